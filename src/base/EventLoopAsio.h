@@ -127,10 +127,10 @@ template <class Handler>
 auto bindToQueue(const SerialQueue& queue, Handler handler) {
     auto state = QueueInternals::state(queue);
     QueueStrand strand = state->strand;
-    return asio::bind_executor(
-        std::move(strand), [state = std::move(state), handler = std::move(handler)](auto&&... args) mutable {
-            runOnQueue(*state, [&] { handler(std::forward<decltype(args)>(args)...); });
-        });
+    return asio::bind_executor(std::move(strand),
+                               [state = std::move(state), handler = std::move(handler)](auto&&... args) mutable {
+                                   runOnQueue(*state, [&] { handler(std::forward<decltype(args)>(args)...); });
+                               });
 }
 
 }  // namespace bexil::detail

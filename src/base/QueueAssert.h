@@ -12,16 +12,16 @@ namespace bexil::detail {
 
 }  // namespace bexil::detail
 
-#define BX_ASSERT_ON_QUEUE(queue)                                                                    \
-    do {                                                                                             \
-        const auto& bxAssertQueue_ = (queue);                                                        \
-        if (!bxAssertQueue_.isCurrent())                                                             \
-            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), true, __FILE__, __LINE__);  \
+#define BX_ASSERT_ON_QUEUE(queue)                                                                  \
+    do {                                                                                           \
+        const auto& bxAssertQueue_ = (queue);                                                      \
+        if (!bxAssertQueue_.isCurrent())                                                           \
+            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), true, __FILE__, __LINE__); \
     } while (false)
 
-#define BX_ASSERT_NOT_ON_QUEUE(queue)                                                                \
-    do {                                                                                             \
-        const auto& bxAssertQueue_ = (queue);                                                        \
-        if (bxAssertQueue_.isCurrent())                                                              \
+#define BX_ASSERT_NOT_ON_QUEUE(queue)                                                               \
+    do {                                                                                            \
+        const auto& bxAssertQueue_ = (queue);                                                       \
+        if (bxAssertQueue_.isCurrent())                                                             \
             ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), false, __FILE__, __LINE__); \
     } while (false)

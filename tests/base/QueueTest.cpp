@@ -357,6 +357,10 @@ void recordUncaught(std::string_view label, std::exception_ptr exception) {
 }  // namespace
 
 TEST(SerialQueueTest, AnEscapingExceptionIsReportedAndTheLoopCarriesOn) {
+    {
+        std::lock_guard lock(reportedMutex);
+        reported.clear();
+    }
     EventLoop::setUncaughtExceptionHandler(&recordUncaught);
     {
         EventLoop loop(1);
