@@ -11,6 +11,15 @@
 // object that made it. When the EventLoop is destroyed its core is shut down: pending blocks and handlers are
 // destroyed without running, and anything submitted afterwards is dropped.
 
+// Every translation unit that sees Asio must see it configured alike, including ones (tests) that do not link the
+// bexil_asio target which sets these.
+#ifndef ASIO_STANDALONE
+#define ASIO_STANDALONE
+#endif
+#ifndef ASIO_NO_DEPRECATED
+#define ASIO_NO_DEPRECATED
+#endif
+
 #include <asio.hpp>
 #include <atomic>
 #include <exception>
