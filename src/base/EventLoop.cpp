@@ -1,0 +1,116 @@
+#include "base/EventLoop.h"
+
+#include <atomic>
+#include <cstdio>
+#include <mutex>
+#include <string>
+
+#include "base/Error.h"
+#include "base/EventLoopAsio.h"
+
+namespace bexil {
+
+namespace {
+
+// The loop the calling thread is running, if any. A thread runs at most one loop at a time.
+thread_local const detail::EventLoopCore* tlsRunningLoop = nullptr;
+
+void writeUncaughtToStandardError(std::string_view queueLabel, std::exception_ptr exception) {
+    std::string what = "unknown exception";
+    try {
+        std::rethrow_exception(exception);
+    } catch (const std::exception& e) {
+        what = e.what();
+    } catch (...) {
+    }
+    std::fprintf(stderr, "bexil: block on queue \"%.*s\" threw: %s\n", static_cast<int>(queueLabel.size()),
+                 queueLabel.data(), what.c_str());
+}
+
+std::atomic<EventLoop::UncaughtExceptionHandler> uncaughtHandler{&writeUncaughtToStandardError};
+
+std::mutex sharedMutex;
+EventLoop* sharedLoop = nullptr;
+unsigned sharedOwnThreads = EventLoop::kDefaultEventLoopThreads;
+
+// Runs the loop on the calling thread until it is stopped. Handlers of our queues catch their own exceptions; this
+// catches what a foreign handler might let through, so a bug there cannot end a loop thread.
+// REQUIRES: the caller counted this thread in core.runners already.
+void runLoop(detail::EventLoopCore& core) {
+    const detail::EventLoopCore* previous = tlsRunningLoop;
+    tlsRunningLoop = &core;
+    for (;;) {
+        try {
+            core.run();
+            break;
+        } catch (...) {
+            detail::reportUncaughtException("event loop", std::current_exception());
+        }
+    }
+    core.runners.fetch_sub(1);
+    tlsRunningLoop = previous;
+}
+
+}  // namespace
+
+namespace detail {
+
+bool runsOnCurrentThread(const EventLoopCore& core) { return tlsRunningLoop == &core; }
+
+void reportUncaughtException(std::string_view label, std::exception_ptr exception) {
+    uncaughtHandler.load()(label, exception);
+}
+
+}  // namespace detail
+
+EventLoop& EventLoop::shared() {
+    std::lock_guard lock(sharedMutex);
+    // Never destroyed: queues of static objects may still use it while the process exits.
+    if (sharedLoop == nullptr) sharedLoop = new EventLoop(sharedOwnThreads);
+    return *sharedLoop;
+}
+
+void EventLoop::configureShared(unsigned ownThreads) {
+    std::lock_guard lock(sharedMutex);
+    if (sharedLoop != nullptr) throw InternalInconsistency("the shared event loop is already running");
+    sharedOwnThreads = ownThreads;
+}
+
+void EventLoop::setUncaughtExceptionHandler(UncaughtExceptionHandler handler) {
+    uncaughtHandler.store(handler != nullptr ? handler : &writeUncaughtToStandardError);
+}
+
+EventLoop::EventLoop(unsigned ownThreads) : core_(std::make_shared<detail::EventLoopCore>()) {
+    threads_.reserve(ownThreads);
+    // Counted before they start, so that a sync made right away already knows it may block one of them.
+    core_->runners.fetch_add(ownThreads);
+    for (unsigned i = 0; i < ownThreads; ++i) {
+        threads_.emplace_back([core = core_] { runLoop(*core); });
+    }
+}
+
+EventLoop::~EventLoop() {
+    stop();
+    for (auto& thread : threads_) thread.join();
+    // Pending blocks hold their queues, and queues hold the core: destroying the blocks here breaks that cycle.
+    core_->shutDown();
+}
+
+void EventLoop::runOnCurrentThread() {
+    if (runsOnCurrentThread()) throw InternalInconsistency("runOnCurrentThread called from inside the same loop");
+    core_->runners.fetch_add(1);
+    runLoop(*core_);
+}
+
+void EventLoop::stop() {
+    core_->releaseKeepAlive();
+    core_->stop();
+}
+
+bool EventLoop::isStopped() const { return core_->stopped(); }
+
+bool EventLoop::runsOnCurrentThread() const { return detail::runsOnCurrentThread(*core_); }
+
+unsigned EventLoop::runningThreadCount() const { return core_->runners.load(); }
+
+}  // namespace bexil

@@ -1,0 +1,19 @@
+#include "base/QueueAssert.h"
+
+#include <string>
+
+#include "base/Error.h"
+
+namespace bexil::detail {
+
+void failQueueAssertion(std::string_view label, bool expectedOnQueue, const char* file, int line) {
+    std::string message = expectedOnQueue ? "not on queue \"" : "unexpectedly on queue \"";
+    message.append(label);
+    message.append("\" at ");
+    message.append(file);
+    message.push_back(':');
+    message.append(std::to_string(line));
+    throw InternalInconsistency(message);
+}
+
+}  // namespace bexil::detail

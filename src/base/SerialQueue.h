@@ -1,0 +1,72 @@
+#pragma once
+
+// SerialQueue runs blocks one at a time, in the order they were submitted, on the threads of an EventLoop; blocks of
+// one queue never overlap, blocks of different queues may. A queue costs a small allocation and no thread, so every
+// connection can have its own. SerialQueue is a handle: copies refer to the same queue, and the queue lives until
+// the last copy and the last block queued on it are gone. Any thread may use it.
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <type_traits>
+#include <utility>
+
+#include "base/EventLoop.h"
+
+namespace bexil {
+
+namespace detail {
+struct SerialQueueState;
+}  // namespace detail
+
+class SerialQueue {
+public:
+    // A new queue on `loop`; the label names it in log lines and in consistency failures.
+    explicit SerialQueue(std::string label, EventLoop& loop = EventLoop::shared());
+
+    const std::string& label() const;
+    // The label, for "%@" in log texts.
+    const std::string& description() const { return label(); }
+
+    // Queues `block` to run after every block submitted to this queue before it. Never runs it on the caller's
+    // stack, even when the caller is on this queue. An exception escaping the block goes to the loop's
+    // uncaught-exception handler.
+    void async(std::function<void()> block) const;
+
+    // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
+    void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
+
+    // True while the calling thread runs a block of this queue; false inside a block of another queue, even one
+    // that a block of this queue waits for with sync.
+    bool isCurrent() const;
+
+    // Runs `block` on the queue, waits for it and returns its result; an exception it throws is rethrown here.
+    // REQUIRES: not called from inside this queue (nor from a queue that a block of this queue waits for with
+    // sync), nor from the loop's thread when it is the loop's only thread, nor after the loop stopped: each would
+    // wait for ever, so each throws InternalInconsistency instead.
+    template <class F>
+    std::invoke_result_t<F&> sync(F&& block) const {
+        using R = std::invoke_result_t<F&>;
+        if constexpr (std::is_void_v<R>) {
+            syncBlock([&] { block(); });
+        } else {
+            std::optional<R> result;
+            syncBlock([&] { result.emplace(block()); });
+            return std::move(*result);
+        }
+    }
+
+    // Two handles are equal when they refer to the same queue.
+    bool operator==(const SerialQueue& other) const { return state_ == other.state_; }
+
+private:
+    friend struct detail::QueueInternals;
+
+    void syncBlock(const std::function<void()>& block) const;
+
+    std::shared_ptr<detail::SerialQueueState> state_;
+};
+
+}  // namespace bexil

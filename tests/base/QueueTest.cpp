@@ -1,0 +1,556 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <fstream>
+#include <future>
+#include <memory>
+#include <mutex>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/EventLoop.h"
+#include "base/EventLoopAsio.h"
+#include "base/QueueAssert.h"
+#include "base/SerialQueue.h"
+#include "base/SyncQueue.h"
+
+using namespace bexil;
+using namespace std::chrono_literals;
+
+namespace {
+
+// Generous: only a broken queue ever waits this long.
+constexpr auto kPatience = 20s;
+
+int processThreadCount() {
+    std::ifstream status("/proc/self/status");
+    std::string line;
+    while (std::getline(status, line)) {
+        if (line.rfind("Threads:", 0) == 0) return std::stoi(line.substr(8));
+    }
+    return -1;
+}
+
+// Counts down to zero from any thread; the test waits for zero.
+class Countdown {
+public:
+    explicit Countdown(int count) : count_(count) {}
+    void arrive() {
+        std::lock_guard lock(mutex_);
+        if (--count_ == 0) zero_.notify_all();
+    }
+    bool wait() {
+        std::unique_lock lock(mutex_);
+        return zero_.wait_for(lock, kPatience, [&] { return count_ == 0; });
+    }
+
+private:
+    std::mutex mutex_;
+    std::condition_variable zero_;
+    int count_;
+};
+
+// Records the highest number of blocks seen running at once.
+class InFlight {
+public:
+    void enter() {
+        int now = ++current_;
+        int seen = highest_.load();
+        while (now > seen && !highest_.compare_exchange_weak(seen, now)) {
+        }
+    }
+    void leave() { --current_; }
+    int highest() const { return highest_.load(); }
+
+private:
+    std::atomic<int> current_{0};
+    std::atomic<int> highest_{0};
+};
+
+}  // namespace
+
+// ---- SerialQueue ordering and concurrency --------------------------------------------------------------------
+
+TEST(SerialQueueTest, KeepsEachProducersOrderAndRunsOneBlockAtATime) {
+    EventLoop loop(2);
+    constexpr int kProducers = 4;
+    constexpr int kPerProducer = 2000;
+    SerialQueue queue("fifo", loop);
+
+    std::vector<int> lastSeen(kProducers, -1);  // touched only on the queue
+    std::atomic<int> outOfOrder{0};
+    InFlight inFlight;
+    Countdown done(kProducers * kPerProducer);
+
+    std::vector<std::thread> producers;
+    for (int p = 0; p < kProducers; ++p) {
+        producers.emplace_back([&, p] {
+            for (int i = 0; i < kPerProducer; ++i) {
+                queue.async([&, p, i] {
+                    inFlight.enter();
+                    if (lastSeen[p] != i - 1) ++outOfOrder;
+                    lastSeen[p] = i;
+                    inFlight.leave();
+                    done.arrive();
+                });
+            }
+        });
+    }
+    for (auto& t : producers) t.join();
+    ASSERT_TRUE(done.wait());
+    EXPECT_EQ(outOfOrder.load(), 0);
+    EXPECT_EQ(inFlight.highest(), 1);
+    for (int p = 0; p < kProducers; ++p) EXPECT_EQ(lastSeen[p], kPerProducer - 1);
+}
+
+TEST(SerialQueueTest, RunsInSubmissionOrderAcrossProducers) {
+    // Producers take a ticket and submit under one lock, so submission order is the ticket order.
+    EventLoop loop(2);
+    SerialQueue queue("tickets", loop);
+    std::mutex submitting;
+    int nextTicket = 0;
+    std::vector<int> ran;  // touched only on the queue
+    constexpr int kTotal = 3 * 1500;
+    Countdown done(kTotal);
+    std::vector<std::thread> producers;
+    for (int p = 0; p < 3; ++p) {
+        producers.emplace_back([&] {
+            for (int i = 0; i < kTotal / 3; ++i) {
+                std::lock_guard lock(submitting);
+                int ticket = nextTicket++;
+                queue.async([&, ticket] {
+                    ran.push_back(ticket);
+                    done.arrive();
+                });
+            }
+        });
+    }
+    for (auto& t : producers) t.join();
+    ASSERT_TRUE(done.wait());
+    ASSERT_EQ(ran.size(), static_cast<size_t>(kTotal));
+    for (int i = 0; i < kTotal; ++i) ASSERT_EQ(ran[i], i);
+}
+
+TEST(SerialQueueTest, TwoQueuesRunConcurrentlyButEachStaysSerial) {
+    EventLoop loop(2);
+    SerialQueue a("a", loop);
+    SerialQueue b("b", loop);
+
+    // A rendezvous that only succeeds when a block of each queue runs at the same time.
+    std::promise<void> aStarted, bStarted;
+    auto aFuture = aStarted.get_future();
+    auto bFuture = bStarted.get_future();
+    std::atomic<bool> metA{false}, metB{false};
+    a.async([&] {
+        aStarted.set_value();
+        metA = bFuture.wait_for(kPatience) == std::future_status::ready;
+    });
+    b.async([&] {
+        bStarted.set_value();
+        metB = aFuture.wait_for(kPatience) == std::future_status::ready;
+    });
+
+    InFlight inA, inB;
+    constexpr int kBlocks = 3000;
+    Countdown done(2 * kBlocks);
+    for (int i = 0; i < kBlocks; ++i) {
+        a.async([&] {
+            inA.enter();
+            std::this_thread::yield();
+            inA.leave();
+            done.arrive();
+        });
+        b.async([&] {
+            inB.enter();
+            std::this_thread::yield();
+            inB.leave();
+            done.arrive();
+        });
+    }
+    ASSERT_TRUE(done.wait());
+    EXPECT_TRUE(metA.load());
+    EXPECT_TRUE(metB.load());
+    EXPECT_EQ(inA.highest(), 1);
+    EXPECT_EQ(inB.highest(), 1);
+}
+
+TEST(SerialQueueTest, TenThousandQueuesShareAFewThreads) {
+    const int threadsBefore = processThreadCount();
+    ASSERT_GT(threadsBefore, 0);
+    EventLoop loop(2);
+    constexpr int kQueues = 10000;
+    constexpr int kBlocksEach = 3;
+    std::vector<SerialQueue> queues;
+    queues.reserve(kQueues);
+    for (int i = 0; i < kQueues; ++i) queues.emplace_back("connection " + std::to_string(i), loop);
+
+    std::vector<int> ranPerQueue(kQueues, 0);  // element i touched only on queue i
+    std::atomic<int> wrongQueue{0};
+    Countdown done(kQueues * kBlocksEach);
+    for (int round = 0; round < kBlocksEach; ++round) {
+        for (int i = 0; i < kQueues; ++i) {
+            queues[i].async([&, i, round] {
+                if (!queues[i].isCurrent() || ranPerQueue[i] != round) ++wrongQueue;
+                ++ranPerQueue[i];
+                done.arrive();
+            });
+        }
+    }
+    ASSERT_TRUE(done.wait());
+    EXPECT_EQ(wrongQueue.load(), 0);
+    for (int i = 0; i < kQueues; ++i) ASSERT_EQ(ranPerQueue[i], kBlocksEach) << "queue " << i;
+    EXPECT_LE(processThreadCount(), threadsBefore + 4);
+}
+
+TEST(SerialQueueTest, AsyncAfterNeverFiresEarlyAndStaysInOrder) {
+    EventLoop loop(1);
+    SerialQueue queue("timers", loop);
+    constexpr auto kDelay = 50ms;
+    std::promise<std::chrono::steady_clock::time_point> fired;
+    std::vector<std::string> order;  // touched only on the queue
+    Countdown done(3);
+    const auto submitted = std::chrono::steady_clock::now();
+    queue.asyncAfter(kDelay, [&] {
+        fired.set_value(std::chrono::steady_clock::now());
+        order.push_back("late");
+        done.arrive();
+    });
+    queue.asyncAfter(0ms, [&] {
+        order.push_back("zero");
+        done.arrive();
+    });
+    queue.async([&] {
+        order.push_back("now");
+        done.arrive();
+    });
+    ASSERT_TRUE(done.wait());
+    EXPECT_GE(fired.get_future().get() - submitted, kDelay);
+    ASSERT_EQ(order.size(), 3u);
+    EXPECT_EQ(order.back(), "late");
+}
+
+TEST(SerialQueueTest, AsyncNeverRunsTheBlockOnTheCallersStack) {
+    EventLoop loop(1);
+    SerialQueue queue("reentry", loop);
+    std::vector<int> order;
+    queue.sync([&] {
+        queue.async([&] { order.push_back(2); });
+        order.push_back(1);
+    });
+    queue.sync([] {});  // everything submitted before has run
+    EXPECT_EQ(order, (std::vector<int>{1, 2}));
+}
+
+// ---- isCurrent and sync -------------------------------------------------------------------------------------------
+
+TEST(SerialQueueTest, IsCurrentOnlyInsideItsOwnBlocks) {
+    EventLoop loop(2);
+    SerialQueue a("a", loop);
+    SerialQueue b("b", loop);
+    EXPECT_FALSE(a.isCurrent());
+    struct Seen {
+        bool aInA = false, bInA = false, aInB = false, bInB = false, aInNestedB = false;
+    } seen;
+    a.sync([&] {
+        seen.aInA = a.isCurrent();
+        seen.bInA = b.isCurrent();
+        b.sync([&] {
+            seen.aInB = a.isCurrent();
+            seen.bInB = b.isCurrent();
+        });
+        seen.aInNestedB = a.isCurrent();  // restored after the wait
+    });
+    EXPECT_TRUE(seen.aInA);
+    EXPECT_FALSE(seen.bInA);
+    EXPECT_FALSE(seen.aInB);
+    EXPECT_TRUE(seen.bInB);
+    EXPECT_TRUE(seen.aInNestedB);
+    EXPECT_FALSE(a.isCurrent());
+
+    // A copy of the handle is the same queue.
+    SerialQueue copy = a;
+    EXPECT_TRUE(copy == a);
+    EXPECT_FALSE(copy == b);
+    EXPECT_TRUE(a.sync([&] { return copy.isCurrent(); }));
+}
+
+TEST(SerialQueueTest, SyncReturnsTheResultAndRethrows) {
+    EventLoop loop(1);
+    SerialQueue queue("sync", loop);
+    EXPECT_EQ(queue.sync([] { return std::string("answer"); }), "answer");
+    EXPECT_THROW(queue.sync([]() -> int { throw std::runtime_error("bad record"); }), std::runtime_error);
+    // The queue is usable after a block threw.
+    EXPECT_EQ(queue.sync([] { return 7; }), 7);
+}
+
+TEST(SerialQueueTest, SyncThatWouldWaitForItselfThrows) {
+    EventLoop loop(2);
+    SerialQueue a("service", loop);
+    SerialQueue b("other", loop);
+
+    auto message = [](auto&& attempt) -> std::string {
+        try {
+            attempt();
+        } catch (const InternalInconsistency& e) {
+            return e.what();
+        }
+        return "no exception";
+    };
+    // Directly from inside.
+    std::string direct = a.sync([&] { return message([&] { a.sync([] {}); }); });
+    EXPECT_NE(direct.find("\"service\""), std::string::npos) << direct;
+    // Through another queue that a block of `a` is waiting for.
+    std::string indirect = a.sync([&] { return b.sync([&] { return message([&] { a.sync([] {}); }); }); });
+    EXPECT_NE(indirect.find("\"service\""), std::string::npos) << indirect;
+    // Both queues still work.
+    EXPECT_EQ(a.sync([] { return 1; }) + b.sync([] { return 2; }), 3);
+}
+
+TEST(SerialQueueTest, SyncFromTheOnlyLoopThreadThrows) {
+    EventLoop loop(1);
+    SerialQueue a("a", loop);
+    SerialQueue b("b", loop);
+    std::string what = a.sync([&] {
+        try {
+            b.sync([] {});
+        } catch (const InternalInconsistency& e) {
+            return std::string(e.what());
+        }
+        return std::string("no exception");
+    });
+    EXPECT_NE(what.find("only thread"), std::string::npos) << what;
+
+    // With a second thread the same call is fine.
+    EventLoop wide(2);
+    SerialQueue c("c", wide);
+    SerialQueue d("d", wide);
+    EXPECT_EQ(c.sync([&] { return d.sync([] { return 5; }); }), 5);
+}
+
+TEST(SerialQueueTest, SyncOnAStoppedLoopThrows) {
+    EventLoop loop(1);
+    SerialQueue queue("late", loop);
+    loop.stop();
+    EXPECT_THROW(queue.sync([] {}), InternalInconsistency);
+}
+
+// ---- failures and lifetime ----------------------------------------------------------------------------------------
+
+namespace {
+std::mutex reportedMutex;
+std::vector<std::string> reported;
+void recordUncaught(std::string_view label, std::exception_ptr exception) {
+    std::string what;
+    try {
+        std::rethrow_exception(exception);
+    } catch (const std::exception& e) {
+        what = e.what();
+    }
+    std::lock_guard lock(reportedMutex);
+    reported.push_back(std::string(label) + ": " + what);
+}
+}  // namespace
+
+TEST(SerialQueueTest, AnEscapingExceptionIsReportedAndTheLoopCarriesOn) {
+    {
+        std::lock_guard lock(reportedMutex);
+        reported.clear();
+    }
+    EventLoop::setUncaughtExceptionHandler(&recordUncaught);
+    {
+        EventLoop loop(1);
+        SerialQueue queue("faulty", loop);
+        queue.async([] { throw InternalInconsistency("broken record"); });
+        EXPECT_EQ(queue.sync([] { return 3; }), 3);
+    }
+    EventLoop::setUncaughtExceptionHandler(nullptr);
+    std::lock_guard lock(reportedMutex);
+    ASSERT_EQ(reported.size(), 1u);
+    EXPECT_EQ(reported[0], "faulty: broken record");
+}
+
+TEST(SerialQueueTest, DestroyingTheLoopDropsPendingBlocksWithoutRunningThem) {
+    auto sentinel = std::make_shared<int>(0);
+    std::atomic<bool> ran{false};
+    std::optional<SerialQueue> survivor;
+    {
+        EventLoop loop(1);
+        SerialQueue queue("doomed", loop);
+        survivor = queue;
+        queue.asyncAfter(1h, [&ran, sentinel] { ran = true; });
+        std::promise<void> gate, holding;
+        auto opened = gate.get_future().share();
+        // Holds the queue so that the next block is still waiting when the loop stops.
+        queue.async([opened, &holding] {
+            holding.set_value();
+            opened.wait();
+        });
+        holding.get_future().wait();
+        queue.async([&ran, sentinel] { ran = true; });
+        loop.stop();
+        gate.set_value();
+        EXPECT_GT(sentinel.use_count(), 1);
+    }
+    EXPECT_FALSE(ran.load());
+    EXPECT_EQ(sentinel.use_count(), 1);  // the pending blocks were destroyed
+    // A queue that outlived its loop drops what it is given.
+    survivor->async([&ran, sentinel] { ran = true; });
+    EXPECT_EQ(sentinel.use_count(), 1);
+    EXPECT_THROW(survivor->sync([] {}), InternalInconsistency);
+    EXPECT_FALSE(ran.load());
+}
+
+TEST(EventLoopTest, RunOnCurrentThreadRunsWorkHereUntilStopped) {
+    EventLoop loop(0);
+    SerialQueue queue("main", loop);
+    const auto caller = std::this_thread::get_id();
+    std::vector<std::thread::id> ranOn;  // touched only on the queue
+    bool sawLoopThread = false;
+    for (int i = 0; i < 3; ++i) queue.async([&] { ranOn.push_back(std::this_thread::get_id()); });
+    queue.async([&] {
+        sawLoopThread = loop.runsOnCurrentThread() && loop.runningThreadCount() == 1;
+        // Only one thread runs this loop, so a sync from here must be refused rather than hang.
+        try {
+            SerialQueue("other", loop).sync([] {});
+        } catch (const InternalInconsistency&) {
+            ranOn.push_back(std::this_thread::get_id());
+        }
+        loop.stop();
+    });
+    EXPECT_FALSE(loop.runsOnCurrentThread());
+    loop.runOnCurrentThread();  // returns only once stop() was called
+    EXPECT_TRUE(loop.isStopped());
+    EXPECT_TRUE(sawLoopThread);
+    ASSERT_EQ(ranOn.size(), 4u);
+    for (auto id : ranOn) EXPECT_EQ(id, caller);
+    EXPECT_EQ(loop.runningThreadCount(), 0u);
+    loop.runOnCurrentThread();  // a stopped loop stays stopped: returns at once
+}
+
+TEST(EventLoopTest, StopFromAnotherThreadEndsRunOnCurrentThread) {
+    EventLoop loop(0);
+    std::thread stopper([&] {
+        while (loop.runningThreadCount() == 0) std::this_thread::sleep_for(1ms);
+        loop.stop();
+    });
+    loop.runOnCurrentThread();
+    stopper.join();
+    EXPECT_TRUE(loop.isStopped());
+}
+
+TEST(EventLoopTest, SharedLoopRunsQueuesOnItsOwnThread) {
+    SerialQueue queue("shared");
+    auto ranOn = queue.sync([] { return std::this_thread::get_id(); });
+    EXPECT_NE(ranOn, std::this_thread::get_id());
+    EXPECT_EQ(&EventLoop::shared(), &EventLoop::shared());
+    EXPECT_THROW(EventLoop::configureShared(0), InternalInconsistency);
+}
+
+TEST(EventLoopTest, HandlersBoundToAQueueRunAsItsBlocks) {
+    EventLoop loop(2);
+    SerialQueue queue("connection", loop);
+    InFlight inFlight;
+    Countdown done(200);
+    std::atomic<int> notCurrent{0};
+    std::vector<std::unique_ptr<asio::steady_timer>> timers;
+    for (int i = 0; i < 100; ++i) {
+        auto& timer = timers.emplace_back(std::make_unique<asio::steady_timer>(detail::ioContext(loop), 1ms));
+        timer->async_wait(detail::bindToQueue(queue, [&](const asio::error_code& error) {
+            inFlight.enter();
+            if (error || !queue.isCurrent()) ++notCurrent;
+            inFlight.leave();
+            done.arrive();
+        }));
+        queue.async([&] {
+            inFlight.enter();
+            inFlight.leave();
+            done.arrive();
+        });
+    }
+    ASSERT_TRUE(done.wait());
+    EXPECT_EQ(notCurrent.load(), 0);
+    EXPECT_EQ(inFlight.highest(), 1);
+}
+
+// ---- SyncQueue and the assertions ---------------------------------------------------------------------------------
+
+TEST(SyncQueueTest, ExcludesOtherThreadsAndReturnsTheResult) {
+    SyncQueue queue("serverSync");
+    InFlight inFlight;
+    long counter = 0;  // guarded by the queue only
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t) {
+        threads.emplace_back([&] {
+            for (int i = 0; i < 5000; ++i) {
+                queue.sync([&] {
+                    inFlight.enter();
+                    ++counter;
+                    inFlight.leave();
+                });
+            }
+        });
+    }
+    for (auto& t : threads) t.join();
+    EXPECT_EQ(counter, 4 * 5000);
+    EXPECT_EQ(inFlight.highest(), 1);
+    EXPECT_EQ(queue.sync([&] { return counter * 2; }), 40000);
+}
+
+TEST(SyncQueueTest, IsCurrentPerThread) {
+    SyncQueue queue("BXDatabase");
+    EXPECT_FALSE(queue.isCurrent());
+    bool otherThreadSawInside = true;
+    bool inside = queue.sync([&] {
+        std::thread([&] { otherThreadSawInside = queue.isCurrent(); }).join();
+        return queue.isCurrent();
+    });
+    EXPECT_TRUE(inside);
+    EXPECT_FALSE(otherThreadSawInside);
+    EXPECT_FALSE(queue.isCurrent());
+}
+
+TEST(SyncQueueTest, EnteringFromInsideThrowsNamingTheQueue) {
+    SyncQueue queue("BXDatabase");
+    std::string what = queue.sync([&] {
+        try {
+            queue.sync([] {});
+        } catch (const InternalInconsistency& e) {
+            return std::string(e.what());
+        }
+        return std::string("no exception");
+    });
+    EXPECT_NE(what.find("\"BXDatabase\""), std::string::npos) << what;
+    // An exception out of the block leaves the queue, so it can be entered again.
+    EXPECT_THROW(queue.sync([] { throw std::runtime_error("x"); }), std::runtime_error);
+    EXPECT_FALSE(queue.isCurrent());
+    EXPECT_EQ(queue.sync([] { return 1; }), 1);
+}
+
+TEST(QueueAssertTest, ThrowsOnTheWrongSideOfTheQueue) {
+    SyncQueue sync("serverSync");
+    EXPECT_THROW(BX_ASSERT_ON_QUEUE(sync), InternalInconsistency);
+    EXPECT_NO_THROW(BX_ASSERT_NOT_ON_QUEUE(sync));
+    sync.sync([&] {
+        EXPECT_NO_THROW(BX_ASSERT_ON_QUEUE(sync));
+        EXPECT_THROW(BX_ASSERT_NOT_ON_QUEUE(sync), InternalInconsistency);
+    });
+
+    EventLoop loop(1);
+    SerialQueue serial("service", loop);
+    EXPECT_THROW(BX_ASSERT_ON_QUEUE(serial), InternalInconsistency);
+    std::string what = serial.sync([&] {
+        BX_ASSERT_ON_QUEUE(serial);
+        try {
+            BX_ASSERT_NOT_ON_QUEUE(serial);
+        } catch (const InternalInconsistency& e) {
+            return std::string(e.what());
+        }
+        return std::string();
+    });
+    EXPECT_NE(what.find("\"service\""), std::string::npos) << what;
+}
