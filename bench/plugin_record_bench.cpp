@@ -81,8 +81,8 @@ std::shared_ptr<BXPlugInCore> setUp(const Value& info) {
 }
 
 void reportAllocations(benchmark::State& state, uint64_t before) {
-    state.counters["allocs/record"] = benchmark::Counter(static_cast<double>(gAllocations.load() - before) /
-                                                         static_cast<double>(state.iterations()));
+    state.counters["allocs/record"] =
+        benchmark::Counter(static_cast<double>(gAllocations.load() - before) / static_cast<double>(state.iterations()));
 }
 
 void BM_SetUpExportReadBack(benchmark::State& state) {

@@ -32,8 +32,14 @@ constexpr const char* kVocabulary[] = {
     "localizedDisplayName", "localizedShortName", "hash", "requirement", "extensions"};
 constexpr size_t kVocabularySize = sizeof(kVocabulary) / sizeof(kVocabulary[0]);
 
-constexpr const char* kStrings[] = {"RZObject", "#Data", "com.example.fuzz", "/Apps/A.app/PlugIns/P.wexa",
-                                    "/System/Library/Bexil/P.bundle", "1.2", "", "00000000-0000-0000-0000-000000000000",
+constexpr const char* kStrings[] = {"RZObject",
+                                    "#Data",
+                                    "com.example.fuzz",
+                                    "/Apps/A.app/PlugIns/P.wexa",
+                                    "/System/Library/Bexil/P.bundle",
+                                    "1.2",
+                                    "",
+                                    "00000000-0000-0000-0000-000000000000",
                                     "6F1C2A7E-3B4D-4E5F-8A9B-0C1D2E3F4A5B"};
 constexpr size_t kStringCount = sizeof(kStrings) / sizeof(kStrings[0]);
 
@@ -41,7 +47,7 @@ constexpr int kMaxDepth = 5;
 constexpr size_t kMaxEntries = 12;
 
 class ByteReader {
-public:
+  public:
     ByteReader(const uint8_t* data, size_t size) : data_(data), size_(size) {}
     bool empty() const { return pos_ >= size_; }
     uint8_t byte() { return empty() ? 0 : data_[pos_++]; }
@@ -63,7 +69,7 @@ public:
         return b;
     }
 
-private:
+  private:
     const uint8_t* data_;
     size_t size_;
     size_t pos_ = 0;
@@ -79,14 +85,22 @@ Value value(ByteReader& in, int depth) {
     uint8_t kind = in.byte();
     if (depth >= kMaxDepth) kind %= 9;  // scalars only
     switch (kind % 12) {
-        case 0: return Value();
-        case 1: return Value::boolean(in.byte() & 1);
-        case 2: return Value::int64(static_cast<int64_t>(in.u64()));
-        case 3: return Value::uint64(in.u64() >> (in.byte() % 64));
-        case 4: return Value::real(static_cast<double>(static_cast<int64_t>(in.u64())) / ((in.byte() % 7) + 1));
-        case 5: return Value::string(kStrings[in.byte() % kStringCount]);
-        case 6: return Value::string(in.text());
-        case 7: return Value::data(in.bytes());
+        case 0:
+            return Value();
+        case 1:
+            return Value::boolean(in.byte() & 1);
+        case 2:
+            return Value::int64(static_cast<int64_t>(in.u64()));
+        case 3:
+            return Value::uint64(in.u64() >> (in.byte() % 64));
+        case 4:
+            return Value::real(static_cast<double>(static_cast<int64_t>(in.u64())) / ((in.byte() % 7) + 1));
+        case 5:
+            return Value::string(kStrings[in.byte() % kStringCount]);
+        case 6:
+            return Value::string(in.text());
+        case 7:
+            return Value::data(in.bytes());
         case 8: {
             std::array<uint8_t, 16> b{};
             for (auto& x : b) x = in.byte();

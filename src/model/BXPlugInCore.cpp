@@ -154,8 +154,8 @@ std::shared_ptr<BXPlugInCore> BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(st
                                                                               std::optional<Value> info,
                                                                               std::optional<Uuid> uuid) {
     auto record = std::make_shared<BXPlugInCore>();
-    if (!record->setupWithNameUrlBundleInfoInfoUuid(std::move(identifier), std::move(url), std::move(bundleInfo),
-                                                    info, uuid))
+    if (!record->setupWithNameUrlBundleInfoInfoUuid(std::move(identifier), std::move(url), std::move(bundleInfo), info,
+                                                    uuid))
         return nullptr;
     if (!record->plugInDictionary()) record->setPlugInDictionary(std::move(info));
     return record;
@@ -220,12 +220,14 @@ void BXPlugInCore::canonicalize() {
 // ---- Checks and annotations ----
 
 std::optional<Error> BXPlugInCore::diagnose() const {
-    if (!identifier()) return invalidConfiguration("missing identifier (no RZExtensionIdentifier, nor even BDBundleIdentifier)");
+    if (!identifier())
+        return invalidConfiguration("missing identifier (no RZExtensionIdentifier, nor even BDBundleIdentifier)");
     if (!protocolSpec()) return invalidConfiguration("missing \"RZExtensionProtocol\" key in Info.vrec or SDK");
     if (!attributes()) return invalidConfiguration("missing \"RZExtensionAttributes\" key in Info.vrec or SDK");
     if (isAppExtension() && !isString(principalSpec(), kRZObject))
         return invalidConfiguration("Application Extensions may not use the \"PrincipalClass\" key");
-    if (pluginKey(keys::kPassProxy)) return invalidConfiguration("the \"PassProxy\" key is not supported on this platform");
+    if (pluginKey(keys::kPassProxy))
+        return invalidConfiguration("the \"PassProxy\" key is not supported on this platform");
     if (isHybrid()) return invalidConfiguration("hybrid plug-ins are not supported on this platform");
     return std::nullopt;
 }
@@ -237,8 +239,8 @@ void BXPlugInCore::setAnnotationValue(std::string_view key, const std::optional<
         std::optional<Value> before = annotations();
         std::optional<Value> after = dictionaryChangingTo(before, key, value);
         std::lock_guard<std::mutex> guard(mutex_);
-        bool unchanged = before.has_value() == annotations_.has_value() &&
-                         (!before || before->identical(*annotations_));
+        bool unchanged =
+            before.has_value() == annotations_.has_value() && (!before || before->identical(*annotations_));
         if (unchanged) {
             annotations_.swap(after);
             return;
@@ -356,8 +358,8 @@ Result<MutableDictionary> BXPlugInCore::exportForm() const {
     out.set(form::kHubProtocolVersion, Value::uint64(hubProtocolVersion()));
     setIfPresent(out, form::kPath, path());
     out.set(form::kSystemResident, Value::boolean(onSystemVolume()));
-    setIfPresent(out, form::kIdentifier, identifier());
-    setIfPresent(out, form::kOriginalIdentifier, originalIdentifier());
+    setIfPresent(out, form::kIdentifier, load(identifier_));
+    setIfPresent(out, form::kOriginalIdentifier, load(originalIdentifier_));
     setIfPresent(out, form::kVersion, version());
     setIfPresent(out, form::kBundleInfo, bundleInfo);
     setIfPresent(out, form::kInfo, plugInDictionary());
@@ -368,9 +370,9 @@ Result<MutableDictionary> BXPlugInCore::exportForm() const {
 
     setIfPresent(out, form::kEntitlements, entitlements());
     setIfPresent(out, form::kContainingPath, containingPath());
-    setIfPresent(out, form::kLocalizedContainingDisplayName, localizedContainingName());
-    setIfPresent(out, form::kLocalizedDisplayName, localizedName());
-    setIfPresent(out, form::kLocalizedShortName, localizedShortName());
+    setIfPresent(out, form::kLocalizedContainingDisplayName, load(localizedContainingName_));
+    setIfPresent(out, form::kLocalizedDisplayName, load(localizedName_));
+    setIfPresent(out, form::kLocalizedShortName, load(localizedShortName_));
     return out;
 }
 
@@ -391,9 +393,9 @@ bool BXPlugInCore::setupWithForm(const Value& form) {
         if (n && *n <= UINT32_MAX) generation = static_cast<uint32_t>(*n);
     }
     setHubProtocolVersion(generation);
-    setOriginalIdentifier(formString(form, form::kOriginalIdentifier));
+    store(originalIdentifier_, textEntry(form, form::kOriginalIdentifier));
     setCdhash(formOfKind(form, form::kHash, ValueKind::Data));
-    setRequirement(formString(form, form::kRequirement));
+    store(requirement_, textEntry(form, form::kRequirement));
 
     int32_t seconds = 0;
     if (const Value* v = formEntry(form, form::kLastModified)) {
@@ -407,9 +409,9 @@ bool BXPlugInCore::setupWithForm(const Value& form) {
     const Value* resident = formEntry(form, form::kSystemResident);
     setOnSystemVolume(resident != nullptr && truthValue(*resident));
     setAnnotations(formOfKind(form, form::kAnnotations, ValueKind::Dictionary));
-    setLocalizedName(formString(form, form::kLocalizedDisplayName));
-    setLocalizedShortName(formString(form, form::kLocalizedShortName));
-    setLocalizedContainingName(formString(form, form::kLocalizedContainingDisplayName));
+    store(localizedName_, textEntry(form, form::kLocalizedDisplayName));
+    store(localizedShortName_, textEntry(form, form::kLocalizedShortName));
+    store(localizedContainingName_, textEntry(form, form::kLocalizedContainingDisplayName));
     return true;
 }
 
@@ -419,12 +421,29 @@ void BXPlugInCore::updateFromForm(const Value& form) {
 
 // ---- Stored properties ----
 
-std::optional<std::string> BXPlugInCore::identifier() const { return load(identifier_); }
-void BXPlugInCore::setIdentifier(std::optional<std::string> v) { store(identifier_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::originalIdentifier() const { return load(originalIdentifier_); }
-void BXPlugInCore::setOriginalIdentifier(std::optional<std::string> v) { store(originalIdentifier_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::url() const { return load(url_); }
-void BXPlugInCore::setUrl(std::optional<std::string> v) { store(url_, std::move(v)); }
+std::optional<std::string> BXPlugInCore::loadText(const std::optional<Value>& field) const {
+    std::optional<Value> v = load(field);
+    if (!v) return std::nullopt;
+    return std::string(v->stringView());
+}
+
+std::optional<Value> BXPlugInCore::textValue(std::optional<std::string> text) {
+    if (!text) return std::nullopt;
+    return Value::string(std::move(*text));
+}
+
+std::optional<Value> BXPlugInCore::textEntry(const Value& form, std::string_view key) {
+    return formOfKind(form, key, ValueKind::String);
+}
+
+std::optional<std::string> BXPlugInCore::identifier() const { return loadText(identifier_); }
+void BXPlugInCore::setIdentifier(std::optional<std::string> v) { store(identifier_, textValue(std::move(v))); }
+std::optional<std::string> BXPlugInCore::originalIdentifier() const { return loadText(originalIdentifier_); }
+void BXPlugInCore::setOriginalIdentifier(std::optional<std::string> v) {
+    store(originalIdentifier_, textValue(std::move(v)));
+}
+std::optional<std::string> BXPlugInCore::url() const { return loadText(url_); }
+void BXPlugInCore::setUrl(std::optional<std::string> v) { store(url_, textValue(std::move(v))); }
 std::optional<Value> BXPlugInCore::bundleInfoDictionary() const { return load(bundleInfoDictionary_); }
 void BXPlugInCore::setBundleInfoDictionary(std::optional<Value> v) { store(bundleInfoDictionary_, std::move(v)); }
 std::optional<Value> BXPlugInCore::plugInDictionary() const { return load(plugInDictionary_); }
@@ -433,19 +452,21 @@ std::optional<Value> BXPlugInCore::entitlements() const { return load(entitlemen
 void BXPlugInCore::setEntitlements(std::optional<Value> v) { store(entitlements_, std::move(v)); }
 std::optional<Value> BXPlugInCore::annotations() const { return load(annotations_); }
 void BXPlugInCore::setAnnotations(std::optional<Value> v) { store(annotations_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::containingUrl() const { return load(containingUrl_); }
-void BXPlugInCore::setContainingUrl(std::optional<std::string> v) { store(containingUrl_, std::move(v)); }
+std::optional<std::string> BXPlugInCore::containingUrl() const { return loadText(containingUrl_); }
+void BXPlugInCore::setContainingUrl(std::optional<std::string> v) { store(containingUrl_, textValue(std::move(v))); }
 bool BXPlugInCore::onSystemVolume() const { return load(onSystemVolume_); }
 void BXPlugInCore::setOnSystemVolume(bool v) { store(onSystemVolume_, v); }
 uint32_t BXPlugInCore::hubProtocolVersion() const { return load(hubProtocolVersion_); }
 void BXPlugInCore::setHubProtocolVersion(uint32_t v) { store(hubProtocolVersion_, v); }
-std::optional<std::string> BXPlugInCore::localizedName() const { return load(localizedName_); }
-void BXPlugInCore::setLocalizedName(std::optional<std::string> v) { store(localizedName_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::localizedShortName() const { return load(localizedShortName_); }
-void BXPlugInCore::setLocalizedShortName(std::optional<std::string> v) { store(localizedShortName_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::localizedContainingName() const { return load(localizedContainingName_); }
+std::optional<std::string> BXPlugInCore::localizedName() const { return loadText(localizedName_); }
+void BXPlugInCore::setLocalizedName(std::optional<std::string> v) { store(localizedName_, textValue(std::move(v))); }
+std::optional<std::string> BXPlugInCore::localizedShortName() const { return loadText(localizedShortName_); }
+void BXPlugInCore::setLocalizedShortName(std::optional<std::string> v) {
+    store(localizedShortName_, textValue(std::move(v)));
+}
+std::optional<std::string> BXPlugInCore::localizedContainingName() const { return loadText(localizedContainingName_); }
 void BXPlugInCore::setLocalizedContainingName(std::optional<std::string> v) {
-    store(localizedContainingName_, std::move(v));
+    store(localizedContainingName_, textValue(std::move(v)));
 }
 int32_t BXPlugInCore::lastModified() const { return load(lastModified_); }
 void BXPlugInCore::setLastModified(int32_t v) { store(lastModified_, v); }
@@ -453,7 +474,7 @@ std::optional<Uuid> BXPlugInCore::uuid() const { return load(uuid_); }
 void BXPlugInCore::setUuid(std::optional<Uuid> v) { store(uuid_, v); }
 std::optional<Value> BXPlugInCore::cdhash() const { return load(cdhash_); }
 void BXPlugInCore::setCdhash(std::optional<Value> v) { store(cdhash_, std::move(v)); }
-std::optional<std::string> BXPlugInCore::requirement() const { return load(requirement_); }
-void BXPlugInCore::setRequirement(std::optional<std::string> v) { store(requirement_, std::move(v)); }
+std::optional<std::string> BXPlugInCore::requirement() const { return loadText(requirement_); }
+void BXPlugInCore::setRequirement(std::optional<std::string> v) { store(requirement_, textValue(std::move(v))); }
 
 }  // namespace bexil

@@ -24,7 +24,7 @@
 namespace bexil {
 
 class BXPlugInCore {
-public:
+  public:
     // `init`: an empty record with no property set. Set it up with one of the setup operations before sharing it.
     BXPlugInCore() = default;
     virtual ~BXPlugInCore() = default;
@@ -160,7 +160,7 @@ public:
     std::optional<std::string> requirement() const;
     void setRequirement(std::optional<std::string> v);
 
-private:
+  private:
     template <typename T>
     T load(const T& field) const {
         std::lock_guard<std::mutex> guard(mutex_);
@@ -176,25 +176,30 @@ private:
         }
     }
 
+    // Text properties are kept as string Values so that exporting and reading forms share them instead of copying.
+    std::optional<std::string> loadText(const std::optional<Value>& field) const;
+    static std::optional<Value> textValue(std::optional<std::string> text);
+    static std::optional<Value> textEntry(const Value& form, std::string_view key);
+
     // Guards every stored property, one at a time; never held while calling anything else.
     mutable std::mutex mutex_;
-    std::optional<std::string> identifier_;
-    std::optional<std::string> originalIdentifier_;
-    std::optional<std::string> url_;
+    std::optional<Value> identifier_;
+    std::optional<Value> originalIdentifier_;
+    std::optional<Value> url_;
     std::optional<Value> bundleInfoDictionary_;
     std::optional<Value> plugInDictionary_;
     std::optional<Value> entitlements_;
     std::optional<Value> annotations_;
-    std::optional<std::string> containingUrl_;
+    std::optional<Value> containingUrl_;
     bool onSystemVolume_ = false;
     uint32_t hubProtocolVersion_ = 0;
-    std::optional<std::string> localizedName_;
-    std::optional<std::string> localizedShortName_;
-    std::optional<std::string> localizedContainingName_;
+    std::optional<Value> localizedName_;
+    std::optional<Value> localizedShortName_;
+    std::optional<Value> localizedContainingName_;
     int32_t lastModified_ = 0;
     std::optional<Uuid> uuid_;
     std::optional<Value> cdhash_;
-    std::optional<std::string> requirement_;
+    std::optional<Value> requirement_;
 };
 
 // Identity of records by UUID, for std::unordered_set/map keyed by shared records. An empty pointer equals only an

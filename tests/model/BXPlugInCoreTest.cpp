@@ -1,5 +1,3 @@
-#include "model/BXPlugInCore.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -8,6 +6,8 @@
 #include <unordered_map>
 #include <unordered_set>
 #include <vector>
+
+#include "model/BXPlugInCore.h"
 
 namespace bexil {
 namespace {
@@ -40,13 +40,13 @@ Value shareInfo(Entries extraPlugIn = {}) {
 
 std::shared_ptr<BXPlugInCore> makeRecord(const char* path, Value info, std::optional<Uuid> uuid = std::nullopt) {
     return BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.mail.share", std::string(path), info,
-                                                          std::nullopt, uuid);
+                                                           std::nullopt, uuid);
 }
 
 // A record whose plug-in dictionary is a dictionary of the given entries (no information dictionary).
 std::shared_ptr<BXPlugInCore> recordWithPlugIn(const char* path, Entries plugIn) {
     return BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.tool", std::string(path), std::nullopt,
-                                                          dict(std::move(plugIn)), std::nullopt);
+                                                           dict(std::move(plugIn)), std::nullopt);
 }
 
 // ---- Set-up ----
@@ -54,7 +54,7 @@ std::shared_ptr<BXPlugInCore> recordWithPlugIn(const char* path, Entries plugIn)
 TEST(BXPlugInCoreSetup, MissingUrlFailsWithoutLogging) {
     testing::internal::CaptureStderr();
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::nullopt, shareInfo(),
-                                                                 std::nullopt, std::nullopt);
+                                                                  std::nullopt, std::nullopt);
     EXPECT_EQ(record, nullptr);
     EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
@@ -62,7 +62,7 @@ TEST(BXPlugInCoreSetup, MissingUrlFailsWithoutLogging) {
 TEST(BXPlugInCoreSetup, MissingIdentifierFailsAndLogsThePath) {
     testing::internal::CaptureStderr();
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::nullopt, std::string(kSharePath), shareInfo(),
-                                                                 std::nullopt, std::nullopt);
+                                                                  std::nullopt, std::nullopt);
     std::string log = testing::internal::GetCapturedStderr();
     EXPECT_EQ(record, nullptr);
     EXPECT_NE(log.find(std::string("missing identifier in plug-in at ") + kSharePath), std::string::npos) << log;
@@ -101,8 +101,8 @@ TEST(BXPlugInCoreSetup, InformationDictionaryOfWrongKindFailsAndChangesNothing) 
 
 TEST(BXPlugInCoreSetup, InfoArgumentIsUsedOnlyByTheFactoryAndOnlyWithoutRZExtension) {
     Value info = dict({{"RZExtensionProtocol", str("P")}});
-    auto built = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
-                                                                std::nullopt, info, std::nullopt);
+    auto built = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath), std::nullopt,
+                                                                 info, std::nullopt);
     ASSERT_TRUE(built);
     ASSERT_TRUE(built->plugInDictionary());
     EXPECT_TRUE(built->plugInDictionary()->identical(info));
@@ -114,8 +114,8 @@ TEST(BXPlugInCoreSetup, InfoArgumentIsUsedOnlyByTheFactoryAndOnlyWithoutRZExtens
     EXPECT_FALSE(setUp.plugInDictionary());
 
     Value bundle = shareInfo();
-    auto both = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kSharePath), bundle,
-                                                               info, std::nullopt);
+    auto both = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kSharePath), bundle, info,
+                                                                std::nullopt);
     ASSERT_TRUE(both);
     EXPECT_TRUE(both->plugInDictionary()->identical(*bundle.find("RZExtension")));
 }
@@ -147,7 +147,7 @@ TEST(BXPlugInCoreSetup, ObsoleteMultipleKeyIsLoggedAndIgnored) {
 // A subclass that rewrites the information dictionary before it is stored, as a builder with its own conventions
 // would.
 class NormalizingRecord : public BXPlugInCore {
-public:
+  public:
     Value normalizeInfoDictionary(const Value& info) override {
         MutableDictionary copy(info);
         copy.set("RZExtension", dict({{"RZExtensionProtocol", str("Normalized")}}));
@@ -221,9 +221,10 @@ TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValue) {
         std::optional<Value> value;
         bool expected;
     };
-    std::vector<Case> cases = {{std::nullopt, false},       {Value::int64(1), true},       {Value::boolean(true), true},
-                               {Value::boolean(false), false}, {Value::int64(0), false},   {Value::real(0.5), true},
-                               {Value::uint64(7), true},       {str("YES"), false},        {Value::emptyDictionary(), false}};
+    std::vector<Case> cases = {
+        {std::nullopt, false},          {Value::int64(1), true},  {Value::boolean(true), true},
+        {Value::boolean(false), false}, {Value::int64(0), false}, {Value::real(0.5), true},
+        {Value::uint64(7), true},       {str("YES"), false},      {Value::emptyDictionary(), false}};
     for (const Case& c : cases) {
         Entries plugIn;
         if (c.value) plugIn.push_back({"Dedicated", *c.value});
@@ -234,7 +235,9 @@ TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValue) {
 }
 
 TEST(BXPlugInCoreDerived, DataOnlyForExactlyHashData) {
-    auto isData = [](Value protocol) { return recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", protocol}})->isData(); };
+    auto isData = [](Value protocol) {
+        return recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", protocol}})->isData();
+    };
     EXPECT_TRUE(isData(str("#Data")));
     EXPECT_FALSE(isData(str("#data")));
     EXPECT_FALSE(isData(str("#Data ")));
@@ -259,7 +262,8 @@ TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeys) {
     auto current = makeRecord(kSharePath, shareInfo());
     EXPECT_FALSE(current->oldStyle());
 
-    auto old = makeRecord(kToolPath, dict({{"Bexil", Value::emptyDictionary()}, {"RZExtension", Value::emptyDictionary()}}));
+    auto old =
+        makeRecord(kToolPath, dict({{"Bexil", Value::emptyDictionary()}, {"RZExtension", Value::emptyDictionary()}}));
     EXPECT_FALSE(old->oldStyle()) << "RZExtension decides first";
 
     BXPlugInCore legacy;
@@ -283,8 +287,8 @@ TEST(BXPlugInCoreDerived, NeitherStyleIsAFaultAndAnswersOldStyle) {
 // ---- Canonical shape ----
 
 TEST(BXPlugInCoreCanonicalize, AddsAttributesWithVersionFromTheBundle) {
-    Value info = dict({{"BDBundleShortVersionString", str("3.1")},
-                       {"RZExtension", dict({{"RZExtensionProtocol", str("P")}})}});
+    Value info =
+        dict({{"BDBundleShortVersionString", str("3.1")}, {"RZExtension", dict({{"RZExtensionProtocol", str("P")}})}});
     auto record = makeRecord(kToolPath, info);
     ASSERT_TRUE(record);
     EXPECT_FALSE(record->attributes());
@@ -335,8 +339,9 @@ TEST(BXPlugInCoreDiagnose, EachCheckHasItsMessageAndTheFirstFailureWins) {
                     "Application Extensions may not use the \"PrincipalClass\" key");
     expectDiagnosis(*makeRecord(kSharePath, shareInfo({{"PrincipalClass", Value::int64(1)}})),
                     "Application Extensions may not use the \"PrincipalClass\" key");
-    expectDiagnosis(*makeRecord(kSharePath, shareInfo({{"PassProxy", Value::boolean(false)}, {"EmbeddedCode", str("x")}})),
-                    "the \"PassProxy\" key is not supported on this platform");
+    expectDiagnosis(
+        *makeRecord(kSharePath, shareInfo({{"PassProxy", Value::boolean(false)}, {"EmbeddedCode", str("x")}})),
+        "the \"PassProxy\" key is not supported on this platform");
     expectDiagnosis(*makeRecord(kSharePath, shareInfo({{"EmbeddedCode", str("Contents/Code")}})),
                     "hybrid plug-ins are not supported on this platform");
 }
@@ -355,11 +360,11 @@ TEST(BXPlugInCoreDiagnose, UsableRecordsPass) {
 TEST(BXPlugInCoreIdentity, EqualityAndHashFollowTheUuidAlone) {
     Uuid shared = Uuid::random();
     auto a = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.a", std::string("/a.wexa"), std::nullopt,
-                                                            std::nullopt, shared);
+                                                             std::nullopt, shared);
     auto b = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.b", std::string("/b.bundle"), shareInfo(),
-                                                            std::nullopt, shared);
+                                                             std::nullopt, shared);
     auto c = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.a", std::string("/a.wexa"), std::nullopt,
-                                                            std::nullopt, Uuid::random());
+                                                             std::nullopt, Uuid::random());
     EXPECT_TRUE(*a == *b);
     EXPECT_EQ(a->hash(), b->hash());
     EXPECT_EQ(std::hash<BXPlugInCore>()(*a), a->hash());
@@ -428,7 +433,7 @@ TEST(BXPlugInCoreAnnotations, AbsentAnnotationsStayAbsent) {
 
 // Answers the plug-in dictionary's keys from its own table, as the daemon's record answers them from the registry.
 class RedirectingRecord : public BXPlugInCore {
-public:
+  public:
     std::map<std::string, Value, std::less<>> table;
     std::optional<Value> pluginKey(std::string_view key) const override {
         auto it = table.find(key);
@@ -443,8 +448,8 @@ public:
 
 TEST(BXPlugInCoreRedirect, DerivedPropertiesFollowRedirectedLookUps) {
     RedirectingRecord record;
-    ASSERT_TRUE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.redirect", std::string(kToolPath),
-                                                          std::nullopt, std::nullopt, std::nullopt));
+    ASSERT_TRUE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.redirect", std::string(kToolPath), std::nullopt,
+                                                          std::nullopt, std::nullopt));
     EXPECT_FALSE(record.plugInDictionary());
     record.table = {{"RZExtensionProtocol", str("#Data")},
                     {"RZExtensionPointIdentifier", str("com.quorvel.widgets")},

@@ -29,7 +29,7 @@ Value widgetInfo() {
 // A record as a builder fills it in: every stored property that the form carries has a value.
 std::shared_ptr<BXPlugInCore> fullRecord() {
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.notes.widget", std::string(kPath),
-                                                                 widgetInfo(), std::nullopt, std::nullopt);
+                                                                  widgetInfo(), std::nullopt, std::nullopt);
     record->setOriginalIdentifier("com.example.notes.widget.original");
     record->setHubProtocolVersion(2);
     record->setOnSystemVolume(true);
@@ -57,10 +57,9 @@ std::set<std::string> keysOf(const Value& dictionary) {
     return keys;
 }
 
-const std::set<std::string> kAlwaysWritten = {"hubProtocolVersion", "path",   "systemResident",
-                                              "identifier",         "original-identifier", "version",
-                                              "bundleInfo",         "info",   "uuid",
-                                              "lastmodified",       "annotations"};
+const std::set<std::string> kAlwaysWritten = {
+    "hubProtocolVersion", "path", "systemResident", "identifier",   "original-identifier", "version",
+    "bundleInfo",         "info", "uuid",           "lastmodified", "annotations"};
 
 // Reads a form, swallowing the log lines a failing read writes.
 std::shared_ptr<BXPlugInCore> read(const Value& form, std::string* log = nullptr) {
@@ -112,7 +111,7 @@ TEST(BXPlugInFormExport, BundleInfoNeverCarriesItsOwnLocationAndTheRecordKeepsIt
 
 TEST(BXPlugInFormExport, MinimalRecordWritesOnlyTheAlwaysPresentEntries) {
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.min", std::string("/x.bundle"),
-                                                                 widgetInfo(), std::nullopt, std::nullopt);
+                                                                  widgetInfo(), std::nullopt, std::nullopt);
     record->setOriginalIdentifier("com.example.min");
     Value form = exported(*record);
     EXPECT_EQ(keysOf(form), kAlwaysWritten);
@@ -260,7 +259,8 @@ TEST(BXPlugInFormRead, EntriesOfUnexpectedKindsTakeTheirDefaults) {
         {"containingPath", Value::emptyDictionary(), [](const BXPlugInCore& r) { return !r.containingUrl(); }},
         {"localizedDisplayName", Value::int64(3), [](const BXPlugInCore& r) { return !r.localizedName(); }},
         {"hash", str("abcd"), [](const BXPlugInCore& r) { return !r.cdhash(); }},
-        {"requirement", Value::data(std::vector<uint8_t>{1, 2}), [](const BXPlugInCore& r) { return !r.requirement(); }},
+        {"requirement", Value::data(std::vector<uint8_t>{1, 2}),
+         [](const BXPlugInCore& r) { return !r.requirement(); }},
         {"info", str("not used anyway"), [](const BXPlugInCore& r) { return r.plugInDictionary().has_value(); }},
     };
     for (const Case& c : cases) {

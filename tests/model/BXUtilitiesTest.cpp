@@ -1,6 +1,6 @@
-#include "model/BXUtilities.h"
-
 #include <gtest/gtest.h>
+
+#include "model/BXUtilities.h"
 
 namespace bexil {
 namespace {
@@ -69,20 +69,16 @@ TEST_P(CompareVersionString, OrdersDigitRunsByValue) {
 
 INSTANTIATE_TEST_SUITE_P(
     Versions, CompareVersionString,
-    testing::Values(VersionCase{"1.10", "1.9", ComparisonResult::Descending},
-                    VersionCase{"1.2", "1.2", ComparisonResult::Same},
-                    VersionCase{"1.2a", "1.2b", ComparisonResult::Ascending},
-                    VersionCase{"10", "9", ComparisonResult::Descending},
-                    VersionCase{"2", "10", ComparisonResult::Ascending},
-                    VersionCase{"1.0", "1", ComparisonResult::Descending},
-                    VersionCase{"A", "a", ComparisonResult::Ascending},
-                    VersionCase{"", "", ComparisonResult::Same},
-                    VersionCase{"", "0", ComparisonResult::Ascending},
-                    VersionCase{"1.9.9", "1.10", ComparisonResult::Ascending},
-                    VersionCase{"1a", "1.", ComparisonResult::Descending},
-                    // Runs longer than any integer type still compare by value.
-                    VersionCase{"99999999999999999999999", "100000000000000000000000", ComparisonResult::Ascending},
-                    VersionCase{"1.2.3-beta", "1.2.3-beta", ComparisonResult::Same}));
+    testing::Values(
+        VersionCase{"1.10", "1.9", ComparisonResult::Descending}, VersionCase{"1.2", "1.2", ComparisonResult::Same},
+        VersionCase{"1.2a", "1.2b", ComparisonResult::Ascending}, VersionCase{"10", "9", ComparisonResult::Descending},
+        VersionCase{"2", "10", ComparisonResult::Ascending}, VersionCase{"1.0", "1", ComparisonResult::Descending},
+        VersionCase{"A", "a", ComparisonResult::Ascending}, VersionCase{"", "", ComparisonResult::Same},
+        VersionCase{"", "0", ComparisonResult::Ascending}, VersionCase{"1.9.9", "1.10", ComparisonResult::Ascending},
+        VersionCase{"1a", "1.", ComparisonResult::Descending},
+        // Runs longer than any integer type still compare by value.
+        VersionCase{"99999999999999999999999", "100000000000000000000000", ComparisonResult::Ascending},
+        VersionCase{"1.2.3-beta", "1.2.3-beta", ComparisonResult::Same}));
 
 }  // namespace
 }  // namespace bexil
