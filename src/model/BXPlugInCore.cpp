@@ -157,7 +157,8 @@ std::shared_ptr<BXPlugInCore> BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(st
     if (!record->setupWithNameUrlBundleInfoInfoUuid(std::move(identifier), std::move(url), std::move(bundleInfo), info,
                                                     uuid))
         return nullptr;
-    if (!record->plugInDictionary()) record->setPlugInDictionary(std::move(info));
+    // Only a dictionary can stand in for the plug-in dictionary; anything else counts as no `info`.
+    if (!record->plugInDictionary() && info && info->isDictionary()) record->setPlugInDictionary(std::move(info));
     return record;
 }
 

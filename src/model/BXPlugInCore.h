@@ -34,7 +34,7 @@ class BXPlugInCore {
     // ---- Construction ----
 
     // A set-up record, or an empty pointer when set-up fails. When set-up succeeded and the record still has no
-    // plug-in dictionary, `info` becomes it; this is the only place that reads `info`.
+    // plug-in dictionary, `info` (when it is a dictionary) becomes it; this is the only place that reads `info`.
     static std::shared_ptr<BXPlugInCore> initWithNameUrlBundleInfoInfoUuid(std::optional<std::string> identifier,
                                                                            std::optional<std::string> url,
                                                                            std::optional<Value> bundleInfo,

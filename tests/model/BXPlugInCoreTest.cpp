@@ -113,6 +113,11 @@ TEST(BXPlugInCoreSetup, InfoArgumentIsUsedOnlyByTheFactoryAndOnlyWithoutRZExtens
                                                          std::nullopt));
     EXPECT_FALSE(setUp.plugInDictionary());
 
+    auto notADictionary = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
+                                                                          std::nullopt, str("flat"), std::nullopt);
+    ASSERT_TRUE(notADictionary);
+    EXPECT_FALSE(notADictionary->plugInDictionary());
+
     Value bundle = shareInfo();
     auto both = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kSharePath), bundle, info,
                                                                 std::nullopt);
