@@ -1,0 +1,481 @@
+// The record keeps its facts in plain fields behind one small lock and derives everything else on demand through
+// the three primitive look-ups, so a subclass that answers those from elsewhere (the registry, in the daemon) gets
+// every derived property for free. Nothing here caches a derived value: the dictionaries may be replaced while the
+// record is shared, and a cache would have to be invalidated in the same atomic step.
+
+#include "model/BXPlugInCore.h"
+
+#include <cstdio>
+#include <initializer_list>
+
+#include "model/BXUtilities.h"
+
+namespace bexil {
+
+namespace {
+
+enum class ModelLogLevel { Debug, Info, Default, Error, Fault };
+
+// FIXME: the ops log channel is not in the tree yet; until it is, the record's log lines go to standard error
+// through this one function. `format` is the channel's printf-style text; each "%@" / "%{public}@" takes the next
+// argument's text.
+void logOps(ModelLogLevel level, std::string_view format, std::initializer_list<std::string_view> args) {
+    static constexpr const char* kLevelNames[] = {"debug", "info", "default", "error", "fault"};
+    std::string text;
+    auto arg = args.begin();
+    for (size_t i = 0; i < format.size();) {
+        std::string_view rest = format.substr(i);
+        size_t skip = rest.starts_with("%{public}@") ? 10 : rest.starts_with("%@") ? 2 : 0;
+        if (skip != 0 && arg != args.end()) {
+            text.append(*arg++);
+            i += skip;
+        } else {
+            text.push_back(format[i++]);
+        }
+    }
+    std::fprintf(stderr, "bexil[ops] %s: %s\n", kLevelNames[static_cast<int>(level)], text.c_str());
+}
+
+// The plug-in configuration vocabulary: keys of the information, plug-in and attributes dictionaries.
+namespace keys {
+constexpr std::string_view kRZExtension = "RZExtension";
+constexpr std::string_view kBexil = "Bexil";
+constexpr std::string_view kBDBundleShortVersionString = "BDBundleShortVersionString";
+constexpr std::string_view kBDBundleInfoVrecURL = "BDBundleInfoVrecURL";
+constexpr std::string_view kMultiple = "Multiple";
+constexpr std::string_view kRZExtensionAttributes = "RZExtensionAttributes";
+constexpr std::string_view kRZExtensionProtocol = "RZExtensionProtocol";
+constexpr std::string_view kPrincipalClass = "PrincipalClass";
+constexpr std::string_view kEmbeddedCode = "EmbeddedCode";
+constexpr std::string_view kEmbeddedProtocol = "EmbeddedProtocol";
+constexpr std::string_view kDedicated = "Dedicated";
+constexpr std::string_view kPassProxy = "PassProxy";
+constexpr std::string_view kRZExtensionPointIdentifier = "RZExtensionPointIdentifier";
+constexpr std::string_view kRZExtensionVersion = "RZExtensionVersion";
+}  // namespace keys
+
+// Entries of the serialised form.
+namespace form {
+constexpr std::string_view kHubProtocolVersion = "hubProtocolVersion";
+constexpr std::string_view kPath = "path";
+constexpr std::string_view kSystemResident = "systemResident";
+constexpr std::string_view kIdentifier = "identifier";
+constexpr std::string_view kOriginalIdentifier = "original-identifier";
+constexpr std::string_view kVersion = "version";
+constexpr std::string_view kBundleInfo = "bundleInfo";
+constexpr std::string_view kInfo = "info";
+constexpr std::string_view kUuid = "uuid";
+constexpr std::string_view kLastModified = "lastmodified";
+constexpr std::string_view kAnnotations = "annotations";
+constexpr std::string_view kEntitlements = "entitlements";
+constexpr std::string_view kContainingPath = "containingPath";
+constexpr std::string_view kLocalizedContainingDisplayName = "localizedContainingDisplayName";
+constexpr std::string_view kLocalizedDisplayName = "localizedDisplayName";
+constexpr std::string_view kLocalizedShortName = "localizedShortName";
+constexpr std::string_view kHash = "hash";
+constexpr std::string_view kRequirement = "requirement";
+}  // namespace form
+
+// The truth value of a configuration entry: booleans as they are, numbers when not zero. Anything else (a string,
+// a dictionary) is not a truth value and counts as NO.
+bool truthValue(const std::optional<Value>& v) {
+    if (!v) return false;
+    if (std::optional<bool> b = v->getBool()) return *b;
+    if (std::optional<double> d = v->numberAsDouble()) return *d != 0;
+    return false;
+}
+
+bool isString(const std::optional<Value>& v, std::string_view text) {
+    return v && v->isString() && v->stringView() == text;
+}
+
+std::optional<Value> lookUp(const std::optional<Value>& dictionary, std::string_view key) {
+    if (!dictionary) return std::nullopt;
+    const Value* found = dictionary->find(key);
+    if (found == nullptr) return std::nullopt;
+    return *found;
+}
+
+constexpr std::string_view kRZObject = "RZObject";
+constexpr int kInvalidConfiguration = 12;
+
+Error invalidConfiguration(std::string message) { return BXError(kInvalidConfiguration, message); }
+
+// Forms come from disk and from the wire, so every entry is read by kind: a value of another kind (or a null) reads
+// as absent and the caller applies the default. Nothing here trusts that the writer was our own exportForm.
+const Value* formEntry(const Value& form, std::string_view key) {
+    const Value* v = form.find(key);
+    return v == nullptr || v->isNull() ? nullptr : v;
+}
+
+std::optional<std::string> formString(const Value& form, std::string_view key) {
+    const Value* v = formEntry(form, key);
+    if (v == nullptr || !v->isString()) return std::nullopt;
+    return *v->getString();
+}
+
+// A path that names a file: a non-empty string. Anything else gives no URL.
+std::optional<std::string> formPath(const Value& form, std::string_view key) {
+    std::optional<std::string> p = formString(form, key);
+    if (p && p->empty()) return std::nullopt;
+    return p;
+}
+
+std::optional<Value> formOfKind(const Value& form, std::string_view key, ValueKind kind) {
+    const Value* v = formEntry(form, key);
+    if (v == nullptr || v->kind() != kind) return std::nullopt;
+    return *v;
+}
+
+// The canonical UUID text; a UUID-kind value is taken too, since a wire conversion may have produced one.
+std::optional<Uuid> formUuid(const Value& form) {
+    const Value* v = formEntry(form, form::kUuid);
+    if (v == nullptr) return std::nullopt;
+    if (const Uuid* u = v->getUuid()) return *u;
+    if (v->isString()) return Uuid::parse(v->stringView());
+    return std::nullopt;
+}
+
+void setIfPresent(MutableDictionary& out, std::string_view key, const std::optional<std::string>& v) {
+    if (v) out.set(key, Value::string(*v));
+}
+
+void setIfPresent(MutableDictionary& out, std::string_view key, const std::optional<Value>& v) {
+    if (v) out.set(key, *v);
+}
+
+}  // namespace
+
+// ---- Construction ----
+
+std::shared_ptr<BXPlugInCore> BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::optional<std::string> identifier,
+                                                                              std::optional<std::string> url,
+                                                                              std::optional<Value> bundleInfo,
+                                                                              std::optional<Value> info,
+                                                                              std::optional<Uuid> uuid) {
+    auto record = std::make_shared<BXPlugInCore>();
+    if (!record->setupWithNameUrlBundleInfoInfoUuid(std::move(identifier), std::move(url), std::move(bundleInfo), info,
+                                                    uuid))
+        return nullptr;
+    // Only a dictionary can stand in for the plug-in dictionary; anything else counts as no `info`.
+    if (!record->plugInDictionary() && info && info->isDictionary()) record->setPlugInDictionary(std::move(info));
+    return record;
+}
+
+std::shared_ptr<BXPlugInCore> BXPlugInCore::initWithForm(const Value& form) {
+    auto record = std::make_shared<BXPlugInCore>();
+    if (!record->setupWithForm(form)) return nullptr;
+    return record;
+}
+
+bool BXPlugInCore::setupWithNameUrlBundleInfoInfoUuid(std::optional<std::string> identifier,
+                                                      std::optional<std::string> url, std::optional<Value> bundleInfo,
+                                                      std::optional<Value> /*info*/, std::optional<Uuid> uuid) {
+    if (!url) return false;
+    if (!identifier) {
+        logOps(ModelLogLevel::Error, "missing identifier in plug-in at %@", {*url});
+        return false;
+    }
+    if (bundleInfo) {
+        if (!setDictionaries(normalizeInfoDictionary(*bundleInfo))) {
+            logOps(ModelLogLevel::Default, "malformed plug-in dictionary in plug-in %@ at %@: %@",
+                   {*identifier, *url, bundleInfo->description()});
+            return false;
+        }
+    }
+    setIdentifier(std::move(identifier));
+    setUrl(std::move(url));
+    setUuid(uuid ? *uuid : Uuid::random());
+    return true;
+}
+
+// ---- Dictionaries ----
+
+bool BXPlugInCore::setDictionaries(const Value& info) {
+    if (!info.isDictionary()) return false;
+    setBundleInfoDictionary(info);
+    const Value* plugIn = info.find(keys::kRZExtension);
+    if (plugIn == nullptr || !plugIn->isDictionary()) return false;
+    setPlugInDictionary(*plugIn);
+    if (plugIn->contains(keys::kMultiple))
+        logOps(ModelLogLevel::Default, "multiplexed plug-ins (%{public}@ key) obsolete and ignored", {keys::kMultiple});
+    return true;
+}
+
+Value BXPlugInCore::normalizeInfoDictionary(const Value& info) { return info; }
+
+void BXPlugInCore::canonicalize() {
+    std::optional<Value> existing = attributes();
+    MutableDictionary attrs(existing ? *existing : Value::emptyDictionary());
+    bool hasVersion = attribute(keys::kRZExtensionVersion).has_value();
+    if (!hasVersion) {
+        std::optional<Value> shortVersion = infoKey(keys::kBDBundleShortVersionString);
+        attrs.set(keys::kRZExtensionVersion, shortVersion ? *shortVersion : Value::string("1"));
+    }
+    std::optional<Value> current = plugInDictionary();
+    MutableDictionary plugIn(current ? *current : Value::emptyDictionary());
+    plugIn.set(keys::kRZExtensionAttributes, attrs.take());
+    setPlugInDictionary(plugIn.take());
+}
+
+// ---- Checks and annotations ----
+
+std::optional<Error> BXPlugInCore::diagnose() const {
+    if (!identifier())
+        return invalidConfiguration("missing identifier (no RZExtensionIdentifier, nor even BDBundleIdentifier)");
+    if (!protocolSpec()) return invalidConfiguration("missing \"RZExtensionProtocol\" key in Info.vrec or SDK");
+    if (!attributes()) return invalidConfiguration("missing \"RZExtensionAttributes\" key in Info.vrec or SDK");
+    if (isAppExtension() && !isString(principalSpec(), kRZObject))
+        return invalidConfiguration("Application Extensions may not use the \"PrincipalClass\" key");
+    if (pluginKey(keys::kPassProxy))
+        return invalidConfiguration("the \"PassProxy\" key is not supported on this platform");
+    if (isHybrid()) return invalidConfiguration("hybrid plug-ins are not supported on this platform");
+    return std::nullopt;
+}
+
+void BXPlugInCore::setAnnotationValue(std::string_view key, const std::optional<Value>& value) {
+    // Read, build the new dictionary outside the lock, and store it only if nobody replaced the annotations in the
+    // meantime; otherwise start again from theirs, so that two concurrent changes of different keys both survive.
+    for (;;) {
+        std::optional<Value> before = annotations();
+        std::optional<Value> after = dictionaryChangingTo(before, key, value);
+        std::lock_guard<std::mutex> guard(mutex_);
+        bool unchanged =
+            before.has_value() == annotations_.has_value() && (!before || before->identical(*annotations_));
+        if (unchanged) {
+            annotations_.swap(after);
+            return;
+        }
+    }
+}
+
+// ---- Identity ----
+
+bool BXPlugInCore::isEqual(const BXPlugInCore& other) const {
+    std::optional<Uuid> mine = uuid();
+    if (!mine) throw InternalInconsistency("self.uuid");
+    if (&other == this) return true;
+    std::optional<Uuid> theirs = other.uuid();
+    return theirs && *theirs == *mine;
+}
+
+size_t BXPlugInCore::hash() const {
+    std::optional<Uuid> mine = uuid();
+    if (!mine) throw InternalInconsistency("self.uuid");
+    return std::hash<Uuid>()(*mine);
+}
+
+size_t BXPlugInCoreHash::operator()(const BXPlugInCore* record) const { return record ? record->hash() : 0; }
+
+bool BXPlugInCoreEqual::operator()(const BXPlugInCore* a, const BXPlugInCore* b) const {
+    if (a == nullptr || b == nullptr) return a == b;
+    return a->isEqual(*b);
+}
+
+// ---- Primitive look-ups ----
+
+std::optional<Value> BXPlugInCore::infoKey(std::string_view key) const { return lookUp(bundleInfoDictionary(), key); }
+
+std::optional<Value> BXPlugInCore::pluginKey(std::string_view key) const { return lookUp(plugInDictionary(), key); }
+
+std::optional<Value> BXPlugInCore::attribute(std::string_view key) const {
+    std::optional<Value> attrs = attributes();
+    return lookUp(attrs, key);
+}
+
+// ---- Derived properties ----
+
+std::optional<std::string> BXPlugInCore::path() const { return url(); }
+
+std::optional<std::string> BXPlugInCore::containingPath() const { return containingUrl(); }
+
+std::optional<Value> BXPlugInCore::attributes() const { return pluginKey(keys::kRZExtensionAttributes); }
+
+std::optional<Value> BXPlugInCore::version() const { return attribute(keys::kRZExtensionVersion); }
+
+std::optional<Value> BXPlugInCore::protocolSpec() const {
+    if (std::optional<Value> spec = pluginKey(keys::kRZExtensionProtocol)) return spec;
+    if (isAppExtension()) return Value::string(kRZObject);
+    return std::nullopt;
+}
+
+std::optional<Value> BXPlugInCore::principalSpec() const {
+    if (std::optional<Value> spec = pluginKey(keys::kPrincipalClass)) return spec;
+    if (isAppExtension()) return Value::string(kRZObject);
+    return std::nullopt;
+}
+
+std::optional<Value> BXPlugInCore::sdkSpec() const { return pluginKey(keys::kRZExtensionPointIdentifier); }
+
+std::optional<std::string> BXPlugInCore::embeddedCodePath() const { return std::nullopt; }
+
+std::optional<Value> BXPlugInCore::embeddedProtocolSpec() const {
+    if (std::optional<Value> spec = pluginKey(keys::kEmbeddedProtocol)) return spec;
+    return protocolSpec();
+}
+
+bool BXPlugInCore::isAppExtension() const {
+    std::optional<std::string> p = path();
+    return p && p->ends_with(".wexa");
+}
+
+bool BXPlugInCore::isMultiplexed() const { return false; }
+
+bool BXPlugInCore::isHybrid() const { return pluginKey(keys::kEmbeddedCode).has_value(); }
+
+bool BXPlugInCore::isDedicated() const { return truthValue(pluginKey(keys::kDedicated)); }
+
+bool BXPlugInCore::isData() const { return isString(protocolSpec(), "#Data"); }
+
+bool BXPlugInCore::oldStyle() const {
+    if (infoKey(keys::kRZExtension)) return false;
+    if (infoKey(keys::kBexil)) return true;
+    std::string who = description();
+    logOps(ModelLogLevel::Fault, "unknown plug-in configuration style (%{public}@ of %@)", {"oldStyle", who});
+    return true;
+}
+
+Date BXPlugInCore::timestamp() const { return Date{static_cast<double>(lastModified())}; }
+
+std::string BXPlugInCore::description() const {
+    std::optional<Uuid> u = uuid();
+    return "<BXPlugInCore " + identifier().value_or("(no identifier)") + " " + (u ? u->string() : "(no uuid)") + " " +
+           url().value_or("(no path)") + ">";
+}
+
+// ---- Form ----
+
+Result<MutableDictionary> BXPlugInCore::exportForm() const {
+    // The information dictionary is shared as it is unless it carries the key the form must never hold.
+    std::optional<Value> bundleInfo = bundleInfoDictionary();
+    if (bundleInfo && bundleInfo->contains(keys::kBDBundleInfoVrecURL)) {
+        MutableDictionary copy(*bundleInfo);
+        copy.remove(keys::kBDBundleInfoVrecURL);
+        bundleInfo = copy.take();
+    }
+
+    MutableDictionary out;
+    out.reserve(16);
+    out.set(form::kHubProtocolVersion, Value::uint64(hubProtocolVersion()));
+    setIfPresent(out, form::kPath, path());
+    out.set(form::kSystemResident, Value::boolean(onSystemVolume()));
+    setIfPresent(out, form::kIdentifier, load(identifier_));
+    setIfPresent(out, form::kOriginalIdentifier, load(originalIdentifier_));
+    setIfPresent(out, form::kVersion, version());
+    setIfPresent(out, form::kBundleInfo, bundleInfo);
+    setIfPresent(out, form::kInfo, plugInDictionary());
+    if (std::optional<Uuid> u = uuid()) out.set(form::kUuid, Value::string(u->string()));
+    out.set(form::kLastModified, Value::int64(lastModified()));
+    std::optional<Value> notes = annotations();
+    out.set(form::kAnnotations, notes ? *notes : Value::emptyDictionary());
+
+    setIfPresent(out, form::kEntitlements, entitlements());
+    setIfPresent(out, form::kContainingPath, containingPath());
+    setIfPresent(out, form::kLocalizedContainingDisplayName, load(localizedContainingName_));
+    setIfPresent(out, form::kLocalizedDisplayName, load(localizedName_));
+    setIfPresent(out, form::kLocalizedShortName, load(localizedShortName_));
+    return out;
+}
+
+bool BXPlugInCore::setupWithForm(const Value& form) {
+    std::optional<std::string> url = formPath(form, form::kPath);
+    std::optional<Uuid> uuid = formUuid(form);
+    std::optional<Value> bundleInfo;
+    if (const Value* v = formEntry(form, form::kBundleInfo)) bundleInfo = *v;
+    std::optional<Value> info;
+    if (const Value* v = formEntry(form, form::kInfo)) info = *v;
+    if (!setupWithNameUrlBundleInfoInfoUuid(formString(form, form::kIdentifier), std::move(url), std::move(bundleInfo),
+                                            std::move(info), uuid))
+        return false;
+
+    uint32_t generation = 1;
+    if (const Value* v = formEntry(form, form::kHubProtocolVersion)) {
+        std::optional<uint64_t> n = v->isBool() ? std::nullopt : v->numberAsUInt64();
+        if (n && *n <= UINT32_MAX) generation = static_cast<uint32_t>(*n);
+    }
+    setHubProtocolVersion(generation);
+    store(originalIdentifier_, textEntry(form, form::kOriginalIdentifier));
+    setCdhash(formOfKind(form, form::kHash, ValueKind::Data));
+    store(requirement_, textEntry(form, form::kRequirement));
+
+    int32_t seconds = 0;
+    if (const Value* v = formEntry(form, form::kLastModified)) {
+        std::optional<int64_t> n = v->isBool() ? std::nullopt : v->numberAsInt64();
+        if (n && *n >= INT32_MIN && *n <= INT32_MAX) seconds = static_cast<int32_t>(*n);
+    }
+    setLastModified(seconds);
+    setEntitlements(formOfKind(form, form::kEntitlements, ValueKind::Dictionary));
+    if (std::optional<std::string> containing = formPath(form, form::kContainingPath))
+        setContainingUrl(std::move(containing));
+    const Value* resident = formEntry(form, form::kSystemResident);
+    setOnSystemVolume(resident != nullptr && truthValue(*resident));
+    setAnnotations(formOfKind(form, form::kAnnotations, ValueKind::Dictionary));
+    store(localizedName_, textEntry(form, form::kLocalizedDisplayName));
+    store(localizedShortName_, textEntry(form, form::kLocalizedShortName));
+    store(localizedContainingName_, textEntry(form, form::kLocalizedContainingDisplayName));
+    return true;
+}
+
+void BXPlugInCore::updateFromForm(const Value& form) {
+    setAnnotations(formOfKind(form, form::kAnnotations, ValueKind::Dictionary));
+}
+
+// ---- Stored properties ----
+
+std::optional<std::string> BXPlugInCore::loadText(const std::optional<Value>& field) const {
+    std::optional<Value> v = load(field);
+    if (!v) return std::nullopt;
+    return std::string(v->stringView());
+}
+
+std::optional<Value> BXPlugInCore::textValue(std::optional<std::string> text) {
+    if (!text) return std::nullopt;
+    return Value::string(std::move(*text));
+}
+
+std::optional<Value> BXPlugInCore::textEntry(const Value& form, std::string_view key) {
+    return formOfKind(form, key, ValueKind::String);
+}
+
+std::optional<std::string> BXPlugInCore::identifier() const { return loadText(identifier_); }
+void BXPlugInCore::setIdentifier(std::optional<std::string> v) { store(identifier_, textValue(std::move(v))); }
+std::optional<std::string> BXPlugInCore::originalIdentifier() const { return loadText(originalIdentifier_); }
+void BXPlugInCore::setOriginalIdentifier(std::optional<std::string> v) {
+    store(originalIdentifier_, textValue(std::move(v)));
+}
+std::optional<std::string> BXPlugInCore::url() const { return loadText(url_); }
+void BXPlugInCore::setUrl(std::optional<std::string> v) { store(url_, textValue(std::move(v))); }
+std::optional<Value> BXPlugInCore::bundleInfoDictionary() const { return load(bundleInfoDictionary_); }
+void BXPlugInCore::setBundleInfoDictionary(std::optional<Value> v) { store(bundleInfoDictionary_, std::move(v)); }
+std::optional<Value> BXPlugInCore::plugInDictionary() const { return load(plugInDictionary_); }
+void BXPlugInCore::setPlugInDictionary(std::optional<Value> v) { store(plugInDictionary_, std::move(v)); }
+std::optional<Value> BXPlugInCore::entitlements() const { return load(entitlements_); }
+void BXPlugInCore::setEntitlements(std::optional<Value> v) { store(entitlements_, std::move(v)); }
+std::optional<Value> BXPlugInCore::annotations() const { return load(annotations_); }
+void BXPlugInCore::setAnnotations(std::optional<Value> v) { store(annotations_, std::move(v)); }
+std::optional<std::string> BXPlugInCore::containingUrl() const { return loadText(containingUrl_); }
+void BXPlugInCore::setContainingUrl(std::optional<std::string> v) { store(containingUrl_, textValue(std::move(v))); }
+bool BXPlugInCore::onSystemVolume() const { return load(onSystemVolume_); }
+void BXPlugInCore::setOnSystemVolume(bool v) { store(onSystemVolume_, v); }
+uint32_t BXPlugInCore::hubProtocolVersion() const { return load(hubProtocolVersion_); }
+void BXPlugInCore::setHubProtocolVersion(uint32_t v) { store(hubProtocolVersion_, v); }
+std::optional<std::string> BXPlugInCore::localizedName() const { return loadText(localizedName_); }
+void BXPlugInCore::setLocalizedName(std::optional<std::string> v) { store(localizedName_, textValue(std::move(v))); }
+std::optional<std::string> BXPlugInCore::localizedShortName() const { return loadText(localizedShortName_); }
+void BXPlugInCore::setLocalizedShortName(std::optional<std::string> v) {
+    store(localizedShortName_, textValue(std::move(v)));
+}
+std::optional<std::string> BXPlugInCore::localizedContainingName() const { return loadText(localizedContainingName_); }
+void BXPlugInCore::setLocalizedContainingName(std::optional<std::string> v) {
+    store(localizedContainingName_, textValue(std::move(v)));
+}
+int32_t BXPlugInCore::lastModified() const { return load(lastModified_); }
+void BXPlugInCore::setLastModified(int32_t v) { store(lastModified_, v); }
+std::optional<Uuid> BXPlugInCore::uuid() const { return load(uuid_); }
+void BXPlugInCore::setUuid(std::optional<Uuid> v) { store(uuid_, v); }
+std::optional<Value> BXPlugInCore::cdhash() const { return load(cdhash_); }
+void BXPlugInCore::setCdhash(std::optional<Value> v) { store(cdhash_, std::move(v)); }
+std::optional<std::string> BXPlugInCore::requirement() const { return loadText(requirement_); }
+void BXPlugInCore::setRequirement(std::optional<std::string> v) { store(requirement_, textValue(std::move(v))); }
+
+}  // namespace bexil

@@ -1,0 +1,227 @@
+#pragma once
+
+// BXPlugInCore is the one description of a plug-in that the database caches, the match rules test and replies carry
+// in serialised form. It names a bundle, holds its information dictionaries and the facts its builder supplied, and
+// derives the plug-in's configuration from three primitive look-ups (infoKey, pluginKey, attribute) that a subclass
+// may redirect. Records are shared through std::shared_ptr between queues: each stored property is read and written
+// atomically on its own (a small per-record lock, never held across records or while calling out), so any thread may
+// read a record while another replaces, say, its annotations.
+//
+// URLs are kept as file-system paths (std::string): every URL a record holds is a file URL, and the path is all that
+// anyone reads from it. Dictionaries are Values holding a dictionary, shared by reference count and never edited in
+// place; an absent dictionary is an empty std::optional.
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace bexil {
+
+class BXPlugInCore {
+  public:
+    // `init`: an empty record with no property set. Set it up with one of the setup operations before sharing it.
+    BXPlugInCore() = default;
+    virtual ~BXPlugInCore() = default;
+    BXPlugInCore(const BXPlugInCore&) = delete;
+    BXPlugInCore& operator=(const BXPlugInCore&) = delete;
+
+    // ---- Construction ----
+
+    // A set-up record, or an empty pointer when set-up fails. When set-up succeeded and the record still has no
+    // plug-in dictionary, `info` (when it is a dictionary) becomes it; this is the only place that reads `info`.
+    static std::shared_ptr<BXPlugInCore> initWithNameUrlBundleInfoInfoUuid(std::optional<std::string> identifier,
+                                                                           std::optional<std::string> url,
+                                                                           std::optional<Value> bundleInfo,
+                                                                           std::optional<Value> info,
+                                                                           std::optional<Uuid> uuid);
+    // A record read from its serialised form, or an empty pointer when the form cannot be read.
+    static std::shared_ptr<BXPlugInCore> initWithForm(const Value& form);
+
+    // Sets the record up from names and dictionaries; false when the URL or identifier is missing or the information
+    // dictionary is malformed (logged, except for a missing URL). `info` is not used here. A missing UUID is replaced
+    // by a fresh random one.
+    virtual bool setupWithNameUrlBundleInfoInfoUuid(std::optional<std::string> identifier,
+                                                    std::optional<std::string> url, std::optional<Value> bundleInfo,
+                                                    std::optional<Value> info, std::optional<Uuid> uuid);
+    // Sets the record up from a serialised form. Entries of an unexpected kind read as absent and take their
+    // defaults; only "identifier", "path" and a present "bundleInfo" can make reading fail.
+    virtual bool setupWithForm(const Value& form);
+
+    // ---- Dictionaries ----
+
+    // Stores `info` as the information dictionary and its "RZExtension" entry as the plug-in dictionary. False when
+    // `info` is not a dictionary (nothing changes) or its "RZExtension" is not one (the information dictionary stays
+    // stored, the plug-in dictionary is unchanged).
+    virtual bool setDictionaries(const Value& info);
+    // Hook run on an information dictionary before setDictionaries during set-up; the base record keeps it as is.
+    virtual Value normalizeInfoDictionary(const Value& info);
+    // Rewrites the plug-in dictionary so that it holds an attributes dictionary with an "RZExtensionVersion".
+    virtual void canonicalize();
+
+    // ---- Form ----
+
+    // The serialised form. Never fails today; callers check the result all the same. An entry whose record value is
+    // missing (a record that was never fully set up) is left out rather than invented.
+    virtual Result<MutableDictionary> exportForm() const;
+    // Replaces the annotations by the form's "annotations" entry; no such dictionary there makes them absent.
+    virtual void updateFromForm(const Value& form);
+
+    // ---- Checks and annotations ----
+
+    // Nothing when the record is usable, else an error of code 12 saying why. Never logs.
+    virtual std::optional<Error> diagnose() const;
+    // Replaces the annotations by a copy in which `key` maps to `value` (or is removed when `value` is nothing). A
+    // record without annotations keeps none. The change is one atomic step: concurrent changes are never lost.
+    virtual void setAnnotationValue(std::string_view key, const std::optional<Value>& value);
+
+    // ---- Identity ----
+
+    // True exactly when `other` (a record of this class or any subclass) has this record's UUID. REQUIRES: this
+    // record has a UUID; otherwise throws InternalInconsistency("self.uuid").
+    virtual bool isEqual(const BXPlugInCore& other) const;
+    // The hash of the UUID. REQUIRES: this record has a UUID; otherwise throws InternalInconsistency("self.uuid").
+    virtual size_t hash() const;
+    bool operator==(const BXPlugInCore& other) const { return isEqual(other); }
+
+    // ---- Primitive look-ups: every derived property goes through these ----
+
+    virtual std::optional<Value> infoKey(std::string_view key) const;
+    virtual std::optional<Value> pluginKey(std::string_view key) const;
+    virtual std::optional<Value> attribute(std::string_view key) const;
+
+    // ---- Derived properties ----
+
+    virtual std::optional<std::string> path() const;
+    virtual std::optional<std::string> containingPath() const;
+    virtual std::optional<Value> attributes() const;
+    virtual std::optional<Value> version() const;
+    // A protocol name or an array of names; "RZObject" for an application extension that names none.
+    virtual std::optional<Value> protocolSpec() const;
+    virtual std::optional<Value> principalSpec() const;
+    virtual std::optional<Value> sdkSpec() const;
+    virtual std::optional<std::string> embeddedCodePath() const;
+    virtual std::optional<Value> embeddedProtocolSpec() const;
+    virtual bool isAppExtension() const;
+    virtual bool isMultiplexed() const;
+    virtual bool isHybrid() const;
+    virtual bool isDedicated() const;
+    virtual bool isData() const;
+    // Every plug-in is old-style or current-style; a record that is neither is reported as an internal fault on the
+    // ops channel and answers true.
+    virtual bool oldStyle() const;
+    virtual Date timestamp() const;
+
+    // "<BXPlugInCore identifier uuid path>" for log lines.
+    virtual std::string description() const;
+
+    // ---- Stored properties (each read and written atomically) ----
+
+    std::optional<std::string> identifier() const;
+    void setIdentifier(std::optional<std::string> v);
+    std::optional<std::string> originalIdentifier() const;
+    void setOriginalIdentifier(std::optional<std::string> v);
+    // File URL of the bundle, as its path.
+    std::optional<std::string> url() const;
+    void setUrl(std::optional<std::string> v);
+    std::optional<Value> bundleInfoDictionary() const;
+    void setBundleInfoDictionary(std::optional<Value> v);
+    virtual std::optional<Value> plugInDictionary() const;
+    virtual void setPlugInDictionary(std::optional<Value> v);
+    std::optional<Value> entitlements() const;
+    void setEntitlements(std::optional<Value> v);
+    std::optional<Value> annotations() const;
+    void setAnnotations(std::optional<Value> v);
+    // File URL of the containing application's bundle, as its path.
+    std::optional<std::string> containingUrl() const;
+    void setContainingUrl(std::optional<std::string> v);
+    bool onSystemVolume() const;
+    void setOnSystemVolume(bool v);
+    uint32_t hubProtocolVersion() const;
+    void setHubProtocolVersion(uint32_t v);
+    std::optional<std::string> localizedName() const;
+    void setLocalizedName(std::optional<std::string> v);
+    std::optional<std::string> localizedShortName() const;
+    void setLocalizedShortName(std::optional<std::string> v);
+    std::optional<std::string> localizedContainingName() const;
+    void setLocalizedContainingName(std::optional<std::string> v);
+    int32_t lastModified() const;
+    void setLastModified(int32_t v);
+    std::optional<Uuid> uuid() const;
+    void setUuid(std::optional<Uuid> v);
+    // Data value (20 bytes when present); carried, never computed here.
+    std::optional<Value> cdhash() const;
+    void setCdhash(std::optional<Value> v);
+    std::optional<std::string> requirement() const;
+    void setRequirement(std::optional<std::string> v);
+
+  private:
+    template <typename T>
+    T load(const T& field) const {
+        std::lock_guard<std::mutex> guard(mutex_);
+        return field;
+    }
+    template <typename T>
+    void store(T& field, T value) {
+        // The old value is released outside the lock: dropping the last reference to a large dictionary may take a
+        // while and must not stall readers of the other properties.
+        {
+            std::lock_guard<std::mutex> guard(mutex_);
+            std::swap(field, value);
+        }
+    }
+
+    // Text properties are kept as string Values so that exporting and reading forms share them instead of copying.
+    std::optional<std::string> loadText(const std::optional<Value>& field) const;
+    static std::optional<Value> textValue(std::optional<std::string> text);
+    static std::optional<Value> textEntry(const Value& form, std::string_view key);
+
+    // Guards every stored property, one at a time; never held while calling anything else.
+    mutable std::mutex mutex_;
+    std::optional<Value> identifier_;
+    std::optional<Value> originalIdentifier_;
+    std::optional<Value> url_;
+    std::optional<Value> bundleInfoDictionary_;
+    std::optional<Value> plugInDictionary_;
+    std::optional<Value> entitlements_;
+    std::optional<Value> annotations_;
+    std::optional<Value> containingUrl_;
+    bool onSystemVolume_ = false;
+    uint32_t hubProtocolVersion_ = 0;
+    std::optional<Value> localizedName_;
+    std::optional<Value> localizedShortName_;
+    std::optional<Value> localizedContainingName_;
+    int32_t lastModified_ = 0;
+    std::optional<Uuid> uuid_;
+    std::optional<Value> cdhash_;
+    std::optional<Value> requirement_;
+};
+
+// Identity of records by UUID, for std::unordered_set/map keyed by shared records. An empty pointer equals only an
+// empty pointer; a record without a UUID throws InternalInconsistency("self.uuid").
+struct BXPlugInCoreHash {
+    size_t operator()(const BXPlugInCore* record) const;
+    template <typename T>
+    size_t operator()(const std::shared_ptr<T>& record) const {
+        return (*this)(static_cast<const BXPlugInCore*>(record.get()));
+    }
+};
+struct BXPlugInCoreEqual {
+    bool operator()(const BXPlugInCore* a, const BXPlugInCore* b) const;
+    template <typename T, typename U>
+    bool operator()(const std::shared_ptr<T>& a, const std::shared_ptr<U>& b) const {
+        return (*this)(static_cast<const BXPlugInCore*>(a.get()), static_cast<const BXPlugInCore*>(b.get()));
+    }
+};
+
+}  // namespace bexil
+
+template <>
+struct std::hash<bexil::BXPlugInCore> {
+    size_t operator()(const bexil::BXPlugInCore& record) const { return record.hash(); }
+};
