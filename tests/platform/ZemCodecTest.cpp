@@ -1,5 +1,3 @@
-#include "platform/zem/ZemCodec.h"
-
 #include <gtest/gtest.h>
 
 #include <cmath>
@@ -11,6 +9,7 @@
 #include <vector>
 
 #include "ZemStrictEqual.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 
 namespace bexil {
@@ -157,6 +156,12 @@ TEST(ZemCodec, DictionaryKeysInAnyOrderAreAccepted) {
     ASSERT_TRUE(v.ok()) << v.error().description();
     EXPECT_EQ(v->get("a").getUInt64(), 2u);
     EXPECT_EQ(v->get("b").getUInt64(), 1u);
+    // Order broken after a sorted run: "a", "c", "b".
+    Result<Value> w = ZemCodec::decode(hex("0b 03 01 61 04 01 01 63 04 03 01 62 04 02"));
+    ASSERT_TRUE(w.ok()) << w.error().description();
+    ASSERT_EQ(w->count(), 3u);
+    EXPECT_EQ(w->entries()[1].key, "b");
+    EXPECT_EQ(w->get("c").getUInt64(), 3u);
 }
 
 // ---- Encoding into a buffer ----
@@ -241,8 +246,9 @@ TEST(ZemCodec, DuplicateKeysAreRefusedWhereverTheyStand) {
     // Adjacent, as in sorted input.
     std::string message = expectError(hex("0b 02 01 61 00 01 61 01"), ZemErrorCode::DuplicateKey);
     EXPECT_NE(message.find("\"a\" at offset 5"), std::string::npos) << message;
-    // Apart, in unsorted input: "b", "a", "b".
+    // Apart, in unsorted input: "b", "a", "b"; and "a", "c", "a", where order breaks after a sorted run.
     expectError(hex("0b 03 01 62 00 01 61 00 01 62 00"), ZemErrorCode::DuplicateKey);
+    expectError(hex("0b 03 01 61 00 01 63 00 01 61 00"), ZemErrorCode::DuplicateKey);
     // Inside a nested dictionary.
     expectError(hex("0a 01 0b 02 00 00 00 00"), ZemErrorCode::DuplicateKey);
 }

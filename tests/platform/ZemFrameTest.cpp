@@ -1,5 +1,3 @@
-#include "platform/zem/ZemFrame.h"
-
 #include <gtest/gtest.h>
 
 #include <random>
@@ -8,6 +6,7 @@
 
 #include "ZemStrictEqual.h"
 #include "platform/zem/ZemCodec.h"
+#include "platform/zem/ZemFrame.h"
 #include "platform/zem/ZemFrameReader.h"
 
 namespace bexil {
@@ -106,8 +105,8 @@ TEST(ZemFrame, BadHeadersAreRefusedWithTheirOwnCode) {
         EXPECT_TRUE(isZemError(h.error(), c.code)) << h.error().description();
     }
     // The largest legal payload is accepted, and a message may have serial 0.
-    EXPECT_TRUE(ZemFrame::decodeHeader(std::span<const uint8_t, 24>(
-                    header(m, 1, 1, 0, ZemFrame::kMaxPayloadBytes, 0, 0).data(), 24))
+    EXPECT_TRUE(ZemFrame::decodeHeader(
+                    std::span<const uint8_t, 24>(header(m, 1, 1, 0, ZemFrame::kMaxPayloadBytes, 0, 0).data(), 24))
                     .ok());
 }
 

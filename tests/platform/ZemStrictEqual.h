@@ -15,20 +15,27 @@ namespace bexil::testing {
 inline bool strictlyEqual(const Value& a, const Value& b) {
     if (a.kind() != b.kind()) return false;
     switch (a.kind()) {
-        case ValueKind::Null: return true;
-        case ValueKind::Bool: return *a.getBool() == *b.getBool();
-        case ValueKind::Int64: return *a.getInt64() == *b.getInt64();
-        case ValueKind::UInt64: return *a.getUInt64() == *b.getUInt64();
-        case ValueKind::Real: return std::bit_cast<uint64_t>(*a.getReal()) == std::bit_cast<uint64_t>(*b.getReal());
+        case ValueKind::Null:
+            return true;
+        case ValueKind::Bool:
+            return *a.getBool() == *b.getBool();
+        case ValueKind::Int64:
+            return *a.getInt64() == *b.getInt64();
+        case ValueKind::UInt64:
+            return *a.getUInt64() == *b.getUInt64();
+        case ValueKind::Real:
+            return std::bit_cast<uint64_t>(*a.getReal()) == std::bit_cast<uint64_t>(*b.getReal());
         case ValueKind::Date:
             return std::bit_cast<uint64_t>(a.getDate()->secondsSince1970) ==
                    std::bit_cast<uint64_t>(b.getDate()->secondsSince1970);
-        case ValueKind::String: return a.stringView() == b.stringView();
+        case ValueKind::String:
+            return a.stringView() == b.stringView();
         case ValueKind::Data: {
             auto x = a.dataBytes(), y = b.dataBytes();
             return x.size() == y.size() && std::equal(x.begin(), x.end(), y.begin());
         }
-        case ValueKind::Uuid: return *a.getUuid() == *b.getUuid();
+        case ValueKind::Uuid:
+            return *a.getUuid() == *b.getUuid();
         case ValueKind::Array: {
             auto x = a.items(), y = b.items();
             if (x.size() != y.size()) return false;

@@ -142,19 +142,29 @@ inline uint8_t* putTag(uint8_t* p, ZemTag tag) {
 // First pass: the exact size, or the first thing the peer would refuse. `size` is also the offset in the
 // encoding where the value being looked at starts, which makes encoding errors as precise as decoding ones.
 class Sizer {
-public:
+  public:
     std::optional<Error> error;
     size_t size = 0;
 
     void visit(const Value& v, size_t depth) {
         switch (v.kind()) {
             case ValueKind::Null:
-            case ValueKind::Bool: size += 1; return;
-            case ValueKind::Int64: size += 1 + varintSize(zigzag(*v.getInt64())); return;
-            case ValueKind::UInt64: size += 1 + varintSize(*v.getUInt64()); return;
+            case ValueKind::Bool:
+                size += 1;
+                return;
+            case ValueKind::Int64:
+                size += 1 + varintSize(zigzag(*v.getInt64()));
+                return;
+            case ValueKind::UInt64:
+                size += 1 + varintSize(*v.getUInt64());
+                return;
             case ValueKind::Real:
-            case ValueKind::Date: size += 9; return;
-            case ValueKind::Uuid: size += 17; return;
+            case ValueKind::Date:
+                size += 9;
+                return;
+            case ValueKind::Uuid:
+                size += 17;
+                return;
             case ValueKind::String: {
                 std::string_view s = v.stringView();
                 text(s, "string");
@@ -188,12 +198,12 @@ public:
         }
     }
 
-private:
+  private:
     bool enter(size_t depth) {
         if (depth < ZemCodec::kMaxDepth) return true;
-        error = zemError(ZemErrorCode::TooDeep,
-                         fmt::format("container at offset {} nests deeper than the limit of {} levels", size,
-                                     ZemCodec::kMaxDepth));
+        error = zemError(
+            ZemErrorCode::TooDeep,
+            fmt::format("container at offset {} nests deeper than the limit of {} levels", size, ZemCodec::kMaxDepth));
         return false;
     }
 
@@ -209,14 +219,20 @@ private:
 // Second pass: writes what the first pass measured and validated.
 uint8_t* write(uint8_t* p, const Value& v) {
     switch (v.kind()) {
-        case ValueKind::Null: return putTag(p, ZemTag::Null);
-        case ValueKind::Bool: return putTag(p, *v.getBool() ? ZemTag::True : ZemTag::False);
-        case ValueKind::Int64: return putVarint(putTag(p, ZemTag::Int64), zigzag(*v.getInt64()));
-        case ValueKind::UInt64: return putVarint(putTag(p, ZemTag::UInt64), *v.getUInt64());
-        case ValueKind::Real: return putU64(putTag(p, ZemTag::Real), std::bit_cast<uint64_t>(*v.getReal()));
+        case ValueKind::Null:
+            return putTag(p, ZemTag::Null);
+        case ValueKind::Bool:
+            return putTag(p, *v.getBool() ? ZemTag::True : ZemTag::False);
+        case ValueKind::Int64:
+            return putVarint(putTag(p, ZemTag::Int64), zigzag(*v.getInt64()));
+        case ValueKind::UInt64:
+            return putVarint(putTag(p, ZemTag::UInt64), *v.getUInt64());
+        case ValueKind::Real:
+            return putU64(putTag(p, ZemTag::Real), std::bit_cast<uint64_t>(*v.getReal()));
         case ValueKind::Date:
             return putU64(putTag(p, ZemTag::Date), std::bit_cast<uint64_t>(v.getDate()->secondsSince1970));
-        case ValueKind::Uuid: return putBytes(putTag(p, ZemTag::Uuid), v.getUuid()->bytes().data(), 16);
+        case ValueKind::Uuid:
+            return putBytes(putTag(p, ZemTag::Uuid), v.getUuid()->bytes().data(), 16);
         case ValueKind::String: {
             std::string_view s = v.stringView();
             return putBytes(putVarint(putTag(p, ZemTag::String), s.size()), s.data(), s.size());
@@ -244,20 +260,27 @@ uint8_t* write(uint8_t* p, const Value& v) {
 // ---- Decoding ----
 
 class Decoder {
-public:
+  public:
     Decoder(const uint8_t* bytes, size_t size) : base_(bytes), size_(size) {}
 
     std::optional<Error> error;
 
     bool value(Value& out, size_t depth) {
         size_t start = pos_;
-        if (pos_ >= size_) return fail(ZemErrorCode::Truncated, fmt::format("input ends at offset {} where a value "
-                                                                            "should start", pos_));
+        if (pos_ >= size_)
+            return fail(ZemErrorCode::Truncated,
+                        fmt::format("input ends at offset {} where a value should start", pos_));
         auto tag = static_cast<ZemTag>(base_[pos_++]);
         switch (tag) {
-            case ZemTag::Null: out = Value(); return true;
-            case ZemTag::False: out = Value::boolean(false); return true;
-            case ZemTag::True: out = Value::boolean(true); return true;
+            case ZemTag::Null:
+                out = Value();
+                return true;
+            case ZemTag::False:
+                out = Value::boolean(false);
+                return true;
+            case ZemTag::True:
+                out = Value::boolean(true);
+                return true;
             case ZemTag::Int64: {
                 uint64_t u;
                 if (!varint(u, "int64")) return false;
@@ -300,8 +323,10 @@ public:
                 pos_ += n;
                 return true;
             }
-            case ZemTag::Array: return array(out, depth, start);
-            case ZemTag::Dictionary: return dictionary(out, depth, start);
+            case ZemTag::Array:
+                return array(out, depth, start);
+            case ZemTag::Dictionary:
+                return dictionary(out, depth, start);
         }
         return fail(ZemErrorCode::BadTag,
                     fmt::format("unknown tag 0x{:02x} at offset {}", static_cast<uint8_t>(tag), start));
@@ -309,7 +334,7 @@ public:
 
     size_t position() const { return pos_; }
 
-private:
+  private:
     const uint8_t* base_;
     size_t size_;
     size_t pos_ = 0;
@@ -366,9 +391,9 @@ private:
 
     bool enter(size_t depth, size_t start) {
         if (depth < ZemCodec::kMaxDepth) return true;
-        return fail(ZemErrorCode::TooDeep, fmt::format("container at offset {} nests deeper than the limit of {} "
-                                                       "levels",
-                                                       start, ZemCodec::kMaxDepth));
+        return fail(
+            ZemErrorCode::TooDeep,
+            fmt::format("container at offset {} nests deeper than the limit of {} levels", start, ZemCodec::kMaxDepth));
     }
 
     // Checks a count against the input before anything is allocated for it: every item takes at least
@@ -376,9 +401,9 @@ private:
     bool count(uint64_t& n, uint64_t minimumItemBytes, const char* what, size_t start) {
         if (!varint(n, what)) return false;
         if (n <= remaining() / minimumItemBytes) return true;
-        return fail(ZemErrorCode::CountExceedsInput,
-                    fmt::format("{} at offset {} claims {} items but only {} bytes remain", what, start, n,
-                                remaining()));
+        return fail(
+            ZemErrorCode::CountExceedsInput,
+            fmt::format("{} at offset {} claims {} items but only {} bytes remain", what, start, n, remaining()));
     }
 
     bool array(Value& out, size_t depth, size_t start) {
@@ -398,37 +423,51 @@ private:
         uint64_t n;
         // An entry is at least a key length byte and a value tag.
         if (!enter(depth, start) || !count(n, 2, "dictionary", start)) return false;
+        // Our own encoder writes keys in ascending byte order: such entries go straight into the dictionary
+        // being built, and a duplicate shows up as a key equal to the one before. The first key out of order
+        // moves everything to a list that is checked for duplicates once complete, so any order is accepted
+        // without quadratic insertion.
+        MutableDictionary sorted;
+        sorted.reserve(std::min<uint64_t>(n, kMaxInitialReserve));
         std::vector<std::pair<std::string, Value>> entries;
-        entries.reserve(std::min<uint64_t>(n, kMaxInitialReserve));
         std::string_view previous;
         bool ascending = true;
         for (uint64_t i = 0; i < n; ++i) {
             size_t keyStart = pos_;
             std::string_view key;
             if (!text(key, "dictionary key", keyStart)) return false;
-            // Our own encoder writes keys in ascending byte order, so duplicates show up next to each other;
-            // other orders are accepted and checked for duplicates once the dictionary is complete.
-            if (i > 0 && ascending) {
+            if (ascending && i > 0 && !(previous < key)) {
                 if (key == previous)
                     return fail(ZemErrorCode::DuplicateKey,
-                                fmt::format("duplicate key {} at offset {} in the dictionary at offset {}",
-                                            quoted(key), keyStart, start));
-                ascending = previous < key;
+                                fmt::format("duplicate key {} at offset {} in the dictionary at offset {}", quoted(key),
+                                            keyStart, start));
+                ascending = false;
+                Value partial = sorted.take();
+                entries.reserve(std::min<uint64_t>(n, kMaxInitialReserve));
+                for (const DictionaryEntry& e : partial.entries()) entries.emplace_back(e.key, e.value);
             }
             previous = key;
-            entries.emplace_back(std::string(key), Value());
-            if (!value(entries.back().second, depth + 1)) return false;
+            if (ascending) {
+                Value item;
+                if (!value(item, depth + 1)) return false;
+                sorted.set(key, std::move(item));
+            } else {
+                entries.emplace_back(std::string(key), Value());
+                if (!value(entries.back().second, depth + 1)) return false;
+            }
         }
-        if (!ascending) {
-            std::vector<std::string_view> keys;
-            keys.reserve(entries.size());
-            for (const auto& e : entries) keys.emplace_back(e.first);
-            std::sort(keys.begin(), keys.end());
-            auto dup = std::adjacent_find(keys.begin(), keys.end());
-            if (dup != keys.end())
-                return fail(ZemErrorCode::DuplicateKey,
-                            fmt::format("duplicate key {} in the dictionary at offset {}", quoted(*dup), start));
+        if (ascending) {
+            out = sorted.take();
+            return true;
         }
+        std::vector<std::string_view> keys;
+        keys.reserve(entries.size());
+        for (const auto& e : entries) keys.emplace_back(e.first);
+        std::sort(keys.begin(), keys.end());
+        auto dup = std::adjacent_find(keys.begin(), keys.end());
+        if (dup != keys.end())
+            return fail(ZemErrorCode::DuplicateKey,
+                        fmt::format("duplicate key {} in the dictionary at offset {}", quoted(*dup), start));
         out = Value::dictionary(std::move(entries));
         return true;
     }

@@ -32,7 +32,7 @@ enum class ZemTag : uint8_t {
 };
 
 class ZemCodec {
-public:
+  public:
     // Arrays and dictionaries nest at most this deep: the outermost container is level 1.
     static constexpr size_t kMaxDepth = 256;
 

@@ -33,9 +33,12 @@ uint64_t getLittleEndian(const uint8_t* p, size_t bytes) {
 
 const char* zemFrameKindName(ZemFrameKind kind) {
     switch (kind) {
-        case ZemFrameKind::Message: return "message";
-        case ZemFrameKind::Request: return "request";
-        case ZemFrameKind::Reply: return "reply";
+        case ZemFrameKind::Message:
+            return "message";
+        case ZemFrameKind::Request:
+            return "request";
+        case ZemFrameKind::Reply:
+            return "reply";
     }
     return "unknown";
 }
@@ -72,8 +75,8 @@ std::optional<Error> ZemFrame::checkHeader(const ZemFrameHeader& h) {
     if (h.kind == ZemFrameKind::Reply && h.inReplyTo == 0)
         return zemError(ZemErrorCode::BadHeader, fmt::format("reply #{} answers serial 0", h.serial));
     if (h.kind != ZemFrameKind::Reply && h.inReplyTo != 0)
-        return zemError(ZemErrorCode::BadHeader, fmt::format("{} #{} carries in-reply-to #{}",
-                                                             zemFrameKindName(h.kind), h.serial, h.inReplyTo));
+        return zemError(ZemErrorCode::BadHeader,
+                        fmt::format("{} #{} carries in-reply-to #{}", zemFrameKindName(h.kind), h.serial, h.inReplyTo));
     if (kHeaderBytes + uint64_t{h.payloadLength} > kMaxFrameBytes)
         return zemError(ZemErrorCode::FrameTooLarge,
                         fmt::format("frame of {} bytes exceeds limit kMaxFrameBytes ({})",

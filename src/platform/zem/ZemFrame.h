@@ -36,7 +36,7 @@ struct ZemFrameHeader {
 };
 
 class ZemFrame {
-public:
+  public:
     static constexpr uint8_t kMagic = 0xB7;
     static constexpr uint8_t kVersion = 1;
     static constexpr size_t kHeaderBytes = 24;
@@ -45,8 +45,7 @@ public:
     static constexpr size_t kMaxPayloadBytes = kMaxFrameBytes - kHeaderBytes;
 
     ZemFrame() = default;
-    ZemFrame(ZemFrameHeader header, std::vector<uint8_t> payload)
-        : header_(header), payload_(std::move(payload)) {}
+    ZemFrame(ZemFrameHeader header, std::vector<uint8_t> payload) : header_(header), payload_(std::move(payload)) {}
 
     const ZemFrameHeader& header() const { return header_; }
     ZemFrameKind kind() const { return header_.kind; }
@@ -75,7 +74,7 @@ public:
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
                                        std::vector<uint8_t>& out);
 
-private:
+  private:
     ZemFrameHeader header_;
     std::vector<uint8_t> payload_;
 };

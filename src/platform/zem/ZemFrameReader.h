@@ -19,7 +19,7 @@
 namespace bexil {
 
 class ZemFrameReader {
-public:
+  public:
     ZemFrameReader() = default;
 
     // Takes the next bytes of the stream. Returns the protocol error that the stream has broken, if any; the
@@ -37,7 +37,7 @@ public:
     // Bytes held for the partial frame (header bytes, or payload bytes so far) and for frames not yet taken.
     size_t bufferedBytes() const { return bufferedBytes_ + (inPayload_ ? payload_.size() : headerFill_); }
 
-private:
+  private:
     // Payload buffers start this small and grow with the bytes that actually arrive, so a header that merely
     // announces a large frame does not make the reader allocate it.
     static constexpr size_t kInitialPayloadReserve = 64 * 1024;
