@@ -1,0 +1,57 @@
+#pragma once
+
+// ZemFrameReader cuts a Zem byte stream into frames. The connection layer feeds it whatever chunks the socket
+// delivers and takes complete frames out; it refuses a bad header (magic, version, kind, reserved bits, serial
+// rules) and an oversized announced length as soon as the header is complete, before any payload is buffered.
+// One reader belongs to one connection and is used from that connection's queue only.
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <optional>
+#include <span>
+#include <vector>
+
+#include "base/Error.h"
+#include "platform/zem/ZemFrame.h"
+
+namespace bexil {
+
+class ZemFrameReader {
+  public:
+    ZemFrameReader() = default;
+
+    // Takes the next bytes of the stream. Returns the protocol error that the stream has broken, if any; the
+    // error is sticky (later calls return it and ignore their bytes, the stream cannot be resynchronised), but
+    // frames completed before the offending header can still be taken with next().
+    std::optional<Error> feed(std::span<const uint8_t> bytes);
+
+    // The oldest complete frame not yet taken, in stream order.
+    std::optional<ZemFrame> next();
+
+    const std::optional<Error>& error() const { return error_; }
+    // True while part of a frame (some header bytes, or a header and part of its payload) has arrived. A peer
+    // that closes the stream in this state cut a frame short.
+    bool hasPartialFrame() const { return headerFill_ > 0 || inPayload_; }
+    // Bytes held for the partial frame (header bytes, or payload bytes so far) and for frames not yet taken.
+    size_t bufferedBytes() const { return bufferedBytes_ + (inPayload_ ? payload_.size() : headerFill_); }
+
+  private:
+    // Payload buffers start this small and grow with the bytes that actually arrive, so a header that merely
+    // announces a large frame does not make the reader allocate it.
+    static constexpr size_t kInitialPayloadReserve = 64 * 1024;
+
+    void completeFrame();
+
+    std::array<uint8_t, ZemFrame::kHeaderBytes> header_{};
+    size_t headerFill_ = 0;
+    bool inPayload_ = false;
+    ZemFrameHeader current_;
+    std::vector<uint8_t> payload_;
+    std::deque<ZemFrame> ready_;
+    size_t bufferedBytes_ = 0;
+    std::optional<Error> error_;
+};
+
+}  // namespace bexil
