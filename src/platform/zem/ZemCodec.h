@@ -11,7 +11,7 @@
 
 #include "base/Error.h"
 #include "base/Value.h"
-#include "platform/zem/ZemError.h"
+#include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
 
