@@ -1,9 +1,10 @@
 #pragma once
 
-// The errors of the Zem wire layer (protocol violations; connection-level events are ZemError). Every error it returns is an Error in the domain "Zem" with one of the codes
-// below and a message that says what was wrong and at which byte offset, ready to be logged by the caller. The
-// codes are stable: docs/protocol.md lists them, and the connection layer decides on them (for example, to log
-// an oversized frame by its limit) without parsing messages.
+// The errors of the Zem wire layer: protocol violations (connection-level events are ZemError, not these). Every
+// error it returns is an Error in the domain "Zem" with one of the codes below and a message that says what was
+// wrong and at which byte offset, ready to be logged by the caller. The codes are stable: docs/protocol.md lists
+// them, and the connection layer decides on them (for example, to log an oversized frame by its limit) without
+// parsing messages.
 
 #include <string>
 #include <string_view>
