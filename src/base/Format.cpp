@@ -277,14 +277,15 @@ std::string formatPrintfRuntime(std::string_view format, std::span<const FormatA
                 broken = true;
                 return;
             }
+            // Clamped first, so that negating the most negative value cannot overflow.
             int64_t v = a.kind() == FormatArg::Kind::Signed
-                            ? a.signedValue()
-                            : static_cast<int64_t>(std::min<uint64_t>(a.unsignedValue(), 4096));
+                            ? std::clamp<int64_t>(a.signedValue(), -format_detail::kMaxWidth, format_detail::kMaxWidth)
+                            : static_cast<int64_t>(std::min<uint64_t>(a.unsignedValue(), format_detail::kMaxWidth));
             if (isWidth && v < 0) {
                 leftAlign = true;
                 v = -v;
             }
-            into = v < 0 ? -1 : static_cast<int>(std::min<int64_t>(v, 4096));
+            into = v < 0 ? -1 : static_cast<int>(v);
         };
         if (s.widthStar) star(width, true);
         if (s.precisionStar) star(precision, false);

@@ -152,6 +152,9 @@ constexpr unsigned acceptedBy(char conversion) {
     }
 }
 
+// Widths and precisions beyond this are cut to it, so that no format can ask for gigabytes of padding.
+inline constexpr int kMaxWidth = 4096;
+
 // One parsed conversion. `end` is the offset just past it.
 struct Spec {
     bool ok = false;
@@ -198,7 +201,7 @@ constexpr Spec parseSpec(std::string_view text, size_t start) {
     } else {
         while (at(i) >= '0' && at(i) <= '9') {
             s.width = (s.width < 0 ? 0 : s.width) * 10 + (at(i) - '0');
-            if (s.width > 4096) s.width = 4096;
+            if (s.width > kMaxWidth) s.width = kMaxWidth;
             ++i;
         }
     }
@@ -211,7 +214,7 @@ constexpr Spec parseSpec(std::string_view text, size_t start) {
         } else {
             while (at(i) >= '0' && at(i) <= '9') {
                 s.precision = s.precision * 10 + (at(i) - '0');
-                if (s.precision > 4096) s.precision = 4096;
+                if (s.precision > kMaxWidth) s.precision = kMaxWidth;
                 ++i;
             }
         }
