@@ -156,7 +156,7 @@ constexpr unsigned acceptedBy(char conversion) {
 inline constexpr int kMaxWidth = 4096;
 
 // One parsed conversion. `end` is the offset just past it.
-struct Spec {
+struct Conversion {
     bool ok = false;
     bool percent = false;  // "%%"
     bool leftAlign = false, plus = false, space = false, alternate = false, zeroPad = false;
@@ -168,8 +168,8 @@ struct Spec {
 };
 
 // Parses the conversion that starts at text[start] == '%'. Shared by the compile-time check and the renderer.
-constexpr Spec parseSpec(std::string_view text, size_t start) {
-    Spec s;
+constexpr Conversion parseConversion(std::string_view text, size_t start) {
+    Conversion s;
     size_t i = start + 1;
     auto at = [&](size_t k) { return k < text.size() ? text[k] : '\0'; };
     if (at(i) == '{') {
@@ -277,7 +277,7 @@ consteval void checkFormat(const char* format) {
     };
     for (size_t i = 0; i < text.size(); ++i) {
         if (text[i] != '%') continue;
-        Spec s = parseSpec(text, i);
+        Conversion s = parseConversion(text, i);
         if (!s.ok) format_has_a_malformed_conversion();
         i = s.end - 1;
         if (s.percent) continue;
