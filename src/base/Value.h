@@ -89,6 +89,7 @@ public:
     static Value real(double d);
     static Value string(std::string_view s);
     static Value string(std::string&& s);
+    static Value string(const char* s) { return string(std::string_view(s)); }
     static Value data(std::span<const uint8_t> bytes);
     static Value data(std::vector<uint8_t>&& bytes);
     static Value date(Date d);
@@ -157,7 +158,8 @@ private:
     friend class MutableArray;
 
     Value(ValueKind kind, detail::Node* node) noexcept : kind_(kind) { scalar_.node = node; }
-    bool holdsNode() const { return kind_ >= ValueKind::String; }
+    // Dates are stored inline like numbers; every later kind lives in a shared node.
+    bool holdsNode() const { return kind_ >= ValueKind::String && kind_ != ValueKind::Date; }
     void retain() const noexcept;
     void release() noexcept;
 
