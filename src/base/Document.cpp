@@ -52,7 +52,10 @@ Error posixError(int err, std::string_view operation, const std::filesystem::pat
 // A short, printable excerpt of text for an error message.
 std::string snippet(std::string_view text) {
     std::string out;
-    for (size_t i = 0; i < text.size() && i < kSnippetLength; ++i) {
+    size_t length = std::min(text.size(), kSnippetLength);
+    // Never cut a UTF-8 sequence in half: messages end up in logs that expect valid text.
+    while (length > 0 && length < text.size() && (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80) --length;
+    for (size_t i = 0; i < length; ++i) {
         unsigned char c = static_cast<unsigned char>(text[i]);
         if (c < 0x20 || c == 0x7F || c == '"' || c == '\\') {
             char buf[8];
@@ -62,7 +65,7 @@ std::string snippet(std::string_view text) {
             out += static_cast<char>(c);
         }
     }
-    if (text.size() > kSnippetLength) out += "...";
+    if (length < text.size()) out += "...";
     return "\"" + out + "\"";
 }
 

@@ -289,6 +289,15 @@ TEST(DocumentRead, ErrorsDeepInsideNameThePath) {
         << message(v.error());
 }
 
+TEST(DocumentRead, LongTextInMessagesIsCutAtACharacterBoundary) {
+    std::string key(39, 'k');
+    key += "\xC3\xA9tail";  // the 40-byte cut would fall inside the two-byte character
+    Result<Value> v = Document::read(wrap("<dict><key>" + key + "</key><integer>x</integer></dict>"));
+    ASSERT_FALSE(v.ok());
+    EXPECT_NE(message(v.error()).find("at root[\"" + std::string(39, 'k') + "...\"]"), std::string::npos)
+        << message(v.error());
+}
+
 // ---- depth and size limits ----
 
 std::string nestedText(size_t depth, bool closed) {
