@@ -1,0 +1,187 @@
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "base/Document.h"
+#include "platform/codesign/CodeSigningIdentity.h"
+#include "platform/codesign/EntitlementsDirectory.h"
+#include "platform/log/CaptureSink.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* kManager = "com.quorvel.private.bexil.manager";
+
+std::string selfExecutable() { return fs::read_symlink("/proc/self/exe").string(); }
+
+class CodeSigningIdentityTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        root_ = fs::temp_directory_path() / ("bx-codesign-" + std::to_string(getpid()));
+        fs::remove_all(root_);
+        fs::create_directories(root_ / "entitlements.d");
+        chmod(root_.c_str(), 0755);
+        chmod((root_ / "entitlements.d").c_str(), 0755);
+        socketPath_ = (root_ / "sock").string();
+        listener_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un addr{};
+        addr.sun_family = AF_UNIX;
+        strncpy(addr.sun_path, socketPath_.c_str(), sizeof addr.sun_path - 1);
+        ASSERT_EQ(bind(listener_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+        ASSERT_EQ(listen(listener_, 8), 0);
+    }
+    void TearDown() override {
+        close(listener_);
+        fs::remove_all(root_);
+    }
+
+    fs::path entitlementsDir() const { return root_ / "entitlements.d"; }
+
+    void writeEntitlements(const std::string& name, const std::string& executable, Value entitlements,
+                           mode_t mode = 0644) {
+        Value doc = Value::dictionary({{"Executable", Value::string(executable)}, {"Entitlements", entitlements}});
+        fs::path file = entitlementsDir() / name;
+        ASSERT_FALSE(Document::writeFileAtomically(file, doc).has_value());
+        chmod(file.c_str(), mode);
+    }
+
+    // Forks a child that connects to the listener and then either waits for a byte (stays alive) or exits at once.
+    pid_t connectFromChild(bool exitAtOnce) {
+        pid_t child = fork();
+        if (child == 0) {
+            int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+            sockaddr_un addr{};
+            addr.sun_family = AF_UNIX;
+            strncpy(addr.sun_path, socketPath_.c_str(), sizeof addr.sun_path - 1);
+            if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
+            if (!exitAtOnce) {
+                char c;
+                (void)!read(fd, &c, 1);
+            }
+            _exit(0);
+        }
+        return child;
+    }
+
+    fs::path root_;
+    std::string socketPath_;
+    int listener_ = -1;
+};
+
+TEST_F(CodeSigningIdentityTest, LivePeerGetsCredentialsExecutableAndTrustedEntitlements) {
+    writeEntitlements("self.vrec", selfExecutable(),
+                      Value::dictionary({{kManager, Value::boolean(true)}, {"other", Value::string("x")}}));
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+    pid_t child = connectFromChild(false);
+    int fd = accept(listener_, nullptr, nullptr);
+    ASSERT_GE(fd, 0);
+    auto id = CodeSigningIdentity::fromConnectedSocket(fd, &dir);
+
+    EXPECT_TRUE(id->established()) << id->failureReason();
+    EXPECT_EQ(id->pid(), child);
+    EXPECT_EQ(id->uid(), geteuid());
+    EXPECT_GE(id->pidfd(), 0);
+    EXPECT_EQ(id->executablePath(), selfExecutable());
+    auto value = id->entitlementValueForKey(kManager);
+    ASSERT_TRUE(value.ok());
+    EXPECT_EQ(*value, Value::boolean(true));
+    auto absent = id->entitlementValueForKey("com.example.absent");
+    ASSERT_TRUE(absent.ok());
+    EXPECT_TRUE(absent->isNull());
+
+    (void)!write(fd, "x", 1);
+    close(fd);
+    waitpid(child, nullptr, 0);
+}
+
+TEST_F(CodeSigningIdentityTest, PeerThatExitsRightAfterConnectingHasNoIdentity) {
+    writeEntitlements("self.vrec", selfExecutable(), Value::dictionary({{kManager, Value::boolean(true)}}));
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+    for (bool reaped : {false, true}) {
+        pid_t child = connectFromChild(true);
+        if (reaped) {
+            waitpid(child, nullptr, 0);
+        } else {
+            // Wait until the child is a zombie: exited, not yet reaped.
+            siginfo_t info{};
+            waitid(P_PID, static_cast<id_t>(child), &info, WEXITED | WNOWAIT);
+        }
+        int fd = accept(listener_, nullptr, nullptr);
+        ASSERT_GE(fd, 0);
+        auto id = CodeSigningIdentity::fromConnectedSocket(fd, &dir);
+        EXPECT_FALSE(id->established()) << (reaped ? "reaped" : "zombie");
+        EXPECT_TRUE(id->entitlements().count() == 0);
+        auto value = id->entitlementValueForKey(kManager);
+        EXPECT_FALSE(value.ok());
+        close(fd);
+        if (!reaped) waitpid(child, nullptr, 0);
+    }
+}
+
+TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
+    log::CaptureSink capture;
+    const std::string self = selfExecutable();
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+
+    writeEntitlements("group-writable.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}), 0664);
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    EXPECT_TRUE(capture.contains("ignoring untrusted entitlements file"));
+    fs::remove(entitlementsDir() / "group-writable.vrec");
+
+    writeEntitlements("world-writable.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}), 0646);
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    fs::remove(entitlementsDir() / "world-writable.vrec");
+
+    if (geteuid() == 0) {
+        // Owned by somebody who is neither root nor the daemon's user.
+        writeEntitlements("foreign.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}));
+        ASSERT_EQ(chown((entitlementsDir() / "foreign.vrec").c_str(), 12345, 12345), 0);
+        EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+        fs::remove(entitlementsDir() / "foreign.vrec");
+    }
+
+    // A trusted file naming an executable that others may write grants nothing either.
+    fs::path copy = root_ / "writable-program";
+    fs::copy_file(self, copy);
+    chmod(copy.c_str(), 0777);
+    writeEntitlements("writable-program.vrec", copy.string(), Value::dictionary({{kManager, Value::boolean(true)}}));
+    EXPECT_EQ(dir.entitlementsForExecutable(copy.string())->count(), 0u);
+
+    // Malformed documents are ignored, and a correct file beside them still counts.
+    std::ofstream(entitlementsDir() / "garbage.vrec") << "<not a document";
+    chmod((entitlementsDir() / "garbage.vrec").c_str(), 0644);
+    writeEntitlements("good.vrec", self, Value::dictionary({{kManager, Value::string("yes")}}));
+    auto granted = dir.entitlementsForExecutable(self);
+    ASSERT_TRUE(granted.ok());
+    EXPECT_EQ(granted->get(kManager), Value::string("yes"));
+}
+
+TEST_F(CodeSigningIdentityTest, ChangedFilesAreSeenAndRemovedFilesForgotten) {
+    const std::string self = selfExecutable();
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    writeEntitlements("a.vrec", self, Value::dictionary({{"k", Value::int64(1)}}));
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->get("k"), Value::int64(1));
+    writeEntitlements("a.vrec", self, Value::dictionary({{"k", Value::int64(2)}}));
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->get("k"), Value::int64(2));
+    // Two files for one program: the later name wins, whatever order the directory lists them in.
+    writeEntitlements("b.vrec", self, Value::dictionary({{"k", Value::int64(3)}}));
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->get("k"), Value::int64(3));
+    fs::remove(entitlementsDir() / "b.vrec");
+    fs::remove(entitlementsDir() / "a.vrec");
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    // A missing directory grants nothing and is not an error.
+    EntitlementsDirectory missing(root_ / "nope", geteuid());
+    ASSERT_TRUE(missing.entitlementsForExecutable(self).ok());
+}
+
+}  // namespace
+}  // namespace bexil
