@@ -37,6 +37,9 @@ CurrentQueueScope::~CurrentQueueScope() { tlsCurrentFrame = previous_; }
 SerialQueue::SerialQueue(std::string label, EventLoop& loop)
     : state_(std::make_shared<detail::SerialQueueState>(std::move(label), detail::QueueInternals::core(loop))) {}
 
+SerialQueue::SerialQueue(std::string label, const SerialQueue& sibling)
+    : state_(std::make_shared<detail::SerialQueueState>(std::move(label), sibling.state_->core)) {}
+
 const std::string& SerialQueue::label() const { return state_->label; }
 
 void SerialQueue::async(std::function<void()> block) const {

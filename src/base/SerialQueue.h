@@ -25,6 +25,8 @@ class SerialQueue {
 public:
     // A new queue on `loop`; the label names it in log lines and in consistency failures.
     explicit SerialQueue(std::string label, EventLoop& loop = EventLoop::shared());
+    // A new queue on the same loop as `sibling` (the IPC layer gives each accepted connection one).
+    SerialQueue(std::string label, const SerialQueue& sibling);
 
     const std::string& label() const;
     // The label, for "%@" in log texts.

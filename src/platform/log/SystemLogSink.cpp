@@ -4,14 +4,24 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <ctime>
 #include <string>
+#include <string_view>
 
 namespace bexil::log {
 
-SystemLogSink::SystemLogSink()
-    : destination_(access(kJournalSocket, W_OK) == 0 ? Destination::Journal : Destination::Stream),
-      fd_(STDERR_FILENO) {}
+// BX_LOG_SINK=stderr (or =journal) overrides the choice, so that tests and the demo read bxd's log from its
+// standard error even on a machine that runs a journal.
+static SystemLogSink::Destination defaultDestination() {
+    const char* forced = getenv("BX_LOG_SINK");
+    if (forced && std::string_view(forced) == "stderr") return SystemLogSink::Destination::Stream;
+    if (forced && std::string_view(forced) == "journal") return SystemLogSink::Destination::Journal;
+    return access(SystemLogSink::kJournalSocket, W_OK) == 0 ? SystemLogSink::Destination::Journal
+                                                            : SystemLogSink::Destination::Stream;
+}
+
+SystemLogSink::SystemLogSink() : destination_(defaultDestination()), fd_(STDERR_FILENO) {}
 
 SystemLogSink::SystemLogSink(Destination destination, int fd) : destination_(destination), fd_(fd) {}
 

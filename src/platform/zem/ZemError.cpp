@@ -4,9 +4,12 @@ namespace bexil {
 
 std::string ZemError::description() const {
     switch (kind_) {
-        case Kind::ConnectionInvalid: return "Connection invalid";
-        case Kind::ConnectionInterrupted: return "Connection interrupted";
-        case Kind::TerminationImminent: return "Termination imminent";
+        case Kind::ConnectionInvalid:
+            return "Connection invalid";
+        case Kind::ConnectionInterrupted:
+            return "Connection interrupted";
+        case Kind::TerminationImminent:
+            return "Termination imminent";
     }
     return "Unknown connection error";
 }

@@ -8,7 +8,7 @@
 namespace bexil {
 
 class ZemError {
-public:
+  public:
     enum class Kind {
         // The peer is gone, or the connection was cancelled: nothing more will arrive.
         ConnectionInvalid,
@@ -26,7 +26,7 @@ public:
 
     bool operator==(const ZemError&) const = default;
 
-private:
+  private:
     Kind kind_;
 };
 

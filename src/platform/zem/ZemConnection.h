@@ -1,0 +1,71 @@
+#pragma once
+
+// One end of a Zem connection: a Unix-domain stream socket carrying length-prefixed frames, each holding one
+// dictionary. Incoming messages and connection errors are delivered, one at a time and in order, to the event
+// handler on the connection's serial queue; sends may be made from any thread. The connection object is shared:
+// its pending I/O keeps it alive while it is open, and the finalizer runs once it is closed and unreferenced.
+// A client connection is made with createClient; peer connections come from a ZemListener.
+
+#include <sys/types.h>
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <variant>
+
+#include "base/Value.h"
+#include "platform/zem/ZemError.h"
+#include "platform/zem/ZemMessage.h"
+
+namespace bexil {
+
+class SerialQueue;
+class CodeSigningIdentity;
+
+class ZemConnection {
+  public:
+    using Event = std::variant<ZemMessage, ZemError>;
+    using EventHandler = std::function<void(const Event&)>;
+    // The reply's dictionary, or the connection error that took its place; called exactly once.
+    using ReplyHandler = std::function<void(const std::variant<Value, ZemError>&)>;
+    using Finalizer = std::function<void(std::shared_ptr<void> context)>;
+
+    virtual ~ZemConnection() = default;
+
+    // A client connection to `<service dir>/<serviceName>` delivering on `queue` (which must outlive it). It starts
+    // suspended; nothing is sent until resume(). When the service is not there, the connection ends with
+    // ConnectionInvalid and every request sent on it is answered with that error.
+    static std::shared_ptr<ZemConnection> createClient(const std::string& serviceName, SerialQueue& queue);
+
+    // REQUIRES: before resume().
+    virtual void setEventHandler(EventHandler handler) = 0;
+    virtual void setContext(std::shared_ptr<void> context) = 0;
+    virtual std::shared_ptr<void> context() const = 0;
+    virtual void setFinalizer(Finalizer finalizer) = 0;
+
+    // Starts or restarts delivery of events; suspend() holds them (and stops reading) until the next resume().
+    virtual void resume() = 0;
+    virtual void suspend() = 0;
+    // Closes the connection: the handler gets ConnectionInvalid once, pending replies get it too.
+    virtual void cancel() = 0;
+
+    // One-way message.
+    virtual void send(const Value& message) = 0;
+    // The answer to `request`, which the peer receives as the reply it waits for.
+    virtual void sendReply(const ZemMessage& request, const Value& reply) = 0;
+    // A message that expects one reply; `handler` runs on `replyQueue` with the reply or the error in its place.
+    virtual void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) = 0;
+
+    // The peer's credentials taken when the connection was accepted (peer connections) or made (client side:
+    // the service's). A pid of 0 when they are unknown.
+    virtual pid_t peerPid() const = 0;
+    virtual uid_t peerUid() const = 0;
+    virtual gid_t peerGid() const = 0;
+    // The identity of the peer taken at accept (peer connections only; null on client connections).
+    virtual std::shared_ptr<const CodeSigningIdentity> peerIdentity() const = 0;
+
+    virtual const std::string& serviceName() const = 0;
+    virtual std::string description() const = 0;
+};
+
+}  // namespace bexil

@@ -1,0 +1,62 @@
+#pragma once
+
+// The listening end of a Zem service: accepts peer connections on `<service dir>/<name>` (or on the socket systemd
+// passed for it) and hands each, suspended, to the connection handler on the listener's queue. It also turns
+// SIGTERM into a termination-imminent event on every open peer connection, and counts keep-alive units for idle
+// accounting. Created and controlled on one queue; counters may be read anywhere.
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "base/Error.h"
+
+namespace bexil {
+
+class SerialQueue;
+class EntitlementsDirectory;
+class ZemConnection;
+
+class ZemListener {
+  public:
+    using ConnectionHandler = std::function<void(std::shared_ptr<ZemConnection>)>;
+    using ErrorHandler = std::function<void(const Error&)>;
+
+    // Largest number of peer connections open at once; further ones are refused (and logged) until some close.
+    static constexpr size_t kMaxConnections = 4096;
+
+    virtual ~ZemListener() = default;
+
+    // Binds the service. A socket file left by a dead daemon is replaced; one that a live process still accepts on
+    // is never taken over: that is an error naming the service. `entitlements` may be null (no peer has any).
+    // The listener starts suspended: nothing is accepted before resume().
+    static Result<std::shared_ptr<ZemListener>> create(const std::string& serviceName, SerialQueue& queue,
+                                                       EntitlementsDirectory* entitlements);
+
+    // $BX_SERVICE_DIR, else /run/bexil for root, else $XDG_RUNTIME_DIR/bexil.
+    static std::filesystem::path serviceDirectory();
+    static std::filesystem::path socketPathForService(const std::string& serviceName);
+
+    // REQUIRES: before resume().
+    virtual void setConnectionHandler(ConnectionHandler handler) = 0;
+    // Errors of the listening socket itself; they are never taken for a connection.
+    virtual void setErrorHandler(ErrorHandler handler) = 0;
+    // What happens after SIGTERM has been turned into termination-imminent events (default: the process exits).
+    virtual void setTerminationHandler(std::function<void()> handler) = 0;
+    virtual void resume() = 0;
+    virtual void cancel() = 0;
+
+    // Keep-alive units: while any is open the process is busy for the platform's idle accounting.
+    virtual void keepAliveOpen() = 0;
+    virtual void keepAliveClose() = 0;
+    virtual uint64_t keepAliveCount() const = 0;
+
+    virtual size_t connectionCount() const = 0;
+    virtual const std::string& serviceName() const = 0;
+    // True when the socket came from systemd socket activation rather than from bind().
+    virtual bool activatedBySystemd() const = 0;
+};
+
+}  // namespace bexil

@@ -1,0 +1,293 @@
+#include "platform/zem/ZemSocketConnection.h"
+
+#include <sys/socket.h>
+
+#include <cinttypes>
+
+#include "base/EventLoopAsio.h"
+#include "platform/log/Log.h"
+#include "platform/zem/ZemFrame.h"
+#include "platform/zem/ZemListener.h"
+
+// Design. A connection is a small state machine that lives on its serial queue. Reads are always outstanding while
+// the connection is open and resumed; every chunk read is cut into frames, decoded and delivered before the next
+// read is issued, so a peer that floods us is throttled by our own pace. Writes are double-buffered: frames are
+// encoded straight into `outgoing_`, which is swapped into `writing_` whenever no write is in flight, so any
+// number of replies produced in one turn of the loop leave in one system call. The queued-bytes limit bounds what
+// a peer that stops reading can cost us. Every pending operation holds a strong reference, so the object lives
+// exactly as long as it has I/O in flight or an owner outside.
+
+namespace bexil {
+
+namespace {
+
+asio::io_context& ioContextOf(const SerialQueue& queue) { return *detail::QueueInternals::state(queue)->core; }
+
+}  // namespace
+
+ZemSocketConnection::ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName,
+                                         std::shared_ptr<const CodeSigningIdentity> identity, pid_t pid, uid_t uid,
+                                         gid_t gid)
+    : side_(Side::Peer),
+      queue_(std::move(queue)),
+      socket_(std::move(socket)),
+      serviceName_(std::move(serviceName)),
+      identity_(std::move(identity)),
+      pid_(pid),
+      uid_(uid),
+      gid_(gid),
+      state_(State::Open) {}
+
+ZemSocketConnection::ZemSocketConnection(SerialQueue queue, std::string serviceName)
+    : side_(Side::Client), queue_(queue), socket_(ioContextOf(queue)), serviceName_(std::move(serviceName)) {}
+
+ZemSocketConnection::~ZemSocketConnection() {
+    if (finalizer_) finalizer_(std::move(context_));
+}
+
+std::shared_ptr<ZemConnection> ZemConnection::createClient(const std::string& serviceName, SerialQueue& queue) {
+    return std::make_shared<ZemSocketConnection>(queue, serviceName);
+}
+
+void ZemSocketConnection::setEventHandler(EventHandler handler) { handler_ = std::move(handler); }
+void ZemSocketConnection::setContext(std::shared_ptr<void> context) { context_ = std::move(context); }
+std::shared_ptr<void> ZemSocketConnection::context() const { return context_; }
+void ZemSocketConnection::setFinalizer(Finalizer finalizer) { finalizer_ = std::move(finalizer); }
+
+void ZemSocketConnection::resume() {
+    queue_.async([self = shared_from_this()] {
+        if (!self->suspended_) return;
+        self->suspended_ = false;
+        if (self->side_ == Side::Client && self->state_ == State::Idle && !self->connectClient()) return;
+        std::vector<ZemFrame> held = std::move(self->heldFrames_);
+        self->heldFrames_.clear();
+        for (ZemFrame& frame : held) {
+            if (self->state_ != State::Open) break;
+            self->handleFrame(std::move(frame));
+        }
+        self->readMore();
+        self->writeMore();
+    });
+}
+
+void ZemSocketConnection::suspend() {
+    queue_.async([self = shared_from_this()] { self->suspended_ = true; });
+}
+
+void ZemSocketConnection::cancel() {
+    queue_.async([self = shared_from_this()] { self->close(ZemError::Kind::ConnectionInvalid); });
+}
+
+void ZemSocketConnection::deliverTerminationImminent() {
+    queue_.async([self = shared_from_this()] {
+        if (self->state_ == State::Open) self->deliver(ZemError(ZemError::Kind::TerminationImminent));
+    });
+}
+
+void ZemSocketConnection::send(const Value& message) {
+    queue_.async([self = shared_from_this(), message] {
+        self->enqueueFrame(ZemFrameKind::Message, 0, 0, message, std::nullopt);
+    });
+}
+
+void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& reply) {
+    if (!request.expectsReply()) {
+        log::ops().error("reply to message #%llu, which expects none, dropped",
+                         static_cast<unsigned long long>(request.serial()));
+        return;
+    }
+    queue_.async([self = shared_from_this(), serial = request.serial(), reply] {
+        self->enqueueFrame(ZemFrameKind::Reply, 0, serial, reply, std::nullopt);
+    });
+}
+
+void ZemSocketConnection::sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) {
+    queue_.async([self = shared_from_this(), message, pending = PendingReply{replyQueue, std::move(handler)}] {
+        self->enqueueFrame(ZemFrameKind::Request, 0, 0, message, pending);
+    });
+}
+
+bool ZemSocketConnection::connectClient() {
+    std::filesystem::path path = ZemListener::socketPathForService(serviceName_);
+    asio::error_code error;
+    socket_ = Socket(ioContextOf(queue_));
+    socket_.connect(asio::local::stream_protocol::endpoint(path.string()), error);
+    if (error) {
+        log::ops().debug("cannot connect to service %s at %s: %s", serviceName_.c_str(), path.c_str(),
+                         error.message().c_str());
+        state_ = State::Open;  // so that close() runs its course
+        close(ZemError::Kind::ConnectionInvalid);
+        return false;
+    }
+    struct ucred cred {};
+    socklen_t len = sizeof cred;
+    if (getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &cred, &len) == 0) {
+        pid_ = cred.pid;
+        uid_ = cred.uid;
+        gid_ = cred.gid;
+    }
+    state_ = State::Open;
+    return true;
+}
+
+void ZemSocketConnection::readMore() {
+    if (suspended_ || reading_ || state_ != State::Open) return;
+    reading_ = true;
+    if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
+    socket_.async_read_some(
+        asio::buffer(readBuffer_),
+        detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error, size_t bytes) {
+            self->onRead(error, bytes);
+        }));
+}
+
+void ZemSocketConnection::onRead(const asio::error_code& error, size_t bytes) {
+    reading_ = false;
+    if (state_ != State::Open) return;
+    if (error) {
+        if (reader_.hasPartialFrame())
+            log::ops().error("peer %d closed its connection in the middle of a frame", static_cast<int>(pid_));
+        close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    std::optional<Error> broken = reader_.feed(std::span<const uint8_t>(readBuffer_.data(), bytes));
+    // Frames completed before a bad header are still whole and are handled; then the stream is dropped.
+    while (std::optional<ZemFrame> frame = reader_.next()) {
+        if (state_ != State::Open) return;
+        if (suspended_)
+            heldFrames_.push_back(std::move(*frame));
+        else
+            handleFrame(std::move(*frame));
+    }
+    if (broken) {
+        log::ops().error("protocol violation by peer %d: %@; disconnecting", static_cast<int>(pid_), *broken);
+        close(ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    readMore();
+}
+
+void ZemSocketConnection::handleFrame(ZemFrame frame) {
+    Result<Value> body = frame.decodePayload();
+    if (!body) {
+        log::ops().error("protocol violation by peer %d in %s: %@; disconnecting", static_cast<int>(pid_),
+                         frame.description().c_str(), body.error());
+        close(ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    switch (frame.kind()) {
+        case ZemFrameKind::Message:
+        case ZemFrameKind::Request:
+            deliver(ZemMessage(std::move(*body), frame.serial(), frame.kind() == ZemFrameKind::Request));
+            return;
+        case ZemFrameKind::Reply: {
+            auto it = pendingReplies_.find(frame.inReplyTo());
+            if (it == pendingReplies_.end()) {
+                log::ops().error("reply from peer %d to unknown request #%llu dropped", static_cast<int>(pid_),
+                                 static_cast<unsigned long long>(frame.inReplyTo()));
+                return;
+            }
+            PendingReply pending = std::move(it->second);
+            pendingReplies_.erase(it);
+            pending.queue.async([handler = std::move(pending.handler), reply = std::move(*body)] {
+                handler(std::variant<Value, ZemError>(reply));
+            });
+            return;
+        }
+    }
+}
+
+void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
+                                       std::optional<PendingReply> pending) {
+    if (side_ == Side::Client && state_ == State::Interrupted) {
+        // The service went away earlier; a new message tries to reach it again.
+        state_ = State::Idle;
+        if (!suspended_ && !connectClient()) {
+            if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+            return;
+        }
+        readMore();
+    }
+    if (state_ == State::Closed) {
+        if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    if (kind != ZemFrameKind::Reply) serial = nextSerial_++;
+    if (std::optional<Error> error = ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_)) {
+        log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(kind), static_cast<int>(pid_), *error);
+        if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    if (pending) pendingReplies_.emplace(serial, std::move(*pending));
+    size_t queued = outgoing_.size() + writing_.size();
+    if (queued > kMaxQueuedBytes) {
+        log::ops().error("peer %d has %zu bytes queued, over the limit of %zu (kMaxQueuedBytes): disconnecting",
+                         static_cast<int>(pid_), queued, kMaxQueuedBytes);
+        close(ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    writeMore();
+}
+
+void ZemSocketConnection::writeMore() {
+    if (writeInFlight_ || outgoing_.empty() || state_ != State::Open) return;
+    writing_.swap(outgoing_);
+    outgoing_.clear();
+    writeInFlight_ = true;
+    asio::async_write(
+        socket_, asio::buffer(writing_),
+        detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error, size_t bytes) {
+            self->onWritten(error, bytes);
+        }));
+}
+
+void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
+    writeInFlight_ = false;
+    writing_.clear();
+    if (state_ != State::Open) return;
+    if (error) {
+        close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    writeMore();
+}
+
+void ZemSocketConnection::failPendingReplies(ZemError::Kind kind) {
+    auto pending = std::move(pendingReplies_);
+    pendingReplies_.clear();
+    for (auto& [serial, reply] : pending) answerWithError(reply, kind);
+}
+
+void ZemSocketConnection::answerWithError(PendingReply& pending, ZemError::Kind kind) {
+    pending.queue.async(
+        [handler = std::move(pending.handler), kind] { handler(std::variant<Value, ZemError>(ZemError(kind))); });
+}
+
+void ZemSocketConnection::close(ZemError::Kind kind) {
+    if (state_ == State::Closed) return;
+    bool interrupted = side_ == Side::Client && kind == ZemError::Kind::ConnectionInterrupted;
+    state_ = interrupted ? State::Interrupted : State::Closed;
+    asio::error_code ignored;
+    socket_.close(ignored);
+    reader_ = ZemFrameReader();
+    outgoing_.clear();
+    heldFrames_.clear();
+    failPendingReplies(kind);
+    deliver(ZemError(kind));
+    if (!interrupted) {
+        // Nothing follows an invalid connection: let go of the handler (and what it captured) now.
+        handler_ = nullptr;
+        if (closedCallback_) std::exchange(closedCallback_, nullptr)();
+    }
+}
+
+void ZemSocketConnection::deliver(const Event& event) {
+    if (handler_) handler_(event);
+}
+
+std::string ZemSocketConnection::description() const {
+    return "<zem connection " + serviceName_ + (side_ == Side::Peer ? " peer pid " : " service pid ") +
+           std::to_string(pid_.load()) + ">";
+}
+
+}  // namespace bexil

@@ -1,0 +1,113 @@
+#pragma once
+
+// INTERNAL to the IPC layer: the Unix-socket implementation of ZemConnection. Every piece of its state is touched
+// on its queue only (the strand of the connection's SerialQueue): reading, cutting frames, decoding, delivering
+// events, encoding and writing. Sends from other threads are posted there first. Includes Asio, so only .cpp files
+// of src/platform/zem include it.
+
+#include <asio.hpp>
+#include <atomic>
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "base/SerialQueue.h"
+#include "platform/zem/ZemConnection.h"
+#include "platform/zem/ZemFrameReader.h"
+
+namespace bexil {
+
+class ZemSocketConnection final : public ZemConnection, public std::enable_shared_from_this<ZemSocketConnection> {
+  public:
+    using Socket = asio::local::stream_protocol::socket;
+
+    // Bytes of replies and messages queued towards one peer that has not read them yet; past this the peer is
+    // taken to have stopped reading and is disconnected.
+    static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
+    // Size of one read from the socket.
+    static constexpr size_t kReadChunkBytes = 64 * 1024;
+
+    enum class Side { Peer, Client };
+
+    // A peer connection around an accepted socket, with the identity taken at accept.
+    ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName,
+                        std::shared_ptr<const CodeSigningIdentity> identity, pid_t pid, uid_t uid, gid_t gid);
+    // A client connection, not yet connected.
+    ZemSocketConnection(SerialQueue queue, std::string serviceName);
+    ~ZemSocketConnection() override;
+
+    // Called once when the connection ends (listener bookkeeping).
+    void setClosedCallback(std::function<void()> callback) { closedCallback_ = std::move(callback); }
+    // Delivers TerminationImminent to the event handler (posted to the connection's queue).
+    void deliverTerminationImminent();
+
+    void setEventHandler(EventHandler handler) override;
+    void setContext(std::shared_ptr<void> context) override;
+    std::shared_ptr<void> context() const override;
+    void setFinalizer(Finalizer finalizer) override;
+    void resume() override;
+    void suspend() override;
+    void cancel() override;
+    void send(const Value& message) override;
+    void sendReply(const ZemMessage& request, const Value& reply) override;
+    void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) override;
+    pid_t peerPid() const override { return pid_.load(); }
+    uid_t peerUid() const override { return uid_.load(); }
+    gid_t peerGid() const override { return gid_.load(); }
+    std::shared_ptr<const CodeSigningIdentity> peerIdentity() const override { return identity_; }
+    const std::string& serviceName() const override { return serviceName_; }
+    std::string description() const override;
+
+  private:
+    struct PendingReply {
+        SerialQueue queue;
+        ReplyHandler handler;
+    };
+    enum class State { Idle, Open, Interrupted, Closed };
+
+    // All of the following run on queue_.
+    void start();
+    bool connectClient();
+    void readMore();
+    void onRead(const asio::error_code& error, size_t bytes);
+    void handleFrame(ZemFrame frame);
+    void enqueueFrame(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
+                      std::optional<PendingReply> pending);
+    void writeMore();
+    void onWritten(const asio::error_code& error, size_t bytes);
+    // Ends the connection because of `why` (logged when it is a protocol violation or a limit).
+    void close(ZemError::Kind kind);
+    void failPendingReplies(ZemError::Kind kind);
+    // Answers one request with the error that took its reply's place, on the request's reply queue.
+    static void answerWithError(PendingReply& pending, ZemError::Kind kind);
+    void deliver(const Event& event);
+
+    const Side side_;
+    SerialQueue queue_;
+    Socket socket_;
+    const std::string serviceName_;
+    std::shared_ptr<const CodeSigningIdentity> identity_;
+    std::atomic<pid_t> pid_{0};
+    std::atomic<uid_t> uid_{static_cast<uid_t>(-1)};
+    std::atomic<gid_t> gid_{static_cast<gid_t>(-1)};
+
+    EventHandler handler_;
+    std::shared_ptr<void> context_;
+    Finalizer finalizer_;
+    std::function<void()> closedCallback_;
+
+    State state_ = State::Idle;
+    bool suspended_ = true;
+    bool reading_ = false;
+    ZemFrameReader reader_;
+    std::vector<uint8_t> readBuffer_;
+    std::vector<uint8_t> outgoing_;  // frames waiting for the write in flight to finish
+    std::vector<uint8_t> writing_;   // the frames of the write in flight
+    bool writeInFlight_ = false;
+    uint64_t nextSerial_ = 1;
+    std::map<uint64_t, PendingReply> pendingReplies_;
+    std::vector<ZemFrame> heldFrames_;  // frames read while suspended
+};
+
+}  // namespace bexil
