@@ -1,0 +1,95 @@
+#include "daemon/BXDServer.h"
+
+#include <systemd/sd-daemon.h>
+
+#include <algorithm>
+#include <atomic>
+
+#include "base/EventLoop.h"
+#include "daemon/BXDPlugInHold.h"
+#include "daemon/BXDZemClient.h"
+#include "platform/codesign/EntitlementsDirectory.h"
+#include "platform/log/Log.h"
+#include "platform/zem/ZemConnection.h"
+#include "platform/zem/ZemListener.h"
+
+namespace bexil {
+
+static std::atomic<BXDServer*> gServer{nullptr};
+
+// How long bxd lingers after SIGTERM so that termination-imminent events reach every connection queue.
+static constexpr auto kTerminationGrace = std::chrono::milliseconds(50);
+
+BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
+    : BXDatabase(databasePath ? std::optional<std::string>(databasePath) : std::nullopt),
+      loop_(loop),
+      zemQueue_("zem", loop),
+      mainQueue_("service", loop),
+      syncQueue_("serverSync") {}
+
+BXDServer::~BXDServer() {
+    if (service_) service_->cancel();
+    BXDServer* self = this;
+    gServer.compare_exchange_strong(self, nullptr);
+}
+
+std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* serviceName, const char* databasePath,
+                                                             EventLoop& loop) {
+    std::unique_ptr<BXDServer> server(new BXDServer(databasePath, loop));
+    if (!server->initWithDatabase()) return nullptr;
+
+    server->entitlements_ = std::make_unique<EntitlementsDirectory>(EntitlementsDirectory::defaultPath(), geteuid());
+    Result<std::shared_ptr<ZemListener>> listener = ZemListener::create(serviceName ? serviceName : kDefaultServiceName,
+                                                                        server->zemQueue_, server->entitlements_.get());
+    if (!listener) {
+        log::ops().error("cannot listen on service %s: %@", serviceName ? serviceName : kDefaultServiceName,
+                         listener.error());
+        return nullptr;
+    }
+    server->service_ = *listener;
+
+    gServer.store(server.get());
+    server->setDelegate(server.get());
+
+    BXDServer* raw = server.get();
+    server->service_->setConnectionHandler([raw](std::shared_ptr<ZemConnection> connection) {
+        // The client object lives as long as its connection: the server keeps no list of clients.
+        BXDZemClient::initWithConnectionServer(connection, raw);
+    });
+    server->service_->setErrorHandler(
+        [](const Error& error) { log::ops().error("error on the listening endpoint: %@", error); });
+
+    // After SIGTERM every client has been told; give their connection queues a moment to log it, then leave the
+    // loop so that main returns and the process exits with status 0.
+    server->service_->setTerminationHandler(
+        [raw] { raw->mainQueue_.asyncAfter(kTerminationGrace, [raw] { raw->loop_.stop(); }); });
+
+    server->userPrefs_ = std::make_unique<BXDUserPrefs>();
+    return server;
+}
+
+BXDServer* BXDServer::server() { return gServer.load(); }
+
+void BXDServer::run() {
+    service_->resume();
+    // Readiness means "accepting connections": the listener is bound and resumed, the loop starts right below.
+    sd_notify(0, "READY=1");
+    loop_.runOnCurrentThread();
+}
+
+void BXDServer::submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
+
+void BXDServer::removedPlugIns(const Value& plugIns) {
+    // FIXME: terminate the plug-ins' running instances first, once the service manager is there to ask.
+    log::ops().debug("removal complete for %@", plugIns);
+}
+
+std::vector<std::shared_ptr<BXDPlugInHold>>& BXDServer::holds() { return holds_; }
+
+void BXDServer::unholdClient(const BXDZemClient* client) {
+    syncQueue_.sync([&] {
+        std::erase_if(holds_, [client](const std::shared_ptr<BXDPlugInHold>& hold) { return hold->belongsTo(client); });
+    });
+}
+
+}  // namespace bexil

@@ -1,0 +1,76 @@
+#pragma once
+
+// The one server of the bxd process: the plug-in database (its base class), the Zem listener, the three queues on
+// which all daemon work runs, the hold list and the preferences. Built once by main and reachable through
+// server(); lives for the life of the process. Requests run one at a time on mainQueue; holds are touched only
+// inside syncQueue.
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/SerialQueue.h"
+#include "base/SyncQueue.h"
+#include "database/BXDUserPrefs.h"
+#include "database/BXDatabase.h"
+
+namespace bexil {
+
+class BXDPlugInHold;
+class BXDZemClient;
+class EntitlementsDirectory;
+class EventLoop;
+class ZemListener;
+
+class BXDServer : public BXDatabase, public BXDatabaseDelegate {
+  public:
+    static constexpr const char* kDefaultServiceName = "com.quorvel.bexil.bxd";
+
+    // initForService:database: builds the server on `loop`; none when the database or the listener cannot be
+    // built (the listener failure is logged with its reason).
+    static std::unique_ptr<BXDServer> initForServiceDatabase(const char* serviceName, const char* databasePath,
+                                                             EventLoop& loop);
+    ~BXDServer() override;
+
+    // The process-wide server (null before initForServiceDatabase has run).
+    static BXDServer* server();
+
+    // Resumes the listener, tells systemd that bxd is ready, and runs the event loop on the calling thread.
+    // Returns only when the loop is stopped (tests); the daemon's process ends from outside.
+    void run();
+    // Queues `work` on mainQueue.
+    void submitWork(std::function<void()> work);
+
+    // Database delegate: plug-ins about to be uninstalled.
+    void removedPlugIns(const Value& plugIns) override;
+    // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
+    void unholdClient(const BXDZemClient* client);
+
+    SerialQueue& zemQueue() { return zemQueue_; }
+    SerialQueue& mainQueue() { return mainQueue_; }
+    SyncQueue& syncQueue() { return syncQueue_; }
+    ZemListener& service() { return *service_; }
+    BXDUserPrefs& userPrefs() { return *userPrefs_; }
+    EventLoop& eventLoop() { return loop_; }
+    // REQUIRES: inside syncQueue.
+    std::vector<std::shared_ptr<BXDPlugInHold>>& holds();
+
+    unsigned verbose() const { return verbose_; }
+    void setVerbose(unsigned count) { verbose_ = count; }
+
+  private:
+    BXDServer(const char* databasePath, EventLoop& loop);
+
+    EventLoop& loop_;
+    SerialQueue zemQueue_;
+    SerialQueue mainQueue_;
+    SyncQueue syncQueue_;
+    std::unique_ptr<EntitlementsDirectory> entitlements_;
+    std::shared_ptr<ZemListener> service_;
+    std::vector<std::shared_ptr<BXDPlugInHold>> holds_;
+    std::unique_ptr<BXDUserPrefs> userPrefs_;
+    unsigned verbose_ = 0;
+};
+
+}  // namespace bexil

@@ -1,0 +1,66 @@
+#pragma once
+
+// The daemon's view of one connected peer: who it is (pid, executable, bundle, code-signing identity and its
+// entitlements) and the bridge from its connection to the request queue. Made by the server for each accepted
+// connection and owned by that connection (as its context) and by the client's pending transactions. Connection
+// events run on the connection's queue; requestCount is touched only on the request queue.
+
+#include <sys/types.h>
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "base/Value.h"
+#include "platform/zem/ZemConnection.h"
+
+namespace bexil {
+
+class BXDServer;
+class CodeSigningIdentity;
+
+class BXDZemClient : public std::enable_shared_from_this<BXDZemClient> {
+  public:
+    // Size of the buffer the executable path is read into; longer paths count as unknown.
+    static constexpr size_t kExecutablePathBufferSize = 2048;
+
+    // initWithConnection:server: builds and starts the client; the connection keeps it alive from then on.
+    static std::shared_ptr<BXDZemClient> initWithConnectionServer(const std::shared_ptr<ZemConnection>& connection,
+                                                                  BXDServer* server);
+
+    // The peer is about to exit (the daemon is being stopped); only logged.
+    void dying();
+    // The connection is gone: releases the client's holds and stops accepting work.
+    void dead();
+
+    // The entitlement's value in the peer's signature, or a null Value.
+    Value entitlementValueForKey(std::string_view key) const;
+    // True when the entitlement has a value that is not equal to false (so not false and not the number 0).
+    bool hasEntitlement(std::string_view key) const;
+
+    std::string description() const;
+
+    std::shared_ptr<ZemConnection> connection() const { return connection_.lock(); }
+    BXDServer* server() const { return server_; }
+    // The peer's pid, read from the connection every time; 0 once the connection no longer exists.
+    pid_t pid() const;
+    // The peer's executable path; empty when it could not be found.
+    const std::string& path() const { return path_; }
+    bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }
+    unsigned requestCount() const { return requestCount_; }
+
+  private:
+    BXDZemClient(const std::shared_ptr<ZemConnection>& connection, BXDServer* server);
+    void start();
+    void handleEvent(const ZemConnection::Event& event);
+
+    std::weak_ptr<ZemConnection> connection_;
+    BXDServer* server_;
+    std::string path_;
+    std::atomic<bool> acceptWork_{true};
+    std::shared_ptr<const CodeSigningIdentity> _task;
+    unsigned requestCount_ = 0;  // request queue only
+};
+
+}  // namespace bexil

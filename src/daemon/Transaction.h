@@ -1,0 +1,77 @@
+#pragma once
+
+// One request on its way through the daemon: the request message, the client that sent it and the reply being
+// built. Made on the client's connection queue, dispatched once on the server's request queue, and answered
+// exactly once with done() (directly or through fail()), possibly later from another queue. A Transaction holds
+// its client strongly, so the client outlives every request it has pending.
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string_view>
+
+#include "base/Error.h"
+#include "base/Value.h"
+#include "platform/zem/ZemMessage.h"
+
+namespace bexil {
+
+class BXDServer;
+class BXDZemClient;
+class ZemConnection;
+
+// The value under `key` if it is an array, otherwise none.
+std::optional<Value> zem_dictionary_get_array(const Value& dictionary, std::string_view key);
+// The value under `key` if it is a dictionary, otherwise none.
+std::optional<Value> zem_dictionary_get_dictionary(const Value& dictionary, std::string_view key);
+
+class Transaction : public std::enable_shared_from_this<Transaction> {
+  public:
+    // The protocol version this daemon speaks; 2 is still accepted.
+    static constexpr uint64_t kCurrentProtocolVersion = 3;
+
+    // initWithRequest:forClient: stores both and creates the reply from the request.
+    Transaction(ZemMessage request, std::shared_ptr<BXDZemClient> client);
+
+    // Validates the envelope and calls the handler for the request's name. REQUIRES: on the server's request queue.
+    void dispatch();
+    // Sends the reply. Called exactly once per transaction; later calls are ignored.
+    void done();
+    // Sets "errorcode" and "error" in the reply, then done().
+    void fail(int code, std::string_view message);
+    // A Bexil-domain error answers with its own code and message; any other with `code` and its description.
+    void fail(int code, const Error& error);
+
+    const std::shared_ptr<BXDZemClient>& client() const { return client_; }
+    const Value& request() const { return request_.body(); }
+    const ZemMessage& requestMessage() const { return request_; }
+    // The reply under construction. REQUIRES: only the handler touches it, before done().
+    MutableDictionary& reply() { return reply_; }
+    uint64_t version() const { return version_; }
+    BXDServer* server() const;
+    std::shared_ptr<ZemConnection> connection() const;
+    bool answered() const { return answered_.load(); }
+
+    // Request handlers, one per request name.
+    void addPlugIns();
+    void removePlugIns();
+    void bulkPlugIns();
+    void matchPlugIns();
+    void readyPlugIns();
+    void accessPlugIns();
+    void annotatePlugIns();
+    void bulkAnnotatePlugIns();
+    void lockDownPlugIns();
+
+  private:
+    void runHandler(std::string_view name);
+
+    ZemMessage request_;
+    std::shared_ptr<BXDZemClient> client_;
+    MutableDictionary reply_;
+    uint64_t version_ = 0;
+    std::atomic<bool> answered_{false};
+};
+
+}  // namespace bexil

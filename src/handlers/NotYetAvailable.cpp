@@ -1,0 +1,18 @@
+// Request names whose operations this daemon does not have yet. Each answers code 4 with a message that says so,
+// rather than "unrecognized request", so a client can tell a missing feature from a typo.
+
+#include "daemon/Transaction.h"
+
+namespace bexil {
+
+void Transaction::addPlugIns() { fail(4, "the \"add\" operation is not available yet"); }
+void Transaction::removePlugIns() { fail(4, "the \"remove\" operation is not available yet"); }
+void Transaction::bulkPlugIns() { fail(4, "the \"bulk\" operation is not available yet"); }
+void Transaction::matchPlugIns() { fail(4, "the \"match\" operation is not available yet"); }
+void Transaction::readyPlugIns() { fail(4, "the \"ready\" operation is not available yet"); }
+void Transaction::accessPlugIns() { fail(4, "the \"access\" operation is not available yet"); }
+void Transaction::annotatePlugIns() { fail(4, "the \"annotate\" operation is not available yet"); }
+void Transaction::bulkAnnotatePlugIns() { fail(4, "the \"bulk-annotate\" operation is not available yet"); }
+void Transaction::lockDownPlugIns() { fail(4, "the \"lock\" operation is not available yet"); }
+
+}  // namespace bexil
