@@ -1,11 +1,11 @@
-#include "base/Value.h"
-
 #include <gtest/gtest.h>
 
 #include <cmath>
 #include <limits>
 #include <thread>
 #include <unordered_set>
+
+#include "base/Value.h"
 
 namespace bexil {
 namespace {
@@ -45,8 +45,8 @@ TEST(ValueSharing, SharedAcrossThreadsWithoutRaces) {
 }
 
 TEST(ValueDictionary, KeepsSortedOrderAndLastDuplicateWins) {
-    Value d = dict({{"zeta", Value::int64(1)}, {"alpha", Value::int64(2)}, {"mid", Value::int64(3)},
-                    {"alpha", Value::int64(4)}});
+    Value d = dict(
+        {{"zeta", Value::int64(1)}, {"alpha", Value::int64(2)}, {"mid", Value::int64(3)}, {"alpha", Value::int64(4)}});
     ASSERT_EQ(d.count(), 3u);
     EXPECT_EQ(d.entries()[0].key, "alpha");
     EXPECT_EQ(d.entries()[1].key, "mid");
@@ -188,8 +188,8 @@ TEST(Date, Iso8601RoundTripsToTheMicrosecond) {
     }
     EXPECT_EQ(Date{0}.iso8601(), "1970-01-01T00:00:00Z");
     EXPECT_EQ(Date{951782400.5}.iso8601(), "2000-02-29T00:00:00.5Z");
-    for (const char* bad : {"2026-02-29T00:00:00Z", "2026-13-01T00:00:00Z", "2026-01-01 00:00:00Z", "2026-01-01T00:00:00",
-                            "2026-01-01T00:00:00.Z", "2026-01-01T24:00:00Z", "garbage"})
+    for (const char* bad : {"2026-02-29T00:00:00Z", "2026-13-01T00:00:00Z", "2026-01-01 00:00:00Z",
+                            "2026-01-01T00:00:00", "2026-01-01T00:00:00.Z", "2026-01-01T24:00:00Z", "garbage"})
         EXPECT_FALSE(Date::parseIso8601(bad)) << bad;
 }
 
@@ -200,9 +200,10 @@ TEST(ValueDescription, ReadableAndBounded) {
                     {"ok", Value::boolean(true)},
                     {"bytes", Value::data(std::vector<uint8_t>{0xde, 0xad})},
                     {"list", Value::array({Value::null(), Value::real(1.5)})}});
-    EXPECT_EQ(v.description(),
-              "{\"bytes\": <dead>, \"flags\": 7, \"list\": [null, 1.5], \"n\": -3, \"name\": \"a \\\"quoted\\\"\\nline\", "
-              "\"ok\": true}");
+    EXPECT_EQ(
+        v.description(),
+        "{\"bytes\": <dead>, \"flags\": 7, \"list\": [null, 1.5], \"n\": -3, \"name\": \"a \\\"quoted\\\"\\nline\", "
+        "\"ok\": true}");
 
     MutableArray huge;
     for (int i = 0; i < 100000; ++i) huge.append(Value::string("element number " + std::to_string(i)));

@@ -8,9 +8,19 @@
 #include <vector>
 
 #include "model/BXPlugInCore.h"
+#include "platform/log/CaptureSink.h"
 
 namespace bexil {
 namespace {
+
+// The captured lines as "<level>: <message>", one per line, in the order they were logged.
+[[maybe_unused]] std::string capturedLog(const log::CaptureSink& capture) {
+    std::string text;
+    for (const auto& entry : capture.entries())
+        text += std::string(log::levelName(entry.level)) + ": " + entry.message + "\n";
+    return text;
+}
+
 
 using Entries = std::vector<std::pair<std::string, Value>>;
 
@@ -52,18 +62,18 @@ std::shared_ptr<BXPlugInCore> recordWithPlugIn(const char* path, Entries plugIn)
 // ---- Set-up ----
 
 TEST(BXPlugInCoreSetup, MissingUrlFailsWithoutLogging) {
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::nullopt, shareInfo(),
                                                                   std::nullopt, std::nullopt);
     EXPECT_EQ(record, nullptr);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+    EXPECT_EQ(capturedLog(capture), "");
 }
 
 TEST(BXPlugInCoreSetup, MissingIdentifierFailsAndLogsThePath) {
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::nullopt, std::string(kSharePath), shareInfo(),
                                                                   std::nullopt, std::nullopt);
-    std::string log = testing::internal::GetCapturedStderr();
+    std::string log = capturedLog(capture);
     EXPECT_EQ(record, nullptr);
     EXPECT_NE(log.find(std::string("missing identifier in plug-in at ") + kSharePath), std::string::npos) << log;
     EXPECT_NE(log.find("error"), std::string::npos) << log;
@@ -72,10 +82,10 @@ TEST(BXPlugInCoreSetup, MissingIdentifierFailsAndLogsThePath) {
 TEST(BXPlugInCoreSetup, NonDictionaryRZExtensionFailsButKeepsTheInformationDictionary) {
     Value info = dict({{"BDBundleIdentifier", str("com.example.broken")}, {"RZExtension", str("oops")}});
     BXPlugInCore record;
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     EXPECT_FALSE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.broken", std::string(kToolPath), info,
                                                            std::nullopt, std::nullopt));
-    std::string log = testing::internal::GetCapturedStderr();
+    std::string log = capturedLog(capture);
     EXPECT_NE(log.find("malformed plug-in dictionary in plug-in com.example.broken at /System/Library/Bexil/"
                        "Indexer.bundle: "),
               std::string::npos)
@@ -90,10 +100,10 @@ TEST(BXPlugInCoreSetup, NonDictionaryRZExtensionFailsButKeepsTheInformationDicti
 
 TEST(BXPlugInCoreSetup, InformationDictionaryOfWrongKindFailsAndChangesNothing) {
     BXPlugInCore record;
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     EXPECT_FALSE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
                                                            Value::array({str("a")}), std::nullopt, std::nullopt));
-    EXPECT_NE(testing::internal::GetCapturedStderr().find("malformed plug-in dictionary"), std::string::npos);
+    EXPECT_NE(capturedLog(capture).find("malformed plug-in dictionary"), std::string::npos);
     EXPECT_FALSE(record.bundleInfoDictionary());
     EXPECT_FALSE(record.setDictionaries(str("not a dictionary")));
     EXPECT_FALSE(record.bundleInfoDictionary());
@@ -141,9 +151,9 @@ TEST(BXPlugInCoreSetup, StoresNamesAndGivenOrFreshUuid) {
 }
 
 TEST(BXPlugInCoreSetup, ObsoleteMultipleKeyIsLoggedAndIgnored) {
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     auto record = makeRecord(kSharePath, shareInfo({{"Multiple", Value::boolean(true)}}));
-    std::string log = testing::internal::GetCapturedStderr();
+    std::string log = capturedLog(capture);
     ASSERT_TRUE(record);
     EXPECT_NE(log.find("multiplexed plug-ins (Multiple key) obsolete and ignored"), std::string::npos) << log;
     EXPECT_FALSE(record->isMultiplexed());
@@ -163,10 +173,10 @@ class NormalizingRecord : public BXPlugInCore {
 TEST(BXPlugInCoreSetup, NormalizeHookRunsBeforeTheDictionariesAreStored) {
     NormalizingRecord record;
     Value info = dict({{"RZExtension", str("would be malformed")}});
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     ASSERT_TRUE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath), info, std::nullopt,
                                                           std::nullopt));
-    testing::internal::GetCapturedStderr();
+    capturedLog(capture);
     EXPECT_EQ(record.protocolSpec(), str("Normalized"));
 }
 
@@ -273,16 +283,16 @@ TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeys) {
 
     BXPlugInCore legacy;
     legacy.setBundleInfoDictionary(dict({{"Bexil", dict({{"Protocol", str("P")}})}}));
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     EXPECT_TRUE(legacy.oldStyle());
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+    EXPECT_EQ(capturedLog(capture), "");
 }
 
 TEST(BXPlugInCoreDerived, NeitherStyleIsAFaultAndAnswersOldStyle) {
     auto record = recordWithPlugIn(kToolPath, {});
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     EXPECT_TRUE(record->oldStyle());
-    std::string log = testing::internal::GetCapturedStderr();
+    std::string log = capturedLog(capture);
     EXPECT_NE(log.find("fault"), std::string::npos) << log;
     EXPECT_NE(log.find("unknown plug-in configuration style"), std::string::npos) << log;
     EXPECT_NE(log.find("oldStyle"), std::string::npos) << log;

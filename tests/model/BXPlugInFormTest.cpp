@@ -4,9 +4,19 @@
 #include <set>
 
 #include "model/BXPlugInCore.h"
+#include "platform/log/CaptureSink.h"
 
 namespace bexil {
 namespace {
+
+// The captured lines as "<level>: <message>", one per line, in the order they were logged.
+[[maybe_unused]] std::string capturedLog(const log::CaptureSink& capture) {
+    std::string text;
+    for (const auto& entry : capture.entries())
+        text += std::string(log::levelName(entry.level)) + ": " + entry.message + "\n";
+    return text;
+}
+
 
 using Entries = std::vector<std::pair<std::string, Value>>;
 
@@ -63,9 +73,9 @@ const std::set<std::string> kAlwaysWritten = {
 
 // Reads a form, swallowing the log lines a failing read writes.
 std::shared_ptr<BXPlugInCore> read(const Value& form, std::string* log = nullptr) {
-    testing::internal::CaptureStderr();
+    log::CaptureSink capture;
     auto record = BXPlugInCore::initWithForm(form);
-    std::string text = testing::internal::GetCapturedStderr();
+    std::string text = capturedLog(capture);
     if (log) *log = text;
     return record;
 }
