@@ -19,7 +19,7 @@ namespace bexil {
 inline constexpr std::string_view BXErrorDomain = "Bexil";
 
 class Error {
-public:
+  public:
     Error(std::string domain, int64_t code, std::optional<std::string> message = std::nullopt)
         : domain_(std::move(domain)), code_(code), message_(std::move(message)) {}
 
@@ -34,7 +34,7 @@ public:
 
     bool operator==(const Error&) const = default;
 
-private:
+  private:
     std::string domain_;
     int64_t code_;
     std::optional<std::string> message_;
@@ -54,7 +54,7 @@ inline Error BXErrorWithFormat(int code, std::nullptr_t) { return BXError(code, 
 // A value or the error that prevented it. Expected failures travel this way, never as exceptions.
 template <typename T>
 class Result {
-public:
+  public:
     Result(T value) : v_(std::move(value)) {}
     Result(Error error) : v_(std::move(error)) {}
 
@@ -69,14 +69,14 @@ public:
     T& operator*() & { return value(); }
     const T& operator*() const& { return value(); }
 
-private:
+  private:
     std::variant<T, Error> v_;
 };
 
 // A broken invariant (a registry answer of the wrong kind, a reply with a message but no code). The request
 // boundary catches it, logs at fault level and answers code 4; nothing else should catch it.
 class InternalInconsistency : public std::logic_error {
-public:
+  public:
     using std::logic_error::logic_error;
 };
 

@@ -52,17 +52,28 @@ using detail::UuidNode;
 
 const char* valueKindName(ValueKind kind) {
     switch (kind) {
-        case ValueKind::Null: return "null";
-        case ValueKind::Bool: return "bool";
-        case ValueKind::Int64: return "int64";
-        case ValueKind::UInt64: return "uint64";
-        case ValueKind::Real: return "real";
-        case ValueKind::String: return "string";
-        case ValueKind::Data: return "data";
-        case ValueKind::Date: return "date";
-        case ValueKind::Uuid: return "uuid";
-        case ValueKind::Array: return "array";
-        case ValueKind::Dictionary: return "dictionary";
+        case ValueKind::Null:
+            return "null";
+        case ValueKind::Bool:
+            return "bool";
+        case ValueKind::Int64:
+            return "int64";
+        case ValueKind::UInt64:
+            return "uint64";
+        case ValueKind::Real:
+            return "real";
+        case ValueKind::String:
+            return "string";
+        case ValueKind::Data:
+            return "data";
+        case ValueKind::Date:
+            return "date";
+        case ValueKind::Uuid:
+            return "uuid";
+        case ValueKind::Array:
+            return "array";
+        case ValueKind::Dictionary:
+            return "dictionary";
     }
     return "unknown";
 }
@@ -369,35 +380,48 @@ static std::optional<uint64_t> doubleToUInt64(double d) {
 
 std::optional<int64_t> Value::numberAsInt64() const {
     switch (kind_) {
-        case ValueKind::Bool: return scalar_.b ? 1 : 0;
-        case ValueKind::Int64: return scalar_.i;
+        case ValueKind::Bool:
+            return scalar_.b ? 1 : 0;
+        case ValueKind::Int64:
+            return scalar_.i;
         case ValueKind::UInt64:
             if (scalar_.u > static_cast<uint64_t>(INT64_MAX)) return std::nullopt;
             return static_cast<int64_t>(scalar_.u);
-        case ValueKind::Real: return doubleToInt64(scalar_.r);
-        default: return std::nullopt;
+        case ValueKind::Real:
+            return doubleToInt64(scalar_.r);
+        default:
+            return std::nullopt;
     }
 }
 
 std::optional<uint64_t> Value::numberAsUInt64() const {
     switch (kind_) {
-        case ValueKind::Bool: return scalar_.b ? 1 : 0;
+        case ValueKind::Bool:
+            return scalar_.b ? 1 : 0;
         case ValueKind::Int64:
             if (scalar_.i < 0) return std::nullopt;
             return static_cast<uint64_t>(scalar_.i);
-        case ValueKind::UInt64: return scalar_.u;
-        case ValueKind::Real: return doubleToUInt64(scalar_.r);
-        default: return std::nullopt;
+        case ValueKind::UInt64:
+            return scalar_.u;
+        case ValueKind::Real:
+            return doubleToUInt64(scalar_.r);
+        default:
+            return std::nullopt;
     }
 }
 
 std::optional<double> Value::numberAsDouble() const {
     switch (kind_) {
-        case ValueKind::Bool: return scalar_.b ? 1.0 : 0.0;
-        case ValueKind::Int64: return static_cast<double>(scalar_.i);
-        case ValueKind::UInt64: return static_cast<double>(scalar_.u);
-        case ValueKind::Real: return scalar_.r;
-        default: return std::nullopt;
+        case ValueKind::Bool:
+            return scalar_.b ? 1.0 : 0.0;
+        case ValueKind::Int64:
+            return static_cast<double>(scalar_.i);
+        case ValueKind::UInt64:
+            return static_cast<double>(scalar_.u);
+        case ValueKind::Real:
+            return scalar_.r;
+        default:
+            return std::nullopt;
     }
 }
 
@@ -464,14 +488,18 @@ bool Value::operator==(const Value& other) const {
     if (kind_ != other.kind_) return false;
     if (holdsNode() && scalar_.node == other.scalar_.node) return true;
     switch (kind_) {
-        case ValueKind::Null: return true;
-        case ValueKind::Date: return scalar_.r == other.scalar_.r;
-        case ValueKind::String: return *getString() == *other.getString();
+        case ValueKind::Null:
+            return true;
+        case ValueKind::Date:
+            return scalar_.r == other.scalar_.r;
+        case ValueKind::String:
+            return *getString() == *other.getString();
         case ValueKind::Data: {
             auto a = dataBytes(), b = other.dataBytes();
             return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin());
         }
-        case ValueKind::Uuid: return *getUuid() == *other.getUuid();
+        case ValueKind::Uuid:
+            return *getUuid() == *other.getUuid();
         case ValueKind::Array: {
             auto a = items(), b = other.items();
             return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin());
@@ -483,7 +511,8 @@ bool Value::operator==(const Value& other) const {
                 if (a[i].key != b[i].key || !(a[i].value == b[i].value)) return false;
             return true;
         }
-        default: return false;
+        default:
+            return false;
     }
 }
 
@@ -499,15 +528,19 @@ size_t Value::hash() const {
     }
     size_t seed = static_cast<size_t>(kind_) * 0x100000001b3ULL;
     switch (kind_) {
-        case ValueKind::Null: return seed;
-        case ValueKind::Date: return mix(seed, std::hash<double>{}(scalar_.r));
-        case ValueKind::String: return mix(seed, std::hash<std::string>{}(*getString()));
+        case ValueKind::Null:
+            return seed;
+        case ValueKind::Date:
+            return mix(seed, std::hash<double>{}(scalar_.r));
+        case ValueKind::String:
+            return mix(seed, std::hash<std::string>{}(*getString()));
         case ValueKind::Data: {
             auto b = dataBytes();
             return mix(seed, std::hash<std::string_view>{}(
                                  std::string_view(reinterpret_cast<const char*>(b.data()), b.size())));
         }
-        case ValueKind::Uuid: return mix(seed, std::hash<Uuid>{}(*getUuid()));
+        case ValueKind::Uuid:
+            return mix(seed, std::hash<Uuid>{}(*getUuid()));
         case ValueKind::Array:
             for (const Value& v : items()) seed = mix(seed, v.hash());
             return seed;
@@ -515,7 +548,8 @@ size_t Value::hash() const {
             for (const DictionaryEntry& e : entries())
                 seed = mix(mix(seed, std::hash<std::string>{}(e.key)), e.value.hash());
             return seed;
-        default: return seed;
+        default:
+            return seed;
     }
 }
 
@@ -530,7 +564,7 @@ bool Value::identical(const Value& other) const {
 namespace {
 // Appends to `out` until the budget is spent; once spent, every further append is dropped.
 class Describer {
-public:
+  public:
     explicit Describer(size_t limit) : limit_(limit) {}
     bool full() const { return out_.size() >= limit_; }
     void put(std::string_view s) {
@@ -541,15 +575,36 @@ public:
         if (full()) return;
         char buf[64];
         switch (v.kind()) {
-            case ValueKind::Null: put("null"); break;
-            case ValueKind::Bool: put(*v.getBool() ? "true" : "false"); break;
-            case ValueKind::Int64: snprintf(buf, sizeof buf, "%lld", static_cast<long long>(*v.getInt64())); put(buf); break;
-            case ValueKind::UInt64: snprintf(buf, sizeof buf, "%llu", static_cast<unsigned long long>(*v.getUInt64())); put(buf); break;
-            case ValueKind::Real: snprintf(buf, sizeof buf, "%.17g", *v.getReal()); put(buf); break;
-            case ValueKind::Date: put(v.getDate()->iso8601()); break;
-            case ValueKind::Uuid: put(v.getUuid()->string()); break;
-            case ValueKind::String: quoted(v.stringView()); break;
-            case ValueKind::Data: data(v.dataBytes()); break;
+            case ValueKind::Null:
+                put("null");
+                break;
+            case ValueKind::Bool:
+                put(*v.getBool() ? "true" : "false");
+                break;
+            case ValueKind::Int64:
+                snprintf(buf, sizeof buf, "%lld", static_cast<long long>(*v.getInt64()));
+                put(buf);
+                break;
+            case ValueKind::UInt64:
+                snprintf(buf, sizeof buf, "%llu", static_cast<unsigned long long>(*v.getUInt64()));
+                put(buf);
+                break;
+            case ValueKind::Real:
+                snprintf(buf, sizeof buf, "%.17g", *v.getReal());
+                put(buf);
+                break;
+            case ValueKind::Date:
+                put(v.getDate()->iso8601());
+                break;
+            case ValueKind::Uuid:
+                put(v.getUuid()->string());
+                break;
+            case ValueKind::String:
+                quoted(v.stringView());
+                break;
+            case ValueKind::Data:
+                data(v.dataBytes());
+                break;
             case ValueKind::Array: {
                 put("[");
                 bool first = true;
@@ -583,17 +638,27 @@ public:
         return std::move(out_);
     }
 
-private:
+  private:
     void quoted(std::string_view s) {
         put("\"");
         for (char c : s) {
             if (full()) return;
             switch (c) {
-                case '"': put("\\\""); break;
-                case '\\': put("\\\\"); break;
-                case '\n': put("\\n"); break;
-                case '\t': put("\\t"); break;
-                case '\r': put("\\r"); break;
+                case '"':
+                    put("\\\"");
+                    break;
+                case '\\':
+                    put("\\\\");
+                    break;
+                case '\n':
+                    put("\\n");
+                    break;
+                case '\t':
+                    put("\\t");
+                    break;
+                case '\r':
+                    put("\\r");
+                    break;
                 default:
                     if (static_cast<unsigned char>(c) < 0x20) {
                         char buf[8];

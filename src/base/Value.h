@@ -25,7 +25,7 @@ const char* valueKindName(ValueKind kind);
 
 // A 128-bit universally unique identifier. The nil UUID (all zero) is the default.
 class Uuid {
-public:
+  public:
     static constexpr size_t kTextLength = 36;
 
     Uuid() = default;
@@ -44,7 +44,7 @@ public:
     auto operator<=>(const Uuid&) const = default;
     bool operator==(const Uuid&) const = default;
 
-private:
+  private:
     std::array<uint8_t, 16> bytes_{};
 };
 
@@ -71,7 +71,7 @@ class Value;
 struct DictionaryEntry;
 
 class Value {
-public:
+  public:
     // Longest text description() returns by default; longer values end in a truncation marker.
     static constexpr size_t kDescriptionLimit = 4096;
 
@@ -153,7 +153,7 @@ public:
     // A readable rendering for logs and probes, at most `limit` bytes plus a short truncation marker.
     std::string description(size_t limit = kDescriptionLimit) const;
 
-private:
+  private:
     friend class MutableDictionary;
     friend class MutableArray;
 
@@ -184,7 +184,7 @@ struct ValueHash {
 
 // Builds a new dictionary Value. Starting from an existing dictionary shares its values (reference counts only).
 class MutableDictionary {
-public:
+  public:
     MutableDictionary() = default;
     // Copies the entries of `dictionary` (a non-dictionary starts empty).
     explicit MutableDictionary(const Value& dictionary);
@@ -200,13 +200,13 @@ public:
     // The dictionary built so far, leaving the builder empty (no copies).
     Value take();
 
-private:
+  private:
     std::vector<DictionaryEntry> entries_;
 };
 
 // Builds a new array Value.
 class MutableArray {
-public:
+  public:
     MutableArray() = default;
     explicit MutableArray(const Value& array);
 
@@ -216,7 +216,7 @@ public:
     Value value() const;
     Value take();
 
-private:
+  private:
     std::vector<Value> items_;
 };
 

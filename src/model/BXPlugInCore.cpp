@@ -5,36 +5,13 @@
 
 #include "model/BXPlugInCore.h"
 
-#include <cstdio>
-#include <initializer_list>
 
 #include "model/BXUtilities.h"
+#include "platform/log/Log.h"
 
 namespace bexil {
 
 namespace {
-
-enum class ModelLogLevel { Debug, Info, Default, Error, Fault };
-
-// FIXME: the ops log channel is not in the tree yet; until it is, the record's log lines go to standard error
-// through this one function. `format` is the channel's printf-style text; each "%@" / "%{public}@" takes the next
-// argument's text.
-void logOps(ModelLogLevel level, std::string_view format, std::initializer_list<std::string_view> args) {
-    static constexpr const char* kLevelNames[] = {"debug", "info", "default", "error", "fault"};
-    std::string text;
-    auto arg = args.begin();
-    for (size_t i = 0; i < format.size();) {
-        std::string_view rest = format.substr(i);
-        size_t skip = rest.starts_with("%{public}@") ? 10 : rest.starts_with("%@") ? 2 : 0;
-        if (skip != 0 && arg != args.end()) {
-            text.append(*arg++);
-            i += skip;
-        } else {
-            text.push_back(format[i++]);
-        }
-    }
-    std::fprintf(stderr, "bexil[ops] %s: %s\n", kLevelNames[static_cast<int>(level)], text.c_str());
-}
 
 // The plug-in configuration vocabulary: keys of the information, plug-in and attributes dictionaries.
 namespace keys {
@@ -173,13 +150,12 @@ bool BXPlugInCore::setupWithNameUrlBundleInfoInfoUuid(std::optional<std::string>
                                                       std::optional<Value> /*info*/, std::optional<Uuid> uuid) {
     if (!url) return false;
     if (!identifier) {
-        logOps(ModelLogLevel::Error, "missing identifier in plug-in at %@", {*url});
+        log::ops().error("missing identifier in plug-in at %@", *url);
         return false;
     }
     if (bundleInfo) {
         if (!setDictionaries(normalizeInfoDictionary(*bundleInfo))) {
-            logOps(ModelLogLevel::Default, "malformed plug-in dictionary in plug-in %@ at %@: %@",
-                   {*identifier, *url, bundleInfo->description()});
+            log::ops().notice("malformed plug-in dictionary in plug-in %@ at %@: %@", *identifier, *url, *bundleInfo);
             return false;
         }
     }
@@ -198,7 +174,7 @@ bool BXPlugInCore::setDictionaries(const Value& info) {
     if (plugIn == nullptr || !plugIn->isDictionary()) return false;
     setPlugInDictionary(*plugIn);
     if (plugIn->contains(keys::kMultiple))
-        logOps(ModelLogLevel::Default, "multiplexed plug-ins (%{public}@ key) obsolete and ignored", {keys::kMultiple});
+        log::ops().notice("multiplexed plug-ins (%{public}@ key) obsolete and ignored", keys::kMultiple);
     return true;
 }
 
@@ -330,8 +306,7 @@ bool BXPlugInCore::isData() const { return isString(protocolSpec(), "#Data"); }
 bool BXPlugInCore::oldStyle() const {
     if (infoKey(keys::kRZExtension)) return false;
     if (infoKey(keys::kBexil)) return true;
-    std::string who = description();
-    logOps(ModelLogLevel::Fault, "unknown plug-in configuration style (%{public}@ of %@)", {"oldStyle", who});
+    log::ops().fault("unknown plug-in configuration style (%{public}@ of %@)", "oldStyle", description());
     return true;
 }
 
