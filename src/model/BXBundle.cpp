@@ -116,8 +116,7 @@ std::optional<std::string> BXBundle::bundleDirectory(std::string_view name) cons
 }
 
 std::optional<std::string> BXBundle::executablePath() const {
-    if (std::optional<std::string> executable = stringProperty(BundleStringProperty::ExecutablePath))
-        return executable;
+    if (std::optional<std::string> executable = stringProperty(BundleStringProperty::ExecutablePath)) return executable;
     return path();
 }
 

@@ -1,5 +1,3 @@
-#include "model/BXBundle.h"
-
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
@@ -12,6 +10,7 @@
 #include <vector>
 
 #include "base/Document.h"
+#include "model/BXBundle.h"
 #include "platform/log/CaptureSink.h"
 
 namespace bexil {
@@ -223,7 +222,8 @@ TEST(BXBundleQueries, ExamplesWithoutExecutableOrIdentifierFallBack) {
     EXPECT_FALSE(data->stringProperty(BundleStringProperty::ExecutablePath));
     EXPECT_EQ(data->executablePath(), real(stationery));
 
-    auto anonymous = BXBundle::initWithPath((kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin").string());
+    auto anonymous =
+        BXBundle::initWithPath((kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin").string());
     EXPECT_FALSE(anonymous->bundleIdentifier());
     ASSERT_TRUE(anonymous->infoDictionary());
     EXPECT_TRUE(anonymous->infoDictionary()->contains("RZExtension"));
@@ -268,8 +268,7 @@ TEST(BXBundleQueries, ConcurrentFirstUsesOfSupportPathAgree) {
         auto bundle = BXBundle::initWithZEMBundle(fake);
         std::vector<std::optional<std::string>> seen(8);
         std::vector<std::thread> threads;
-        for (size_t i = 0; i < seen.size(); ++i)
-            threads.emplace_back([&, i] { seen[i] = bundle->plugInsPath(); });
+        for (size_t i = 0; i < seen.size(); ++i) threads.emplace_back([&, i] { seen[i] = bundle->plugInsPath(); });
         for (auto& t : threads) t.join();
         for (const auto& s : seen) EXPECT_EQ(s, fake->support.value() + "/PlugIns");
         EXPECT_GE(fake->supportQueries.load(), 1);

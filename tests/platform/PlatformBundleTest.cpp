@@ -126,6 +126,13 @@ TEST_F(BundleDirectoryTest, PathsThatNameNoBundleAnswerNothing) {
         EXPECT_NE(bundle->description().find("no bundle at"), std::string::npos);
         expectNothing(*DirectoryBundle::create(path, BundleLookup::ContainingExecutable));
     }
+    // A NUL byte would cut the path short at the system call; the bundle at the shorter path must not answer.
+    makeBundle("Cut.app", "tool");
+    fs::path cut = (root_ / "Cut.app").string() + std::string(1, '\0') + "/elsewhere";
+    expectNothing(*DirectoryBundle::create(cut, BundleLookup::Directory));
+    expectNothing(*DirectoryBundle::create((root_ / "Cut.app/tool").string() + std::string(1, '\0'),
+                                           BundleLookup::ContainingExecutable));
+
     writeText(root_ / "file", "not a directory");
     auto file = DirectoryBundle::create(root_ / "file", BundleLookup::Directory);
     expectNothing(*file);

@@ -139,6 +139,9 @@ DirectoryBundle::DirectoryBundle(Parts parts)
 
 std::shared_ptr<const DirectoryBundle> DirectoryBundle::create(const fs::path& path, BundleLookup lookup) {
     if (path.empty()) return std::make_shared<const DirectoryBundle>(nothingAt("", "empty path"));
+    // The system calls would see the path cut short at the NUL and resolve some other file.
+    if (path.native().find('\0') != std::string::npos)
+        return std::make_shared<const DirectoryBundle>(nothingAt(path.string(), "path contains a NUL byte"));
     switch (lookup) {
         case BundleLookup::Directory:
             return std::make_shared<const DirectoryBundle>(openDirectory(path));
