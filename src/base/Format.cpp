@@ -14,7 +14,7 @@
 
 namespace bexil {
 
-using format_detail::Spec;
+using format_detail::Conversion;
 
 const char* FormatArg::kindName() const {
     switch (kind_) {
@@ -86,11 +86,11 @@ bool accepts(char conversion, FormatArg::Kind kind) {
     return (format_detail::acceptedBy(conversion) & category) != 0;
 }
 
-__attribute__((format(printf, 2, 3))) void appendPrintf(std::string& out, const char* spec, ...) {
+__attribute__((format(printf, 2, 3))) void appendPrintf(std::string& out, const char* directive, ...) {
     char small[128];
     va_list args;
-    va_start(args, spec);
-    int n = vsnprintf(small, sizeof small, spec, args);
+    va_start(args, directive);
+    int n = vsnprintf(small, sizeof small, directive, args);
     va_end(args);
     if (n < 0) return;
     if (static_cast<size_t>(n) < sizeof small) {
@@ -99,23 +99,23 @@ __attribute__((format(printf, 2, 3))) void appendPrintf(std::string& out, const 
     }
     size_t at = out.size();
     out.resize(at + static_cast<size_t>(n) + 1);
-    va_start(args, spec);
-    vsnprintf(out.data() + at, static_cast<size_t>(n) + 1, spec, args);
+    va_start(args, directive);
+    vsnprintf(out.data() + at, static_cast<size_t>(n) + 1, directive, args);
     va_end(args);
     out.resize(at + static_cast<size_t>(n));
 }
 
 // "%-08.3" and so on, without the length modifier and conversion; width and precision already resolved.
-std::string numericSpec(const Spec& s, int width, int precision) {
-    std::string spec = "%";
-    if (s.leftAlign) spec += '-';
-    if (s.plus) spec += '+';
-    if (s.space) spec += ' ';
-    if (s.alternate) spec += '#';
-    if (s.zeroPad) spec += '0';
-    if (width >= 0) spec += std::to_string(width);
-    if (precision >= 0) spec += "." + std::to_string(precision);
-    return spec;
+std::string numericDirective(const Conversion& s, int width, int precision) {
+    std::string directive = "%";
+    if (s.leftAlign) directive += '-';
+    if (s.plus) directive += '+';
+    if (s.space) directive += ' ';
+    if (s.alternate) directive += '#';
+    if (s.zeroPad) directive += '0';
+    if (width >= 0) directive += std::to_string(width);
+    if (precision >= 0) directive += "." + std::to_string(precision);
+    return directive;
 }
 
 void pad(std::string& out, std::string_view text, int width, bool leftAlign) {
@@ -133,7 +133,7 @@ std::string_view clip(std::string_view text, size_t bytes) {
     return text.substr(0, end);
 }
 
-int effectiveBytes(const FormatArg& arg, const Spec& s) {
+int effectiveBytes(const FormatArg& arg, const Conversion& s) {
     int length = s.lengthBytes == 0 ? 4 : std::min(s.lengthBytes, 8);
     return std::max(arg.integerBytes(), length);
 }
@@ -168,20 +168,20 @@ uint64_t asUnsigned(const FormatArg& arg, int bytes) {
     }
 }
 
-void renderOne(std::string& out, const Spec& s, const FormatArg& arg, int width, int precision, bool leftAlign) {
-    Spec spec = s;
-    spec.leftAlign = leftAlign;
+void renderOne(std::string& out, const Conversion& s, const FormatArg& arg, int width, int precision, bool leftAlign) {
+    Conversion directive = s;
+    directive.leftAlign = leftAlign;
     switch (s.conversion) {
         case 'd':
         case 'i':
-            appendPrintf(out, (numericSpec(spec, width, precision) + "lld").c_str(),
+            appendPrintf(out, (numericDirective(directive, width, precision) + "lld").c_str(),
                          static_cast<long long>(asSigned(arg, effectiveBytes(arg, s))));
             return;
         case 'u':
         case 'x':
         case 'X':
         case 'o':
-            appendPrintf(out, (numericSpec(spec, width, precision) + "ll" + s.conversion).c_str(),
+            appendPrintf(out, (numericDirective(directive, width, precision) + "ll" + s.conversion).c_str(),
                          static_cast<unsigned long long>(asUnsigned(arg, effectiveBytes(arg, s))));
             return;
         case 'c': {
@@ -200,7 +200,7 @@ void renderOne(std::string& out, const Spec& s, const FormatArg& arg, int width,
             long double v = arg.kind() == FormatArg::Kind::Real     ? arg.realValue()
                             : arg.kind() == FormatArg::Kind::Signed ? static_cast<long double>(arg.signedValue())
                                                                     : static_cast<long double>(arg.unsignedValue());
-            appendPrintf(out, (numericSpec(spec, width, precision) + "L" + s.conversion).c_str(), v);
+            appendPrintf(out, (numericDirective(directive, width, precision) + "L" + s.conversion).c_str(), v);
             return;
         }
         case 'p': {
@@ -250,7 +250,7 @@ std::string formatPrintfRuntime(std::string_view format, std::span<const FormatA
             break;
         }
         out.append(format.substr(i, percent - i));
-        Spec s = format_detail::parseSpec(format, percent);
+        Conversion s = format_detail::parseConversion(format, percent);
         std::string_view written = format.substr(percent, s.end - percent);
         i = s.end;
         if (!s.ok) {
@@ -277,14 +277,15 @@ std::string formatPrintfRuntime(std::string_view format, std::span<const FormatA
                 broken = true;
                 return;
             }
+            // Clamped first, so that negating the most negative value cannot overflow.
             int64_t v = a.kind() == FormatArg::Kind::Signed
-                            ? a.signedValue()
-                            : static_cast<int64_t>(std::min<uint64_t>(a.unsignedValue(), 4096));
+                            ? std::clamp<int64_t>(a.signedValue(), -format_detail::kMaxWidth, format_detail::kMaxWidth)
+                            : static_cast<int64_t>(std::min<uint64_t>(a.unsignedValue(), format_detail::kMaxWidth));
             if (isWidth && v < 0) {
                 leftAlign = true;
                 v = -v;
             }
-            into = v < 0 ? -1 : static_cast<int>(std::min<int64_t>(v, 4096));
+            into = v < 0 ? -1 : static_cast<int>(v);
         };
         if (s.widthStar) star(width, true);
         if (s.precisionStar) star(precision, false);

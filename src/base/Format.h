@@ -152,8 +152,11 @@ constexpr unsigned acceptedBy(char conversion) {
     }
 }
 
+// Widths and precisions beyond this are cut to it, so that no format can ask for gigabytes of padding.
+inline constexpr int kMaxWidth = 4096;
+
 // One parsed conversion. `end` is the offset just past it.
-struct Spec {
+struct Conversion {
     bool ok = false;
     bool percent = false;  // "%%"
     bool leftAlign = false, plus = false, space = false, alternate = false, zeroPad = false;
@@ -165,8 +168,8 @@ struct Spec {
 };
 
 // Parses the conversion that starts at text[start] == '%'. Shared by the compile-time check and the renderer.
-constexpr Spec parseSpec(std::string_view text, size_t start) {
-    Spec s;
+constexpr Conversion parseConversion(std::string_view text, size_t start) {
+    Conversion s;
     size_t i = start + 1;
     auto at = [&](size_t k) { return k < text.size() ? text[k] : '\0'; };
     if (at(i) == '{') {
@@ -198,7 +201,7 @@ constexpr Spec parseSpec(std::string_view text, size_t start) {
     } else {
         while (at(i) >= '0' && at(i) <= '9') {
             s.width = (s.width < 0 ? 0 : s.width) * 10 + (at(i) - '0');
-            if (s.width > 4096) s.width = 4096;
+            if (s.width > kMaxWidth) s.width = kMaxWidth;
             ++i;
         }
     }
@@ -211,7 +214,7 @@ constexpr Spec parseSpec(std::string_view text, size_t start) {
         } else {
             while (at(i) >= '0' && at(i) <= '9') {
                 s.precision = s.precision * 10 + (at(i) - '0');
-                if (s.precision > 4096) s.precision = 4096;
+                if (s.precision > kMaxWidth) s.precision = kMaxWidth;
                 ++i;
             }
         }
@@ -274,7 +277,7 @@ consteval void checkFormat(const char* format) {
     };
     for (size_t i = 0; i < text.size(); ++i) {
         if (text[i] != '%') continue;
-        Spec s = parseSpec(text, i);
+        Conversion s = parseConversion(text, i);
         if (!s.ok) format_has_a_malformed_conversion();
         i = s.end - 1;
         if (s.percent) continue;

@@ -27,7 +27,8 @@ void SystemLogSink::write(const LogRecord& record) {
             rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%i", priority, "BEXIL_SUBSYSTEM=%s",
                                  subsystem.c_str(), "BEXIL_CATEGORY=%s", category.c_str(), nullptr);
         }
-        // A journal that went away must not swallow messages: they go to standard error instead.
+        // The journal library reports a missing socket as success, which is why the choice of destination is made
+        // from the socket's presence; a message the journal refuses (too large, no memory) goes to standard error.
         if (rc >= 0) return;
     }
     writeLine(record);
