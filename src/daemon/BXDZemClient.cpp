@@ -5,6 +5,7 @@
 
 #include "daemon/BXDServer.h"
 #include "daemon/Transaction.h"
+#include "model/BXBundle.h"
 #include "platform/codesign/CodeSigningIdentity.h"
 #include "platform/log/Log.h"
 #include "platform/trace/Probes.h"
@@ -29,12 +30,18 @@ void BXDZemClient::start() {
     std::shared_ptr<const CodeSigningIdentity> identity = connection->peerIdentity();
 
     // The executable was read and pinned to the live process when the connection was accepted.
-    if (identity && identity->established() && identity->executablePath().size() < kExecutablePathBufferSize)
+    if (identity && identity->established() && identity->executablePath().size() < kExecutablePathBufferSize) {
         path_ = identity->executablePath();
+        std::shared_ptr<BXBundle> bundle = BXBundle::initWithExecutablePath(path_);
+        if (bundle && bundle->path()) bundle_ = std::move(bundle);
+    }
 
     const pid_t peer = connection->peerPid();
     log::ops().debug("new client %d %s", static_cast<int>(peer), path_.c_str());
     trace::clientNew(static_cast<int>(peer));
+    if (bundle_)
+        log::ops().debug("client %d is inside bundle %s (%s)", static_cast<int>(peer), bundle_->path()->c_str(),
+                         bundle_->bundleIdentifier().value_or("no identifier").c_str());
 
     _task = identity;
 

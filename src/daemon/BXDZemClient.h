@@ -17,6 +17,7 @@
 
 namespace bexil {
 
+class BXBundle;
 class BXDServer;
 class CodeSigningIdentity;
 
@@ -47,6 +48,8 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient> {
     pid_t pid() const;
     // The peer's executable path; empty when it could not be found.
     const std::string& path() const { return path_; }
+    // The bundle that contains the peer's executable; null when there is none.
+    const std::shared_ptr<BXBundle>& bundle() const { return bundle_; }
     bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }
     unsigned requestCount() const { return requestCount_; }
 
@@ -58,6 +61,7 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient> {
     std::weak_ptr<ZemConnection> connection_;
     BXDServer* server_;
     std::string path_;
+    std::shared_ptr<BXBundle> bundle_;
     std::atomic<bool> acceptWork_{true};
     std::shared_ptr<const CodeSigningIdentity> _task;
     unsigned requestCount_ = 0;  // request queue only

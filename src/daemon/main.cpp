@@ -12,6 +12,18 @@
 
 namespace {
 
+// A block that lets an exception escape fails alone; the loop, and with it every other client, carries on.
+void logUncaughtException(std::string_view queueLabel, std::exception_ptr exception) {
+    std::string what = "unknown exception";
+    try {
+        std::rethrow_exception(exception);
+    } catch (const std::exception& e) {
+        what = e.what();
+    } catch (...) {
+    }
+    bexil::log::ops().fault("block on queue %s threw: %s", std::string(queueLabel), what);
+}
+
 [[noreturn]] void usage() {
     fputs("Usage: bxd [-S servicename] [-v]\n", stderr);
     exit(2);
@@ -54,6 +66,7 @@ int main(int argc, char** argv) {
 
     // The main thread is the loop's only thread: socket I/O, decoding, every request and encoding share it, so a
     // request never changes threads between its bytes arriving and its reply leaving.
+    EventLoop::setUncaughtExceptionHandler(logUncaughtException);
     EventLoop loop(0);
     std::unique_ptr<BXDServer> server = BXDServer::initForServiceDatabase(serviceName, databasePath, loop);
     if (!server) {
