@@ -50,6 +50,13 @@ void SerialQueue::async(std::function<void()> block) const {
     asio::post(state_->strand, [state = state_, block = std::move(block)] { detail::runOnQueue(*state, block); });
 }
 
+void SerialQueue::dispatch(std::function<void()> block) const {
+    if (state_->core->closed()) return;
+    // A strand runs a dispatched handler inline when this thread runs its io_context and the strand is free (or is
+    // already running further out on this thread); otherwise it queues the handler exactly as post would.
+    asio::dispatch(state_->strand, [state = state_, block = std::move(block)] { detail::runOnQueue(*state, block); });
+}
+
 void SerialQueue::asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
     if (state_->core->closed()) return;
     auto timer = std::make_shared<asio::steady_timer>(*state_->core, delay);

@@ -37,6 +37,14 @@ public:
     // uncaught-exception handler.
     void async(std::function<void()> block) const;
 
+    // Like async, except that `block` runs at once, on the caller's stack, when the calling thread runs this queue's
+    // loop and the queue is free: nothing of it queued or running on another thread. It still runs as a block of
+    // this queue (isCurrent() is true inside it, no other thread runs the queue meanwhile, and it keeps its place
+    // after blocks already queued). When the caller is itself nested inside a block of this queue further out, it
+    // runs at once too, inside that block: a queue whose state can be entered that way must say so. For hand-overs
+    // on the request path, where a trip through the loop costs more than the work handed over.
+    void dispatch(std::function<void()> block) const;
+
     // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
     void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
 

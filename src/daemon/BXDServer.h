@@ -39,7 +39,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // Resumes the listener, tells systemd that bxd is ready, and runs the event loop on the calling thread.
     // Returns only when the loop is stopped (tests); the daemon's process ends from outside.
     void run();
-    // Queues `work` on mainQueue.
+    // Runs `work` on mainQueue: at once when called on the loop's thread while the queue is free, else queued.
     void submitWork(std::function<void()> work);
 
     // Database delegate: plug-ins about to be uninstalled.

@@ -246,6 +246,53 @@ TEST(SerialQueueTest, AsyncNeverRunsTheBlockOnTheCallersStack) {
     EXPECT_EQ(order, (std::vector<int>{1, 2}));
 }
 
+// ---- dispatch -------------------------------------------------------------------------------------------------------
+
+TEST(SerialQueueTest, DispatchOnTheLoopThreadRunsAtOnceAsABlockOfTheQueue) {
+    EventLoop loop(1);
+    SerialQueue a("a", loop);
+    SerialQueue b("b", loop);
+    std::vector<int> order;
+    bool bCurrentInside = false, aCurrentInside = true, aCurrentAfter = false;
+    a.sync([&] {
+        b.dispatch([&] {
+            order.push_back(1);
+            bCurrentInside = b.isCurrent();
+            aCurrentInside = a.isCurrent();
+        });
+        order.push_back(2);
+        aCurrentAfter = a.isCurrent();
+    });
+    EXPECT_EQ(order, (std::vector<int>{1, 2}));
+    EXPECT_TRUE(bCurrentInside);
+    EXPECT_FALSE(aCurrentInside);
+    EXPECT_TRUE(aCurrentAfter);
+}
+
+TEST(SerialQueueTest, DispatchKeepsItsPlaceBehindBlocksAlreadyQueued) {
+    EventLoop loop(1);
+    SerialQueue a("a", loop);
+    SerialQueue b("b", loop);
+    std::vector<int> order;
+    a.sync([&] {
+        b.async([&] { order.push_back(1); });
+        b.dispatch([&] { order.push_back(2); });
+        order.push_back(0);
+    });
+    b.sync([] {});
+    EXPECT_EQ(order, (std::vector<int>{0, 1, 2}));
+}
+
+TEST(SerialQueueTest, DispatchFromOutsideTheLoopIsQueued) {
+    EventLoop loop(1);
+    SerialQueue queue("q", loop);
+    std::promise<std::thread::id> ranOn;
+    queue.dispatch([&] { ranOn.set_value(std::this_thread::get_id()); });
+    std::future<std::thread::id> future = ranOn.get_future();
+    ASSERT_EQ(future.wait_for(kPatience), std::future_status::ready);
+    EXPECT_NE(future.get(), std::this_thread::get_id());
+}
+
 // ---- isCurrent and sync -------------------------------------------------------------------------------------------
 
 TEST(SerialQueueTest, IsCurrentOnlyInsideItsOwnBlocks) {

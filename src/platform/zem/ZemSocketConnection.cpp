@@ -2,6 +2,7 @@
 
 #include <sys/socket.h>
 
+#include <cerrno>
 #include <cinttypes>
 
 #include "base/EventLoopAsio.h"
@@ -12,10 +13,13 @@
 // Design. A connection is a small state machine that lives on its serial queue. Reads are always outstanding while
 // the connection is open and resumed; every chunk read is cut into frames, decoded and delivered before the next
 // read is issued, so a peer that floods us is throttled by our own pace. Writes are double-buffered: frames are
-// encoded straight into `outgoing_`, which is swapped into `writing_` whenever no write is in flight, so any
-// number of replies produced in one turn of the loop leave in one system call. The queued-bytes limit bounds what
-// a peer that stops reading can cost us. Every pending operation holds a strong reference, so the object lives
-// exactly as long as it has I/O in flight or an owner outside.
+// encoded straight into `outgoing_` and sent at once with a non-blocking send; what the socket does not take is
+// swapped into `writing_` for an asynchronous write, and replies produced meanwhile gather in `outgoing_` to leave
+// together when it completes. Replies are handed over with SerialQueue::dispatch, so a request answered on the
+// loop's thread is written from inside the request's own handling, possibly while this connection is still
+// delivering the request further out on the stack: every member function is safe to enter that way. The queued-bytes
+// limit bounds what a peer that stops reading can cost us. Every pending operation holds a strong reference, so the
+// object lives exactly as long as it has I/O in flight or an owner outside.
 
 namespace bexil {
 
@@ -96,7 +100,9 @@ void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& repl
                          static_cast<unsigned long long>(request.serial()));
         return;
     }
-    queue_.async([self = shared_from_this(), serial = request.serial(), reply] {
+    // Usually called from the request queue on the loop's own thread: the reply is then encoded and written at once
+    // instead of taking another turn of the loop (which costs a reactor poll, more than the whole reply).
+    queue_.dispatch([self = shared_from_this(), serial = request.serial(), reply] {
         self->enqueueFrame(ZemFrameKind::Reply, 0, serial, reply, std::nullopt);
     });
 }
@@ -231,6 +237,20 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t serial, uint6
 
 void ZemSocketConnection::writeMore() {
     if (writeInFlight_ || outgoing_.empty() || state_ != State::Open) return;
+    // The socket buffer almost always has room: try a non-blocking send first, so that a reply costs one system
+    // call and no completion handler; only what does not fit waits for the socket to drain.
+    ssize_t sent = ::send(socket_.native_handle(), outgoing_.data(), outgoing_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (sent < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
+        close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    if (sent > 0) {
+        if (static_cast<size_t>(sent) == outgoing_.size()) {
+            outgoing_.clear();
+            return;
+        }
+        outgoing_.erase(outgoing_.begin(), outgoing_.begin() + sent);
+    }
     writing_.swap(outgoing_);
     outgoing_.clear();
     writeInFlight_ = true;
@@ -275,14 +295,20 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     failPendingReplies(kind);
     deliver(ZemError(kind));
     if (!interrupted) {
-        // Nothing follows an invalid connection: let go of the handler (and what it captured) now.
+        // Nothing follows an invalid connection: let go of the handler (and what it captured) now, or, when the
+        // handler is running further out on this stack (a reply sent from inside it can end the connection), as
+        // soon as this block is over.
+        if (delivering_ > 0) queue_.async([handler = std::move(handler_)] {});
         handler_ = nullptr;
         if (closedCallback_) std::exchange(closedCallback_, nullptr)();
     }
 }
 
 void ZemSocketConnection::deliver(const Event& event) {
-    if (handler_) handler_(event);
+    if (!handler_) return;
+    ++delivering_;
+    handler_(event);
+    --delivering_;
 }
 
 std::string ZemSocketConnection::description() const {

@@ -105,6 +105,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     std::vector<uint8_t> outgoing_;  // frames waiting for the write in flight to finish
     std::vector<uint8_t> writing_;   // the frames of the write in flight
     bool writeInFlight_ = false;
+    unsigned delivering_ = 0;  // depth of event handler calls in progress on the stack
     uint64_t nextSerial_ = 1;
     std::map<uint64_t, PendingReply> pendingReplies_;
     std::vector<ZemFrame> heldFrames_;  // frames read while suspended
