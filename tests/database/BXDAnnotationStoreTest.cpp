@@ -1,16 +1,19 @@
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <optional>
 #include <random>
 #include <string>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -537,7 +540,7 @@ std::vector<uint8_t> blobFor(int64_t step) {
 }
 
 TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
-    constexpr int kKills = 60;
+    constexpr int kKills = 50;
     constexpr int kFixedEntries = 100;
     MutableDictionary initial;
     for (int i = 0; i < kFixedEntries; ++i)
@@ -552,9 +555,12 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
     int killedWithProgress = 0;
     int interruptedWrites = 0;
     for (int round = 0; round < kKills; ++round) {
+        int progress[2];
+        ASSERT_EQ(pipe(progress), 0);
         pid_t child = fork();
         ASSERT_GE(child, 0);
         if (child == 0) {
+            close(progress[0]);
             // Continues from whatever the last run left, as a restarted daemon would.
             BXDAnnotationStore annotations(store());
             int64_t step = annotations.annotationForIdentifier("state").get("step").numberAsInt64().value_or(-1000);
@@ -564,13 +570,31 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
                 annotations.setAnnotationForIdentifier(
                     dict({{"step", integer(step)}, {"blob", Value::data(blobFor(step))}}), "state");
                 if (annotations.diskBehind()) _exit(4);
+                // One byte per finished save, so that the kill can be timed against the writer's real pace.
+                if (::write(progress[1], "s", 1) != 1) _exit(5);
             }
         }
-        usleep(std::uniform_int_distribution<useconds_t>(5000, 150000)(random));
+        close(progress[1]);
+        // Two finished saves give the length of one; the kill then lands anywhere inside the next one, however
+        // fast or loaded the machine is.
+        auto awaitSave = [&] {
+            pollfd ready{progress[0], POLLIN, 0};
+            char byte;
+            return poll(&ready, 1, 30000) == 1 && ::read(progress[0], &byte, 1) == 1;
+        };
+        bool saving = awaitSave();
+        auto first = std::chrono::steady_clock::now();
+        saving = saving && awaitSave();
+        auto period = std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::steady_clock::now() - first);
+        if (saving)
+            std::this_thread::sleep_for(
+                std::chrono::microseconds(std::uniform_int_distribution<int64_t>(0, period.count())(random)));
         ASSERT_EQ(kill(child, SIGKILL), 0);
+        close(progress[0]);
         int status = 0;
         ASSERT_EQ(waitpid(child, &status, 0), child);
         ASSERT_TRUE(WIFSIGNALED(status)) << "the writer stopped by itself with status " << WEXITSTATUS(status);
+        ASSERT_TRUE(saving) << "the writer did not save within 30 s";
         for (const auto& entry : fs::directory_iterator(directory_))
             if (entry.path().filename().string().find(".tmp-") != std::string::npos) ++interruptedWrites;
 
@@ -593,8 +617,8 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
         if (*step > lastStep) ++killedWithProgress;
         lastStep = *step;
     }
-    // The writer must really have been writing, and been killed in the middle of writes, or this proved nothing.
-    EXPECT_GE(killedWithProgress, kKills / 4);
+    // Every round saved at least twice; some kills must have hit a write in the middle, or this proved nothing.
+    EXPECT_EQ(killedWithProgress, kKills);
     EXPECT_GE(interruptedWrites, 1);
     RecordProperty("interrupted_writes", interruptedWrites);
     RecordProperty("steps", static_cast<int>(lastStep));
