@@ -1,0 +1,918 @@
+#include "base/Document.h"
+
+// The document codec. Reading goes through pugixml, which parses without recursion; the conversion of its tree into
+// a Value recurses once per container and stops at kMaxDocumentDepth. Before pugixml sees the text, the whole buffer
+// is checked to be UTF-8 made of characters XML 1.0 allows, character references included, because pugixml would
+// otherwise decode "&#0;" into a silent truncation and out-of-range references into invalid UTF-8.
+//
+// Writing does not use pugixml: it writes a raw carriage return, which XML's end-of-line handling turns into a line
+// feed on reading, and it writes control characters as references that XML 1.0 forbids. The writer here escapes
+// carriage returns, refuses what XML cannot carry, and checks for every real and date that the text it chose parses
+// back to the very same double, so that nothing it writes reads back different.
+
+#include <fcntl.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <bit>
+#include <cerrno>
+#include <charconv>
+#include <cmath>
+#include <cstring>
+#include <limits>
+#include <pugixml.hpp>
+#include <unordered_set>
+#include <variant>
+#include <vector>
+
+namespace bexil {
+
+namespace {
+
+constexpr std::string_view kRootName = "vrec";
+constexpr std::string_view kFormatVersion = "1";
+constexpr size_t kSnippetLength = 40;
+
+Error documentError(int code, std::string message) {
+    return Error(std::string(BXDocumentErrorDomain), code, std::move(message));
+}
+
+Error posixError(int err, std::string_view operation, const std::filesystem::path& path) {
+    std::string message(operation);
+    message += " \"";
+    message += path.string();
+    message += "\": ";
+    message += strerror(err);
+    return Error(std::string(BXPosixErrorDomain), err, std::move(message));
+}
+
+// A short, printable excerpt of text for an error message.
+std::string snippet(std::string_view text) {
+    std::string out;
+    for (size_t i = 0; i < text.size() && i < kSnippetLength; ++i) {
+        unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c < 0x20 || c == 0x7F || c == '"' || c == '\\') {
+            char buf[8];
+            snprintf(buf, sizeof buf, "\\x%02X", c);
+            out += buf;
+        } else {
+            out += static_cast<char>(c);
+        }
+    }
+    if (text.size() > kSnippetLength) out += "...";
+    return "\"" + out + "\"";
+}
+
+// One step from a container to a value in it, kept cheap while all goes well and spelled out only for errors.
+struct PathStep {
+    std::string_view key;  // the dictionary key, when index is npos
+    size_t index = std::string_view::npos;
+};
+
+std::string pathText(const std::vector<PathStep>& steps) {
+    std::string out = "root";
+    for (const PathStep& step : steps) {
+        if (step.index != std::string_view::npos) {
+            out += "[" + std::to_string(step.index) + "]";
+        } else {
+            out += "[" + snippet(step.key) + "]";
+        }
+    }
+    return out;
+}
+
+bool isXmlWhitespace(char c) { return c == ' ' || c == '\t' || c == '\n' || c == '\r'; }
+
+std::string_view trimmed(std::string_view s) {
+    while (!s.empty() && isXmlWhitespace(s.front())) s.remove_prefix(1);
+    while (!s.empty() && isXmlWhitespace(s.back())) s.remove_suffix(1);
+    return s;
+}
+
+bool isXmlChar(uint32_t c) {
+    return c == 0x9 || c == 0xA || c == 0xD || (c >= 0x20 && c <= 0xD7FF) || (c >= 0xE000 && c <= 0xFFFD) ||
+           (c >= 0x10000 && c <= 0x10FFFF);
+}
+
+// Where text stops being UTF-8 made of XML characters.
+struct TextFault {
+    size_t offset;
+    bool invalidUtf8;
+    uint32_t character;  // when the encoding is fine but the character is not allowed
+
+    std::string describe() const {
+        if (invalidUtf8) return "invalid UTF-8";
+        char buf[48];
+        snprintf(buf, sizeof buf, "character U+%04X, which XML 1.0 cannot carry,", character);
+        return buf;
+    }
+};
+
+std::optional<TextFault> findTextFault(std::string_view s) {
+    const auto* p = reinterpret_cast<const unsigned char*>(s.data());
+    size_t n = s.size();
+    size_t i = 0;
+    while (i < n) {
+        unsigned char c = p[i];
+        if (c < 0x80) {
+            if (!isXmlChar(c)) return TextFault{i, false, c};
+            ++i;
+            continue;
+        }
+        size_t length;
+        uint32_t cp;
+        uint32_t minimum;
+        if ((c & 0xE0) == 0xC0) {
+            length = 2, cp = c & 0x1F, minimum = 0x80;
+        } else if ((c & 0xF0) == 0xE0) {
+            length = 3, cp = c & 0x0F, minimum = 0x800;
+        } else if ((c & 0xF8) == 0xF0) {
+            length = 4, cp = c & 0x07, minimum = 0x10000;
+        } else {
+            return TextFault{i, true, 0};
+        }
+        if (i + length > n) return TextFault{i, true, 0};
+        for (size_t k = 1; k < length; ++k) {
+            if ((p[i + k] & 0xC0) != 0x80) return TextFault{i, true, 0};
+            cp = (cp << 6) | (p[i + k] & 0x3F);
+        }
+        if (cp < minimum || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF)) return TextFault{i, true, 0};
+        if (!isXmlChar(cp)) return TextFault{i, false, cp};
+        i += length;
+    }
+    return std::nullopt;
+}
+
+// Character references decode to what they name; each must name an XML character. This mirrors which references
+// pugixml decodes ("&#" decimal ";" and "&#x" hex ";"); anything else it leaves as literal text.
+std::optional<Error> checkCharacterReferences(std::string_view text) {
+    for (size_t at = text.find("&#"); at != std::string_view::npos; at = text.find("&#", at + 2)) {
+        size_t i = at + 2;
+        bool hex = i < text.size() && text[i] == 'x';
+        if (hex) ++i;
+        uint64_t code = 0;
+        size_t digits = 0;
+        for (; i < text.size(); ++i) {
+            char c = text[i];
+            int d;
+            if (c >= '0' && c <= '9') {
+                d = c - '0';
+            } else if (hex && (c | 0x20) >= 'a' && (c | 0x20) <= 'f') {
+                d = (c | 0x20) - 'a' + 10;
+            } else {
+                break;
+            }
+            code = code * (hex ? 16 : 10) + static_cast<uint64_t>(d);
+            if (code > 0x10FFFF) code = 0x110000;  // saturate: only "too large" matters
+            ++digits;
+        }
+        if (digits == 0 || i >= text.size() || text[i] != ';') continue;  // literal text, not a reference
+        if (!isXmlChar(static_cast<uint32_t>(code))) {
+            return documentError(kDocumentMalformed, "character reference " + snippet(text.substr(at, i + 1 - at)) +
+                                                         " names a character XML 1.0 cannot carry (byte " +
+                                                         std::to_string(at) + ")");
+        }
+    }
+    return std::nullopt;
+}
+
+// ---- base64 ----
+
+constexpr char kBase64Alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+
+void appendBase64(std::string& out, std::span<const uint8_t> bytes) {
+    size_t i = 0;
+    for (; i + 3 <= bytes.size(); i += 3) {
+        uint32_t v = uint32_t(bytes[i]) << 16 | uint32_t(bytes[i + 1]) << 8 | bytes[i + 2];
+        out += kBase64Alphabet[v >> 18];
+        out += kBase64Alphabet[(v >> 12) & 63];
+        out += kBase64Alphabet[(v >> 6) & 63];
+        out += kBase64Alphabet[v & 63];
+    }
+    size_t rest = bytes.size() - i;
+    if (rest > 0) {
+        uint32_t v = uint32_t(bytes[i]) << 16 | (rest == 2 ? uint32_t(bytes[i + 1]) << 8 : 0);
+        out += kBase64Alphabet[v >> 18];
+        out += kBase64Alphabet[(v >> 12) & 63];
+        out += rest == 2 ? kBase64Alphabet[(v >> 6) & 63] : '=';
+        out += '=';
+    }
+}
+
+int base64Digit(char c) {
+    if (c >= 'A' && c <= 'Z') return c - 'A';
+    if (c >= 'a' && c <= 'z') return c - 'a' + 26;
+    if (c >= '0' && c <= '9') return c - '0' + 52;
+    if (c == '+') return 62;
+    if (c == '/') return 63;
+    return -1;
+}
+
+// The bytes, or a description of the first fault.
+std::variant<std::vector<uint8_t>, std::string> decodeBase64(std::string_view text) {
+    std::vector<uint8_t> out;
+    out.reserve(text.size() / 4 * 3);
+    uint32_t quad = 0;
+    int count = 0;    // digits in the current group of four
+    int padding = 0;  // '=' seen so far; only more '=' and whitespace may follow
+    for (char c : text) {
+        if (isXmlWhitespace(c)) continue;
+        if (c == '=') {
+            if (count < 2) return std::string("misplaced '=' padding");
+            ++padding;
+            ++count;
+            if (count == 4) {
+                if (padding == 2) {
+                    out.push_back(static_cast<uint8_t>(quad >> 4));
+                } else {
+                    out.push_back(static_cast<uint8_t>(quad >> 10));
+                    out.push_back(static_cast<uint8_t>(quad >> 2));
+                }
+                count = 0;
+            }
+            continue;
+        }
+        int d = base64Digit(c);
+        if (d < 0) return "character " + snippet(std::string_view(&c, 1)) + " is not base64";
+        if (padding > 0) return std::string("text after '=' padding");
+        quad = (quad << 6) | static_cast<uint32_t>(d);
+        if (++count == 4) {
+            out.push_back(static_cast<uint8_t>(quad >> 16));
+            out.push_back(static_cast<uint8_t>(quad >> 8));
+            out.push_back(static_cast<uint8_t>(quad));
+            quad = 0;
+            count = 0;
+        }
+    }
+    if (count != 0) return std::string("length is not a multiple of four (missing '=' padding?)");
+    return out;
+}
+
+// ---- dates ----
+
+constexpr int64_t kSecondsPerDay = 86400;
+// 0000-01-01T00:00:00Z and 9999-12-31T23:59:59Z: the years that four digits can spell.
+constexpr int64_t kFirstWritableSecond = -62167219200;
+constexpr int64_t kLastWritableSecond = 253402300799;
+
+int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
+    y -= m <= 2;
+    int64_t era = (y >= 0 ? y : y - 399) / 400;
+    auto yoe = static_cast<unsigned>(y - era * 400);
+    unsigned doy = (153 * (m + (m > 2 ? -3 : 9)) + 2) / 5 + d - 1;
+    unsigned doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
+    return era * 146097 + static_cast<int64_t>(doe) - 719468;
+}
+
+void civilFromDays(int64_t z, int64_t& y, unsigned& m, unsigned& d) {
+    z += 719468;
+    int64_t era = (z >= 0 ? z : z - 146096) / 146097;
+    auto doe = static_cast<unsigned>(z - era * 146097);
+    unsigned yoe = (doe - doe / 1460 + doe / 36524 - doe / 146096) / 365;
+    y = static_cast<int64_t>(yoe) + era * 400;
+    unsigned doy = doe - (365 * yoe + yoe / 4 - yoe / 100);
+    unsigned mp = (5 * doy + 2) / 153;
+    d = doy - (153 * mp + 2) / 5 + 1;
+    m = mp < 10 ? mp + 3 : mp - 9;
+    y += m <= 2;
+}
+
+bool readFixedDigits(std::string_view s, size_t pos, size_t count, unsigned& out) {
+    unsigned v = 0;
+    for (size_t i = pos; i < pos + count; ++i) {
+        if (s[i] < '0' || s[i] > '9') return false;
+        v = v * 10 + static_cast<unsigned>(s[i] - '0');
+    }
+    out = v;
+    return true;
+}
+
+// "YYYY-MM-DDTHH:MM:SS[.digits]Z": the whole seconds plus the fraction read as one decimal number, so the writer
+// can predict exactly which double a text gives.
+std::optional<double> parseDate(std::string_view s) {
+    unsigned year, month, day, hour, minute, second;
+    if (s.size() < 20 || !readFixedDigits(s, 0, 4, year) || s[4] != '-' || !readFixedDigits(s, 5, 2, month) ||
+        s[7] != '-' || !readFixedDigits(s, 8, 2, day) || s[10] != 'T' || !readFixedDigits(s, 11, 2, hour) ||
+        s[13] != ':' || !readFixedDigits(s, 14, 2, minute) || s[16] != ':' || !readFixedDigits(s, 17, 2, second))
+        return std::nullopt;
+    if (s.back() != 'Z') return std::nullopt;
+    if (month < 1 || month > 12 || day < 1 || hour > 23 || minute > 59 || second > 59) return std::nullopt;
+    static constexpr unsigned kDaysInMonth[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+    bool leap = (year % 4 == 0 && year % 100 != 0) || year % 400 == 0;
+    if (day > kDaysInMonth[month - 1] + (month == 2 && leap ? 1 : 0)) return std::nullopt;
+    int64_t whole = daysFromCivil(year, month, day) * kSecondsPerDay + hour * 3600 + minute * 60 + second;
+    std::string_view rest = s.substr(19, s.size() - 20);
+    double fraction = 0;
+    if (!rest.empty()) {
+        if (rest.size() < 2 || rest[0] != '.') return std::nullopt;
+        for (char c : rest.substr(1))
+            if (c < '0' || c > '9') return std::nullopt;
+        std::string number = "0";
+        number += rest;
+        auto [end, ec] = std::from_chars(number.data(), number.data() + number.size(), fraction);
+        if (ec != std::errc() || end != number.data() + number.size()) return std::nullopt;
+    }
+    return static_cast<double>(whole) + fraction;
+}
+
+// The text of a date that parseDate reads back as exactly `seconds`, or none when there is no such text.
+std::optional<std::string> formatDate(double seconds) {
+    if (!std::isfinite(seconds)) return std::nullopt;
+    double whole = std::floor(seconds);
+    if (whole < static_cast<double>(kFirstWritableSecond) || whole > static_cast<double>(kLastWritableSecond))
+        return std::nullopt;
+    auto w = static_cast<int64_t>(whole);
+    int64_t days = w >= 0 ? w / kSecondsPerDay : -((-w + kSecondsPerDay - 1) / kSecondsPerDay);
+    int64_t secondOfDay = w - days * kSecondsPerDay;
+    int64_t year;
+    unsigned month, day;
+    civilFromDays(days, year, month, day);
+    char buf[32];
+    snprintf(buf, sizeof buf, "%04d-%02u-%02uT%02d:%02d:%02d", static_cast<int>(year), month, day,
+             static_cast<int>(secondOfDay / 3600), static_cast<int>(secondOfDay / 60 % 60),
+             static_cast<int>(secondOfDay % 60));
+    std::string base(buf);
+    double fraction = seconds - whole;
+    if (fraction == 0) return base + "Z";
+    // Prefer the short forms people write (milliseconds, microseconds); fall back to the exact decimal expansion.
+    auto attempt = [&](std::string_view digits) -> std::optional<std::string> {
+        // digits is "0.xxx" from to_chars
+        if (digits.size() < 3 || digits[0] != '0') return std::nullopt;
+        while (digits.size() > 3 && digits.back() == '0') digits.remove_suffix(1);
+        std::string text = base + std::string(digits.substr(1)) + "Z";
+        auto back = parseDate(text);
+        if (back && std::bit_cast<uint64_t>(*back) == std::bit_cast<uint64_t>(seconds)) return text;
+        return std::nullopt;
+    };
+    std::array<char, 1200> chars;
+    for (int precision = 1; precision <= 9; ++precision) {
+        auto r =
+            std::to_chars(chars.data(), chars.data() + chars.size(), fraction, std::chars_format::fixed, precision);
+        if (r.ec != std::errc()) break;
+        if (auto text = attempt(std::string_view(chars.data(), r.ptr))) return text;
+    }
+    auto r = std::to_chars(chars.data(), chars.data() + chars.size(), fraction, std::chars_format::fixed);
+    if (r.ec == std::errc()) return attempt(std::string_view(chars.data(), r.ptr));
+    return std::nullopt;
+}
+
+// ---- reals and integers ----
+
+std::optional<double> parseReal(std::string_view s) {
+    if (s == "inf") return std::numeric_limits<double>::infinity();
+    if (s == "-inf") return -std::numeric_limits<double>::infinity();
+    if (s == "nan") return std::numeric_limits<double>::quiet_NaN();
+    // from_chars also takes "infinity" and "nan(...)"; the document form spells those only one way.
+    if (s.empty() || !std::all_of(s.begin(), s.end(), [](char c) {
+            return (c >= '0' && c <= '9') || c == '.' || c == '-' || c == '+' || c == 'e' || c == 'E';
+        }))
+        return std::nullopt;
+    double d;
+    auto [end, ec] = std::from_chars(s.data(), s.data() + s.size(), d);
+    if (ec != std::errc() || end != s.data() + s.size()) return std::nullopt;
+    return d;
+}
+
+void appendReal(std::string& out, double d) {
+    if (std::isnan(d)) {
+        out += "nan";
+    } else if (std::isinf(d)) {
+        out += d < 0 ? "-inf" : "inf";
+    } else {
+        char buf[64];
+        auto r = std::to_chars(buf, buf + sizeof buf, d);
+        out.append(buf, r.ptr);
+    }
+}
+
+// ---- reading ----
+
+class Reader {
+  public:
+    explicit Reader(std::string_view text) : text_(text) {}
+
+    Result<Value> run() {
+        if (text_.size() > kMaxDocumentBytes) {
+            return documentError(kDocumentLimitExceeded, "document of " + std::to_string(text_.size()) +
+                                                             " bytes is larger than the limit of " +
+                                                             std::to_string(kMaxDocumentBytes));
+        }
+        std::string_view body = text_;
+        if (body.substr(0, 3) == "\xEF\xBB\xBF") body.remove_prefix(3);
+        if (auto fault = findTextFault(body)) {
+            size_t offset = fault->offset + (text_.size() - body.size());
+            return documentError(kDocumentMalformed,
+                                 fault->describe() + " in the text (byte " + std::to_string(offset) + ")");
+        }
+        if (auto error = checkCharacterReferences(text_)) return *error;
+
+        // Fragment mode keeps text outside the root element, so that trailing garbage can be seen and refused.
+        unsigned options = pugi::parse_default | pugi::parse_ws_pcdata | pugi::parse_fragment;
+        pugi::xml_parse_result parsed = document_.load_buffer(text_.data(), text_.size(), options, pugi::encoding_utf8);
+        if (!parsed) {
+            return documentError(kDocumentMalformed, std::string("malformed XML: ") + parsed.description() + " (byte " +
+                                                         std::to_string(parsed.offset) + ")");
+        }
+
+        pugi::xml_node root;
+        for (pugi::xml_node node : document_.children()) {
+            if (node.type() == pugi::node_element) {
+                if (root) return fail(node, "a second element <" + std::string(node.name()) + "> after the root");
+                root = node;
+            } else if (isText(node) && !trimmed(node.value()).empty()) {
+                return fail(node, "text " + snippet(trimmed(node.value())) + " outside the root element");
+            }
+        }
+        if (!root) return documentError(kDocumentMalformed, "no root element");
+        if (root.name() != kRootName) {
+            return fail(root, "unknown root element <" + std::string(root.name()) + ">, expected <vrec>");
+        }
+        for (pugi::xml_attribute attribute : root.attributes()) {
+            if (std::string_view(attribute.name()) != "version")
+                return fail(root, "unknown attribute \"" + std::string(attribute.name()) + "\" on <vrec>");
+            if (attribute.value() != kFormatVersion)
+                return fail(root, "unsupported document version " + snippet(attribute.value()));
+        }
+        if (std::distance(root.attributes_begin(), root.attributes_end()) > 1)
+            return fail(root, "more than one version attribute on <vrec>");
+
+        pugi::xml_node valueNode;
+        for (pugi::xml_node node : root.children()) {
+            if (node.type() == pugi::node_element) {
+                if (valueNode) return fail(node, "more than one value in <vrec>");
+                valueNode = node;
+            } else if (isText(node) && !trimmed(node.value()).empty()) {
+                return fail(node, "text " + snippet(trimmed(node.value())) + " in <vrec>");
+            }
+        }
+        if (!valueNode) return fail(root, "<vrec> holds no value");
+        std::optional<Value> value = readValue(valueNode, 0);
+        if (!value) return *error_;
+        return std::move(*value);
+    }
+
+  private:
+    static bool isText(pugi::xml_node node) {
+        return node.type() == pugi::node_pcdata || node.type() == pugi::node_cdata;
+    }
+
+    Error fail(pugi::xml_node node, const std::string& what) {
+        std::string message = what;
+        if (!path_.empty()) message += " at " + pathText(path_);
+        ptrdiff_t offset = node.offset_debug();
+        // pugixml points at an element's name; the message points at its '<'.
+        if (node.type() == pugi::node_element && offset > 0) --offset;
+        if (offset >= 0) message += " (byte " + std::to_string(offset) + ")";
+        return documentError(kDocumentMalformed, message);
+    }
+
+    std::nullopt_t failValue(pugi::xml_node node, const std::string& what, int code = kDocumentMalformed) {
+        Error e = fail(node, what);
+        error_ = Error(e.domain(), code, e.localizedDescription());
+        return std::nullopt;
+    }
+
+    // The character data of a scalar element; any child element is an error.
+    std::optional<std::string> textOf(pugi::xml_node node) {
+        std::string out;
+        for (pugi::xml_node child : node.children()) {
+            if (child.type() == pugi::node_element) {
+                failValue(child, "element <" + std::string(child.name()) + "> inside <" + node.name() + ">");
+                return std::nullopt;
+            }
+            if (isText(child)) out += child.value();
+        }
+        if (auto fault = findTextFault(out)) {
+            failValue(node, fault->describe() + " in <" + std::string(node.name()) + ">");
+            return std::nullopt;
+        }
+        return out;
+    }
+
+    // The element children of a container; non-blank text between them is an error.
+    bool elementsOf(pugi::xml_node node, std::vector<pugi::xml_node>& out) {
+        for (pugi::xml_node child : node.children()) {
+            if (child.type() == pugi::node_element) {
+                out.push_back(child);
+            } else if (isText(child) && !trimmed(child.value()).empty()) {
+                failValue(child, "text " + snippet(trimmed(child.value())) + " inside <" + node.name() + ">");
+                return false;
+            }
+        }
+        return true;
+    }
+
+    // `depth` counts the containers that enclose this node.
+    std::optional<Value> readValue(pugi::xml_node node, size_t depth) {
+        if (node.first_attribute())
+            return failValue(node, "unexpected attribute \"" + std::string(node.first_attribute().name()) + "\" on <" +
+                                       node.name() + ">");
+        std::string_view name = node.name();
+        if (name == "dict" || name == "array") {
+            if (depth + 1 > kMaxDocumentDepth)
+                return failValue(node, "containers nested deeper than " + std::to_string(kMaxDocumentDepth),
+                                 kDocumentLimitExceeded);
+            return name == "dict" ? readDictionary(node, depth + 1) : readArray(node, depth + 1);
+        }
+        if (name == "true" || name == "false" || name == "null") {
+            auto text = textOf(node);
+            if (!text) return std::nullopt;
+            if (!trimmed(*text).empty()) return failValue(node, "<" + std::string(name) + "> must be empty");
+            if (name == "null") return Value::null();
+            return Value::boolean(name == "true");
+        }
+        if (name == "key") return failValue(node, "a <key> outside a <dict>");
+        if (name != "string" && name != "integer" && name != "real" && name != "date" && name != "data")
+            return failValue(node, "unknown element <" + std::string(name) + ">");
+
+        auto text = textOf(node);
+        if (!text) return std::nullopt;
+        if (name == "string") return Value::string(std::move(*text));
+        if (name == "data") {
+            auto bytes = decodeBase64(*text);
+            if (auto* problem = std::get_if<std::string>(&bytes))
+                return failValue(node, "bad base64 data: " + *problem);
+            return Value::data(std::move(std::get<std::vector<uint8_t>>(bytes)));
+        }
+        std::string_view s = trimmed(*text);
+        if (name == "integer") return readInteger(node, s);
+        if (name == "real") {
+            auto d = parseReal(s);
+            if (!d) return failValue(node, "bad real " + snippet(s));
+            return Value::real(*d);
+        }
+        auto seconds = parseDate(s);
+        if (!seconds) return failValue(node, "bad date " + snippet(s) + ", expected YYYY-MM-DDTHH:MM:SS[.fraction]Z");
+        // A fraction can round a date past 9999-12-31T23:59:59Z; only dates that can be written again are read.
+        if (!formatDate(*seconds)) return failValue(node, "date " + snippet(s) + " out of range");
+        return Value::date(Date{*seconds});
+    }
+
+    std::optional<Value> readInteger(pugi::xml_node node, std::string_view s) {
+        const char* first = s.data();
+        const char* last = s.data() + s.size();
+        bool digitsOnly = !s.empty() && std::all_of(s[0] == '-' ? first + 1 : first, last,
+                                                    [](char c) { return c >= '0' && c <= '9'; });
+        if (!digitsOnly || s == "-") return failValue(node, "bad integer " + snippet(s));
+        if (s[0] == '-') {
+            int64_t i;
+            auto [end, ec] = std::from_chars(first, last, i);
+            if (ec == std::errc::result_out_of_range) return failValue(node, "integer out of range " + snippet(s));
+            if (ec != std::errc() || end != last) return failValue(node, "bad integer " + snippet(s));
+            return Value::int64(i);
+        }
+        uint64_t u;
+        auto [end, ec] = std::from_chars(first, last, u);
+        if (ec == std::errc::result_out_of_range) return failValue(node, "integer out of range " + snippet(s));
+        if (ec != std::errc() || end != last) return failValue(node, "bad integer " + snippet(s));
+        if (u <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max()))
+            return Value::int64(static_cast<int64_t>(u));
+        return Value::uint64(u);
+    }
+
+    std::optional<Value> readArray(pugi::xml_node node, size_t depth) {
+        std::vector<pugi::xml_node> children;
+        if (!elementsOf(node, children)) return std::nullopt;
+        std::vector<Value> items;
+        items.reserve(children.size());
+        for (size_t i = 0; i < children.size(); ++i) {
+            path_.push_back(PathStep{{}, i});
+            std::optional<Value> item = readValue(children[i], depth);
+            path_.pop_back();
+            if (!item) return std::nullopt;
+            items.push_back(std::move(*item));
+        }
+        return Value::array(std::move(items));
+    }
+
+    std::optional<Value> readDictionary(pugi::xml_node node, size_t depth) {
+        std::vector<pugi::xml_node> children;
+        if (!elementsOf(node, children)) return std::nullopt;
+        std::vector<std::pair<std::string, Value>> entries;
+        std::vector<pugi::xml_node> keyNodes;
+        entries.reserve(children.size() / 2);
+        keyNodes.reserve(children.size() / 2);
+        for (size_t i = 0; i < children.size(); i += 2) {
+            pugi::xml_node child = children[i];
+            if (std::string_view(child.name()) != "key") {
+                // Keys and values are taken in pairs, so a value here follows a complete pair or opens the dict.
+                if (i == 0) return failValue(child, "a value without a key in <dict>");
+                return failValue(child, "two values for key " + snippet(entries.back().first));
+            }
+            if (child.first_attribute())
+                return failValue(
+                    child, "unexpected attribute \"" + std::string(child.first_attribute().name()) + "\" on <key>");
+            auto key = textOf(child);
+            if (!key) return std::nullopt;
+            if (i + 1 >= children.size() || std::string_view(children[i + 1].name()) == "key")
+                return failValue(child, "key " + snippet(*key) + " without a value");
+            path_.push_back(PathStep{*key, std::string_view::npos});
+            std::optional<Value> value = readValue(children[i + 1], depth);
+            path_.pop_back();
+            if (!value) return std::nullopt;
+            entries.emplace_back(std::move(*key), std::move(*value));
+            keyNodes.push_back(child);
+        }
+        size_t given = entries.size();
+        Value dictionary = Value::dictionary(std::move(entries));
+        if (dictionary.count() != given) {
+            std::unordered_set<std::string> seen;
+            for (pugi::xml_node keyNode : keyNodes) {
+                std::string key = *textOf(keyNode);
+                if (!seen.insert(key).second) return failValue(keyNode, "duplicate key " + snippet(key));
+            }
+        }
+        return dictionary;
+    }
+
+    std::string_view text_;
+    pugi::xml_document document_;
+    std::vector<PathStep> path_;
+    std::optional<Error> error_;
+};
+
+// ---- writing ----
+
+class Writer {
+  public:
+    Result<std::string> run(const Value& value) {
+        out_ = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<vrec version=\"1\">\n";
+        if (!writeValue(value, 0)) return *error_;
+        out_ += "</vrec>\n";
+        if (out_.size() > kMaxDocumentBytes) return tooLarge();
+        return std::move(out_);
+    }
+
+  private:
+    bool fail(int code, const std::string& what) {
+        std::string message = what;
+        message += " at " + pathText(path_);
+        error_ = documentError(code, message);
+        return false;
+    }
+
+    Error tooLarge() {
+        return documentError(kDocumentLimitExceeded,
+                             "document larger than the limit of " + std::to_string(kMaxDocumentBytes) + " bytes");
+    }
+
+    void indent(size_t depth) { out_.append(depth, '\t'); }
+
+    bool appendEscaped(std::string_view s, const char* what) {
+        if (auto fault = findTextFault(s)) {
+            return fail(kDocumentUnrepresentable, std::string(what) + " with " + fault->describe() + " at byte " +
+                                                      std::to_string(fault->offset) + " of " + snippet(s));
+        }
+        size_t start = 0;
+        for (size_t i = 0; i < s.size(); ++i) {
+            const char* replacement;
+            switch (s[i]) {
+                case '&':
+                    replacement = "&amp;";
+                    break;
+                case '<':
+                    replacement = "&lt;";
+                    break;
+                case '>':
+                    replacement = "&gt;";
+                    break;
+                case '\r':
+                    replacement = "&#13;";
+                    break;
+                default:
+                    continue;
+            }
+            out_.append(s.substr(start, i - start));
+            out_ += replacement;
+            start = i + 1;
+        }
+        out_.append(s.substr(start));
+        return true;
+    }
+
+    void element(const char* name, std::string_view content) {
+        out_ += '<';
+        out_ += name;
+        out_ += '>';
+        out_ += content;
+        out_ += "</";
+        out_ += name;
+        out_ += ">\n";
+    }
+
+    bool writeValue(const Value& value, size_t depth) {
+        if (out_.size() > kMaxDocumentBytes) {
+            error_ = tooLarge();
+            return false;
+        }
+        indent(depth);
+        switch (value.kind()) {
+            case ValueKind::Null:
+                out_ += "<null/>\n";
+                return true;
+            case ValueKind::Bool:
+                out_ += *value.getBool() ? "<true/>\n" : "<false/>\n";
+                return true;
+            case ValueKind::Int64:
+                element("integer", std::to_string(*value.getInt64()));
+                return true;
+            case ValueKind::UInt64:
+                element("integer", std::to_string(*value.getUInt64()));
+                return true;
+            case ValueKind::Real: {
+                std::string text;
+                appendReal(text, *value.getReal());
+                element("real", text);
+                return true;
+            }
+            case ValueKind::String:
+                out_ += "<string>";
+                if (!appendEscaped(value.stringView(), "a string")) return false;
+                out_ += "</string>\n";
+                return true;
+            case ValueKind::Data: {
+                // Known before encoding: a blob that cannot fit is refused without building its text.
+                if (out_.size() + (value.dataBytes().size() + 2) / 3 * 4 > kMaxDocumentBytes) {
+                    error_ = tooLarge();
+                    return false;
+                }
+                out_ += "<data>";
+                appendBase64(out_, value.dataBytes());
+                out_ += "</data>\n";
+                return true;
+            }
+            case ValueKind::Date: {
+                auto text = formatDate(value.getDate()->secondsSince1970);
+                if (!text) {
+                    return fail(kDocumentUnrepresentable, "a date outside the years 0000-9999 (" +
+                                                              std::to_string(value.getDate()->secondsSince1970) +
+                                                              " seconds since 1970)");
+                }
+                element("date", *text);
+                return true;
+            }
+            case ValueKind::Uuid:
+                return fail(kDocumentUnrepresentable,
+                            "a uuid (" + value.getUuid()->string() + "), which a document cannot represent,");
+            case ValueKind::Array:
+            case ValueKind::Dictionary:
+                break;
+        }
+        const char* name = value.isArray() ? "array" : "dict";
+        if (depth + 1 > kMaxDocumentDepth)
+            return fail(kDocumentLimitExceeded, "containers nested deeper than " + std::to_string(kMaxDocumentDepth));
+        if (value.count() == 0) {
+            out_ += '<';
+            out_ += name;
+            out_ += "/>\n";
+            return true;
+        }
+        out_ += '<';
+        out_ += name;
+        out_ += ">\n";
+        if (value.isArray()) {
+            size_t index = 0;
+            for (const Value& item : value.items()) {
+                path_.push_back(PathStep{{}, index++});
+                bool ok = writeValue(item, depth + 1);
+                path_.pop_back();
+                if (!ok) return false;
+            }
+        } else {
+            for (const DictionaryEntry& entry : value.entries()) {
+                path_.push_back(PathStep{entry.key, std::string_view::npos});
+                indent(depth + 1);
+                out_ += "<key>";
+                bool ok = appendEscaped(entry.key, "a key");
+                if (ok) {
+                    out_ += "</key>\n";
+                    ok = writeValue(entry.value, depth + 1);
+                }
+                path_.pop_back();
+                if (!ok) return false;
+            }
+        }
+        indent(depth);
+        out_ += "</";
+        out_ += name;
+        out_ += ">\n";
+        return true;
+    }
+
+    std::string out_;
+    std::vector<PathStep> path_;
+    std::optional<Error> error_;
+};
+
+}  // namespace
+
+// ---- Document ----
+
+int Document::FileSystem::open(const char* path, int flags, mode_t mode) { return ::open(path, flags, mode); }
+ssize_t Document::FileSystem::write(int fd, const void* bytes, size_t count) { return ::write(fd, bytes, count); }
+int Document::FileSystem::fsync(int fd) { return ::fsync(fd); }
+int Document::FileSystem::close(int fd) { return ::close(fd); }
+int Document::FileSystem::rename(const char* from, const char* to) { return ::rename(from, to); }
+int Document::FileSystem::unlink(const char* path) { return ::unlink(path); }
+
+Document::FileSystem& Document::posixFileSystem() {
+    static FileSystem fileSystem;
+    return fileSystem;
+}
+
+Result<Value> Document::read(std::string_view text) { return Reader(text).run(); }
+
+Result<std::string> Document::write(const Value& value) { return Writer().run(value); }
+
+Result<Value> Document::readFile(const std::filesystem::path& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return posixError(errno, "open", path);
+    std::string text;
+    struct stat info {};
+    if (::fstat(fd, &info) == 0 && S_ISREG(info.st_mode) && static_cast<uint64_t>(info.st_size) <= kMaxDocumentBytes)
+        text.reserve(static_cast<size_t>(info.st_size));
+    char buffer[65536];
+    for (;;) {
+        ssize_t n = ::read(fd, buffer, sizeof buffer);
+        if (n < 0) {
+            if (errno == EINTR) continue;
+            int err = errno;
+            ::close(fd);
+            return posixError(err, "read", path);
+        }
+        if (n == 0) break;
+        text.append(buffer, static_cast<size_t>(n));
+        if (text.size() > kMaxDocumentBytes) {
+            ::close(fd);
+            return documentError(kDocumentLimitExceeded, path.string() + ": document larger than the limit of " +
+                                                             std::to_string(kMaxDocumentBytes) + " bytes");
+        }
+    }
+    ::close(fd);
+    Result<Value> value = read(text);
+    if (!value.ok()) {
+        const Error& e = value.error();
+        return Error(e.domain(), e.code(), path.string() + ": " + e.localizedDescription().value_or(""));
+    }
+    return value;
+}
+
+std::optional<Error> Document::writeFileAtomically(const std::filesystem::path& path, const Value& value,
+                                                   FileSystem& fs) {
+    Result<std::string> text = write(value);
+    if (!text.ok()) return text.error();
+
+    // A name of our own beside the target, so the rename stays within one file system.
+    std::array<uint8_t, 8> random{};
+    if (getrandom(random.data(), random.size(), GRND_NONBLOCK) != static_cast<ssize_t>(random.size())) random.fill(0);
+    std::string suffix = ".tmp-" + std::to_string(getpid()) + "-";
+    for (uint8_t b : random) {
+        char hex[3];
+        snprintf(hex, sizeof hex, "%02x", b);
+        suffix += hex;
+    }
+    std::filesystem::path temporary = path;
+    temporary += suffix;
+
+    int fd = fs.open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+    if (fd < 0) return posixError(errno, "create", temporary);
+
+    auto abandon = [&](int err, const char* operation, bool closeFirst) {
+        if (closeFirst) fs.close(fd);
+        fs.unlink(temporary.c_str());
+        return posixError(err, operation, temporary);
+    };
+
+    std::string_view rest = *text;
+    while (!rest.empty()) {
+        ssize_t n = fs.write(fd, rest.data(), rest.size());
+        if (n < 0 && errno == EINTR) continue;
+        if (n < 0) return abandon(errno, "write", true);
+        if (n == 0) return abandon(EIO, "write", true);
+        rest.remove_prefix(static_cast<size_t>(n));
+    }
+    if (fs.fsync(fd) != 0) return abandon(errno, "fsync", true);
+    if (fs.close(fd) != 0) return abandon(errno, "close", false);
+    if (fs.rename(temporary.c_str(), path.c_str()) != 0) {
+        int err = errno;
+        fs.unlink(temporary.c_str());
+        return posixError(err, "rename over", path);
+    }
+
+    std::filesystem::path directory = path.parent_path();
+    if (directory.empty()) directory = ".";
+    int dirFd = fs.open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC, 0);
+    if (dirFd < 0) return posixError(errno, "open directory", directory);
+    if (fs.fsync(dirFd) != 0) {
+        int err = errno;
+        fs.close(dirFd);
+        return posixError(err, "fsync directory", directory);
+    }
+    fs.close(dirFd);
+    return std::nullopt;
+}
+
+}  // namespace bexil
