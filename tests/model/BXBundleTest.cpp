@@ -1,0 +1,280 @@
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <atomic>
+#include <cctype>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/Document.h"
+#include "model/BXBundle.h"
+#include "platform/log/CaptureSink.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
+
+std::string real(const fs::path& path) { return fs::canonical(path).string(); }
+
+Value dict(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
+
+// "file://" and the path with every byte outside a small safe set percent-encoded.
+std::string fileURL(const std::string& path) {
+    static const char* kHex = "0123456789ABCDEF";
+    std::string url = "file://";
+    for (unsigned char c : path) {
+        if (std::isalnum(c) || c == '/' || c == '.' || c == '-' || c == '_') {
+            url.push_back(static_cast<char>(c));
+        } else {
+            url.push_back('%');
+            url.push_back(kHex[c >> 4]);
+            url.push_back(kHex[c & 15]);
+        }
+    }
+    return url;
+}
+
+// A platform bundle whose answers the test sets, counting how often each property is asked for.
+class FakeBundle : public PlatformBundle {
+public:
+    std::optional<std::string> bundlePath;
+    std::optional<std::string> executable;
+    std::optional<std::string> support;
+    std::optional<Value> info;
+    mutable std::atomic<int> supportQueries{0};
+
+    std::optional<std::string> stringProperty(BundleStringProperty property) const override {
+        switch (property) {
+            case BundleStringProperty::BundlePath:
+                return bundlePath;
+            case BundleStringProperty::ExecutablePath:
+                return executable;
+            case BundleStringProperty::SupportPath:
+                ++supportQueries;
+                return support;
+        }
+        return std::nullopt;
+    }
+    std::optional<Value> infoDictionary() const override { return info; }
+    std::string description() const override { return "<fake bundle>"; }
+};
+
+TEST(BXBundleConstruction, EveryConstructorFindsTheExampleApplication) {
+    fs::path greeter = kExamples / "Greeter.app";
+    std::string app = real(greeter);
+    const std::shared_ptr<BXBundle> bundles[] = {
+        BXBundle::initWithPath(greeter.string()),
+        BXBundle::initWithURL(fileURL(greeter.string())),
+        BXBundle::initWithURL(greeter.string()),
+        BXBundle::initWithExecutablePath((greeter / "greeter").string()),
+        BXBundle::initWithExecutableURL(fileURL((greeter / "greeter").string())),
+        BXBundle::initWithExecutablePath(greeter.string()),  // the bundle directory itself
+        BXBundle::initWithZEMBundle(BXBundle::initWithPath(app)->bundle()),
+    };
+    for (const auto& bundle : bundles) {
+        ASSERT_TRUE(bundle);
+        SCOPED_TRACE(bundle->description());
+        EXPECT_EQ(bundle->path(), app);
+        EXPECT_EQ(bundle->url(), app);
+        EXPECT_EQ(bundle->supportPath(), app);
+        EXPECT_EQ(bundle->plugInsPath(), app + "/PlugIns");
+        EXPECT_EQ(bundle->bundleDirectory("Resources"), app + "/Resources");
+        EXPECT_EQ(bundle->executablePath(), app + "/greeter");
+        EXPECT_EQ(bundle->bundleIdentifier(), "com.example.greeter");
+        ASSERT_TRUE(bundle->infoDictionary());
+        EXPECT_EQ(bundle->infoDictionary()->get("BDBundleName"), Value::string("Greeter"));
+    }
+}
+
+TEST(BXBundleConstruction, ExecutableDeepInsideAPlugInGivesThePlugIn) {
+    fs::path bonjour = kExamples / "Greeter.app/PlugIns/Bonjour.bxplugin";
+    auto bundle = BXBundle::initWithExecutablePath((bonjour / "bin/bonjour").string());
+    EXPECT_EQ(bundle->path(), real(bonjour));
+    EXPECT_EQ(bundle->executablePath(), real(bonjour) + "/bin/bonjour");
+    EXPECT_EQ(bundle->bundleIdentifier(), "com.example.greeter.bonjour");
+    // Its plug-in directory is its own, not the application's.
+    EXPECT_EQ(bundle->plugInsPath(), real(bonjour) + "/PlugIns");
+}
+
+TEST(BXBundleConstruction, URLsAreDecodedOnlyWhenTheyAreFileURLs) {
+    std::string pattern = (fs::temp_directory_path() / "bexil-url-XXXXXX").string();
+    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+    fs::path dir = fs::canonical(pattern) / "With Space%41.app";
+    fs::create_directories(dir);
+    EXPECT_EQ(BXBundle::initWithURL(fileURL(dir.string()))->path(), dir.string());
+    EXPECT_EQ(BXBundle::initWithURL("file://localhost" + fileURL(dir.string()).substr(7))->path(), dir.string());
+    // A plain path is never decoded: its "%41" stays.
+    EXPECT_EQ(BXBundle::initWithURL(dir.string())->path(), dir.string());
+    // A URL naming another host is no local path.
+    EXPECT_FALSE(BXBundle::initWithURL("file://elsewhere" + dir.string())->path());
+    fs::remove_all(fs::canonical(pattern));
+}
+
+TEST(BXBundleConstruction, OnlyAMissingPlatformBundleGivesNoObject) {
+    EXPECT_EQ(BXBundle::initWithZEMBundle(nullptr), nullptr);
+    // The test program lies in no bundle: its main bundle exists and answers nothing.
+    auto main = BXBundle::initForMainBundle();
+    ASSERT_TRUE(main);
+    EXPECT_FALSE(main->path());
+    EXPECT_FALSE(main->executablePath());
+}
+
+TEST(BXBundleQueries, MissingPathAnswersNothingAndLogsWhyItHasNoInformation) {
+    log::CaptureSink capture;
+    auto bundle = BXBundle::initWithPath("/nonexistent/Nowhere.app");
+    ASSERT_TRUE(bundle);
+    EXPECT_FALSE(bundle->path());
+    EXPECT_FALSE(bundle->url());
+    EXPECT_FALSE(bundle->supportPath());
+    EXPECT_FALSE(bundle->plugInsPath());
+    EXPECT_FALSE(bundle->bundleDirectory("Resources"));
+    EXPECT_FALSE(bundle->executablePath());
+    EXPECT_FALSE(bundle->bundleIdentifier());
+    EXPECT_FALSE(capture.contains("Info.vrec")) << "bundleIdentifier must not log";
+    EXPECT_FALSE(bundle->infoDictionary());
+
+    auto entries = capture.matching("failed to retrieve Info.vrec for ");
+    ASSERT_EQ(entries.size(), 1u);
+    EXPECT_EQ(entries[0].level, log::Level::Info);
+    EXPECT_EQ(entries[0].category, "ops");
+    EXPECT_EQ(entries[0].message,
+              "failed to retrieve Info.vrec for (null) through <no bundle at /nonexistent/Nowhere.app: "
+              "No such file or directory>");
+    EXPECT_EQ(BXBundle::initWithExecutablePath("/nonexistent/tool")->executablePath(), std::nullopt);
+}
+
+class BXBundleFileTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::string pattern = (fs::temp_directory_path() / "bexil-bxbundle-XXXXXX").string();
+        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+        root_ = fs::canonical(pattern);
+    }
+    void TearDown() override {
+        std::error_code ec;
+        fs::remove_all(root_, ec);
+    }
+    fs::path root_;
+};
+
+TEST_F(BXBundleFileTest, MalformedInformationIsLoggedAsNotRetrieved) {
+    fs::path bundle = root_ / "Broken.app";
+    fs::create_directories(bundle);
+    std::ofstream(bundle / "Info.vrec") << "<vrec><dict><key>BDBundleIdentifier</key>";
+    log::CaptureSink capture;
+    auto broken = BXBundle::initWithPath(bundle.string());
+    EXPECT_EQ(broken->path(), bundle.string());
+    EXPECT_EQ(broken->executablePath(), bundle.string());
+    EXPECT_FALSE(broken->bundleIdentifier());
+    EXPECT_FALSE(broken->infoDictionary());
+    auto entry = capture.find("failed to retrieve Info.vrec for " + bundle.string() + " through <bundle ");
+    ASSERT_TRUE(entry);
+    EXPECT_NE(entry->message.find("BexilDocument"), std::string::npos) << entry->message;
+}
+
+TEST_F(BXBundleFileTest, InformationThatIsNotADictionaryIsLoggedAsNotConverted) {
+    fs::path bundle = root_ / "Listed.app";
+    fs::create_directories(bundle);
+    ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", Value::array({Value::string("x")})));
+    log::CaptureSink capture;
+    auto listed = BXBundle::initWithPath(bundle.string());
+    EXPECT_FALSE(listed->bundleIdentifier());
+    EXPECT_FALSE(listed->infoDictionary());
+    EXPECT_EQ(capture.count("failed to retrieve"), 0u);
+    auto entries = capture.matching("failed to convert Info.vrec to dictionary: ");
+    ASSERT_EQ(entries.size(), 1u);
+    EXPECT_EQ(entries[0].level, log::Level::Info);
+    EXPECT_EQ(entries[0].message, "failed to convert Info.vrec to dictionary: " + bundle.string() + " source=<bundle " +
+                                      bundle.string() + ">");
+}
+
+TEST_F(BXBundleFileTest, IdentifierMustBeAString) {
+    fs::path bundle = root_ / "Numbered.app";
+    fs::create_directories(bundle);
+    ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", dict({{"BDBundleIdentifier", Value::int64(5)}})));
+    auto numbered = BXBundle::initWithPath(bundle.string());
+    EXPECT_FALSE(numbered->bundleIdentifier());
+    EXPECT_TRUE(numbered->infoDictionary());
+}
+
+TEST_F(BXBundleFileTest, SymbolicLinkLoopAnswersNothing) {
+    fs::create_symlink(root_ / "b.app", root_ / "a.app");
+    fs::create_symlink(root_ / "a.app", root_ / "b.app");
+    for (const auto& bundle : {BXBundle::initWithPath((root_ / "a.app").string()),
+                               BXBundle::initWithExecutablePath((root_ / "a.app").string())}) {
+        ASSERT_TRUE(bundle);
+        EXPECT_FALSE(bundle->path());
+        EXPECT_FALSE(bundle->executablePath());
+        EXPECT_FALSE(bundle->plugInsPath());
+        EXPECT_FALSE(bundle->infoDictionary());
+    }
+}
+
+TEST(BXBundleQueries, ExamplesWithoutExecutableOrIdentifierFallBack) {
+    fs::path stationery = kExamples / "Notes.app/PlugIns/Stationery.bxplugin";
+    auto data = BXBundle::initWithPath(stationery.string());
+    EXPECT_FALSE(data->stringProperty(BundleStringProperty::ExecutablePath));
+    EXPECT_EQ(data->executablePath(), real(stationery));
+
+    auto anonymous =
+        BXBundle::initWithPath((kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin").string());
+    EXPECT_FALSE(anonymous->bundleIdentifier());
+    ASSERT_TRUE(anonymous->infoDictionary());
+    EXPECT_TRUE(anonymous->infoDictionary()->contains("RZExtension"));
+}
+
+TEST(BXBundleQueries, PathsFollowTheSupportDirectoryNotTheBundlePath) {
+    auto fake = std::make_shared<FakeBundle>();
+    fake->bundlePath = "/apps/Tool.app";
+    fake->support = "/var/support/Tool/";
+    auto bundle = BXBundle::initWithZEMBundle(fake);
+    EXPECT_EQ(bundle->plugInsPath(), "/var/support/Tool/PlugIns");
+    EXPECT_EQ(bundle->bundleDirectory("Themes"), "/var/support/Tool/Themes");
+    EXPECT_EQ(bundle->executablePath(), "/apps/Tool.app");
+
+    fake->executable = "/apps/Tool.app/tool";
+    EXPECT_EQ(bundle->executablePath(), "/apps/Tool.app/tool");
+    EXPECT_EQ(bundle->bundle(), fake);
+}
+
+TEST(BXBundleQueries, SupportPathIsAskedOnceAndKeptEvenWhenAbsent) {
+    auto fake = std::make_shared<FakeBundle>();
+    fake->support = "/s";
+    auto bundle = BXBundle::initWithZEMBundle(fake);
+    EXPECT_EQ(bundle->supportPath(), "/s");
+    fake->support = "/changed";
+    EXPECT_EQ(bundle->supportPath(), "/s");
+    EXPECT_EQ(bundle->plugInsPath(), "/s/PlugIns");
+    EXPECT_EQ(fake->supportQueries.load(), 1);
+
+    auto none = std::make_shared<FakeBundle>();
+    auto empty = BXBundle::initWithZEMBundle(none);
+    EXPECT_FALSE(empty->supportPath());
+    none->support = "/late";
+    EXPECT_FALSE(empty->plugInsPath());
+    EXPECT_EQ(none->supportQueries.load(), 1);
+}
+
+TEST(BXBundleQueries, ConcurrentFirstUsesOfSupportPathAgree) {
+    for (int round = 0; round < 20; ++round) {
+        auto fake = std::make_shared<FakeBundle>();
+        fake->support = "/support/" + std::to_string(round);
+        auto bundle = BXBundle::initWithZEMBundle(fake);
+        std::vector<std::optional<std::string>> seen(8);
+        std::vector<std::thread> threads;
+        for (size_t i = 0; i < seen.size(); ++i) threads.emplace_back([&, i] { seen[i] = bundle->plugInsPath(); });
+        for (auto& t : threads) t.join();
+        for (const auto& s : seen) EXPECT_EQ(s, fake->support.value() + "/PlugIns");
+        EXPECT_GE(fake->supportQueries.load(), 1);
+        EXPECT_EQ(bundle->supportPath(), fake->support);
+    }
+}
+
+}  // namespace
+}  // namespace bexil
