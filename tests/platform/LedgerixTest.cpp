@@ -673,6 +673,8 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchanged) {
     writePlugIn(bundles_ / "BadEntitlements.bxplugin", {.identifier = "x.bad1"});
     write(bundles_ / "BadEntitlements.bxplugin/Entitlements.vrec", "garbage");
     writePlugIn(bundles_ / "ArrayEntitlements.bxplugin", {.identifier = "x.bad2", .entitlements = Value::array({})});
+    writePlugIn(bundles_ / "HugeEntitlements.bxplugin", {.identifier = "x.bad3"});
+    write(bundles_ / "HugeEntitlements.bxplugin/Entitlements.vrec", std::string(2 << 20, ' '));
     writePlugIn(bundles_ / "Escape.bxplugin", {.identifier = "../../escape"});
     writePlugIn(bundles_ / "Dots.bxplugin", {.identifier = ".."});
     fs::create_directory_symlink(bundles_ / "LoopB.bxplugin", bundles_ / "LoopA.bxplugin");
@@ -696,6 +698,7 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchanged) {
         {(bundles_ / "StringPlugIn.bxplugin").string(), kLXNotAPlugIn},
         {(bundles_ / "BadEntitlements.bxplugin").string(), kLXBadEntitlements},
         {(bundles_ / "ArrayEntitlements.bxplugin").string(), kLXBadEntitlements},
+        {(bundles_ / "HugeEntitlements.bxplugin").string(), kLXBadEntitlements},
         {(bundles_ / "Escape.bxplugin").string(), kLXBadIdentifier},
         {(bundles_ / "Dots.bxplugin").string(), kLXBadIdentifier},
     };

@@ -62,8 +62,10 @@ class LXApplicationWorkspace {
     virtual void removeObserver(const LXApplicationWorkspaceObserverProtocol* observer) = 0;
 
     // Registers the plug-in bundle at the path (a "file://" URL is accepted). Registering an unchanged bundle again
-    // changes nothing and keeps its UUID; a changed bundle replaces its old record (uninstall, then install). On
-    // failure the registry is unchanged.
+    // changes nothing and keeps its UUID; a changed bundle replaces its old record (uninstall, then install): under
+    // a new UUID when its identifier or "BDBundleVersion" changed, under the old one otherwise. On failure the
+    // registry is unchanged; if the store fails after the old record's uninstall was announced, observers have
+    // heard of an uninstall that did not happen and find the record again on their next look-up.
     virtual Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) = 0;
     // Removes the record of the plug-in registered at the path; the bundle itself need not exist any more.
     virtual std::optional<Error> unregisterPlugin(std::string_view url) = 0;

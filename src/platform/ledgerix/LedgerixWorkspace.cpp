@@ -40,6 +40,8 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr std::string_view kEntitlementsFileName = "Entitlements.vrec";
+// Entitlements are a handful of keys; like information documents, anything larger is refused rather than read.
+constexpr size_t kMaxEntitlementsBytes = DirectoryBundle::kMaxInfoBytes;
 constexpr std::string_view kExtensionPointKey = "RZExtensionPointIdentifier";
 constexpr std::string_view kIdentifierKey = "RZExtensionIdentifier";
 // Dynamic discovery queries get statements of their own shape; past this many the cache is dropped and rebuilt.
@@ -334,7 +336,7 @@ bool isDamage(int code) {
 
 bool exec(sqlite3* db, const char* sql) { return sqlite3_exec(db, sql, nullptr, nullptr, nullptr) == SQLITE_OK; }
 
-Opened openStore(const std::string& path) {
+Opened openStore(const std::string& path, LedgerixWorkspace::Durability durability) {
     Opened result;
     sqlite3* db = nullptr;
     int rc =
@@ -351,7 +353,8 @@ Opened openStore(const std::string& path) {
     sqlite3_busy_timeout(db, 5000);
 
     // WAL keeps readers and the writer apart and makes a commit one append; FULL syncs the log at every commit, so
-    // a registration that returned is on disk.
+    // a registration that returned is on disk. NORMAL leaves the sync to checkpoints: still atomic, and still safe
+    // when only the process dies, because the log is in the kernel's hands once written.
     sqlite3_stmt* stmt = nullptr;
     rc = sqlite3_prepare_v2(db, "PRAGMA journal_mode=WAL", -1, &stmt, nullptr);
     if (rc == SQLITE_OK) rc = sqlite3_step(stmt);
@@ -363,7 +366,9 @@ Opened openStore(const std::string& path) {
         sqlite3_close(db);
         return result;
     }
-    if (!exec(db, "PRAGMA synchronous=FULL") || !exec(db, "PRAGMA foreign_keys=ON"))
+    const char* synchronous =
+        durability == LedgerixWorkspace::Durability::Full ? "PRAGMA synchronous=FULL" : "PRAGMA synchronous=NORMAL";
+    if (!exec(db, synchronous) || !exec(db, "PRAGMA foreign_keys=ON"))
         return fail("configure the database", sqlite3_errcode(db));
 
     // A quick check reads every page once; it finds truncated and overwritten files before they answer wrongly.
@@ -444,13 +449,13 @@ Result<std::shared_ptr<LedgerixWorkspace>> LedgerixWorkspace::open(Options optio
         return lxError(kLXStoreFailure, formatPrintf("cannot make the registry state directory %s: %s",
                                                      options.stateDirectory.string(), ec.message()));
     std::string path = (options.stateDirectory / kDatabaseFileName).string();
-    Opened opened = openStore(path);
+    Opened opened = openStore(path, options.durability);
     if (!opened.db && opened.damaged) {
         std::string movedTo;
         if (std::optional<Error> error = quarantine(path, &movedTo)) return *error;
         log::ops().error("registry database %s is damaged (%@); moved it aside to %s and started an empty registry",
                          path, opened.error, movedTo);
-        opened = openStore(path);
+        opened = openStore(path, options.durability);
     }
     if (!opened.db) return *opened.error;
     return std::make_shared<LedgerixWorkspace>(std::move(options), opened.db, Private{});
@@ -851,6 +856,9 @@ Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view ur
     fs::path entitlementsPath = fs::path(*real) / kEntitlementsFileName;
     struct stat entitlementsStatus;
     if (::lstat(entitlementsPath.c_str(), &entitlementsStatus) == 0) {
+        if (entitlementsStatus.st_size > static_cast<off_t>(kMaxEntitlementsBytes))
+            return lxError(kLXBadEntitlements, formatPrintf("the entitlements of %s are larger than %zu bytes", *real,
+                                                            kMaxEntitlementsBytes));
         Result<Value> entitlements = Document::readFile(entitlementsPath);
         if (!entitlements.ok())
             return lxError(kLXBadEntitlements,
@@ -1013,6 +1021,14 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
         return read.error();
     }
     Row candidate = std::move(read).value();
+    // The container is made before the record that names it is committed, and outside the lock; after a failure or
+    // a crash in between an empty container is left behind, which the next registration of that identifier reuses.
+    if (candidate.container) {
+        if (std::optional<Error> error = makeContainer(*candidate.container)) {
+            log::lx().info("registration of %s refused: %@", candidate.path, *error);
+            return *error;
+        }
+    }
 
     std::vector<Uuid> announced;
     for (;;) {
@@ -1030,11 +1046,6 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
             announced.push_back(old->uuid);
             notifyObservers(false, {proxyFromRow(*old)});
             continue;
-        }
-        // The container is made before the record that names it is committed; after a crash in between an empty
-        // container is left behind, which the next registration of that identifier simply reuses.
-        if (candidate.container) {
-            if (std::optional<Error> error = makeContainer(*candidate.container)) return *error;
         }
         // The UUID names the plug-in as long as the bundle keeps its identity and version; a new build is a new
         // plug-in for everyone who caches by UUID.

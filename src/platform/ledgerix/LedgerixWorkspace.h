@@ -26,12 +26,22 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     static constexpr std::string_view kDatabaseFileName = "registry.sqlite3";
     static constexpr std::string_view kContainersDirectoryName = "containers";
 
+    // How far a committed change is guaranteed to survive.
+    enum class Durability {
+        // A change that returned survives a crash of the process and of the machine (the log is synced at commit).
+        Full,
+        // A change that returned survives a crash of the process; a crash of the machine may lose the last ones,
+        // never consistency. For bulk loading and measurements.
+        Process,
+    };
+
     struct Options {
         // Where the database and the data containers live.
         std::filesystem::path stateDirectory;
         // The directory that stands for "/" when deciding whether a bundle lies on the system volume (under
         // "<root>/System/"). Only tests change it, so that they never need a real /System.
         std::filesystem::path rootDirectory = "/";
+        Durability durability = Durability::Full;
     };
 
     // Opens (creating or migrating) the registry. A damaged database is moved aside and an empty one started (logged);
