@@ -508,6 +508,33 @@ TEST_F(LedgerixPersistenceTest, TruncatedDatabaseIsDetectedAtOpen) {
     EXPECT_TRUE(sink.contains("is damaged"));
 }
 
+TEST_F(LedgerixPersistenceTest, DamageFoundWhileRunningIsCheckedAndMovedAsideAtNextOpen) {
+    for (int i = 0; i < 150; ++i)
+        registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
+                               {.identifier = "com.example.m" + std::to_string(i)}));
+    workspace_.reset();
+    // Overwrite the middle of the file, leaving the header and the schema page intact: a light open passes.
+    fs::path file = state_ / "registry.sqlite3";
+    uintmax_t size = fs::file_size(file);
+    {
+        std::fstream stream(file, std::ios::in | std::ios::out | std::ios::binary);
+        stream.seekp(static_cast<std::streamoff>(size / 4));
+        std::string garbage(size / 2, '\xa5');
+        stream.write(garbage.data(), static_cast<std::streamsize>(garbage.size()));
+    }
+    open();
+    log::CaptureSink sink(log::Level::Error);
+    EXPECT_FALSE(workspace_->installedPlugins()) << "reading a damaged table must fail, not answer wrongly";
+    EXPECT_TRUE(sink.contains("will be checked when next opened"));
+    EXPECT_TRUE(fs::exists(state_ / "registry.sqlite3.needs-check"));
+
+    open();
+    EXPECT_TRUE(sink.contains("is damaged ("));
+    EXPECT_EQ(count(), 0u);
+    EXPECT_FALSE(fs::exists(state_ / "registry.sqlite3.needs-check"));
+    EXPECT_FALSE(workspace_->checkIntegrity());
+}
+
 TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     workspace_.reset();
     fs::path file = state_ / "registry.sqlite3";

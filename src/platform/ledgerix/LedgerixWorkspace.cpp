@@ -23,6 +23,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <fstream>
 #include <system_error>
 #include <utility>
 
@@ -39,6 +40,8 @@ namespace fs = std::filesystem;
 
 namespace {
 
+// Next to the database: present when damage was seen at run time, so that the next open runs the full check.
+constexpr std::string_view kNeedsCheckSuffix = ".needs-check";
 constexpr std::string_view kEntitlementsFileName = "Entitlements.vrec";
 // Entitlements are a handful of keys; like information documents, anything larger is refused rather than read.
 constexpr size_t kMaxEntitlementsBytes = DirectoryBundle::kMaxInfoBytes;
@@ -336,7 +339,9 @@ bool isDamage(int code) {
 
 bool exec(sqlite3* db, const char* sql) { return sqlite3_exec(db, sql, nullptr, nullptr, nullptr) == SQLITE_OK; }
 
-Opened openStore(const std::string& path, LedgerixWorkspace::Durability durability) {
+enum class OpenCheck { Light, Full };
+
+Opened openStore(const std::string& path, LedgerixWorkspace::Durability durability, OpenCheck check) {
     Opened result;
     sqlite3* db = nullptr;
     int rc =
@@ -371,21 +376,48 @@ Opened openStore(const std::string& path, LedgerixWorkspace::Durability durabili
     if (!exec(db, synchronous) || !exec(db, "PRAGMA foreign_keys=ON"))
         return fail("configure the database", sqlite3_errcode(db));
 
-    // A quick check reads every page once; it finds truncated and overwritten files before they answer wrongly.
-    rc = sqlite3_prepare_v2(db, "PRAGMA quick_check", -1, &stmt, nullptr);
-    std::string verdict;
-    if (rc == SQLITE_OK) {
-        while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
-            if (verdict.empty()) verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0));
+    // The full check reads every page, which a registry of 100,000 plug-ins should not pay at every start. It runs
+    // when the last run saw damage (the marker file); otherwise the open reads the header and the schema and checks
+    // that the file is as long as its header says, which finds truncation and files that are not databases.
+    if (check == OpenCheck::Full) {
+        rc = sqlite3_prepare_v2(db, "PRAGMA quick_check", -1, &stmt, nullptr);
+        std::string verdict;
+        if (rc == SQLITE_OK) {
+            while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
+                if (verdict.empty()) verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0));
+            }
         }
-    }
-    sqlite3_finalize(stmt);
-    if (rc != SQLITE_DONE) return fail("check the database", sqlite3_errcode(db));
-    if (verdict != "ok") {
-        result.damaged = true;
-        result.error = lxError(kLXStoreFailure, "registry database check failed: " + verdict);
-        sqlite3_close(db);
-        return result;
+        sqlite3_finalize(stmt);
+        if (rc != SQLITE_DONE) return fail("check the database", sqlite3_errcode(db));
+        if (verdict != "ok") {
+            result.damaged = true;
+            // The check lists every bad page; the first few say enough.
+            if (verdict.size() > 300) verdict = verdict.substr(0, 300) + "...";
+            result.error = lxError(kLXStoreFailure, "registry database check failed: " + verdict);
+            sqlite3_close(db);
+            return result;
+        }
+    } else {
+        if (!exec(db, "SELECT count(*) FROM sqlite_schema")) return fail("read the schema", sqlite3_errcode(db));
+        int64_t pages = 0, pageSize = 0;
+        for (auto [sql, out] : {std::pair{"PRAGMA page_count", &pages}, std::pair{"PRAGMA page_size", &pageSize}}) {
+            rc = sqlite3_prepare_v2(db, sql, -1, &stmt, nullptr);
+            if (rc == SQLITE_OK) rc = sqlite3_step(stmt);
+            if (rc == SQLITE_ROW) *out = sqlite3_column_int64(stmt, 0);
+            sqlite3_finalize(stmt);
+            if (rc != SQLITE_ROW) return fail("read the database size", sqlite3_errcode(db));
+        }
+        // Pages still in the log may lie beyond the end of the file; without a log the file holds every page.
+        std::error_code ec;
+        bool logPending = fs::exists(path + "-wal", ec) && fs::file_size(path + "-wal", ec) > 0;
+        uintmax_t size = fs::file_size(path, ec);
+        if (!logPending && !ec && size < static_cast<uintmax_t>(pages * pageSize)) {
+            result.damaged = true;
+            result.error = lxError(kLXStoreFailure, formatPrintf("registry database is truncated: %ju of %lld bytes",
+                                                                 size, static_cast<long long>(pages * pageSize)));
+            sqlite3_close(db);
+            return result;
+        }
     }
 
     rc = sqlite3_prepare_v2(db, "PRAGMA user_version", -1, &stmt, nullptr);
@@ -449,15 +481,18 @@ Result<std::shared_ptr<LedgerixWorkspace>> LedgerixWorkspace::open(Options optio
         return lxError(kLXStoreFailure, formatPrintf("cannot make the registry state directory %s: %s",
                                                      options.stateDirectory.string(), ec.message()));
     std::string path = (options.stateDirectory / kDatabaseFileName).string();
-    Opened opened = openStore(path, options.durability);
+    fs::path marker = path + std::string(kNeedsCheckSuffix);
+    bool suspect = fs::exists(marker, ec);
+    Opened opened = openStore(path, options.durability, suspect ? OpenCheck::Full : OpenCheck::Light);
     if (!opened.db && opened.damaged) {
         std::string movedTo;
         if (std::optional<Error> error = quarantine(path, &movedTo)) return *error;
         log::ops().error("registry database %s is damaged (%@); moved it aside to %s and started an empty registry",
                          path, opened.error, movedTo);
-        opened = openStore(path, options.durability);
+        opened = openStore(path, options.durability, OpenCheck::Light);
     }
     if (!opened.db) return *opened.error;
+    if (suspect) fs::remove(marker, ec);
     return std::make_shared<LedgerixWorkspace>(std::move(options), opened.db, Private{});
 }
 
@@ -482,11 +517,23 @@ std::shared_ptr<LedgerixWorkspace::Statement> LedgerixWorkspace::statement(const
     sqlite3_stmt* stmt = nullptr;
     if (sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT, &stmt, nullptr) !=
         SQLITE_OK) {
-        storeError(db_, "prepare a statement");
+        failure("prepare a statement");
         return nullptr;
     }
     statements_.push_back(std::make_shared<Statement>(sql, stmt));
     return statements_.back();
+}
+
+Error LedgerixWorkspace::failure(std::string_view what) {
+    int code = sqlite3_extended_errcode(db_);
+    Error error = storeError(db_, what);
+    if (isDamage(code)) {
+        // The file is damaged somewhere a light open check does not look; make the next open check every page.
+        std::ofstream(databasePath_.string() + std::string(kNeedsCheckSuffix)) << "damage seen: " << what << "\n";
+        log::ops().fault("registry database %s is damaged; it will be checked when next opened",
+                         databasePath_.string());
+    }
+    return error;
 }
 
 void LedgerixWorkspace::LXClearSchemaCaches() {
@@ -555,7 +602,7 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
         }
     }
     if (rc != SQLITE_DONE) {
-        storeError(db_, "read plug-in records");
+        failure("read plug-in records");
         return std::nullopt;
     }
     return rows;
@@ -646,7 +693,7 @@ std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::pluginProxyForUUID(const 
             found.emplace();
             readRowColumns(use, *found);
         } else if (rc != SQLITE_DONE) {
-            storeError(db_, "look a plug-in up by UUID");
+            failure("look a plug-in up by UUID");
         }
     }
     if (!found) {
@@ -686,7 +733,7 @@ std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationProxyFor
                 fields = LXApplicationProxy::Fields{use.text(1).value_or(path), use.text(2), use.text(3),
                                                     use.integer(4) != 0};
             } else if (rc != SQLITE_DONE) {
-                storeError(db_, "look an application up");
+                failure("look an application up");
                 return nullptr;
             }
         }
@@ -751,7 +798,7 @@ std::optional<size_t> LedgerixWorkspace::plugInCount() {
     if (!stmt) return std::nullopt;
     Use use(stmt->get());
     if (use.step() != SQLITE_ROW) {
-        storeError(db_, "count plug-ins");
+        failure("count plug-ins");
         return std::nullopt;
     }
     return static_cast<size_t>(use.integer(0));
@@ -762,14 +809,14 @@ std::optional<Error> LedgerixWorkspace::checkIntegrity() {
         std::lock_guard lock(mutex_);
         sqlite3_stmt* stmt = nullptr;
         if (sqlite3_prepare_v2(db_, "PRAGMA integrity_check", -1, &stmt, nullptr) != SQLITE_OK)
-            return storeError(db_, "run the integrity check");
+            return failure("run the integrity check");
         std::string verdict;
         int rc;
         while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
             if (verdict.empty()) verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0));
         }
         sqlite3_finalize(stmt);
-        if (rc != SQLITE_DONE) return storeError(db_, "run the integrity check");
+        if (rc != SQLITE_DONE) return failure("run the integrity check");
         if (verdict != "ok") return lxError(kLXStoreFailure, "registry integrity check failed: " + verdict);
     }
     std::optional<std::vector<Row>> rows;
@@ -777,7 +824,7 @@ std::optional<Error> LedgerixWorkspace::checkIntegrity() {
         std::lock_guard lock(mutex_);
         rows = selectRowsLocked("", {}, std::nullopt);
         std::shared_ptr<Statement> stmt = statement("SELECT count(*) FROM plugins");
-        if (!rows || !stmt) return storeError(db_, "read every plug-in record");
+        if (!rows || !stmt) return failure("read every plug-in record");
         Use use(stmt->get());
         if (use.step() != SQLITE_ROW || static_cast<size_t>(use.integer(0)) != rows->size())
             return lxError(kLXStoreFailure, "registry holds plug-in rows that cannot be read");
@@ -937,9 +984,9 @@ std::optional<Error> LedgerixWorkspace::makeContainer(const std::string& path) {
 
 std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid& uuid, double registered,
                                                      std::optional<int64_t> replacedApplication) {
-    if (!exec(db_, "BEGIN IMMEDIATE")) return storeError(db_, "begin a registration");
+    if (!exec(db_, "BEGIN IMMEDIATE")) return failure("begin a registration");
     auto rollback = [&](std::string_view what) {
-        Error error = storeError(db_, what);
+        Error error = failure(what);
         exec(db_, "ROLLBACK");
         return error;
     };
@@ -1007,10 +1054,10 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
 std::optional<Error> LedgerixWorkspace::dropApplicationIfEmptyLocked(int64_t applicationId) {
     std::shared_ptr<Statement> stmt = statement(
         "DELETE FROM applications WHERE id = ?1 AND NOT EXISTS (SELECT 1 FROM plugins WHERE application_id = ?1)");
-    if (!stmt) return storeError(db_, "prepare the removal of an empty application");
+    if (!stmt) return failure("prepare the removal of an empty application");
     Use use(stmt->get());
     use.bind(1, applicationId);
-    if (use.step() != SQLITE_DONE) return storeError(db_, "remove an empty application");
+    if (use.step() != SQLITE_DONE) return failure("remove an empty application");
     return std::nullopt;
 }
 
@@ -1035,7 +1082,7 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
         std::unique_lock lock(mutex_);
         bool failed = false;
         std::optional<Row> old = rowAtPathLocked(candidate.path, &failed);
-        if (failed) return storeError(db_, "read the current record");
+        if (failed) return failure("read the current record");
         if (old && old->sameBundleAs(candidate)) {
             lock.unlock();
             log::lx().debug("%s is registered unchanged as %@", candidate.path, old->uuid);
@@ -1056,8 +1103,8 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
                 commitLocked(candidate, uuid, Date::now().secondsSince1970, old ? old->applicationId : std::nullopt))
             return *error;
         std::optional<Row> stored = rowAtPathLocked(candidate.path, &failed);
+        if (!stored) return failure("read the new record back");
         lock.unlock();
-        if (!stored) return storeError(db_, "read the new record back");
         std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(*stored);
         log::lx().debug("registered %@", proxy);
         notifyObservers(true, {proxy});
@@ -1074,7 +1121,7 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
         for (const std::string& path : paths) {
             bool failed = false;
             row = rowAtPathLocked(path, &failed);
-            if (failed) return storeError(db_, "read the current record");
+            if (failed) return failure("read the current record");
             if (row) break;
         }
         if (!row) {
@@ -1088,7 +1135,7 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
             notifyObservers(false, {proxyFromRow(*row)});
             continue;
         }
-        if (!exec(db_, "BEGIN IMMEDIATE")) return storeError(db_, "begin an unregistration");
+        if (!exec(db_, "BEGIN IMMEDIATE")) return failure("begin an unregistration");
         std::shared_ptr<Statement> stmt = statement("DELETE FROM plugins WHERE uuid = ?");
         bool deleted = false;
         if (stmt) {
@@ -1097,7 +1144,7 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
             deleted = use.step() == SQLITE_DONE;
         }
         if (!deleted) {
-            Error error = storeError(db_, "remove a plug-in record");
+            Error error = failure("remove a plug-in record");
             exec(db_, "ROLLBACK");
             return error;
         }
@@ -1108,7 +1155,7 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
             }
         }
         if (!exec(db_, "COMMIT")) {
-            Error error = storeError(db_, "commit an unregistration");
+            Error error = failure("commit an unregistration");
             exec(db_, "ROLLBACK");
             return error;
         }

@@ -81,7 +81,9 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
   private:
     class Statement;
 
-    // REQUIRES: mutex_ held, for every member whose name ends in Locked and for statement().
+    // The error of a failed store operation (logged); damage it reveals marks the file for a full check at next open.
+    Error failure(std::string_view what);
+    // REQUIRES: mutex_ held, for every member whose name ends in Locked, for statement() and failure().
     std::shared_ptr<Statement> statement(const std::string& sql);
     std::optional<std::vector<Row>> selectRowsLocked(std::string_view where, const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument);
