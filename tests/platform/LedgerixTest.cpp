@@ -318,6 +318,25 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
+TEST(LXBexilProxyTest, DictionariesReadFromTextOrValuesAndOldStyleFallsBack) {
+    LXBexilProxy::Fields garbled;
+    garbled.infoVrecDocument = "<not a document";
+    garbled.entitlementsDocument = Document::write(Value::array({})).value();
+    LXBexilProxy broken(garbled);
+    EXPECT_FALSE(broken.infoVrec());
+    EXPECT_FALSE(broken.entitlements()) << "a root that is not a dictionary reads as absent";
+    EXPECT_FALSE(broken.objectForInfoDictionaryKeyOfClassInScope("x", std::nullopt, LXInfoScope::Attributes));
+
+    LXBexilProxy::Fields oldStyle;
+    Value bexil = Value::dictionary({{"RZExtensionAttributes", Value::dictionary({{"a", str("b")}})}});
+    oldStyle.infoVrec = Value::dictionary({{"Bexil", bexil}});
+    oldStyle.infoVrecDocument = "<ignored when a value is given";
+    LXBexilProxy proxy(oldStyle);
+    EXPECT_EQ(proxy.bexilDictionary(), bexil);
+    EXPECT_EQ(proxy.objectForInfoDictionaryKeyOfClassInScope("a", ValueKind::String, LXInfoScope::Attributes),
+              str("b"));
+}
+
 // ---- Registering again ----
 
 using LedgerixReRegistrationTest = LedgerixTest;
@@ -549,6 +568,17 @@ TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     EXPECT_EQ(opened.error().code(), kLXStoreFailure);
     EXPECT_NE(opened.error().localizedDescription()->find("schema version 99"), std::string::npos);
     EXPECT_TRUE(fs::exists(file)) << "a newer database must be left alone";
+}
+
+TEST_F(LedgerixPersistenceTest, DefaultWorkspaceIsSharedAndLivesInTheStateDirectory) {
+    setenv("BX_STATE_DIR", (dir_ / "default").c_str(), 1);
+    auto first = LXApplicationWorkspace::defaultWorkspace();
+    auto second = LXApplicationWorkspace::defaultWorkspace();
+    unsetenv("BX_STATE_DIR");
+    ASSERT_TRUE(first.ok()) << first.error().description();
+    ASSERT_TRUE(second.ok());
+    EXPECT_EQ(first.value(), second.value());
+    EXPECT_TRUE(fs::exists(dir_ / "default/registry.sqlite3"));
 }
 
 TEST_F(LedgerixPersistenceTest, StateDirectoryFollowsTheEnvironment) {
