@@ -234,6 +234,10 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
         ASSERT_TRUE(found) << form;
         EXPECT_EQ(found->pluginUUID(), proxy->pluginUUID()) << form;
     }
+    // Dropping the derived caches changes no answer; records handed out before stay valid.
+    workspace_->LXClearSchemaCaches();
+    EXPECT_EQ(workspace_->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), proxy->bundleURL());
+    EXPECT_TRUE(byUuid->infoVrec());
     EXPECT_FALSE(workspace_->pluginProxyForURL("relative/One.bxplugin"));
     EXPECT_FALSE(workspace_->pluginProxyForURL((bundles_ / "Other.bxplugin").string()));
     EXPECT_FALSE(workspace_->applicationProxyForBundleURL((bundles_ / "Nowhere.app").string()));
