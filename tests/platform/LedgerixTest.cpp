@@ -35,7 +35,7 @@ const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 Value str(std::string_view s) { return Value::string(s); }
 
 // What a test plug-in bundle holds; every field has a usable default.
-struct PlugInSpec {
+struct TestBundle {
     std::string identifier = "com.example.plugin";
     std::string version = "1";
     std::string point = "com.example.point";
@@ -45,19 +45,19 @@ struct PlugInSpec {
     std::vector<std::pair<std::string, Value>> extraAttributes;
 };
 
-Value infoFor(const PlugInSpec& spec) {
+Value infoFor(const TestBundle& shape) {
     MutableDictionary attributes;
     attributes.set("RZExtensionVersion", str("1.0"));
-    for (const auto& [key, value] : spec.extraAttributes) attributes.set(key, value);
+    for (const auto& [key, value] : shape.extraAttributes) attributes.set(key, value);
     MutableDictionary plugIn;
-    plugIn.set("RZExtensionPointIdentifier", str(spec.point));
-    plugIn.set("RZExtensionProtocol", str(spec.protocol));
+    plugIn.set("RZExtensionPointIdentifier", str(shape.point));
+    plugIn.set("RZExtensionProtocol", str(shape.protocol));
     plugIn.set("RZExtensionAttributes", attributes.take());
     MutableDictionary info;
-    if (!spec.identifier.empty()) info.set("BDBundleIdentifier", str(spec.identifier));
-    info.set("BDBundleVersion", str(spec.version));
+    if (!shape.identifier.empty()) info.set("BDBundleIdentifier", str(shape.identifier));
+    info.set("BDBundleVersion", str(shape.version));
     info.set("RZExtension", plugIn.take());
-    for (const auto& [key, value] : spec.extraInfo) info.set(key, value);
+    for (const auto& [key, value] : shape.extraInfo) info.set(key, value);
     return info.take();
 }
 
@@ -120,11 +120,11 @@ class LedgerixTest : public ::testing::Test {
         workspace_->addObserver(observer_);
     }
 
-    fs::path writePlugIn(const fs::path& bundle, const PlugInSpec& spec) {
+    fs::path writePlugIn(const fs::path& bundle, const TestBundle& shape) {
         fs::create_directories(bundle);
-        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", infoFor(spec)).has_value());
-        if (spec.entitlements)
-            EXPECT_FALSE(Document::writeFileAtomically(bundle / "Entitlements.vrec", *spec.entitlements).has_value());
+        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", infoFor(shape)).has_value());
+        if (shape.entitlements)
+            EXPECT_FALSE(Document::writeFileAtomically(bundle / "Entitlements.vrec", *shape.entitlements).has_value());
         else
             fs::remove(bundle / "Entitlements.vrec");
         return bundle;
@@ -612,9 +612,9 @@ class LedgerixQueryTest : public LedgerixTest {
         LedgerixTest::SetUp();
         const char* points[] = {"com.example.a", "com.example.b", "com.example.v01"};
         for (int i = 0; i < 30; ++i) {
-            PlugInSpec spec{.identifier = "com.example.q" + std::to_string(i), .point = points[i % 3]};
-            if (i % 5 == 0) spec.entitlements = Value::dictionary({{"tag", Value::int64(i)}});
-            registerOK(writePlugIn(bundles_ / ("Q.app/PlugIns/Q" + std::to_string(i) + ".bxplugin"), spec));
+            TestBundle shape{.identifier = "com.example.q" + std::to_string(i), .point = points[i % 3]};
+            if (i % 5 == 0) shape.entitlements = Value::dictionary({{"tag", Value::int64(i)}});
+            registerOK(writePlugIn(bundles_ / ("Q.app/PlugIns/Q" + std::to_string(i) + ".bxplugin"), shape));
         }
     }
 
