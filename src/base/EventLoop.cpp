@@ -1,5 +1,7 @@
 #include "base/EventLoop.h"
 
+#include <cstdlib>
+
 #include <atomic>
 #include <cstdio>
 #include <mutex>
@@ -66,7 +68,22 @@ void reportUncaughtException(std::string_view label, std::exception_ptr exceptio
 EventLoop& EventLoop::shared() {
     std::lock_guard lock(sharedMutex);
     // Never destroyed: queues of static objects may still use it while the process exits.
-    if (sharedLoop == nullptr) sharedLoop = new EventLoop(sharedOwnThreads);
+    if (sharedLoop == nullptr) {
+        // The loop's threads must be gone before the process's static objects are: a handler still running during
+        // exit would use Asio's error categories after their destruction. Touching the categories first makes them
+        // outlive the exit handler registered right after, which stops the loop and joins its threads.
+        (void)asio::system_category();
+        (void)asio::error::get_misc_category();
+        (void)asio::error::get_netdb_category();
+        (void)asio::error::get_addrinfo_category();
+        sharedLoop = new EventLoop(sharedOwnThreads);
+        std::atexit([] {
+            EventLoop* loop = sharedLoop;
+            loop->stop();
+            for (std::thread& thread : loop->threads_)
+                if (thread.joinable() && thread.get_id() != std::this_thread::get_id()) thread.join();
+        });
+    }
     return *sharedLoop;
 }
 
