@@ -9,6 +9,7 @@
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDZemClient.h"
 #include "platform/codesign/EntitlementsDirectory.h"
+#include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemListener.h"
@@ -79,7 +80,7 @@ void BXDServer::run() {
 
 void BXDServer::submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
 
-void BXDServer::removedPlugIns(const Value& plugIns) {
+void BXDServer::removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
     // FIXME: terminate the plug-ins' running instances first, once the service manager is there to ask.
     log::ops().debug("removal complete for %@", plugIns);
 }
