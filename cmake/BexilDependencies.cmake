@@ -4,6 +4,8 @@ find_package(Threads REQUIRED)
 find_package(GTest REQUIRED)
 find_package(fmt REQUIRED)
 find_package(pugixml REQUIRED)
+# The application registry's store; only src/platform/ledgerix includes it.
+find_package(SQLite3 REQUIRED)
 pkg_check_modules(SYSTEMD REQUIRED IMPORTED_TARGET libsystemd)
 if(BEXIL_BENCH AND NOT BEXIL_FUZZ)
     find_package(benchmark REQUIRED)

@@ -1,0 +1,91 @@
+#pragma once
+
+// LXApplicationWorkspace is the application registry as the rest of the system sees it: it registers plug-in
+// bundles read from disk, answers look-ups and discovery queries with immutable records, and tells its observers
+// about installs and uninstalls. Implementations are safe to call from any thread; they never hold a lock of their
+// own while calling an observer or a query filter. LedgerixWorkspace is the implementation over SQLite; tests of
+// the layers above may substitute their own.
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace bexil {
+
+class LXApplicationProxy;
+class LXApplicationWorkspaceObserverProtocol;
+class LXBexilProxy;
+
+// The error domain of registry failures, with the codes below.
+inline constexpr std::string_view LXErrorDomain = "Ledgerix";
+
+enum LXErrorCode : int {
+    // The path is not absolute, does not resolve (missing, symbolic-link loop) or is not a directory.
+    kLXBadPath = 1,
+    // The bundle has no readable information document, or its root is not a dictionary.
+    kLXBadInfo = 2,
+    // The information document describes no plug-in ("RZExtension" missing or not a dictionary).
+    kLXNotAPlugIn = 3,
+    // Entitlements.vrec exists but cannot be read, or its root is not a dictionary.
+    kLXBadEntitlements = 4,
+    // The identifier cannot name a data container (empty, ".", "..", a "/" in it, too long).
+    kLXBadIdentifier = 5,
+    // The data container could not be made.
+    kLXContainerFailure = 6,
+    // Nothing is registered at the path.
+    kLXNotRegistered = 7,
+    // The store failed (I/O, corruption, full disk); the registry is unchanged.
+    kLXStoreFailure = 8,
+};
+
+using LXProxyList = std::vector<std::shared_ptr<const LXBexilProxy>>;
+// A discovery filter: called once per candidate with its identifier (empty when it has none) and its entitlements
+// (none when it has none); true keeps the candidate.
+using LXPlugInFilter = std::function<bool(std::string_view identifier, const std::optional<Value>& entitlements)>;
+
+class LXApplicationWorkspace {
+  public:
+    virtual ~LXApplicationWorkspace() = default;
+
+    // The process's shared registry over the default state directory, opened on first use. An error when the
+    // store cannot be opened (the next call tries again).
+    static Result<std::shared_ptr<LXApplicationWorkspace>> defaultWorkspace();
+
+    // Observers are held weakly: an observer that is gone is skipped and forgotten.
+    virtual void addObserver(std::weak_ptr<LXApplicationWorkspaceObserverProtocol> observer) = 0;
+    virtual void removeObserver(const LXApplicationWorkspaceObserverProtocol* observer) = 0;
+
+    // Registers the plug-in bundle at the path (a "file://" URL is accepted). Registering an unchanged bundle again
+    // changes nothing and keeps its UUID; a changed bundle replaces its old record (uninstall, then install). On
+    // failure the registry is unchanged.
+    virtual Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) = 0;
+    // Removes the record of the plug-in registered at the path; the bundle itself need not exist any more.
+    virtual std::optional<Error> unregisterPlugin(std::string_view url) = 0;
+
+    // `_LXClearSchemaCaches`: drops whatever the registry derives and caches; records already handed out stay valid.
+    virtual void LXClearSchemaCaches() = 0;
+
+    // The record of a plug-in UUID, or none.
+    virtual std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid& uuid) = 0;
+    // The record of the plug-in bundle at the path, or none.
+    virtual std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view url) = 0;
+    // The record of the application bundle at the path, with its plug-ins, or none.
+    virtual std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) = 0;
+
+    // Every registered plug-in in registration order; none when the store cannot be read.
+    virtual std::optional<LXProxyList> installedPlugins() = 0;
+    // The plug-ins that may match the query and that pass the filter, in registration order; none when the store
+    // cannot be read. The registry pre-selects by the query's extension point and identifier rules when they are
+    // plain equalities and otherwise lets everything through: the caller re-checks every rule itself. The filter
+    // runs once per candidate on the calling thread.
+    virtual std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
+                                                                       const LXPlugInFilter& filter) = 0;
+};
+
+}  // namespace bexil

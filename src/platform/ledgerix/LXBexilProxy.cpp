@@ -1,0 +1,75 @@
+#include "platform/ledgerix/LXBexilProxy.h"
+
+#include <utility>
+
+#include "base/Document.h"
+
+namespace bexil {
+
+LXBexilProxy::LXBexilProxy(Fields fields) : fields_(std::move(fields)) {}
+
+std::optional<Value> LXBexilProxy::decodeDictionary(const std::optional<Value>& value, const std::string& document) {
+    if (value) return value->isDictionary() ? value : std::nullopt;
+    if (document.empty()) return std::nullopt;
+    Result<Value> decoded = Document::read(document);
+    if (!decoded.ok() || !decoded->isDictionary()) return std::nullopt;
+    return std::move(decoded).value();
+}
+
+const std::optional<Value>& LXBexilProxy::infoVrec() const {
+    std::call_once(infoDecoded_, [this] { info_ = decodeDictionary(fields_.infoVrec, fields_.infoVrecDocument); });
+    return info_;
+}
+
+const std::optional<Value>& LXBexilProxy::entitlements() const {
+    std::call_once(entitlementsDecoded_,
+                   [this] { entitlements_ = decodeDictionary(fields_.entitlements, fields_.entitlementsDocument); });
+    return entitlements_;
+}
+
+std::optional<Value> LXBexilProxy::bexilDictionary() const {
+    const std::optional<Value>& info = infoVrec();
+    if (!info) return std::nullopt;
+    for (std::string_view key : {"RZExtension", "Bexil"}) {
+        if (const Value* entry = info->find(key); entry && entry->isDictionary()) return *entry;
+    }
+    return std::nullopt;
+}
+
+std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std::string_view key,
+                                                                            std::optional<ValueKind> ofClass,
+                                                                            LXInfoScope scope) const {
+    std::optional<Value> dictionary;
+    switch (scope) {
+        case LXInfoScope::Info:
+            dictionary = infoVrec();
+            break;
+        case LXInfoScope::PlugIn:
+            dictionary = bexilDictionary();
+            break;
+        case LXInfoScope::Attributes:
+            if (std::optional<Value> plugIn = bexilDictionary()) {
+                if (const Value* attributes = plugIn->find("RZExtensionAttributes");
+                    attributes && attributes->isDictionary())
+                    dictionary = *attributes;
+            }
+            break;
+    }
+    if (!dictionary) return std::nullopt;
+    const Value* found = dictionary->find(key);
+    if (found == nullptr || (ofClass && found->kind() != *ofClass)) return std::nullopt;
+    return *found;
+}
+
+std::string LXBexilProxy::description() const {
+    std::string text = "<plug-in ";
+    text += fields_.pluginIdentifier.value_or("(no identifier)");
+    text += ' ';
+    text += fields_.pluginUUID ? fields_.pluginUUID->string() : std::string("(no uuid)");
+    text += ' ';
+    text += fields_.bundleURL.value_or("(no path)");
+    text += '>';
+    return text;
+}
+
+}  // namespace bexil

@@ -1,0 +1,106 @@
+#pragma once
+
+// LXBexilProxy is the registry's record of one registered plug-in: where its bundle is, its identifiers, UUID and
+// registration date, its information dictionary and entitlements as read at registration, its containing
+// application, system-volume residence, data container and display names. It is an immutable snapshot shared
+// through std::shared_ptr; any thread may read it. A record read from the store decodes its dictionaries on first
+// use, so look-ups and discovery pay only for what they read.
+//
+// Tests of the layers above build records directly from Fields; the registry builds them from its rows.
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Value.h"
+
+namespace bexil {
+
+class LXApplicationProxy;
+
+// Where objectForInfoDictionaryKeyOfClassInScope looks.
+enum class LXInfoScope : int {
+    // The attributes dictionary ("RZExtensionAttributes" of the plug-in dictionary).
+    Attributes = 0,
+    // The plug-in dictionary ("RZExtension" of the information dictionary).
+    PlugIn = 1,
+    // The whole information dictionary.
+    Info = 2,
+};
+
+class LXBexilProxy {
+  public:
+    struct Fields {
+        // The plug-in bundle's path; URLs are file-system paths throughout.
+        std::optional<std::string> bundleURL;
+        std::optional<std::string> pluginIdentifier;
+        std::optional<std::string> originalIdentifier;
+        std::optional<std::string> bundleIdentifier;
+        std::optional<std::string> bundleVersion;
+        std::optional<Uuid> pluginUUID;
+        std::optional<Date> registrationDate;
+        bool isOnSystemPartition = false;
+        std::shared_ptr<const LXApplicationProxy> containingBundle;
+        std::optional<std::string> dataContainerURL;
+        std::optional<std::string> localizedName;
+        std::optional<std::string> localizedShortName;
+        // The dictionaries, either as values or as their document text (decoded on first use; text that does not
+        // decode, or whose root is not a dictionary, reads as absent). A value wins over text.
+        std::optional<Value> infoVrec;
+        std::optional<Value> entitlements;
+        std::string infoVrecDocument;
+        std::string entitlementsDocument;
+    };
+
+    explicit LXBexilProxy(Fields fields);
+    LXBexilProxy(const LXBexilProxy&) = delete;
+    LXBexilProxy& operator=(const LXBexilProxy&) = delete;
+
+    const std::optional<std::string>& bundleURL() const { return fields_.bundleURL; }
+    // The plug-in's identifier: the plug-in dictionary's "RZExtensionIdentifier", else "BDBundleIdentifier".
+    const std::optional<std::string>& pluginIdentifier() const { return fields_.pluginIdentifier; }
+    // The identifier the bundle was shipped under ("BDBundleIdentifier").
+    const std::optional<std::string>& originalIdentifier() const { return fields_.originalIdentifier; }
+    const std::optional<std::string>& bundleIdentifier() const { return fields_.bundleIdentifier; }
+    // "BDBundleVersion" of the information dictionary.
+    const std::optional<std::string>& bundleVersion() const { return fields_.bundleVersion; }
+    const std::optional<Uuid>& pluginUUID() const { return fields_.pluginUUID; }
+    const std::optional<Date>& registrationDate() const { return fields_.registrationDate; }
+    bool isOnSystemPartition() const { return fields_.isOnSystemPartition; }
+    // The application that contains the plug-in; none outside applications.
+    const std::shared_ptr<const LXApplicationProxy>& containingBundle() const { return fields_.containingBundle; }
+    // The plug-in's data container directory; none for data plug-ins.
+    const std::optional<std::string>& dataContainerURL() const { return fields_.dataContainerURL; }
+    const std::optional<std::string>& localizedName() const { return fields_.localizedName; }
+    const std::optional<std::string>& localizedShortName() const { return fields_.localizedShortName; }
+
+    // The whole information dictionary (Info.vrec), or none.
+    const std::optional<Value>& infoVrec() const;
+    // The plug-in dictionary: "RZExtension" of the information dictionary, else the old-style "Bexil" entry, when
+    // it is a dictionary.
+    std::optional<Value> bexilDictionary() const;
+    // The entitlements dictionary (Entitlements.vrec), or none.
+    const std::optional<Value>& entitlements() const;
+
+    // The value of `key` in the dictionary that `scope` selects, or none. With `ofClass` set, a value of another
+    // kind reads as none.
+    std::optional<Value> objectForInfoDictionaryKeyOfClassInScope(std::string_view key,
+                                                                  std::optional<ValueKind> ofClass,
+                                                                  LXInfoScope scope) const;
+
+    // "<plug-in com.example.hello 0A1B... /path/Hello.bxplugin>" for log lines.
+    std::string description() const;
+
+  private:
+    static std::optional<Value> decodeDictionary(const std::optional<Value>& value, const std::string& document);
+
+    Fields fields_;
+    mutable std::once_flag infoDecoded_;
+    mutable std::once_flag entitlementsDecoded_;
+    mutable std::optional<Value> info_;
+    mutable std::optional<Value> entitlements_;
+};
+
+}  // namespace bexil

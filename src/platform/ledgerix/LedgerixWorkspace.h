@@ -1,0 +1,110 @@
+#pragma once
+
+// LedgerixWorkspace is the application registry over one SQLite database in the state directory (see
+// docs/ledgerix.md for the file, its schema and what survives a crash). It owns the database handle; one internal
+// mutex serialises every use of it, and is never held while an observer or a query filter runs. Records are read
+// one row at a time when asked for; opening a large registry reads nothing but the schema.
+
+#include <filesystem>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/ledgerix/LXApplicationWorkspace.h"
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace bexil {
+
+class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enable_shared_from_this<LedgerixWorkspace> {
+  public:
+    static constexpr int kSchemaVersion = 1;
+    static constexpr std::string_view kDatabaseFileName = "registry.sqlite3";
+    static constexpr std::string_view kContainersDirectoryName = "containers";
+
+    struct Options {
+        // Where the database and the data containers live.
+        std::filesystem::path stateDirectory;
+        // The directory that stands for "/" when deciding whether a bundle lies on the system volume (under
+        // "<root>/System/"). Only tests change it, so that they never need a real /System.
+        std::filesystem::path rootDirectory = "/";
+    };
+
+    // Opens (creating or migrating) the registry. A damaged database is moved aside and an empty one started (logged);
+    // a database of a newer schema, or a state directory that cannot be made, is an error.
+    static Result<std::shared_ptr<LedgerixWorkspace>> open(Options options);
+    // $BX_STATE_DIR, else /var/lib/bexil for root, else $XDG_STATE_HOME/bexil ($HOME/.local/state/bexil).
+    static std::filesystem::path defaultStateDirectory();
+
+    ~LedgerixWorkspace() override;
+    LedgerixWorkspace(const LedgerixWorkspace&) = delete;
+    LedgerixWorkspace& operator=(const LedgerixWorkspace&) = delete;
+
+    void addObserver(std::weak_ptr<LXApplicationWorkspaceObserverProtocol> observer) override;
+    void removeObserver(const LXApplicationWorkspaceObserverProtocol* observer) override;
+    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) override;
+    std::optional<Error> unregisterPlugin(std::string_view url) override;
+    void LXClearSchemaCaches() override;
+    std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid& uuid) override;
+    std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view url) override;
+    std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) override;
+    std::optional<LXProxyList> installedPlugins() override;
+    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
+                                                               const LXPlugInFilter& filter) override;
+
+    const std::filesystem::path& databasePath() const { return databasePath_; }
+    // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
+    std::optional<Error> checkIntegrity();
+    // The number of registered plug-ins; none when the store cannot be read.
+    std::optional<size_t> plugInCount();
+
+    // Use open(); public only for make_shared.
+    struct Private;
+    LedgerixWorkspace(Options options, sqlite3* db, const Private&);
+    // The columns of one stored record; defined and used only by the implementation.
+    struct Row;
+
+  private:
+    class Statement;
+
+    // REQUIRES: mutex_ held, for every member whose name ends in Locked and for statement().
+    std::shared_ptr<Statement> statement(const std::string& sql);
+    std::optional<std::vector<Row>> selectRowsLocked(std::string_view where, const std::vector<std::string>& arguments,
+                                                     std::optional<int64_t> integerArgument);
+    std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
+                                               std::optional<int64_t> integerArgument);
+    // The record at exactly this path; none when there is none or the store failed (then *failed is set).
+    std::optional<Row> rowAtPathLocked(const std::string& path, bool* failed);
+    std::optional<Error> commitLocked(const Row& row, const Uuid& uuid, double registered,
+                                      std::optional<int64_t> replacedApplication);
+    std::optional<Error> dropApplicationIfEmptyLocked(int64_t applicationId);
+
+    // The bundle at the URL as it would be stored, or why it cannot be registered.
+    Result<Row> readBundle(std::string_view url);
+    static std::optional<Error> makeContainer(const std::string& path);
+    // The paths under which a URL may be registered: its lexical form, then its real path when that differs.
+    static std::vector<std::string> candidatePaths(std::string_view url);
+
+    std::shared_ptr<const LXBexilProxy> proxyFromRow(const Row& row);
+    LXProxyList proxiesFromRows(const std::vector<Row>& rows);
+    std::shared_ptr<const LXApplicationProxy> applicationFromRow(const Row& row);
+    LXProxyList plugInsOfApplication(int64_t applicationId);
+    void notifyObservers(bool didInstall, const LXProxyList& plugins);
+
+    const Options options_;
+    const std::filesystem::path databasePath_;
+    // Serialises every use of db_ and of the statement cache.
+    std::mutex mutex_;
+    sqlite3* db_;
+    std::vector<std::shared_ptr<Statement>> statements_;
+    // Bundles whose real path begins with this lie on the system volume ("/System/" unless tests move the root).
+    std::string systemPrefix_;
+    std::mutex observersMutex_;
+    std::vector<std::weak_ptr<LXApplicationWorkspaceObserverProtocol>> observers_;
+};
+
+}  // namespace bexil

@@ -1,0 +1,735 @@
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <random>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/Document.h"
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXApplicationWorkspaceObserverProtocol.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/ledgerix/LedgerixWorkspace.h"
+#include "platform/log/CaptureSink.h"
+
+// Test bundles are described with designated initializers that name only what differs from the defaults; g++ 12
+// warns about the members left to their default initializers, which is the point.
+#pragma GCC diagnostic ignored "-Wmissing-field-initializers"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
+
+Value str(std::string_view s) { return Value::string(s); }
+
+// What a test plug-in bundle holds; every field has a usable default.
+struct PlugInSpec {
+    std::string identifier = "com.example.plugin";
+    std::string version = "1";
+    std::string point = "com.example.point";
+    std::string protocol = "ExampleProtocol";
+    std::optional<Value> entitlements;
+    std::vector<std::pair<std::string, Value>> extraInfo;
+    std::vector<std::pair<std::string, Value>> extraAttributes;
+};
+
+Value infoFor(const PlugInSpec& spec) {
+    MutableDictionary attributes;
+    attributes.set("RZExtensionVersion", str("1.0"));
+    for (const auto& [key, value] : spec.extraAttributes) attributes.set(key, value);
+    MutableDictionary plugIn;
+    plugIn.set("RZExtensionPointIdentifier", str(spec.point));
+    plugIn.set("RZExtensionProtocol", str(spec.protocol));
+    plugIn.set("RZExtensionAttributes", attributes.take());
+    MutableDictionary info;
+    if (!spec.identifier.empty()) info.set("BDBundleIdentifier", str(spec.identifier));
+    info.set("BDBundleVersion", str(spec.version));
+    info.set("RZExtension", plugIn.take());
+    for (const auto& [key, value] : spec.extraInfo) info.set(key, value);
+    return info.take();
+}
+
+// Records observer callbacks in order as "install <uuid>" / "uninstall <uuid>", and whether the record was still
+// registered when its uninstall was announced.
+class RecordingObserver : public LXApplicationWorkspaceObserverProtocol {
+  public:
+    explicit RecordingObserver(LedgerixWorkspace* workspace) : workspace_(workspace) {}
+    void pluginsDidInstall(const LXProxyList& plugins) override {
+        std::lock_guard lock(mutex_);
+        for (const auto& p : plugins) events.push_back("install " + p->pluginUUID()->string());
+    }
+    void pluginsWillUninstall(const LXProxyList& plugins) override {
+        // Looking records up from inside the callback must work: the registry holds no lock here.
+        bool stillThere = workspace_ && workspace_->pluginProxyForUUID(*plugins.front()->pluginUUID()) != nullptr;
+        std::lock_guard lock(mutex_);
+        for (const auto& p : plugins) events.push_back("uninstall " + p->pluginUUID()->string());
+        uninstallsSeenRegistered += stillThere ? 1 : 0;
+    }
+    std::vector<std::string> snapshot() {
+        std::lock_guard lock(mutex_);
+        return events;
+    }
+
+    std::vector<std::string> events;
+    int uninstallsSeenRegistered = 0;
+
+  private:
+    LedgerixWorkspace* workspace_;
+    std::mutex mutex_;
+};
+
+// A private state directory, bundle directory and root for each test, removed afterwards.
+class LedgerixTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        std::string pattern = (fs::temp_directory_path() / "bexil-ledgerix-XXXXXX").string();
+        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+        dir_ = fs::canonical(pattern);
+        state_ = dir_ / "state";
+        bundles_ = dir_ / "bundles";
+        root_ = dir_ / "root";
+        fs::create_directories(bundles_);
+        fs::create_directories(root_);
+        open();
+    }
+    void TearDown() override {
+        workspace_.reset();
+        std::error_code ec;
+        fs::remove_all(dir_, ec);
+    }
+
+    void open() {
+        workspace_.reset();
+        observer_.reset();
+        Result<std::shared_ptr<LedgerixWorkspace>> opened = LedgerixWorkspace::open({state_, root_});
+        ASSERT_TRUE(opened.ok()) << opened.error().description();
+        workspace_ = std::move(opened).value();
+        observer_ = std::make_shared<RecordingObserver>(workspace_.get());
+        workspace_->addObserver(observer_);
+    }
+
+    fs::path writePlugIn(const fs::path& bundle, const PlugInSpec& spec) {
+        fs::create_directories(bundle);
+        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", infoFor(spec)).has_value());
+        if (spec.entitlements)
+            EXPECT_FALSE(Document::writeFileAtomically(bundle / "Entitlements.vrec", *spec.entitlements).has_value());
+        else
+            fs::remove(bundle / "Entitlements.vrec");
+        return bundle;
+    }
+    void writeApplication(const fs::path& app, const std::string& identifier) {
+        fs::create_directories(app);
+        Value info = Value::dictionary({{"BDBundleIdentifier", str(identifier)}, {"BDBundleName", str("App")}});
+        ASSERT_FALSE(Document::writeFileAtomically(app / "Info.vrec", info).has_value());
+    }
+    std::shared_ptr<const LXBexilProxy> registerOK(const fs::path& path) {
+        Result<std::shared_ptr<const LXBexilProxy>> result = workspace_->registerPlugin(path.string());
+        EXPECT_TRUE(result.ok()) << (result.ok() ? "" : result.error().description());
+        return result.ok() ? result.value() : nullptr;
+    }
+    size_t count() { return workspace_->plugInCount().value_or(SIZE_MAX); }
+
+    fs::path dir_, state_, bundles_, root_;
+    std::shared_ptr<LedgerixWorkspace> workspace_;
+    std::shared_ptr<RecordingObserver> observer_;
+};
+
+// ---- Registering, unregistering and looking up ----
+
+using LedgerixRegistrationTest = LedgerixTest;
+
+TEST_F(LedgerixRegistrationTest, RecordCarriesWhatTheBundleAndItsApplicationSay) {
+    const fs::path bonjour = kExamples / "Greeter.app/PlugIns/Bonjour.bxplugin";
+    auto before = Date::now();
+    auto proxy = registerOK(bonjour);
+    ASSERT_TRUE(proxy);
+    EXPECT_EQ(proxy->bundleURL(), fs::canonical(bonjour).string());
+    EXPECT_EQ(proxy->pluginIdentifier(), "com.example.greeter.bonjour");
+    EXPECT_EQ(proxy->originalIdentifier(), "com.example.greeter.bonjour");
+    EXPECT_EQ(proxy->bundleVersion(), "1");
+    EXPECT_EQ(proxy->localizedName(), "Bonjour");
+    EXPECT_FALSE(proxy->isOnSystemPartition());
+    ASSERT_TRUE(proxy->registrationDate());
+    EXPECT_GE(proxy->registrationDate()->secondsSince1970, before.secondsSince1970 - 1);
+    ASSERT_TRUE(proxy->entitlements());
+    EXPECT_TRUE(proxy->entitlements()->contains("com.quorvel.developer.replace-plugin"));
+    ASSERT_TRUE(proxy->bexilDictionary());
+    EXPECT_EQ(proxy->bexilDictionary()->get("RZExtensionPointIdentifier"), str("com.example.greeting"));
+
+    // The three scopes of the keyed look-up, and the kind restriction.
+    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("BDBundleVersion", std::nullopt, LXInfoScope::Info),
+              str("1"));
+    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("PrincipalClass", std::nullopt, LXInfoScope::PlugIn),
+              str("BonjourGreeting"));
+    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("Language", std::nullopt, LXInfoScope::Attributes),
+              str("fr"));
+    EXPECT_FALSE(proxy->objectForInfoDictionaryKeyOfClassInScope("Language", std::nullopt, LXInfoScope::Info));
+    EXPECT_FALSE(
+        proxy->objectForInfoDictionaryKeyOfClassInScope("Language", ValueKind::Array, LXInfoScope::Attributes));
+
+    ASSERT_TRUE(proxy->containingBundle());
+    EXPECT_EQ(proxy->containingBundle()->bundleURL(), fs::canonical(kExamples / "Greeter.app").string());
+    EXPECT_EQ(proxy->containingBundle()->bundleIdentifier(), "com.example.greeter");
+    EXPECT_FALSE(proxy->containingBundle()->isPlaceholder());
+
+    // A plug-in that carries code gets its data container, with a tmp directory, private to its owner.
+    ASSERT_TRUE(proxy->dataContainerURL());
+    EXPECT_EQ(*proxy->dataContainerURL(), (state_ / "containers/com.example.greeter.bonjour").string());
+    EXPECT_TRUE(fs::is_directory(*proxy->dataContainerURL() + "/tmp"));
+    EXPECT_EQ(fs::status(*proxy->dataContainerURL()).permissions() & fs::perms::all, fs::perms::owner_all);
+
+    EXPECT_EQ(observer_->snapshot(), std::vector<std::string>{"install " + proxy->pluginUUID()->string()});
+}
+
+TEST_F(LedgerixRegistrationTest, DataPlugInGetsNoContainerAndApplicationIsRecordedOnce) {
+    auto stationery = registerOK(kExamples / "Notes.app/PlugIns/Stationery.bxplugin");
+    auto clipper = registerOK(kExamples / "Notes.app/PlugIns/Clipper.wexa");
+    ASSERT_TRUE(stationery && clipper);
+    EXPECT_FALSE(stationery->dataContainerURL());
+    EXPECT_TRUE(clipper->dataContainerURL());
+    EXPECT_FALSE(stationery->entitlements());
+
+    auto app = workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string());
+    ASSERT_TRUE(app);
+    ASSERT_EQ(app->plugins().size(), 2u);
+    // In path order: Clipper.wexa before Stationery.bxplugin.
+    EXPECT_EQ(app->plugins()[0]->pluginUUID(), clipper->pluginUUID());
+    EXPECT_EQ(app->plugins()[1]->pluginUUID(), stationery->pluginUUID());
+    // The containing bundle of a record lists the same plug-ins, read when asked.
+    EXPECT_EQ(stationery->containingBundle()->plugins().size(), 2u);
+
+    // Unregistering the last plug-in forgets the application.
+    EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Clipper.wexa").string()));
+    EXPECT_EQ(workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string())->plugins().size(), 1u);
+    EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Stationery.bxplugin").string()));
+    EXPECT_FALSE(workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string()));
+}
+
+TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
+    fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {.identifier = "com.example.one"});
+    auto proxy = registerOK(bundle);
+    ASSERT_TRUE(proxy);
+    auto byUuid = workspace_->pluginProxyForUUID(*proxy->pluginUUID());
+    ASSERT_TRUE(byUuid);
+    EXPECT_EQ(byUuid->bundleURL(), bundle.string());
+    EXPECT_FALSE(workspace_->pluginProxyForUUID(Uuid::random()));
+
+    fs::create_directory_symlink(bundle, dir_ / "link.bxplugin");
+    for (std::string form :
+         {bundle.string(), "file://" + bundle.string(), bundle.string() + "/",
+          (bundles_ / "A.app/PlugIns/../PlugIns/One.bxplugin").string(), (dir_ / "link.bxplugin").string()}) {
+        auto found = workspace_->pluginProxyForURL(form);
+        ASSERT_TRUE(found) << form;
+        EXPECT_EQ(found->pluginUUID(), proxy->pluginUUID()) << form;
+    }
+    EXPECT_FALSE(workspace_->pluginProxyForURL("relative/One.bxplugin"));
+    EXPECT_FALSE(workspace_->pluginProxyForURL((bundles_ / "Other.bxplugin").string()));
+    EXPECT_FALSE(workspace_->applicationProxyForBundleURL((bundles_ / "Nowhere.app").string()));
+}
+
+TEST_F(LedgerixRegistrationTest, UnregisterWorksAfterTheBundleIsGoneAndRefusesUnknownPaths) {
+    fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {});
+    auto proxy = registerOK(bundle);
+    fs::remove_all(bundles_ / "A.app");
+    EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
+    EXPECT_EQ(count(), 0u);
+    EXPECT_FALSE(workspace_->pluginProxyForUUID(*proxy->pluginUUID()));
+    EXPECT_EQ(observer_->snapshot(), (std::vector<std::string>{"install " + proxy->pluginUUID()->string(),
+                                                               "uninstall " + proxy->pluginUUID()->string()}));
+    EXPECT_EQ(observer_->uninstallsSeenRegistered, 1);
+    // The data container outlives the registration: it holds the plug-in's data for a later reinstall.
+    EXPECT_TRUE(fs::is_directory(*proxy->dataContainerURL()));
+
+    std::optional<Error> error = workspace_->unregisterPlugin(bundle.string());
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), LXErrorDomain);
+    EXPECT_EQ(error->code(), kLXNotRegistered);
+}
+
+TEST_F(LedgerixRegistrationTest, ResidenceOutsideApplicationsAndOnTheSystemVolume) {
+    // The workspace's root stands for "/", so <root>/System/ is the system volume here.
+    auto system = registerOK(writePlugIn(root_ / "System/Library/PlugIns/Clock.bxplugin", {.identifier = "a.clock"}));
+    auto lookalike = registerOK(writePlugIn(root_ / "SystemX/Clock.bxplugin", {.identifier = "b.clock"}));
+    auto outside = registerOK(writePlugIn(bundles_ / "Loose.bxplugin", {.identifier = "c.loose"}));
+    auto notAnApp = registerOK(writePlugIn(bundles_ / "Folder/PlugIns/In.bxplugin", {.identifier = "d.in"}));
+    ASSERT_TRUE(system && lookalike && outside && notAnApp);
+    EXPECT_TRUE(system->isOnSystemPartition());
+    EXPECT_FALSE(lookalike->isOnSystemPartition());
+    EXPECT_FALSE(outside->isOnSystemPartition());
+    // Outside applications the registry records the plug-in all the same; whether it may be used is not its call.
+    EXPECT_FALSE(system->containingBundle());
+    EXPECT_FALSE(outside->containingBundle());
+    EXPECT_FALSE(notAnApp->containingBundle());
+}
+
+TEST_F(LedgerixRegistrationTest, ApplicationWithoutInformationIsAPlaceholder) {
+    auto proxy = registerOK(writePlugIn(bundles_ / "Half.app/PlugIns/P.bxplugin", {}));
+    ASSERT_TRUE(proxy && proxy->containingBundle());
+    EXPECT_TRUE(proxy->containingBundle()->isPlaceholder());
+    EXPECT_EQ(proxy->containingBundle()->localizedName(), "Half");
+
+    // Once the application is complete, registering again records that.
+    writeApplication(bundles_ / "Half.app", "com.example.half");
+    auto again = registerOK(bundles_ / "Half.app/PlugIns/P.bxplugin");
+    ASSERT_TRUE(again && again->containingBundle());
+    EXPECT_FALSE(again->containingBundle()->isPlaceholder());
+    EXPECT_EQ(again->containingBundle()->bundleIdentifier(), "com.example.half");
+}
+
+TEST_F(LedgerixRegistrationTest, PlugInWithoutIdentifierIsRecordedWithoutContainer) {
+    auto proxy = registerOK(kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin");
+    ASSERT_TRUE(proxy);
+    EXPECT_FALSE(proxy->pluginIdentifier());
+    EXPECT_FALSE(proxy->dataContainerURL());
+}
+
+TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
+    constexpr int kPerThread = 25;
+    std::vector<fs::path> paths;
+    for (int i = 0; i < 2 * kPerThread; ++i)
+        paths.push_back(writePlugIn(bundles_ / ("App.app/PlugIns/P" + std::to_string(i) + ".bxplugin"),
+                                    {.identifier = "com.example.p" + std::to_string(i)}));
+    std::atomic<int> failures = 0;
+    auto worker = [&](int offset) {
+        for (int i = offset; i < 2 * kPerThread; i += 2) {
+            if (!workspace_->registerPlugin(paths[i].string()).ok()) ++failures;
+            if (!workspace_->pluginProxyForURL(paths[i].string())) ++failures;
+        }
+    };
+    std::thread a(worker, 0), b(worker, 1);
+    a.join();
+    b.join();
+    EXPECT_EQ(failures, 0);
+    EXPECT_EQ(count(), paths.size());
+    EXPECT_EQ(workspace_->applicationProxyForBundleURL((bundles_ / "App.app").string())->plugins().size(),
+              paths.size());
+    EXPECT_FALSE(workspace_->checkIntegrity());
+}
+
+// ---- Registering again ----
+
+using LedgerixReRegistrationTest = LedgerixTest;
+
+TEST_F(LedgerixReRegistrationTest, UnchangedBundleKeepsItsRecordSilently) {
+    fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {});
+    auto first = registerOK(bundle);
+    auto second = registerOK(bundle);
+    ASSERT_TRUE(first && second);
+    EXPECT_EQ(first->pluginUUID(), second->pluginUUID());
+    EXPECT_EQ(first->registrationDate(), second->registrationDate());
+    EXPECT_EQ(observer_->snapshot().size(), 1u);
+    EXPECT_EQ(count(), 1u);
+}
+
+TEST_F(LedgerixReRegistrationTest, NewVersionIsUninstallThenInstallUnderANewUuid) {
+    fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {.version = "1"});
+    auto old = registerOK(bundle);
+    writePlugIn(bundle, {.version = "2"});
+    auto updated = registerOK(bundle);
+    ASSERT_TRUE(old && updated);
+    EXPECT_NE(old->pluginUUID(), updated->pluginUUID());
+    EXPECT_EQ(updated->bundleVersion(), "2");
+    EXPECT_EQ(observer_->snapshot(), (std::vector<std::string>{"install " + old->pluginUUID()->string(),
+                                                               "uninstall " + old->pluginUUID()->string(),
+                                                               "install " + updated->pluginUUID()->string()}));
+    // The uninstall was announced while the old record was still registered.
+    EXPECT_EQ(observer_->uninstallsSeenRegistered, 1);
+    EXPECT_FALSE(workspace_->pluginProxyForUUID(*old->pluginUUID()));
+    EXPECT_EQ(count(), 1u);
+}
+
+TEST_F(LedgerixReRegistrationTest, SameVersionWithNewContentKeepsUuidButIsAnnounced) {
+    fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {});
+    auto old = registerOK(bundle);
+    writePlugIn(bundle, {.entitlements =
+                             Value::dictionary({{"com.quorvel.developer.auto-elect-plugin", Value::boolean(true)}})});
+    auto updated = registerOK(bundle);
+    ASSERT_TRUE(old && updated);
+    EXPECT_EQ(old->pluginUUID(), updated->pluginUUID());
+    ASSERT_TRUE(updated->entitlements());
+    EXPECT_EQ(updated->entitlements()->get("com.quorvel.developer.auto-elect-plugin"), Value::boolean(true));
+    // Whoever caches the record by UUID hears that it went and came back, so it rebuilds it.
+    EXPECT_EQ(observer_->snapshot().size(), 3u);
+    EXPECT_EQ(observer_->snapshot()[1], "uninstall " + old->pluginUUID()->string());
+}
+
+TEST_F(LedgerixReRegistrationTest, ObserversThatAreGoneAreSkipped) {
+    observer_.reset();
+    fs::path bundle = writePlugIn(bundles_ / "One.bxplugin", {});
+    EXPECT_TRUE(registerOK(bundle));
+    EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
+}
+
+// ---- Persistence and damage ----
+
+using LedgerixPersistenceTest = LedgerixTest;
+
+TEST_F(LedgerixPersistenceTest, RecordsSurviveReopening) {
+    auto hello = registerOK(kExamples / "Greeter.app/PlugIns/Hello.bxplugin");
+    auto clock = registerOK(writePlugIn(root_ / "System/Library/PlugIns/Clock.bxplugin", {.identifier = "s.clock"}));
+    ASSERT_TRUE(hello && clock);
+    open();
+    auto hello2 = workspace_->pluginProxyForUUID(*hello->pluginUUID());
+    auto clock2 = workspace_->pluginProxyForURL(clock->bundleURL().value());
+    ASSERT_TRUE(hello2 && clock2);
+    EXPECT_EQ(hello2->registrationDate(), hello->registrationDate());
+    EXPECT_EQ(hello2->infoVrec(), hello->infoVrec());
+    EXPECT_EQ(hello2->dataContainerURL(), hello->dataContainerURL());
+    EXPECT_EQ(hello2->containingBundle()->bundleURL(), hello->containingBundle()->bundleURL());
+    EXPECT_EQ(clock2->pluginUUID(), clock->pluginUUID());
+    EXPECT_TRUE(clock2->isOnSystemPartition());
+    // Registering the unchanged bundle after a restart still keeps its UUID.
+    EXPECT_EQ(registerOK(kExamples / "Greeter.app/PlugIns/Hello.bxplugin")->pluginUUID(), hello->pluginUUID());
+    EXPECT_EQ(observer_->snapshot().size(), 0u);
+}
+
+TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReported) {
+    constexpr int kBundles = 40;
+    std::vector<fs::path> paths;
+    for (int i = 0; i < kBundles; ++i)
+        paths.push_back(
+            writePlugIn(bundles_ / ("App" + std::to_string(i % 4) + ".app/PlugIns/P" + std::to_string(i) + ".bxplugin"),
+                        {.identifier = "com.example.crash" + std::to_string(i)}));
+    workspace_.reset();
+
+    std::mt19937 random(12345);
+    std::set<std::string> reported;
+    for (int round = 0; round < 8; ++round) {
+        int pipeEnds[2];
+        ASSERT_EQ(pipe(pipeEnds), 0);
+        pid_t child = fork();
+        ASSERT_GE(child, 0);
+        if (child == 0) {
+            // Register, re-register with new versions and unregister for ever; report each registration that
+            // returned, so the parent can check that it survived the kill.
+            close(pipeEnds[0]);
+            auto opened = LedgerixWorkspace::open({state_, root_});
+            if (!opened.ok()) _exit(3);
+            auto workspace = opened.value();
+            for (unsigned step = 0;; ++step) {
+                const fs::path& path = paths[step % kBundles];
+                if (step % 7 == 3) {
+                    (void)workspace->unregisterPlugin(path.string());
+                    continue;
+                }
+                if (!workspace->registerPlugin(path.string()).ok()) _exit(4);
+                std::string line = path.string() + "\n";
+                if (write(pipeEnds[1], line.data(), line.size()) != static_cast<ssize_t>(line.size())) _exit(5);
+            }
+        }
+        close(pipeEnds[1]);
+        std::this_thread::sleep_for(std::chrono::milliseconds(20 + random() % 150));
+        kill(child, SIGKILL);
+        int status = 0;
+        waitpid(child, &status, 0);
+        ASSERT_TRUE(WIFSIGNALED(status)) << "the registering child stopped by itself: " << WEXITSTATUS(status);
+        std::string text;
+        char buffer[4096];
+        ssize_t n;
+        while ((n = read(pipeEnds[0], buffer, sizeof buffer)) > 0) text.append(buffer, n);
+        close(pipeEnds[0]);
+
+        // The last reported registration for a path may since have been undone by an unregistration the child
+        // made later; only the final reported path is certain to be registered.
+        std::string last;
+        for (size_t start = 0, end; (end = text.find('\n', start)) != std::string::npos; start = end + 1)
+            last = text.substr(start, end - start);
+
+        auto opened = LedgerixWorkspace::open({state_, root_});
+        ASSERT_TRUE(opened.ok()) << opened.error().description();
+        auto workspace = opened.value();
+        EXPECT_FALSE(workspace->checkIntegrity()) << "round " << round;
+        auto installed = workspace->installedPlugins();
+        ASSERT_TRUE(installed);
+        std::set<std::string> uuids;
+        for (const auto& proxy : *installed) {
+            EXPECT_TRUE(proxy->infoVrec());
+            EXPECT_TRUE(uuids.insert(proxy->pluginUUID()->string()).second);
+            EXPECT_EQ(workspace->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), proxy->bundleURL());
+        }
+        if (!last.empty()) {
+            reported.insert(last);
+            EXPECT_TRUE(workspace->pluginProxyForURL(last)) << "round " << round << ": lost " << last;
+        }
+    }
+    EXPECT_FALSE(reported.empty()) << "the child never got a registration done before being killed";
+}
+
+TEST_F(LedgerixPersistenceTest, GarbageDatabaseIsMovedAsideAndRegistryStartsEmpty) {
+    registerOK(writePlugIn(bundles_ / "One.bxplugin", {}));
+    workspace_.reset();
+    const std::string garbage(8192, 'x');
+    std::ofstream(state_ / "registry.sqlite3", std::ios::binary | std::ios::trunc) << garbage;
+    fs::remove(state_ / "registry.sqlite3-wal");
+
+    log::CaptureSink sink(log::Level::Error);
+    open();
+    EXPECT_EQ(count(), 0u);
+    EXPECT_TRUE(sink.contains("is damaged"));
+    bool keptAside = false;
+    for (const auto& entry : fs::directory_iterator(state_)) {
+        if (entry.path().filename().string().starts_with("registry.sqlite3.corrupt-") &&
+            entry.path().extension() != ".sqlite3-wal") {
+            std::ifstream in(entry.path(), std::ios::binary);
+            std::string kept((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+            keptAside = keptAside || kept == garbage;
+        }
+    }
+    EXPECT_TRUE(keptAside);
+    // The fresh registry works.
+    EXPECT_TRUE(registerOK(bundles_ / "One.bxplugin"));
+}
+
+TEST_F(LedgerixPersistenceTest, TruncatedDatabaseIsDetectedAtOpen) {
+    for (int i = 0; i < 150; ++i)
+        registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
+                               {.identifier = "com.example.t" + std::to_string(i)}));
+    workspace_.reset();
+    fs::path file = state_ / "registry.sqlite3";
+    ASSERT_FALSE(fs::exists(state_ / "registry.sqlite3-wal")) << "closing should have checkpointed the log";
+    fs::resize_file(file, fs::file_size(file) / 2);
+
+    log::CaptureSink sink(log::Level::Error);
+    open();
+    EXPECT_FALSE(workspace_->checkIntegrity());
+    EXPECT_EQ(count(), 0u);
+    EXPECT_TRUE(sink.contains("is damaged"));
+}
+
+TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
+    workspace_.reset();
+    fs::path file = state_ / "registry.sqlite3";
+    // user_version is the big-endian 32-bit number at offset 60 of the database header.
+    std::fstream stream(file, std::ios::in | std::ios::out | std::ios::binary);
+    stream.seekp(60);
+    const char version[4] = {0, 0, 0, 99};
+    stream.write(version, 4);
+    stream.close();
+    Result<std::shared_ptr<LedgerixWorkspace>> opened = LedgerixWorkspace::open({state_, root_});
+    ASSERT_FALSE(opened.ok());
+    EXPECT_EQ(opened.error().code(), kLXStoreFailure);
+    EXPECT_NE(opened.error().localizedDescription()->find("schema version 99"), std::string::npos);
+    EXPECT_TRUE(fs::exists(file)) << "a newer database must be left alone";
+}
+
+TEST_F(LedgerixPersistenceTest, StateDirectoryFollowsTheEnvironment) {
+    std::string saved = getenv("BX_STATE_DIR") ? getenv("BX_STATE_DIR") : "";
+    setenv("BX_STATE_DIR", dir_.c_str(), 1);
+    EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), dir_);
+    unsetenv("BX_STATE_DIR");
+    if (geteuid() != 0) {
+        std::string savedXdg = getenv("XDG_STATE_HOME") ? getenv("XDG_STATE_HOME") : "";
+        setenv("XDG_STATE_HOME", "/xdg/state", 1);
+        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), fs::path("/xdg/state/bexil"));
+        if (savedXdg.empty())
+            unsetenv("XDG_STATE_HOME");
+        else
+            setenv("XDG_STATE_HOME", savedXdg.c_str(), 1);
+    } else {
+        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), fs::path("/var/lib/bexil"));
+    }
+    if (!saved.empty()) setenv("BX_STATE_DIR", saved.c_str(), 1);
+}
+
+// ---- Discovery queries ----
+
+class LedgerixQueryTest : public LedgerixTest {
+  protected:
+    void SetUp() override {
+        LedgerixTest::SetUp();
+        const char* points[] = {"com.example.a", "com.example.b", "com.example.v01"};
+        for (int i = 0; i < 30; ++i) {
+            PlugInSpec spec{.identifier = "com.example.q" + std::to_string(i), .point = points[i % 3]};
+            if (i % 5 == 0) spec.entitlements = Value::dictionary({{"tag", Value::int64(i)}});
+            registerOK(writePlugIn(bundles_ / ("Q.app/PlugIns/Q" + std::to_string(i) + ".bxplugin"), spec));
+        }
+    }
+
+    // Runs the query and returns the identifiers the filter saw; the filter keeps what `keep` says.
+    std::vector<std::string> filtered(const Value& query, std::optional<LXProxyList>* result = nullptr,
+                                      std::function<bool(std::string_view)> keep = nullptr) {
+        std::vector<std::string> seen;
+        auto matches = workspace_->pluginsMatchingQueryApplyFilter(
+            query, [&](std::string_view identifier, const std::optional<Value>&) {
+                seen.emplace_back(identifier);
+                return keep ? keep(identifier) : true;
+            });
+        EXPECT_TRUE(matches);
+        if (result) *result = matches;
+        return seen;
+    }
+};
+
+TEST_F(LedgerixQueryTest, ExtensionPointEqualityCallsTheFilterOnlyForThatPoint) {
+    std::optional<LXProxyList> result;
+    auto seen = filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.b")}}), &result,
+                         [](std::string_view id) { return id != "com.example.q1"; });
+    EXPECT_EQ(seen.size(), 10u);
+    for (const std::string& id : seen) EXPECT_EQ(std::stoi(id.substr(13)) % 3, 1) << id;
+    EXPECT_EQ(result->size(), 9u);  // the filter's refusal counts
+    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("=com.example.a")}})).size(), 10u);
+}
+
+TEST_F(LedgerixQueryTest, DigitRunsCompareByValueSoLeadingZerosStillMatch) {
+    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.v1")}})).size(), 10u);
+    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionIdentifier", str("com.example.q007")}})),
+              std::vector<std::string>{"com.example.q7"});
+}
+
+TEST_F(LedgerixQueryTest, IdentifierListsAndCombinedRulesNarrowTogether) {
+    Value ids = Value::array({str("com.example.q3"), str("=com.example.q4"), str("com.example.q99")});
+    auto seen = filtered(Value::dictionary({{"RZExtensionIdentifier", ids}}));
+    EXPECT_EQ(seen, (std::vector<std::string>{"com.example.q3", "com.example.q4"}));
+    seen = filtered(
+        Value::dictionary({{"RZExtensionIdentifier", ids}, {"RZExtensionPointIdentifier", str("com.example.a")}}));
+    EXPECT_EQ(seen, std::vector<std::string>{"com.example.q3"});
+}
+
+TEST_F(LedgerixQueryTest, RulesThatAreNotPlainEqualityLetEveryPlugInThrough) {
+    for (Value pattern :
+         {str(">=com.example.b"), str("<>com.example.a"), str("?ZQ-CONFORMS:public.item"), Value::boolean(true),
+          Value::int64(1), Value::array({}), Value::array({str("com.example.a"), str("<com.example.b")}),
+          Value::dictionary({{"x", Value::int64(1)}})}) {
+        EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", pattern}})).size(), 30u)
+            << pattern.description();
+    }
+    EXPECT_EQ(filtered(Value::dictionary({})).size(), 30u);
+    EXPECT_EQ(filtered(Value::dictionary({{"RZUserElection", str("1")}, {"Language", str("fr")}})).size(), 30u);
+    // A query that is not a dictionary pins nothing either.
+    EXPECT_EQ(filtered(str("nonsense")).size(), 30u);
+}
+
+TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandidates) {
+    registerOK(writePlugIn(
+        bundles_ / "W1.bxplugin",
+        {.identifier = "com.example.w1", .extraAttributes = {{"RZExtensionPointIdentifier", str("com.example.zzz")}}}));
+    registerOK(writePlugIn(
+        bundles_ / "W2.bxplugin",
+        {.identifier = "com.example.w2", .extraInfo = {{"RZExtensionPointIdentifier", str("com.example.yyy")}}}));
+    auto noId = writePlugIn(bundles_ / "W3.bxplugin", {.identifier = ""});
+    registerOK(noId);
+    auto seen = filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.b")}}));
+    EXPECT_EQ(seen.size(), 12u);
+    EXPECT_NE(std::find(seen.begin(), seen.end(), "com.example.w1"), seen.end());
+    EXPECT_NE(std::find(seen.begin(), seen.end(), "com.example.w2"), seen.end());
+    // Without an identifier a plug-in may still answer an identifier rule from its dictionaries.
+    seen = filtered(Value::dictionary({{"RZExtensionIdentifier", str("com.example.q1")}}));
+    EXPECT_EQ(seen, (std::vector<std::string>{"com.example.q1", ""}));
+}
+
+TEST_F(LedgerixQueryTest, FilterSeesEntitlementsAndMayCallTheRegistry) {
+    int withEntitlements = 0;
+    auto matches = workspace_->pluginsMatchingQueryApplyFilter(
+        Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.a")}}),
+        [&](std::string_view identifier, const std::optional<Value>& entitlements) {
+            // Re-entering the registry from the filter must not deadlock.
+            EXPECT_TRUE(workspace_->installedPlugins());
+            if (entitlements) {
+                ++withEntitlements;
+                EXPECT_EQ(entitlements->get("tag"), Value::int64(std::stoi(std::string(identifier.substr(13)))));
+            }
+            return true;
+        });
+    ASSERT_TRUE(matches);
+    EXPECT_EQ(matches->size(), 10u);
+    EXPECT_EQ(withEntitlements, 2);  // q0 and q15 serve point a and carry entitlements
+}
+
+// ---- Bundles the registry refuses ----
+
+using LedgerixBadBundleTest = LedgerixTest;
+
+TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchanged) {
+    // A good registration that must survive every failure below, including failures at its own path.
+    fs::path good = writePlugIn(bundles_ / "A.app/PlugIns/Good.bxplugin", {.identifier = "com.example.good"});
+    auto original = registerOK(good);
+    ASSERT_TRUE(original);
+    auto write = [](const fs::path& file, const std::string& text) {
+        fs::create_directories(file.parent_path());
+        std::ofstream(file, std::ios::binary | std::ios::trunc) << text;
+    };
+    for (const char* name : {"Empty", "ArrayRoot", "NoPlugIn", "StringPlugIn"})
+        fs::create_directories(bundles_ / (std::string(name) + ".bxplugin"));
+    write(bundles_ / "File.bxplugin", "not a directory");
+    write(bundles_ / "Garbled.bxplugin/Info.vrec", "<vrec version=\"1\"><dict><key>x</key>");
+    ASSERT_FALSE(Document::writeFileAtomically(bundles_ / "ArrayRoot.bxplugin/Info.vrec", Value::array({str("x")})));
+    ASSERT_FALSE(Document::writeFileAtomically(bundles_ / "NoPlugIn.bxplugin/Info.vrec",
+                                               Value::dictionary({{"BDBundleIdentifier", str("x.y")}})));
+    ASSERT_FALSE(Document::writeFileAtomically(
+        bundles_ / "StringPlugIn.bxplugin/Info.vrec",
+        Value::dictionary({{"BDBundleIdentifier", str("x.y")}, {"RZExtension", str("nope")}})));
+    writePlugIn(bundles_ / "BadEntitlements.bxplugin", {.identifier = "x.bad1"});
+    write(bundles_ / "BadEntitlements.bxplugin/Entitlements.vrec", "garbage");
+    writePlugIn(bundles_ / "ArrayEntitlements.bxplugin", {.identifier = "x.bad2", .entitlements = Value::array({})});
+    writePlugIn(bundles_ / "Escape.bxplugin", {.identifier = "../../escape"});
+    writePlugIn(bundles_ / "Dots.bxplugin", {.identifier = ".."});
+    fs::create_directory_symlink(bundles_ / "LoopB.bxplugin", bundles_ / "LoopA.bxplugin");
+    fs::create_directory_symlink(bundles_ / "LoopA.bxplugin", bundles_ / "LoopB.bxplugin");
+
+    struct Case {
+        std::string path;
+        int code;
+    };
+    const Case cases[] = {
+        {"relative/Thing.bxplugin", kLXBadPath},
+        {"", kLXBadPath},
+        {std::string("/tmp/nul\0byte", 13), kLXBadPath},
+        {(bundles_ / "Missing.bxplugin").string(), kLXBadPath},
+        {(bundles_ / "File.bxplugin").string(), kLXBadPath},
+        {(bundles_ / "LoopA.bxplugin").string(), kLXBadPath},
+        {(bundles_ / "Empty.bxplugin").string(), kLXBadInfo},
+        {(bundles_ / "Garbled.bxplugin").string(), kLXBadInfo},
+        {(bundles_ / "ArrayRoot.bxplugin").string(), kLXBadInfo},
+        {(bundles_ / "NoPlugIn.bxplugin").string(), kLXNotAPlugIn},
+        {(bundles_ / "StringPlugIn.bxplugin").string(), kLXNotAPlugIn},
+        {(bundles_ / "BadEntitlements.bxplugin").string(), kLXBadEntitlements},
+        {(bundles_ / "ArrayEntitlements.bxplugin").string(), kLXBadEntitlements},
+        {(bundles_ / "Escape.bxplugin").string(), kLXBadIdentifier},
+        {(bundles_ / "Dots.bxplugin").string(), kLXBadIdentifier},
+    };
+    for (const Case& c : cases) {
+        auto result = workspace_->registerPlugin(c.path);
+        ASSERT_FALSE(result.ok()) << c.path;
+        EXPECT_EQ(result.error().domain(), LXErrorDomain) << c.path;
+        EXPECT_EQ(result.error().code(), c.code) << c.path << ": " << result.error().description();
+        EXPECT_TRUE(result.error().localizedDescription().has_value());
+    }
+    EXPECT_FALSE(fs::exists(dir_ / "escape"));
+
+    // The good bundle turns bad in place: the old record stays as it was.
+    write(good / "Info.vrec", "broken");
+    EXPECT_FALSE(workspace_->registerPlugin(good.string()).ok());
+    EXPECT_EQ(count(), 1u);
+    auto still = workspace_->pluginProxyForURL(good.string());
+    ASSERT_TRUE(still);
+    EXPECT_EQ(still->pluginUUID(), original->pluginUUID());
+    EXPECT_EQ(still->infoVrec(), original->infoVrec());
+    EXPECT_EQ(observer_->snapshot().size(), 1u);
+    EXPECT_FALSE(workspace_->checkIntegrity());
+}
+
+TEST_F(LedgerixBadBundleTest, ContainerThatCannotBeMadeRefusesTheRegistration) {
+    // A file where the container directory should be.
+    fs::create_directories(state_ / "containers");
+    std::ofstream(state_ / "containers/com.example.blocked") << "in the way";
+    auto result = workspace_->registerPlugin(
+        writePlugIn(bundles_ / "Blocked.bxplugin", {.identifier = "com.example.blocked"}).string());
+    ASSERT_FALSE(result.ok());
+    EXPECT_EQ(result.error().code(), kLXContainerFailure);
+    EXPECT_EQ(count(), 0u);
+}
+
+}  // namespace
+}  // namespace bexil
