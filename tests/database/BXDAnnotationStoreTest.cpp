@@ -1,0 +1,608 @@
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <optional>
+#include <random>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "base/Document.h"
+#include "database/BXDAnnotationStore.h"
+#include "platform/log/CaptureSink.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+Value dict(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
+Value integer(int64_t i) { return Value::int64(i); }
+
+// A record that reads and writes annotations under a key of its own, as the daemon's plug-in records do.
+struct KeyedRecord {
+    std::string key;
+    std::string annotationKey() const { return key; }
+};
+
+// Restores an environment variable when the test ends.
+class ScopedEnv {
+  public:
+    ScopedEnv(const char* name, const std::optional<std::string>& value) : name_(name) {
+        if (const char* old = getenv(name)) old_ = old;
+        if (value)
+            setenv(name, value->c_str(), 1);
+        else
+            unsetenv(name);
+    }
+    ~ScopedEnv() {
+        if (old_)
+            setenv(name_, old_->c_str(), 1);
+        else
+            unsetenv(name_);
+    }
+
+  private:
+    const char* name_;
+    std::optional<std::string> old_;
+};
+
+// Makes one named call fail with a given errno (after `afterCalls` successful ones), otherwise the real calls.
+class FailingFileSystem : public Document::FileSystem {
+  public:
+    FailingFileSystem(std::string call, int error, int afterCalls = 0)
+        : call_(std::move(call)), error_(error), afterCalls_(afterCalls) {}
+    void heal() { call_.clear(); }
+
+    int open(const char* path, int flags, mode_t mode) override {
+        return shouldFail("open") ? -1 : FileSystem::open(path, flags, mode);
+    }
+    ssize_t write(int fd, const void* bytes, size_t count) override {
+        return shouldFail("write") ? -1 : FileSystem::write(fd, bytes, count);
+    }
+    int fsync(int fd) override { return shouldFail("fsync") ? -1 : FileSystem::fsync(fd); }
+    int rename(const char* from, const char* to) override {
+        return shouldFail("rename") ? -1 : FileSystem::rename(from, to);
+    }
+
+  private:
+    bool shouldFail(const std::string& call) {
+        if (call != call_) return false;
+        if (afterCalls_-- > 0) return false;
+        errno = error_;
+        return true;
+    }
+    std::string call_;
+    int error_;
+    int afterCalls_;
+};
+
+class AnnotationStoreTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        directory_ = fs::path(BEXIL_BINARY_DIR) / "annotation-store-test" /
+                     ::testing::UnitTest::GetInstance()->current_test_info()->name();
+        fs::remove_all(directory_);
+        fs::create_directories(directory_);
+        path_ = directory_ / "Bexil-Annotations";
+        legacyPath_ = directory_ / "state" / "containers" / "com.quorvel.bxd" / "Bexil-Annotations";
+        stateDir_.emplace("BX_STATE_DIR", (directory_ / "state").string());
+    }
+    void TearDown() override {
+        stateDir_.reset();
+        fs::remove_all(directory_);
+    }
+
+    static Value document(Value data, int64_t version = 16) {
+        return dict({{"version", integer(version)}, {"data", std::move(data)}});
+    }
+    static void put(const fs::path& path, const Value& root) {
+        fs::create_directories(path.parent_path());
+        ASSERT_FALSE(Document::writeFileAtomically(path, root));
+    }
+    static void putText(const fs::path& path, const std::string& text) {
+        std::ofstream(path, std::ios::binary) << text;
+    }
+    static std::string text(const fs::path& path) {
+        std::ifstream in(path, std::ios::binary);
+        return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+    }
+    // The document on disk, which must load.
+    Value onDisk() const {
+        Result<Value> root = Document::readFile(path_);
+        EXPECT_TRUE(root.ok()) << root.error().description();
+        return root.ok() ? *root : Value();
+    }
+    std::string store() const { return path_.string(); }
+
+    fs::path directory_, path_, legacyPath_;
+    std::optional<ScopedEnv> stateDir_;
+    log::CaptureSink capture_;
+};
+
+// ---- loading at start ----
+
+TEST_F(AnnotationStoreTest, MissingDocumentStartsEmptySilentlyAndWritesOnlyAtTheFirstChange) {
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotationsURL(), path_);
+    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+    EXPECT_TRUE(capture_.matching("unable to").empty());
+    EXPECT_FALSE(capture_.contains("migrating"));
+    EXPECT_FALSE(fs::exists(path_));
+
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "com.example.a");
+    EXPECT_EQ(onDisk(), document(dict({{"com.example.a", dict({{"election", integer(1)}})}})));
+}
+
+TEST_F(AnnotationStoreTest, WhatIsSavedLoadsBackEqualWithNestedExtensionValues) {
+    Value extension = dict({
+        {"list", Value::array({integer(-3), Value::string("two"), Value::boolean(true)})},
+        {"nested", dict({{"deeper", dict({{"real", Value::real(2.5)}})}})},
+        {"when", Value::date(Date{1700000000.25})},
+        {"bytes", Value::data(std::vector<uint8_t>{0, 1, 254, 255})},
+        {"big", Value::uint64(18446744073709551615ull)},
+        {"empty", Value::string("")},
+    });
+    {
+        BXDAnnotationStore annotations(store());
+        annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}, {"extension", extension}}), "a");
+        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
+    }
+    BXDAnnotationStore reloaded(store());
+    EXPECT_EQ(reloaded.annotationForIdentifier("a"), dict({{"election", integer(2)}, {"extension", extension}}));
+    EXPECT_EQ(reloaded.annotationForIdentifier("b"), dict({{"election", integer(1)}}));
+    EXPECT_TRUE(reloaded.annotationForIdentifier("c").isNull());
+    EXPECT_EQ(onDisk().get("version"), integer(16));
+}
+
+TEST_F(AnnotationStoreTest, OtherVersionIsLoggedResetAndOverwrittenAtTheFirstChange) {
+    put(path_, document(dict({{"old", dict({{"election", integer(1)}})}}), 15));
+    std::string before = text(path_);
+
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+    std::vector<log::CaptureSink::Entry> lines = capture_.matching("unable to load annotation database");
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0].level, log::Level::Error);
+    EXPECT_EQ(lines[0].category, "ops");
+    EXPECT_EQ(lines[0].message, "unable to load annotation database:" + path_.string() +
+                                    " error:Error Domain=Bexil Code=7 \"found database version 15 needed version "
+                                    "16\" (resetting)");
+    // Kept for inspection until something is written.
+    EXPECT_EQ(text(path_), before);
+
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "new");
+    EXPECT_EQ(onDisk(), document(dict({{"new", dict({{"election", integer(2)}})}})));
+}
+
+TEST_F(AnnotationStoreTest, MissingOrNonNumericVersionCountsAsZero) {
+    for (Value root : {dict({{"data", Value::emptyDictionary()}}),
+                       dict({{"version", Value::string("16")}, {"data", Value::emptyDictionary()}})}) {
+        put(path_, root);
+        capture_.clear();
+        BXDAnnotationStore annotations(store());
+        EXPECT_TRUE(capture_.contains("\"found database version 0 needed version 16\" (resetting)"))
+            << root.description();
+    }
+}
+
+TEST_F(AnnotationStoreTest, DocumentWithoutDataIsAnEmptyMap) {
+    put(path_, dict({{"version", integer(16)}}));
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+    EXPECT_TRUE(capture_.matching("unable to").empty());
+}
+
+TEST_F(AnnotationStoreTest, CorruptOrTruncatedDocumentsAreLoggedAndReset) {
+    put(path_, document(dict({{"a", dict({{"election", integer(1)}, {"extension", dict({{"x", integer(9)}})}})}})));
+    std::string good = text(path_);
+    struct Case {
+        const char* name;
+        std::string contents;
+    };
+    std::vector<Case> cases = {
+        {"truncated", good.substr(0, good.size() / 2)},
+        {"cut before the end tag", good.substr(0, good.rfind("</vrec>"))},
+        {"empty", ""},
+        {"not xml", "\x01\x02garbage\xff"},
+        {"root is an array", "<vrec><array><integer>16</integer></array></vrec>"},
+        {"data is a string",
+         "<vrec><dict><key>version</key><integer>16</integer><key>data</key><string>x</string></dict></vrec>"},
+    };
+    for (const Case& c : cases) {
+        putText(path_, c.contents);
+        capture_.clear();
+        BXDAnnotationStore annotations(store());
+        EXPECT_EQ(annotations.annotations(), Value::emptyDictionary()) << c.name;
+        std::optional<log::CaptureSink::Entry> line = capture_.find("unable to load annotation database:");
+        ASSERT_TRUE(line.has_value()) << c.name;
+        EXPECT_EQ(line->level, log::Level::Error);
+        EXPECT_TRUE(line->message.starts_with("unable to load annotation database:" + path_.string() + " error:"))
+            << line->message;
+        EXPECT_TRUE(line->message.ends_with(" (resetting)")) << line->message;
+        EXPECT_NE(line->message.find("BexilDocument"), std::string::npos) << c.name << ": " << line->message;
+        // Serves and saves as usual afterwards.
+        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
+        EXPECT_EQ(onDisk(), document(dict({{"b", dict({{"election", integer(1)}})}}))) << c.name;
+    }
+}
+
+TEST_F(AnnotationStoreTest, UnreadableDocumentIsLoggedWithItsPosixError) {
+    fs::create_directories(path_);  // a directory where the file should be
+    BXDAnnotationStore annotations(store());
+    EXPECT_TRUE(capture_.contains("error:Error Domain=POSIX Code=" + std::to_string(EISDIR)));
+    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+}
+
+TEST_F(AnnotationStoreTest, LoadFailureLeavesTheMapUnchanged) {
+    BXDAnnotationStore annotations(store());
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "kept");
+    Value before = annotations.annotations();
+
+    fs::path other = directory_ / "other";
+    put(other, document(dict({{"x", Value::emptyDictionary()}}), 17));
+    std::optional<Error> error = annotations.loadDb(other);
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(*error, BXError(7, "found database version 17 needed version 16"));
+    EXPECT_EQ(annotations.annotations(), before);
+
+    error = annotations.loadDb(directory_ / "absent");
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(error->domain(), BXPosixErrorDomain);
+    EXPECT_EQ(error->code(), ENOENT);
+    EXPECT_EQ(annotations.annotations(), before);
+}
+
+// ---- the legacy document ----
+
+TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedWhenThereIsNoDocument) {
+    Value legacy = dict({{"com.example.old", dict({{"election", integer(1)}, {"keep", Value::string("me")}})}});
+    put(legacyPath_, document(legacy));
+    std::string legacyText = text(legacyPath_);
+
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotations(), legacy);
+    std::optional<log::CaptureSink::Entry> line = capture_.find("migrating shared annotations");
+    ASSERT_TRUE(line.has_value());
+    EXPECT_EQ(line->level, log::Level::Info);
+    EXPECT_EQ(line->message, "migrating shared annotations");
+    EXPECT_TRUE(capture_.matching("unable to").empty());
+    EXPECT_EQ(onDisk(), document(legacy));
+    // Only ever read.
+    EXPECT_EQ(text(legacyPath_), legacyText);
+}
+
+TEST_F(AnnotationStoreTest, LegacyDocumentReplacesABadDocumentAndIsIgnoredBesideAGoodOne) {
+    Value legacy = dict({{"legacy", dict({{"election", integer(3)}})}});
+    put(legacyPath_, document(legacy));
+
+    putText(path_, "<vrec><dict>");
+    {
+        BXDAnnotationStore annotations(store());
+        EXPECT_TRUE(capture_.contains("(resetting)"));
+        EXPECT_TRUE(capture_.contains("migrating shared annotations"));
+        EXPECT_EQ(annotations.annotations(), legacy);
+        EXPECT_EQ(onDisk(), document(legacy));
+    }
+
+    Value current = dict({{"current", dict({{"election", integer(1)}})}});
+    put(path_, document(current));
+    capture_.clear();
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotations(), current);
+    EXPECT_FALSE(capture_.contains("migrating"));
+}
+
+TEST_F(AnnotationStoreTest, LegacyDocumentOfAnotherVersionIsNotMigrated) {
+    put(legacyPath_, document(dict({{"legacy", Value::emptyDictionary()}}), 15));
+    BXDAnnotationStore annotations(store());
+    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+    EXPECT_FALSE(capture_.contains("migrating"));
+    EXPECT_FALSE(fs::exists(path_));
+}
+
+TEST_F(AnnotationStoreTest, UnsavableMigrationIsLoggedAndServedFromMemory) {
+    Value legacy = dict({{"legacy", dict({{"election", integer(1)}})}});
+    put(legacyPath_, document(legacy));
+    FailingFileSystem failing("fsync", EIO);
+
+    BXDAnnotationStore annotations(store(), failing);
+    EXPECT_EQ(annotations.annotationForIdentifier("legacy"), dict({{"election", integer(1)}}));
+    EXPECT_TRUE(annotations.diskBehind());
+    std::optional<log::CaptureSink::Entry> line = capture_.find("unable to save migrated annotations to ");
+    ASSERT_TRUE(line.has_value());
+    EXPECT_EQ(line->level, log::Level::Error);
+    EXPECT_TRUE(line->message.starts_with("unable to save migrated annotations to " + path_.string() +
+                                          " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
+        << line->message;
+    EXPECT_FALSE(fs::exists(path_));
+}
+
+TEST_F(AnnotationStoreTest, ContainerIsUnderTheStateDirectory) {
+    EXPECT_EQ(BXDAnnotationStore::containerURL(), directory_ / "state" / "containers" / "com.quorvel.bxd" / "");
+    EXPECT_EQ(BXDAnnotationStore::defaultDatabaseURL(), fs::path("/var/db/Bexil-Annotations"));
+}
+
+TEST_F(AnnotationStoreTest, NoContainerStopsTheDaemonWhenTheLegacyDocumentIsNeeded) {
+    // An unprivileged process with no state directory at all; as root, the child drops to nobody first.
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(10);
+        unsetenv("BX_STATE_DIR");
+        unsetenv("XDG_STATE_HOME");
+        unsetenv("HOME");
+        log::CaptureSink capture;
+        try {
+            BXDAnnotationStore annotations(store());
+        } catch (const InternalInconsistency& e) {
+            bool logged = capture.contains("failed to get storage container: error=2");
+            _exit(std::string(e.what()) == "unable to locate user container: error 2" && logged ? 0 : 11);
+        }
+        _exit(12);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(WEXITSTATUS(status), 0) << "10: cannot drop privileges, 11: wrong message or log, 12: no exception";
+}
+
+// ---- setting annotations ----
+
+TEST_F(AnnotationStoreTest, SettingMergesIntoTheStoredAnnotation) {
+    put(path_, document(dict({{"p", dict({{"election", integer(1)},
+                                          {"extension", dict({{"a", integer(1)}, {"b", integer(2)}})},
+                                          {"unknown", Value::string("kept")}})}})));
+    BXDAnnotationStore annotations(store());
+    KeyedRecord plugIn{"p"};
+
+    annotations.setAnnotationForPlugIn(dict({{"election", integer(2)}}), plugIn);
+    Value expected = dict({{"election", integer(2)},
+                           {"extension", dict({{"a", integer(1)}, {"b", integer(2)}})},
+                           {"unknown", Value::string("kept")}});
+    EXPECT_EQ(annotations.annotationForPlugIn(plugIn), expected);
+    EXPECT_EQ(onDisk().get("data").get("p"), expected);
+
+    // A given "extension" replaces the stored one whole; the merge is one level deep.
+    annotations.setAnnotationForPlugIn(dict({{"extension", dict({{"c", integer(3)}})}}), plugIn);
+    expected =
+        dict({{"election", integer(2)}, {"extension", dict({{"c", integer(3)}})}, {"unknown", Value::string("kept")}});
+    EXPECT_EQ(annotations.annotationForPlugIn(plugIn), expected);
+
+    // An empty annotation changes nothing.
+    annotations.setAnnotationForPlugIn(Value::emptyDictionary(), plugIn);
+    EXPECT_EQ(annotations.annotationForPlugIn(plugIn), expected);
+    EXPECT_EQ(onDisk().get("data").get("p"), expected);
+}
+
+TEST_F(AnnotationStoreTest, NewKeyStoresTheGivenAnnotation) {
+    BXDAnnotationStore annotations(store());
+    Value given = dict({{"election", integer(0)}, {"extension", Value::emptyDictionary()}});
+    annotations.setAnnotationForIdentifier(given, "fresh");
+    EXPECT_EQ(annotations.annotationForIdentifier("fresh"), given);
+    annotations.setAnnotationForIdentifier(Value::emptyDictionary(), "blank");
+    EXPECT_EQ(annotations.annotationForIdentifier("blank"), Value::emptyDictionary());
+    EXPECT_EQ(onDisk().get("data"), dict({{"blank", Value::emptyDictionary()}, {"fresh", given}}));
+}
+
+TEST_F(AnnotationStoreTest, NullRemovesTheWholeEntry) {
+    BXDAnnotationStore annotations(store());
+    KeyedRecord plugIn{"p"};
+    annotations.setAnnotationForPlugIn(dict({{"election", integer(1)}, {"extension", dict({})}}), plugIn);
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "other");
+
+    annotations.setAnnotationForPlugIn(Value(), plugIn);
+    EXPECT_TRUE(annotations.annotationForPlugIn(plugIn).isNull());
+    EXPECT_EQ(onDisk().get("data"), dict({{"other", dict({{"election", integer(1)}})}}));
+
+    // Setting after removal starts from nothing: nothing of the removed entry comes back.
+    annotations.setAnnotationForPlugIn(dict({{"election", integer(2)}}), plugIn);
+    EXPECT_EQ(annotations.annotationForPlugIn(plugIn), dict({{"election", integer(2)}}));
+
+    // Removing what is not there is harmless.
+    annotations.setAnnotationForIdentifier(Value(), "never-set");
+    EXPECT_EQ(onDisk().get("data").count(), 2u);
+}
+
+TEST_F(AnnotationStoreTest, RecordsWithTheSameAnnotationKeyShareOneAnnotation) {
+    BXDAnnotationStore annotations(store());
+    KeyedRecord version1{"com.example.share"}, version2{"com.example.share"}, other{"com.example.other"};
+    annotations.setAnnotationForPlugIn(dict({{"election", integer(1)}}), version1);
+    annotations.setAnnotationForPlugIn(dict({{"extension", dict({{"k", integer(1)}})}}), version2);
+    Value both = dict({{"election", integer(1)}, {"extension", dict({{"k", integer(1)}})}});
+    EXPECT_EQ(annotations.annotationForPlugIn(version1), both);
+    EXPECT_EQ(annotations.annotationForPlugIn(version2), both);
+    EXPECT_TRUE(annotations.annotationForPlugIn(other).isNull());
+}
+
+TEST_F(AnnotationStoreTest, EntryThatIsNotADictionaryReadsAsNoneAndSurvivesUntilSet) {
+    put(path_, document(dict({{"odd", Value::string("not a dictionary")}, {"ok", dict({})}})));
+    BXDAnnotationStore annotations(store());
+    EXPECT_TRUE(annotations.annotationForIdentifier("odd").isNull());
+
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "ok");
+    EXPECT_EQ(onDisk().get("data").get("odd"), Value::string("not a dictionary"));
+
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "odd");
+    EXPECT_EQ(onDisk().get("data").get("odd"), dict({{"election", integer(2)}}));
+}
+
+TEST_F(AnnotationStoreTest, AnnotationOfAnotherKindIsABrokenInvariantAndChangesNothing) {
+    BXDAnnotationStore annotations(store());
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "p");
+    for (Value bad : {Value::string("x"), integer(1), Value::emptyArray()})
+        EXPECT_THROW(annotations.setAnnotationForIdentifier(bad, "p"), InternalInconsistency);
+    EXPECT_EQ(annotations.annotationForIdentifier("p"), dict({{"election", integer(1)}}));
+}
+
+// ---- failed writes ----
+
+TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
+    for (const char* call : {"open", "write", "fsync", "rename"}) {
+        SCOPED_TRACE(call);
+        fs::remove(path_);
+        {
+            BXDAnnotationStore annotations(store());
+            annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "a");
+        }
+        std::string before = text(path_);
+        FailingFileSystem failing(call, EIO);
+        BXDAnnotationStore annotations(store(), failing);
+        capture_.clear();
+
+        annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "a");
+        EXPECT_EQ(annotations.annotationForIdentifier("a"), dict({{"election", integer(2)}}));
+        EXPECT_TRUE(annotations.diskBehind());
+        EXPECT_EQ(text(path_), before);
+        std::optional<log::CaptureSink::Entry> line = capture_.find("unable to save annotations:");
+        ASSERT_TRUE(line.has_value());
+        EXPECT_EQ(line->level, log::Level::Error);
+        EXPECT_EQ(line->category, "ops");
+        EXPECT_TRUE(line->message.starts_with("unable to save annotations:" + path_.string() +
+                                              " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
+            << line->message;
+        std::vector<std::string> names;
+        for (const auto& entry : fs::directory_iterator(directory_)) names.push_back(entry.path().filename());
+        EXPECT_EQ(std::count_if(names.begin(), names.end(),
+                                [](const std::string& n) { return n.find(".tmp-") != std::string::npos; }),
+                  0);
+
+        // The next successful save writes the whole map, the change whose save failed included.
+        failing.heal();
+        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
+        EXPECT_FALSE(annotations.diskBehind());
+        EXPECT_EQ(onDisk(),
+                  document(dict({{"a", dict({{"election", integer(2)}})}, {"b", dict({{"election", integer(1)}})}})));
+    }
+}
+
+TEST_F(AnnotationStoreTest, FailedDirectorySyncIsReportedThoughTheDocumentIsReplaced) {
+    // The second fsync of a save is the directory's.
+    FailingFileSystem failing("fsync", EIO, 1);
+    BXDAnnotationStore annotations(store(), failing);
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "a");
+    EXPECT_TRUE(capture_.contains("unable to save annotations:"));
+    EXPECT_TRUE(annotations.diskBehind());
+    EXPECT_EQ(onDisk(), document(dict({{"a", dict({{"election", integer(1)}})}})));
+}
+
+TEST_F(AnnotationStoreTest, UnrepresentableValueFailsEverySaveUntilItIsRemoved) {
+    BXDAnnotationStore annotations(store());
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "good");
+    std::string before = text(path_);
+
+    Value withUuid = dict({{"extension", dict({{"id", Value::uuid(Uuid::random())}})}});
+    annotations.setAnnotationForIdentifier(withUuid, "bad");
+    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "good");
+    EXPECT_EQ(capture_.count("unable to save annotations:" + path_.string() + " error:Error Domain=BexilDocument"), 2u);
+    EXPECT_EQ(text(path_), before);
+    EXPECT_EQ(annotations.annotationForIdentifier("bad"), withUuid);
+
+    annotations.setAnnotationForIdentifier(Value(), "bad");
+    EXPECT_FALSE(annotations.diskBehind());
+    EXPECT_EQ(onDisk(), document(dict({{"good", dict({{"election", integer(2)}})}})));
+}
+
+// ---- crashes ----
+
+TEST_F(AnnotationStoreTest, LeftoversOfInterruptedWritesAreRemovedAtStart) {
+    pid_t dead = fork();
+    ASSERT_GE(dead, 0);
+    if (dead == 0) _exit(0);
+    ASSERT_EQ(waitpid(dead, nullptr, 0), dead);
+
+    fs::path stale = directory_ / ("Bexil-Annotations.tmp-" + std::to_string(dead) + "-00aa");
+    fs::path live = directory_ / ("Bexil-Annotations.tmp-" + std::to_string(getppid()) + "-00bb");
+    fs::path foreign = directory_ / ("Other.tmp-" + std::to_string(dead) + "-00cc");
+    for (const fs::path& p : {stale, live, foreign}) putText(p, "partial");
+
+    BXDAnnotationStore annotations(store());
+    EXPECT_FALSE(fs::exists(stale));
+    EXPECT_TRUE(fs::exists(live));
+    EXPECT_TRUE(fs::exists(foreign));
+}
+
+// The bytes of the large value written at `step`, so that a torn write cannot pass for a whole one.
+std::vector<uint8_t> blobFor(int64_t step) {
+    std::vector<uint8_t> bytes(96 * 1024);
+    for (size_t i = 0; i < bytes.size(); ++i) bytes[i] = static_cast<uint8_t>((step * 131 + i * 7) >> (i % 3));
+    return bytes;
+}
+
+TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
+    constexpr int kKills = 60;
+    constexpr int kFixedEntries = 100;
+    MutableDictionary initial;
+    for (int i = 0; i < kFixedEntries; ++i)
+        initial.set("com.example.p" + std::to_string(i),
+                    dict({{"election", integer(i % 3)}, {"extension", dict({{"n", integer(i)}})}}));
+    initial.set("state", dict({{"step", integer(0)}, {"blob", Value::data(blobFor(0))}}));
+    Value initialMap = initial.take();
+    put(path_, document(initialMap));
+
+    std::mt19937 random(20240611);
+    int64_t lastStep = 0;
+    int killedWithProgress = 0;
+    int interruptedWrites = 0;
+    for (int round = 0; round < kKills; ++round) {
+        pid_t child = fork();
+        ASSERT_GE(child, 0);
+        if (child == 0) {
+            // Continues from whatever the last run left, as a restarted daemon would.
+            BXDAnnotationStore annotations(store());
+            int64_t step = annotations.annotationForIdentifier("state").get("step").numberAsInt64().value_or(-1000);
+            if (step < 0) _exit(3);
+            for (;;) {
+                ++step;
+                annotations.setAnnotationForIdentifier(
+                    dict({{"step", integer(step)}, {"blob", Value::data(blobFor(step))}}), "state");
+                if (annotations.diskBehind()) _exit(4);
+            }
+        }
+        usleep(std::uniform_int_distribution<useconds_t>(5000, 150000)(random));
+        ASSERT_EQ(kill(child, SIGKILL), 0);
+        int status = 0;
+        ASSERT_EQ(waitpid(child, &status, 0), child);
+        ASSERT_TRUE(WIFSIGNALED(status)) << "the writer stopped by itself with status " << WEXITSTATUS(status);
+        for (const auto& entry : fs::directory_iterator(directory_))
+            if (entry.path().filename().string().find(".tmp-") != std::string::npos) ++interruptedWrites;
+
+        Result<Value> root = Document::readFile(path_);
+        ASSERT_TRUE(root.ok()) << "round " << round << ": " << root.error().description();
+        ASSERT_EQ(root->get("version"), integer(16));
+        Value data = root->get("data");
+        ASSERT_EQ(data.count(), static_cast<size_t>(kFixedEntries + 1));
+        for (const DictionaryEntry& entry : initialMap.entries()) {
+            if (entry.key != "state") {
+                ASSERT_EQ(data.get(entry.key), entry.value) << entry.key;
+            }
+        }
+        Value state = data.get("state");
+        std::optional<int64_t> step = state.get("step").numberAsInt64();
+        ASSERT_TRUE(step.has_value());
+        ASSERT_GE(*step, lastStep) << "a later document went back to an earlier map";
+        ASSERT_EQ(state, dict({{"step", integer(*step)}, {"blob", Value::data(blobFor(*step))}}))
+            << "round " << round << " step " << *step;
+        if (*step > lastStep) ++killedWithProgress;
+        lastStep = *step;
+    }
+    // The writer must really have been writing, and been killed in the middle of writes, or this proved nothing.
+    EXPECT_GE(killedWithProgress, kKills / 4);
+    EXPECT_GE(interruptedWrites, 1);
+    RecordProperty("interrupted_writes", interruptedWrites);
+    RecordProperty("steps", static_cast<int>(lastStep));
+
+    BXDAnnotationStore survivor(store());
+    for (const auto& entry : fs::directory_iterator(directory_))
+        EXPECT_EQ(entry.path().filename().string().find(".tmp-"), std::string::npos) << entry.path();
+}
+
+}  // namespace
+}  // namespace bexil
