@@ -1,0 +1,90 @@
+#pragma once
+
+// The public connection of an application to bxd, the plug-in registry daemon. A DaemonClient holds one connection
+// to the daemon's service for its whole life; every request method sends at once and calls back later, on the
+// client's own serial queue, with the outcome (one callback at a time, in delivery order). Request methods may be
+// called from any thread; wait() blocks the calling thread for one reply and must not be called from a callback.
+//
+// Values are bexil::Value (base/Value.h): immutable, shared property-list values with MutableDictionary and
+// MutableArray builders. Errors are bexil::Error in the domain "Bexil" with the daemon's codes.
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace bexil {
+
+class DaemonClient {
+  public:
+    // The outcome of one request.
+    struct Reply {
+        // The reply dictionary; null when the connection failed in its place.
+        Value message;
+        // None on success; the daemon's code and message otherwise (code 4 for a failed connection or a reply
+        // that never came within wait()'s time limit).
+        std::optional<Error> error;
+        // True when no reply dictionary came: the daemon is not running, went away or did not answer in time.
+        bool connectionFailed = false;
+
+        bool ok() const { return !error.has_value(); }
+    };
+    using Callback = std::function<void(const Reply&)>;
+
+    // Discovery flags of match().
+    static constexpr uint64_t kDiscoverAllVersions = 0x1;
+    static constexpr uint64_t kDiscoverAllInstances = 0x4;
+    static constexpr uint64_t kDiscoverSystemOnly = 0x8;
+    static constexpr uint64_t kDiscoverAll = 0x200;
+    // Hold flags of hold().
+    static constexpr uint64_t kHoldPlugInPaths = 0x1;
+    static constexpr uint64_t kHoldRefuseBusy = 0x2;
+    static constexpr uint64_t kHoldTerminate = 0x4;
+
+    // Connects to `serviceName`, or to the daemon's default service when it is empty.
+    explicit DaemonClient(const std::string& serviceName = {});
+    ~DaemonClient();
+    DaemonClient(const DaemonClient&) = delete;
+    DaemonClient& operator=(const DaemonClient&) = delete;
+
+    const std::string& serviceName() const;
+
+    // Requests; paths are absolute file-system paths.
+    void add(const std::vector<std::string>& paths, Callback done);
+    void remove(const std::vector<std::string>& paths, Callback done);
+    void bulk(uint64_t flags, Callback done);
+    void ready(const std::vector<Uuid>& plugIns, Callback done);
+    void access(const std::vector<Uuid>& plugIns, Callback done);
+    void match(const Value& rules, uint64_t flags, Callback done);
+    void annotate(const std::vector<Uuid>& plugIns, const Value& annotations, Callback done);
+    void bulkAnnotate(const Value& annotations, Callback done);
+    void hold(const std::vector<std::string>& paths, uint64_t flags, Callback done);
+    void releaseHold(const Uuid& hold, Callback done);
+
+    // Runs `start` with a callback and waits for its reply at most `timeout`:
+    //     auto reply = client.wait([&](auto done) { client.bulk(0, done); });
+    Reply wait(const std::function<void(Callback)>& start,
+               std::chrono::milliseconds timeout = std::chrono::seconds(30));
+
+    // The plug-in forms of a successful match() reply (dictionaries with "identifier", "uuid", "path", "version",
+    // "annotations" ...), or none when the reply has no readable result.
+    std::optional<Value> matches(const Reply& reply) const;
+
+    // Calls `callback` on the client's queue with the notification's counter each time `name` is posted (for
+    // example "com.quorvel.bexil.annotation-change"). Returns a token for stopObserving, or none when the
+    // notification folder cannot be watched.
+    std::optional<uint64_t> observe(const std::string& name, std::function<void(uint64_t counter)> callback);
+    void stopObserving(uint64_t token);
+
+  private:
+    struct Impl;
+    std::unique_ptr<Impl> impl_;
+};
+
+}  // namespace bexil

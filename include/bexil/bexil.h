@@ -1,0 +1,16 @@
+#pragma once
+
+// The client library of the Bexil plug-in registry: include this one header and link with
+// `pkg-config --cflags --libs bexil`.
+
+#include "bexil/DaemonClient.h"
+
+#define BEXIL_VERSION_MAJOR 0
+#define BEXIL_VERSION_MINOR 1
+
+namespace bexil {
+
+// The library's version as "major.minor.patch".
+const char* libraryVersion();
+
+}  // namespace bexil

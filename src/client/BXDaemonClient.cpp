@@ -1,0 +1,167 @@
+#include "client/BXDaemonClient.h"
+
+#include <utility>
+
+#include "platform/log/Log.h"
+
+namespace bexil {
+
+namespace {
+
+constexpr std::string_view kUnknownErrorMessage = "unknown error returned by Bexil subsystem";
+
+}  // namespace
+
+BXDaemonClient::BXDaemonClient(const char* serviceName, EventLoop& loop)
+    : serviceName_(serviceName != nullptr ? serviceName : kDefaultServiceName),
+      replyQueue_(kReplyQueueLabel, loop),
+      bxd_(ZemConnection::createClient(serviceName_, replyQueue_)),
+      protocolVersion_(0) {
+    // Connection events carry no work for a client: replies come through their own handlers, and a failed
+    // connection answers every outstanding request with the error. The event is only worth a log line.
+    bxd_->setEventHandler([](const ZemConnection::Event& event) {
+        if (const auto* error = std::get_if<ZemError>(&event)) {
+            log::ops().error("Communications error: %{public}@", *error);
+        } else {
+            log::ops().error("Communications error: %{public}@", std::get<ZemMessage>(event));
+        }
+    });
+    protocolVersion_.store(kProtocolVersion, std::memory_order_relaxed);
+    bxd_->resume();
+}
+
+BXDaemonClient::~BXDaemonClient() { bxd_->cancel(); }
+
+std::shared_ptr<BXDaemonClient> BXDaemonClient::initWithServiceName(const char* serviceName) {
+    return std::make_shared<BXDaemonClient>(serviceName);
+}
+
+MutableDictionary BXDaemonClient::request(const char* name) const {
+    MutableDictionary request;
+    request.set("request", Value::string(name));
+    // The version travels unsigned; a negative setting goes out as its two's complement, which bxd refuses.
+    request.set("version", Value::uint64(static_cast<uint64_t>(protocolVersion())));
+    return request;
+}
+
+MutableDictionary BXDaemonClient::requestPaths(const char* name, const Value& paths) const {
+    MutableDictionary message = request(name);
+    message.set("paths", paths);
+    return message;
+}
+
+void BXDaemonClient::setUuids(MutableDictionary& request, const std::vector<Uuid>& uuids) {
+    MutableArray array;
+    array.reserve(uuids.size());
+    for (const Uuid& uuid : uuids) array.append(Value::uuid(uuid));
+    request.set("uuids", array.take());
+}
+
+void BXDaemonClient::sendReply(const Value& request, ReplyHandler reply) {
+    log::traffic().debug("request: %@", request);
+    bxd_->sendWithReply(request, replyQueue_, [reply = std::move(reply)](const Reply& answer) {
+        if (const auto* error = std::get_if<ZemError>(&answer)) {
+            log::traffic().debug("reply: %@", *error);
+        } else {
+            log::traffic().debug("reply: %@", std::get<Value>(answer));
+        }
+        if (reply) reply(answer);
+    });
+}
+
+void BXDaemonClient::addPlugInsReply(const Value& paths, ReplyHandler reply) {
+    sendReply(requestPaths("add", paths).take(), std::move(reply));
+}
+
+void BXDaemonClient::removePlugInsReply(const Value& paths, ReplyHandler reply) {
+    sendReply(requestPaths("remove", paths).take(), std::move(reply));
+}
+
+void BXDaemonClient::bulkPluginsReply(uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = request("bulk");
+    message.set("flags", Value::uint64(flags));
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::readyPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = request("ready");
+    message.set("flags", Value::uint64(flags));
+    setUuids(message, uuids);
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::accessPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = request("access");
+    message.set("flags", Value::uint64(flags));
+    setUuids(message, uuids);
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::matchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = request("match");
+    message.set("rules", rules);
+    message.set("flags", Value::uint64(flags));
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,
+                                                          ReplyHandler reply) {
+    MutableDictionary message = request("annotate");
+    setUuids(message, uuids);
+    message.set("annotations", annotations);
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply) {
+    MutableDictionary message = request("bulk-annotate");
+    message.set("annotations", annotations);
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::holdPluginsFlagsReply(const Value& paths, uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = requestPaths("lock", paths);
+    message.set("flags", Value::uint64(flags));
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
+    MutableDictionary message = request("lock");
+    setUuids(message, {hold});
+    sendReply(message.take(), std::move(reply));
+}
+
+std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {
+    if (const auto* error = std::get_if<ZemError>(&reply)) return BXError(4, error->description());
+    const Value& dictionary = std::get<Value>(reply);
+    // Only the low 32 bits of the code are looked at: the daemon widens a signed 32-bit code with its sign.
+    int32_t code = 0;
+    if (const Value* entry = dictionary.find("errorcode")) {
+        if (auto u = entry->numberAsUInt64()) {
+            code = static_cast<int32_t>(static_cast<uint32_t>(*u));
+        } else if (auto i = entry->numberAsInt64()) {
+            code = static_cast<int32_t>(static_cast<uint32_t>(static_cast<uint64_t>(*i)));
+        }
+    }
+    const std::string* message = nullptr;
+    if (const Value* entry = dictionary.find("error")) message = entry->getString();
+    if (code == 0 && message == nullptr) return std::nullopt;
+    if (code == 0) throw InternalInconsistency(formatPrintf("bxd reported error without a code: %s", *message));
+    if (message == nullptr) return BXError(code, kUnknownErrorMessage);
+    return BXError(code, *message);
+}
+
+// The message form: our Zem carries every kind a property-list value can have (null, booleans, both integer
+// kinds, reals, strings, data, dates, UUIDs, arrays, dictionaries) and keeps them apart on the wire, so the
+// message form of a value is the value itself. Only the version gate is left, so that a daemon and a client that
+// speak another protocol version never mistake a result for one they could read.
+std::optional<Value> BXDaemonClient::convertToZEMVersion(const Value& value, int64_t version) {
+    if (version != kProtocolVersion) return std::nullopt;
+    return value;
+}
+
+std::optional<Value> BXDaemonClient::convertFromZEM(const Value& value) const {
+    if (protocolVersion() != kProtocolVersion) return std::nullopt;
+    return value;
+}
+
+}  // namespace bexil

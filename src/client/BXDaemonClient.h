@@ -1,0 +1,89 @@
+#pragma once
+
+// BXDaemonClient is the client end of the daemon's request protocol: it holds one Zem connection to bxd's service,
+// builds one request dictionary per operation, sends it with a reply expected and hands the raw reply (the reply
+// dictionary or the connection error in its place) to the caller's callback on its own serial queue, "bxd_client".
+// The request methods may be called from any thread; every callback and connection event of one client runs on
+// its replyQueue, one at a time, in delivery order. The object keeps its one connection for its whole life and
+// never reconnects; destroying it cancels the connection, and replies still outstanding then arrive as
+// connection errors.
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
+#include "base/Value.h"
+#include "platform/zem/ZemConnection.h"
+#include "platform/zem/ZemError.h"
+
+namespace bexil {
+
+class BXDaemonClient {
+  public:
+    static constexpr const char* kDefaultServiceName = "com.quorvel.bexil.bxd";
+    static constexpr const char* kReplyQueueLabel = "bxd_client";
+    // The version written into every request after creation; the only one whose discovery result is encoded.
+    static constexpr int64_t kProtocolVersion = 3;
+
+    // The reply dictionary, or the connection-level error delivered in its place.
+    using Reply = std::variant<Value, ZemError>;
+    using ReplyHandler = std::function<void(const Reply&)>;
+
+    // Connects to `serviceName`, or to kDefaultServiceName when it is null. The reply queue runs on `loop`.
+    explicit BXDaemonClient(const char* serviceName = nullptr, EventLoop& loop = EventLoop::shared());
+    ~BXDaemonClient();
+    BXDaemonClient(const BXDaemonClient&) = delete;
+    BXDaemonClient& operator=(const BXDaemonClient&) = delete;
+
+    static std::shared_ptr<BXDaemonClient> initWithServiceName(const char* serviceName);
+
+    const std::shared_ptr<ZemConnection>& bxd() const { return bxd_; }
+    const SerialQueue& replyQueue() const { return replyQueue_; }
+    const std::string& serviceName() const { return serviceName_; }
+    int64_t protocolVersion() const { return protocolVersion_.load(std::memory_order_relaxed); }
+    void setProtocolVersion(int64_t version) { protocolVersion_.store(version, std::memory_order_relaxed); }
+
+    // Requests. `paths` is an array of path strings, `rules` and `annotations` dictionaries; each is sent as is.
+    void addPlugInsReply(const Value& paths, ReplyHandler reply);
+    void removePlugInsReply(const Value& paths, ReplyHandler reply);
+    void bulkPluginsReply(uint64_t flags, ReplyHandler reply);
+    void readyPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply);
+    void accessPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply);
+    void matchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply);
+    void setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,
+                                              ReplyHandler reply);
+    void bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply);
+    void holdPluginsFlagsReply(const Value& paths, uint64_t flags, ReplyHandler reply);
+    void releaseHoldReply(const Uuid& hold, ReplyHandler reply);
+
+    // Building blocks of the request methods.
+    MutableDictionary request(const char* name) const;
+    MutableDictionary requestPaths(const char* name, const Value& paths) const;
+    static void setUuids(MutableDictionary& request, const std::vector<Uuid>& uuids);
+    void sendReply(const Value& request, ReplyHandler reply);
+
+    // None when the reply reports success; code 4 with the error's description for a connection error.
+    // Throws InternalInconsistency for a reply that carries a message without a code.
+    static std::optional<Error> errorInReply(const Reply& reply);
+
+    // The message form of the discovery result for `version`; none for every version but 3.
+    static std::optional<Value> convertToZEMVersion(const Value& value, int64_t version);
+    // The value decoded from the message form; none unless this client's protocolVersion is 3.
+    std::optional<Value> convertFromZEM(const Value& value) const;
+
+  private:
+    std::string serviceName_;
+    SerialQueue replyQueue_;
+    std::shared_ptr<ZemConnection> bxd_;
+    std::atomic<int64_t> protocolVersion_;
+};
+
+}  // namespace bexil

@@ -1,0 +1,23 @@
+#pragma once
+
+// A synchronous layer over BXDaemonClient for tools and simple programs: start a request, wait for its reply with
+// a time limit. The callback API stays the primary one; this only parks the calling thread on a future.
+// REQUIRES: not called on the client's replyQueue (the reply could never be delivered while it waits).
+
+#include <chrono>
+#include <functional>
+#include <optional>
+
+#include "client/BXDaemonClient.h"
+
+namespace bexil {
+
+// How long the tools wait for any one reply before they give up on the daemon.
+inline constexpr std::chrono::milliseconds kDefaultReplyTimeout = std::chrono::seconds(30);
+
+// Calls `start` with a reply handler and waits for the reply; none when it did not come within `timeout`.
+// Example: sendAndWait([&](auto reply) { client.bulkPluginsReply(0, std::move(reply)); });
+std::optional<BXDaemonClient::Reply> sendAndWait(const std::function<void(BXDaemonClient::ReplyHandler)>& start,
+                                                 std::chrono::milliseconds timeout = kDefaultReplyTimeout);
+
+}  // namespace bexil

@@ -1,0 +1,216 @@
+#include "platform/notify/SystemNotifications.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/eventfd.h>
+#include <sys/file.h>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "platform/log/Log.h"
+
+namespace bexil {
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr const char* kLockFileName = ".lock";
+
+Error posixError(const std::string& what, int error) { return BXError(4, what + ": " + std::strerror(error)); }
+
+// The counter file is a decimal number; anything else (a stray file) counts as 0 so that the next post repairs it.
+uint64_t readCounter(const fs::path& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return 0;
+    std::array<char, 32> buffer{};
+    ssize_t n = ::read(fd, buffer.data(), buffer.size() - 1);
+    ::close(fd);
+    if (n <= 0) return 0;
+    uint64_t value = 0;
+    auto [end, error] = std::from_chars(buffer.data(), buffer.data() + n, value);
+    if (error != std::errc()) return 0;
+    (void)end;
+    return value;
+}
+
+class FdCloser {
+  public:
+    explicit FdCloser(int fd) : fd_(fd) {}
+    ~FdCloser() {
+        if (fd_ >= 0) ::close(fd_);
+    }
+    FdCloser(const FdCloser&) = delete;
+    FdCloser& operator=(const FdCloser&) = delete;
+
+  private:
+    int fd_;
+};
+
+}  // namespace
+
+fs::path SystemNotifications::defaultDirectory() {
+    fs::path runtime;
+    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) {
+        runtime = dir;
+    } else if (geteuid() == 0) {
+        runtime = "/run/bexil";
+    } else if (const char* xdg = getenv("XDG_RUNTIME_DIR"); xdg && *xdg) {
+        runtime = fs::path(xdg) / "bexil";
+    } else {
+        runtime = fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
+    }
+    return runtime / "notify";
+}
+
+SystemNotifications::SystemNotifications(fs::path directory) : directory_(std::move(directory)) {}
+
+SystemNotifications::~SystemNotifications() {
+    if (watcher_.joinable()) {
+        uint64_t one = 1;
+        (void)!::write(stopFd_, &one, sizeof one);
+        watcher_.join();
+    }
+    if (inotifyFd_ >= 0) ::close(inotifyFd_);
+    if (stopFd_ >= 0) ::close(stopFd_);
+}
+
+bool SystemNotifications::validName(std::string_view name) {
+    if (name.empty() || name.size() > kMaxNameLength || name.front() == '.') return false;
+    return name.find('/') == std::string_view::npos && name.find('\0') == std::string_view::npos;
+}
+
+std::optional<Error> SystemNotifications::post(std::string_view name) {
+    if (!validName(name)) return BXError(4, "invalid notification name \"" + std::string(name) + "\"");
+    std::error_code ec;
+    fs::create_directories(directory_, ec);
+    if (ec) return BXError(4, "cannot create " + directory_.string() + ": " + ec.message());
+
+    int lockFd = ::open((directory_ / kLockFileName).c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    if (lockFd < 0) return posixError("cannot open notification lock in " + directory_.string(), errno);
+    FdCloser closeLock(lockFd);
+    while (::flock(lockFd, LOCK_EX) != 0) {
+        if (errno != EINTR) return posixError("cannot lock notification folder " + directory_.string(), errno);
+    }
+
+    const fs::path target = directory_ / std::string(name);
+    const std::string text = std::to_string(readCounter(target) + 1) + "\n";
+    const fs::path temporary = directory_ / ("." + std::string(name) + "." + std::to_string(getpid()) + ".tmp");
+    int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (fd < 0) return posixError("cannot write " + temporary.string(), errno);
+    ssize_t written = ::write(fd, text.data(), text.size());
+    int writeErrno = errno;
+    ::close(fd);
+    if (written != static_cast<ssize_t>(text.size())) {
+        ::unlink(temporary.c_str());
+        return posixError("cannot write " + temporary.string(), written < 0 ? writeErrno : EIO);
+    }
+    // The counter is a wake-up signal, not data worth an fsync: after a crash observers start over anyway.
+    if (::rename(temporary.c_str(), target.c_str()) != 0) {
+        int error = errno;
+        ::unlink(temporary.c_str());
+        return posixError("cannot replace " + target.string(), error);
+    }
+    return std::nullopt;
+}
+
+uint64_t SystemNotifications::state(std::string_view name) const {
+    if (!validName(name)) return 0;
+    return readCounter(directory_ / std::string(name));
+}
+
+Result<SystemNotifications::Token> SystemNotifications::observe(std::string name, Callback callback,
+                                                                SerialQueue queue) {
+    if (!validName(name)) return BXError(4, "invalid notification name \"" + name + "\"");
+    std::lock_guard lock(mutex_);
+    if (inotifyFd_ < 0) {
+        if (auto error = startWatching()) return *error;
+    }
+    Token token = nextToken_++;
+    observers_.emplace(token, std::make_shared<Observer>(Observer{std::move(name), std::move(callback), queue}));
+    return token;
+}
+
+void SystemNotifications::cancel(Token token) {
+    std::lock_guard lock(mutex_);
+    observers_.erase(token);
+}
+
+// REQUIRES: mutex_ held.
+std::optional<Error> SystemNotifications::startWatching() {
+    std::error_code ec;
+    fs::create_directories(directory_, ec);
+    if (ec) return BXError(4, "cannot create " + directory_.string() + ": " + ec.message());
+    int inotifyFd = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
+    if (inotifyFd < 0) return posixError("inotify_init1", errno);
+    // A post renames its counter file into place; a plain write by some other tool closes it after writing.
+    if (inotify_add_watch(inotifyFd, directory_.c_str(), IN_MOVED_TO | IN_CLOSE_WRITE) < 0) {
+        int error = errno;
+        ::close(inotifyFd);
+        return posixError("cannot watch " + directory_.string(), error);
+    }
+    int stopFd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (stopFd < 0) {
+        int error = errno;
+        ::close(inotifyFd);
+        return posixError("eventfd", error);
+    }
+    inotifyFd_ = inotifyFd;
+    stopFd_ = stopFd;
+    watcher_ = std::thread([this] { watch(); });
+    return std::nullopt;
+}
+
+void SystemNotifications::watch() {
+    alignas(inotify_event) std::array<char, 16 * (sizeof(inotify_event) + NAME_MAX + 1)> buffer;
+    for (;;) {
+        std::array<pollfd, 2> fds{pollfd{inotifyFd_, POLLIN, 0}, pollfd{stopFd_, POLLIN, 0}};
+        if (::poll(fds.data(), fds.size(), -1) < 0) {
+            if (errno == EINTR) continue;
+            log::ops().error("notification watcher stops: poll failed: %s", std::strerror(errno));
+            return;
+        }
+        if (fds[1].revents != 0) return;
+        for (;;) {
+            ssize_t n = ::read(inotifyFd_, buffer.data(), buffer.size());
+            if (n <= 0) break;
+            for (ssize_t offset = 0; offset < n;) {
+                const auto* event = reinterpret_cast<const inotify_event*>(buffer.data() + offset);
+                offset += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
+                if (event->mask & IN_Q_OVERFLOW) {
+                    log::ops().error("notification watcher lost events in %s (inotify queue overflow)",
+                                     directory_.c_str());
+                    continue;
+                }
+                if (event->len == 0) continue;
+                std::string name(event->name);
+                if (validName(name)) dispatch(name);
+            }
+        }
+    }
+}
+
+void SystemNotifications::dispatch(const std::string& name) {
+    std::vector<std::shared_ptr<Observer>> targets;
+    {
+        std::lock_guard lock(mutex_);
+        for (const auto& [token, observer] : observers_) {
+            if (observer->name == name) targets.push_back(observer);
+        }
+    }
+    if (targets.empty()) return;
+    uint64_t counter = readCounter(directory_ / name);
+    for (const auto& observer : targets) {
+        observer->queue.async([observer, name, counter] { observer->callback(name, counter); });
+    }
+}
+
+}  // namespace bexil

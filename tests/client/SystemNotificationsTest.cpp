@@ -1,0 +1,147 @@
+// System notifications across processes: a child process posts, the parent observes through inotify.
+
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <future>
+
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
+#include "platform/notify/SystemNotifications.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+class SystemNotificationsTest : public ::testing::Test {
+  protected:
+    SystemNotificationsTest()
+        : dir_(fs::temp_directory_path() / ("bexil-notify-" + std::to_string(getpid()) + "-" +
+                                            ::testing::UnitTest::GetInstance()->current_test_info()->name())) {
+        fs::remove_all(dir_);
+    }
+    ~SystemNotificationsTest() override { fs::remove_all(dir_); }
+
+    // Forks a child that posts `name` `times` times and exits 0 when every post succeeded.
+    void postFromChild(const std::string& name, int times) {
+        pid_t child = fork();
+        ASSERT_GE(child, 0);
+        if (child == 0) {
+            SystemNotifications poster(dir_);
+            int failures = 0;
+            for (int i = 0; i < times; ++i) failures += poster.post(name).has_value() ? 1 : 0;
+            _exit(failures == 0 ? 0 : 1);
+        }
+        int status = 0;
+        ASSERT_EQ(waitpid(child, &status, 0), child);
+        ASSERT_TRUE(WIFEXITED(status));
+        EXPECT_EQ(WEXITSTATUS(status), 0);
+    }
+
+    fs::path dir_;
+    EventLoop loop_{1};
+    SerialQueue queue_{"observer", loop_};
+};
+
+TEST_F(SystemNotificationsTest, ObserverSeesPostsOfAnotherProcess) {
+    SystemNotifications observer(dir_);
+    std::atomic<int> calls{0};
+    std::promise<uint64_t> third;
+    auto token = observer.observe(
+        "com.quorvel.bexil.annotation-change",
+        [&](const std::string& name, uint64_t counter) {
+            EXPECT_EQ(name, "com.quorvel.bexil.annotation-change");
+            if (++calls == 3) third.set_value(counter);
+        },
+        queue_);
+    ASSERT_TRUE(token.ok());
+    postFromChild("com.quorvel.bexil.annotation-change", 3);
+    auto future = third.get_future();
+    ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready) << "saw " << calls << " posts";
+    EXPECT_EQ(future.get(), 3u);
+    EXPECT_EQ(observer.state("com.quorvel.bexil.annotation-change"), 3u);
+}
+
+TEST_F(SystemNotificationsTest, OtherNamesAndCancelledObserversAreNotCalled) {
+    SystemNotifications observer(dir_);
+    std::atomic<int> wanted{0}, cancelled{0};
+    std::promise<void> seen;
+    ASSERT_TRUE(observer
+                    .observe(
+                        "a",
+                        [&](const std::string&, uint64_t) {
+                            if (++wanted == 1) seen.set_value();
+                        },
+                        queue_)
+                    .ok());
+    auto token = observer.observe(
+        "b", [&](const std::string&, uint64_t) { ++cancelled; }, queue_);
+    ASSERT_TRUE(token.ok());
+    observer.cancel(*token);
+    postFromChild("b", 1);
+    postFromChild("c", 1);
+    postFromChild("a", 1);
+    ASSERT_EQ(seen.get_future().wait_for(std::chrono::seconds(5)), std::future_status::ready);
+    // Blocks of one queue run in order: once this one runs, every callback queued before it has run.
+    queue_.sync([] {});
+    EXPECT_EQ(wanted, 1);
+    EXPECT_EQ(cancelled, 0);
+}
+
+TEST_F(SystemNotificationsTest, CounterSurvivesConcurrentPostersAndStrayContent) {
+    SystemNotifications notifications(dir_);
+    ASSERT_FALSE(notifications.post("n").has_value());
+    // Someone wrote garbage into the counter file: the next post starts over instead of failing.
+    { std::ofstream(dir_ / "n") << "not a number"; }
+    EXPECT_EQ(notifications.state("n"), 0u);
+    ASSERT_FALSE(notifications.post("n").has_value());
+    EXPECT_EQ(notifications.state("n"), 1u);
+
+    std::vector<pid_t> children;
+    for (int c = 0; c < 4; ++c) {
+        pid_t child = fork();
+        ASSERT_GE(child, 0);
+        if (child == 0) {
+            SystemNotifications poster(dir_);
+            for (int i = 0; i < 25; ++i)
+                if (poster.post("n")) _exit(1);
+            _exit(0);
+        }
+        children.push_back(child);
+    }
+    for (pid_t child : children) {
+        int status = 0;
+        ASSERT_EQ(waitpid(child, &status, 0), child);
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    }
+    EXPECT_EQ(notifications.state("n"), 101u) << "the lock file must serialise increments";
+}
+
+TEST_F(SystemNotificationsTest, BadNamesAreRefused) {
+    SystemNotifications notifications(dir_);
+    for (std::string bad : {std::string(), std::string("../escape"), std::string(".hidden"), std::string("a/b"),
+                            std::string(SystemNotifications::kMaxNameLength + 1, 'x')}) {
+        auto error = notifications.post(bad);
+        ASSERT_TRUE(error.has_value()) << bad;
+        EXPECT_EQ(error->code(), 4);
+        EXPECT_FALSE(notifications
+                         .observe(
+                             bad, [](const std::string&, uint64_t) {}, queue_)
+                         .ok());
+    }
+    EXPECT_FALSE(fs::exists(dir_.parent_path() / "escape"));
+}
+
+TEST(SystemNotificationsDirectoryTest, RuntimeDirectoryComesFromTheEnvironment) {
+    setenv("BX_RUNTIME_DIR", "/tmp/bexil-rt-test", 1);
+    EXPECT_EQ(SystemNotifications::defaultDirectory(), fs::path("/tmp/bexil-rt-test/notify"));
+    unsetenv("BX_RUNTIME_DIR");
+}
+
+}  // namespace
+}  // namespace bexil

@@ -1,0 +1,446 @@
+#include "JsonText.h"
+
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+
+namespace bexil::tool {
+
+namespace {
+
+class Parser {
+  public:
+    explicit Parser(std::string_view text) : text_(text) {}
+
+    Result<Value> document() {
+        Value value;
+        if (!parseValue(value, 0)) return failure();
+        skipSpace();
+        if (pos_ != text_.size()) {
+            error_ = "unexpected text after the value";
+            return failure();
+        }
+        return value;
+    }
+
+  private:
+    Error failure() const {
+        size_t line = 1;
+        for (size_t i = 0; i < pos_ && i < text_.size(); ++i)
+            if (text_[i] == '\n') ++line;
+        return BXError(4, "JSON line " + std::to_string(line) + ": " + error_);
+    }
+
+    void skipSpace() {
+        while (pos_ < text_.size() &&
+               (text_[pos_] == ' ' || text_[pos_] == '\t' || text_[pos_] == '\n' || text_[pos_] == '\r'))
+            ++pos_;
+    }
+
+    bool literal(std::string_view word) {
+        if (text_.substr(pos_, word.size()) != word) return false;
+        pos_ += word.size();
+        return true;
+    }
+
+    bool parseValue(Value& out, int depth) {
+        if (depth > kMaxJsonDepth) {
+            error_ = "nested too deeply";
+            return false;
+        }
+        skipSpace();
+        if (pos_ >= text_.size()) {
+            error_ = "unexpected end of text";
+            return false;
+        }
+        char c = text_[pos_];
+        if (c == '{') return parseObject(out, depth);
+        if (c == '[') return parseArray(out, depth);
+        if (c == '"') {
+            std::string s;
+            if (!parseString(s)) return false;
+            out = Value::string(std::move(s));
+            return true;
+        }
+        if (literal("true")) return out = Value::boolean(true), true;
+        if (literal("false")) return out = Value::boolean(false), true;
+        if (literal("null")) return out = Value::null(), true;
+        if (c == '-' || (c >= '0' && c <= '9')) return parseNumber(out);
+        error_ = std::string("unexpected character '") + c + "'";
+        return false;
+    }
+
+    bool parseObject(Value& out, int depth) {
+        ++pos_;
+        MutableDictionary dictionary;
+        skipSpace();
+        if (pos_ < text_.size() && text_[pos_] == '}') {
+            ++pos_;
+            out = dictionary.take();
+            return true;
+        }
+        for (;;) {
+            skipSpace();
+            std::string key;
+            if (pos_ >= text_.size() || text_[pos_] != '"') {
+                error_ = "expected a key in double quotes";
+                return false;
+            }
+            if (!parseString(key)) return false;
+            skipSpace();
+            if (pos_ >= text_.size() || text_[pos_] != ':') {
+                error_ = "expected ':' after a key";
+                return false;
+            }
+            ++pos_;
+            Value value;
+            if (!parseValue(value, depth + 1)) return false;
+            if (dictionary.find(key) != nullptr) {
+                error_ = "key \"" + key + "\" given twice";
+                return false;
+            }
+            dictionary.set(key, std::move(value));
+            skipSpace();
+            if (pos_ < text_.size() && text_[pos_] == ',') {
+                ++pos_;
+                continue;
+            }
+            if (pos_ < text_.size() && text_[pos_] == '}') {
+                ++pos_;
+                out = dictionary.take();
+                return true;
+            }
+            error_ = "expected ',' or '}'";
+            return false;
+        }
+    }
+
+    bool parseArray(Value& out, int depth) {
+        ++pos_;
+        MutableArray array;
+        skipSpace();
+        if (pos_ < text_.size() && text_[pos_] == ']') {
+            ++pos_;
+            out = array.take();
+            return true;
+        }
+        for (;;) {
+            Value value;
+            if (!parseValue(value, depth + 1)) return false;
+            array.append(std::move(value));
+            skipSpace();
+            if (pos_ < text_.size() && text_[pos_] == ',') {
+                ++pos_;
+                continue;
+            }
+            if (pos_ < text_.size() && text_[pos_] == ']') {
+                ++pos_;
+                out = array.take();
+                return true;
+            }
+            error_ = "expected ',' or ']'";
+            return false;
+        }
+    }
+
+    static void appendUtf8(std::string& s, uint32_t cp) {
+        if (cp < 0x80) {
+            s += static_cast<char>(cp);
+        } else if (cp < 0x800) {
+            s += static_cast<char>(0xC0 | (cp >> 6));
+            s += static_cast<char>(0x80 | (cp & 0x3F));
+        } else if (cp < 0x10000) {
+            s += static_cast<char>(0xE0 | (cp >> 12));
+            s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
+            s += static_cast<char>(0x80 | (cp & 0x3F));
+        } else {
+            s += static_cast<char>(0xF0 | (cp >> 18));
+            s += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
+            s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
+            s += static_cast<char>(0x80 | (cp & 0x3F));
+        }
+    }
+
+    bool hex4(uint32_t& out) {
+        if (pos_ + 4 > text_.size()) {
+            error_ = "truncated \\u escape";
+            return false;
+        }
+        out = 0;
+        for (int i = 0; i < 4; ++i) {
+            char h = text_[pos_++];
+            out <<= 4;
+            if (h >= '0' && h <= '9')
+                out |= static_cast<uint32_t>(h - '0');
+            else if (h >= 'a' && h <= 'f')
+                out |= static_cast<uint32_t>(h - 'a' + 10);
+            else if (h >= 'A' && h <= 'F')
+                out |= static_cast<uint32_t>(h - 'A' + 10);
+            else {
+                error_ = "bad \\u escape";
+                return false;
+            }
+        }
+        return true;
+    }
+
+    bool parseString(std::string& out) {
+        ++pos_;
+        while (pos_ < text_.size()) {
+            char c = text_[pos_++];
+            if (c == '"') return true;
+            if (static_cast<unsigned char>(c) < 0x20) {
+                error_ = "control character in a string";
+                return false;
+            }
+            if (c != '\\') {
+                out += c;
+                continue;
+            }
+            if (pos_ >= text_.size()) break;
+            char e = text_[pos_++];
+            switch (e) {
+                case '"':
+                    out += '"';
+                    break;
+                case '\\':
+                    out += '\\';
+                    break;
+                case '/':
+                    out += '/';
+                    break;
+                case 'b':
+                    out += '\b';
+                    break;
+                case 'f':
+                    out += '\f';
+                    break;
+                case 'n':
+                    out += '\n';
+                    break;
+                case 'r':
+                    out += '\r';
+                    break;
+                case 't':
+                    out += '\t';
+                    break;
+                case 'u': {
+                    uint32_t cp = 0;
+                    if (!hex4(cp)) return false;
+                    if (cp >= 0xD800 && cp <= 0xDBFF) {
+                        uint32_t low = 0;
+                        if (!literal("\\u") || !hex4(low) || low < 0xDC00 || low > 0xDFFF) {
+                            error_ = "unpaired surrogate in \\u escape";
+                            return false;
+                        }
+                        cp = 0x10000 + ((cp - 0xD800) << 10) + (low - 0xDC00);
+                    } else if (cp >= 0xDC00 && cp <= 0xDFFF) {
+                        error_ = "unpaired surrogate in \\u escape";
+                        return false;
+                    }
+                    appendUtf8(out, cp);
+                    break;
+                }
+                default:
+                    error_ = std::string("bad escape \\") + e;
+                    return false;
+            }
+        }
+        error_ = "unterminated string";
+        return false;
+    }
+
+    bool parseNumber(Value& out) {
+        size_t start = pos_;
+        bool real = false;
+        if (text_[pos_] == '-') ++pos_;
+        while (pos_ < text_.size()) {
+            char c = text_[pos_];
+            if (c >= '0' && c <= '9') {
+                ++pos_;
+            } else if (c == '.' || c == 'e' || c == 'E' || c == '+' || c == '-') {
+                real = true;
+                ++pos_;
+            } else {
+                break;
+            }
+        }
+        std::string number(text_.substr(start, pos_ - start));
+        char* end = nullptr;
+        errno = 0;
+        if (!real) {
+            if (number[0] == '-') {
+                long long v = std::strtoll(number.c_str(), &end, 10);
+                if (errno == 0 && end && *end == '\0') return out = Value::int64(v), true;
+            } else {
+                unsigned long long v = std::strtoull(number.c_str(), &end, 10);
+                if (errno == 0 && end && *end == '\0') {
+                    out = v <= static_cast<unsigned long long>(INT64_MAX) ? Value::int64(static_cast<int64_t>(v))
+                                                                          : Value::uint64(v);
+                    return true;
+                }
+            }
+            errno = 0;
+        }
+        double d = std::strtod(number.c_str(), &end);
+        if (end == nullptr || *end != '\0' || number == "-" || !std::isfinite(d)) {
+            error_ = "malformed number " + number;
+            return false;
+        }
+        out = Value::real(d);
+        return true;
+    }
+
+    std::string_view text_;
+    size_t pos_ = 0;
+    std::string error_;
+};
+
+void writeString(std::string& out, std::string_view s) {
+    out += '"';
+    for (unsigned char c : s) {
+        switch (c) {
+            case '"':
+                out += "\\\"";
+                break;
+            case '\\':
+                out += "\\\\";
+                break;
+            case '\n':
+                out += "\\n";
+                break;
+            case '\r':
+                out += "\\r";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            default:
+                if (c < 0x20) {
+                    char buffer[8];
+                    std::snprintf(buffer, sizeof buffer, "\\u%04x", c);
+                    out += buffer;
+                } else {
+                    out += static_cast<char>(c);
+                }
+        }
+    }
+    out += '"';
+}
+
+std::string base64(std::span<const uint8_t> bytes) {
+    static constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+    std::string out;
+    size_t i = 0;
+    for (; i + 2 < bytes.size(); i += 3) {
+        uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8) | bytes[i + 2];
+        for (int k = 18; k >= 0; k -= 6) out += kAlphabet[(n >> k) & 0x3F];
+    }
+    if (i + 1 == bytes.size()) {
+        uint32_t n = bytes[i] << 16;
+        out += kAlphabet[(n >> 18) & 0x3F];
+        out += kAlphabet[(n >> 12) & 0x3F];
+        out += "==";
+    } else if (i + 2 == bytes.size()) {
+        uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8);
+        out += kAlphabet[(n >> 18) & 0x3F];
+        out += kAlphabet[(n >> 12) & 0x3F];
+        out += kAlphabet[(n >> 6) & 0x3F];
+        out += '=';
+    }
+    return out;
+}
+
+void write(std::string& out, const Value& value, bool pretty, int indent) {
+    auto newline = [&](int level) {
+        if (!pretty) return;
+        out += '\n';
+        out.append(static_cast<size_t>(level) * 2, ' ');
+    };
+    switch (value.kind()) {
+        case ValueKind::Null:
+            out += "null";
+            break;
+        case ValueKind::Bool:
+            out += *value.getBool() ? "true" : "false";
+            break;
+        case ValueKind::Int64:
+            out += std::to_string(*value.getInt64());
+            break;
+        case ValueKind::UInt64:
+            out += std::to_string(*value.getUInt64());
+            break;
+        case ValueKind::Real: {
+            double d = *value.getReal();
+            if (!std::isfinite(d)) {
+                out += "null";
+            } else {
+                char buffer[32];
+                std::snprintf(buffer, sizeof buffer, "%.17g", d);
+                out += buffer;
+            }
+            break;
+        }
+        case ValueKind::String:
+            writeString(out, value.stringView());
+            break;
+        case ValueKind::Data:
+            writeString(out, base64(value.dataBytes()));
+            break;
+        case ValueKind::Date:
+            writeString(out, value.getDate()->iso8601());
+            break;
+        case ValueKind::Uuid:
+            writeString(out, value.getUuid()->string());
+            break;
+        case ValueKind::Array: {
+            if (value.count() == 0) {
+                out += "[]";
+                break;
+            }
+            out += '[';
+            bool first = true;
+            for (const Value& item : value.items()) {
+                if (!first) out += ',';
+                first = false;
+                newline(indent + 1);
+                write(out, item, pretty, indent + 1);
+            }
+            newline(indent);
+            out += ']';
+            break;
+        }
+        case ValueKind::Dictionary: {
+            if (value.count() == 0) {
+                out += "{}";
+                break;
+            }
+            out += '{';
+            bool first = true;
+            for (const DictionaryEntry& entry : value.entries()) {
+                if (!first) out += ',';
+                first = false;
+                newline(indent + 1);
+                writeString(out, entry.key);
+                out += pretty ? ": " : ":";
+                write(out, entry.value, pretty, indent + 1);
+            }
+            newline(indent);
+            out += '}';
+            break;
+        }
+    }
+}
+
+}  // namespace
+
+Result<Value> parseJson(std::string_view text) { return Parser(text).document(); }
+
+std::string toJson(const Value& value, bool pretty) {
+    std::string out;
+    write(out, value, pretty, 0);
+    return out;
+}
+
+}  // namespace bexil::tool

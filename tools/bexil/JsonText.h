@@ -1,0 +1,22 @@
+#pragma once
+
+// JSON for the bexil tool only: reading rule and annotation files, and printing replies with --json. Numbers
+// without a fraction or exponent read as int64 (uint64 above its range), others as reals; null, booleans,
+// strings, arrays and objects map to the Value kinds of the same name. Writing renders data as base64 text, dates
+// as ISO 8601 text and UUIDs as their canonical text, since JSON has none of those kinds. Stateless; any thread.
+
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace bexil::tool {
+
+// Deepest nesting a JSON file may have; deeper input is refused rather than risk the stack.
+inline constexpr int kMaxJsonDepth = 128;
+
+Result<Value> parseJson(std::string_view text);
+std::string toJson(const Value& value, bool pretty = true);
+
+}  // namespace bexil::tool

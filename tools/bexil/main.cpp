@@ -1,0 +1,405 @@
+// bexil: the command line of the plug-in registry. One subcommand per request of bxd, plus the global exclusions
+// preference. Every argument is checked before anything is sent; every wait for the daemon has a time limit.
+// Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 69 when bxd is not running,
+// 70 for a reply the tool cannot read, 75 when bxd did not answer in time.
+
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <cstdio>
+#include <filesystem>
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "JsonText.h"
+#include "ToolArguments.h"
+#include "base/Document.h"
+#include "client/BXDaemonClient.h"
+#include "client/BXDaemonClientSync.h"
+#include "client/BXPlugInMatches.h"
+#include "platform/log/Log.h"
+#include "platform/zem/ZemListener.h"
+
+namespace bexil::tool {
+namespace {
+
+namespace fs = std::filesystem;
+
+struct Options {
+    std::string service = BXDaemonClient::kDefaultServiceName;
+    bool json = false;
+    bool verbose = false;
+    double timeoutSeconds = 30;
+};
+
+void usageError(const std::string& message) { std::fprintf(stderr, "bexil: %s\n", message.c_str()); }
+
+int usageFailure(const Error& error) {
+    usageError(error.localizedDescription().value_or("invalid arguments"));
+    return kExitUsage;
+}
+
+// Sends one request and turns the outcome into an exit status; on success `onSuccess` prints the reply.
+int roundTrip(const Options& options, const char* what,
+              const std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>& send,
+              const std::function<int(BXDaemonClient&, const Value&)>& onSuccess) {
+    BXDaemonClient client(options.service.c_str());
+    auto timeout = std::chrono::milliseconds(static_cast<int64_t>(options.timeoutSeconds * 1000));
+    std::optional<BXDaemonClient::Reply> reply =
+        sendAndWait([&](BXDaemonClient::ReplyHandler handler) { send(client, std::move(handler)); }, timeout);
+    if (!reply) {
+        std::fprintf(stderr, "bexil: bxd did not answer %s within %g seconds on service %s\n", what,
+                     options.timeoutSeconds, options.service.c_str());
+        return kExitTimeout;
+    }
+    if (std::holds_alternative<ZemError>(*reply)) {
+        std::fprintf(stderr, "bexil: bxd is not running on service %s (%s)\n", options.service.c_str(),
+                     ZemListener::socketPathForService(options.service).c_str());
+        return kExitUnavailable;
+    }
+    std::optional<Error> error;
+    try {
+        error = BXDaemonClient::errorInReply(*reply);
+    } catch (const InternalInconsistency& inconsistency) {
+        std::fprintf(stderr, "bexil: %s failed: %s\n", what, inconsistency.what());
+        return kExitSoftware;
+    }
+    const Value& message = std::get<Value>(*reply);
+    if (error) {
+        if (options.json) {
+            std::printf("%s\n", toJson(message).c_str());
+        }
+        std::fprintf(stderr, "bexil: %s failed (code %lld): %s\n", what, static_cast<long long>(error->code()),
+                     error->localizedDescription().value_or("").c_str());
+        if (const Value* conflicts = message.find("conflicts"); conflicts && !options.json) {
+            std::fprintf(stderr, "bexil: busy: %s\n", conflicts->description().c_str());
+        }
+        return exitStatusForCode(error->code());
+    }
+    if (options.json && !onSuccess) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    return onSuccess ? onSuccess(client, message) : 0;
+}
+
+std::string cell(const std::optional<std::string>& text) { return text && !text->empty() ? *text : "-"; }
+
+int printMatches(const Options& options, BXDaemonClient& client, const Value& message) {
+    if (options.json) {
+        std::optional<Value> matches;
+        if (const Value* encoded = message.find("matches")) matches = client.convertFromZEM(*encoded);
+        std::printf("%s\n", toJson(matches.value_or(Value::emptyArray())).c_str());
+        return 0;
+    }
+    auto plugIns = plugInsFromMatchReply(client, message);
+    if (!plugIns) {
+        std::fprintf(stderr, "bexil: match failed (code %lld): %s\n", static_cast<long long>(plugIns.error().code()),
+                     plugIns.error().localizedDescription().value_or("").c_str());
+        return kExitSoftware;
+    }
+    if (plugIns->empty()) {
+        std::printf("no plug-ins match\n");
+        return 0;
+    }
+    struct Row {
+        std::string identifier, version, election, uuid, path;
+    };
+    std::vector<Row> rows{{"IDENTIFIER", "VERSION", "ELECTION", "UUID", "PATH"}};
+    for (const auto& plugIn : *plugIns) {
+        Row row;
+        row.identifier = cell(plugIn->identifier());
+        std::optional<Value> version = plugIn->version();
+        row.version = version && version->isString() ? *version->getString() : "-";
+        std::optional<Value> annotations = plugIn->annotations();
+        std::optional<int64_t> election;
+        if (annotations) election = annotations->get("election").numberAsInt64();
+        row.election = election ? std::to_string(*election) : "-";
+        row.uuid = plugIn->uuid() ? plugIn->uuid()->string() : "-";
+        row.path = cell(plugIn->path());
+        rows.push_back(std::move(row));
+    }
+    size_t w[4] = {0, 0, 0, 0};
+    for (const Row& row : rows) {
+        w[0] = std::max(w[0], row.identifier.size());
+        w[1] = std::max(w[1], row.version.size());
+        w[2] = std::max(w[2], row.election.size());
+        w[3] = std::max(w[3], row.uuid.size());
+    }
+    for (const Row& row : rows) {
+        std::printf("%-*s  %-*s  %-*s  %-*s  %s\n", static_cast<int>(w[0]), row.identifier.c_str(),
+                    static_cast<int>(w[1]), row.version.c_str(), static_cast<int>(w[2]), row.election.c_str(),
+                    static_cast<int>(w[3]), row.uuid.c_str(), row.path.c_str());
+    }
+    return 0;
+}
+
+int printHold(const Options& options, BXDaemonClient&, const Value& message) {
+    if (options.json) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    const Value* uuid = message.find("uuids");
+    if (uuid == nullptr || !uuid->isUuid()) {
+        std::fprintf(stderr, "bexil: hold granted without a hold UUID in the reply\n");
+        return kExitSoftware;
+    }
+    std::printf("%s\n", uuid->getUuid()->string().c_str());
+    return 0;
+}
+
+int printExtensions(const Options& options, BXDaemonClient&, const Value& message) {
+    if (options.json) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    for (const Value& token : message.get("extensions").items()) std::printf("%s\n", token.description().c_str());
+    return 0;
+}
+
+// ---- exclusions ----
+
+int exclusionsCommand(const Options& options, const std::string& setFile, const std::vector<std::string>& add,
+                      bool clear) {
+    fs::path file = preferencesFile();
+    Value preferences = Value::emptyDictionary();
+    std::error_code ec;
+    if (fs::exists(file, ec)) {
+        auto read = Document::readFile(file);
+        if (!read || !read->isDictionary()) {
+            usageError("cannot read preferences " + file.string() + ": " +
+                       (read ? std::string("not a dictionary") : read.error().localizedDescription().value_or("")));
+            return kExitUsage;
+        }
+        preferences = *read;
+    }
+    Value exclusions = preferences.get("exclusions");
+    if (exclusions.isNull()) exclusions = Value::emptyArray();
+
+    bool change = clear || !setFile.empty() || !add.empty();
+    if (change) {
+        MutableArray updated;
+        if (!setFile.empty()) {
+            auto value = readDictionaryFile(setFile);
+            // A file given to --set holds {"exclusions": [...]}; a single rule dictionary is taken as one rule.
+            if (!value) return usageFailure(value.error());
+            Value rules = value->contains("exclusions") ? value->get("exclusions") : Value::array({*value});
+            if (auto error = validateExclusions(rules)) return usageFailure(*error);
+            updated = MutableArray(rules);
+        } else if (!clear) {
+            if (auto error = validateExclusions(exclusions)) return usageFailure(*error);
+            updated = MutableArray(exclusions);
+        }
+        if (!add.empty()) {
+            auto rule = rulesFromArguments(add);
+            if (!rule) return usageFailure(rule.error());
+            updated.append(*rule);
+        }
+        exclusions = updated.take();
+        MutableDictionary newPreferences(preferences);
+        newPreferences.set("exclusions", exclusions);
+        fs::create_directories(file.parent_path(), ec);
+        if (auto error = Document::writeFileAtomically(file, newPreferences.take())) {
+            std::fprintf(stderr, "bexil: cannot write %s: %s\n", file.c_str(),
+                         error->localizedDescription().value_or("").c_str());
+            return 73;  // EX_CANTCREAT
+        }
+    }
+    if (options.json) {
+        std::printf("%s\n", toJson(exclusions).c_str());
+    } else if (!change) {
+        if (exclusions.count() == 0) std::printf("no exclusions (%s)\n", file.c_str());
+        for (const Value& rule : exclusions.items()) std::printf("%s\n", toJson(rule, false).c_str());
+    }
+    return 0;
+}
+
+int run(int argc, char** argv) {
+    Options options;
+    CLI::App app{
+        "bexil: talk to bxd, the plug-in registry daemon.\n"
+        "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
+        "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
+        "annotation); 64 bad arguments (nothing sent); 69 bxd not running; 70 unreadable reply; 75 no answer in time.",
+        "bexil"};
+    app.require_subcommand(1);
+    app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();
+    app.add_flag("--json", options.json, "print replies as JSON for scripts");
+    app.add_flag("-v,--verbose", options.verbose, "log the request and reply trace to standard error");
+    app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply")
+        ->check(CLI::PositiveNumber)
+        ->capture_default_str();
+
+    std::vector<std::string> paths, uuids, rules, flagNames, addRules;
+    std::string file, setFile;
+    uint64_t flags = 0;
+    int64_t election = -1;
+    bool pluginPaths = false, refuseBusy = false, terminate = false, clear = false;
+    std::function<int()> action;
+
+    auto* add = app.add_subcommand(
+        "add", "register plug-in bundles\n  example: bexil add /opt/Greeter.app/PlugIns/Hello.bxplugin");
+    add->add_option("paths", paths, "absolute paths of plug-in bundles")->required();
+    auto* remove = app.add_subcommand("remove",
+                                      "unregister plug-in bundles (needs the manager entitlement)\n  example: bexil "
+                                      "remove /opt/Greeter.app/PlugIns/Hello.bxplugin");
+    remove->add_option("paths", paths, "absolute paths of plug-in bundles")->required();
+    auto* bulk =
+        app.add_subcommand("bulk", "bulk registration request (no option is supported today)\n  example: bexil bulk");
+    bulk->add_option("--flags", flags, "option bits");
+    auto* match = app.add_subcommand("match",
+                                     "discover plug-ins\n  example: bexil match "
+                                     "RZExtensionPointIdentifier=com.example.greeting --flag all-versions");
+    match->add_option("rules", rules, "rules as KEY=PATTERN");
+    match->add_option("--rules-file", file, "rule dictionary from a .vrec or JSON file");
+    match->add_option("--flag", flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+    auto* ready = app.add_subcommand("ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...");
+    ready->add_option("uuids", uuids, "plug-in UUIDs")->required();
+    auto* access =
+        app.add_subcommand("access", "get read access tokens for plug-in bundles\n  example: bexil access 2F1C...");
+    access->add_option("uuids", uuids, "plug-in UUIDs")->required();
+    auto* annotate = app.add_subcommand(
+        "annotate", "set annotations of plug-ins\n  example: bexil annotate --election 1 --extension ext.json 2F1C...");
+    annotate->add_option("uuids", uuids, "plug-in UUIDs")->required();
+    annotate->add_option("--election", election, "election value (0: none, 1: elected)")->check(CLI::NonNegativeNumber);
+    annotate->add_option("--extension", file, "the client-defined annotation from a .vrec or JSON file");
+    auto* elect = app.add_subcommand("elect", "elect plug-ins (election 1)\n  example: bexil elect 2F1C...");
+    elect->add_option("uuids", uuids, "plug-in UUIDs")->required();
+    auto* unelect = app.add_subcommand(
+        "unelect", "withdraw the election of plug-ins (election 0)\n  example: bexil unelect 2F1C...");
+    unelect->add_option("uuids", uuids, "plug-in UUIDs")->required();
+    auto* bulkAnnotate = app.add_subcommand("bulk-annotate",
+                                            "replace the client-defined annotations of many plug-ins\n  example: bexil "
+                                            "bulk-annotate annotations.json   # {\"<uuid>\": {...}, ...}");
+    bulkAnnotate->add_option("file", file, ".vrec or JSON dictionary from plug-in UUID to annotation")->required();
+    auto* hold = app.add_subcommand(
+        "hold", "hold plug-ins out of use; prints the hold UUID\n  example: bexil hold --refuse-busy /opt/Greeter.app");
+    hold->add_option("paths", paths, "absolute paths of applications (or plug-ins with --plugin-paths)")->required();
+    hold->add_flag("--plugin-paths", pluginPaths, "the paths name plug-in bundles, not applications");
+    hold->add_flag("--refuse-busy", refuseBusy, "refuse the hold when a plug-in is busy");
+    hold->add_flag("--terminate", terminate, "terminate running instances once the hold is placed");
+    auto* release = app.add_subcommand("release", "release a hold\n  example: bexil release 7A0E...");
+    release->add_option("uuid", uuids, "the hold's UUID")->required()->expected(1);
+    auto* exclusions = app.add_subcommand("exclusions",
+                                          "show or set the global exclusions preference\n  example: bexil exclusions "
+                                          "--add RZExtensionPointIdentifier=com.example.ads");
+    exclusions->add_option("--set", setFile, "replace the exclusions by a .vrec or JSON file");
+    exclusions->add_option("--add", addRules, "append one rule made of KEY=PATTERN arguments");
+    exclusions->add_flag("--clear", clear, "remove every exclusion");
+
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::CallForHelp& e) {
+        return app.exit(e);
+    } catch (const CLI::CallForAllHelp& e) {
+        return app.exit(e);
+    } catch (const CLI::ParseError& e) {
+        std::fprintf(stderr, "bexil: %s\n", e.what());
+        return kExitUsage;
+    }
+
+    // The library logs to the system log; on a terminal without one, its lines would mix with the tool's own.
+    log::LogRegistry::shared().setThreshold(options.verbose ? log::Level::Debug : log::Level::Fault);
+
+    auto withPaths = [&](const char* what, auto sendPaths) -> int {
+        auto array = absolutePaths(paths);
+        if (!array) return usageFailure(array.error());
+        return roundTrip(options, what, [&](BXDaemonClient& c, auto h) { sendPaths(c, *array, std::move(h)); }, {});
+    };
+    auto withUuids = [&](const char* what, auto sendUuids,
+                         std::function<int(BXDaemonClient&, const Value&)> done) -> int {
+        auto list = parseUuids(uuids);
+        if (!list) return usageFailure(list.error());
+        return roundTrip(
+            options, what, [&](BXDaemonClient& c, auto h) { sendUuids(c, *list, std::move(h)); }, std::move(done));
+    };
+    auto annotateWith = [&](Value annotations) {
+        return withUuids("annotate",
+                         [&](BXDaemonClient& c, const std::vector<Uuid>& list, auto h) {
+                             c.setPluginAnnotationsAnnotationsReply(list, annotations, std::move(h));
+                         },
+                         {});
+    };
+
+    if (*add) return withPaths("add", [](BXDaemonClient& c, const Value& p, auto h) { c.addPlugInsReply(p, h); });
+    if (*remove)
+        return withPaths("remove", [](BXDaemonClient& c, const Value& p, auto h) { c.removePlugInsReply(p, h); });
+    if (*bulk) return roundTrip(options, "bulk", [&](BXDaemonClient& c, auto h) { c.bulkPluginsReply(flags, h); }, {});
+    if (*match) {
+        auto ruleSet = rulesFromArguments(rules);
+        if (!ruleSet) return usageFailure(ruleSet.error());
+        Value combined = *ruleSet;
+        if (!file.empty()) {
+            auto fromFile = readDictionaryFile(file);
+            if (!fromFile) return usageFailure(fromFile.error());
+            MutableDictionary merged(*fromFile);
+            for (const DictionaryEntry& entry : ruleSet->entries()) merged.set(entry.key, entry.value);
+            combined = merged.take();
+        }
+        auto matchFlags = discoveryFlags(flagNames);
+        if (!matchFlags) return usageFailure(matchFlags.error());
+        return roundTrip(
+            options, "match", [&](BXDaemonClient& c, auto h) { c.matchPlugInsFlagsReply(combined, *matchFlags, h); },
+            [&](BXDaemonClient& c, const Value& m) { return printMatches(options, c, m); });
+    }
+    if (*ready)
+        return withUuids(
+            "ready", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.readyPlugInsFlagsReply(l, 0, h); },
+            {});
+    if (*access)
+        return withUuids(
+            "access", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.accessPlugInsFlagsReply(l, 0, h); },
+            [&](BXDaemonClient& c, const Value& m) { return printExtensions(options, c, m); });
+    if (*annotate) {
+        MutableDictionary annotations;
+        if (election >= 0) annotations.set("election", Value::int64(election));
+        if (!file.empty()) {
+            auto extension = readDictionaryFile(file);
+            if (!extension) return usageFailure(extension.error());
+            annotations.set("extension", *extension);
+        }
+        if (annotations.count() == 0) {
+            usageError("annotate needs --election or --extension");
+            return kExitUsage;
+        }
+        return annotateWith(annotations.take());
+    }
+    if (*elect) return annotateWith(Value::dictionary({{"election", Value::int64(1)}}));
+    if (*unelect) return annotateWith(Value::dictionary({{"election", Value::int64(0)}}));
+    if (*bulkAnnotate) {
+        auto annotations = readDictionaryFile(file);
+        if (!annotations) return usageFailure(annotations.error());
+        for (const DictionaryEntry& entry : annotations->entries()) {
+            if (!Uuid::parse(entry.key)) {
+                usageError("bulk annotation key \"" + entry.key + "\" is not a plug-in UUID");
+                return kExitUsage;
+            }
+            if (!entry.value.isDictionary()) {
+                usageError("bulk annotation of " + entry.key + " is not a dictionary");
+                return kExitUsage;
+            }
+        }
+        return roundTrip(options, "bulk-annotate",
+                         [&](BXDaemonClient& c, auto h) { c.bulkSetPluginAnnotationsReply(*annotations, h); }, {});
+    }
+    if (*hold) {
+        auto array = absolutePaths(paths);
+        if (!array) return usageFailure(array.error());
+        uint64_t holdFlags = (pluginPaths ? 0x1 : 0) | (refuseBusy ? 0x2 : 0) | (terminate ? 0x4 : 0);
+        return roundTrip(
+            options, "hold", [&](BXDaemonClient& c, auto h) { c.holdPluginsFlagsReply(*array, holdFlags, h); },
+            [&](BXDaemonClient& c, const Value& m) { return printHold(options, c, m); });
+    }
+    if (*release)
+        return withUuids(
+            "release", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.releaseHoldReply(l.front(), h); },
+            {});
+    if (*exclusions) return exclusionsCommand(options, setFile, addRules, clear);
+    return kExitUsage;
+}
+
+}  // namespace
+}  // namespace bexil::tool
+
+int main(int argc, char** argv) { return bexil::tool::run(argc, argv); }
