@@ -1,12 +1,15 @@
 #include "policy/BXDPlugIn.h"
 
+#include <cerrno>
 #include <cmath>
 #include <cstdint>
+#include <cstring>
 #include <limits>
 
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
+#include "policy/BXIssueReadExtension.h"
 
 namespace bexil {
 
@@ -15,6 +18,9 @@ namespace {
 constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
 constexpr std::string_view kOldStyleInfoKey = "Bexil";
 constexpr std::string_view kDebugToolPrefix = "DT";
+constexpr std::string_view kSharedKey = "Shared";
+constexpr std::string_view kExtensionsFormKey = "extensions";
+constexpr std::string_view kWholeBundle = ".";
 
 // Seconds since 1970 with the fraction dropped, held to the range of the 32-bit field rather than wrapping.
 int32_t secondsAsInt32(double seconds) {
@@ -129,6 +135,36 @@ std::optional<std::string> BXDPlugIn::localizedContainingName() const {
     if (lxproxy_ && lxproxy_->containingBundle()) fetched = lxproxy_->containingBundle()->localizedName();
     if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedContainingName(fetched);
     return fetched;
+}
+
+// ---- Resource extensions ----
+
+void BXDPlugIn::augmentForm(MutableDictionary& form) const {
+    std::optional<Value> resources = pluginKey(kSharedKey);
+    // An application extension's host may read its whole bundle; its "Shared" entry is not used.
+    if (isAppExtension()) resources = Value::array({Value::string(kWholeBundle)});
+    if (!resources) return;
+    form.set(kExtensionsFormKey, issueResourceExtensions(*resources));
+}
+
+Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
+    Value list = paths.isString() ? Value::array({paths}) : paths;
+    std::string bundle = url().value_or(std::string());
+    MutableDictionary result;
+    for (const Value& element : list.items()) {
+        const std::string* resource = element.getString();
+        if (resource == nullptr) continue;
+        // Declared paths are joined unchanged; the sandbox resolves the target to its canonical form.
+        std::string target = *resource == kWholeBundle ? bundle : bundle + "/" + *resource;
+        if (std::optional<std::string> token = BXIssueReadExtension(target)) {
+            result.set(*resource, Value::string(std::move(*token)));
+        } else {
+            int cause = errno;
+            log::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", target, bundle,
+                            strerror(cause));
+        }
+    }
+    return result.take();
 }
 
 // ---- Entitlements and annotations ----

@@ -49,6 +49,13 @@ class BXDPlugIn : public BXPlugInCore {
     std::optional<std::string> localizedShortName() const override;
     std::optional<std::string> localizedContainingName() const override;
 
+    // Adds "extensions" to the form: read-only tokens for the whole bundle (".") of an application extension, else
+    // for the plug-in dictionary's "Shared" resources; a plug-in with neither leaves the form unchanged.
+    void augmentForm(MutableDictionary& form) const;
+    // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
+    // is one string or an array; other elements are passed over; paths that get no token are left out (logged).
+    Value issueResourceExtensions(const Value& paths) const;
+
     // The value of `key` in the plug-in's entitlements, or none.
     std::optional<Value> valueForEntitlement(std::string_view key) const;
     // True unless the entitlement is absent or equal to false (false, 0).

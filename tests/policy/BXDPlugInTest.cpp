@@ -1,10 +1,14 @@
 #include <gtest/gtest.h>
+#include <stdlib.h>
 
+#include <filesystem>
+#include <fstream>
 #include <unordered_set>
 
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
+#include "platform/sandbox/SandboxExtensions.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {
@@ -261,6 +265,88 @@ TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
     Value exported = form->value();
     EXPECT_EQ(exported.get("localizedContainingDisplayName"), str("Greeter"));
     EXPECT_EQ(exported.get("bundleInfo"), helloInfo());
+}
+
+// Plug-in bundles on disk, so that the sandbox can resolve the paths it issues tokens for.
+class BXDPlugInExtensionsTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        char pattern[] = "/tmp/bxdplugin-extensions-XXXXXX";
+        ASSERT_NE(mkdtemp(pattern), nullptr);
+        root_ = std::filesystem::canonical(pattern);
+        // The process's sandbox keeps its key under the runtime dir, read once on first use.
+        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        std::filesystem::create_directories(root_ / "Greeter.app/PlugIns/Hello.bxplugin/Resources");
+        std::ofstream(root_ / "Greeter.app/PlugIns/Hello.bxplugin/Resources/greetings.txt") << "hi";
+        std::filesystem::create_directories(root_ / "Greeter.app/PlugIns/Clipper.wexa");
+    }
+    void TearDown() override { std::filesystem::remove_all(root_); }
+
+    std::shared_ptr<BXDPlugIn> plugInAt(const std::string& relative, Value plugIn) {
+        auto fields = helloFields();
+        fields.bundleURL = (root_ / relative).string();
+        fields.infoVrec = helloInfo(plugIn);
+        return build(fields);
+    }
+
+    // The path a token grants, as a consumer over the same key sees it.
+    std::string grantedPath(const Value& token) {
+        SandboxExtensions consumer(SandboxExtensions::shared().keyPath());
+        int64_t handle = consumer.consume(std::string(token.stringView()));
+        EXPECT_GT(handle, 0);
+        return consumer.consumedPath(handle).value_or("(refused)");
+    }
+
+    std::filesystem::path root_;
+};
+
+TEST_F(BXDPlugInExtensionsTest, SharedResourcesGetTokensKeyedAsDeclared) {
+    auto plugIn = plugInAt("Greeter.app/PlugIns/Hello.bxplugin",
+                           plugInDictionary({{"Shared", Value::array({str("Resources/greetings.txt"), Value::int64(7),
+                                                                      str("Resources/missing.txt")})}}));
+    ASSERT_NE(plugIn, nullptr);
+    log::CaptureSink capture;
+    MutableDictionary form;
+    plugIn->augmentForm(form);
+    Value extensions = form.value().get("extensions");
+    ASSERT_EQ(extensions.count(), 1u) << extensions.description();
+    EXPECT_EQ(grantedPath(extensions.get("Resources/greetings.txt")),
+              (root_ / "Greeter.app/PlugIns/Hello.bxplugin/Resources/greetings.txt").string());
+    EXPECT_TRUE(capture.contains("failed to make extension for " + *plugIn->url() +
+                                 "/Resources/missing.txt in plug-in at " + *plugIn->url() +
+                                 ": No such file or directory"));
+
+    // A single string is a list of one.
+    Value single = plugIn->issueResourceExtensions(str("Resources"));
+    EXPECT_EQ(single.count(), 1u);
+    EXPECT_TRUE(single.contains("Resources"));
+}
+
+TEST_F(BXDPlugInExtensionsTest, ApplicationExtensionGetsOneTokenForItsWholeBundle) {
+    auto plugIn = plugInAt("Greeter.app/PlugIns/Clipper.wexa",
+                           plugInDictionary({{"PrincipalClass", str("RZObject")}, {"Shared", str("ignored")}}));
+    ASSERT_NE(plugIn, nullptr);
+    ASSERT_TRUE(plugIn->isAppExtension());
+    MutableDictionary form;
+    plugIn->augmentForm(form);
+    Value extensions = form.value().get("extensions");
+    ASSERT_EQ(extensions.count(), 1u);
+    EXPECT_EQ(grantedPath(extensions.get(".")), *plugIn->url());
+}
+
+TEST_F(BXDPlugInExtensionsTest, PlugInWithoutSharedResourcesLeavesTheFormAlone) {
+    auto plugIn = plugInAt("Greeter.app/PlugIns/Hello.bxplugin", plugInDictionary());
+    ASSERT_NE(plugIn, nullptr);
+    MutableDictionary form;
+    form.set("identifier", str("x"));
+    plugIn->augmentForm(form);
+    EXPECT_EQ(form.value(), dict({{"identifier", str("x")}}));
+
+    // Resources that all fail still leave an (empty) "extensions" entry.
+    auto missing = plugInAt("Greeter.app/PlugIns/Hello.bxplugin", plugInDictionary({{"Shared", str("nothing")}}));
+    MutableDictionary other;
+    missing->augmentForm(other);
+    EXPECT_EQ(other.value().get("extensions"), Value::emptyDictionary());
 }
 
 }  // namespace
