@@ -6,6 +6,8 @@ find_package(fmt REQUIRED)
 find_package(pugixml REQUIRED)
 # The application registry's store; only src/platform/ledgerix includes it.
 find_package(SQLite3 REQUIRED)
+# Digests and sandbox-token signatures (libcrypto only).
+find_package(OpenSSL REQUIRED COMPONENTS Crypto)
 pkg_check_modules(SYSTEMD REQUIRED IMPORTED_TARGET libsystemd)
 if(BEXIL_BENCH AND NOT BEXIL_FUZZ)
     find_package(benchmark REQUIRED)

@@ -9,6 +9,7 @@
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDZemClient.h"
 #include "platform/codesign/EntitlementsDirectory.h"
+#include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemListener.h"
@@ -81,7 +82,7 @@ void BXDServer::run() {
 // request queue is free, so a request goes from its bytes to its reply without another turn of the loop.
 void BXDServer::submitWork(std::function<void()> work) { mainQueue_.dispatch(std::move(work)); }
 
-void BXDServer::removedPlugIns(const Value& plugIns) {
+void BXDServer::removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
     // FIXME: terminate the plug-ins' running instances first, once the service manager is there to ask.
     log::ops().debug("removal complete for %@", plugIns);
 }

@@ -21,6 +21,7 @@ class BXDPlugInHold;
 class BXDZemClient;
 class EntitlementsDirectory;
 class EventLoop;
+class LXBexilProxy;
 class ZemListener;
 
 class BXDServer : public BXDatabase, public BXDatabaseDelegate {
@@ -43,7 +44,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     void submitWork(std::function<void()> work);
 
     // Database delegate: plug-ins about to be uninstalled.
-    void removedPlugIns(const Value& plugIns) override;
+    void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
     // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
     void unholdClient(const BXDZemClient* client);
 

@@ -7,8 +7,10 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
+#include <string>
 #include <string_view>
 
 #include "base/Error.h"
@@ -17,6 +19,7 @@
 
 namespace bexil {
 
+class BXDPlugIn;
 class BXDServer;
 class BXDZemClient;
 class ZemConnection;
@@ -52,6 +55,20 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     BXDServer* server() const;
     std::shared_ptr<ZemConnection> connection() const;
     bool answered() const { return answered_.load(); }
+
+    // Called per path of a request with the path (resolved when `resolved`, else as the client sent it); false
+    // stops the walk, after the handler has answered with fail().
+    using RegistrationHandler = std::function<bool(const std::string& path, bool resolved)>;
+    // Called per plug-in named by a request; false stops the walk, after the handler has answered with fail().
+    using PlugInHandler = std::function<bool(const std::shared_ptr<BXDPlugIn>& plugIn)>;
+
+    // Walks the request's "paths": every element must be an absolute path string. True when every path was handled
+    // and every handler call returned true; on false the transaction has been answered.
+    bool marshalPaths(const RegistrationHandler& handler);
+    // marshalPaths, then done() when it returned true.
+    bool processPaths(const RegistrationHandler& handler);
+    // Walks the request's "uuids", resolving each through the database. Sends no reply on success.
+    bool processUuidList(const PlugInHandler& handler);
 
     // Request handlers, one per request name.
     void addPlugIns();

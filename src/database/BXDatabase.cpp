@@ -1,12 +1,231 @@
 #include "database/BXDatabase.h"
 
+// Every record the daemon hands out comes from here. The cache is a plain map guarded by `_sync`; the registry is
+// asked outside `_sync` wherever the algorithm allows (look-ups by path and by application), so a slow registry
+// query never blocks the annotation operations of other requests. The purge is deliberately all or nothing: the
+// limit exists to bound memory in pathological cases, not to implement an eviction policy.
+
+#include "base/QueueAssert.h"
+#include "database/BXDAnnotationStore.h"
+#include "model/BXUtilities.h"
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXApplicationWorkspace.h"
+#include "platform/ledgerix/LXApplicationWorkspaceObserverProtocol.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/log/Log.h"
+#include "platform/notify/SystemNotifications.h"
+#include "policy/BXDPlugIn.h"
+
 namespace bexil {
 
-BXDatabase::BXDatabase(std::optional<std::string> databasePath) : databasePath_(std::move(databasePath)) {}
+namespace {
+
+constexpr std::string_view kAnnotationsFormKey = "annotations";
+
+std::string pathOf(const std::shared_ptr<const LXBexilProxy>& proxy) { return proxy->bundleURL().value_or("(null)"); }
+
+std::string uuidText(const std::shared_ptr<const LXBexilProxy>& proxy) {
+    return proxy->pluginUUID() ? proxy->pluginUUID()->string() : std::string("(null)");
+}
+
+}  // namespace
+
+// Forwards the registry's callbacks to the database that owns it.
+class BXDatabase::Observer final : public LXApplicationWorkspaceObserverProtocol {
+  public:
+    explicit Observer(BXDatabase& database) : database_(database) {}
+    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) override {
+        database_.pluginsDidInstall(plugins);
+    }
+    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) override {
+        database_.pluginsWillUninstall(plugins);
+    }
+
+  private:
+    BXDatabase& database_;
+};
+
+BXDatabase::BXDatabase(std::optional<std::string> databasePath, std::shared_ptr<LXApplicationWorkspace> workspace,
+                       NotificationPoster poster)
+    : databasePath_(std::move(databasePath)), workspace_(std::move(workspace)), poster_(std::move(poster)) {}
+
+BXDatabase::~BXDatabase() {
+    if (workspace_ && observer_) workspace_->removeObserver(observer_.get());
+}
+
+std::unique_ptr<BXDatabase> BXDatabase::create(std::optional<std::string> databasePath,
+                                               std::shared_ptr<LXApplicationWorkspace> workspace,
+                                               NotificationPoster poster) {
+    std::unique_ptr<BXDatabase> database(
+        new BXDatabase(std::move(databasePath), std::move(workspace), std::move(poster)));
+    if (!database->initWithDatabase()) return nullptr;
+    return database;
+}
 
 bool BXDatabase::initWithDatabase() {
-    // Nothing can fail yet: the stores that can (the registry, the annotation document) open here as they arrive.
+    if (!workspace_) {
+        Result<std::shared_ptr<LXApplicationWorkspace>> shared = LXApplicationWorkspace::defaultWorkspace();
+        if (!shared) {
+            log::ops().error("unable to open the application registry: %@", shared.error());
+            return false;
+        }
+        workspace_ = *shared;
+    }
+    try {
+        annotations_ = std::make_unique<BXDAnnotationStore>(databasePath_);
+    } catch (const InternalInconsistency& e) {
+        // The store could locate neither the document nor the daemon's container: nothing to serve annotations from.
+        log::ops().error("unable to open the annotation store: %s", e.what());
+        return false;
+    }
+    if (!poster_) {
+        auto notifications = std::make_shared<SystemNotifications>();
+        poster_ = [notifications](std::string_view name) {
+            if (std::optional<Error> error = notifications->post(name))
+                log::ops().error("unable to post %{public}@: %@", name, *error);
+        };
+    }
+    observer_ = std::make_shared<Observer>(*this);
+    workspace_->addObserver(observer_);
     return true;
+}
+
+BXDAnnotationStore& BXDatabase::annotations() {
+    BX_ASSERT_ON_QUEUE(_sync);
+    return *annotations_;
+}
+
+// ---- Records ----
+
+std::shared_ptr<BXDPlugIn> BXDatabase::plugInForProxy(const std::shared_ptr<const LXBexilProxy>& proxy) {
+    if (!proxy) return nullptr;
+    return _sync.sync([&]() -> std::shared_ptr<BXDPlugIn> {
+        if (proxy->pluginUUID()) {
+            auto hit = cache_.find(*proxy->pluginUUID());
+            if (hit != cache_.end()) return hit->second;
+        }
+        return createPlugInForProxy(proxy);
+    });
+}
+
+std::shared_ptr<BXDPlugIn> BXDatabase::createPlugInForProxy(const std::shared_ptr<const LXBexilProxy>& proxy) {
+    BX_ASSERT_ON_QUEUE(_sync);
+    std::shared_ptr<BXDPlugIn> plugIn = BXDPlugIn::initWithLXData(proxy);
+    if (!plugIn) return nullptr;
+    if (plugIn->hasEntitlement(BXDPlugIn::kAutoElectEntitlement)) autoElect(*plugIn);
+    purgeCachesToLimit(cacheLimit());
+    // A record always has a UUID after set-up (a random one when the registry gave none).
+    cache_[*plugIn->uuid()] = plugIn;
+    return plugIn;
+}
+
+void BXDatabase::purgeCachesToLimit(unsigned limit) {
+    BX_ASSERT_ON_QUEUE(_sync);
+    if (cache_.size() <= limit) return;
+    log::ops().info("purging cache for %d > %d", cache_.size(), limit);
+    cache_.clear();
+    workspace_->LXClearSchemaCaches();
+}
+
+std::shared_ptr<BXDPlugIn> BXDatabase::findPlugIn(const Uuid& uuid) {
+    return _sync.sync([&]() -> std::shared_ptr<BXDPlugIn> {
+        auto hit = cache_.find(uuid);
+        if (hit != cache_.end()) return hit->second;
+        if (std::shared_ptr<const LXBexilProxy> proxy = workspace_->pluginProxyForUUID(uuid))
+            return createPlugInForProxy(proxy);
+        log::ops().info("Ledgerix cannot find plug-in with UUID:%{public}@", uuid.string());
+        return nullptr;
+    });
+}
+
+std::shared_ptr<BXDPlugIn> BXDatabase::findPlugInAtPath(std::string_view url) {
+    std::shared_ptr<const LXBexilProxy> proxy = workspace_->pluginProxyForURL(url);
+    if (!proxy) {
+        log::ops().info("Ledgerix cannot find plug-in at path:%@", url);
+        return nullptr;
+    }
+    // A registry record always carries its UUID; one without cannot be looked up by it.
+    if (!proxy->pluginUUID()) return nullptr;
+    return findPlugIn(*proxy->pluginUUID());
+}
+
+std::optional<std::vector<std::shared_ptr<BXDPlugIn>>> BXDatabase::plugInsWithinApplication(std::string_view url) {
+    std::shared_ptr<const LXApplicationProxy> application = workspace_->applicationProxyForBundleURL(url);
+    if (!application || application->plugins().empty()) return std::nullopt;
+    std::vector<std::shared_ptr<BXDPlugIn>> plugIns;
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : application->plugins()) {
+        if (std::shared_ptr<BXDPlugIn> plugIn = plugInForProxy(proxy)) plugIns.push_back(std::move(plugIn));
+    }
+    return plugIns;
+}
+
+std::optional<Error> BXDatabase::addPlugIn(std::string_view url) {
+    Result<std::shared_ptr<const LXBexilProxy>> registered = workspace_->registerPlugin(url);
+    if (!registered) {
+        log::ops().debug("registry refused %@: %@", url, registered.error());
+        return BXError(2, "Ledgerix failed to register the plug-in");
+    }
+    return std::nullopt;
+}
+
+std::optional<Error> BXDatabase::removePlugIn(std::string_view url) {
+    if (std::optional<Error> error = workspace_->unregisterPlugin(url)) {
+        log::ops().debug("registry refused to unregister %@: %@", url, *error);
+        return BXError(2, "Ledgerix failed to deregister the plug-in");
+    }
+    return std::nullopt;
+}
+
+size_t BXDatabase::cachedCount() {
+    return _sync.sync([&] { return cache_.size(); });
+}
+
+// ---- Annotations ----
+
+Value BXDatabase::annotationForPlugIn(const BXDPlugIn& plugIn) {
+    return _sync.sync([&] { return annotations_->annotationForPlugIn(plugIn); });
+}
+
+void BXDatabase::setAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn) {
+    _sync.sync([&] { annotations_->setAnnotationForPlugIn(annotation, plugIn); });
+}
+
+void BXDatabase::addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& form) {
+    Value annotation = annotationForPlugIn(plugIn);
+    form.set(kAnnotationsFormKey, annotation.isDictionary() ? annotation : Value::emptyDictionary());
+}
+
+void BXDatabase::notifyAnnotationChange() { poster_(kAnnotationChangeNotification); }
+
+void BXDatabase::autoElect(const BXDPlugIn& plugIn) {
+    BX_ASSERT_ON_QUEUE(_sync);
+    // The store directly: the database's own annotation operations would enter `_sync` again.
+    Value current = annotations_->annotationForPlugIn(plugIn);
+    if (!current.isDictionary()) current = Value::emptyDictionary();
+    const Value* election = current.find(kElectionKey);
+    if (election != nullptr && !(*election == Value::int64(0))) return;
+    std::optional<Value> elected = dictionaryChangingTo(current, kElectionKey, Value::int64(kAutoElection));
+    annotations_->setAnnotationForPlugIn(*elected, plugIn);
+}
+
+// ---- Registry events ----
+
+void BXDatabase::pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) {
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : plugins) {
+        log::ops().notice("plug-in INSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
+                          proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
+    }
+}
+
+void BXDatabase::pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) {
+    _sync.sync([&] {
+        for (const std::shared_ptr<const LXBexilProxy>& proxy : plugins) {
+            log::ops().notice("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
+                              proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
+            if (proxy->pluginUUID()) cache_.erase(*proxy->pluginUUID());
+        }
+    });
+    if (BXDatabaseDelegate* target = delegate()) target->removedPlugIns(plugins);
 }
 
 }  // namespace bexil

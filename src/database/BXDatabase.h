@@ -1,25 +1,58 @@
 #pragma once
 
-// The daemon's plug-in database: owns the record cache, the annotation store and the registry workspace, and tells
-// its delegate about uninstalls. This is the part that process start-up needs (the database path, the cache limit
-// and the delegate); the cache and the registry grow on it.
+// BXDatabase is the daemon's view of the installed plug-ins. The application registry is the source of truth; the
+// database caches the daemon's plug-in records (BXDPlugIn) by UUID, builds them lazily from the registry's records,
+// owns the annotation store, asks the registry to register and unregister bundles and observes its install and
+// uninstall events. The cache and the annotation store are touched only inside `_sync`; every public operation may
+// be called from any thread that is not inside `_sync` (those marked REQUIRES are the exception).
 
 #include <atomic>
+#include <functional>
+#include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
 
+#include "base/Error.h"
+#include "base/SyncQueue.h"
+#include "base/Value.h"
 #include "database/BXDatabaseDelegate.h"
 
 namespace bexil {
+
+class BXDAnnotationStore;
+class BXDPlugIn;
+class LXApplicationWorkspace;
+class LXBexilProxy;
+class MutableDictionary;
 
 class BXDatabase {
   public:
     // Default for the largest number of cached records before the cache is emptied.
     static constexpr unsigned kDefaultCacheLimit = 1000000;
+    // Posted (without payload) after a client's annotation changes and after hold changes.
+    static constexpr std::string_view kAnnotationChangeNotification = "com.quorvel.bexil.annotation-change";
+    // The annotation "election" key and the value automatic election stores.
+    static constexpr std::string_view kElectionKey = "election";
+    static constexpr int64_t kAutoElection = 1;
 
-    virtual ~BXDatabase() = default;
+    // Posts a named system notification; the default posts through the platform's notification folder.
+    using NotificationPoster = std::function<void(std::string_view name)>;
 
-    // The annotation document path (none: the store's default location).
+    // A database over `workspace` (none: the registry's shared workspace in the default state directory) with the
+    // annotation document at `databasePath` (none: the store's default). None when the registry or the annotation
+    // store cannot be opened (logged). For tests and tools; the daemon builds its server instead.
+    static std::unique_ptr<BXDatabase> create(std::optional<std::string> databasePath,
+                                              std::shared_ptr<LXApplicationWorkspace> workspace = nullptr,
+                                              NotificationPoster poster = nullptr);
+
+    virtual ~BXDatabase();
+    BXDatabase(const BXDatabase&) = delete;
+    BXDatabase& operator=(const BXDatabase&) = delete;
+
+    // The annotation document path given at construction (none: the store's default location).
     const std::optional<std::string>& databasePath() const { return databasePath_; }
 
     unsigned cacheLimit() const { return cacheLimit_.load(std::memory_order_relaxed); }
@@ -29,16 +62,74 @@ class BXDatabase {
     BXDatabaseDelegate* delegate() const { return delegate_.load(); }
     void setDelegate(BXDatabaseDelegate* delegate) { delegate_.store(delegate); }
 
+    const std::shared_ptr<LXApplicationWorkspace>& workspace() const { return workspace_; }
+    // REQUIRES: inside `_sync` (the store has no lock of its own).
+    BXDAnnotationStore& annotations();
+    SyncQueue& sync() { return _sync; }
+
+    // ---- Records ----
+
+    // The record of a registry record: the cached one, else a new one. None when no record can be built.
+    std::shared_ptr<BXDPlugIn> plugInForProxy(const std::shared_ptr<const LXBexilProxy>& proxy);
+    // Builds, auto-elects and caches a record (purging first when the cache is over its limit). REQUIRES: inside
+    // `_sync`.
+    std::shared_ptr<BXDPlugIn> createPlugInForProxy(const std::shared_ptr<const LXBexilProxy>& proxy);
+    // Empties the whole cache when it holds more than `limit` records. REQUIRES: inside `_sync`.
+    void purgeCachesToLimit(unsigned limit);
+
+    std::shared_ptr<BXDPlugIn> findPlugIn(const Uuid& uuid);
+    // The record of the plug-in bundle at `url` (a path); the registry is asked every time.
+    std::shared_ptr<BXDPlugIn> findPlugInAtPath(std::string_view url);
+    // The records of an application's plug-ins in the registry's order; none (not empty) when it has none.
+    std::optional<std::vector<std::shared_ptr<BXDPlugIn>>> plugInsWithinApplication(std::string_view url);
+
+    // Registers / unregisters the plug-in bundle at `url`; an error of code 2 when the registry refuses.
+    std::optional<Error> addPlugIn(std::string_view url);
+    std::optional<Error> removePlugIn(std::string_view url);
+
+    // The number of cached records (for tests and diagnostics).
+    size_t cachedCount();
+
+    // ---- Annotations ----
+
+    // The stored annotation of the plug-in (a dictionary), or null.
+    Value annotationForPlugIn(const BXDPlugIn& plugIn);
+    // Merges `annotation` into the stored one (null removes it) and saves. Posts nothing: callers that change
+    // annotations for a client call notifyAnnotationChange once when they are done.
+    void setAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn);
+    // Sets the form's "annotations" to the plug-in's stored annotation, or to an empty dictionary.
+    void addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& form);
+    void notifyAnnotationChange();
+    // Stores election 1 unless an election is already made. REQUIRES: inside `_sync`.
+    void autoElect(const BXDPlugIn& plugIn);
+
+    // ---- Registry events ----
+
+    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins);
+    // Drops the records from the cache inside `_sync`, then tells the delegate outside it.
+    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins);
+
   protected:
-    // initWithDatabase: a path or none; subclasses finish construction and report failure through initWithDatabase.
-    explicit BXDatabase(std::optional<std::string> databasePath);
-    // Whether the database could be built (its stores opened); false makes the server's construction fail.
+    // initWithDatabase: remembers the path; initWithDatabase() then opens the registry and the store.
+    explicit BXDatabase(std::optional<std::string> databasePath,
+                        std::shared_ptr<LXApplicationWorkspace> workspace = nullptr,
+                        NotificationPoster poster = nullptr);
+    // False when the registry or the annotation store cannot be opened (logged); the object is then unusable.
     bool initWithDatabase();
 
   private:
+    class Observer;
+
     std::optional<std::string> databasePath_;
     std::atomic<unsigned> cacheLimit_{kDefaultCacheLimit};
     std::atomic<BXDatabaseDelegate*> delegate_{nullptr};
+    std::shared_ptr<LXApplicationWorkspace> workspace_;
+    std::unique_ptr<BXDAnnotationStore> annotations_;
+    NotificationPoster poster_;
+    // The registry holds its observers weakly; this forwarder lives exactly as long as the database.
+    std::shared_ptr<Observer> observer_;
+    SyncQueue _sync{"BXDatabase"};
+    std::unordered_map<Uuid, std::shared_ptr<BXDPlugIn>> cache_;
 };
 
 }  // namespace bexil

@@ -1,17 +1,20 @@
 #pragma once
 
-// What the plug-in database tells its owner: plug-ins that are about to be uninstalled. Called on the database's
-// queue after it has left its lock.
+// What the plug-in database tells its owner: plug-ins that are about to be uninstalled. Called on the thread on which
+// the registry reported the uninstall, after the database has left its lock.
 
-#include "base/Value.h"
+#include <memory>
+#include <vector>
 
 namespace bexil {
+
+class LXBexilProxy;
 
 class BXDatabaseDelegate {
   public:
     virtual ~BXDatabaseDelegate() = default;
-    // `plugIns` is an array describing the registry records about to be uninstalled.
-    virtual void removedPlugIns(const Value& plugIns) = 0;
+    // The registry records about to be uninstalled, as the registry reported them.
+    virtual void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) = 0;
 };
 
 }  // namespace bexil

@@ -5,9 +5,6 @@
 
 namespace bexil {
 
-void Transaction::addPlugIns() { fail(4, "the \"add\" operation is not available yet"); }
-void Transaction::removePlugIns() { fail(4, "the \"remove\" operation is not available yet"); }
-void Transaction::bulkPlugIns() { fail(4, "the \"bulk\" operation is not available yet"); }
 void Transaction::matchPlugIns() { fail(4, "the \"match\" operation is not available yet"); }
 void Transaction::readyPlugIns() { fail(4, "the \"ready\" operation is not available yet"); }
 void Transaction::accessPlugIns() { fail(4, "the \"access\" operation is not available yet"); }

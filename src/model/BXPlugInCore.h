@@ -129,7 +129,8 @@ class BXPlugInCore {
     // File URL of the bundle, as its path.
     std::optional<std::string> url() const;
     void setUrl(std::optional<std::string> v);
-    std::optional<Value> bundleInfoDictionary() const;
+    // The four below are virtual so that a record backed by another source (the registry) can answer them.
+    virtual std::optional<Value> bundleInfoDictionary() const;
     void setBundleInfoDictionary(std::optional<Value> v);
     virtual std::optional<Value> plugInDictionary() const;
     virtual void setPlugInDictionary(std::optional<Value> v);
@@ -144,11 +145,11 @@ class BXPlugInCore {
     void setOnSystemVolume(bool v);
     uint32_t hubProtocolVersion() const;
     void setHubProtocolVersion(uint32_t v);
-    std::optional<std::string> localizedName() const;
+    virtual std::optional<std::string> localizedName() const;
     void setLocalizedName(std::optional<std::string> v);
-    std::optional<std::string> localizedShortName() const;
+    virtual std::optional<std::string> localizedShortName() const;
     void setLocalizedShortName(std::optional<std::string> v);
-    std::optional<std::string> localizedContainingName() const;
+    virtual std::optional<std::string> localizedContainingName() const;
     void setLocalizedContainingName(std::optional<std::string> v);
     int32_t lastModified() const;
     void setLastModified(int32_t v);

@@ -1,0 +1,133 @@
+// The registration requests ("add", "remove", "bulk") and the two walkers that other handlers build on: the path
+// walker and the UUID-list walker. Every walker stops at the first element that fails and leaves the reply to the
+// code that failed; work done for earlier elements is not undone, because the registry's changes are per bundle.
+
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <string>
+
+#include "daemon/BXDServer.h"
+#include "daemon/BXDZemClient.h"
+#include "daemon/Transaction.h"
+#include "platform/log/Log.h"
+#include "platform/trace/Probes.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+
+namespace {
+
+// Resolved paths longer than this are treated as not resolving, as with the fixed buffer clients were promised.
+constexpr size_t kResolvedPathBufferSize = 1024;
+// Entitlement that a caller needs to unregister plug-ins.
+constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
+
+// The canonical absolute path of `path`, or none when it does not resolve (or does not fit the buffer size).
+std::optional<std::string> resolvePath(const std::string& path) {
+    // A path with an embedded NUL cannot name a file; realpath would silently look at a prefix of it.
+    if (path.find('\0') != std::string::npos) return std::nullopt;
+    std::unique_ptr<char, decltype(&free)> resolved(realpath(path.c_str(), nullptr), &free);
+    if (!resolved || strlen(resolved.get()) >= kResolvedPathBufferSize) return std::nullopt;
+    return std::string(resolved.get());
+}
+
+}  // namespace
+
+bool Transaction::marshalPaths(const RegistrationHandler& handler) {
+    std::optional<Value> paths = zem_dictionary_get_array(request(), "paths");
+    if (!paths) {
+        fail(4, "invalid request format");
+        return false;
+    }
+    for (const Value& element : paths->items()) {
+        const std::string* path = element.getString();
+        if (path == nullptr) {
+            fail(4, "invalid request format");
+            return false;
+        }
+        if (path->empty() || path->front() != '/') {
+            fail(9, formatPrintf("absolute path required: %s", *path));
+            return false;
+        }
+        std::optional<std::string> resolved = resolvePath(*path);
+        if (!handler(resolved ? *resolved : *path, resolved.has_value())) return false;
+    }
+    return true;
+}
+
+bool Transaction::processPaths(const RegistrationHandler& handler) {
+    if (!marshalPaths(handler)) return false;
+    done();
+    return true;
+}
+
+bool Transaction::processUuidList(const PlugInHandler& handler) {
+    std::optional<Value> uuids = zem_dictionary_get_array(request(), "uuids");
+    if (!uuids) {
+        fail(4, "invalid request format (uuid)");
+        return false;
+    }
+    for (const Value& element : uuids->items()) {
+        const Uuid* bytes = element.getUuid();
+        if (bytes == nullptr) {
+            fail(4, "invalid request (bad uuid array)");
+            return false;
+        }
+        // A UUID value is always its 16 bytes, so making the UUID object cannot fail here; the answer for that case
+        // ("invalid request (uuid allocation failure)") therefore never goes out.
+        Uuid uuid(bytes->bytes());
+        std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(uuid);
+        if (!plugIn) {
+            fail(4, "no such plugin (uuid not found)");
+            return false;
+        }
+        if (!handler(plugIn)) return false;
+    }
+    return true;
+}
+
+void Transaction::addPlugIns() {
+    processPaths([this](const std::string& path, bool resolved) {
+        if (!resolved) {
+            fail(9, formatPrintf("invalid plugin path: %@", path));
+            return false;
+        }
+        trace::pluginAdd(path.c_str());
+        if (std::optional<Error> error = server()->addPlugIn(path)) {
+            log::ops().notice("failed to register plug-in at %@", path);
+            // The database's own wording stays in the log; the client learns only which path failed.
+            fail(2, formatPrintf("unable to register plug-in at %@", path));
+            return false;
+        }
+        return true;
+    });
+}
+
+void Transaction::removePlugIns() {
+    processPaths([this](const std::string& path, bool resolved) {
+        trace::pluginRemove(path.c_str(), resolved);
+        if (!client()->hasEntitlement(kManagerEntitlement)) {
+            log::defaultLog().notice(
+                "refused request from pid=%d to remove plug-in at %@ - client lacks required entitlement",
+                client()->pid(), path);
+            fail(11, "caller lacks entitlement for this operation");
+            return false;
+        }
+        // An unresolved path goes to the registry as the client sent it: the bundle may already be deleted.
+        if (server()->removePlugIn(path)) {
+            fail(9, formatPrintf("no plugin at %@", path));
+            return false;
+        }
+        return true;
+    });
+}
+
+void Transaction::bulkPlugIns() {
+    uint64_t flags = request().get("flags").numberAsUInt64().value_or(0);
+    log::ops().info("bulk options 0x%lx not supported", static_cast<unsigned long>(flags));
+    done();
+}
+
+}  // namespace bexil

@@ -1,0 +1,182 @@
+#include "platform/sandbox/SandboxExtensions.h"
+
+#include <fcntl.h>
+#include <openssl/crypto.h>
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+#include <openssl/rand.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstdlib>
+
+namespace bexil {
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr size_t kKeyBytes = 32;
+constexpr char kSeparator = ';';
+
+std::string hex(const unsigned char* bytes, size_t count) {
+    static constexpr char kDigits[] = "0123456789abcdef";
+    std::string text;
+    text.reserve(count * 2);
+    for (size_t i = 0; i < count; ++i) {
+        text += kDigits[bytes[i] >> 4];
+        text += kDigits[bytes[i] & 0xf];
+    }
+    return text;
+}
+
+// Writes the key to a fresh temporary file of mode 0600 and renames it into place, so a reader sees the old key or
+// the new one, never a part.
+bool writeKey(const fs::path& path, const std::vector<uint8_t>& key) {
+    std::error_code ec;
+    fs::create_directories(path.parent_path(), ec);
+    fs::path temporary = path;
+    temporary += ".tmp-" + std::to_string(getpid());
+    int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600);
+    if (fd < 0) return false;
+    // The mode of an existing temporary left by a crash is not trusted.
+    bool ok = ::fchmod(fd, 0600) == 0 && ::write(fd, key.data(), key.size()) == static_cast<ssize_t>(key.size()) &&
+              ::fsync(fd) == 0;
+    int saved = errno;
+    ::close(fd);
+    if (!ok || ::rename(temporary.c_str(), path.c_str()) != 0) {
+        if (ok) saved = errno;
+        ::unlink(temporary.c_str());
+        errno = saved;
+        return false;
+    }
+    return true;
+}
+
+std::optional<std::vector<uint8_t>> readKey(const fs::path& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return std::nullopt;
+    std::vector<uint8_t> key(kKeyBytes + 1);
+    ssize_t n = ::read(fd, key.data(), key.size());
+    int saved = errno;
+    ::close(fd);
+    if (n != static_cast<ssize_t>(kKeyBytes)) {
+        errno = n < 0 ? saved : EINVAL;
+        return std::nullopt;
+    }
+    key.resize(kKeyBytes);
+    return key;
+}
+
+}  // namespace
+
+fs::path SandboxExtensions::defaultKeyPath() {
+    fs::path runtime;
+    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) {
+        runtime = dir;
+    } else if (geteuid() == 0) {
+        runtime = "/run/bexil";
+    } else if (const char* xdg = getenv("XDG_RUNTIME_DIR"); xdg && *xdg) {
+        runtime = fs::path(xdg) / "bexil";
+    } else {
+        runtime = fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
+    }
+    return runtime / "sandbox" / "extension-key";
+}
+
+SandboxExtensions& SandboxExtensions::shared() {
+    static SandboxExtensions instance(defaultKeyPath());
+    return instance;
+}
+
+SandboxExtensions::SandboxExtensions(fs::path keyPath) : keyPath_(std::move(keyPath)) {}
+
+bool SandboxExtensions::ensureIssuingKeyLocked() {
+    if (!issuingKey_.empty()) {
+        // Someone cleaned the runtime dir: put the key back, or no consumer could check this run's tokens.
+        struct stat status;
+        if (::stat(keyPath_.c_str(), &status) == 0) return true;
+        return writeKey(keyPath_, issuingKey_);
+    }
+    std::vector<uint8_t> key(kKeyBytes);
+    if (RAND_bytes(key.data(), static_cast<int>(key.size())) != 1) {
+        errno = EIO;
+        return false;
+    }
+    if (!writeKey(keyPath_, key)) return false;
+    issuingKey_ = std::move(key);
+    return true;
+}
+
+std::string SandboxExtensions::signature(const std::vector<uint8_t>& key, std::string_view extensionClass,
+                                         std::string_view path) const {
+    // Class and path are joined by a NUL, which neither can contain, so no two pairs sign the same bytes.
+    std::string message(extensionClass);
+    message += '\0';
+    message += path;
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int length = 0;
+    HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(message.data()),
+         message.size(), digest, &length);
+    return hex(digest, length);
+}
+
+std::optional<std::string> SandboxExtensions::issueFileExtension(std::string_view extensionClass,
+                                                                 const std::string& path) {
+    if (extensionClass.empty() || extensionClass.find(kSeparator) != std::string_view::npos ||
+        path.find('\0') != std::string::npos) {
+        errno = EINVAL;
+        return std::nullopt;
+    }
+    std::unique_ptr<char, decltype(&free)> canonical(realpath(path.c_str(), nullptr), &free);
+    if (!canonical) return std::nullopt;
+    std::string resolved(canonical.get());
+    if (resolved.size() > kMaxPathLength) {
+        errno = ENAMETOOLONG;
+        return std::nullopt;
+    }
+    std::lock_guard lock(mutex_);
+    if (!ensureIssuingKeyLocked()) return std::nullopt;
+    return std::string(extensionClass) + kSeparator + signature(issuingKey_, extensionClass, resolved) + kSeparator +
+           resolved;
+}
+
+int64_t SandboxExtensions::consume(const std::string& token) {
+    size_t first = token.find(kSeparator);
+    size_t second = first == std::string::npos ? std::string::npos : token.find(kSeparator, first + 1);
+    if (second == std::string::npos || first == 0 || second + 1 >= token.size()) {
+        errno = EPERM;
+        return -1;
+    }
+    std::string_view extensionClass(token.data(), first);
+    std::string_view mac(token.data() + first + 1, second - first - 1);
+    std::string_view path(token.data() + second + 1, token.size() - second - 1);
+
+    std::optional<std::vector<uint8_t>> key = readKey(keyPath_);
+    if (!key) return -1;
+    std::string expected = signature(*key, extensionClass, path);
+    if (mac.size() != expected.size() || CRYPTO_memcmp(mac.data(), expected.data(), expected.size()) != 0) {
+        errno = EPERM;
+        return -1;
+    }
+    std::lock_guard lock(mutex_);
+    int64_t handle = nextHandle_++;
+    consumed_.emplace(handle, std::string(path));
+    return handle;
+}
+
+void SandboxExtensions::release(int64_t handle) {
+    std::lock_guard lock(mutex_);
+    consumed_.erase(handle);
+}
+
+std::optional<std::string> SandboxExtensions::consumedPath(int64_t handle) const {
+    std::lock_guard lock(mutex_);
+    auto found = consumed_.find(handle);
+    if (found == consumed_.end()) return std::nullopt;
+    return found->second;
+}
+
+}  // namespace bexil

@@ -1,0 +1,212 @@
+#include "policy/BXDPlugIn.h"
+
+#include <cerrno>
+#include <cmath>
+#include <cstdint>
+#include <cstring>
+#include <limits>
+
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/log/Log.h"
+#include "policy/BXIssueReadExtension.h"
+
+namespace bexil {
+
+namespace {
+
+constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
+constexpr std::string_view kOldStyleInfoKey = "Bexil";
+constexpr std::string_view kDebugToolPrefix = "DT";
+constexpr std::string_view kSharedKey = "Shared";
+constexpr std::string_view kExtensionsFormKey = "extensions";
+constexpr std::string_view kWholeBundle = ".";
+
+// Seconds since 1970 with the fraction dropped, held to the range of the 32-bit field rather than wrapping.
+int32_t secondsAsInt32(double seconds) {
+    if (std::isnan(seconds)) return 0;
+    double truncated = std::trunc(seconds);
+    if (truncated <= static_cast<double>(std::numeric_limits<int32_t>::min()))
+        return std::numeric_limits<int32_t>::min();
+    if (truncated >= static_cast<double>(std::numeric_limits<int32_t>::max()))
+        return std::numeric_limits<int32_t>::max();
+    return static_cast<int32_t>(truncated);
+}
+
+Error misconfigured(std::string_view message) { return BXError(12, message); }
+
+}  // namespace
+
+std::shared_ptr<BXDPlugIn> BXDPlugIn::initWithLXData(std::shared_ptr<const LXBexilProxy> proxy) {
+    if (!proxy || !proxy->bundleURL()) return nullptr;
+
+    auto record = std::make_shared<BXDPlugIn>();
+    std::optional<Value> plugInDictionary = proxy->bexilDictionary();
+    if (!record->setupWithNameUrlBundleInfoInfoUuid(proxy->pluginIdentifier(), proxy->bundleURL(), std::nullopt,
+                                                    plugInDictionary, proxy->pluginUUID()))
+        return nullptr;
+    // Without an information dictionary set-up stores no plug-in dictionary; the registry's one stands in.
+    if (!record->plugInDictionary() && plugInDictionary && plugInDictionary->isDictionary())
+        record->setPlugInDictionary(*plugInDictionary);
+
+    record->setLxproxy(proxy);
+    record->setEntitlements(proxy->entitlements());
+    record->setOriginalIdentifier(proxy->originalIdentifier());
+    record->setLastModified(proxy->registrationDate() ? secondsAsInt32(proxy->registrationDate()->secondsSince1970)
+                                                      : 0);
+    record->setOnSystemVolume(proxy->isOnSystemPartition());
+
+    std::optional<Value> stored = record->plugInDictionary();
+    const Value* explicitVersion = stored ? stored->find(kHubProtocolVersionKey) : nullptr;
+    if (explicitVersion != nullptr) {
+        record->setHubProtocolVersion(static_cast<uint32_t>(explicitVersion->numberAsUInt64().value_or(0)));
+    } else {
+        // Old-style plug-ins name their configuration under "Bexil" in the information dictionary.
+        record->setHubProtocolVersion(record->infoKey(kOldStyleInfoKey) ? 1 : 2);
+    }
+
+    if (const std::shared_ptr<const LXApplicationProxy>& container = proxy->containingBundle())
+        record->setContainingUrl(container->bundleURL());
+
+    if (std::optional<Error> error = record->diagnose()) {
+        log::ops().info("ignoring mis-configured plug-in at %@: %{public}@", *proxy->bundleURL(),
+                        error->localizedDescription());
+        return nullptr;
+    }
+    return record;
+}
+
+// ---- Look-ups through the registry ----
+
+std::optional<Value> BXDPlugIn::lookUp(std::string_view key, int scope) const {
+    // Before the registry record is attached (during set-up) there is nobody to ask.
+    if (!lxproxy_) return std::nullopt;
+    return lxproxy_->objectForInfoDictionaryKeyOfClassInScope(key, std::nullopt, static_cast<LXInfoScope>(scope));
+}
+
+std::optional<Value> BXDPlugIn::infoKey(std::string_view key) const {
+    return lookUp(key, static_cast<int>(LXInfoScope::Info));
+}
+
+std::optional<Value> BXDPlugIn::pluginKey(std::string_view key) const {
+    return lookUp(key, static_cast<int>(LXInfoScope::PlugIn));
+}
+
+std::optional<Value> BXDPlugIn::attribute(std::string_view key) const {
+    return lookUp(key, static_cast<int>(LXInfoScope::Attributes));
+}
+
+std::optional<Value> BXDPlugIn::bundleInfoDictionary() const {
+    if (!lxproxy_) return std::nullopt;
+    return lxproxy_->infoVrec();
+}
+
+Value BXDPlugIn::prunedInfoDictionaryFor(const Value& dictionary) {
+    MutableDictionary pruned;
+    for (const DictionaryEntry& entry : dictionary.entries()) {
+        if (!entry.key.starts_with(kDebugToolPrefix)) pruned.set(entry.key, entry.value);
+    }
+    return pruned.take();
+}
+
+// ---- Display names ----
+//
+// The caches are the base record's atomic fields. Two first uses at once may both ask the registry and both store
+// the same answer, which is harmless. The records are always made non-const (make_shared), so filling the cache
+// from a const getter is sound.
+
+std::optional<std::string> BXDPlugIn::localizedName() const {
+    if (std::optional<std::string> cached = BXPlugInCore::localizedName()) return cached;
+    std::optional<std::string> fetched = lxproxy_ ? lxproxy_->localizedName() : std::nullopt;
+    if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedName(fetched);
+    return fetched;
+}
+
+std::optional<std::string> BXDPlugIn::localizedShortName() const {
+    if (std::optional<std::string> cached = BXPlugInCore::localizedShortName()) return cached;
+    std::optional<std::string> fetched = lxproxy_ ? lxproxy_->localizedShortName() : std::nullopt;
+    if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedShortName(fetched);
+    return fetched;
+}
+
+std::optional<std::string> BXDPlugIn::localizedContainingName() const {
+    if (std::optional<std::string> cached = BXPlugInCore::localizedContainingName()) return cached;
+    std::optional<std::string> fetched;
+    if (lxproxy_ && lxproxy_->containingBundle()) fetched = lxproxy_->containingBundle()->localizedName();
+    if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedContainingName(fetched);
+    return fetched;
+}
+
+// ---- Resource extensions ----
+
+void BXDPlugIn::augmentForm(MutableDictionary& form) const {
+    std::optional<Value> resources = pluginKey(kSharedKey);
+    // An application extension's host may read its whole bundle; its "Shared" entry is not used.
+    if (isAppExtension()) resources = Value::array({Value::string(kWholeBundle)});
+    if (!resources) return;
+    form.set(kExtensionsFormKey, issueResourceExtensions(*resources));
+}
+
+Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
+    Value list = paths.isString() ? Value::array({paths}) : paths;
+    std::string bundle = url().value_or(std::string());
+    MutableDictionary result;
+    for (const Value& element : list.items()) {
+        const std::string* resource = element.getString();
+        if (resource == nullptr) continue;
+        // Declared paths are joined unchanged; the sandbox resolves the target to its canonical form.
+        std::string target = *resource == kWholeBundle ? bundle : bundle + "/" + *resource;
+        if (std::optional<std::string> token = BXIssueReadExtension(target)) {
+            result.set(*resource, Value::string(std::move(*token)));
+        } else {
+            int cause = errno;
+            log::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", target, bundle,
+                            strerror(cause));
+        }
+    }
+    return result.take();
+}
+
+// ---- Entitlements and annotations ----
+
+std::optional<Value> BXDPlugIn::valueForEntitlement(std::string_view key) const {
+    std::optional<Value> all = entitlements();
+    if (!all) return std::nullopt;
+    const Value* value = all->find(key);
+    if (value == nullptr) return std::nullopt;
+    return *value;
+}
+
+bool BXDPlugIn::hasEntitlement(std::string_view key) const {
+    std::optional<Value> value = valueForEntitlement(key);
+    // Numbers compare across kinds, so false, 0 and 0.0 all read as "not entitled".
+    return value && !(*value == Value::boolean(false));
+}
+
+std::string BXDPlugIn::annotationKey() const {
+    std::optional<Value> replaced = valueForEntitlement(kReplacePlugInEntitlement);
+    if (replaced && replaced->isString()) return *replaced->getString();
+    return identifier().value_or(std::string());
+}
+
+// ---- Checks ----
+
+std::optional<Error> BXDPlugIn::diagnose() const {
+    if (std::optional<Error> error = BXPlugInCore::diagnose()) return error;
+    if (!isData() && !(lxproxy_ && lxproxy_->dataContainerURL()))
+        return misconfigured("this plug-in has no sandbox data container");
+    if (!containingUrl()) {
+        std::optional<std::string> location = path();
+        if (!location || !location->starts_with(kSystemPrefix))
+            return misconfigured("plug-ins outside containing apps must be in /System");
+    }
+    return std::nullopt;
+}
+
+std::string BXDPlugIn::description() const {
+    std::optional<Uuid> u = uuid();
+    return "<BXDPlugIn " + identifier().value_or("(no identifier)") + " " + (u ? u->string() : "(no uuid)") + " " +
+           url().value_or("(no path)") + ">";
+}
+
+}  // namespace bexil

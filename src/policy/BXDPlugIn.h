@@ -1,0 +1,82 @@
+#pragma once
+
+// BXDPlugIn is the plug-in record as the daemon holds it: built from the registry's record of the plug-in, which it
+// keeps for life and asks for every configuration question instead of keeping its own copies of the dictionaries.
+// It adds entitlement queries, the annotation key and the stricter placement checks. The database builds and caches
+// records on its lock `_sync`; afterwards any queue may read them (the stored properties are atomic, lxproxy is
+// written once before the record is shared).
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "base/Value.h"
+#include "model/BXPlugInCore.h"
+
+namespace bexil {
+
+class LXBexilProxy;
+
+class BXDPlugIn : public BXPlugInCore {
+  public:
+    // Lets a plug-in take over the annotations (and the user's election) of the identifier it names.
+    static constexpr std::string_view kReplacePlugInEntitlement = "com.quorvel.developer.replace-plugin";
+    // Makes the database elect the plug-in automatically the first time it builds its record.
+    static constexpr std::string_view kAutoElectEntitlement = "com.quorvel.developer.auto-elect-plugin";
+    // Plug-ins outside any application must live below this directory.
+    static constexpr std::string_view kSystemPrefix = "/System/";
+
+    BXDPlugIn() = default;
+
+    // initWithLXData: the record of a registry plug-in, or none when the registry record has no bundle URL, the
+    // record cannot be set up, or diagnose finds it mis-configured (logged at info level).
+    static std::shared_ptr<BXDPlugIn> initWithLXData(std::shared_ptr<const LXBexilProxy> proxy);
+
+    // The three look-ups ask the registry: scope 2 (information dictionary), 1 (plug-in dictionary), 0 (attributes).
+    std::optional<Value> infoKey(std::string_view key) const override;
+    std::optional<Value> pluginKey(std::string_view key) const override;
+    std::optional<Value> attribute(std::string_view key) const override;
+    // The registry's information dictionary, asked anew on every call.
+    std::optional<Value> bundleInfoDictionary() const override;
+
+    // A new dictionary with every entry of `dictionary` except those whose key begins with "DT".
+    static Value prunedInfoDictionaryFor(const Value& dictionary);
+
+    // Display names: fetched from the registry on first use and cached; an absent answer is not cached.
+    std::optional<std::string> localizedName() const override;
+    std::optional<std::string> localizedShortName() const override;
+    std::optional<std::string> localizedContainingName() const override;
+
+    // Adds "extensions" to the form: read-only tokens for the whole bundle (".") of an application extension, else
+    // for the plug-in dictionary's "Shared" resources; a plug-in with neither leaves the form unchanged.
+    void augmentForm(MutableDictionary& form) const;
+    // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
+    // is one string or an array; other elements are passed over; paths that get no token are left out (logged).
+    Value issueResourceExtensions(const Value& paths) const;
+
+    // The value of `key` in the plug-in's entitlements, or none.
+    std::optional<Value> valueForEntitlement(std::string_view key) const;
+    // True unless the entitlement is absent or equal to false (false, 0).
+    bool hasEntitlement(std::string_view key) const;
+    // The replace-plugin entitlement when it is a string, else the identifier.
+    std::string annotationKey() const;
+
+    // The base checks, then: a plug-in that carries code needs a data container; a plug-in outside any
+    // application must live below /System/. Errors have code 12.
+    std::optional<Error> diagnose() const override;
+
+    std::string description() const override;
+
+    const std::shared_ptr<const LXBexilProxy>& lxproxy() const { return lxproxy_; }
+    // REQUIRES: before the record is shared with another queue.
+    void setLxproxy(std::shared_ptr<const LXBexilProxy> proxy) { lxproxy_ = std::move(proxy); }
+
+  private:
+    std::optional<Value> lookUp(std::string_view key, int scope) const;
+
+    std::shared_ptr<const LXBexilProxy> lxproxy_;
+};
+
+}  // namespace bexil

@@ -1,0 +1,11 @@
+#include "policy/BXIssueReadExtension.h"
+
+#include "platform/sandbox/SandboxExtensions.h"
+
+namespace bexil {
+
+std::optional<std::string> BXIssueReadExtension(const std::string& url) {
+    return SandboxExtensions::shared().issueFileExtension(SandboxExtensions::kReadOnlyClass, url);
+}
+
+}  // namespace bexil

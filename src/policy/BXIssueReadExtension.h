@@ -1,0 +1,15 @@
+#pragma once
+
+// Read-only sandbox extensions for plug-in files, issued by the daemon and handed to hosts (in discovery results and
+// by the "access" request). Any thread.
+
+#include <optional>
+#include <string>
+
+namespace bexil {
+
+// The token of a read-only extension for the canonical form of `url` (a path), or none with errno as the sandbox
+// set it (for example ENOENT when the path does not exist).
+std::optional<std::string> BXIssueReadExtension(const std::string& url);
+
+}  // namespace bexil

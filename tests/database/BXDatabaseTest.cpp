@@ -1,0 +1,355 @@
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <mutex>
+
+#include "base/Document.h"
+#include "database/BXDAnnotationStore.h"
+#include "database/BXDatabase.h"
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/ledgerix/LedgerixWorkspace.h"
+#include "platform/log/CaptureSink.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
+
+class RecordingDelegate : public BXDatabaseDelegate {
+  public:
+    explicit RecordingDelegate(BXDatabase& database) : database_(database) {}
+    void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override {
+        std::lock_guard lock(mutex_);
+        calledInsideSync_ = calledInsideSync_ || database_.sync().isCurrent();
+        for (const auto& proxy : plugIns) removed_.push_back(proxy->bundleURL().value_or(""));
+    }
+    std::vector<std::string> removed() {
+        std::lock_guard lock(mutex_);
+        return removed_;
+    }
+    bool calledInsideSync() const { return calledInsideSync_; }
+
+  private:
+    BXDatabase& database_;
+    std::mutex mutex_;
+    std::vector<std::string> removed_;
+    bool calledInsideSync_ = false;
+};
+
+// A database over a registry in a private state directory, with copies of the example bundles to register.
+class BXDatabaseTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        char pattern[] = "/tmp/bxdatabase-test-XXXXXX";
+        ASSERT_NE(mkdtemp(pattern), nullptr);
+        root_ = pattern;
+        fs::create_directories(root_ / "bundles");
+        for (const char* bundle : {"Greeter.app", "Notes.app", "Misconfigured.app", "OutsideApplication.bxplugin"})
+            fs::copy(kExamples / bundle, root_ / "bundles" / bundle, fs::copy_options::recursive);
+        // The annotation store looks for a legacy document in the daemon's container under the state dir.
+        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
+        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        open();
+    }
+    void TearDown() override {
+        database_.reset();
+        workspace_.reset();
+        fs::remove_all(root_);
+    }
+
+    void open() {
+        database_.reset();
+        LedgerixWorkspace::Options options;
+        options.stateDirectory = root_ / "state";
+        Result<std::shared_ptr<LedgerixWorkspace>> opened = LedgerixWorkspace::open(options);
+        ASSERT_TRUE(opened.ok()) << opened.error().description();
+        workspace_ = *opened;
+        database_ = BXDatabase::create(annotationsPath().string(), workspace_,
+                                       [this](std::string_view name) { posted_.emplace_back(name); });
+        ASSERT_NE(database_, nullptr);
+        delegate_ = std::make_unique<RecordingDelegate>(*database_);
+        database_->setDelegate(delegate_.get());
+    }
+
+    fs::path annotationsPath() const { return root_ / "annotations.vrec"; }
+    std::string bundle(const std::string& relative) const { return (root_ / "bundles" / relative).string(); }
+    std::string hello() const { return bundle("Greeter.app/PlugIns/Hello.bxplugin"); }
+    std::string bonjour() const { return bundle("Greeter.app/PlugIns/Bonjour.bxplugin"); }
+    std::string nightTheme() const { return bundle("Greeter.app/PlugIns/NightTheme.bxplugin"); }
+
+    std::shared_ptr<BXDPlugIn> addAndFind(const std::string& path) {
+        std::optional<Error> error = database_->addPlugIn(path);
+        EXPECT_FALSE(error) << error->description();
+        return database_->findPlugInAtPath(path);
+    }
+
+    void grantAutoElection(const std::string& path) {
+        ASSERT_FALSE(Document::writeFileAtomically(
+            fs::path(path) / "Entitlements.vrec",
+            Value::dictionary({{std::string(BXDPlugIn::kAutoElectEntitlement), Value::boolean(true)}})));
+    }
+
+    // The annotation map as the document on disk has it.
+    Value annotationsOnDisk() const {
+        Result<Value> root = Document::readFile(annotationsPath());
+        return root ? root->get("data") : Value();
+    }
+
+    fs::path root_;
+    std::shared_ptr<LedgerixWorkspace> workspace_;
+    std::unique_ptr<BXDatabase> database_;
+    std::unique_ptr<RecordingDelegate> delegate_;
+    std::vector<std::string> posted_;
+};
+
+// ---- look-ups and the cache ----
+
+TEST_F(BXDatabaseTest, RegisteredPlugInIsFoundByPathAndUuidAsOneCachedRecord) {
+    std::shared_ptr<BXDPlugIn> byPath = addAndFind(hello());
+    ASSERT_NE(byPath, nullptr);
+    EXPECT_EQ(byPath->identifier(), "com.example.greeter.hello");
+    EXPECT_EQ(byPath->containingUrl(), bundle("Greeter.app"));
+    std::shared_ptr<BXDPlugIn> byUuid = database_->findPlugIn(*byPath->uuid());
+    EXPECT_EQ(byUuid.get(), byPath.get());
+    EXPECT_EQ(database_->plugInForProxy(workspace_->pluginProxyForURL(hello())).get(), byPath.get());
+    EXPECT_EQ(database_->cachedCount(), 1u);
+}
+
+TEST_F(BXDatabaseTest, InstallingCachesNothingAndIsLogged) {
+    log::CaptureSink capture;
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    EXPECT_EQ(database_->cachedCount(), 0u);
+    auto line = capture.find("plug-in INSTALLED:");
+    ASSERT_TRUE(line);
+    EXPECT_EQ(line->level, log::Level::Default);
+    EXPECT_NE(line->message.find("com.example.greeter.hello"), std::string::npos) << line->message;
+    EXPECT_NE(line->message.find(hello()), std::string::npos) << line->message;
+}
+
+TEST_F(BXDatabaseTest, UnknownUuidAndPathYieldNothingAndCacheNothing) {
+    log::CaptureSink capture;
+    Uuid unknown = Uuid::random();
+    EXPECT_EQ(database_->findPlugIn(unknown), nullptr);
+    EXPECT_EQ(database_->findPlugIn(unknown), nullptr);
+    EXPECT_EQ(capture.count("Ledgerix cannot find plug-in with UUID:" + unknown.string()), 2u);
+
+    EXPECT_EQ(database_->findPlugInAtPath(hello()), nullptr);
+    EXPECT_TRUE(capture.contains("Ledgerix cannot find plug-in at path:" + hello()));
+    EXPECT_EQ(database_->cachedCount(), 0u);
+}
+
+TEST_F(BXDatabaseTest, MisconfiguredPlugInIsRegisteredButNeverBuilt) {
+    std::string missingProtocol = bundle("Misconfigured.app/PlugIns/MissingProtocol.bxplugin");
+    ASSERT_FALSE(database_->addPlugIn(missingProtocol));
+    EXPECT_EQ(database_->findPlugInAtPath(missingProtocol), nullptr);
+    EXPECT_EQ(database_->cachedCount(), 0u) << "nothing is cached, so a later look-up tries again";
+}
+
+TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOnes) {
+    for (const std::string& path : {hello(), bonjour(), nightTheme()}) ASSERT_FALSE(database_->addPlugIn(path));
+    auto plugIns = database_->plugInsWithinApplication(bundle("Greeter.app"));
+    ASSERT_TRUE(plugIns);
+    std::vector<std::string> paths;
+    for (const auto& plugIn : *plugIns) paths.push_back(plugIn->path().value_or(""));
+    std::vector<std::string> registryOrder;
+    auto application = workspace_->applicationProxyForBundleURL(bundle("Greeter.app"));
+    ASSERT_TRUE(application);
+    for (const auto& proxy : application->plugins()) registryOrder.push_back(*proxy->bundleURL());
+    EXPECT_EQ(paths, registryOrder);
+    EXPECT_EQ(paths.size(), 3u);
+
+    ASSERT_FALSE(database_->addPlugIn(bundle("Misconfigured.app/PlugIns/MissingAttributes.bxplugin")));
+    ASSERT_FALSE(database_->addPlugIn(bundle("Misconfigured.app/PlugIns/PassProxyKey.bxplugin")));
+    auto misconfigured = database_->plugInsWithinApplication(bundle("Misconfigured.app"));
+    ASSERT_TRUE(misconfigured) << "registered plug-ins exist, so the answer is a (possibly empty) array";
+    EXPECT_TRUE(misconfigured->empty());
+}
+
+TEST_F(BXDatabaseTest, ApplicationWithoutPlugInsGivesNothingNotAnEmptyArray) {
+    EXPECT_FALSE(database_->plugInsWithinApplication(bundle("Notes.app")));
+    EXPECT_FALSE(database_->plugInsWithinApplication(bundle("NoSuch.app")));
+}
+
+TEST_F(BXDatabaseTest, RegistryRefusalsBecomeCode2) {
+    std::optional<Error> added = database_->addPlugIn(bundle("Greeter.app/PlugIns/Missing.bxplugin"));
+    ASSERT_TRUE(added);
+    EXPECT_EQ(added->code(), 2);
+    EXPECT_EQ(added->localizedDescription(), "Ledgerix failed to register the plug-in");
+
+    std::shared_ptr<BXDPlugIn> cached = addAndFind(hello());
+    std::optional<Error> removed = database_->removePlugIn(bonjour());
+    ASSERT_TRUE(removed);
+    EXPECT_EQ(removed->code(), 2);
+    EXPECT_TRUE(removed->isBexil());
+    EXPECT_EQ(removed->localizedDescription(), "Ledgerix failed to deregister the plug-in");
+    EXPECT_EQ(database_->cachedCount(), 1u);
+    EXPECT_EQ(database_->findPlugIn(*cached->uuid()).get(), cached.get());
+}
+
+TEST_F(BXDatabaseTest, CreatingOutsideTheLockIsAnInternalInconsistency) {
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    EXPECT_THROW(database_->createPlugInForProxy(workspace_->pluginProxyForURL(hello())), InternalInconsistency);
+    EXPECT_THROW(database_->purgeCachesToLimit(0), InternalInconsistency);
+}
+
+// ---- the purge ----
+
+TEST_F(BXDatabaseTest, PurgeIsAllOrNothingAboveTheLimit) {
+    std::vector<std::string> all = {hello(), bonjour(), nightTheme(), bundle("Notes.app/PlugIns/Stationery.bxplugin"),
+                                    bundle("Notes.app/PlugIns/Clipper.wexa")};
+    for (const std::string& path : all) ASSERT_FALSE(database_->addPlugIn(path));
+
+    log::CaptureSink capture;
+    database_->setCacheLimit(2);
+    ASSERT_TRUE(database_->findPlugInAtPath(all[0]));
+    ASSERT_TRUE(database_->findPlugInAtPath(all[1]));
+    ASSERT_TRUE(database_->findPlugInAtPath(all[2]));
+    EXPECT_EQ(database_->cachedCount(), 3u) << "a count equal to the limit does not purge";
+    EXPECT_FALSE(capture.contains("purging cache"));
+    std::shared_ptr<BXDPlugIn> fourth = database_->findPlugInAtPath(all[3]);
+    ASSERT_TRUE(fourth);
+    EXPECT_EQ(database_->cachedCount(), 1u);
+    EXPECT_TRUE(capture.contains("purging cache for 3 > 2"));
+    EXPECT_EQ(database_->findPlugIn(*fourth->uuid()).get(), fourth.get());
+}
+
+TEST_F(BXDatabaseTest, LimitZeroKeepsAtMostOneRecord) {
+    database_->setCacheLimit(0);
+    std::shared_ptr<BXDPlugIn> first = addAndFind(hello());
+    EXPECT_EQ(database_->cachedCount(), 1u);
+    std::shared_ptr<BXDPlugIn> second = addAndFind(bonjour());
+    EXPECT_EQ(database_->cachedCount(), 1u);
+    // The first record was purged: looking it up again builds a new, equal record.
+    std::shared_ptr<BXDPlugIn> again = database_->findPlugIn(*first->uuid());
+    ASSERT_TRUE(again);
+    EXPECT_NE(again.get(), first.get());
+    EXPECT_TRUE(*again == *first);
+}
+
+// ---- uninstall ----
+
+TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLock) {
+    std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
+    ASSERT_TRUE(plugIn);
+    log::CaptureSink capture;
+    ASSERT_FALSE(database_->removePlugIn(hello()));
+    EXPECT_EQ(delegate_->removed(), std::vector<std::string>{hello()});
+    EXPECT_FALSE(delegate_->calledInsideSync());
+    EXPECT_EQ(database_->cachedCount(), 0u);
+    auto line = capture.find("plug-in UNINSTALLED:");
+    ASSERT_TRUE(line);
+    EXPECT_NE(line->message.find(plugIn->uuid()->string()), std::string::npos) << line->message;
+    EXPECT_EQ(database_->findPlugIn(*plugIn->uuid()), nullptr) << "the registry has forgotten it";
+}
+
+TEST_F(BXDatabaseTest, UninstallOfANeverCachedPlugInStillInformsTheDelegate) {
+    ASSERT_FALSE(database_->addPlugIn(bonjour()));
+    ASSERT_FALSE(database_->removePlugIn(bonjour()));
+    EXPECT_EQ(delegate_->removed(), std::vector<std::string>{bonjour()});
+}
+
+// ---- annotations ----
+
+TEST_F(BXDatabaseTest, AnnotationsMergeSurviveUninstallAndPostOnlyWhenAsked) {
+    std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
+    ASSERT_TRUE(plugIn);
+    EXPECT_TRUE(database_->annotationForPlugIn(*plugIn).isNull());
+    MutableDictionary form;
+    database_->addAnnotationForPlugInIn(*plugIn, form);
+    EXPECT_EQ(form.value().get("annotations"), Value::emptyDictionary());
+
+    database_->setAnnotationForPlugIn(Value::dictionary({{"election", Value::int64(2)}}), *plugIn);
+    database_->setAnnotationForPlugIn(Value::dictionary({{"extension", Value::emptyDictionary()}}), *plugIn);
+    Value expected = Value::dictionary({{"election", Value::int64(2)}, {"extension", Value::emptyDictionary()}});
+    EXPECT_EQ(database_->annotationForPlugIn(*plugIn), expected);
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello"), expected);
+    EXPECT_TRUE(posted_.empty()) << "setting an annotation posts nothing by itself";
+    database_->notifyAnnotationChange();
+    EXPECT_EQ(posted_, std::vector<std::string>{"com.quorvel.bexil.annotation-change"});
+
+    ASSERT_FALSE(database_->removePlugIn(hello()));
+    std::shared_ptr<BXDPlugIn> reinstalled = addAndFind(hello());
+    ASSERT_TRUE(reinstalled);
+    EXPECT_EQ(database_->annotationForPlugIn(*reinstalled), expected);
+    database_->addAnnotationForPlugInIn(*reinstalled, form);
+    EXPECT_EQ(form.value().get("annotations"), expected);
+}
+
+TEST_F(BXDatabaseTest, AutomaticElectionStoresOneAndIsPersisted) {
+    grantAutoElection(hello());
+    std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
+    ASSERT_TRUE(plugIn);
+    EXPECT_TRUE(plugIn->hasEntitlement(BXDPlugIn::kAutoElectEntitlement));
+    EXPECT_EQ(database_->annotationForPlugIn(*plugIn), Value::dictionary({{"election", Value::int64(1)}}));
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello").get("election"), Value::int64(1));
+    EXPECT_TRUE(posted_.empty()) << "automatic election posts no notification";
+
+    // A plug-in without the entitlement is left alone.
+    std::shared_ptr<BXDPlugIn> other = addAndFind(bonjour());
+    EXPECT_TRUE(database_->annotationForPlugIn(*other).isNull());
+}
+
+TEST_F(BXDatabaseTest, AutomaticElectionNeverOverridesAnElectionMade) {
+    grantAutoElection(hello());
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    // Elect before the first record exists, through the store's key (the identifier).
+    database_->sync().sync([&] {
+        database_->annotations().setAnnotationForIdentifier(
+            Value::dictionary({{"election", Value::int64(2)}, {"extension", Value::string("kept")}}),
+            "com.example.greeter.hello");
+    });
+    database_->setCacheLimit(0);
+    for (int round = 0; round < 3; ++round) {
+        std::shared_ptr<BXDPlugIn> plugIn = database_->findPlugInAtPath(hello());
+        ASSERT_TRUE(plugIn);
+        ASSERT_TRUE(addAndFind(bonjour()));  // purges the cache, so the next look-up builds the record again
+        EXPECT_EQ(database_->annotationForPlugIn(*plugIn).get("election"), Value::int64(2));
+    }
+}
+
+TEST_F(BXDatabaseTest, AutomaticElectionReplacesAZeroElection) {
+    grantAutoElection(hello());
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    database_->sync().sync([&] {
+        database_->annotations().setAnnotationForIdentifier(
+            Value::dictionary({{"election", Value::int64(0)}, {"extension", Value::string("kept")}}),
+            "com.example.greeter.hello");
+    });
+    std::shared_ptr<BXDPlugIn> plugIn = database_->findPlugInAtPath(hello());
+    ASSERT_TRUE(plugIn);
+    EXPECT_EQ(database_->annotationForPlugIn(*plugIn),
+              Value::dictionary({{"election", Value::int64(1)}, {"extension", Value::string("kept")}}));
+}
+
+TEST_F(BXDatabaseTest, AnnotationsAndRegistrationsSurviveReopening) {
+    std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
+    ASSERT_TRUE(plugIn);
+    Uuid uuid = *plugIn->uuid();
+    database_->setAnnotationForPlugIn(Value::dictionary({{"election", Value::int64(3)}}), *plugIn);
+    plugIn.reset();
+    open();
+    std::shared_ptr<BXDPlugIn> again = database_->findPlugIn(uuid);
+    ASSERT_TRUE(again);
+    EXPECT_EQ(database_->annotationForPlugIn(*again).get("election"), Value::int64(3));
+}
+
+TEST_F(BXDatabaseTest, DefaultPosterWritesTheNotificationCounter) {
+    auto database = BXDatabase::create((root_ / "other-annotations").string(), workspace_);
+    ASSERT_TRUE(database);
+    database->notifyAnnotationChange();
+    database->notifyAnnotationChange();
+    std::ifstream counter(root_ / "runtime" / "notify" / "com.quorvel.bexil.annotation-change");
+    std::string text;
+    std::getline(counter, text);
+    EXPECT_EQ(text, "2");
+}
+
+}  // namespace
+}  // namespace bexil

@@ -1,0 +1,63 @@
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <filesystem>
+
+#include "model/BXSandboxExtension.h"
+#include "platform/sandbox/SandboxExtensions.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+class BXSandboxExtensionTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        char pattern[] = "/tmp/sandbox-extension-test-XXXXXX";
+        ASSERT_NE(mkdtemp(pattern), nullptr);
+        root_ = pattern;
+        sandbox_ = std::make_unique<SandboxExtensions>(root_ / "extension-key");
+        auto issued = sandbox_->issueFileExtension(SandboxExtensions::kReadOnlyClass, root_.string());
+        ASSERT_TRUE(issued);
+        token_ = *issued;
+    }
+    void TearDown() override { fs::remove_all(root_); }
+
+    fs::path root_;
+    std::unique_ptr<SandboxExtensions> sandbox_;
+    std::string token_;
+};
+
+TEST_F(BXSandboxExtensionTest, ConsumesOnceAndExpelsOnce) {
+    BXSandboxExtension extension(token_, sandbox_.get());
+    EXPECT_EQ(extension.handle(), 0);
+    extension.expel();  // nothing consumed yet: nothing happens
+    extension.consume();
+    int64_t handle = extension.handle();
+    ASSERT_GT(handle, 0);
+    extension.consume();
+    EXPECT_EQ(extension.handle(), handle) << "a second consume does not consume again";
+    EXPECT_TRUE(sandbox_->consumedPath(handle));
+    extension.expel();
+    EXPECT_EQ(extension.handle(), 0);
+    EXPECT_FALSE(sandbox_->consumedPath(handle));
+}
+
+TEST_F(BXSandboxExtensionTest, DestructionReleasesAndRefusedTokensStayUnconsumed) {
+    int64_t handle = 0;
+    {
+        BXSandboxExtension extension(token_, sandbox_.get());
+        extension.consume();
+        handle = extension.handle();
+        ASSERT_TRUE(sandbox_->consumedPath(handle));
+    }
+    EXPECT_FALSE(sandbox_->consumedPath(handle));
+
+    BXSandboxExtension forged(token_ + "x", sandbox_.get());
+    forged.consume();
+    EXPECT_EQ(forged.handle(), 0);
+}
+
+}  // namespace
+}  // namespace bexil
