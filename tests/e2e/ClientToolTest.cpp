@@ -106,8 +106,6 @@ TEST_F(ClientToolTest, DaemonErrorsBecomeOneLineAndTheCodeAsStatus) {
     // Every request reaches its handler; the handlers not built yet answer code 4.
     const std::pair<const char*, const char*> cases[] = {
         {"match", "match"},
-        {"bulk", "bulk"},
-        {"add /no/such.bxplugin", "add"},
         {"ready 11111111-2222-4333-8444-555555555555", "ready"},
         {"elect 11111111-2222-4333-8444-555555555555", "annotate"},
         {"release 11111111-2222-4333-8444-555555555555", "release"},
@@ -119,11 +117,19 @@ TEST_F(ClientToolTest, DaemonErrorsBecomeOneLineAndTheCodeAsStatus) {
         EXPECT_EQ(lines(run.err), 1u) << run.err;
         EXPECT_EQ(run.err.rfind(std::string("bexil: ") + what + " failed (code 4): ", 0), 0u) << run.err;
     }
+    // The daemon's own code becomes the exit status.
+    Outcome missing = bexil("add /no/such.bxplugin");
+    EXPECT_EQ(missing.status, 9) << missing.err;
+    EXPECT_EQ(missing.err, "bexil: add failed (code 9): invalid plugin path: /no/such.bxplugin\n");
+    // A request that succeeds prints nothing on standard error and exits 0.
+    Outcome bulk = bexil("bulk");
+    EXPECT_EQ(bulk.status, 0) << bulk.err;
+    EXPECT_EQ(bulk.err, "");
 }
 
 TEST_F(ClientToolTest, JsonOutputCarriesTheRawReply) {
     ASSERT_TRUE(bxd_.start());
-    Outcome run = bexil("--json bulk");
+    Outcome run = bexil("--json match");
     EXPECT_EQ(run.status, 4);
     EXPECT_NE(run.out.find("\"errorcode\": 4"), std::string::npos) << run.out;
     EXPECT_NE(run.out.find("\"error\": "), std::string::npos) << run.out;
