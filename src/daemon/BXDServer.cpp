@@ -4,6 +4,8 @@
 
 #include <algorithm>
 #include <atomic>
+#include <semaphore>
+#include <thread>
 
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
@@ -83,8 +85,45 @@ void BXDServer::run() {
 void BXDServer::submitWork(std::function<void()> work) { mainQueue_.dispatch(std::move(work)); }
 
 void BXDServer::removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
-    // FIXME: terminate the plug-ins' running instances first, once the service manager is there to ask.
-    log::ops().debug("removal complete for %@", plugIns);
+    terminatePlugInsReply(plugIns, [plugIns] { log::ops().debug("removal complete for %@", plugIns); });
+}
+
+// Every record gets one request to the service manager; their completions run on this call's "killer" queue and
+// each signals the semaphore once, whatever its outcome. The waiter consumes exactly that many signals on a thread
+// of its own ("killer-waiter"), so neither the request queue nor the event loop ever waits for a process to exit.
+void BXDServer::terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
+                                      std::function<void()> reply) {
+    SerialQueue killer("killer", loop_);
+    auto answered = std::make_shared<std::counting_semaphore<>>(0);
+    const size_t count = plugIns.size();
+    for (const std::shared_ptr<const LXBexilProxy>& plugIn : plugIns) {
+        std::string version = "1";
+        if (plugIn->infoVrec())
+            if (const std::string* v = plugIn->infoVrec()->get("BDBundleVersion").getString()) version = *v;
+        std::string uuid = plugIn->pluginUUID() ? plugIn->pluginUUID()->string() : std::string("(none)");
+        log::ops().debug("requesting termination for %@(%@) jobard:%@ %@", plugIn->bundleIdentifier(),
+                         plugIn->bundleVersion(), version, uuid);
+        serviceManager_.removeExternalService(
+            plugIn->bundleIdentifier().value_or(""), version, killer, [answered, uuid](int error) {
+                if (error == 0)
+                    log::ops().info("one or more plug-ins have been terminated for uuid=%@", uuid);
+                else if (error == ServiceManager::kNothingOnRecord)
+                    log::ops().debug("jobard reported no plug-ins on record for uuid=%@", uuid);
+                else
+                    log::ops().error("jobard error attempting to terminate plug-ins: error=%d for uuid=%@", error,
+                                     uuid);
+                answered->release();
+            });
+    }
+    std::thread([answered, count, reply = std::move(reply)] {
+        log::ops().debug("waiting for %d termination replies", static_cast<int>(count));
+        for (size_t i = 0; i < count; ++i) {
+            log::ops().debug("awaiting termination reply #%d", static_cast<int>(i));
+            answered->acquire();
+        }
+        log::ops().debug("sending termination reply");
+        reply();
+    }).detach();
 }
 
 std::vector<std::shared_ptr<BXDPlugInHold>>& BXDServer::holds() { return holds_; }

@@ -14,6 +14,7 @@
 #include "base/SyncQueue.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
+#include "platform/jobard/ServiceManager.h"
 
 namespace bexil {
 
@@ -45,6 +46,12 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
 
     // Database delegate: plug-ins about to be uninstalled.
     void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
+    // Asks the service manager to end every running instance of `plugIns`; `reply` runs once, on a waiter thread
+    // of this call, after every request has been answered. Returns at once.
+    void terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
+                               std::function<void()> reply);
+    // The service manager used for termination (tests point it at their own runtime directory).
+    void setServiceManager(ServiceManager manager) { serviceManager_ = std::move(manager); }
     // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
     void unholdClient(const BXDZemClient* client);
 
@@ -72,6 +79,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::vector<std::shared_ptr<BXDPlugInHold>> holds_;
     std::unique_ptr<BXDUserPrefs> userPrefs_;
     unsigned verbose_ = 0;
+    ServiceManager serviceManager_;
 };
 
 }  // namespace bexil

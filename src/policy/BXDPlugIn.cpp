@@ -209,4 +209,19 @@ std::string BXDPlugIn::description() const {
            url().value_or("(no path)") + ">";
 }
 
+std::optional<Value> BXDPlugIn::checkBusy(const ProcessAssertions& assertions) const {
+    std::optional<Value> identifier = infoKey("BDBundleIdentifier");
+    if (!identifier || !identifier->isString()) return std::nullopt;
+    for (const Value& instance : assertions.busyExtensionInstances({std::string(identifier->stringView())})) {
+        const std::string* busy = instance.get(ProcessAssertions::kBundleIdentifierKey).getString();
+        if (!busy) {
+            log::ops().error("wardend reported incomplete bundle for plug-in %@/%{public}@", this->identifier(),
+                             uuid() ? uuid()->string() : std::string("(none)"));
+            continue;
+        }
+        return Value::dictionary({{ProcessAssertions::kBundleIdentifierKey, Value::string(*busy)}});
+    }
+    return std::nullopt;
+}
+
 }  // namespace bexil

@@ -14,6 +14,7 @@
 #include "base/Error.h"
 #include "base/Value.h"
 #include "model/BXPlugInCore.h"
+#include "platform/wardend/ProcessAssertions.h"
 
 namespace bexil {
 
@@ -62,6 +63,10 @@ class BXDPlugIn : public BXPlugInCore {
     bool hasEntitlement(std::string_view key) const;
     // The replace-plugin entitlement when it is a string, else the identifier.
     std::string annotationKey() const;
+
+    // A description of a busy instance of this plug-in ({ProcessAssertions::kBundleIdentifierKey: identifier}),
+    // or none when no instance is busy. Instances reported without a bundle identifier are logged and passed over.
+    std::optional<Value> checkBusy(const ProcessAssertions& assertions) const;
 
     // The base checks, then: a plug-in that carries code needs a data container; a plug-in outside any
     // application must live below /System/. Errors have code 12.

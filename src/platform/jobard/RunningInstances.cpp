@@ -1,0 +1,76 @@
+#include "platform/jobard/RunningInstances.h"
+
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+namespace bexil {
+
+namespace fs = std::filesystem;
+
+fs::path RunningInstances::runtimeDirectory() {
+    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) return dir;
+    if (geteuid() == 0) return "/run/bexil";
+    if (const char* runtime = getenv("XDG_RUNTIME_DIR"); runtime && *runtime) return fs::path(runtime) / "bexil";
+    return fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
+}
+
+RunningInstances::RunningInstances(std::string kind, fs::path runtimeDir) : directory_(runtimeDir / kind) {}
+
+std::optional<unsigned long long> RunningInstances::startTime(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string stat;
+    if (!std::getline(in, stat)) return std::nullopt;
+    // The command name (field 2) may contain spaces and parentheses; the fields after it follow the last ')'.
+    size_t close = stat.rfind(')');
+    if (close == std::string::npos) return std::nullopt;
+    std::istringstream fields(stat.substr(close + 2));
+    std::string field;
+    for (int index = 3; fields >> field; ++index) {
+        if (index == 22) return std::strtoull(field.c_str(), nullptr, 10);
+    }
+    return std::nullopt;
+}
+
+// A bundle identifier names one folder: nothing that could climb out of the runtime directory.
+static bool safeComponent(const std::string& name) {
+    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos &&
+           name.find('\0') == std::string::npos;
+}
+
+bool RunningInstances::record(const std::string& bundleIdentifier, pid_t pid) const {
+    if (!safeComponent(bundleIdentifier)) return false;
+    std::optional<unsigned long long> started = startTime(pid);
+    if (!started) return false;
+    std::error_code ec;
+    fs::create_directories(directory_ / bundleIdentifier, ec);
+    std::ofstream out(directory_ / bundleIdentifier / std::to_string(pid));
+    out << *started << "\n";
+    return static_cast<bool>(out);
+}
+
+std::vector<RunningInstances::Instance> RunningInstances::live(const std::string& bundleIdentifier) const {
+    std::vector<Instance> found;
+    if (!safeComponent(bundleIdentifier)) return found;
+    std::error_code ec;
+    for (const auto& entry : fs::directory_iterator(directory_ / bundleIdentifier, ec)) {
+        const std::string name = entry.path().filename().string();
+        char* end = nullptr;
+        long pid = std::strtol(name.c_str(), &end, 10);
+        if (name.empty() || *end != '\0' || pid <= 0) continue;
+        std::ifstream in(entry.path());
+        unsigned long long recorded = 0;
+        in >> recorded;
+        std::optional<unsigned long long> started = startTime(static_cast<pid_t>(pid));
+        if (!in || !started || *started != recorded) {
+            fs::remove(entry.path(), ec);  // the process is gone, or its pid now names another one
+            continue;
+        }
+        found.push_back(Instance{static_cast<pid_t>(pid), entry.path()});
+    }
+    return found;
+}
+
+}  // namespace bexil

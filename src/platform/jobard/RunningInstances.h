@@ -1,0 +1,45 @@
+#pragma once
+
+// The records that plug-in runtimes keep of their running instances: one file per process under
+// `<runtime dir>/<kind>/<bundle identifier>/<pid>`, holding the process's start time (field 22 of /proc/<pid>/stat),
+// so that a record whose pid has since been reused by another process is recognised as stale. Used by the service
+// manager (kind "instances") and the process-assertion service (kind "assertions"). Stateless; any thread.
+
+#include <sys/types.h>
+
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace bexil {
+
+class RunningInstances {
+  public:
+    struct Instance {
+        pid_t pid;
+        std::filesystem::path record;
+    };
+
+    // $BX_RUNTIME_DIR, else /run/bexil for root, else $XDG_RUNTIME_DIR/bexil.
+    static std::filesystem::path runtimeDirectory();
+
+    // `kind` is the sub-folder ("instances" or "assertions").
+    explicit RunningInstances(std::string kind, std::filesystem::path runtimeDir = runtimeDirectory());
+
+    // Records `pid` as a live instance of `bundleIdentifier` (what a plug-in runtime does when it starts).
+    bool record(const std::string& bundleIdentifier, pid_t pid) const;
+    // The recorded instances of `bundleIdentifier` whose process is still the one recorded; stale records are
+    // removed on the way.
+    std::vector<Instance> live(const std::string& bundleIdentifier) const;
+
+    // The start time of a process, or none when it does not exist.
+    static std::optional<unsigned long long> startTime(pid_t pid);
+
+    const std::filesystem::path& directory() const { return directory_; }
+
+  private:
+    std::filesystem::path directory_;
+};
+
+}  // namespace bexil

@@ -1,0 +1,76 @@
+#include "platform/jobard/ServiceManager.h"
+
+#include <poll.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <filesystem>
+#include <thread>
+
+namespace bexil {
+
+namespace {
+
+int pidfdOpen(pid_t pid) { return static_cast<int>(syscall(SYS_pidfd_open, pid, 0)); }
+int pidfdSignal(int pidfd, int signal) {
+    return static_cast<int>(syscall(SYS_pidfd_send_signal, pidfd, signal, nullptr, 0));
+}
+
+// A pidfd becomes readable when its process has exited.
+bool waitForExit(int pidfd, std::chrono::milliseconds timeout) {
+    pollfd p{pidfd, POLLIN, 0};
+    int rc;
+    do {
+        rc = poll(&p, 1, static_cast<int>(timeout.count()));
+    } while (rc < 0 && errno == EINTR);
+    return rc > 0;
+}
+
+// Ends one instance: SIGTERM, then SIGKILL after the grace period. Returns 0 or an errno value.
+int terminate(const RunningInstances::Instance& instance, unsigned long long recordedStart) {
+    int pidfd = pidfdOpen(instance.pid);
+    if (pidfd < 0) return errno == ESRCH ? 0 : errno;
+    // The pidfd pins one process; make sure it is still the one the record names before signalling it.
+    if (RunningInstances::startTime(instance.pid) != recordedStart) {
+        close(pidfd);
+        return 0;
+    }
+    int result = 0;
+    if (pidfdSignal(pidfd, SIGTERM) != 0) {
+        result = errno == ESRCH ? 0 : errno;
+    } else if (!waitForExit(pidfd, ServiceManager::kTerminationGrace)) {
+        if (pidfdSignal(pidfd, SIGKILL) != 0 && errno != ESRCH) result = errno;
+        waitForExit(pidfd, std::chrono::seconds(1));
+    }
+    close(pidfd);
+    return result;
+}
+
+}  // namespace
+
+ServiceManager::ServiceManager(RunningInstances instances) : instances_(std::move(instances)) {}
+
+void ServiceManager::removeExternalService(const std::string& bundleIdentifier, const std::string& /*version*/,
+                                           SerialQueue queue, std::function<void(int error)> completion) const {
+    std::vector<RunningInstances::Instance> running = instances_.live(bundleIdentifier);
+    if (running.empty()) {
+        queue.async([completion = std::move(completion)] { completion(kNothingOnRecord); });
+        return;
+    }
+    // Waiting for processes to exit can take seconds: it must not hold up any queue.
+    std::thread([running = std::move(running), queue, completion = std::move(completion)]() mutable {
+        int error = 0;
+        for (const RunningInstances::Instance& instance : running) {
+            std::optional<unsigned long long> started = RunningInstances::startTime(instance.pid);
+            int result = started ? terminate(instance, *started) : 0;
+            std::error_code ignored;
+            std::filesystem::remove(instance.record, ignored);
+            if (result != 0 && error == 0) error = result;
+        }
+        queue.async([completion = std::move(completion), error] { completion(error); });
+    }).detach();
+}
+
+}  // namespace bexil

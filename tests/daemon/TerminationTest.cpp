@@ -1,0 +1,216 @@
+// Termination of running plug-in instances and the busy check, with real processes recorded the way plug-in
+// runtimes record them.
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "base/EventLoop.h"
+#include "daemon/BXDServer.h"
+#include "platform/jobard/ServiceManager.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/log/CaptureSink.h"
+#include "platform/wardend/ProcessAssertions.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+// A child process that sleeps until it is signalled. It lets go of the test's output (so nothing waiting for that
+// output waits for it) and dies with the test, whatever way the test ends.
+pid_t startSleeper(bool ignoreTerm = false) {
+    pid_t parent = getpid();
+    pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (getppid() != parent) _exit(0);
+        int devnull = open("/dev/null", O_RDWR);
+        dup2(devnull, STDOUT_FILENO);
+        dup2(devnull, STDERR_FILENO);
+        if (ignoreTerm) signal(SIGTERM, SIG_IGN);
+        for (;;) pause();
+    }
+    return child;
+}
+
+// Kills and reaps the sleepers it was given when the test ends, also when an assertion ends it early.
+class SleeperGuard {
+  public:
+    explicit SleeperGuard(std::initializer_list<pid_t> pids) : pids_(pids) {}
+    ~SleeperGuard() {
+        for (pid_t pid : pids_) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+    }
+
+  private:
+    std::vector<pid_t> pids_;
+};
+
+bool reapWithin(pid_t pid, std::chrono::seconds timeout) {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+        if (waitpid(pid, nullptr, WNOHANG) == pid) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
+std::shared_ptr<const LXBexilProxy> proxy(const std::string& bundleIdentifier, std::optional<std::string> version) {
+    LXBexilProxy::Fields fields;
+    fields.bundleIdentifier = bundleIdentifier;
+    fields.pluginIdentifier = bundleIdentifier;
+    fields.bundleVersion = version.value_or("1.0");
+    fields.pluginUUID = Uuid::random();
+    MutableDictionary info;
+    info.set("BDBundleIdentifier", Value::string(bundleIdentifier));
+    if (version) info.set("BDBundleVersion", Value::string(*version));
+    fields.infoVrec = info.take();
+    return std::make_shared<LXBexilProxy>(std::move(fields));
+}
+
+class TerminationTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        root_ = fs::temp_directory_path() / ("bx-termination-" + std::to_string(getpid()));
+        fs::remove_all(root_);
+        for (const char* sub : {"service", "state", "runtime"}) fs::create_directories(root_ / sub);
+        setenv("BX_SERVICE_DIR", (root_ / "service").c_str(), 1);
+        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
+        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        server_ =
+            BXDServer::initForServiceDatabase("com.example.termination", (root_ / "annotations.vrec").c_str(), loop_);
+        ASSERT_NE(server_, nullptr);
+        server_->setServiceManager(ServiceManager(instances()));
+    }
+    void TearDown() override {
+        server_.reset();
+        fs::remove_all(root_);
+    }
+
+    RunningInstances instances() const { return RunningInstances("instances", root_ / "runtime"); }
+
+    // Runs terminatePlugInsReply and waits for its reply.
+    void terminate(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
+        std::promise<void> done;
+        int calls = 0;
+        server_->terminatePlugInsReply(plugIns, [&] {
+            ++calls;
+            done.set_value();
+        });
+        ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
+        EXPECT_EQ(calls, 1);
+    }
+
+    fs::path root_;
+    EventLoop loop_{1};
+    std::unique_ptr<BXDServer> server_;
+};
+
+TEST_F(TerminationTest, RecordedInstancesAreTerminatedAndEveryReplyIsAwaited) {
+    log::CaptureSink capture;
+    pid_t a = startSleeper();
+    pid_t b = startSleeper(/*ignoreTerm=*/true);  // needs the SIGKILL after the grace period
+    SleeperGuard guard{a, b};
+    ASSERT_TRUE(instances().record("com.example.greeter.hello", a));
+    ASSERT_TRUE(instances().record("com.example.greeter.bonjour", b));
+
+    terminate({proxy("com.example.greeter.hello", "3"), proxy("com.example.greeter.bonjour", std::nullopt),
+               proxy("com.example.idle", "1")});
+
+    EXPECT_TRUE(reapWithin(a, std::chrono::seconds(2)));
+    EXPECT_TRUE(reapWithin(b, std::chrono::seconds(2)));
+    EXPECT_EQ(capture.count("one or more plug-ins have been terminated for uuid="), 2u);
+    EXPECT_EQ(capture.count("jobard reported no plug-ins on record for uuid="), 1u);
+    EXPECT_TRUE(capture.contains("waiting for 3 termination replies"));
+    EXPECT_TRUE(capture.contains("awaiting termination reply #2"));
+    // A record without "BDBundleVersion" is terminated as version 1.
+    EXPECT_TRUE(capture.contains("(1.0) jobard:1 ")) << "version fallback";
+    EXPECT_TRUE(capture.contains("(3) jobard:3 "));
+    // The records of the ended instances are gone.
+    EXPECT_TRUE(instances().live("com.example.greeter.hello").empty());
+}
+
+TEST_F(TerminationTest, EmptyListRepliesAtOnce) {
+    log::CaptureSink capture;
+    terminate({});
+    EXPECT_TRUE(capture.contains("waiting for 0 termination replies"));
+    EXPECT_TRUE(capture.contains("sending termination reply"));
+}
+
+TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
+    log::CaptureSink capture;
+    pid_t gone = startSleeper();
+    SleeperGuard guard{gone};
+    ASSERT_TRUE(instances().record("com.example.greeter.hello", gone));
+    kill(gone, SIGKILL);
+    waitpid(gone, nullptr, 0);
+    // The same pid recorded with a start time that no live process has: a reused pid must not be taken for it.
+    fs::path stale = root_ / "runtime" / "instances" / "com.example.greeter.bonjour" / std::to_string(getpid());
+    fs::create_directories(stale.parent_path());
+    std::ofstream(stale) << "1\n";
+
+    terminate({proxy("com.example.greeter.hello", "1"), proxy("com.example.greeter.bonjour", "1")});
+    EXPECT_EQ(capture.count("jobard reported no plug-ins on record"), 2u);
+    EXPECT_FALSE(fs::exists(stale));
+}
+
+TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
+    fs::path runtime = fs::temp_directory_path() / ("bx-assertions-" + std::to_string(getpid()));
+    RunningInstances assertions("assertions", runtime);
+    ProcessAssertions wardend(assertions);
+    pid_t busy = startSleeper();
+    pid_t finished = startSleeper();
+    SleeperGuard guard{busy, finished};
+    ASSERT_TRUE(assertions.record("com.example.greeter.hello", busy));
+    ASSERT_TRUE(assertions.record("com.example.greeter.bonjour", finished));
+    kill(finished, SIGKILL);
+    waitpid(finished, nullptr, 0);
+
+    std::vector<Value> found =
+        wardend.busyExtensionInstances({"com.example.greeter.hello", "com.example.greeter.bonjour", "../escape"});
+    ASSERT_EQ(found.size(), 1u);
+    EXPECT_EQ(found[0].get(ProcessAssertions::kBundleIdentifierKey), Value::string("com.example.greeter.hello"));
+    EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
+
+    // The plug-in record asks by its bundle identifier and describes the busy instance by it alone.
+    LXBexilProxy::Fields fields;
+    // A data plug-in on the system volume passes the record's checks without a container or an application.
+    fields.bundleURL = "/System/Library/PlugIns/Hello.bxplugin";
+    fields.isOnSystemPartition = true;
+    fields.pluginIdentifier = "com.example.greeter.hello";
+    fields.bundleIdentifier = "com.example.greeter.hello";
+    fields.pluginUUID = Uuid::random();
+    fields.infoVrec = Value::dictionary(
+        {{"BDBundleIdentifier", Value::string("com.example.greeter.hello")},
+         {"RZExtension", Value::dictionary({
+                             {"RZExtensionProtocol", Value::string("#Data")},
+                             {"RZExtensionAttributes", Value::dictionary({{"RZExtensionVersion", Value::string("1")}})},
+                         })}});
+    auto plugIn = BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+    ASSERT_NE(plugIn, nullptr);
+    std::optional<Value> description = plugIn->checkBusy(wardend);
+    ASSERT_TRUE(description);
+    EXPECT_EQ(
+        *description,
+        Value::dictionary({{ProcessAssertions::kBundleIdentifierKey, Value::string("com.example.greeter.hello")}}));
+
+    kill(busy, SIGKILL);
+    waitpid(busy, nullptr, 0);
+    EXPECT_TRUE(wardend.busyExtensionInstances({"com.example.greeter.hello"}).empty());
+    EXPECT_FALSE(plugIn->checkBusy(wardend));
+    fs::remove_all(runtime);
+}
+
+}  // namespace
+}  // namespace bexil
