@@ -69,6 +69,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool processPaths(const RegistrationHandler& handler);
     // Walks the request's "uuids", resolving each through the database. Sends no reply on success.
     bool processUuidList(const PlugInHandler& handler);
+    // Sets the reply entry's "annotations" to the plug-in's stored annotation, or to an empty dictionary.
+    void addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& entry);
 
     // Request handlers, one per request name.
     void addPlugIns();

@@ -103,7 +103,8 @@ TEST_F(ClientToolTest, BadArgumentsAreRefusedBeforeAnythingIsSent) {
 
 TEST_F(ClientToolTest, DaemonErrorsBecomeOneLineAndTheCodeAsStatus) {
     ASSERT_TRUE(bxd_.start());
-    // Every request reaches its handler; the handlers not built yet answer code 4.
+    // Every request reaches its handler; the handlers not built yet, and "annotate" for an unknown plug-in, answer
+    // code 4.
     const std::pair<const char*, const char*> cases[] = {
         {"match", "match"},
         {"ready 11111111-2222-4333-8444-555555555555", "ready"},

@@ -1,0 +1,119 @@
+// The requests that change plug-in annotations: "annotate" (an election and/or client data for plug-ins named by
+// UUID) and "bulk-annotate" (client data for many plug-ins keyed by UUID text). Neither checks an entitlement: any
+// client may change the annotations of any plug-in it can name. Changes are saved one plug-in at a time, so when a
+// later plug-in fails the earlier ones keep their change; other processes are told through the change notification
+// only when the whole request succeeded.
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "daemon/BXDServer.h"
+#include "daemon/BXDZemClient.h"
+#include "daemon/Transaction.h"
+#include "platform/log/Log.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+
+namespace {
+
+constexpr std::string_view kAnnotationsKey = "annotations";
+constexpr std::string_view kElectionKey = "election";
+constexpr std::string_view kExtensionKey = "extension";
+
+// An election must be numeric. A boolean is not accepted: the stored election is compared as a number by readers,
+// and "true" would silently read back as the automatic election.
+bool isElectionNumber(const Value& value) { return value.isNumber() && !value.isBool(); }
+
+std::string uuidText(const BXDPlugIn& plugIn) {
+    std::optional<Uuid> uuid = plugIn.uuid();
+    return uuid ? uuid->string() : std::string("(null)");
+}
+
+}  // namespace
+
+void Transaction::annotatePlugIns() {
+    std::optional<Value> annotations = zem_dictionary_get_dictionary(request(), kAnnotationsKey);
+    if (!annotations) {
+        fail(4, "invalid request format (bad annotations dictionary)");
+        return;
+    }
+
+    // Only the two known keys become part of the change; anything else the client sent is ignored.
+    MutableDictionary change;
+    if (const Value* election = annotations->find(kElectionKey)) {
+        if (!isElectionNumber(*election)) {
+            fail(4, "invalid request format (annotation election)");
+            return;
+        }
+        change.set(kElectionKey, *election);
+    }
+    if (const Value* extension = annotations->find(kExtensionKey)) {
+        if (!extension->isDictionary()) {
+            fail(4, "invalid request format (annotation extension)");
+            return;
+        }
+        change.set(kExtensionKey, *extension);
+    }
+    if (change.count() == 0) {
+        // Nothing to change: the plug-in list is not even read, and nobody needs to be told.
+        done();
+        return;
+    }
+
+    const Value changeValue = change.take();
+    const Value* newElection = changeValue.find(kElectionKey);
+    const pid_t pid = client()->pid();
+    bool walked = processUuidList([&](const std::shared_ptr<BXDPlugIn>& plugIn) {
+        std::optional<std::string> identifier = plugIn->identifier();
+        std::string uuid = uuidText(*plugIn);
+        log::ops().debug("client %d plug-in %@(%{public}@) annotation change: %@", pid, identifier, uuid, changeValue);
+        if (newElection != nullptr)
+            log::ops().info("client %d plug-in %@(%{public}@) election := %@", pid, identifier, uuid, *newElection);
+        server()->setAnnotationForPlugIn(changeValue, *plugIn);
+        return true;
+    });
+    if (!walked) return;
+    server()->notifyAnnotationChange();
+    done();
+}
+
+void Transaction::bulkAnnotatePlugIns() {
+    std::optional<Value> annotations = zem_dictionary_get_dictionary(request(), kAnnotationsKey);
+    if (!annotations) {
+        fail(4, "invalid request format (bad annotations dictionary)");
+        return;
+    }
+    log::ops().debug("bulk change requested for %u plug-ins", annotations->count());
+
+    const pid_t pid = client()->pid();
+    for (const DictionaryEntry& entry : annotations->entries()) {
+        if (!entry.value.isDictionary()) {
+            fail(18, "annotations values must be dictionaries");
+            return;
+        }
+        std::optional<Uuid> uuid = Uuid::parse(entry.key);
+        if (!uuid) {
+            fail(18, "invalid plug-in UUID value");
+            return;
+        }
+        std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(*uuid);
+        if (!plugIn) {
+            fail(2, "no plug-in with the requested uuid");
+            return;
+        }
+        log::ops().debug("client %d bulk plug-in %@(%{public}@) annotation change: %@", pid, plugIn->identifier(),
+                         uuid->string(), entry.value);
+        // The whole "extension" annotation is replaced; the election is a separate key and stays.
+        server()->setAnnotationForPlugIn(Value::dictionary({{std::string(kExtensionKey), entry.value}}), *plugIn);
+    }
+    server()->notifyAnnotationChange();
+    done();
+}
+
+void Transaction::addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& entry) {
+    server()->addAnnotationForPlugInIn(plugIn, entry);
+}
+
+}  // namespace bexil
