@@ -1,0 +1,190 @@
+#include "policy/BXMatchRules.h"
+
+#include <cmath>
+#include <cstdint>
+#include <limits>
+#include <optional>
+
+#include "model/BXUtilities.h"
+#include "platform/log/Log.h"
+
+namespace bexil {
+
+namespace {
+
+const Value& trueValue() {
+    static const Value value = Value::boolean(true);
+    return value;
+}
+const Value& falseValue() {
+    static const Value value = Value::boolean(false);
+    return value;
+}
+
+// Value equality is numeric across bool, integer and real, so this is "a number equal to 1 / to 0"; a string is
+// never equal to either.
+bool isTrue(const Value& value) { return value == trueValue(); }
+bool isFalse(const Value& value) { return value == falseValue(); }
+
+const TypeRegistry& typesOf(const BXMatchContext& context) {
+    return context.types != nullptr ? *context.types : TypeRegistry::shared();
+}
+
+int32_t clampToInt32(long double number) {
+    if (std::isnan(number)) return 0;
+    if (number >= static_cast<long double>(std::numeric_limits<int32_t>::max()))
+        return std::numeric_limits<int32_t>::max();
+    if (number <= static_cast<long double>(std::numeric_limits<int32_t>::min()))
+        return std::numeric_limits<int32_t>::min();
+    return static_cast<int32_t>(number);  // cuts toward zero
+}
+
+// The leading decimal integer of a string, after blanks and an optional sign; 0 when there is none.
+int32_t leadingInteger(std::string_view text) {
+    size_t i = 0;
+    while (i < text.size() && (text[i] == ' ' || text[i] == '\t' || text[i] == '\n')) ++i;
+    bool negative = false;
+    if (i < text.size() && (text[i] == '-' || text[i] == '+')) negative = text[i++] == '-';
+    int64_t magnitude = 0;
+    constexpr int64_t kCap = int64_t{1} << 32;  // beyond every int32, so clamping below decides
+    for (; i < text.size() && text[i] >= '0' && text[i] <= '9'; ++i) {
+        magnitude = magnitude * 10 + (text[i] - '0');
+        if (magnitude > kCap) magnitude = kCap;
+    }
+    return clampToInt32(static_cast<long double>(negative ? -magnitude : magnitude));
+}
+
+}  // namespace
+
+bool BXMatchRules::match(const Value& rules, const BXPlugInCore& plugIn, const BXMatchContext& context) {
+    if (rules.isNull()) return true;
+    if (!rules.isDictionary()) return false;
+    for (const auto& entry : rules.entries()) {
+        if (!matchKeyPattern(entry.key, entry.value, plugIn, context)) return false;
+    }
+    return true;
+}
+
+bool BXMatchRules::matchKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
+                                   const BXMatchContext& context) {
+    std::optional<Value> value;
+    if (key.starts_with(kEntitlementKeyPrefix)) {
+        const BXEntitlementSource& entitlements =
+            context.entitlements != nullptr ? *context.entitlements : BXEntitlementSource::recordEntitlements();
+        value = entitlements.valueForEntitlement(plugIn, key.substr(kEntitlementKeyPrefix.size()));
+    } else {
+        if (key == kIdentifierKey) {
+            if (auto identifier = plugIn.identifier()) value = Value::string(std::move(*identifier));
+        } else if (key == kUuidKey) {
+            if (auto uuid = plugIn.uuid()) value = Value::string(uuid->string());
+        } else if (key == kUserElectionKey) {
+            value = Value::string(userElectionValue(plugIn, context));
+        } else if (key == kContainingAppKey) {
+            auto containing = plugIn.containingPath();
+            if (!containing) return false;  // whatever the pattern, even false
+            value = Value::string(std::move(*containing));
+        }
+        if (!value) value = plugIn.attribute(key);
+        if (!value || value->isNull()) value = plugIn.infoKey(key);
+    }
+    // A null Value (possible in values that came over the wire) is no value at all.
+    if (value && value->isNull()) value.reset();
+
+    if (isTrue(pattern)) return value.has_value() && !isFalse(*value);
+    if (isFalse(pattern)) return !value || isFalse(*value);
+    if (!value) return false;
+    if (pattern.isDictionary()) return matchDictionaryPattern(*value, pattern, context);
+    if (value->isString()) return matchValuePatterns(*value, pattern, context);
+    if (value->isArray()) {
+        for (const Value& element : value->items()) {
+            if (matchValuePatterns(element, pattern, context)) return true;
+        }
+    }
+    return false;
+}
+
+bool BXMatchRules::matchValuePatterns(const Value& value, const Value& patterns, const BXMatchContext& context) {
+    const std::string* text = value.getString();
+    if (text == nullptr) return false;
+    if (patterns.isString()) return matchValuePattern(*text, patterns, context);
+    for (const Value& pattern : patterns.items()) {  // empty for anything but an array
+        if (matchValuePattern(*text, pattern, context)) return true;
+    }
+    return false;
+}
+
+bool BXMatchRules::matchValuePattern(std::string_view value, const Value& pattern, const BXMatchContext& context) {
+    const std::string* text = pattern.getString();
+    if (text == nullptr) return false;
+    std::string_view p = *text;
+
+    if (p.starts_with('?')) {
+        if (p.starts_with(kConformsOperator))
+            return typesOf(context).conformsTo(value, p.substr(kConformsOperator.size()));
+        if (p.starts_with(kIsOperator)) return typesOf(context).conformsTo(p.substr(kIsOperator.size()), value);
+        log::ops().info("unrecognized match operator:%@", pattern);
+        return false;
+    }
+
+    // Two-character operators first, so "<>" and "<=" are not read as "<", nor ">=" as ">". Only one operator is
+    // stripped: "==a" compares against "=a".
+    struct Operator {
+        std::string_view prefix;
+        ComparisonResult wanted;
+        bool negated;
+    };
+    static constexpr Operator kOperators[] = {
+        {"<>", ComparisonResult::Same, true},      {"<=", ComparisonResult::Descending, true},
+        {">=", ComparisonResult::Ascending, true}, {"=", ComparisonResult::Same, false},
+        {"<", ComparisonResult::Ascending, false}, {">", ComparisonResult::Descending, false},
+    };
+    std::string_view operand = p;
+    ComparisonResult wanted = ComparisonResult::Same;
+    bool negated = false;
+    for (const Operator& op : kOperators) {
+        if (p.starts_with(op.prefix)) {
+            operand = p.substr(op.prefix.size());
+            wanted = op.wanted;
+            negated = op.negated;
+            break;
+        }
+    }
+    return (compareVersionString(value, operand) == wanted) != negated;
+}
+
+bool BXMatchRules::matchDictionaryPattern(const Value& value, const Value& pattern, const BXMatchContext& context) {
+    log::extension().debug("evaluating RZExtension filter: %@ value: %@", pattern, value);
+    if (context.activation != nullptr)
+        return context.activation->evaluateActivationRuleWithExtensionItemsRepresentation(value, pattern);
+    const ActivationRuleEvaluator evaluator(typesOf(context));
+    return evaluator.evaluateActivationRuleWithExtensionItemsRepresentation(value, pattern);
+}
+
+int32_t BXMatchRules::electionFromAnnotation(const Value& annotation) {
+    const Value* election = annotation.find("election");
+    if (election == nullptr) return 0;
+    switch (election->kind()) {
+        case ValueKind::Bool:
+            return *election->getBool() ? 1 : 0;
+        case ValueKind::Int64:
+            return static_cast<int32_t>(static_cast<uint32_t>(*election->getInt64()));
+        case ValueKind::UInt64:
+            return static_cast<int32_t>(static_cast<uint32_t>(*election->getUInt64()));
+        case ValueKind::Real:
+            return clampToInt32(*election->getReal());
+        case ValueKind::String:
+            return leadingInteger(election->stringView());
+        default:
+            return 0;
+    }
+}
+
+std::string BXMatchRules::userElectionValue(const BXPlugInCore& plugIn, const BXMatchContext& context) {
+    Value annotation = context.annotations != nullptr ? context.annotations->annotationForPlugIn(plugIn) : Value();
+    int32_t election = electionFromAnnotation(annotation);
+    // Bits 8 to 15 are cleared and the rest kept, so -1 reads as -65281 and 256 as 0.
+    auto kept = static_cast<int32_t>(static_cast<uint32_t>(election) & ~uint32_t{0xFF00});
+    return std::to_string(kept);
+}
+
+}  // namespace bexil

@@ -1,0 +1,219 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <string>
+
+#include "base/Value.h"
+#include "platform/types/ActivationRuleEvaluator.h"
+#include "platform/types/TypeRegistry.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+// Each test gets its own data directories with small hand-written MIME databases.
+class MimeDirFixture : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        root_ = fs::temp_directory_path() / ("bexil-types-" + std::to_string(::getpid()) + "-" +
+                                             ::testing::UnitTest::GetInstance()->current_test_info()->name());
+        fs::remove_all(root_);
+        fs::create_directories(root_);
+    }
+    void TearDown() override { fs::remove_all(root_); }
+
+    fs::path dataDir(const std::string& name) {
+        fs::path dir = root_ / name;
+        fs::create_directories(dir / "mime");
+        return dir;
+    }
+    static void write(const fs::path& dir, const char* file, const std::string& text) {
+        std::ofstream out(dir / "mime" / file, std::ios::trunc);
+        out << text;
+    }
+
+    fs::path root_;
+};
+
+using TypeRegistryTest = MimeDirFixture;
+
+TEST_F(TypeRegistryTest, ConformanceFollowsSubclassesTransitivelyAndOnlyUpwards) {
+    fs::path dir = dataDir("a");
+    write(dir, "subclasses",
+          "# comment line\n"
+          "image/x-fancy-png image/png\n"
+          "image/png image/x-raster\n"
+          "\n"
+          "image/x-raster image/x-picture\n"
+          "this line has too many fields\n");
+    TypeRegistry types({dir});
+    EXPECT_TRUE(types.conformsTo("image/png", "image/png"));
+    EXPECT_TRUE(types.conformsTo("image/x-fancy-png", "image/x-picture"));
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-raster"));
+    EXPECT_FALSE(types.conformsTo("image/x-picture", "image/png"));
+    EXPECT_FALSE(types.conformsTo("image/png", "image/jpeg"));
+    EXPECT_FALSE(types.conformsTo("this", "line"));
+}
+
+TEST_F(TypeRegistryTest, NamesCompareWithoutRegardToCase) {
+    fs::path dir = dataDir("a");
+    write(dir, "subclasses", "Image/PNG image/X-Raster\n");
+    TypeRegistry types({dir});
+    EXPECT_TRUE(types.conformsTo("IMAGE/png", "image/x-raster"));
+    EXPECT_TRUE(types.conformsTo("image/Png", "IMAGE/PNG"));
+}
+
+TEST_F(TypeRegistryTest, AliasesResolveToTheirCanonicalTypeOnBothSides) {
+    fs::path dir = dataDir("a");
+    write(dir, "aliases", "image/x-png image/png\n");
+    write(dir, "subclasses", "image/png image/x-raster\n");
+    TypeRegistry types({dir});
+    EXPECT_EQ(types.canonicalType("IMAGE/X-PNG"), "image/png");
+    EXPECT_TRUE(types.conformsTo("image/x-png", "image/png"));
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-png"));
+    EXPECT_TRUE(types.conformsTo("image/x-png", "image/x-raster"));
+}
+
+TEST_F(TypeRegistryTest, CyclesEndTheSearch) {
+    fs::path dir = dataDir("a");
+    write(dir, "subclasses", "a/one a/two\na/two a/three\na/three a/one\n");
+    TypeRegistry types({dir});
+    EXPECT_TRUE(types.conformsTo("a/one", "a/three"));
+    EXPECT_TRUE(types.conformsTo("a/three", "a/two"));
+    EXPECT_FALSE(types.conformsTo("a/one", "a/four"));
+}
+
+TEST_F(TypeRegistryTest, ImplicitParentsApplyOnlyToMediaTypes) {
+    TypeRegistry types({dataDir("empty")});
+    EXPECT_TRUE(types.conformsTo("text/x-notes", "text/plain"));
+    EXPECT_TRUE(types.conformsTo("text/x-notes", "application/octet-stream"));
+    EXPECT_TRUE(types.conformsTo("image/png", "application/octet-stream"));
+    EXPECT_FALSE(types.conformsTo("inode/directory", "application/octet-stream"));
+    EXPECT_FALSE(types.conformsTo("image/png", "text/plain"));
+    EXPECT_FALSE(types.conformsTo("1.2", "application/octet-stream"));
+    EXPECT_FALSE(types.conformsTo("a/b/c", "application/octet-stream"));
+    EXPECT_FALSE(types.conformsTo("", ""));
+    EXPECT_FALSE(types.conformsTo("image/png", ""));
+}
+
+TEST_F(TypeRegistryTest, EarlierDirectoriesWinAliasesAndSubclassesAddUp) {
+    fs::path first = dataDir("first");
+    fs::path second = dataDir("second");
+    write(first, "aliases", "image/x-old image/png\n");
+    write(second, "aliases", "image/x-old image/gif\n");
+    write(first, "subclasses", "image/png image/x-raster\n");
+    write(second, "subclasses", "image/png image/x-web\n");
+    TypeRegistry types({first, root_ / "missing", second});
+    EXPECT_EQ(types.canonicalType("image/x-old"), "image/png");
+    EXPECT_TRUE(types.conformsTo("image/x-old", "image/x-raster"));
+    EXPECT_TRUE(types.conformsTo("image/x-old", "image/x-web"));
+    EXPECT_FALSE(types.conformsTo("image/x-old", "image/gif"));
+}
+
+TEST_F(TypeRegistryTest, ChangedFilesAreReadAgain) {
+    fs::path dir = dataDir("a");
+    write(dir, "subclasses", "image/png image/x-raster\n");
+    TypeRegistry types({dir}, std::chrono::milliseconds(0));
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-raster"));
+    EXPECT_FALSE(types.conformsTo("image/png", "image/x-web"));
+
+    write(dir, "subclasses", "image/png image/x-web\n");
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-web"));
+    EXPECT_FALSE(types.conformsTo("image/png", "image/x-raster"));
+
+    write(dir, "aliases", "image/x-png image/png\n");  // a file that did not exist before
+    EXPECT_TRUE(types.conformsTo("image/x-png", "image/x-web"));
+}
+
+TEST_F(TypeRegistryTest, WithinTheRecheckIntervalTheLoadedDataIsKept) {
+    fs::path dir = dataDir("a");
+    write(dir, "subclasses", "image/png image/x-raster\n");
+    TypeRegistry types({dir}, std::chrono::hours(1));
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-raster"));
+    write(dir, "subclasses", "image/png image/x-web\n");
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-raster"));
+}
+
+TEST(TypeRegistrySystemTest, TheInstalledDatabaseIsRead) {
+    if (!fs::exists("/usr/share/mime/subclasses")) GTEST_SKIP() << "no MIME database installed";
+    TypeRegistry types({"/usr/share"});
+    EXPECT_TRUE(types.conformsTo("image/svg+xml", "application/xml"));
+    EXPECT_TRUE(types.conformsTo("image/svg+xml", "text/plain"));  // through application/xml
+    EXPECT_TRUE(types.conformsTo("text/xml", "application/xml"));  // an alias
+    EXPECT_FALSE(types.conformsTo("application/xml", "image/svg+xml"));
+}
+
+// ---- Activation rules ----
+
+class ActivationRuleTest : public MimeDirFixture {
+  protected:
+    void SetUp() override {
+        MimeDirFixture::SetUp();
+        fs::path dir = dataDir("a");
+        write(dir, "subclasses", "image/png image/x-raster\nimage/jpeg image/x-raster\n");
+        types_ = std::make_unique<TypeRegistry>(std::vector<fs::path>{dir});
+        evaluator_ = std::make_unique<ActivationRuleEvaluator>(*types_);
+    }
+
+    static Value rule(std::vector<std::pair<std::string, Value>> entries) {
+        return Value::dictionary(std::move(entries));
+    }
+    static Value items(std::vector<std::string> types) {
+        std::vector<Value> list;
+        for (auto& type : types) list.push_back(Value::string(type));
+        return Value::dictionary({{"attachments", Value::array(std::move(list))}});
+    }
+    bool accepts(const Value& rule, const Value& items) const {
+        return evaluator_->evaluateActivationRuleWithExtensionItemsRepresentation(rule, items);
+    }
+
+    std::unique_ptr<TypeRegistry> types_;
+    std::unique_ptr<ActivationRuleEvaluator> evaluator_;
+};
+
+TEST_F(ActivationRuleTest, EachAttachmentNeedsAConformingTypeWithinItsCount) {
+    Value twoImages = rule({{"image/x-raster", Value::int64(2)}});
+    EXPECT_TRUE(accepts(twoImages, items({"image/png"})));
+    EXPECT_TRUE(accepts(twoImages, items({"image/png", "image/jpeg"})));
+    EXPECT_FALSE(accepts(twoImages, items({"image/png", "image/jpeg", "image/png"})));
+    EXPECT_FALSE(accepts(twoImages, items({"text/plain"})));
+    EXPECT_FALSE(accepts(twoImages, items({"image/png", "text/plain"})));
+    EXPECT_TRUE(accepts(twoImages, items({})));
+}
+
+TEST_F(ActivationRuleTest, AttachmentsAreRedistributedWhenAGreedyChoiceWouldNotFit) {
+    // The first PNG fits both types; it must give way so that the text file can use the octet-stream slot.
+    Value mixed = rule({{"application/octet-stream", Value::int64(1)}, {"image/png", Value::int64(1)}});
+    EXPECT_TRUE(accepts(mixed, items({"image/png", "text/plain"})));
+    EXPECT_TRUE(accepts(mixed, items({"text/plain", "image/png"})));
+    EXPECT_FALSE(accepts(mixed, items({"image/png", "text/plain", "image/png"})));
+}
+
+TEST_F(ActivationRuleTest, ValuesOfTheWrongKindAreRefused) {
+    Value good = rule({{"image/png", Value::int64(1)}});
+    EXPECT_FALSE(accepts(Value::string("image/png"), items({"image/png"})));
+    EXPECT_FALSE(accepts(good, Value::string("image/png")));
+    EXPECT_FALSE(accepts(good, Value::emptyDictionary()));
+    EXPECT_FALSE(accepts(good, Value::dictionary({{"attachments", Value::string("image/png")}})));
+    EXPECT_FALSE(accepts(good, Value::dictionary({{"attachments", Value::array({Value::int64(1)})}})));
+    // Counts that are not whole non-negative numbers admit nothing.
+    EXPECT_FALSE(accepts(rule({{"image/png", Value::int64(-1)}}), items({"image/png"})));
+    EXPECT_FALSE(accepts(rule({{"image/png", Value::real(1.5)}}), items({"image/png"})));
+    EXPECT_FALSE(accepts(rule({{"image/png", Value::string("1")}}), items({"image/png"})));
+    EXPECT_TRUE(accepts(rule({{"image/png", Value::boolean(true)}}), items({"image/png"})));
+    EXPECT_FALSE(accepts(rule({{"image/png", Value::int64(0)}}), items({"image/png"})));
+}
+
+TEST_F(ActivationRuleTest, TooManyAttachmentsAreRefused) {
+    Value unlimited = rule({{"image/png", Value::uint64(UINT64_MAX)}});
+    std::vector<std::string> many(ActivationRuleEvaluator::kMaxAttachments, "image/png");
+    EXPECT_TRUE(accepts(unlimited, items(many)));
+    many.push_back("image/png");
+    EXPECT_FALSE(accepts(unlimited, items(many)));
+}
+
+}  // namespace
+}  // namespace bexil
