@@ -11,6 +11,7 @@
 
 #include "JsonText.h"
 #include "base/Document.h"
+#include "platform/prefs/PreferencesStore.h"
 
 namespace bexil::tool {
 
@@ -108,20 +109,7 @@ Result<uint64_t> discoveryFlags(const std::vector<std::string>& names) {
     return flags;
 }
 
-fs::path preferencesFile() {
-    fs::path directory;
-    if (const char* dir = getenv("BX_PREFERENCES_DIR"); dir && *dir) {
-        directory = dir;
-    } else if (const char* config = getenv("XDG_CONFIG_HOME"); config && *config) {
-        directory = fs::path(config) / "bexil" / "preferences";
-    } else {
-        const char* home = getenv("HOME");
-        directory = fs::path(home && *home ? home : "/") / ".config" / "bexil" / "preferences";
-    }
-    std::array<char, 256> host{};
-    if (gethostname(host.data(), host.size() - 1) != 0) host = {};
-    return directory / ("com.quorvel.bexil.userprefs." + std::string(host.data()) + ".vrec");
-}
+fs::path preferencesFile() { return PreferencesStore().fileForDomain(kUserPrefsDomain); }
 
 std::optional<Error> validateExclusions(const Value& rules) {
     if (!rules.isArray()) return BXError(4, "exclusions must be an array of rule dictionaries");

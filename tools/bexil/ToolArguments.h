@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <filesystem>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "base/Error.h"
@@ -33,8 +34,12 @@ Result<Value> readDictionaryFile(const std::filesystem::path& path);
 // Discovery flags by name: all-versions, all-instances, system-only, all.
 Result<uint64_t> discoveryFlags(const std::vector<std::string>& names);
 
-// Where the global exclusions live: $BX_PREFERENCES_DIR, else $XDG_CONFIG_HOME/bexil/preferences (with
-// ~/.config for an unset XDG_CONFIG_HOME), file com.quorvel.bexil.userprefs.<hostname>.vrec.
+// The preferences domain that holds the global exclusions, under the key "exclusions".
+inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
+
+// Where the global exclusions live: the preferences store's file of kUserPrefsDomain ($BX_PREFERENCES_DIR, else
+// $XDG_CONFIG_HOME/bexil/preferences with ~/.config for an unset XDG_CONFIG_HOME;
+// com.quorvel.bexil.userprefs.<host>.vrec).
 std::filesystem::path preferencesFile();
 // Checks that `rules` is an array of rule dictionaries.
 std::optional<Error> validateExclusions(const Value& rules);

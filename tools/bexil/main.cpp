@@ -19,6 +19,7 @@
 #include "client/BXDaemonClientSync.h"
 #include "client/BXPlugInMatches.h"
 #include "platform/log/Log.h"
+#include "platform/prefs/PreferencesStore.h"
 #include "platform/zem/ZemListener.h"
 
 namespace bexil::tool {
@@ -162,18 +163,15 @@ int printExtensions(const Options& options, BXDaemonClient&, const Value& messag
 
 int exclusionsCommand(const Options& options, const std::string& setFile, const std::vector<std::string>& add,
                       bool clear) {
-    fs::path file = preferencesFile();
-    Value preferences = Value::emptyDictionary();
-    std::error_code ec;
-    if (fs::exists(file, ec)) {
-        auto read = Document::readFile(file);
-        if (!read || !read->isDictionary()) {
-            usageError("cannot read preferences " + file.string() + ": " +
-                       (read ? std::string("not a dictionary") : read.error().localizedDescription().value_or("")));
-            return kExitUsage;
-        }
-        preferences = *read;
+    PreferencesStore store;
+    fs::path file = store.fileForDomain(kUserPrefsDomain);
+    auto read = store.readDomain(kUserPrefsDomain);
+    if (!read) {
+        usageError("cannot read preferences " + file.string() + ": " +
+                   read.error().localizedDescription().value_or(""));
+        return kExitUsage;
     }
+    Value preferences = *read;
     Value exclusions = preferences.get("exclusions");
     if (exclusions.isNull()) exclusions = Value::emptyArray();
 
@@ -197,10 +195,7 @@ int exclusionsCommand(const Options& options, const std::string& setFile, const 
             updated.append(*rule);
         }
         exclusions = updated.take();
-        MutableDictionary newPreferences(preferences);
-        newPreferences.set("exclusions", exclusions);
-        fs::create_directories(file.parent_path(), ec);
-        if (auto error = Document::writeFileAtomically(file, newPreferences.take())) {
+        if (auto error = store.setValue(kUserPrefsDomain, "exclusions", exclusions)) {
             std::fprintf(stderr, "bexil: cannot write %s: %s\n", file.c_str(),
                          error->localizedDescription().value_or("").c_str());
             return 73;  // EX_CANTCREAT

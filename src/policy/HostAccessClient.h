@@ -1,0 +1,22 @@
+#pragma once
+
+// HostAccessClient is what the host access policy needs to know of a connected host: its entitlements. The daemon's
+// client object implements it; tests substitute their own. Implementations must be usable from the queue that
+// runs the request.
+
+#include <string_view>
+
+#include "base/Value.h"
+
+namespace bexil {
+
+class HostAccessClient {
+  public:
+    virtual ~HostAccessClient() = default;
+    // The value of one entitlement of the host's code signature, or a null Value.
+    virtual Value entitlementValueForKey(std::string_view key) const = 0;
+    // Whether the host holds the entitlement: it has a value and that value is not equal to false (nor to 0).
+    virtual bool hasEntitlement(std::string_view key) const = 0;
+};
+
+}  // namespace bexil

@@ -1,0 +1,104 @@
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+#include "base/Document.h"
+#include "database/BXDUserPrefs.h"
+#include "platform/prefs/PreferencesStore.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+Value rule(const char* key, const char* pattern) { return Value::dictionary({{key, Value::string(pattern)}}); }
+
+class BXDUserPrefsTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        std::string pattern = (fs::temp_directory_path() / "bx-userprefs-XXXXXX").string();
+        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+        directory_ = pattern;
+    }
+    void TearDown() override { fs::remove_all(directory_); }
+
+    // Sets "exclusions" the way an administrator's tool does, from another process.
+    void setExclusionsElsewhere(const Value& value) {
+        pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) {
+            PreferencesStore writer(directory_, "host");
+            _exit(writer.setValue(BXDUserPrefs::kDomain, "exclusions", value) ? 1 : 0);
+        }
+        int status = 0;
+        ASSERT_EQ(waitpid(pid, &status, 0), pid);
+        ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    }
+
+    fs::path directory_;
+};
+
+TEST_F(BXDUserPrefsTest, AbsentPreferenceIsNullAndExcludesNothing) {
+    PreferencesStore store(directory_, "host");
+    BXDUserPrefs prefs(store);
+    EXPECT_STREQ(prefs.domain(), "com.quorvel.bexil.userprefs");
+    EXPECT_TRUE(prefs.exclusions().isNull());
+    EXPECT_TRUE(BXDUserPrefs::exclusionRuleSets(prefs.exclusions()).empty());
+}
+
+TEST_F(BXDUserPrefsTest, ChangeMadeByAnotherProcessIsSeenByTheSameObject) {
+    PreferencesStore store(directory_, "host");
+    BXDUserPrefs prefs(store);
+    EXPECT_TRUE(prefs.exclusions().isNull());
+
+    Value first = Value::array({rule("RZExtensionPointIdentifier", "com.example.ads")});
+    setExclusionsElsewhere(first);
+    EXPECT_EQ(prefs.exclusions(), first);
+
+    Value second = Value::array({rule("RZExtensionIdentifier", "com.example.a"), rule("RZExtensionIdentifier", "b")});
+    setExclusionsElsewhere(second);
+    EXPECT_EQ(prefs.exclusions(), second);
+
+    setExclusionsElsewhere(Value::null());
+    EXPECT_TRUE(prefs.exclusions().isNull());
+}
+
+// The preference is handed over exactly as stored; deciding what a strange shape means is left to the caller.
+TEST_F(BXDUserPrefsTest, StoredValueIsReturnedUnchecked) {
+    PreferencesStore store(directory_, "host");
+    BXDUserPrefs prefs(store);
+    setExclusionsElsewhere(Value::string("everything"));
+    EXPECT_EQ(prefs.exclusions(), Value::string("everything"));
+}
+
+TEST_F(BXDUserPrefsTest, RuleSetsOfAMalformedValue) {
+    EXPECT_TRUE(BXDUserPrefs::exclusionRuleSets(Value::string("x")).empty());
+    EXPECT_TRUE(BXDUserPrefs::exclusionRuleSets(rule("RZExtensionIdentifier", "a")).empty())
+        << "a single dictionary is not an array of them";
+    Value a = rule("RZExtensionIdentifier", "a");
+    Value b = Value::emptyDictionary();
+    Value mixed = Value::array({Value::int64(1), a, Value::string("rule"), b, Value::array({a})});
+    std::vector<Value> sets = BXDUserPrefs::exclusionRuleSets(mixed);
+    ASSERT_EQ(sets.size(), 2u);
+    EXPECT_EQ(sets[0], a);
+    EXPECT_EQ(sets[1], b);
+}
+
+TEST_F(BXDUserPrefsTest, UnreadableDomainMeansNoExclusions) {
+    PreferencesStore store(directory_, "host");
+    BXDUserPrefs prefs(store);
+    setExclusionsElsewhere(Value::array({rule("RZExtensionIdentifier", "a")}));
+    ASSERT_FALSE(prefs.exclusions().isNull());
+    {
+        std::ofstream broken(store.fileForDomain(BXDUserPrefs::kDomain), std::ios::trunc);
+        broken << "garbage that is no document at all";
+    }
+    EXPECT_TRUE(prefs.exclusions().isNull());
+}
+
+}  // namespace
+}  // namespace bexil

@@ -1,0 +1,195 @@
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+
+#include "base/Document.h"
+#include "platform/log/CaptureSink.h"
+#include "platform/prefs/PreferencesStore.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* kDomain = "com.example.prefs";
+
+class PreferencesStoreTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        std::string pattern = (fs::temp_directory_path() / "bx-prefs-XXXXXX").string();
+        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+        root_ = pattern;
+        directory_ = root_ / "preferences";
+    }
+    void TearDown() override { fs::remove_all(root_); }
+
+    // Runs `body` in a child process and waits for it; the child's exit status must be 0.
+    template <class F>
+    void inChild(F body) {
+        pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) _exit(body() ? 0 : 1);
+        int status = 0;
+        ASSERT_EQ(waitpid(pid, &status, 0), pid);
+        ASSERT_TRUE(WIFEXITED(status));
+        ASSERT_EQ(WEXITSTATUS(status), 0);
+    }
+
+    void writeText(const std::string& text) {
+        fs::create_directories(directory_);
+        std::ofstream(PreferencesStore(directory_, "host").fileForDomain(kDomain)) << text;
+    }
+    std::string fileText() {
+        std::ifstream in(PreferencesStore(directory_, "host").fileForDomain(kDomain));
+        std::stringstream s;
+        s << in.rdbuf();
+        return s.str();
+    }
+
+    fs::path root_;
+    fs::path directory_;
+};
+
+TEST_F(PreferencesStoreTest, FileIsNamedByDomainAndHost) {
+    PreferencesStore store(directory_, "build-7");
+    EXPECT_EQ(store.fileForDomain("com.quorvel.bexil.userprefs"),
+              directory_ / "com.quorvel.bexil.userprefs.build-7.vrec");
+}
+
+TEST_F(PreferencesStoreTest, DefaultDirectoryFollowsTheEnvironment) {
+    const char* saved = getenv("BX_PREFERENCES_DIR");
+    std::string savedText = saved ? saved : "";
+    setenv("BX_PREFERENCES_DIR", "/srv/prefs", 1);
+    EXPECT_EQ(PreferencesStore::defaultDirectory(), fs::path("/srv/prefs"));
+    unsetenv("BX_PREFERENCES_DIR");
+    setenv("XDG_CONFIG_HOME", "/home/u/.cfg", 1);
+    EXPECT_EQ(PreferencesStore::defaultDirectory(), fs::path("/home/u/.cfg/bexil/preferences"));
+    unsetenv("XDG_CONFIG_HOME");
+    if (saved) setenv("BX_PREFERENCES_DIR", savedText.c_str(), 1);
+    EXPECT_FALSE(PreferencesStore::currentHostName().empty());
+    EXPECT_EQ(PreferencesStore::currentHostName().find('/'), std::string::npos);
+}
+
+TEST_F(PreferencesStoreTest, AbsentFileAndAbsentKeyReadAsNull) {
+    PreferencesStore store(directory_, "host");
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "exclusions").isNull());
+    ASSERT_FALSE(store.setValue(kDomain, "other", Value::int64(3)));
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "exclusions").isNull());
+    EXPECT_EQ(store.copyValueAfterSync(kDomain, "other"), Value::int64(3));
+}
+
+TEST_F(PreferencesStoreTest, SetValueKeepsOtherKeysAndNullRemoves) {
+    PreferencesStore store(directory_, "host");
+    ASSERT_FALSE(store.setValue(kDomain, "a", Value::string("one")));
+    ASSERT_FALSE(store.setValue(kDomain, "b", Value::array({Value::int64(1)})));
+    ASSERT_FALSE(store.setValue(kDomain, "a", Value::null()));
+    auto domain = store.readDomain(kDomain);
+    ASSERT_TRUE(domain);
+    EXPECT_EQ(*domain, Value::dictionary({{"b", Value::array({Value::int64(1)})}}));
+    // What is on disk is an ordinary document, readable by anyone.
+    auto onDisk = Document::readFile(store.fileForDomain(kDomain));
+    ASSERT_TRUE(onDisk);
+    EXPECT_EQ(*onDisk, *domain);
+}
+
+// A reader that already cached the domain sees what another process wrote at its next read, without being made
+// again; values of the same length written in quick succession are told apart too.
+TEST_F(PreferencesStoreTest, ChangeByAnotherProcessIsSeenByTheNextRead) {
+    PreferencesStore reader(directory_, "host");
+    EXPECT_TRUE(reader.copyValueAfterSync(kDomain, "k").isNull());
+    for (const char* text : {"aaaa", "bbbb", "cccc"}) {
+        inChild([&] {
+            PreferencesStore writer(directory_, "host");
+            return !writer.setValue(kDomain, "k", Value::string(text));
+        });
+        EXPECT_EQ(reader.copyValueAfterSync(kDomain, "k"), Value::string(text));
+    }
+    // Removal of the whole file by another process reads as "not set".
+    inChild([&] { return fs::remove(reader.fileForDomain(kDomain)); });
+    EXPECT_TRUE(reader.copyValueAfterSync(kDomain, "k").isNull());
+}
+
+TEST_F(PreferencesStoreTest, ConcurrentWritersInOtherProcessesLoseNoKey) {
+    constexpr int kWriters = 4;
+    constexpr int kWritesEach = 10;
+    std::vector<pid_t> children;
+    for (int w = 0; w < kWriters; ++w) {
+        pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) {
+            PreferencesStore writer(directory_, "host");
+            for (int i = 0; i < kWritesEach; ++i)
+                if (writer.setValue(kDomain, "writer" + std::to_string(w) + "-" + std::to_string(i), Value::int64(i)))
+                    _exit(1);
+            _exit(0);
+        }
+        children.push_back(pid);
+    }
+    for (pid_t pid : children) {
+        int status = 0;
+        ASSERT_EQ(waitpid(pid, &status, 0), pid);
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    }
+    auto domain = PreferencesStore(directory_, "host").readDomain(kDomain);
+    ASSERT_TRUE(domain);
+    EXPECT_EQ(domain->count(), size_t(kWriters * kWritesEach));
+}
+
+// A broken file is logged once per change (not on every read), reads as an empty domain, and is picked up as soon
+// as it is repaired.
+TEST_F(PreferencesStoreTest, MalformedFileReadsAsEmptyAndIsLoggedOncePerChange) {
+    log::CaptureSink capture;
+    PreferencesStore store(directory_, "host");
+    writeText("<vrec><dict><key>k</key><string>unterminated");
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
+    EXPECT_EQ(capture.count("cannot be used, reading it as empty"), 1u);
+
+    ASSERT_FALSE(Document::writeFileAtomically(store.fileForDomain(kDomain), Value::string("not a dictionary")));
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
+    EXPECT_EQ(capture.count("does not hold a dictionary"), 1u);
+
+    ASSERT_FALSE(
+        Document::writeFileAtomically(store.fileForDomain(kDomain), Value::dictionary({{"k", Value::boolean(true)}})));
+    EXPECT_EQ(store.copyValueAfterSync(kDomain, "k"), Value::boolean(true));
+}
+
+TEST_F(PreferencesStoreTest, WriterNeverReplacesAFileItCannotRead) {
+    const std::string broken = "<vrec><dict><key>precious</key>";
+    writeText(broken);
+    PreferencesStore store(directory_, "host");
+    EXPECT_FALSE(store.readDomain(kDomain));
+    auto error = store.setValue(kDomain, "k", Value::int64(1));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(fileText(), broken);
+}
+
+TEST_F(PreferencesStoreTest, OversizedFileIsRefused) {
+    log::CaptureSink capture;
+    std::string text = "<vrec><dict><key>k</key><string>";
+    text.append(PreferencesStore::kMaxPreferencesFileBytes, 'x');
+    text += "</string></dict></vrec>";
+    writeText(text);
+    PreferencesStore store(directory_, "host");
+    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
+    EXPECT_TRUE(capture.contains("is larger than"));
+}
+
+TEST_F(PreferencesStoreTest, DomainNamesCannotLeaveTheDirectory) {
+    PreferencesStore store(directory_, "host");
+    for (const char* domain : {"../escape", "a/b", "", ".."}) {
+        EXPECT_TRUE(store.setValue(domain, "k", Value::int64(1))) << domain;
+        EXPECT_FALSE(store.readDomain(domain)) << domain;
+        EXPECT_TRUE(store.copyValueAfterSync(domain, "k").isNull()) << domain;
+    }
+    EXPECT_FALSE(fs::exists(root_ / "escape.host.vrec"));
+}
+
+}  // namespace
+}  // namespace bexil
