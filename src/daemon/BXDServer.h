@@ -17,6 +17,7 @@
 
 namespace bexil {
 
+class BXDPlugIn;
 class BXDPlugInHold;
 class BXDZemClient;
 class EntitlementsDirectory;
@@ -45,6 +46,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
 
     // Database delegate: plug-ins about to be uninstalled.
     void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
+    // holdOnPlugIn: whether some hold names the plug-in. REQUIRES: not inside syncQueue.
+    bool holdOnPlugIn(const BXDPlugIn& plugIn);
     // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
     void unholdClient(const BXDZemClient* client);
 
