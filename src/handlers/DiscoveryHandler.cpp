@@ -117,14 +117,12 @@ void Transaction::matchPlugIns() {
         trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
 
         const std::shared_ptr<BXBundle>& clientBundle = client()->bundle();
-        for (const std::shared_ptr<BXDPlugIn>& plugIn :
-             candidates ? *candidates : BXDatabase::PlugInSet{}) {
+        for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
             std::string uuidText = plugIn->uuid() ? plugIn->uuid()->string() : std::string();
             if (!all) {
                 // Plug-ins outside the system volume are visible only inside an application, and not at all when
                 // the caller asked for system plug-ins only.
-                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & kDiscoverSystemOnly)))
-                    continue;
+                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & kDiscoverSystemOnly))) continue;
                 if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(*plugIn, clientBundle.get())) continue;
                 if (database->holdOnPlugIn(*plugIn)) continue;
             }
