@@ -128,6 +128,13 @@ void BXDServer::terminatePlugInsReply(const std::vector<std::shared_ptr<const LX
 
 std::vector<std::shared_ptr<BXDPlugInHold>>& BXDServer::holds() { return holds_; }
 
+bool BXDServer::holdOnPlugIn(const BXDPlugIn& plugIn) {
+    return syncQueue_.sync([&] {
+        return std::any_of(holds_.begin(), holds_.end(),
+                           [&](const std::shared_ptr<BXDPlugInHold>& hold) { return hold->blocks(plugIn); });
+    });
+}
+
 void BXDServer::unholdClient(const BXDZemClient* client) {
     syncQueue_.sync([&] {
         std::erase_if(holds_, [client](const std::shared_ptr<BXDPlugInHold>& hold) { return hold->belongsTo(client); });

@@ -18,6 +18,7 @@
 
 namespace bexil {
 
+class BXDPlugIn;
 class BXDPlugInHold;
 class BXDZemClient;
 class EntitlementsDirectory;
@@ -52,6 +53,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
                                std::function<void()> reply);
     // The service manager used for termination (tests point it at their own runtime directory).
     void setServiceManager(ServiceManager manager) { serviceManager_ = std::move(manager); }
+    // holdOnPlugIn: whether some hold names the plug-in. REQUIRES: not inside syncQueue.
+    bool holdOnPlugIn(const BXDPlugIn& plugIn);
     // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
     void unholdClient(const BXDZemClient* client);
 

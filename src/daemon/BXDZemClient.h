@@ -14,6 +14,7 @@
 
 #include "base/Value.h"
 #include "platform/zem/ZemConnection.h"
+#include "policy/HostAccessClient.h"
 
 namespace bexil {
 
@@ -21,7 +22,7 @@ class BXBundle;
 class BXDServer;
 class CodeSigningIdentity;
 
-class BXDZemClient : public std::enable_shared_from_this<BXDZemClient> {
+class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public HostAccessClient {
   public:
     // Size of the buffer the executable path is read into; longer paths count as unknown.
     static constexpr size_t kExecutablePathBufferSize = 2048;
@@ -36,9 +37,9 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient> {
     void dead();
 
     // The entitlement's value in the peer's signature, or a null Value.
-    Value entitlementValueForKey(std::string_view key) const;
+    Value entitlementValueForKey(std::string_view key) const override;
     // True when the entitlement has a value that is not equal to false (so not false and not the number 0).
-    bool hasEntitlement(std::string_view key) const;
+    bool hasEntitlement(std::string_view key) const override;
 
     std::string description() const;
 

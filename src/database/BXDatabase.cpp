@@ -5,6 +5,9 @@
 // query never blocks the annotation operations of other requests. The purge is deliberately all or nothing: the
 // limit exists to bound memory in pathological cases, not to implement an eviction policy.
 
+#include <cctype>
+#include <unordered_set>
+
 #include "base/QueueAssert.h"
 #include "database/BXDAnnotationStore.h"
 #include "model/BXUtilities.h"
@@ -15,6 +18,7 @@
 #include "platform/log/Log.h"
 #include "platform/notify/SystemNotifications.h"
 #include "policy/BXDPlugIn.h"
+#include "policy/BXMatchRules.h"
 
 namespace bexil {
 
@@ -29,6 +33,21 @@ std::string uuidText(const std::shared_ptr<const LXBexilProxy>& proxy) {
 }
 
 }  // namespace
+
+// Gives the match rules the stored annotation of a daemon record, entering `_sync` for each read. Records of other
+// kinds have no annotation key of the daemon's and so no stored annotation.
+class BXDatabase::AnnotationReader final : public BXAnnotationSource {
+  public:
+    explicit AnnotationReader(BXDatabase& database) : database_(database) {}
+    Value annotationForPlugIn(const BXPlugInCore& plugIn) const override {
+        const auto* record = dynamic_cast<const BXDPlugIn*>(&plugIn);
+        if (record == nullptr) return Value();
+        return database_.annotationForPlugIn(*record);
+    }
+
+  private:
+    BXDatabase& database_;
+};
 
 // Forwards the registry's callbacks to the database that owns it.
 class BXDatabase::Observer final : public LXApplicationWorkspaceObserverProtocol {
@@ -47,7 +66,10 @@ class BXDatabase::Observer final : public LXApplicationWorkspaceObserverProtocol
 
 BXDatabase::BXDatabase(std::optional<std::string> databasePath, std::shared_ptr<LXApplicationWorkspace> workspace,
                        NotificationPoster poster)
-    : databasePath_(std::move(databasePath)), workspace_(std::move(workspace)), poster_(std::move(poster)) {}
+    : databasePath_(std::move(databasePath)),
+      workspace_(std::move(workspace)),
+      poster_(std::move(poster)),
+      annotationSource_(std::make_unique<AnnotationReader>(*this)) {}
 
 BXDatabase::~BXDatabase() {
     if (workspace_ && observer_) workspace_->removeObserver(observer_.get());
@@ -157,6 +179,100 @@ std::optional<std::vector<std::shared_ptr<BXDPlugIn>>> BXDatabase::plugInsWithin
         if (std::shared_ptr<BXDPlugIn> plugIn = plugInForProxy(proxy)) plugIns.push_back(std::move(plugIn));
     }
     return plugIns;
+}
+
+// ---- Discovery ----
+
+std::optional<std::string> BXDatabase::normalizeElection(const Value& value) {
+    const std::string* text = value.getString();
+    if (text == nullptr || text->empty()) return std::nullopt;
+    if (text->front() == '=') return text->substr(1);
+    if (!std::isalnum(static_cast<unsigned char>(text->front()))) return std::nullopt;
+    return *text;
+}
+
+std::optional<std::vector<std::string>> BXDatabase::wantedElections(const Value& query) {
+    const Value* election = query.isDictionary() ? query.find(kUserElectionQueryKey) : nullptr;
+    if (election == nullptr) return std::nullopt;
+    std::vector<std::string> wanted;
+    if (election->isString()) {
+        std::optional<std::string> value = normalizeElection(*election);
+        if (!value) return std::nullopt;
+        wanted.push_back(std::move(*value));
+    } else if (election->isArray()) {
+        for (const Value& element : election->items()) {
+            std::optional<std::string> value = normalizeElection(element);
+            // One bad element switches filtering off for the whole query rather than narrowing it silently.
+            if (!value) return std::nullopt;
+            wanted.push_back(std::move(*value));
+        }
+    } else {
+        return std::nullopt;
+    }
+    return wanted;
+}
+
+bool BXDatabase::electionFilter(const std::vector<std::string>& wanted, std::string_view identifier,
+                                const std::optional<Value>& entitlements) {
+    // The same key as the record's annotationKey: a replacing plug-in is filtered by the election it took over.
+    std::string key(identifier);
+    const Value* replaced = entitlements ? entitlements->find(BXDPlugIn::kReplacePlugInEntitlement) : nullptr;
+    if (replaced != nullptr && replaced->isString()) key = replaced->stringView();
+
+    Value annotation = _sync.sync([&] { return annotations_->annotationForIdentifier(key); });
+    int64_t election = 0;
+    if (annotation.isDictionary() && annotation.contains(kElectionKey)) {
+        election = BXMatchRules::electionFromAnnotation(annotation);
+    } else {
+        // Not elected yet: a plug-in entitled to automatic election counts as elected, as it will be once built.
+        const Value* automatic = entitlements ? entitlements->find(BXDPlugIn::kAutoElectEntitlement) : nullptr;
+        std::optional<double> number = automatic != nullptr ? automatic->numberAsDouble() : std::nullopt;
+        election = number && *number != 0 ? 1 : 0;
+    }
+    std::string text = std::to_string(election & 0xff);
+    bool keep = std::find(wanted.begin(), wanted.end(), text) != wanted.end();
+    log::ops().debug("lx filter %@ -> %d", key, keep ? 1 : 0);
+    return keep;
+}
+
+std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query) {
+    BX_ASSERT_NOT_ON_QUEUE(_sync);
+    std::optional<LXProxyList> proxies;
+    if (!query.isDictionary() || query.count() == 0) {
+        proxies = workspace_->installedPlugins();
+        log::lx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
+    } else {
+        std::optional<std::vector<std::string>> wanted = wantedElections(query);
+        LXPlugInFilter filter = [this, &wanted](std::string_view identifier, const std::optional<Value>& entitlements) {
+            return !wanted || electionFilter(*wanted, identifier, entitlements);
+        };
+        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filter);
+        log::lx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, query, proxies);
+    }
+
+    size_t cachedBefore = cachedCount();
+    if (!proxies) return std::nullopt;
+
+    PlugInSet result;
+    std::unordered_set<Uuid> seen;
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : *proxies) {
+        if (!proxy->bundleURL()) {
+            log::ops().info("skipping lx proxy %@ with nil bundleURL", proxy->description());
+            continue;
+        }
+        // A containing bundle is always an application record: the registry's interface has no other kind to
+        // hand out, so the type itself rules out a containing bundle of the wrong kind.
+        const std::shared_ptr<const LXApplicationProxy>& application = proxy->containingBundle();
+        if (application && application->isPlaceholder()) {
+            log::ops().info("skipping lx proxy %@ because its app is a placeholder", proxy->description());
+            continue;
+        }
+        std::shared_ptr<BXDPlugIn> plugIn = plugInForProxy(proxy);
+        if (!plugIn) continue;
+        if (seen.insert(*plugIn->uuid()).second) result.push_back(std::move(plugIn));
+    }
+    log::ops().debug("LX reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore, cachedCount());
+    return result;
 }
 
 std::optional<Error> BXDatabase::addPlugIn(std::string_view url) {

@@ -19,6 +19,7 @@
 #include "base/SyncQueue.h"
 #include "base/Value.h"
 #include "database/BXDatabaseDelegate.h"
+#include "policy/BXAnnotationSource.h"
 
 namespace bexil {
 
@@ -83,6 +84,26 @@ class BXDatabase {
     // The records of an application's plug-ins in the registry's order; none (not empty) when it has none.
     std::optional<std::vector<std::shared_ptr<BXDPlugIn>>> plugInsWithinApplication(std::string_view url);
 
+    // ---- Discovery ----
+
+    // The query key that lists the user elections a discovery wants.
+    static constexpr std::string_view kUserElectionQueryKey = "RZUserElection";
+    using PlugInSet = std::vector<std::shared_ptr<BXDPlugIn>>;
+
+    // findPlugIns: the records of the plug-ins that the registry finds for `query` and whose user election is among
+    // the query's "RZUserElection" values (all of them when there is none, or it is malformed). An empty query lists
+    // every installed plug-in without election filtering. Records without bundle URL and plug-ins of placeholder
+    // applications are skipped. No duplicates, in the registry's order; none when the registry gave nothing.
+    // REQUIRES: not inside `_sync` (the election filter and the record look-ups enter it).
+    std::optional<PlugInSet> findPlugIns(const Value& query);
+
+    // One wanted election value of a query: "=x" is "x" (possibly empty), an alphanumeric start is the whole
+    // string; none for anything else (not a string, empty, another first character).
+    static std::optional<std::string> normalizeElection(const Value& value);
+    // The wanted list of `query`'s "RZUserElection" (a string or an array of them), or none when it is absent, of
+    // another type, or any element fails normalisation: election filtering is then off.
+    static std::optional<std::vector<std::string>> wantedElections(const Value& query);
+
     // Registers / unregisters the plug-in bundle at `url`; an error of code 2 when the registry refuses.
     std::optional<Error> addPlugIn(std::string_view url);
     std::optional<Error> removePlugIn(std::string_view url);
@@ -91,6 +112,9 @@ class BXDatabase {
     size_t cachedCount();
 
     // ---- Annotations ----
+
+    // The annotations as the match rules read them (the election), through `_sync`. Lives as long as the database.
+    const BXAnnotationSource& annotationSource() const { return *annotationSource_; }
 
     // The stored annotation of the plug-in (a dictionary), or null.
     Value annotationForPlugIn(const BXDPlugIn& plugIn);
@@ -119,6 +143,11 @@ class BXDatabase {
 
   private:
     class Observer;
+    class AnnotationReader;
+
+    // The registry's filter for a wanted election list: reads each candidate's election inside `_sync`.
+    bool electionFilter(const std::vector<std::string>& wanted, std::string_view identifier,
+                        const std::optional<Value>& entitlements);
 
     std::optional<std::string> databasePath_;
     std::atomic<unsigned> cacheLimit_{kDefaultCacheLimit};
@@ -128,6 +157,7 @@ class BXDatabase {
     NotificationPoster poster_;
     // The registry holds its observers weakly; this forwarder lives exactly as long as the database.
     std::shared_ptr<Observer> observer_;
+    std::unique_ptr<BXAnnotationSource> annotationSource_;
     SyncQueue _sync{"BXDatabase"};
     std::unordered_map<Uuid, std::shared_ptr<BXDPlugIn>> cache_;
 };

@@ -5,7 +5,6 @@
 
 namespace bexil {
 
-void Transaction::matchPlugIns() { fail(4, "the \"match\" operation is not available yet"); }
 void Transaction::readyPlugIns() { fail(4, "the \"ready\" operation is not available yet"); }
 void Transaction::accessPlugIns() { fail(4, "the \"access\" operation is not available yet"); }
 void Transaction::lockDownPlugIns() { fail(4, "the \"lock\" operation is not available yet"); }

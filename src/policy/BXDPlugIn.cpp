@@ -9,6 +9,7 @@
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
+#include "policy/BXHostAccessPolicy.h"
 #include "policy/BXIssueReadExtension.h"
 
 namespace bexil {
@@ -190,6 +191,20 @@ std::string BXDPlugIn::annotationKey() const {
 }
 
 // ---- Checks ----
+
+bool BXDPlugIn::match(const Value& rules, const BXMatchContext& context) const {
+    return BXMatchRules::match(rules, *this, context);
+}
+
+bool BXDPlugIn::matchKeyPattern(std::string_view key, const Value& pattern, const BXMatchContext& context) const {
+    return BXMatchRules::matchKeyPattern(key, pattern, *this, context);
+}
+
+std::optional<std::string> BXDPlugIn::allowForClient(const HostAccessClient& client,
+                                                     const BXMatchContext& context) const {
+    return BXHostAccessPolicy::allowForClient(*this, client,
+                                              [&](const Value& ruleSet) { return match(ruleSet, context); });
+}
 
 std::optional<Error> BXDPlugIn::diagnose() const {
     if (std::optional<Error> error = BXPlugInCore::diagnose()) return error;

@@ -15,6 +15,8 @@
 #include "base/Value.h"
 #include "model/BXPlugInCore.h"
 #include "platform/wardend/ProcessAssertions.h"
+#include "policy/BXMatchRules.h"
+#include "policy/HostAccessClient.h"
 
 namespace bexil {
 
@@ -67,6 +69,15 @@ class BXDPlugIn : public BXPlugInCore {
     // A description of a busy instance of this plug-in ({ProcessAssertions::kBundleIdentifierKey: identifier}),
     // or none when no instance is busy. Instances reported without a bundle identifier are logged and passed over.
     std::optional<Value> checkBusy(const ProcessAssertions& assertions) const;
+
+    // match: whether the plug-in satisfies every rule of `rules` (a null or empty rule set always matches). The
+    // election is read through `context`'s annotation source. REQUIRES: not on the database's queue.
+    bool match(const Value& rules, const BXMatchContext& context = {}) const;
+    // matchKey:pattern: one rule of a rule set.
+    bool matchKeyPattern(std::string_view key, const Value& pattern, const BXMatchContext& context = {}) const;
+    // allowForClient: the reason why `client` may not use this plug-in, or nothing when it may. A host that
+    // restricts itself with a rule set has it evaluated with `context`.
+    std::optional<std::string> allowForClient(const HostAccessClient& client, const BXMatchContext& context = {}) const;
 
     // The base checks, then: a plug-in that carries code needs a data container; a plug-in outside any
     // application must live below /System/. Errors have code 12.

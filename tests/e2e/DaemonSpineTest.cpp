@@ -261,7 +261,7 @@ TEST_F(BxdEnvelope, RequestNamesAreExactAndKnownOnesAreNotYetAvailable) {
         EXPECT_EQ(errorCode(reply), 4) << name;
         EXPECT_EQ(errorText(reply), "unrecognized request") << name;
     }
-    for (const char* name : {"match", "ready", "access", "lock"}) {
+    for (const char* name : {"ready", "access", "lock"}) {
         Value reply = client.replyTo(request(name));
         EXPECT_EQ(errorCode(reply), 4) << name;
         EXPECT_EQ(errorText(reply), std::string("the \"") + name + "\" operation is not available yet") << name;

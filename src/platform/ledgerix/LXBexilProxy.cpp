@@ -36,6 +36,10 @@ std::optional<Value> LXBexilProxy::bexilDictionary() const {
     return std::nullopt;
 }
 
+namespace {
+constexpr std::string_view kExtensionPointAttribute = "RZExtensionPointIdentifier";
+}  // namespace
+
 std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std::string_view key,
                                                                             std::optional<ValueKind> ofClass,
                                                                             LXInfoScope scope) const {
@@ -55,8 +59,13 @@ std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std:
             }
             break;
     }
-    if (!dictionary) return std::nullopt;
-    const Value* found = dictionary->find(key);
+    const Value* found = dictionary ? dictionary->find(key) : nullptr;
+    // The registry files every plug-in under its extension point and reports that point among its attributes,
+    // where a point's SDK would otherwise supply it: rule sets name the point like any other attribute.
+    std::optional<Value> plugIn;
+    if (found == nullptr && scope == LXInfoScope::Attributes && key == kExtensionPointAttribute &&
+        (plugIn = bexilDictionary()))
+        found = plugIn->find(key);
     if (found == nullptr || (ofClass && found->kind() != *ofClass)) return std::nullopt;
     return *found;
 }

@@ -22,7 +22,8 @@ class LXApplicationProxy;
 
 // Where objectForInfoDictionaryKeyOfClassInScope looks.
 enum class LXInfoScope : int {
-    // The attributes dictionary ("RZExtensionAttributes" of the plug-in dictionary).
+    // The attributes dictionary ("RZExtensionAttributes" of the plug-in dictionary); the plug-in dictionary's
+    // "RZExtensionPointIdentifier" counts among the attributes when they do not name one themselves.
     Attributes = 0,
     // The plug-in dictionary ("RZExtension" of the information dictionary).
     PlugIn = 1,

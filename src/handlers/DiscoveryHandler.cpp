@@ -1,0 +1,206 @@
+// The "match" request: discovery. The database's query gives the candidates (the registry pre-selects by the
+// rules in its own way); every candidate then passes, in order, the visibility checks (where it lives, dedicated
+// plug-ins, holds), the client's rules, the global exclusions and the host policy, before its form is exported
+// and competes with the forms of the same identifier already accepted. The order matters for what a client can
+// learn: a plug-in the client may not see is never matched against its rules, so rules cannot probe for it.
+//
+// The result is a list of forms, not records, because the duplicate resolution compares against what was
+// accepted (the form's version, residence and registration time), and the replacement links are written into the
+// forms after every candidate has been seen.
+
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "client/BXDaemonClient.h"
+#include "daemon/BXDServer.h"
+#include "daemon/BXDZemClient.h"
+#include "daemon/Transaction.h"
+#include "model/BXBundle.h"
+#include "model/BXUtilities.h"
+#include "platform/log/Log.h"
+#include "platform/sandbox/ProcessSandbox.h"
+#include "platform/trace/Probes.h"
+#include "policy/BXDPlugIn.h"
+#include "policy/BXHostAccessPolicy.h"
+
+namespace bexil {
+
+namespace {
+
+// Keep every version of an identifier, not only the best.
+constexpr uint64_t kDiscoverAllVersions = 0x1;
+// With kDiscoverAllVersions: keep also plug-ins that share identifier and version.
+constexpr uint64_t kDiscoverAllInstances = 0x4;
+// Only plug-ins on the system volume.
+constexpr uint64_t kDiscoverSystemOnly = 0x8;
+// Privileged: no visibility checks, no host policy.
+constexpr uint64_t kDiscoverAll = 0x200;
+
+// The entitlement that privileged discovery needs (besides not being sandboxed).
+constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
+
+constexpr std::string_view kIdentifierKey = "identifier";
+constexpr std::string_view kVersionKey = "version";
+constexpr std::string_view kUuidKey = "uuid";
+constexpr std::string_view kSystemResidentKey = "systemResident";
+constexpr std::string_view kLastModifiedKey = "lastmodified";
+constexpr std::string_view kOverriderKey = "overrider";
+constexpr std::string_view kOverridingKey = "overriding";
+
+using Form = std::shared_ptr<MutableDictionary>;
+
+std::string textOf(const MutableDictionary& form, std::string_view key) {
+    const Value* value = form.find(key);
+    return value != nullptr && value->isString() ? std::string(value->stringView()) : std::string();
+}
+
+std::string versionOf(const BXDPlugIn& plugIn) {
+    std::optional<Value> version = plugIn.version();
+    return version && version->isString() ? std::string(version->stringView()) : std::string();
+}
+
+// Whether the new plug-in wins against an accepted form of the same identifier and version: a system plug-in beats
+// one that is not, otherwise the later registration wins and equal times keep what was accepted first.
+bool winsTieBreak(const BXDPlugIn& plugIn, const MutableDictionary& form) {
+    const Value* resident = form.find(kSystemResidentKey);
+    bool formResident = resident != nullptr && resident->getBool().value_or(false);
+    if (plugIn.onSystemVolume() && !formResident) return true;
+    const Value* modified = form.find(kLastModifiedKey);
+    int32_t formModified = modified != nullptr ? static_cast<int32_t>(modified->numberAsInt64().value_or(0)) : 0;
+    return plugIn.lastModified() > formModified;
+}
+
+// The identifiers a plug-in says it replaces: a string names one, an array every string in it.
+std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn) {
+    std::vector<std::string> identifiers;
+    std::optional<Value> value = plugIn.valueForEntitlement(BXDPlugIn::kReplacePlugInEntitlement);
+    if (!value) return identifiers;
+    if (value->isString()) {
+        identifiers.emplace_back(value->stringView());
+    } else if (value->isArray()) {
+        for (const Value& element : value->items()) {
+            if (element.isString()) identifiers.emplace_back(element.stringView());
+        }
+    }
+    return identifiers;
+}
+
+}  // namespace
+
+void Transaction::matchPlugIns() {
+    const Value* rulesEntry = request().find("rules");
+    if (rulesEntry != nullptr && !rulesEntry->isDictionary()) {
+        fail(4, "invalid request format (bad rules dictionary)");
+        return;
+    }
+    Value rules = rulesEntry != nullptr ? *rulesEntry : Value();
+    uint64_t flags = request().get("flags").numberAsUInt64().value_or(0);
+    bool all = (flags & kDiscoverAll) != 0;
+    pid_t pid = client()->pid();
+
+    if (all && (!client()->hasEntitlement(kManagerEntitlement) || processIsSandboxed(pid))) {
+        fail(11, "unauthorized discovery flag (BXDiscoverAll)");
+        return;
+    }
+
+    BXDServer* database = server();
+    BXMatchContext context{.annotations = &database->annotationSource()};
+    std::vector<Form> results;
+    {
+        // Everything per candidate lives in this scope, so the records and rejected forms are gone before the
+        // reply is encoded.
+        std::unordered_map<std::string, Form> replacements;
+        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database->userPrefs().exclusions());
+        std::optional<BXDatabase::PlugInSet> candidates = database->findPlugIns(rules);
+        trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
+
+        const std::shared_ptr<BXBundle>& clientBundle = client()->bundle();
+        for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
+            std::string uuidText = plugIn->uuid() ? plugIn->uuid()->string() : std::string();
+            if (!all) {
+                // Plug-ins outside the system volume are visible only inside an application, and not at all when
+                // the caller asked for system plug-ins only.
+                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & kDiscoverSystemOnly))) continue;
+                if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(*plugIn, clientBundle.get())) continue;
+                if (database->holdOnPlugIn(*plugIn)) continue;
+            }
+            if (!plugIn->match(rules, context)) continue;
+
+            bool excluded = false;
+            for (const Value& exclusion : exclusions) {
+                if (plugIn->match(exclusion, context)) {
+                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText);
+                    excluded = true;
+                    break;
+                }
+            }
+            if (excluded) continue;
+
+            if (!all) {
+                if (std::optional<std::string> reason = plugIn->allowForClient(*client(), context)) {
+                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText, *reason);
+                    continue;
+                }
+            }
+
+            Result<MutableDictionary> exported = plugIn->exportForm();
+            if (!exported) {
+                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText,
+                                 exported.error());
+                continue;
+            }
+
+            // Duplicate resolution against the forms of the same identifier accepted so far.
+            std::string identifier = plugIn->identifier().value_or("");
+            std::string version = versionOf(*plugIn);
+            bool dropped = false;
+            for (auto it = results.begin(); it != results.end(); ++it) {
+                if (textOf(**it, kIdentifierKey) != identifier) continue;
+                ComparisonResult order = compareVersionString(version, textOf(**it, kVersionKey));
+                bool same = order == ComparisonResult::Same;
+                if ((flags & kDiscoverAllVersions) && (!same || (flags & kDiscoverAllInstances))) continue;
+                bool wins = same ? winsTieBreak(*plugIn, **it) : order == ComparisonResult::Descending;
+                if (wins) {
+                    results.erase(it);
+                } else {
+                    dropped = true;
+                }
+                break;
+            }
+            if (dropped) continue;
+
+            Form form = std::make_shared<MutableDictionary>(std::move(*exported));
+            database->addAnnotationForPlugInIn(*plugIn, *form);
+            plugIn->augmentForm(*form);
+            results.push_back(form);
+            // A later plug-in naming the same identifier takes the entry over.
+            for (const std::string& replaced : replacedIdentifiers(*plugIn)) replacements[replaced] = form;
+        }
+
+        if (!replacements.empty()) {
+            for (const Form& form : results) {
+                std::string identifier = textOf(*form, kIdentifierKey);
+                auto replacing = replacements.find(identifier);
+                if (replacing == replacements.end()) continue;
+                std::string replacingUuid = textOf(*replacing->second, kUuidKey);
+                form->set(kOverriderKey, Value::string(replacingUuid));
+                replacing->second->set(kOverridingKey, Value::string(identifier));
+                log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid, textOf(*form, kUuidKey));
+            }
+        }
+    }
+
+    log::ops().info("match returned %u plug-ins", results.size());
+    std::vector<Value> forms;
+    forms.reserve(results.size());
+    for (const Form& form : results) forms.push_back(form->value());
+    if (std::optional<Value> encoded =
+            BXDaemonClient::convertToZEMVersion(Value::array(std::move(forms)), static_cast<int64_t>(version())))
+        reply().set("matches", std::move(*encoded));
+    log::ops().debug("reply marshalled");
+    done();
+}
+
+}  // namespace bexil

@@ -1,0 +1,112 @@
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <filesystem>
+
+#include "base/EventLoop.h"
+#include "daemon/BXDPlugInHold.h"
+#include "daemon/BXDServer.h"
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+Value str(std::string_view s) { return Value::string(s); }
+
+// A daemon record of a well-formed plug-in inside an application, under the UUID given.
+std::shared_ptr<BXDPlugIn> record(const std::string& name, Uuid uuid) {
+    LXApplicationProxy::Fields app;
+    app.bundleURL = "/Applications/Greeter.app";
+    LXBexilProxy::Fields fields;
+    std::string identifier = "com.example." + name;
+    fields.bundleURL = "/Applications/Greeter.app/PlugIns/" + name + ".bxplugin";
+    fields.pluginIdentifier = identifier;
+    fields.pluginUUID = uuid;
+    fields.containingBundle = std::make_shared<LXApplicationProxy>(app, LXApplicationProxy::PlugInList{});
+    fields.dataContainerURL = "/var/lib/bexil/containers/" + identifier;
+    fields.infoVrec = Value::dictionary({
+        {"BDBundleIdentifier", str(identifier)},
+        {"RZExtension", Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")},
+                                           {"RZExtensionProtocol", str("GreetingProvider")},
+                                           {"PrincipalClass", str("Greeting")},
+                                           {"RZExtensionAttributes", Value::emptyDictionary()}})},
+    });
+    return BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+}
+
+// A server over private directories; its listener is bound but never resumed.
+class BXDServerHoldTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        char pattern[] = "/tmp/bxdserver-hold-XXXXXX";
+        ASSERT_NE(mkdtemp(pattern), nullptr);
+        root_ = pattern;
+        for (const char* dir : {"service", "state", "runtime", "entitlements"}) fs::create_directories(root_ / dir);
+        setenv("BX_SERVICE_DIR", (root_ / "service").c_str(), 1);
+        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
+        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        setenv("BX_ENTITLEMENTS_DIR", (root_ / "entitlements").c_str(), 1);
+        server_ =
+            BXDServer::initForServiceDatabase("com.example.hold-test", (root_ / "annotations.vrec").c_str(), loop_);
+        ASSERT_NE(server_, nullptr);
+    }
+    void TearDown() override {
+        server_.reset();
+        fs::remove_all(root_);
+    }
+
+    void place(std::vector<std::shared_ptr<BXDPlugIn>> plugIns) {
+        server_->syncQueue().sync([&] {
+            server_->holds().push_back(
+                std::make_shared<BXDPlugInHold>(Uuid::random(), std::weak_ptr<BXDZemClient>(), std::move(plugIns)));
+        });
+    }
+
+    fs::path root_;
+    EventLoop loop_{0};
+    std::unique_ptr<BXDServer> server_;
+};
+
+TEST_F(BXDServerHoldTest, NoHoldsHoldNothing) {
+    std::shared_ptr<BXDPlugIn> hello = record("hello", Uuid::random());
+    ASSERT_NE(hello, nullptr);
+    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+    // An empty hold (an application without plug-ins) holds nothing either.
+    place({});
+    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+}
+
+TEST_F(BXDServerHoldTest, HoldNamesPlugInsByUuidNotByRecord) {
+    Uuid helloUuid = Uuid::random();
+    std::shared_ptr<BXDPlugIn> hello = record("hello", helloUuid);
+    std::shared_ptr<BXDPlugIn> bonjour = record("bonjour", Uuid::random());
+    std::shared_ptr<BXDPlugIn> night = record("night", Uuid::random());
+    ASSERT_TRUE(hello && bonjour && night);
+    place({bonjour});
+    place({night, hello});
+    EXPECT_TRUE(server_->holdOnPlugIn(*hello)) << "found in a later hold";
+    EXPECT_TRUE(server_->holdOnPlugIn(*bonjour));
+    // A record rebuilt for the same registry plug-in is the same plug-in.
+    std::shared_ptr<BXDPlugIn> rebuilt = record("hello", helloUuid);
+    ASSERT_NE(rebuilt, nullptr);
+    EXPECT_TRUE(server_->holdOnPlugIn(*rebuilt));
+    EXPECT_FALSE(server_->holdOnPlugIn(*record("other", Uuid::random())));
+}
+
+TEST_F(BXDServerHoldTest, ReleasedHoldNoLongerCounts) {
+    std::shared_ptr<BXDPlugIn> hello = record("hello", Uuid::random());
+    ASSERT_NE(hello, nullptr);
+    place({hello});
+    ASSERT_TRUE(server_->holdOnPlugIn(*hello));
+    // A hold without a living client goes with the next release of dead clients' holds.
+    server_->unholdClient(nullptr);
+    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+}
+
+}  // namespace
+}  // namespace bexil

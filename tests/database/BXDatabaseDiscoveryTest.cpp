@@ -1,0 +1,275 @@
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <mutex>
+
+#include "database/BXDAnnotationStore.h"
+#include "database/BXDatabase.h"
+#include "platform/ledgerix/LXApplicationProxy.h"
+#include "platform/ledgerix/LXApplicationWorkspace.h"
+#include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/log/CaptureSink.h"
+#include "policy/BXDPlugIn.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+using Entries = std::vector<std::pair<std::string, Value>>;
+
+Value dict(Entries entries) { return Value::dictionary(std::move(entries)); }
+Value str(std::string_view s) { return Value::string(s); }
+
+// A registry whose answers the test decides. It hands the filter exactly what a real registry would (the
+// identifier and the entitlements) and records what it was asked.
+class ScriptedWorkspace : public LXApplicationWorkspace {
+  public:
+    void addObserver(std::weak_ptr<LXApplicationWorkspaceObserverProtocol>) override {}
+    void removeObserver(const LXApplicationWorkspaceObserverProtocol*) override {}
+    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view) override {
+        return Error("test", 1, "not supported");
+    }
+    std::optional<Error> unregisterPlugin(std::string_view) override { return Error("test", 1, "not supported"); }
+    void LXClearSchemaCaches() override {}
+    std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid&) override { return nullptr; }
+    std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view) override { return nullptr; }
+    std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view) override {
+        return nullptr;
+    }
+    std::optional<LXProxyList> installedPlugins() override {
+        ++installedCalls;
+        return answer;
+    }
+    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
+                                                               const LXPlugInFilter& filter) override {
+        lastQuery = query;
+        if (!answer) return std::nullopt;
+        LXProxyList kept;
+        for (const auto& proxy : *answer) {
+            ++filterCalls;
+            if (filter(proxy->pluginIdentifier().value_or(""), proxy->entitlements())) kept.push_back(proxy);
+        }
+        return kept;
+    }
+
+    std::optional<LXProxyList> answer = LXProxyList{};
+    Value lastQuery;
+    int installedCalls = 0;
+    int filterCalls = 0;
+};
+
+std::shared_ptr<const LXApplicationProxy> application(bool placeholder = false) {
+    LXApplicationProxy::Fields fields;
+    fields.bundleURL = placeholder ? "/Applications/Pending.app" : "/Applications/Greeter.app";
+    fields.isPlaceholder = placeholder;
+    return std::make_shared<LXApplicationProxy>(fields, LXApplicationProxy::PlugInList{});
+}
+
+// A well-formed plug-in inside an application, with the entitlements given.
+std::shared_ptr<const LXBexilProxy> plugIn(const std::string& name, std::optional<Value> entitlements = std::nullopt,
+                                           std::optional<Uuid> uuid = std::nullopt) {
+    LXBexilProxy::Fields fields;
+    std::string identifier = "com.example." + name;
+    fields.bundleURL = "/Applications/Greeter.app/PlugIns/" + name + ".bxplugin";
+    fields.pluginIdentifier = identifier;
+    fields.originalIdentifier = identifier;
+    fields.pluginUUID = uuid ? *uuid : Uuid::random();
+    fields.registrationDate = Date{1700000000};
+    fields.containingBundle = application();
+    fields.dataContainerURL = "/var/lib/bexil/containers/" + identifier;
+    fields.infoVrec = dict({
+        {"BDBundleIdentifier", str(identifier)},
+        {"BDBundleVersion", str("1")},
+        {"RZExtension", dict({{"RZExtensionPointIdentifier", str("com.example.greeting")},
+                              {"RZExtensionProtocol", str("GreetingProvider")},
+                              {"PrincipalClass", str("Greeting")},
+                              {"RZExtensionAttributes", dict({{"RZExtensionVersion", str("1.0")}})}})},
+    });
+    fields.entitlements = std::move(entitlements);
+    return std::make_shared<LXBexilProxy>(std::move(fields));
+}
+
+Value autoElect() { return dict({{std::string(BXDPlugIn::kAutoElectEntitlement), Value::boolean(true)}}); }
+
+class BXDatabaseDiscoveryTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        char pattern[] = "/tmp/bxdiscovery-test-XXXXXX";
+        ASSERT_NE(mkdtemp(pattern), nullptr);
+        root_ = pattern;
+        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
+        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        workspace_ = std::make_shared<ScriptedWorkspace>();
+        database_ = BXDatabase::create((root_ / "annotations.vrec").string(), workspace_, [](std::string_view) {});
+        ASSERT_NE(database_, nullptr);
+    }
+    void TearDown() override {
+        database_.reset();
+        fs::remove_all(root_);
+    }
+
+    void storeElection(const std::string& key, Value election) {
+        database_->sync().sync([&] {
+            database_->annotations().setAnnotationForIdentifier(dict({{"election", std::move(election)}}), key);
+        });
+    }
+
+    // The identifiers of the result, sorted (the result is a set).
+    std::vector<std::string> find(const Value& query) {
+        std::optional<BXDatabase::PlugInSet> found = database_->findPlugIns(query);
+        EXPECT_TRUE(found);
+        std::vector<std::string> identifiers;
+        for (const auto& record : found ? *found : BXDatabase::PlugInSet{})
+            identifiers.push_back(record->identifier().value_or("?"));
+        std::sort(identifiers.begin(), identifiers.end());
+        return identifiers;
+    }
+
+    Value electionQuery(Value wanted) {
+        return dict({{"RZExtensionPointIdentifier", str("com.example.greeting")}, {"RZUserElection", wanted}});
+    }
+
+    // Plug-ins elected 0, 1 and 2, one never elected, and one never elected but entitled to automatic election.
+    void installElectionFixture() {
+        workspace_->answer =
+            LXProxyList{plugIn("zero"), plugIn("one"), plugIn("two"), plugIn("never"), plugIn("auto", autoElect())};
+        storeElection("com.example.zero", Value::int64(0));
+        storeElection("com.example.one", Value::int64(1));
+        storeElection("com.example.two", Value::int64(2));
+    }
+
+    fs::path root_;
+    std::shared_ptr<ScriptedWorkspace> workspace_;
+    std::unique_ptr<BXDatabase> database_;
+};
+
+using Ids = std::vector<std::string>;
+
+TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering) {
+    LXBexilProxy::Fields noUrl;
+    noUrl.pluginIdentifier = "com.example.nowhere";
+    noUrl.pluginUUID = Uuid::random();
+    LXBexilProxy::Fields pendingFields;
+    pendingFields.bundleURL = "/Applications/Pending.app/PlugIns/Pending.bxplugin";
+    pendingFields.pluginIdentifier = "com.example.pending";
+    pendingFields.containingBundle = application(/*placeholder=*/true);
+    workspace_->answer = LXProxyList{plugIn("hello"), std::make_shared<LXBexilProxy>(noUrl),
+                                     std::make_shared<LXBexilProxy>(pendingFields), plugIn("bonjour")};
+    storeElection("com.example.hello", Value::int64(0));
+
+    log::CaptureSink capture;
+    EXPECT_EQ(find(Value::emptyDictionary()), (Ids{"com.example.bonjour", "com.example.hello"}));
+    EXPECT_EQ(find(Value()), (Ids{"com.example.bonjour", "com.example.hello"})) << "no query is an empty one";
+    EXPECT_EQ(workspace_->installedCalls, 2);
+    EXPECT_EQ(workspace_->filterCalls, 0);
+    EXPECT_EQ(capture.count("installedPlugins: "), 2u);
+    auto nil = capture.find("with nil bundleURL");
+    ASSERT_TRUE(nil);
+    EXPECT_EQ(nil->level, log::Level::Info);
+    EXPECT_EQ(nil->category, "ops");
+    EXPECT_EQ(nil->message.rfind("skipping lx proxy ", 0), 0u) << nil->message;
+    auto placeholder = capture.find("because its app is a placeholder");
+    ASSERT_TRUE(placeholder);
+    EXPECT_NE(placeholder->message.find("Pending.bxplugin"), std::string::npos) << placeholder->message;
+}
+
+TEST_F(BXDatabaseDiscoveryTest, SingleElectionKeepsElectedAndAutoElectedPlugIns) {
+    installElectionFixture();
+    EXPECT_EQ(find(electionQuery(str("1"))), (Ids{"com.example.auto", "com.example.one"}));
+    EXPECT_EQ(find(electionQuery(str("=2"))), (Ids{"com.example.two"}));
+    EXPECT_EQ(find(electionQuery(str("0"))), (Ids{"com.example.never", "com.example.zero"}));
+    // The whole query, election included, went to the registry as given.
+    EXPECT_EQ(workspace_->lastQuery, electionQuery(str("0")));
+}
+
+TEST_F(BXDatabaseDiscoveryTest, ElectionArrayKeepsAnyListedValue) {
+    installElectionFixture();
+    EXPECT_EQ(find(electionQuery(Value::array({str("0"), str("=1")}))),
+              (Ids{"com.example.auto", "com.example.never", "com.example.one", "com.example.zero"}));
+}
+
+TEST_F(BXDatabaseDiscoveryTest, MalformedElectionSwitchesFilteringOff) {
+    installElectionFixture();
+    const Ids everything = {"com.example.auto", "com.example.never", "com.example.one", "com.example.two",
+                            "com.example.zero"};
+    for (const Value& wanted :
+         {str(""), str("-1"), str(" 1"), Value::int64(1), Value::array({str("1"), Value::int64(2)}),
+          Value::array({str("1"), str("")}), dict({})}) {
+        EXPECT_EQ(find(electionQuery(wanted)), everything) << wanted.description();
+    }
+    // An empty array is a well-formed list that wants nothing.
+    EXPECT_EQ(find(electionQuery(Value::emptyArray())), Ids{});
+}
+
+TEST_F(BXDatabaseDiscoveryTest, StoredElectionKeepsOnlyItsLowEightBits) {
+    workspace_->answer = LXProxyList{plugIn("wrapped"), plugIn("negative")};
+    storeElection("com.example.wrapped", Value::int64(256));
+    storeElection("com.example.negative", Value::int64(-1));
+    EXPECT_EQ(find(electionQuery(str("0"))), (Ids{"com.example.wrapped"}));
+    EXPECT_EQ(find(electionQuery(str("255"))), (Ids{"com.example.negative"}));
+    EXPECT_EQ(find(electionQuery(str("256"))), Ids{});
+}
+
+TEST_F(BXDatabaseDiscoveryTest, ReplacingPlugInIsFilteredByTheElectionItTookOver) {
+    Value replaces = dict({{std::string(BXDPlugIn::kReplacePlugInEntitlement), str("com.example.original")}});
+    workspace_->answer = LXProxyList{plugIn("replacement", replaces)};
+    storeElection("com.example.original", Value::int64(1));
+    storeElection("com.example.replacement", Value::int64(0));
+
+    log::CaptureSink capture;
+    EXPECT_EQ(find(electionQuery(str("1"))), (Ids{"com.example.replacement"}));
+    EXPECT_TRUE(capture.contains("lx filter com.example.original -> 1"));
+    EXPECT_EQ(find(electionQuery(str("0"))), Ids{});
+    EXPECT_TRUE(capture.contains("lx filter com.example.original -> 0"));
+}
+
+TEST_F(BXDatabaseDiscoveryTest, RegistryWithoutAnswerGivesNothingRatherThanEmpty) {
+    workspace_->answer = std::nullopt;
+    EXPECT_FALSE(database_->findPlugIns(Value::emptyDictionary()));
+    EXPECT_FALSE(database_->findPlugIns(electionQuery(str("1"))));
+    workspace_->answer = LXProxyList{};
+    std::optional<BXDatabase::PlugInSet> empty = database_->findPlugIns(electionQuery(str("1")));
+    ASSERT_TRUE(empty);
+    EXPECT_TRUE(empty->empty());
+}
+
+TEST_F(BXDatabaseDiscoveryTest, ResultIsASetOfCachedRecordsAndTheLogShowsTheCache) {
+    LXProxyList twelve;
+    for (int i = 0; i < 12; ++i) twelve.push_back(plugIn("p" + std::to_string(i)));
+    // The same registry record twice (same UUID) is one plug-in.
+    twelve.push_back(twelve.front());
+    workspace_->answer = twelve;
+
+    log::CaptureSink capture;
+    std::optional<BXDatabase::PlugInSet> first = database_->findPlugIns(electionQuery(str("0")));
+    ASSERT_TRUE(first);
+    EXPECT_EQ(first->size(), 12u);
+    auto line = capture.matching("LX reported ");
+    ASSERT_EQ(line.size(), 1u);
+    EXPECT_EQ(line[0].message, "LX reported 12 plug-ins (cache 0/12)");
+    EXPECT_EQ(line[0].level, log::Level::Debug);
+
+    std::optional<BXDatabase::PlugInSet> second = database_->findPlugIns(Value::emptyDictionary());
+    ASSERT_TRUE(second);
+    EXPECT_EQ(capture.matching("LX reported ").back().message, "LX reported 12 plug-ins (cache 12/12)");
+    // The second query hands out the very records the first one cached.
+    for (size_t i = 0; i < 12; ++i) EXPECT_EQ((*first)[i].get(), (*second)[i].get());
+}
+
+TEST_F(BXDatabaseDiscoveryTest, ElectionNormalisation) {
+    EXPECT_EQ(BXDatabase::normalizeElection(str("=")), "");
+    EXPECT_EQ(BXDatabase::normalizeElection(str("==1")), "=1");
+    EXPECT_EQ(BXDatabase::normalizeElection(str("a-b")), "a-b");
+    EXPECT_EQ(BXDatabase::normalizeElection(str("")), std::nullopt);
+    EXPECT_EQ(BXDatabase::normalizeElection(str("+1")), std::nullopt);
+    EXPECT_EQ(BXDatabase::normalizeElection(Value::boolean(true)), std::nullopt);
+    EXPECT_EQ(BXDatabase::wantedElections(dict({})), std::nullopt);
+    EXPECT_EQ(BXDatabase::wantedElections(dict({{"RZUserElection", Value::array({str("=0"), str("7")})}})),
+              (std::vector<std::string>{"0", "7"}));
+}
+
+}  // namespace
+}  // namespace bexil
