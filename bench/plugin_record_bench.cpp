@@ -61,7 +61,7 @@ Value realisticInfo() {
         {"BDBundleShortVersionString", str("4.2")},
         {"BDBundleVersion", str("4200.17")},
         {"BDBundleInfoVrecURL", str("file:///Applications/Photos.app/PlugIns/PhotosShare.wexa/Info.vrec")},
-        {"BDBundlePackageType", str("XPC!")},
+        {"BDBundlePackageType", str("PLUG")},
         {"BDMinimumSystemVersion", str("12.0")},
         {"RZExtension", plugIn},
     });
