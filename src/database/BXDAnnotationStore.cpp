@@ -1,4 +1,5 @@
 #include "database/BXDAnnotationStore.h"
+#include "base/StandardPaths.h"
 
 // The store trusts nothing it reads: a document that cannot be used is logged, left on disk for inspection and
 // replaced by the first write, never half-applied. Every write builds the whole document from the map in memory
@@ -27,14 +28,8 @@ constexpr std::string_view kDataKey = "data";
 constexpr std::string_view kTemporaryMarker = ".tmp-";
 
 // <state dir> as the platform services share it, or the errno why there is none.
-Result<std::filesystem::path> stateDirectory() {
-    if (const char* dir = getenv("BX_STATE_DIR"); dir && *dir) return std::filesystem::path(dir);
-    if (geteuid() == 0) return std::filesystem::path("/var/lib/bexil");
-    if (const char* state = getenv("XDG_STATE_HOME"); state && state[0] == '/')
-        return std::filesystem::path(state) / "bexil";
-    // The base-directory convention's default for an unset XDG_STATE_HOME.
-    if (const char* home = getenv("HOME"); home && home[0] == '/')
-        return std::filesystem::path(home) / ".local" / "state" / "bexil";
+Result<std::filesystem::path> stateDirectoryOrError() {
+    if (std::optional<std::filesystem::path> dir = stateDirectory()) return *dir;
     return Error(std::string(BXPosixErrorDomain), ENOENT, "no state directory: neither BX_STATE_DIR nor HOME is set");
 }
 
@@ -101,7 +96,7 @@ std::optional<Error> BXDAnnotationStore::saveDb() {
 }
 
 std::filesystem::path BXDAnnotationStore::containerURL() {
-    Result<std::filesystem::path> state = stateDirectory();
+    Result<std::filesystem::path> state = stateDirectoryOrError();
     if (!state.ok()) {
         auto code = static_cast<unsigned long long>(state.error().code());
         log::ops().error("failed to get storage container: error=%llu", code);

@@ -1,4 +1,5 @@
 #include "platform/jobard/RunningInstances.h"
+#include "base/StandardPaths.h"
 
 #include <unistd.h>
 
@@ -10,12 +11,7 @@ namespace bexil {
 
 namespace fs = std::filesystem;
 
-fs::path RunningInstances::runtimeDirectory() {
-    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) return dir;
-    if (geteuid() == 0) return "/run/bexil";
-    if (const char* runtime = getenv("XDG_RUNTIME_DIR"); runtime && *runtime) return fs::path(runtime) / "bexil";
-    return fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
-}
+fs::path RunningInstances::runtimeDirectory() { return bexil::runtimeDirectory(); }
 
 RunningInstances::RunningInstances(std::string kind, fs::path runtimeDir) : directory_(runtimeDir / kind) {}
 

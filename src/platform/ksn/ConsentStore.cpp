@@ -1,4 +1,5 @@
 #include "platform/ksn/ConsentStore.h"
+#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -28,18 +29,8 @@ Error posixError(int code, const std::string& what) {
 }  // namespace
 
 fs::path ConsentStore::defaultFile() {
-    fs::path directory;
-    if (const char* dir = getenv("BX_STATE_DIR"); dir && *dir)
-        directory = dir;
-    else if (geteuid() == 0)
-        directory = "/var/lib/bexil";
-    else if (const char* state = getenv("XDG_STATE_HOME"); state && state[0] == '/')
-        directory = fs::path(state) / "bexil";
-    else if (const char* home = getenv("HOME"); home && home[0] == '/')
-        directory = fs::path(home) / ".local" / "state" / "bexil";
-    else
-        directory = "/";  // no home at all: a path that can be read but where nothing will be found
-    return directory / kFileName;
+    // With no home at all, "/" is a directory that can be read but where nothing will be found.
+    return stateDirectory().value_or("/") / kFileName;
 }
 
 ConsentStore::ConsentStore(fs::path file) : file_(std::move(file)) {}

@@ -11,6 +11,7 @@
 // application comes from the same row (a join), and its plug-in list is read only when someone asks for it.
 
 #include "platform/ledgerix/LedgerixWorkspace.h"
+#include "base/StandardPaths.h"
 
 #include <pwd.h>
 #include <sqlite3.h>
@@ -465,10 +466,7 @@ std::optional<Error> quarantine(const std::string& path, std::string* movedTo) {
 }  // namespace
 
 fs::path LedgerixWorkspace::defaultStateDirectory() {
-    if (const char* dir = std::getenv("BX_STATE_DIR"); dir && *dir) return dir;
-    if (::geteuid() == 0) return "/var/lib/bexil";
-    if (const char* dir = std::getenv("XDG_STATE_HOME"); dir && *dir == '/') return fs::path(dir) / "bexil";
-    if (const char* home = std::getenv("HOME"); home && *home == '/') return fs::path(home) / ".local/state/bexil";
+    if (std::optional<fs::path> dir = stateDirectory()) return *dir;
     if (const passwd* entry = ::getpwuid(::geteuid()); entry && entry->pw_dir)
         return fs::path(entry->pw_dir) / ".local/state/bexil";
     return "/var/lib/bexil";

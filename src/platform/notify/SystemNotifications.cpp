@@ -1,4 +1,5 @@
 #include "platform/notify/SystemNotifications.h"
+#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -58,17 +59,7 @@ class FdCloser {
 }  // namespace
 
 fs::path SystemNotifications::defaultDirectory() {
-    fs::path runtime;
-    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) {
-        runtime = dir;
-    } else if (geteuid() == 0) {
-        runtime = "/run/bexil";
-    } else if (const char* xdg = getenv("XDG_RUNTIME_DIR"); xdg && *xdg) {
-        runtime = fs::path(xdg) / "bexil";
-    } else {
-        runtime = fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
-    }
-    return runtime / "notify";
+    return runtimeDirectory() / "notify";
 }
 
 SystemNotifications::SystemNotifications(fs::path directory) : directory_(std::move(directory)) {}

@@ -1,4 +1,5 @@
 #include "platform/sandbox/SandboxExtensions.h"
+#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <openssl/crypto.h>
@@ -73,17 +74,7 @@ std::optional<std::vector<uint8_t>> readKey(const fs::path& path) {
 }  // namespace
 
 fs::path SandboxExtensions::defaultKeyPath() {
-    fs::path runtime;
-    if (const char* dir = getenv("BX_RUNTIME_DIR"); dir && *dir) {
-        runtime = dir;
-    } else if (geteuid() == 0) {
-        runtime = "/run/bexil";
-    } else if (const char* xdg = getenv("XDG_RUNTIME_DIR"); xdg && *xdg) {
-        runtime = fs::path(xdg) / "bexil";
-    } else {
-        runtime = fs::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
-    }
-    return runtime / "sandbox" / "extension-key";
+    return runtimeDirectory() / "sandbox" / "extension-key";
 }
 
 SandboxExtensions& SandboxExtensions::shared() {
