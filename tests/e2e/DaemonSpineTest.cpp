@@ -13,6 +13,7 @@
 #include <thread>
 
 #include "BxdProcess.h"
+#include "TestClient.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 #include "platform/zem/ZemCodec.h"
@@ -33,35 +34,7 @@ Value request(std::string_view name, std::optional<Value> version = Value::uint6
     return d.take();
 }
 
-// A client connection on a private loop with a blocking round trip, for tests.
-class TestClient {
-  public:
-    explicit TestClient(const std::string& service = "com.quorvel.bexil.bxd")
-        : loop_(1), queue_("test-client", loop_), connection_(ZemConnection::createClient(service, queue_)) {
-        connection_->setEventHandler([](const ZemConnection::Event&) {});
-        connection_->resume();
-    }
-    ~TestClient() { connection_->cancel(); }
-
-    Reply roundTrip(const Value& message, std::chrono::seconds timeout = std::chrono::seconds(10)) {
-        auto promise = std::make_shared<std::promise<Reply>>();
-        auto future = promise->get_future();
-        connection_->sendWithReply(message, queue_, [promise](const Reply& reply) { promise->set_value(reply); });
-        if (future.wait_for(timeout) != std::future_status::ready) return ZemError(ZemError::Kind::ConnectionInvalid);
-        return future.get();
-    }
-    Value replyTo(const Value& message) {
-        Reply reply = roundTrip(message);
-        EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
-        return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
-    }
-    ZemConnection& connection() { return *connection_; }
-
-  private:
-    EventLoop loop_;
-    SerialQueue queue_;
-    std::shared_ptr<ZemConnection> connection_;
-};
+using test::TestClient;
 
 // A raw stream socket to the daemon, for bytes that no well-behaved client would send.
 class RawSocket {

@@ -16,6 +16,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "TestClient.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
@@ -40,34 +41,7 @@ const std::string kClipper = "com.example.notes.clipper";
 
 Value str(std::string_view s) { return Value::string(s); }
 
-// A client connection on a private loop with a blocking round trip.
-class TestClient {
-  public:
-    TestClient() : loop_(1), queue_("discovery-test", loop_) {
-        connection_ = ZemConnection::createClient("com.quorvel.bexil.bxd", queue_);
-        connection_->setEventHandler([](const ZemConnection::Event&) {});
-        connection_->resume();
-    }
-    ~TestClient() { connection_->cancel(); }
-
-    Value replyTo(const Value& message) {
-        auto promise = std::make_shared<std::promise<std::variant<Value, ZemError>>>();
-        auto future = promise->get_future();
-        connection_->sendWithReply(message, queue_, [promise](const auto& reply) { promise->set_value(reply); });
-        if (future.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
-            ADD_FAILURE() << "no reply";
-            return Value();
-        }
-        auto reply = future.get();
-        EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
-        return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
-    }
-
-  private:
-    EventLoop loop_;
-    SerialQueue queue_;
-    std::shared_ptr<ZemConnection> connection_;
-};
+using test::TestClient;
 
 Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0, uint64_t version = 3) {
     std::vector<std::pair<std::string, Value>> entries = {{"request", str("match")},

@@ -11,6 +11,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "TestClient.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
@@ -27,34 +28,7 @@ using test::BxdProcess;
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 
-// A client connection on a private loop with a blocking round trip.
-class TestClient {
-  public:
-    TestClient() : loop_(1), queue_("registration-test", loop_) {
-        connection_ = ZemConnection::createClient("com.quorvel.bexil.bxd", queue_);
-        connection_->setEventHandler([](const ZemConnection::Event&) {});
-        connection_->resume();
-    }
-    ~TestClient() { connection_->cancel(); }
-
-    Value replyTo(const Value& message) {
-        auto promise = std::make_shared<std::promise<std::variant<Value, ZemError>>>();
-        auto future = promise->get_future();
-        connection_->sendWithReply(message, queue_, [promise](const auto& reply) { promise->set_value(reply); });
-        if (future.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
-            ADD_FAILURE() << "no reply";
-            return Value();
-        }
-        auto reply = future.get();
-        EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
-        return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
-    }
-
-  private:
-    EventLoop loop_;
-    SerialQueue queue_;
-    std::shared_ptr<ZemConnection> connection_;
-};
+using test::TestClient;
 
 Value pathsRequest(const char* name, std::vector<Value> paths) {
     return Value::dictionary(
