@@ -110,7 +110,7 @@ void BM_MatchOnePoint(benchmark::State& state) {
     if (matched != kPlugInsOnThePoint) state.SkipWithError("unexpected number of matches");
     state.counters["matches"] = static_cast<double>(matched);
 }
-BENCHMARK(BM_MatchOnePoint)->Arg(1000)->Arg(10000)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_MatchOnePoint)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
 
 }  // namespace
 
