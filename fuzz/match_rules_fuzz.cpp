@@ -16,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "FuzzByteReader.h"
 #include "model/BXPlugInCore.h"
 #include "policy/BXMatchRules.h"
 
@@ -71,28 +72,7 @@ constexpr size_t kPatternCount = sizeof(kPatterns) / sizeof(kPatterns[0]);
 constexpr int kMaxDepth = 6;
 constexpr size_t kMaxEntries = 10;
 
-class ByteReader {
-  public:
-    ByteReader(const uint8_t* data, size_t size) : data_(data), size_(size) {}
-    bool empty() const { return pos_ >= size_; }
-    uint8_t byte() { return empty() ? 0 : data_[pos_++]; }
-    uint64_t u64() {
-        uint64_t v = 0;
-        for (int i = 0; i < 8; ++i) v = (v << 8) | byte();
-        return v;
-    }
-    std::string text() {
-        size_t n = byte() % 24;
-        std::string s;
-        for (size_t i = 0; i < n && !empty(); ++i) s.push_back(static_cast<char>(byte()));
-        return s;
-    }
-
-  private:
-    const uint8_t* data_;
-    size_t size_;
-    size_t pos_ = 0;
-};
+using bexil::fuzz::ByteReader;
 
 std::string key(ByteReader& in) {
     uint8_t pick = in.byte();

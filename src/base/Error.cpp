@@ -13,4 +13,14 @@ Error BXError(int code, std::optional<std::string_view> message) {
     return Error(std::string(BXErrorDomain), code, std::string(*message));
 }
 
+std::string exceptionMessage(const std::exception_ptr& exception) {
+    try {
+        std::rethrow_exception(exception);
+    } catch (const std::exception& e) {
+        return e.what();
+    } catch (...) {
+    }
+    return "unknown exception";
+}
+
 }  // namespace bexil

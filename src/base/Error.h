@@ -4,6 +4,7 @@
 // value (domain, code, optional message) and may be copied and passed between queues freely.
 
 #include <cstdint>
+#include <exception>
 #include <optional>
 #include <stdexcept>
 #include <string>
@@ -79,5 +80,8 @@ class InternalInconsistency : public std::logic_error {
   public:
     using std::logic_error::logic_error;
 };
+
+// The message of an exception caught as a pointer: what() of a std::exception, else "unknown exception".
+std::string exceptionMessage(const std::exception_ptr& exception);
 
 }  // namespace bexil

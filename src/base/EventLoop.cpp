@@ -18,13 +18,7 @@ namespace {
 thread_local const detail::EventLoopCore* tlsRunningLoop = nullptr;
 
 void writeUncaughtToStandardError(std::string_view queueLabel, std::exception_ptr exception) {
-    std::string what = "unknown exception";
-    try {
-        std::rethrow_exception(exception);
-    } catch (const std::exception& e) {
-        what = e.what();
-    } catch (...) {
-    }
+    std::string what = exceptionMessage(exception);
     std::fprintf(stderr, "bexil: block on queue \"%.*s\" threw: %s\n", static_cast<int>(queueLabel.size()),
                  queueLabel.data(), what.c_str());
 }

@@ -14,13 +14,7 @@ namespace {
 
 // A block that lets an exception escape fails alone; the loop, and with it every other client, carries on.
 void logUncaughtException(std::string_view queueLabel, std::exception_ptr exception) {
-    std::string what = "unknown exception";
-    try {
-        std::rethrow_exception(exception);
-    } catch (const std::exception& e) {
-        what = e.what();
-    } catch (...) {
-    }
+    std::string what = bexil::exceptionMessage(exception);
     bexil::log::ops().fault("block on queue %s threw: %s", std::string(queueLabel), what);
 }
 
