@@ -1,11 +1,10 @@
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <mutex>
 
+#include "TestSupport.h"
 #include "database/BXDAnnotationStore.h"
 #include "database/BXDatabase.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
@@ -18,10 +17,8 @@ namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using Entries = std::vector<std::pair<std::string, Value>>;
-
-Value dict(Entries entries) { return Value::dictionary(std::move(entries)); }
-Value str(std::string_view s) { return Value::string(s); }
+using test::dict;
+using test::str;
 
 // A registry whose answers the test decides. It hands the filter exactly what a real registry would (the
 // identifier and the entitlements) and records what it was asked.
@@ -97,19 +94,14 @@ Value autoElect() { return dict({{std::string(BXDPlugIn::kAutoElectEntitlement),
 class BXDatabaseDiscoveryTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/bxdiscovery-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
-        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        root_ = dir_.path();
+        stateDir_.emplace("BX_STATE_DIR", (root_ / "state").string());
+        runtimeDir_.emplace("BX_RUNTIME_DIR", (root_ / "runtime").string());
         workspace_ = std::make_shared<ScriptedWorkspace>();
         database_ = BXDatabase::create((root_ / "annotations.vrec").string(), workspace_, [](std::string_view) {});
         ASSERT_NE(database_, nullptr);
     }
-    void TearDown() override {
-        database_.reset();
-        fs::remove_all(root_);
-    }
+    void TearDown() override { database_.reset(); }
 
     void storeElection(const std::string& key, Value election) {
         database_->sync().sync([&] {
@@ -141,7 +133,9 @@ class BXDatabaseDiscoveryTest : public ::testing::Test {
         storeElection("com.example.two", Value::int64(2));
     }
 
+    test::TempDir dir_{"bxdiscovery-test"};
     fs::path root_;
+    std::optional<test::ScopedEnv> stateDir_, runtimeDir_;
     std::shared_ptr<ScriptedWorkspace> workspace_;
     std::unique_ptr<BXDatabase> database_;
 };
@@ -176,17 +170,14 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering
     EXPECT_NE(placeholder->message.find("Pending.bxplugin"), std::string::npos) << placeholder->message;
 }
 
-TEST_F(BXDatabaseDiscoveryTest, SingleElectionKeepsElectedAndAutoElectedPlugIns) {
+TEST_F(BXDatabaseDiscoveryTest, ElectionOrListOfElectionsKeepsElectedAndAutoElectedPlugIns) {
     installElectionFixture();
     EXPECT_EQ(find(electionQuery(str("1"))), (Ids{"com.example.auto", "com.example.one"}));
     EXPECT_EQ(find(electionQuery(str("=2"))), (Ids{"com.example.two"}));
     EXPECT_EQ(find(electionQuery(str("0"))), (Ids{"com.example.never", "com.example.zero"}));
     // The whole query, election included, went to the registry as given.
     EXPECT_EQ(workspace_->lastQuery, electionQuery(str("0")));
-}
-
-TEST_F(BXDatabaseDiscoveryTest, ElectionArrayKeepsAnyListedValue) {
-    installElectionFixture();
+    // An array keeps any listed value.
     EXPECT_EQ(find(electionQuery(Value::array({str("0"), str("=1")}))),
               (Ids{"com.example.auto", "com.example.never", "com.example.one", "com.example.zero"}));
 }

@@ -1,11 +1,10 @@
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
 #include <mutex>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "database/BXDAnnotationStore.h"
 #include "database/BXDatabase.h"
@@ -47,21 +46,18 @@ class RecordingDelegate : public BXDatabaseDelegate {
 class BXDatabaseTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/bxdatabase-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
+        root_ = dir_.path();
         fs::create_directories(root_ / "bundles");
         for (const char* bundle : {"Greeter.app", "Notes.app", "Misconfigured.app", "OutsideApplication.bxplugin"})
             fs::copy(kExamples / bundle, root_ / "bundles" / bundle, fs::copy_options::recursive);
         // The annotation store looks for a legacy document in the daemon's container under the state dir.
-        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
+        stateDir_.emplace("BX_STATE_DIR", (root_ / "state").string());
+        runtimeDir_.emplace("BX_RUNTIME_DIR", (root_ / "runtime").string());
         open();
     }
     void TearDown() override {
         database_.reset();
         workspace_.reset();
-        fs::remove_all(root_);
     }
 
     void open() {
@@ -102,7 +98,9 @@ class BXDatabaseTest : public ::testing::Test {
         return root ? root->get("data") : Value();
     }
 
+    test::TempDir dir_{"bxdatabase-test"};
     fs::path root_;
+    std::optional<test::ScopedEnv> stateDir_, runtimeDir_;
     std::shared_ptr<LedgerixWorkspace> workspace_;
     std::unique_ptr<BXDatabase> database_;
     std::unique_ptr<RecordingDelegate> delegate_;
@@ -111,18 +109,7 @@ class BXDatabaseTest : public ::testing::Test {
 
 // ---- look-ups and the cache ----
 
-TEST_F(BXDatabaseTest, RegisteredPlugInIsFoundByPathAndUuidAsOneCachedRecord) {
-    std::shared_ptr<BXDPlugIn> byPath = addAndFind(hello());
-    ASSERT_NE(byPath, nullptr);
-    EXPECT_EQ(byPath->identifier(), "com.example.greeter.hello");
-    EXPECT_EQ(byPath->containingUrl(), bundle("Greeter.app"));
-    std::shared_ptr<BXDPlugIn> byUuid = database_->findPlugIn(*byPath->uuid());
-    EXPECT_EQ(byUuid.get(), byPath.get());
-    EXPECT_EQ(database_->plugInForProxy(workspace_->pluginProxyForURL(hello())).get(), byPath.get());
-    EXPECT_EQ(database_->cachedCount(), 1u);
-}
-
-TEST_F(BXDatabaseTest, InstallingCachesNothingAndIsLogged) {
+TEST_F(BXDatabaseTest, InstallingIsLoggedAndCachesNothingAndTheRecordIsFoundByPathAndUuidAsOneCachedRecord) {
     log::CaptureSink capture;
     ASSERT_FALSE(database_->addPlugIn(hello()));
     EXPECT_EQ(database_->cachedCount(), 0u);
@@ -131,6 +118,15 @@ TEST_F(BXDatabaseTest, InstallingCachesNothingAndIsLogged) {
     EXPECT_EQ(line->level, log::Level::Default);
     EXPECT_NE(line->message.find("com.example.greeter.hello"), std::string::npos) << line->message;
     EXPECT_NE(line->message.find(hello()), std::string::npos) << line->message;
+
+    std::shared_ptr<BXDPlugIn> byPath = database_->findPlugInAtPath(hello());
+    ASSERT_NE(byPath, nullptr);
+    EXPECT_EQ(byPath->identifier(), "com.example.greeter.hello");
+    EXPECT_EQ(byPath->containingUrl(), bundle("Greeter.app"));
+    std::shared_ptr<BXDPlugIn> byUuid = database_->findPlugIn(*byPath->uuid());
+    EXPECT_EQ(byUuid.get(), byPath.get());
+    EXPECT_EQ(database_->plugInForProxy(workspace_->pluginProxyForURL(hello())).get(), byPath.get());
+    EXPECT_EQ(database_->cachedCount(), 1u);
 }
 
 TEST_F(BXDatabaseTest, UnknownUuidAndPathYieldNothingAndCacheNothing) {
@@ -152,7 +148,7 @@ TEST_F(BXDatabaseTest, MisconfiguredPlugInIsRegisteredButNeverBuilt) {
     EXPECT_EQ(database_->cachedCount(), 0u) << "nothing is cached, so a later look-up tries again";
 }
 
-TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOnes) {
+TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOnesAndNothingWithoutAny) {
     for (const std::string& path : {hello(), bonjour(), nightTheme()}) ASSERT_FALSE(database_->addPlugIn(path));
     auto plugIns = database_->plugInsWithinApplication(bundle("Greeter.app"));
     ASSERT_TRUE(plugIns);
@@ -170,9 +166,7 @@ TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOne
     auto misconfigured = database_->plugInsWithinApplication(bundle("Misconfigured.app"));
     ASSERT_TRUE(misconfigured) << "registered plug-ins exist, so the answer is a (possibly empty) array";
     EXPECT_TRUE(misconfigured->empty());
-}
-
-TEST_F(BXDatabaseTest, ApplicationWithoutPlugInsGivesNothingNotAnEmptyArray) {
+    // Without registered plug-ins the answer is nothing, not an empty array.
     EXPECT_FALSE(database_->plugInsWithinApplication(bundle("Notes.app")));
     EXPECT_FALSE(database_->plugInsWithinApplication(bundle("NoSuch.app")));
 }
@@ -235,7 +229,7 @@ TEST_F(BXDatabaseTest, LimitZeroKeepsAtMostOneRecord) {
 
 // ---- uninstall ----
 
-TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLock) {
+TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLockCachedOrNot) {
     std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
     ASSERT_TRUE(plugIn);
     log::CaptureSink capture;
@@ -247,12 +241,11 @@ TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLock)
     ASSERT_TRUE(line);
     EXPECT_NE(line->message.find(plugIn->uuid()->string()), std::string::npos) << line->message;
     EXPECT_EQ(database_->findPlugIn(*plugIn->uuid()), nullptr) << "the registry has forgotten it";
-}
 
-TEST_F(BXDatabaseTest, UninstallOfANeverCachedPlugInStillInformsTheDelegate) {
+    // A plug-in never cached is announced all the same.
     ASSERT_FALSE(database_->addPlugIn(bonjour()));
     ASSERT_FALSE(database_->removePlugIn(bonjour()));
-    EXPECT_EQ(delegate_->removed(), std::vector<std::string>{bonjour()});
+    EXPECT_EQ(delegate_->removed(), (std::vector<std::string>{hello(), bonjour()}));
 }
 
 // ---- annotations ----
