@@ -7,25 +7,18 @@
 #include <unordered_set>
 #include <vector>
 
+#include "CapturedLog.h"
+#include "TestSupport.h"
 #include "model/BXPlugInCore.h"
 #include "platform/log/CaptureSink.h"
 
 namespace bexil {
 namespace {
 
-// The captured lines as "<level>: <message>", one per line, in the order they were logged.
-[[maybe_unused]] std::string capturedLog(const log::CaptureSink& capture) {
-    std::string text;
-    for (const auto& entry : capture.entries())
-        text += std::string(log::levelName(entry.level)) + ": " + entry.message + "\n";
-    return text;
-}
-
-
-using Entries = std::vector<std::pair<std::string, Value>>;
-
-Value dict(Entries entries) { return Value::dictionary(std::move(entries)); }
-Value str(const char* s) { return Value::string(s); }
+using test::capturedLog;
+using test::dict;
+using test::Entries;
+using test::str;
 
 const char* const kSharePath = "/Applications/Mail.app/PlugIns/Share.wexa";
 const char* const kToolPath = "/System/Library/Bexil/Indexer.bundle";
@@ -61,16 +54,12 @@ std::shared_ptr<BXPlugInCore> recordWithPlugIn(const char* path, Entries plugIn)
 
 // ---- Set-up ----
 
-TEST(BXPlugInCoreSetup, MissingUrlFailsWithoutLogging) {
+TEST(BXPlugInCoreSetup, MissingUrlFailsSilentlyAndMissingIdentifierFailsLoggingThePath) {
     log::CaptureSink capture;
-    auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::nullopt, shareInfo(),
-                                                                  std::nullopt, std::nullopt);
-    EXPECT_EQ(record, nullptr);
+    EXPECT_EQ(BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::nullopt, shareInfo(), std::nullopt,
+                                                              std::nullopt),
+              nullptr);
     EXPECT_EQ(capturedLog(capture), "");
-}
-
-TEST(BXPlugInCoreSetup, MissingIdentifierFailsAndLogsThePath) {
-    log::CaptureSink capture;
     auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::nullopt, std::string(kSharePath), shareInfo(),
                                                                   std::nullopt, std::nullopt);
     std::string log = capturedLog(capture);
@@ -79,7 +68,7 @@ TEST(BXPlugInCoreSetup, MissingIdentifierFailsAndLogsThePath) {
     EXPECT_NE(log.find("error"), std::string::npos) << log;
 }
 
-TEST(BXPlugInCoreSetup, NonDictionaryRZExtensionFailsButKeepsTheInformationDictionary) {
+TEST(BXPlugInCoreSetup, MalformedDictionariesFailButANonDictionaryRZExtensionKeepsTheInformationDictionary) {
     Value info = dict({{"BDBundleIdentifier", str("com.example.broken")}, {"RZExtension", str("oops")}});
     BXPlugInCore record;
     log::CaptureSink capture;
@@ -96,17 +85,16 @@ TEST(BXPlugInCoreSetup, NonDictionaryRZExtensionFailsButKeepsTheInformationDicti
     // A failed set-up stores neither the names nor an identity.
     EXPECT_FALSE(record.identifier());
     EXPECT_FALSE(record.uuid());
-}
 
-TEST(BXPlugInCoreSetup, InformationDictionaryOfWrongKindFailsAndChangesNothing) {
-    BXPlugInCore record;
-    log::CaptureSink capture;
-    EXPECT_FALSE(record.setupWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
-                                                           Value::array({str("a")}), std::nullopt, std::nullopt));
+    // An information dictionary of the wrong kind is refused and not stored.
+    BXPlugInCore wrongKind;
+    capture.clear();
+    EXPECT_FALSE(wrongKind.setupWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
+                                                              Value::array({str("a")}), std::nullopt, std::nullopt));
     EXPECT_NE(capturedLog(capture).find("malformed plug-in dictionary"), std::string::npos);
-    EXPECT_FALSE(record.bundleInfoDictionary());
-    EXPECT_FALSE(record.setDictionaries(str("not a dictionary")));
-    EXPECT_FALSE(record.bundleInfoDictionary());
+    EXPECT_FALSE(wrongKind.bundleInfoDictionary());
+    EXPECT_FALSE(wrongKind.setDictionaries(str("not a dictionary")));
+    EXPECT_FALSE(wrongKind.bundleInfoDictionary());
 }
 
 TEST(BXPlugInCoreSetup, InfoArgumentIsUsedOnlyByTheFactoryAndOnlyWithoutRZExtension) {
@@ -231,7 +219,7 @@ TEST(BXPlugInCoreDerived, ProtocolSpecKeepsArraysAndEmbeddedProtocolOverrides) {
     EXPECT_EQ(record->embeddedProtocolSpec(), str("E"));
 }
 
-TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValue) {
+TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValueDataAndHybridTheirKeys) {
     struct Case {
         std::optional<Value> value;
         bool expected;
@@ -247,9 +235,7 @@ TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValue) {
         ASSERT_TRUE(record);
         EXPECT_EQ(record->isDedicated(), c.expected) << (c.value ? c.value->description() : "absent");
     }
-}
-
-TEST(BXPlugInCoreDerived, DataOnlyForExactlyHashData) {
+    // Data only for exactly "#Data"; any EmbeddedCode value at all makes a hybrid.
     auto isData = [](Value protocol) {
         return recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", protocol}})->isData();
     };
@@ -257,23 +243,12 @@ TEST(BXPlugInCoreDerived, DataOnlyForExactlyHashData) {
     EXPECT_FALSE(isData(str("#data")));
     EXPECT_FALSE(isData(str("#Data ")));
     EXPECT_FALSE(isData(Value::array({str("#Data")})));
-}
-
-TEST(BXPlugInCoreDerived, AnyEmbeddedCodeValueMakesAHybrid) {
     EXPECT_TRUE(recordWithPlugIn(kToolPath, {{"EmbeddedCode", Value::boolean(false)}})->isHybrid());
     EXPECT_TRUE(recordWithPlugIn(kToolPath, {{"EmbeddedCode", str("Contents/Code")}})->isHybrid());
     EXPECT_FALSE(recordWithPlugIn(kToolPath, {})->isHybrid());
 }
 
-TEST(BXPlugInCoreDerived, TimestampIsSecondsSince1970) {
-    BXPlugInCore record;
-    record.setLastModified(1'700'000'000);
-    EXPECT_EQ(record.timestamp().secondsSince1970, 1'700'000'000.0);
-    record.setLastModified(-5);
-    EXPECT_EQ(record.timestamp().secondsSince1970, -5.0);
-}
-
-TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeys) {
+TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeysAndNeitherIsAFault) {
     auto current = makeRecord(kSharePath, shareInfo());
     EXPECT_FALSE(current->oldStyle());
 
@@ -286,11 +261,9 @@ TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeys) {
     log::CaptureSink capture;
     EXPECT_TRUE(legacy.oldStyle());
     EXPECT_EQ(capturedLog(capture), "");
-}
 
-TEST(BXPlugInCoreDerived, NeitherStyleIsAFaultAndAnswersOldStyle) {
+    // Neither style is a fault, and answers old style.
     auto record = recordWithPlugIn(kToolPath, {});
-    log::CaptureSink capture;
     EXPECT_TRUE(record->oldStyle());
     std::string log = capturedLog(capture);
     EXPECT_NE(log.find("fault"), std::string::npos) << log;
@@ -301,7 +274,7 @@ TEST(BXPlugInCoreDerived, NeitherStyleIsAFaultAndAnswersOldStyle) {
 
 // ---- Canonical shape ----
 
-TEST(BXPlugInCoreCanonicalize, AddsAttributesWithVersionFromTheBundle) {
+TEST(BXPlugInCoreCanonicalize, AddsAttributesWithVersionFromTheBundleOrOneAndKeepsAnExistingVersion) {
     Value info =
         dict({{"BDBundleShortVersionString", str("3.1")}, {"RZExtension", dict({{"RZExtensionProtocol", str("P")}})}});
     auto record = makeRecord(kToolPath, info);
@@ -313,9 +286,8 @@ TEST(BXPlugInCoreCanonicalize, AddsAttributesWithVersionFromTheBundle) {
     // The information dictionary is left as it was: only the plug-in dictionary is rewritten.
     EXPECT_TRUE(record->bundleInfoDictionary()->identical(info));
     EXPECT_FALSE(record->infoKey("RZExtension")->contains("RZExtensionAttributes"));
-}
 
-TEST(BXPlugInCoreCanonicalize, FallsBackToVersionOneAndKeepsAnExistingVersion) {
+    // Without a bundle version it falls back to "1"; an existing version is kept.
     auto bare = recordWithPlugIn(kToolPath, {{"RZExtensionAttributes", dict({{"Other", Value::int64(4)}})}});
     bare->canonicalize();
     EXPECT_EQ(bare->attributes(), dict({{"Other", Value::int64(4)}, {"RZExtensionVersion", str("1")}}));
@@ -341,7 +313,7 @@ void expectDiagnosis(const BXPlugInCore& record, const char* message) {
     EXPECT_EQ(error->localizedDescription(), message);
 }
 
-TEST(BXPlugInCoreDiagnose, EachCheckHasItsMessageAndTheFirstFailureWins) {
+TEST(BXPlugInCoreDiagnose, EachCheckHasItsMessageTheFirstFailureWinsAndUsableRecordsPass) {
     BXPlugInCore nameless;
     nameless.setPlugInDictionary(dict({{"PassProxy", Value::boolean(true)}}));
     expectDiagnosis(nameless, "missing identifier (no RZExtensionIdentifier, nor even BDBundleIdentifier)");
@@ -359,9 +331,7 @@ TEST(BXPlugInCoreDiagnose, EachCheckHasItsMessageAndTheFirstFailureWins) {
         "the \"PassProxy\" key is not supported on this platform");
     expectDiagnosis(*makeRecord(kSharePath, shareInfo({{"EmbeddedCode", str("Contents/Code")}})),
                     "hybrid plug-ins are not supported on this platform");
-}
 
-TEST(BXPlugInCoreDiagnose, UsableRecordsPass) {
     EXPECT_FALSE(makeRecord(kSharePath, shareInfo())->diagnose());
     // Outside an application extension any principal class is fine.
     EXPECT_FALSE(recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", str("P")},
@@ -417,7 +387,7 @@ TEST(BXPlugInCoreIdentity, ARecordWithoutUuidIsAnInternalInconsistency) {
 
 // ---- Annotations ----
 
-TEST(BXPlugInCoreAnnotations, SetReplacesRemovesAndNeverEditsInPlace) {
+TEST(BXPlugInCoreAnnotations, SetReplacesRemovesNeverEditsInPlaceAndAbsentStaysAbsent) {
     auto record = makeRecord(kSharePath, shareInfo());
     Value start = dict({{"com.example.mail.share", dict({{"election", Value::int64(1)}})}});
     record->setAnnotations(start);
@@ -434,10 +404,9 @@ TEST(BXPlugInCoreAnnotations, SetReplacesRemovesAndNeverEditsInPlace) {
 
     record->setAnnotationValue("absent", std::nullopt);
     EXPECT_EQ(*record->annotations(), start);
-}
 
-TEST(BXPlugInCoreAnnotations, AbsentAnnotationsStayAbsent) {
-    auto record = makeRecord(kSharePath, shareInfo());
+    // Absent annotations stay absent.
+    record = makeRecord(kSharePath, shareInfo());
     record->setAnnotationValue("com.example.mail.share", dict({{"election", Value::int64(1)}}));
     EXPECT_FALSE(record->annotations());
     record->setAnnotationValue("com.example.mail.share", std::nullopt);
