@@ -1,10 +1,8 @@
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/ksn/ConsentStore.h"
 #include "platform/log/CaptureSink.h"
@@ -28,30 +26,20 @@ class FakeBundle : public PlatformBundle {
 
 class ConsentStoreTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bx-consent-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        directory_ = pattern;
-    }
-    void TearDown() override { fs::remove_all(directory_); }
-
     fs::path file() const { return directory_ / "state" / "consent.vrec"; }
+    void put(const Value& root) {
+        fs::create_directories(file().parent_path());
+        ASSERT_FALSE(Document::writeFileAtomically(file(), root));
+    }
 
-    fs::path directory_;
+    test::TempDir directory_{"bx-consent"};
 };
 
-TEST_F(ConsentStoreTest, DefaultFileIsInTheStateDirectory) {
-    const char* saved = getenv("BX_STATE_DIR");
-    std::string savedText = saved ? saved : "";
-    setenv("BX_STATE_DIR", "/srv/bexil-state", 1);
-    EXPECT_EQ(ConsentStore::defaultFile(), fs::path("/srv/bexil-state/consent.vrec"));
-    if (saved)
-        setenv("BX_STATE_DIR", savedText.c_str(), 1);
-    else
-        unsetenv("BX_STATE_DIR");
-}
-
-TEST_F(ConsentStoreTest, NoFileMeansNothingGrantedButTheQuerySucceeds) {
+TEST_F(ConsentStoreTest, DefaultFileIsInTheStateDirectoryAndNoFileMeansNothingGranted) {
+    {
+        test::ScopedEnv state("BX_STATE_DIR", "/srv/bexil-state");
+        EXPECT_EQ(ConsentStore::defaultFile(), fs::path("/srv/bexil-state/consent.vrec"));
+    }
     ConsentStore store(file());
     auto records = store.informationForBundleIdentifier("com.example.App");
     ASSERT_TRUE(records);
@@ -77,11 +65,9 @@ TEST_F(ConsentStoreTest, AnswersAreKeptPerBundleAndService) {
 
 // A hand-edited file may hold answers that are not yes or no: such a service is known but not granted.
 TEST_F(ConsentStoreTest, AnswersOfOtherKindsAreNotGrants) {
-    fs::create_directories(file().parent_path());
-    ASSERT_FALSE(Document::writeFileAtomically(
-        file(), Value::dictionary({{"com.example.App", Value::dictionary({{"camera", Value::string("yes")},
-                                                                          {"mic", Value::int64(1)},
-                                                                          {"photos", Value::boolean(true)}})}})));
+    put(Value::dictionary({{"com.example.App", Value::dictionary({{"camera", Value::string("yes")},
+                                                                  {"mic", Value::int64(1)},
+                                                                  {"photos", Value::boolean(true)}})}}));
     ConsentStore store(file());
     auto records = store.informationForBundleIdentifier("com.example.App");
     ASSERT_TRUE(records);
@@ -90,26 +76,19 @@ TEST_F(ConsentStoreTest, AnswersOfOtherKindsAreNotGrants) {
     EXPECT_EQ(store.grantedServices("com.example.App"), (std::set<std::string>{"photos"}));
 }
 
-TEST_F(ConsentStoreTest, UnusableFileFailsTheQueryAndIsNeverOverwritten) {
+TEST_F(ConsentStoreTest, UnusableFileOrEntryFailsTheQueryAndIsNeverOverwritten) {
     log::CaptureSink capture;
-    fs::create_directories(file().parent_path());
     const std::string broken = "<vrec><dict><key>com.example.App</key>";
-    std::ofstream(file()) << broken;
+    test::writeText(file(), broken);
     ConsentStore store(file());
     EXPECT_FALSE(store.informationForBundleIdentifier("com.example.App"));
     EXPECT_TRUE(capture.contains("cannot be read"));
     EXPECT_TRUE(store.grantedServices("com.example.App").empty());
     EXPECT_TRUE(store.setGranted("com.example.App", "camera", true));
-    std::stringstream text;
-    text << std::ifstream(file()).rdbuf();
-    EXPECT_EQ(text.str(), broken);
-}
+    EXPECT_EQ(test::readText(file()), broken);
 
-TEST_F(ConsentStoreTest, EntryThatIsNotADictionaryFailsTheQuery) {
-    fs::create_directories(file().parent_path());
-    ASSERT_FALSE(Document::writeFileAtomically(
-        file(), Value::dictionary({{"com.example.App", Value::array({Value::string("camera")})}})));
-    ConsentStore store(file());
+    // An entry that is not a dictionary fails the query for that bundle only.
+    put(Value::dictionary({{"com.example.App", Value::array({Value::string("camera")})}}));
     EXPECT_FALSE(store.informationForBundleIdentifier("com.example.App"));
     EXPECT_TRUE(store.setGranted("com.example.App", "camera", true));
     auto other = store.informationForBundleIdentifier("com.example.Other");

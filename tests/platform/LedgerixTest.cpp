@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXApplicationWorkspaceObserverProtocol.h"
@@ -32,7 +33,7 @@ namespace fs = std::filesystem;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 
-Value str(std::string_view s) { return Value::string(s); }
+using test::str;
 
 // What a test plug-in bundle holds; every field has a usable default.
 struct TestBundle {
@@ -94,9 +95,7 @@ class RecordingObserver : public LXApplicationWorkspaceObserverProtocol {
 class LedgerixTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bexil-ledgerix-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        dir_ = fs::canonical(pattern);
+        dir_ = tmp_.path();
         state_ = dir_ / "state";
         bundles_ = dir_ / "bundles";
         root_ = dir_ / "root";
@@ -104,11 +103,7 @@ class LedgerixTest : public ::testing::Test {
         fs::create_directories(root_);
         open();
     }
-    void TearDown() override {
-        workspace_.reset();
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
+    void TearDown() override { workspace_.reset(); }
 
     void open() {
         workspace_.reset();
@@ -140,7 +135,15 @@ class LedgerixTest : public ::testing::Test {
         return result.ok() ? result.value() : nullptr;
     }
     size_t count() { return workspace_->plugInCount().value_or(SIZE_MAX); }
+    // Registers `n` plug-ins with identifiers com.example.<prefix><i>, then closes the registry.
+    void fillAndClose(int n, const std::string& prefix) {
+        for (int i = 0; i < n; ++i)
+            registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
+                                   {.identifier = "com.example." + prefix + std::to_string(i)}));
+        workspace_.reset();
+    }
 
+    test::TempDir tmp_{"bexil-ledgerix"};
     fs::path dir_, state_, bundles_, root_;
     std::shared_ptr<LedgerixWorkspace> workspace_;
     std::shared_ptr<RecordingObserver> observer_;
@@ -193,13 +196,18 @@ TEST_F(LedgerixRegistrationTest, RecordCarriesWhatTheBundleAndItsApplicationSay)
     EXPECT_EQ(observer_->snapshot(), std::vector<std::string>{"install " + proxy->pluginUUID()->string()});
 }
 
-TEST_F(LedgerixRegistrationTest, DataPlugInGetsNoContainerAndApplicationIsRecordedOnce) {
+TEST_F(LedgerixRegistrationTest, DataOrNamelessPlugInGetsNoContainerAndApplicationIsRecordedOnce) {
     auto stationery = registerOK(kExamples / "Notes.app/PlugIns/Stationery.bxplugin");
     auto clipper = registerOK(kExamples / "Notes.app/PlugIns/Clipper.wexa");
     ASSERT_TRUE(stationery && clipper);
     EXPECT_FALSE(stationery->dataContainerURL());
     EXPECT_TRUE(clipper->dataContainerURL());
     EXPECT_FALSE(stationery->entitlements());
+    // Nor does a plug-in without an identifier, which is recorded all the same.
+    auto nameless = registerOK(kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin");
+    ASSERT_TRUE(nameless);
+    EXPECT_FALSE(nameless->pluginIdentifier());
+    EXPECT_FALSE(nameless->dataContainerURL());
 
     auto app = workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string());
     ASSERT_TRUE(app);
@@ -292,13 +300,6 @@ TEST_F(LedgerixRegistrationTest, ApplicationWithoutInformationIsAPlaceholder) {
     EXPECT_EQ(again->containingBundle()->bundleIdentifier(), "com.example.half");
 }
 
-TEST_F(LedgerixRegistrationTest, PlugInWithoutIdentifierIsRecordedWithoutContainer) {
-    auto proxy = registerOK(kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin");
-    ASSERT_TRUE(proxy);
-    EXPECT_FALSE(proxy->pluginIdentifier());
-    EXPECT_FALSE(proxy->dataContainerURL());
-}
-
 TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     constexpr int kPerThread = 25;
     std::vector<fs::path> paths;
@@ -345,7 +346,7 @@ TEST(LXBexilProxyTest, DictionariesReadFromTextOrValuesAndOldStyleFallsBack) {
 
 using LedgerixReRegistrationTest = LedgerixTest;
 
-TEST_F(LedgerixReRegistrationTest, UnchangedBundleKeepsItsRecordSilently) {
+TEST_F(LedgerixReRegistrationTest, UnchangedBundleKeepsItsRecordSilentlyAndGoneObserversAreSkipped) {
     fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {});
     auto first = registerOK(bundle);
     auto second = registerOK(bundle);
@@ -354,6 +355,9 @@ TEST_F(LedgerixReRegistrationTest, UnchangedBundleKeepsItsRecordSilently) {
     EXPECT_EQ(first->registrationDate(), second->registrationDate());
     EXPECT_EQ(observer_->snapshot().size(), 1u);
     EXPECT_EQ(count(), 1u);
+    // Observers that are gone are skipped.
+    observer_.reset();
+    EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
 }
 
 TEST_F(LedgerixReRegistrationTest, NewVersionIsUninstallThenInstallUnderANewUuid) {
@@ -386,13 +390,6 @@ TEST_F(LedgerixReRegistrationTest, SameVersionWithNewContentKeepsUuidButIsAnnoun
     // Whoever caches the record by UUID hears that it went and came back, so it rebuilds it.
     EXPECT_EQ(observer_->snapshot().size(), 3u);
     EXPECT_EQ(observer_->snapshot()[1], "uninstall " + old->pluginUUID()->string());
-}
-
-TEST_F(LedgerixReRegistrationTest, ObserversThatAreGoneAreSkipped) {
-    observer_.reset();
-    fs::path bundle = writePlugIn(bundles_ / "One.bxplugin", {});
-    EXPECT_TRUE(registerOK(bundle));
-    EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
 }
 
 // ---- Persistence and damage ----
@@ -516,10 +513,7 @@ TEST_F(LedgerixPersistenceTest, GarbageDatabaseIsMovedAsideAndRegistryStartsEmpt
 }
 
 TEST_F(LedgerixPersistenceTest, TruncatedDatabaseIsDetectedAtOpen) {
-    for (int i = 0; i < 150; ++i)
-        registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
-                               {.identifier = "com.example.t" + std::to_string(i)}));
-    workspace_.reset();
+    fillAndClose(150, "t");
     fs::path file = state_ / "registry.sqlite3";
     ASSERT_FALSE(fs::exists(state_ / "registry.sqlite3-wal")) << "closing should have checkpointed the log";
     fs::resize_file(file, fs::file_size(file) / 2);
@@ -532,10 +526,7 @@ TEST_F(LedgerixPersistenceTest, TruncatedDatabaseIsDetectedAtOpen) {
 }
 
 TEST_F(LedgerixPersistenceTest, DamageFoundWhileRunningIsCheckedAndMovedAsideAtNextOpen) {
-    for (int i = 0; i < 150; ++i)
-        registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
-                               {.identifier = "com.example.m" + std::to_string(i)}));
-    workspace_.reset();
+    fillAndClose(150, "m");
     // Overwrite the middle of the file, leaving the header and the schema page intact: a light open passes.
     fs::path file = state_ / "registry.sqlite3";
     uintmax_t size = fs::file_size(file);
@@ -574,34 +565,21 @@ TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     EXPECT_TRUE(fs::exists(file)) << "a newer database must be left alone";
 }
 
-TEST_F(LedgerixPersistenceTest, DefaultWorkspaceIsSharedAndLivesInTheStateDirectory) {
-    setenv("BX_STATE_DIR", (dir_ / "default").c_str(), 1);
-    auto first = LXApplicationWorkspace::defaultWorkspace();
-    auto second = LXApplicationWorkspace::defaultWorkspace();
-    unsetenv("BX_STATE_DIR");
-    ASSERT_TRUE(first.ok()) << first.error().description();
-    ASSERT_TRUE(second.ok());
-    EXPECT_EQ(first.value(), second.value());
-    EXPECT_TRUE(fs::exists(dir_ / "default/registry.sqlite3"));
-}
-
-TEST_F(LedgerixPersistenceTest, StateDirectoryFollowsTheEnvironment) {
-    std::string saved = getenv("BX_STATE_DIR") ? getenv("BX_STATE_DIR") : "";
-    setenv("BX_STATE_DIR", dir_.c_str(), 1);
-    EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), dir_);
-    unsetenv("BX_STATE_DIR");
-    if (geteuid() != 0) {
-        std::string savedXdg = getenv("XDG_STATE_HOME") ? getenv("XDG_STATE_HOME") : "";
-        setenv("XDG_STATE_HOME", "/xdg/state", 1);
-        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), fs::path("/xdg/state/bexil"));
-        if (savedXdg.empty())
-            unsetenv("XDG_STATE_HOME");
-        else
-            setenv("XDG_STATE_HOME", savedXdg.c_str(), 1);
-    } else {
-        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), fs::path("/var/lib/bexil"));
+TEST_F(LedgerixPersistenceTest, DefaultWorkspaceIsSharedAndLivesInTheStateDirectoryThatFollowsTheEnvironment) {
+    {
+        test::ScopedEnv state("BX_STATE_DIR", (dir_ / "default").string());
+        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), dir_ / "default");
+        auto first = LXApplicationWorkspace::defaultWorkspace();
+        auto second = LXApplicationWorkspace::defaultWorkspace();
+        ASSERT_TRUE(first.ok()) << first.error().description();
+        ASSERT_TRUE(second.ok());
+        EXPECT_EQ(first.value(), second.value());
+        EXPECT_TRUE(fs::exists(dir_ / "default/registry.sqlite3"));
     }
-    if (!saved.empty()) setenv("BX_STATE_DIR", saved.c_str(), 1);
+    test::ScopedEnv state("BX_STATE_DIR", std::nullopt);
+    test::ScopedEnv xdg("XDG_STATE_HOME", "/xdg/state");
+    EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(),
+              fs::path(geteuid() == 0 ? "/var/lib/bexil" : "/xdg/state/bexil"));
 }
 
 // ---- Discovery queries ----

@@ -4,10 +4,9 @@
 
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <string>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/log/CaptureSink.h"
 #include "platform/prefs/PreferencesStore.h"
@@ -21,13 +20,6 @@ constexpr const char* kDomain = "com.example.prefs";
 
 class PreferencesStoreTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bx-prefs-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        root_ = pattern;
-        directory_ = root_ / "preferences";
-    }
-    void TearDown() override { fs::remove_all(root_); }
 
     // Runs `body` in a child process and waits for it; the child's exit status must be 0.
     template <class F>
@@ -41,51 +33,35 @@ class PreferencesStoreTest : public ::testing::Test {
         ASSERT_EQ(WEXITSTATUS(status), 0);
     }
 
-    void writeText(const std::string& text) {
-        fs::create_directories(directory_);
-        std::ofstream(PreferencesStore(directory_, "host").fileForDomain(kDomain)) << text;
-    }
-    std::string fileText() {
-        std::ifstream in(PreferencesStore(directory_, "host").fileForDomain(kDomain));
-        std::stringstream s;
-        s << in.rdbuf();
-        return s.str();
-    }
+    fs::path file() const { return PreferencesStore(directory_, "host").fileForDomain(kDomain); }
 
-    fs::path root_;
-    fs::path directory_;
+    test::TempDir root_{"bx-prefs"};
+    fs::path directory_ = root_ / "preferences";
 };
 
-TEST_F(PreferencesStoreTest, FileIsNamedByDomainAndHost) {
+TEST_F(PreferencesStoreTest, FileIsNamedByDomainAndHostInADirectoryThatFollowsTheEnvironment) {
     PreferencesStore store(directory_, "build-7");
     EXPECT_EQ(store.fileForDomain("com.quorvel.bexil.userprefs"),
               directory_ / "com.quorvel.bexil.userprefs.build-7.vrec");
-}
-
-TEST_F(PreferencesStoreTest, DefaultDirectoryFollowsTheEnvironment) {
-    const char* saved = getenv("BX_PREFERENCES_DIR");
-    std::string savedText = saved ? saved : "";
-    setenv("BX_PREFERENCES_DIR", "/srv/prefs", 1);
-    EXPECT_EQ(PreferencesStore::defaultDirectory(), fs::path("/srv/prefs"));
-    unsetenv("BX_PREFERENCES_DIR");
-    setenv("XDG_CONFIG_HOME", "/home/u/.cfg", 1);
+    {
+        test::ScopedEnv dir("BX_PREFERENCES_DIR", "/srv/prefs");
+        EXPECT_EQ(PreferencesStore::defaultDirectory(), fs::path("/srv/prefs"));
+    }
+    test::ScopedEnv dir("BX_PREFERENCES_DIR", std::nullopt);
+    test::ScopedEnv xdg("XDG_CONFIG_HOME", "/home/u/.cfg");
     EXPECT_EQ(PreferencesStore::defaultDirectory(), fs::path("/home/u/.cfg/bexil/preferences"));
-    unsetenv("XDG_CONFIG_HOME");
-    if (saved) setenv("BX_PREFERENCES_DIR", savedText.c_str(), 1);
     EXPECT_FALSE(PreferencesStore::currentHostName().empty());
     EXPECT_EQ(PreferencesStore::currentHostName().find('/'), std::string::npos);
 }
 
-TEST_F(PreferencesStoreTest, AbsentFileAndAbsentKeyReadAsNull) {
+TEST_F(PreferencesStoreTest, AbsentFileAndKeyReadAsNullSetValueKeepsOtherKeysAndNullRemoves) {
     PreferencesStore store(directory_, "host");
     EXPECT_TRUE(store.copyValueAfterSync(kDomain, "exclusions").isNull());
     ASSERT_FALSE(store.setValue(kDomain, "other", Value::int64(3)));
     EXPECT_TRUE(store.copyValueAfterSync(kDomain, "exclusions").isNull());
     EXPECT_EQ(store.copyValueAfterSync(kDomain, "other"), Value::int64(3));
-}
 
-TEST_F(PreferencesStoreTest, SetValueKeepsOtherKeysAndNullRemoves) {
-    PreferencesStore store(directory_, "host");
+    ASSERT_FALSE(store.setValue(kDomain, "other", Value::null()));
     ASSERT_FALSE(store.setValue(kDomain, "a", Value::string("one")));
     ASSERT_FALSE(store.setValue(kDomain, "b", Value::array({Value::int64(1)})));
     ASSERT_FALSE(store.setValue(kDomain, "a", Value::null()));
@@ -146,7 +122,7 @@ TEST_F(PreferencesStoreTest, ConcurrentWritersInOtherProcessesLoseNoKey) {
 TEST_F(PreferencesStoreTest, MalformedFileReadsAsEmptyAndIsLoggedOncePerChange) {
     log::CaptureSink capture;
     PreferencesStore store(directory_, "host");
-    writeText("<vrec><dict><key>k</key><string>unterminated");
+    test::writeText(file(), "<vrec><dict><key>k</key><string>unterminated");
     EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
     EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
     EXPECT_EQ(capture.count("cannot be used, reading it as empty"), 1u);
@@ -160,24 +136,23 @@ TEST_F(PreferencesStoreTest, MalformedFileReadsAsEmptyAndIsLoggedOncePerChange) 
     EXPECT_EQ(store.copyValueAfterSync(kDomain, "k"), Value::boolean(true));
 }
 
-TEST_F(PreferencesStoreTest, WriterNeverReplacesAFileItCannotRead) {
+TEST_F(PreferencesStoreTest, WriterNeverReplacesAFileItCannotReadAndOversizedFilesAreRefused) {
     const std::string broken = "<vrec><dict><key>precious</key>";
-    writeText(broken);
+    test::writeText(file(), broken);
     PreferencesStore store(directory_, "host");
     EXPECT_FALSE(store.readDomain(kDomain));
     auto error = store.setValue(kDomain, "k", Value::int64(1));
     ASSERT_TRUE(error);
-    EXPECT_EQ(fileText(), broken);
-}
+    EXPECT_EQ(test::readText(file()), broken);
 
-TEST_F(PreferencesStoreTest, OversizedFileIsRefused) {
+    // Nor is a file larger than the limit read.
     log::CaptureSink capture;
     std::string text = "<vrec><dict><key>k</key><string>";
     text.append(PreferencesStore::kMaxPreferencesFileBytes, 'x');
     text += "</string></dict></vrec>";
-    writeText(text);
-    PreferencesStore store(directory_, "host");
-    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "k").isNull());
+    test::writeText(file(), text);
+    PreferencesStore fresh(directory_, "host");
+    EXPECT_TRUE(fresh.copyValueAfterSync(kDomain, "k").isNull());
     EXPECT_TRUE(capture.contains("is larger than"));
 }
 

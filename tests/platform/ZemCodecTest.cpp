@@ -64,6 +64,8 @@ Value sample() {
 
 TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
     const double nan = std::numeric_limits<double>::quiet_NaN();
+    Bytes blob(1 << 20);
+    for (size_t i = 0; i < blob.size(); ++i) blob[i] = static_cast<uint8_t>(i * 131 + (i >> 9));
     std::vector<Value> values = {
         Value::null(),
         Value::boolean(false),
@@ -92,6 +94,8 @@ TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
         Value::emptyDictionary(),
         Value::dictionary({{"", Value::null()}}),
         sample(),
+        Value::dictionary({{"blob", Value::data(blob)}}),
+        nested(ZemCodec::kMaxDepth, Value::string("bottom")),  // exactly at the nesting limit
     };
     for (const Value& v : values) {
         Bytes bytes = encodeOrDie(v);
@@ -102,15 +106,6 @@ TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
         // The encoding is canonical: what comes back encodes to the same bytes.
         EXPECT_EQ(encodeOrDie(*back), bytes) << v.description();
     }
-}
-
-TEST(ZemCodec, IntegerKindsStayApartEvenWhereValuesCompareEqual) {
-    Value signedThree = Value::int64(3), unsignedThree = Value::uint64(3);
-    ASSERT_EQ(signedThree, unsignedThree);  // numeric equality would hide a kind change
-    EXPECT_EQ(ZemCodec::decode(encodeOrDie(signedThree))->kind(), ValueKind::Int64);
-    EXPECT_EQ(ZemCodec::decode(encodeOrDie(unsignedThree))->kind(), ValueKind::UInt64);
-    EXPECT_EQ(ZemCodec::decode(encodeOrDie(Value::boolean(true)))->kind(), ValueKind::Bool);
-    EXPECT_EQ(ZemCodec::decode(encodeOrDie(Value::real(3.0)))->kind(), ValueKind::Real);
 }
 
 TEST(ZemCodec, KnownEncodingsMatchTheDocument) {
@@ -130,24 +125,6 @@ TEST(ZemCodec, KnownEncodingsMatchTheDocument) {
         {Value::boolean(true), "02"},
     };
     for (const auto& [value, expected] : cases) EXPECT_EQ(encodeOrDie(value), hex(expected)) << value.description();
-}
-
-TEST(ZemCodec, NestingExactlyAtTheLimitRoundTrips) {
-    Value deep = nested(ZemCodec::kMaxDepth, Value::string("bottom"));
-    Bytes bytes = encodeOrDie(deep);
-    Result<Value> back = ZemCodec::decode(bytes);
-    ASSERT_TRUE(back.ok()) << back.error().description();
-    EXPECT_TRUE(strictlyEqual(deep, *back));
-}
-
-TEST(ZemCodec, OneMebibyteOfDataRoundTrips) {
-    Bytes blob(1 << 20);
-    for (size_t i = 0; i < blob.size(); ++i) blob[i] = static_cast<uint8_t>(i * 131 + (i >> 9));
-    Value v = Value::dictionary({{"blob", Value::data(blob)}});
-    Result<Value> back = ZemCodec::decode(encodeOrDie(v));
-    ASSERT_TRUE(back.ok());
-    auto bytes = back->get("blob").dataBytes();
-    EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), blob.begin(), blob.end()));
 }
 
 TEST(ZemCodec, DictionaryKeysInAnyOrderAreAccepted) {
