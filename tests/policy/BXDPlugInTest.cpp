@@ -5,6 +5,7 @@
 #include <fstream>
 #include <unordered_set>
 
+#include "TestSupport.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
@@ -14,10 +15,9 @@
 namespace bexil {
 namespace {
 
-using Entries = std::vector<std::pair<std::string, Value>>;
-
-Value dict(Entries entries) { return Value::dictionary(std::move(entries)); }
-Value str(const char* s) { return Value::string(s); }
+using test::dict;
+using test::Entries;
+using test::str;
 
 const char* const kAppPath = "/Applications/Greeter.app";
 const char* const kHelloPath = "/Applications/Greeter.app/PlugIns/Hello.bxplugin";
@@ -82,7 +82,7 @@ std::string refusal(LXBexilProxy::Fields fields) {
     return line ? line->message : std::string("(constructed or refused silently)");
 }
 
-TEST(BXDPlugInConstruction, TakesItsFactsFromTheRegistryRecord) {
+TEST(BXDPlugInConstruction, TakesItsFactsFromTheRegistryRecordWithTheDateTruncatedTowardZero) {
     std::shared_ptr<BXDPlugIn> plugIn = build(helloFields());
     ASSERT_NE(plugIn, nullptr);
     EXPECT_EQ(plugIn->identifier(), "com.example.greeter.hello");
@@ -98,9 +98,8 @@ TEST(BXDPlugInConstruction, TakesItsFactsFromTheRegistryRecord) {
     EXPECT_EQ(plugIn->infoKey("BDBundleVersion"), str("7"));
     EXPECT_EQ(plugIn->attribute("Language"), str("en"));
     EXPECT_EQ(plugIn->lxproxy()->bundleURL(), kHelloPath);
-}
 
-TEST(BXDPlugInConstruction, RegistrationDateIsTruncatedTowardZero) {
+    // The registration date is truncated toward zero and saturates.
     auto fields = helloFields();
     fields.registrationDate = Date{-1.9};
     EXPECT_EQ(build(fields)->lastModified(), -1);
@@ -123,7 +122,7 @@ TEST(BXDPlugInConstruction, GenerationFromExplicitKeyOldStyleKeyOrDefault) {
     EXPECT_EQ(build(helloFields())->hubProtocolVersion(), 2u);
 }
 
-TEST(BXDPlugInConstruction, MissingUrlOrIdentifierYieldsNothing) {
+TEST(BXDPlugInConstruction, MissingUrlOrIdentifierYieldsNothingMissingUuidARandomOne) {
     log::CaptureSink capture;
     auto noUrl = helloFields();
     noUrl.bundleURL.reset();
@@ -134,9 +133,7 @@ TEST(BXDPlugInConstruction, MissingUrlOrIdentifierYieldsNothing) {
     noIdentifier.pluginIdentifier.reset();
     EXPECT_EQ(build(noIdentifier), nullptr);
     EXPECT_TRUE(capture.contains(std::string("missing identifier in plug-in at ") + kHelloPath));
-}
 
-TEST(BXDPlugInConstruction, RecordWithoutRegistryUuidGetsARandomOne) {
     auto fields = helloFields();
     fields.pluginUUID.reset();
     std::shared_ptr<BXDPlugIn> a = build(fields);
@@ -157,14 +154,12 @@ TEST(BXDPlugInConstruction, TwoRecordsOfOneRegistryRecordAreEqualAndHashAlike) {
     EXPECT_EQ(set.size(), 1u);
 }
 
-TEST(BXDPlugInDiagnose, BaseChecksStillApplyThroughTheRegistry) {
+TEST(BXDPlugInDiagnose, BaseChecksStillApplyAndCodeCarryingPlugInNeedsADataContainer) {
     auto fields = helloFields();
     fields.infoVrec = helloInfo(plugInDictionary({{"PassProxy", Value::boolean(true)}}));
     EXPECT_NE(refusal(fields).find(": the \"PassProxy\" key is not supported on this platform"), std::string::npos);
-}
 
-TEST(BXDPlugInDiagnose, CodeCarryingPlugInNeedsADataContainer) {
-    auto fields = helloFields();
+    fields = helloFields();
     fields.dataContainerURL.reset();
     EXPECT_EQ(refusal(fields), std::string("ignoring mis-configured plug-in at ") + kHelloPath +
                                    ": this plug-in has no sandbox data container");
@@ -175,7 +170,7 @@ TEST(BXDPlugInDiagnose, CodeCarryingPlugInNeedsADataContainer) {
     EXPECT_TRUE(data->isData());
 }
 
-TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystem) {
+TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystemWithCode12InTheBexilDomain) {
     auto fields = helloFields();
     fields.containingBundle.reset();
     fields.bundleURL = "/System/Library/PlugIns/Clock.bxplugin";
@@ -190,9 +185,7 @@ TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystem) {
                                        ": plug-ins outside containing apps must be in /System")
             << outside;
     }
-}
 
-TEST(BXDPlugInDiagnose, ErrorsCarryCode12InTheBexilDomain) {
     std::shared_ptr<BXDPlugIn> plugIn = build(helloFields());
     ASSERT_NE(plugIn, nullptr);
     plugIn->setContainingUrl(std::nullopt);
@@ -203,7 +196,7 @@ TEST(BXDPlugInDiagnose, ErrorsCarryCode12InTheBexilDomain) {
     EXPECT_EQ(error->localizedDescription(), "plug-ins outside containing apps must be in /System");
 }
 
-TEST(BXDPlugInEntitlements, FalseAndZeroAreNotEntitlements) {
+TEST(BXDPlugInEntitlements, FalseAndZeroAreNotEntitlementsAndWithoutAnyNothingIsGranted) {
     auto fields = helloFields();
     fields.entitlements = dict({{"false", Value::boolean(false)},
                                 {"zero", Value::int64(0)},
@@ -218,10 +211,8 @@ TEST(BXDPlugInEntitlements, FalseAndZeroAreNotEntitlements) {
     for (const char* yes : {"true", "one", "text", "list"}) EXPECT_TRUE(plugIn->hasEntitlement(yes)) << yes;
     EXPECT_EQ(plugIn->valueForEntitlement("text"), str("no"));
     EXPECT_FALSE(plugIn->valueForEntitlement("absent"));
-}
 
-TEST(BXDPlugInEntitlements, WithoutEntitlementsNothingIsGranted) {
-    std::shared_ptr<BXDPlugIn> plugIn = build(helloFields());
+    plugIn = build(helloFields());
     EXPECT_FALSE(plugIn->hasEntitlement(BXDPlugIn::kAutoElectEntitlement));
     EXPECT_FALSE(plugIn->valueForEntitlement(BXDPlugIn::kAutoElectEntitlement));
 }
@@ -271,16 +262,13 @@ TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
 class BXDPlugInExtensionsTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/bxdplugin-extensions-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = std::filesystem::canonical(pattern);
+        root_ = dir_.path();
         // The process's sandbox keeps its key under the runtime dir, read once on first use.
         setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
         std::filesystem::create_directories(root_ / "Greeter.app/PlugIns/Hello.bxplugin/Resources");
         std::ofstream(root_ / "Greeter.app/PlugIns/Hello.bxplugin/Resources/greetings.txt") << "hi";
         std::filesystem::create_directories(root_ / "Greeter.app/PlugIns/Clipper.wexa");
     }
-    void TearDown() override { std::filesystem::remove_all(root_); }
 
     std::shared_ptr<BXDPlugIn> plugInAt(const std::string& relative, Value plugIn) {
         auto fields = helloFields();
@@ -297,6 +285,7 @@ class BXDPlugInExtensionsTest : public ::testing::Test {
         return consumer.consumedPath(handle).value_or("(refused)");
     }
 
+    test::TempDir dir_{"bxdplugin-extensions"};
     std::filesystem::path root_;
 };
 

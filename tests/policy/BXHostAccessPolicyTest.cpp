@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <map>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/ksn/ConsentStore.h"
 #include "platform/log/CaptureSink.h"
@@ -13,9 +14,8 @@ namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using Entries = std::vector<std::pair<std::string, Value>>;
-
-Value str(const char* s) { return Value::string(s); }
+using test::Entries;
+using test::str;
 
 // A host with a fixed set of entitlements; holding one means a value that is not equal to false.
 class FakeHost : public HostAccessClient {
@@ -61,19 +61,15 @@ std::optional<std::string> allow(const BXPlugInCore& p, const HostAccessClient& 
 constexpr const char* kSharePath = "/Applications/Mail.app/PlugIns/Share.wexa";
 const std::string kAllowed(BXHostAccessPolicy::kAllowedPlugInsEntitlement);
 
-TEST(BXHostAccessPolicyAllow, UnrestrictedHostAndPlugInAreAllowed) {
+TEST(BXHostAccessPolicyAllow, UnrestrictedHostAndPlugInAreAllowedAndANonDictionaryRestrictionRefusesEveryPlugIn) {
     auto p = plugIn(kSharePath);
     ASSERT_TRUE(p);
     Matcher matcher{p.get()};
     EXPECT_EQ(allow(*p, FakeHost(), &matcher), std::nullopt);
     EXPECT_EQ(matcher.calls, 0) << "no rule set, nothing to match";
-}
-
-TEST(BXHostAccessPolicyAllow, NonDictionaryHostRestrictionRefusesEveryPlugIn) {
-    auto p = plugIn(kSharePath);
     for (Value value : {str("com.example.mail.share"), Value::array({Value::emptyDictionary()}), Value::boolean(true),
                         Value::int64(0)}) {
-        Matcher matcher{p.get()};
+        matcher.calls = 0;
         EXPECT_EQ(allow(*p, FakeHost({{kAllowed, value}}), &matcher), "invalid host restriction entitlement")
             << value.description();
         EXPECT_EQ(matcher.calls, 0);
@@ -92,7 +88,7 @@ TEST(BXHostAccessPolicyAllow, HostRuleSetDecidesFirst) {
               "the host's plug-in entitlement does not allow this plug-in");
 }
 
-TEST(BXHostAccessPolicyAllow, PlugInRequiresItsHostEntitlement) {
+TEST(BXHostAccessPolicyAllow, PlugInRequiresItsHostEntitlementAndAHostFailingBothGetsTheHostSideReason) {
     auto p = plugIn(kSharePath, {{"RZExtensionHostEntitlement", str("com.example.may-host-share")}});
     ASSERT_TRUE(p);
     const std::string refused = "the host does not have the \"com.example.may-host-share\" entitlement";
@@ -103,10 +99,6 @@ TEST(BXHostAccessPolicyAllow, PlugInRequiresItsHostEntitlement) {
     for (Value held :
          {Value::boolean(true), str("anything"), Value::int64(2), Value::emptyDictionary(), Value::emptyArray()})
         EXPECT_EQ(allow(*p, FakeHost({{"com.example.may-host-share", held}})), std::nullopt) << held.description();
-}
-
-TEST(BXHostAccessPolicyAllow, HostThatFailsBothGetsTheHostSideReason) {
-    auto p = plugIn(kSharePath, {{"RZExtensionHostEntitlement", str("com.example.may-host-share")}});
     EXPECT_EQ(allow(*p, FakeHost({{kAllowed, Value::dictionary({{"RZExtensionIdentifier", str("com.other")}})}})),
               "the host's plug-in entitlement does not allow this plug-in");
     EXPECT_EQ(allow(*p, FakeHost({{kAllowed, str("bad")}})), "invalid host restriction entitlement");
@@ -123,12 +115,6 @@ TEST(BXHostAccessPolicyAllow, MalformedHostEntitlementNameRefusesEveryHost) {
 
 class PolicyBundlesTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bx-policy-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        root_ = pattern;
-    }
-    void TearDown() override { fs::remove_all(root_); }
 
     // An application bundle directory with an information dictionary.
     fs::path makeApp(const std::string& name, std::optional<std::string> identifier) {
@@ -140,7 +126,7 @@ class PolicyBundlesTest : public ::testing::Test {
         return app;
     }
 
-    fs::path root_;
+    test::TempDir root_{"bx-policy"};
 };
 
 TEST_F(PolicyBundlesTest, DedicatedPlugInIsVisibleOnlyToItsOwnApplication) {
@@ -178,17 +164,16 @@ TEST_F(PolicyBundlesTest, GrantedServicesOfTheContainingApplication) {
     EXPECT_EQ(BXHostAccessPolicy::allowedKSNServices(*p, consent), (std::set<std::string>{"photos"}));
 }
 
-TEST_F(PolicyBundlesTest, SystemPlugInWithoutApplicationHasNoServicesAndNoLogLine) {
-    log::CaptureSink capture;
+TEST_F(PolicyBundlesTest, NoApplicationGivesNoServicesSilentlyAndFailuresWithOneInfoLine) {
     ConsentStore consent(root_ / "consent.vrec");
-    auto p = plugIn("/System/Library/Bexil/Indexer.bundle");
-    ASSERT_TRUE(p);
-    EXPECT_TRUE(BXHostAccessPolicy::allowedKSNServices(*p, consent).empty());
-    EXPECT_TRUE(capture.entries().empty());
-}
-
-TEST_F(PolicyBundlesTest, FailuresGiveNoServicesWithOneInfoLine) {
-    ConsentStore consent(root_ / "consent.vrec");
+    {
+        log::CaptureSink capture;
+        auto system = plugIn("/System/Library/Bexil/Indexer.bundle");
+        ASSERT_TRUE(system);
+        EXPECT_TRUE(BXHostAccessPolicy::allowedKSNServices(*system, consent).empty());
+        EXPECT_TRUE(capture.entries().empty());
+    }
+    // A containing application that cannot be read gives none, with one info line.
     std::string plugInPath = (root_ / "Gone.app" / "PlugIns" / "Share.wexa").string();
     auto p = plugIn(plugInPath);
     {
