@@ -2,13 +2,12 @@
 // listener on a private service directory), how replies become errors, and the message-form conversions.
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <future>
 #include <mutex>
 
+#include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 #include "client/BXDaemonClient.h"
@@ -26,11 +25,7 @@ using Reply = BXDaemonClient::Reply;
 class CapturingService {
   public:
     explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName)
-        : dir_(fs::temp_directory_path() /
-               ("bexil-client-test-" + std::to_string(getpid()) + "-" + std::to_string(counter_++))),
-          queue_("capture", loop_) {
-        fs::create_directories(dir_);
-        setenv("BX_SERVICE_DIR", dir_.c_str(), 1);
+        : queue_("capture", loop_) {
         auto listener = ZemListener::create(service, queue_, nullptr);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;
@@ -55,8 +50,6 @@ class CapturingService {
     ~CapturingService() {
         listener_->cancel();
         for (auto& peer : peers_) peer->cancel();
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
     }
 
     void setAnswer(Value answer) { answer_ = std::move(answer); }
@@ -66,8 +59,8 @@ class CapturingService {
     }
 
   private:
-    static inline int counter_ = 0;
-    fs::path dir_;
+    test::TempDir dir_{"bexil-client-test"};
+    test::ScopedEnv serviceDir_{"BX_SERVICE_DIR", dir_.path().string()};
     EventLoop loop_{1};
     SerialQueue queue_;
     std::shared_ptr<ZemListener> listener_;
@@ -120,7 +113,7 @@ TEST_F(BXDaemonClientRequestTest, CreationDefaultsToTheDaemonServiceQueueAndVers
     EXPECT_EQ(client.bxd()->serviceName(), "com.quorvel.bexil.bxd");
 }
 
-TEST_F(BXDaemonClientRequestTest, PathRequestsCarryPathsOnly) {
+TEST_F(BXDaemonClientRequestTest, PathRequestsCarryPathsOnlyFlagRequestsUnsignedFlags) {
     Value add = sent([](auto& c, auto h) { c.addPlugInsReply(strings({"/a", "/b"}), h); });
     expectEnvelope(add, "add");
     EXPECT_EQ(add.get("paths"), strings({"/a", "/b"}));
@@ -130,9 +123,7 @@ TEST_F(BXDaemonClientRequestTest, PathRequestsCarryPathsOnly) {
     expectEnvelope(remove, "remove");
     EXPECT_EQ(remove.get("paths"), strings({"/x"}));
     EXPECT_EQ(remove.count(), 3u);
-}
 
-TEST_F(BXDaemonClientRequestTest, FlagRequestsCarryUnsignedFlags) {
     Value bulk = sent([](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); });
     expectEnvelope(bulk, "bulk");
     EXPECT_EQ(bulk.get("flags").getUInt64(), std::optional<uint64_t>(0x8000000000000001ull));
@@ -146,7 +137,7 @@ TEST_F(BXDaemonClientRequestTest, FlagRequestsCarryUnsignedFlags) {
     EXPECT_EQ(match.count(), 4u);
 }
 
-TEST_F(BXDaemonClientRequestTest, UuidRequestsKeepTheOrderGiven) {
+TEST_F(BXDaemonClientRequestTest, UuidAndAnnotationRequestsKeepTheOrderGiven) {
     Value ready = sent([](auto& c, auto h) { c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h); });
     expectEnvelope(ready, "ready");
     EXPECT_EQ(uuidsOf(ready), (std::vector<Uuid>{kSecond, kFirst}));
@@ -156,9 +147,7 @@ TEST_F(BXDaemonClientRequestTest, UuidRequestsKeepTheOrderGiven) {
     expectEnvelope(access, "access");
     EXPECT_EQ(uuidsOf(access), (std::vector<Uuid>{kFirst, kFirst}));
     EXPECT_TRUE(access.get("flags").getUInt64().has_value());
-}
 
-TEST_F(BXDaemonClientRequestTest, AnnotationRequests) {
     Value annotations = Value::dictionary({{"election", Value::int64(1)}});
     Value annotate = sent([&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); });
     expectEnvelope(annotate, "annotate");
@@ -206,9 +195,8 @@ TEST_F(BXDaemonClientRequestTest, ReplyCallbacksRunOnTheReplyQueue) {
 }
 
 TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThatIsCode4) {
-    fs::path empty = fs::temp_directory_path() / ("bexil-client-empty-" + std::to_string(getpid()));
-    fs::create_directories(empty);
-    setenv("BX_SERVICE_DIR", empty.c_str(), 1);
+    test::TempDir empty("bexil-client-empty");
+    test::ScopedEnv serviceDir("BX_SERVICE_DIR", empty.path().string());
     BXDaemonClient client("com.example.nobody");
     auto reply = sendAndWait([&](auto h) { client.bulkPluginsReply(0, h); }, std::chrono::seconds(10));
     ASSERT_TRUE(reply.has_value()) << "a missing service must answer, not hang";
@@ -217,35 +205,30 @@ TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThat
     ASSERT_TRUE(error.has_value());
     EXPECT_EQ(error->code(), 4);
     EXPECT_EQ(error->localizedDescription(), std::get<ZemError>(*reply).description());
-    fs::remove_all(empty);
 }
 
 // ---- errorInReply ----
 
 Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
 
-TEST(BXDaemonClientErrorTest, EmptyReplyAndZeroCodeAreSuccess) {
+TEST(BXDaemonClientErrorTest, EmptyReplyAndZeroCodeAreSuccessACodeIsABexilErrorWithItsMessageOrTheGenericText) {
     EXPECT_FALSE(BXDaemonClient::errorInReply(Value::emptyDictionary()).has_value());
     EXPECT_FALSE(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0)}})).has_value());
-}
 
-TEST(BXDaemonClientErrorTest, CodeAndMessageBecomeABexilError) {
     auto error = BXDaemonClient::errorInReply(
         replyWith({{"errorcode", Value::uint64(9)}, {"error", Value::string("no plugin at /x")}}));
     ASSERT_TRUE(error.has_value());
     EXPECT_TRUE(error->isBexil());
     EXPECT_EQ(error->code(), 9);
     EXPECT_EQ(error->localizedDescription(), std::optional<std::string>("no plugin at /x"));
+
+    auto generic = BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(14)}}));
+    ASSERT_TRUE(generic.has_value());
+    EXPECT_EQ(generic->code(), 14);
+    EXPECT_EQ(generic->localizedDescription(), std::optional<std::string>("unknown error returned by Bexil subsystem"));
 }
 
-TEST(BXDaemonClientErrorTest, CodeWithoutMessageGetsTheGenericText) {
-    auto error = BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(14)}}));
-    ASSERT_TRUE(error.has_value());
-    EXPECT_EQ(error->code(), 14);
-    EXPECT_EQ(error->localizedDescription(), std::optional<std::string>("unknown error returned by Bexil subsystem"));
-}
-
-TEST(BXDaemonClientErrorTest, OnlyTheLow32BitsOfTheCodeCount) {
+TEST(BXDaemonClientErrorTest, OnlyTheLow32BitsOfTheCodeCountAndAMessageWithoutCodeIsABrokenInvariant) {
     // A negative 32-bit code widened with its sign, and a code with junk in the high half.
     auto negative = BXDaemonClient::errorInReply(
         replyWith({{"errorcode", Value::uint64(0xFFFFFFFFFFFFFFFEull)}, {"error", Value::string("m")}}));
@@ -253,9 +236,7 @@ TEST(BXDaemonClientErrorTest, OnlyTheLow32BitsOfTheCodeCount) {
     EXPECT_EQ(negative->code(), -2);
     auto highOnly = BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0x100000000ull)}}));
     EXPECT_FALSE(highOnly.has_value()) << "low half 0 and no message is success";
-}
 
-TEST(BXDaemonClientErrorTest, MessageWithoutCodeIsABrokenInvariant) {
     try {
         (void)BXDaemonClient::errorInReply(replyWith({{"error", Value::string("oops")}}));
         FAIL() << "expected InternalInconsistency";
@@ -281,7 +262,7 @@ Value everyKind() {
     return Value::array({d.take()});
 }
 
-TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3) {
+TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3AndEveryOtherVersionYieldsNone) {
     BXDaemonClient client("com.example.unused");
     Value original = everyKind();
     auto encoded = BXDaemonClient::convertToZEMVersion(original, 3);
@@ -292,9 +273,7 @@ TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3) {
     // Kinds stay apart: an int64 does not come back as a uint64 and vice versa.
     EXPECT_TRUE(decoded->items()[0].get("int").getInt64().has_value());
     EXPECT_TRUE(decoded->items()[0].get("uint").getUInt64().has_value());
-}
 
-TEST(BXDaemonClientConversionTest, EveryOtherVersionYieldsNone) {
     for (int64_t version : {int64_t{0}, int64_t{1}, int64_t{2}, int64_t{4}, int64_t{-3}, (int64_t{1} << 32) | 3})
         EXPECT_FALSE(BXDaemonClient::convertToZEMVersion(Value::emptyArray(), version).has_value()) << version;
 }

@@ -9,6 +9,7 @@
 #include <fstream>
 #include <future>
 
+#include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 #include "platform/notify/SystemNotifications.h"
@@ -20,13 +21,6 @@ namespace fs = std::filesystem;
 
 class SystemNotificationsTest : public ::testing::Test {
   protected:
-    SystemNotificationsTest()
-        : dir_(fs::temp_directory_path() / ("bexil-notify-" + std::to_string(getpid()) + "-" +
-                                            ::testing::UnitTest::GetInstance()->current_test_info()->name())) {
-        fs::remove_all(dir_);
-    }
-    ~SystemNotificationsTest() override { fs::remove_all(dir_); }
-
     // Forks a child that posts `name` `times` times and exits 0 when every post succeeded.
     void postFromChild(const std::string& name, int times) {
         pid_t child = fork();
@@ -43,7 +37,8 @@ class SystemNotificationsTest : public ::testing::Test {
         EXPECT_EQ(WEXITSTATUS(status), 0);
     }
 
-    fs::path dir_;
+    test::TempDir tmp_{"bexil-notify"};
+    fs::path dir_ = tmp_ / "notify";
     EventLoop loop_{1};
     SerialQueue queue_{"observer", loop_};
 };
@@ -122,7 +117,7 @@ TEST_F(SystemNotificationsTest, CounterSurvivesConcurrentPostersAndStrayContent)
     EXPECT_EQ(notifications.state("n"), 101u) << "the lock file must serialise increments";
 }
 
-TEST_F(SystemNotificationsTest, BadNamesAreRefused) {
+TEST_F(SystemNotificationsTest, BadNamesAreRefusedAndTheDefaultDirectoryFollowsTheEnvironment) {
     SystemNotifications notifications(dir_);
     for (std::string bad : {std::string(), std::string("../escape"), std::string(".hidden"), std::string("a/b"),
                             std::string(SystemNotifications::kMaxNameLength + 1, 'x')}) {
@@ -135,12 +130,10 @@ TEST_F(SystemNotificationsTest, BadNamesAreRefused) {
                          .ok());
     }
     EXPECT_FALSE(fs::exists(dir_.parent_path() / "escape"));
-}
 
-TEST(SystemNotificationsDirectoryTest, RuntimeDirectoryComesFromTheEnvironment) {
-    setenv("BX_RUNTIME_DIR", "/tmp/bexil-rt-test", 1);
+    // The default directory is under the runtime directory the environment names.
+    test::ScopedEnv runtime("BX_RUNTIME_DIR", "/tmp/bexil-rt-test");
     EXPECT_EQ(SystemNotifications::defaultDirectory(), fs::path("/tmp/bexil-rt-test/notify"));
-    unsetenv("BX_RUNTIME_DIR");
 }
 
 }  // namespace

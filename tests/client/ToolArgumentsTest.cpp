@@ -2,11 +2,10 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
-#include <fstream>
 
 #include "JsonText.h"
+#include "TestSupport.h"
 #include "ToolArguments.h"
 #include "base/Document.h"
 
@@ -15,7 +14,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
-TEST(ToolArgumentsTest, UuidsMustBeCanonical) {
+TEST(ToolArgumentsTest, UuidsMustBeCanonicalAndPathsAbsolute) {
     auto good = parseUuids({"11111111-2222-4333-8444-555555555555", "aaaaaaaa-bbbb-4ccc-8ddd-eeeeeeeeeeee"});
     ASSERT_TRUE(good.ok());
     EXPECT_EQ(good->size(), 2u);
@@ -25,9 +24,7 @@ TEST(ToolArgumentsTest, UuidsMustBeCanonical) {
         ASSERT_FALSE(result.ok()) << bad;
         EXPECT_NE(result.error().localizedDescription()->find(bad), std::string::npos);
     }
-}
 
-TEST(ToolArgumentsTest, PathsMustBeAbsolute) {
     EXPECT_TRUE(absolutePaths({"/a", "/b/c"}).ok());
     auto relative = absolutePaths({"/a", "b"});
     ASSERT_FALSE(relative.ok());
@@ -46,13 +43,11 @@ TEST(ToolArgumentsTest, RulesAreKeyEqualsPattern) {
     EXPECT_FALSE(rulesFromArguments({"K=1", "K=2"}).ok());
 }
 
-TEST(ToolArgumentsTest, FlagsByName) {
+TEST(ToolArgumentsTest, FlagsByNameAndExitStatusIsTheCodeWhenItFits) {
     EXPECT_EQ(*discoveryFlags({}), 0u);
     EXPECT_EQ(*discoveryFlags({"all-versions", "all-instances", "system-only", "all"}), 0x20Du);
     EXPECT_FALSE(discoveryFlags({"all-versions", "everything"}).ok());
-}
 
-TEST(ToolArgumentsTest, ExitStatusIsTheCodeWhenItFits) {
     EXPECT_EQ(exitStatusForCode(11), 11);
     EXPECT_EQ(exitStatusForCode(18), 18);
     EXPECT_EQ(exitStatusForCode(0), 1);
@@ -63,16 +58,10 @@ TEST(ToolArgumentsTest, ExitStatusIsTheCodeWhenItFits) {
 class RuleFileTest : public ::testing::Test {
   protected:
     fs::path write(const std::string& name, const std::string& text) {
-        fs::path path = dir_ / name;
-        std::ofstream(path) << text;
-        return path;
+        test::writeText(dir_ / name, text);
+        return dir_ / name;
     }
-    fs::path dir_ = [] {
-        fs::path d = fs::temp_directory_path() / ("bexil-rules-" + std::to_string(getpid()));
-        fs::create_directories(d);
-        return d;
-    }();
-    ~RuleFileTest() override { fs::remove_all(dir_); }
+    test::TempDir dir_{"bexil-rules"};
 };
 
 TEST_F(RuleFileTest, JsonAndVrecFilesReadAsDictionaries) {
@@ -101,12 +90,10 @@ TEST_F(RuleFileTest, BadFilesAreRefusedWithTheirName) {
     EXPECT_FALSE(readDictionaryFile(write("bad.vrec", "<not a document")).ok());
 }
 
-TEST(JsonTextTest, DeepNestingIsRefusedNotACrash) {
+TEST(JsonTextTest, EscapesAndUnicodeRoundTripAndDeepNestingIsRefusedNotACrash) {
     std::string deep(100000, '[');
     EXPECT_FALSE(parseJson(deep).ok());
-}
 
-TEST(JsonTextTest, EscapesAndUnicodeRoundTrip) {
     auto value =
         parseJson(R"({"s": "a\"b\\c\n\u00e9\ud83d\ude00", "t": true, "n": null, "big": 18446744073709551615})");
     ASSERT_TRUE(value.ok()) << value.error().description();
@@ -125,12 +112,11 @@ TEST(JsonTextTest, KindsJsonLacksBecomeText) {
 }
 
 TEST(ToolPreferencesTest, PreferencesFileHonoursTheOverrideDirectory) {
-    setenv("BX_PREFERENCES_DIR", "/tmp/prefs-test", 1);
+    test::ScopedEnv dir("BX_PREFERENCES_DIR", "/tmp/prefs-test");
     fs::path file = preferencesFile();
     EXPECT_EQ(file.parent_path(), fs::path("/tmp/prefs-test"));
     EXPECT_EQ(file.filename().string().rfind("com.quorvel.bexil.userprefs.", 0), 0u);
     EXPECT_EQ(file.extension(), ".vrec");
-    unsetenv("BX_PREFERENCES_DIR");
 }
 
 }  // namespace
