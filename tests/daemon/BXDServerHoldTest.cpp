@@ -1,9 +1,8 @@
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <unistd.h>
 
 #include <filesystem>
 
+#include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDServer.h"
@@ -43,22 +42,11 @@ std::shared_ptr<BXDPlugIn> record(const std::string& name, Uuid uuid) {
 class BXDServerHoldTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/bxdserver-hold-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
-        for (const char* dir : {"service", "state", "runtime", "entitlements"}) fs::create_directories(root_ / dir);
-        setenv("BX_SERVICE_DIR", (root_ / "service").c_str(), 1);
-        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
-        setenv("BX_ENTITLEMENTS_DIR", (root_ / "entitlements").c_str(), 1);
         server_ =
             BXDServer::initForServiceDatabase("com.example.hold-test", (root_ / "annotations.vrec").c_str(), loop_);
         ASSERT_NE(server_, nullptr);
     }
-    void TearDown() override {
-        server_.reset();
-        fs::remove_all(root_);
-    }
+    void TearDown() override { server_.reset(); }
 
     void place(std::vector<std::shared_ptr<BXDPlugIn>> plugIns) {
         server_->syncQueue().sync([&] {
@@ -67,7 +55,7 @@ class BXDServerHoldTest : public ::testing::Test {
         });
     }
 
-    fs::path root_;
+    test::DaemonDirs root_{"bxdserver-hold"};
     EventLoop loop_{0};
     std::unique_ptr<BXDServer> server_;
 };

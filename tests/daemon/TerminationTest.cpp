@@ -12,6 +12,7 @@
 #include <future>
 #include <thread>
 
+#include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
 #include "platform/jobard/ServiceManager.h"
@@ -82,21 +83,12 @@ std::shared_ptr<const LXBexilProxy> proxy(const std::string& bundleIdentifier, s
 class TerminationTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        root_ = fs::temp_directory_path() / ("bx-termination-" + std::to_string(getpid()));
-        fs::remove_all(root_);
-        for (const char* sub : {"service", "state", "runtime"}) fs::create_directories(root_ / sub);
-        setenv("BX_SERVICE_DIR", (root_ / "service").c_str(), 1);
-        setenv("BX_STATE_DIR", (root_ / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (root_ / "runtime").c_str(), 1);
         server_ =
             BXDServer::initForServiceDatabase("com.example.termination", (root_ / "annotations.vrec").c_str(), loop_);
         ASSERT_NE(server_, nullptr);
         server_->setServiceManager(ServiceManager(instances()));
     }
-    void TearDown() override {
-        server_.reset();
-        fs::remove_all(root_);
-    }
+    void TearDown() override { server_.reset(); }
 
     RunningInstances instances() const { return RunningInstances("instances", root_ / "runtime"); }
 
@@ -112,7 +104,7 @@ class TerminationTest : public ::testing::Test {
         EXPECT_EQ(calls, 1);
     }
 
-    fs::path root_;
+    test::DaemonDirs root_{"bx-termination"};
     EventLoop loop_{1};
     std::unique_ptr<BXDServer> server_;
 };
@@ -166,8 +158,8 @@ TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
 }
 
 TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
-    fs::path runtime = fs::temp_directory_path() / ("bx-assertions-" + std::to_string(getpid()));
-    RunningInstances assertions("assertions", runtime);
+    test::TempDir runtime("bx-assertions");
+    RunningInstances assertions("assertions", runtime.path());
     ProcessAssertions wardend(assertions);
     pid_t busy = startSleeper();
     pid_t finished = startSleeper();
@@ -209,7 +201,6 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     waitpid(busy, nullptr, 0);
     EXPECT_TRUE(wardend.busyExtensionInstances({"com.example.greeter.hello"}).empty());
     EXPECT_FALSE(plugIn->checkBusy(wardend));
-    fs::remove_all(runtime);
 }
 
 }  // namespace

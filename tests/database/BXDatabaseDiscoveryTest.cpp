@@ -95,8 +95,6 @@ class BXDatabaseDiscoveryTest : public ::testing::Test {
   protected:
     void SetUp() override {
         root_ = dir_.path();
-        stateDir_.emplace("BX_STATE_DIR", (root_ / "state").string());
-        runtimeDir_.emplace("BX_RUNTIME_DIR", (root_ / "runtime").string());
         workspace_ = std::make_shared<ScriptedWorkspace>();
         database_ = BXDatabase::create((root_ / "annotations.vrec").string(), workspace_, [](std::string_view) {});
         ASSERT_NE(database_, nullptr);
@@ -133,9 +131,8 @@ class BXDatabaseDiscoveryTest : public ::testing::Test {
         storeElection("com.example.two", Value::int64(2));
     }
 
-    test::TempDir dir_{"bxdiscovery-test"};
+    test::DaemonDirs dir_{"bxdiscovery-test"};
     fs::path root_;
-    std::optional<test::ScopedEnv> stateDir_, runtimeDir_;
     std::shared_ptr<ScriptedWorkspace> workspace_;
     std::unique_ptr<BXDatabase> database_;
 };

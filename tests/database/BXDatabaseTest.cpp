@@ -42,7 +42,8 @@ class RecordingDelegate : public BXDatabaseDelegate {
     bool calledInsideSync_ = false;
 };
 
-// A database over a registry in a private state directory, with copies of the example bundles to register.
+// A database over a registry in private daemon directories (the annotation store looks for a legacy document under
+// the state directory), with copies of the example bundles to register.
 class BXDatabaseTest : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -50,9 +51,6 @@ class BXDatabaseTest : public ::testing::Test {
         fs::create_directories(root_ / "bundles");
         for (const char* bundle : {"Greeter.app", "Notes.app", "Misconfigured.app", "OutsideApplication.bxplugin"})
             fs::copy(kExamples / bundle, root_ / "bundles" / bundle, fs::copy_options::recursive);
-        // The annotation store looks for a legacy document in the daemon's container under the state dir.
-        stateDir_.emplace("BX_STATE_DIR", (root_ / "state").string());
-        runtimeDir_.emplace("BX_RUNTIME_DIR", (root_ / "runtime").string());
         open();
     }
     void TearDown() override {
@@ -98,9 +96,8 @@ class BXDatabaseTest : public ::testing::Test {
         return root ? root->get("data") : Value();
     }
 
-    test::TempDir dir_{"bxdatabase-test"};
+    test::DaemonDirs dir_{"bxdatabase-test"};
     fs::path root_;
-    std::optional<test::ScopedEnv> stateDir_, runtimeDir_;
     std::shared_ptr<LedgerixWorkspace> workspace_;
     std::unique_ptr<BXDatabase> database_;
     std::unique_ptr<RecordingDelegate> delegate_;

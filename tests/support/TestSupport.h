@@ -83,6 +83,24 @@ class ScopedEnv {
     std::optional<std::string> old_;
 };
 
+// A private root with the directories a daemon uses (service, state, runtime, entitlements), each named by its
+// environment variable for the test's lifetime.
+class DaemonDirs {
+  public:
+    explicit DaemonDirs(const std::string& prefix) : root_(prefix) {
+        for (const char* dir : {"service", "state", "runtime", "entitlements"}) fs::create_directories(root_ / dir);
+    }
+    const fs::path& path() const { return root_.path(); }
+    fs::path operator/(const fs::path& relative) const { return root_ / relative; }
+
+  private:
+    TempDir root_;
+    ScopedEnv service_{"BX_SERVICE_DIR", (root_ / "service").string()};
+    ScopedEnv state_{"BX_STATE_DIR", (root_ / "state").string()};
+    ScopedEnv runtime_{"BX_RUNTIME_DIR", (root_ / "runtime").string()};
+    ScopedEnv entitlements_{"BX_ENTITLEMENTS_DIR", (root_ / "entitlements").string()};
+};
+
 // Makes one named call fail with a given errno (after `afterCalls` successful ones), otherwise makes the real
 // calls; writes are cut to 4 KiB so that writers must loop over short writes.
 class FailingFileSystem : public Document::FileSystem {
