@@ -9,6 +9,7 @@
 #include <thread>
 #include <vector>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "model/BXBundle.h"
 #include "platform/log/CaptureSink.h"
@@ -22,7 +23,7 @@ const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 
 std::string real(const fs::path& path) { return fs::canonical(path).string(); }
 
-Value dict(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
+using test::dict;
 
 // "file://" and the path with every byte outside a small safe set percent-encoded.
 std::string fileURL(const std::string& path) {
@@ -103,9 +104,8 @@ TEST(BXBundleConstruction, ExecutableDeepInsideAPlugInGivesThePlugIn) {
 }
 
 TEST(BXBundleConstruction, URLsAreDecodedOnlyWhenTheyAreFileURLs) {
-    std::string pattern = (fs::temp_directory_path() / "bexil-url-XXXXXX").string();
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    fs::path dir = fs::canonical(pattern) / "With Space%41.app";
+    test::TempDir root("bexil-url");
+    fs::path dir = root / "With Space%41.app";
     fs::create_directories(dir);
     EXPECT_EQ(BXBundle::initWithURL(fileURL(dir.string()))->path(), dir.string());
     EXPECT_EQ(BXBundle::initWithURL("file://localhost" + fileURL(dir.string()).substr(7))->path(), dir.string());
@@ -113,7 +113,6 @@ TEST(BXBundleConstruction, URLsAreDecodedOnlyWhenTheyAreFileURLs) {
     EXPECT_EQ(BXBundle::initWithURL(dir.string())->path(), dir.string());
     // A URL naming another host is no local path.
     EXPECT_FALSE(BXBundle::initWithURL("file://elsewhere" + dir.string())->path());
-    fs::remove_all(fs::canonical(pattern));
 }
 
 TEST(BXBundleConstruction, OnlyAMissingPlatformBundleGivesNoObject) {
@@ -151,22 +150,13 @@ TEST(BXBundleQueries, MissingPathAnswersNothingAndLogsWhyItHasNoInformation) {
 
 class BXBundleFileTest : public ::testing::Test {
 protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bexil-bxbundle-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        root_ = fs::canonical(pattern);
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(root_, ec);
-    }
-    fs::path root_;
+    test::TempDir tmp_{"bexil-bxbundle"};
+    fs::path root_ = tmp_.path();
 };
 
-TEST_F(BXBundleFileTest, MalformedInformationIsLoggedAsNotRetrieved) {
+TEST_F(BXBundleFileTest, MalformedInformationIsLoggedAsNotRetrievedAndANonDictionaryAsNotConverted) {
     fs::path bundle = root_ / "Broken.app";
-    fs::create_directories(bundle);
-    std::ofstream(bundle / "Info.vrec") << "<vrec><dict><key>BDBundleIdentifier</key>";
+    test::writeText(bundle / "Info.vrec", "<vrec><dict><key>BDBundleIdentifier</key>");
     log::CaptureSink capture;
     auto broken = BXBundle::initWithPath(bundle.string());
     EXPECT_EQ(broken->path(), bundle.string());
@@ -176,22 +166,21 @@ TEST_F(BXBundleFileTest, MalformedInformationIsLoggedAsNotRetrieved) {
     auto entry = capture.find("failed to retrieve Info.vrec for " + bundle.string() + " through <bundle ");
     ASSERT_TRUE(entry);
     EXPECT_NE(entry->message.find("BexilDocument"), std::string::npos) << entry->message;
-}
 
-TEST_F(BXBundleFileTest, InformationThatIsNotADictionaryIsLoggedAsNotConverted) {
-    fs::path bundle = root_ / "Listed.app";
-    fs::create_directories(bundle);
-    ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", Value::array({Value::string("x")})));
-    log::CaptureSink capture;
-    auto listed = BXBundle::initWithPath(bundle.string());
+    // Information that is not a dictionary is logged as not converted, not as not retrieved.
+    fs::path listedPath = root_ / "Listed.app";
+    fs::create_directories(listedPath);
+    ASSERT_FALSE(Document::writeFileAtomically(listedPath / "Info.vrec", Value::array({Value::string("x")})));
+    capture.clear();
+    auto listed = BXBundle::initWithPath(listedPath.string());
     EXPECT_FALSE(listed->bundleIdentifier());
     EXPECT_FALSE(listed->infoDictionary());
     EXPECT_EQ(capture.count("failed to retrieve"), 0u);
     auto entries = capture.matching("failed to convert Info.vrec to dictionary: ");
     ASSERT_EQ(entries.size(), 1u);
     EXPECT_EQ(entries[0].level, log::Level::Info);
-    EXPECT_EQ(entries[0].message, "failed to convert Info.vrec to dictionary: " + bundle.string() + " source=<bundle " +
-                                      bundle.string() + ">");
+    EXPECT_EQ(entries[0].message, "failed to convert Info.vrec to dictionary: " + listedPath.string() +
+                                      " source=<bundle " + listedPath.string() + ">");
 }
 
 TEST_F(BXBundleFileTest, IdentifierMustBeAString) {
@@ -243,7 +232,7 @@ TEST(BXBundleQueries, PathsFollowTheSupportDirectoryNotTheBundlePath) {
     EXPECT_EQ(bundle->bundle(), fake);
 }
 
-TEST(BXBundleQueries, SupportPathIsAskedOnceAndKeptEvenWhenAbsent) {
+TEST(BXBundleQueries, SupportPathIsAskedOnceAndKeptEvenWhenAbsentAndConcurrentFirstUsesAgree) {
     auto fake = std::make_shared<FakeBundle>();
     fake->support = "/s";
     auto bundle = BXBundle::initWithZEMBundle(fake);
@@ -259,9 +248,7 @@ TEST(BXBundleQueries, SupportPathIsAskedOnceAndKeptEvenWhenAbsent) {
     none->support = "/late";
     EXPECT_FALSE(empty->plugInsPath());
     EXPECT_EQ(none->supportQueries.load(), 1);
-}
 
-TEST(BXBundleQueries, ConcurrentFirstUsesOfSupportPathAgree) {
     for (int round = 0; round < 20; ++round) {
         auto fake = std::make_shared<FakeBundle>();
         fake->support = "/support/" + std::to_string(round);

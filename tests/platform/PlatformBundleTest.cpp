@@ -12,6 +12,7 @@
 #include <string>
 #include <vector>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/bundles/DirectoryBundle.h"
 
@@ -26,23 +27,14 @@ const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kMainBundleVariable = "BX_TEST_EXPECTED_MAIN_BUNDLE";
 constexpr int kProbePassed = 42;
 
-Value dict(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
+using test::dict;
+using test::writeText;
 
 std::string real(const fs::path& path) { return fs::canonical(path).string(); }
 
 // A fresh directory under the system's temporary directory, removed with everything in it afterwards.
 class BundleDirectoryTest : public ::testing::Test {
 protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bexil-bundle-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        root_ = fs::canonical(pattern);
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(root_, ec);
-    }
-
     fs::path makeDirectory(const fs::path& relative) {
         fs::create_directories(root_ / relative);
         return root_ / relative;
@@ -50,10 +42,6 @@ protected:
     void writeInfo(const fs::path& bundle, const Value& info) {
         fs::create_directories(bundle);
         ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", info).has_value());
-    }
-    void writeText(const fs::path& file, const std::string& text) {
-        fs::create_directories(file.parent_path());
-        std::ofstream(file, std::ios::binary) << text;
     }
     void writeExecutable(const fs::path& file) {
         writeText(file, "#!/bin/sh\nexit 0\n");
@@ -76,7 +64,8 @@ protected:
         EXPECT_FALSE(bundle.infoDictionary());
     }
 
-    fs::path root_;
+    test::TempDir tmp_{"bexil-bundle"};
+    fs::path root_ = tmp_.path();
 };
 
 TEST_F(BundleDirectoryTest, ExampleApplicationAnswersItsRootExecutableAndInformation) {
@@ -101,14 +90,12 @@ TEST_F(BundleDirectoryTest, RelativeAndUnnormalisedPathsReportTheRealRoot) {
     EXPECT_EQ(dotted->stringProperty(BundleStringProperty::BundlePath), (root_ / "Real.app").string());
 }
 
-TEST_F(BundleDirectoryTest, BundleWithoutExecutableKeyHasNoExecutable) {
+TEST_F(BundleDirectoryTest, BundleWithoutExecutableKeyOrInformationHasNoExecutable) {
     auto data = DirectoryBundle::create(kExamples / "Notes.app/PlugIns/Stationery.bxplugin", BundleLookup::Directory);
     EXPECT_TRUE(data->stringProperty(BundleStringProperty::BundlePath));
     EXPECT_FALSE(data->stringProperty(BundleStringProperty::ExecutablePath));
     EXPECT_TRUE(data->infoDictionary());
-}
-
-TEST_F(BundleDirectoryTest, DirectoryWithoutInfoIsABundleWithoutInformation) {
+    // A directory without Info.vrec is a bundle without information.
     fs::path plain = makeDirectory("Plain");
     auto bundle = DirectoryBundle::create(plain, BundleLookup::Directory);
     EXPECT_EQ(bundle->stringProperty(BundleStringProperty::BundlePath), plain.string());
@@ -139,7 +126,7 @@ TEST_F(BundleDirectoryTest, PathsThatNameNoBundleAnswerNothing) {
     EXPECT_NE(file->description().find("not a directory"), std::string::npos);
 }
 
-TEST_F(BundleDirectoryTest, UnreadableInformationLeavesTheBundleWithoutItAndSaysWhy) {
+TEST_F(BundleDirectoryTest, UnreadableInformationLeavesTheBundleWithoutItAndSaysWhyAndOtherRootsAreHandedOverAsRead) {
     fs::path malformed = makeDirectory("Malformed.app");
     writeText(malformed / "Info.vrec", "<vrec><dict><key>BDBundleIdentifier</key></dict>");
     auto bundle = DirectoryBundle::create(malformed, BundleLookup::Directory);
@@ -157,13 +144,11 @@ TEST_F(BundleDirectoryTest, UnreadableInformationLeavesTheBundleWithoutItAndSays
     auto notFile = DirectoryBundle::create(folder.parent_path(), BundleLookup::Directory);
     EXPECT_FALSE(notFile->infoDictionary());
     EXPECT_NE(notFile->problem().find("not a regular file"), std::string::npos);
-}
 
-TEST_F(BundleDirectoryTest, InformationThatIsNotADictionaryIsHandedOverAsRead) {
-    fs::path bundle = root_ / "List.app";
-    writeInfo(bundle, Value::array({Value::string("BDBundleExecutable"), Value::string("tool")}));
-    writeExecutable(bundle / "tool");
-    auto list = DirectoryBundle::create(bundle, BundleLookup::Directory);
+    fs::path listed = root_ / "List.app";
+    writeInfo(listed, Value::array({Value::string("BDBundleExecutable"), Value::string("tool")}));
+    writeExecutable(listed / "tool");
+    auto list = DirectoryBundle::create(listed, BundleLookup::Directory);
     ASSERT_TRUE(list->infoDictionary());
     EXPECT_TRUE(list->infoDictionary()->isArray());
     EXPECT_FALSE(list->stringProperty(BundleStringProperty::ExecutablePath));
@@ -290,9 +275,7 @@ TEST(MainBundle, IsTheBundleThatNamesTheRunningProgram) {
     // This program itself lies in no bundle.
     EXPECT_FALSE(DirectoryBundle::createMain()->stringProperty(BundleStringProperty::BundlePath));
 
-    std::string pattern = (fs::temp_directory_path() / "bexil-main-XXXXXX").string();
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    fs::path root = fs::canonical(pattern);
+    test::TempDir root("bexil-main");
     fs::path bundle = root / "Probe.app";
     fs::create_directories(bundle / "bin");
     ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec",
@@ -314,7 +297,6 @@ TEST(MainBundle, IsTheBundleThatNamesTheRunningProgram) {
     int status = 0;
     ASSERT_EQ(waitpid(pid, &status, 0), pid);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == kProbePassed) << "status " << status;
-    fs::remove_all(root);
 }
 
 }  // namespace
