@@ -3,6 +3,7 @@
 
 #include <filesystem>
 
+#include "TestSupport.h"
 #include "model/BXSandboxExtension.h"
 #include "platform/sandbox/SandboxExtensions.h"
 
@@ -14,17 +15,14 @@ namespace fs = std::filesystem;
 class BXSandboxExtensionTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/sandbox-extension-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
         sandbox_ = std::make_unique<SandboxExtensions>(root_ / "extension-key");
         auto issued = sandbox_->issueFileExtension(SandboxExtensions::kReadOnlyClass, root_.string());
         ASSERT_TRUE(issued);
         token_ = *issued;
     }
-    void TearDown() override { fs::remove_all(root_); }
 
-    fs::path root_;
+    test::TempDir tmp_{"sandbox-extension-test"};
+    fs::path root_ = tmp_.path();
     std::unique_ptr<SandboxExtensions> sandbox_;
     std::string token_;
 };

@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "TestSupport.h"
 #include "platform/sandbox/ProcessSandbox.h"
 
 namespace bexil {
@@ -16,15 +17,11 @@ namespace fs = std::filesystem;
 class ProcessSandboxTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/bxsandbox-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = pattern;
         fs::create_directories(root_ / "namespaces");
         std::ofstream(root_ / "namespaces" / "ours") << "";
         std::ofstream(root_ / "namespaces" / "theirs") << "";
         process("self", "0", "ours");
     }
-    void TearDown() override { fs::remove_all(root_); }
 
     void process(const std::string& name, const std::string& seccomp, const std::string& space) {
         fs::path dir = root_ / name;
@@ -35,7 +32,8 @@ class ProcessSandboxTest : public ::testing::Test {
         fs::create_symlink(root_ / "namespaces" / space, dir / "ns" / "user");
     }
 
-    fs::path root_;
+    test::TempDir tmp_{"bxsandbox-test"};
+    fs::path root_ = tmp_.path();
 };
 
 TEST_F(ProcessSandboxTest, PlainProcessInOurNamespaceIsNotSandboxed) {

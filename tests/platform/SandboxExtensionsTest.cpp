@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "TestSupport.h"
 #include "platform/sandbox/SandboxExtensions.h"
 
 namespace bexil {
@@ -16,17 +17,13 @@ namespace fs = std::filesystem;
 class SandboxExtensionsTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        char pattern[] = "/tmp/sandbox-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        root_ = fs::canonical(pattern);
-        fs::create_directories(root_ / "bundle" / "Resources");
-        std::ofstream(root_ / "bundle" / "Resources" / "a.txt") << "a";
+        test::writeText(root_ / "bundle" / "Resources" / "a.txt", "a");
     }
-    void TearDown() override { fs::remove_all(root_); }
 
     fs::path keyPath() const { return root_ / "runtime" / "sandbox" / "extension-key"; }
 
-    fs::path root_;
+    test::TempDir tmp_{"sandbox-test"};
+    fs::path root_ = tmp_.path();
 };
 
 TEST_F(SandboxExtensionsTest, IssuedTokenNamesTheCanonicalPathAndIsConsumable) {
