@@ -58,7 +58,7 @@ TEST(LogLevelTest, NamesAndJournalPriorities) {
     EXPECT_EQ(journalPriority(Level::Fault), 2);
 }
 
-TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndFormatted) {
+TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndFormattedAndAnUnknownOneMeansInfoReportedOnce) {
     LogRegistry registry("error");
     EXPECT_EQ(registry.threshold(), Level::Error);
     EXPECT_FALSE(registry.ops().enabled(Level::Info));
@@ -74,14 +74,12 @@ TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndFormatted) {
     EXPECT_EQ(LogRegistry("").threshold(), Level::Info);
     EXPECT_EQ(LogRegistry("debug").threshold(), Level::Debug);
     EXPECT_EQ(LogRegistry("fault").threshold(), Level::Fault);
-}
 
-TEST(LogThresholdTest, UnknownSettingMeansInfoAndIsReportedOnce) {
     CaptureSink capture;
-    LogRegistry registry("loud");
-    EXPECT_EQ(registry.threshold(), Level::Info);
-    registry.ops().info("first");
-    registry.traffic().info("second");
+    LogRegistry loud("loud");
+    EXPECT_EQ(loud.threshold(), Level::Info);
+    loud.ops().info("first");
+    loud.traffic().info("second");
     auto reports = capture.matching("BXD_LOG_LEVEL");
     ASSERT_EQ(reports.size(), 1u);
     EXPECT_EQ(reports[0].level, Level::Error);
@@ -202,29 +200,14 @@ TEST(LogRegistryTest, ChannelsAreCreatedTogetherOnceOnFirstUse) {
     LogRegistry registry(nullptr, counting);
     EXPECT_EQ(made.load(), 0);  // nothing before the first use
 
+    Channel& (LogRegistry::*const channels[])() = {&LogRegistry::ops, &LogRegistry::traffic,
+                                                      &LogRegistry::extension, &LogRegistry::lx};
     std::vector<std::thread> threads;
     std::vector<Channel*> seen(8);
-    for (int t = 0; t < 8; ++t) {
-        threads.emplace_back([&, t] {
-            switch (t % 4) {
-                case 0:
-                    seen[static_cast<size_t>(t)] = &registry.ops();
-                    break;
-                case 1:
-                    seen[static_cast<size_t>(t)] = &registry.traffic();
-                    break;
-                case 2:
-                    seen[static_cast<size_t>(t)] = &registry.extension();
-                    break;
-                default:
-                    seen[static_cast<size_t>(t)] = &registry.lx();
-                    break;
-            }
-        });
-    }
+    for (size_t t = 0; t < 8; ++t) threads.emplace_back([&, t] { seen[t] = &(registry.*channels[t % 4])(); });
     for (auto& th : threads) th.join();
     EXPECT_EQ(made.load(), 4);
-    for (int t = 0; t < 4; ++t) EXPECT_EQ(seen[static_cast<size_t>(t)], seen[static_cast<size_t>(t + 4)]);
+    for (size_t t = 0; t < 4; ++t) EXPECT_EQ(seen[t], seen[t + 4]);
     EXPECT_EQ(registry.ops().category(), "ops");
     EXPECT_EQ(registry.traffic().category(), "traffic");
     EXPECT_EQ(registry.extension().category(), "extension");
