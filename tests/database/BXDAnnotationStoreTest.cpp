@@ -147,7 +147,7 @@ TEST_F(AnnotationStoreTest, MissingOrNonNumericVersionCountsAsZeroAndMissingData
     EXPECT_TRUE(capture_.matching("unable to").empty());
 }
 
-TEST_F(AnnotationStoreTest, CorruptOrTruncatedDocumentsAreLoggedAndReset) {
+TEST_F(AnnotationStoreTest, CorruptTruncatedOrUnreadableDocumentsAreLoggedAndReset) {
     put(path_, document(dict({{"a", dict({{"election", integer(1)}, {"extension", dict({{"x", integer(9)}})}})}})));
     std::string good = text(path_);
     struct Case {
@@ -176,13 +176,12 @@ TEST_F(AnnotationStoreTest, CorruptOrTruncatedDocumentsAreLoggedAndReset) {
         annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
         EXPECT_EQ(onDisk(), document(dict({{"b", dict({{"election", integer(1)}})}}))) << c.name;
     }
-}
 
-TEST_F(AnnotationStoreTest, UnreadableDocumentIsLoggedWithItsPosixError) {
+    fs::remove(path_);
     fs::create_directories(path_);  // a directory where the file should be
-    BXDAnnotationStore annotations(store());
+    BXDAnnotationStore unreadable(store());
     EXPECT_TRUE(capture_.contains("error:Error Domain=POSIX Code=" + std::to_string(EISDIR)));
-    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
+    EXPECT_EQ(unreadable.annotations(), Value::emptyDictionary());
 }
 
 TEST_F(AnnotationStoreTest, LoadFailureLeavesTheMapUnchanged) {
@@ -206,7 +205,14 @@ TEST_F(AnnotationStoreTest, LoadFailureLeavesTheMapUnchanged) {
 
 // ---- the legacy document ----
 
-TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedWhenThereIsNoDocument) {
+TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedWhenThereIsNoDocumentAndItHasTheCurrentVersion) {
+    put(legacyPath_, document(dict({{"legacy", Value::emptyDictionary()}}), 15));
+    {
+        BXDAnnotationStore other(store());
+        EXPECT_EQ(other.annotations(), Value::emptyDictionary());
+        EXPECT_FALSE(capture_.contains("migrating"));
+        EXPECT_FALSE(fs::exists(path_));
+    }
     Value legacy = dict({{"com.example.old", dict({{"election", integer(1)}, {"keep", Value::string("me")}})}});
     put(legacyPath_, document(legacy));
     std::string legacyText = text(legacyPath_);
@@ -242,14 +248,6 @@ TEST_F(AnnotationStoreTest, LegacyDocumentReplacesABadDocumentAndIsIgnoredBeside
     BXDAnnotationStore annotations(store());
     EXPECT_EQ(annotations.annotations(), current);
     EXPECT_FALSE(capture_.contains("migrating"));
-}
-
-TEST_F(AnnotationStoreTest, LegacyDocumentOfAnotherVersionIsNotMigrated) {
-    put(legacyPath_, document(dict({{"legacy", Value::emptyDictionary()}}), 15));
-    BXDAnnotationStore annotations(store());
-    EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
-    EXPECT_FALSE(capture_.contains("migrating"));
-    EXPECT_FALSE(fs::exists(path_));
 }
 
 TEST_F(AnnotationStoreTest, UnsavableMigrationIsLoggedAndServedFromMemory) {

@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "database/BXDUserPrefs.h"
 #include "platform/prefs/PreferencesStore.h"
@@ -19,13 +20,6 @@ Value rule(const char* key, const char* pattern) { return Value::dictionary({{ke
 
 class BXDUserPrefsTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "bx-userprefs-XXXXXX").string();
-        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-        directory_ = pattern;
-    }
-    void TearDown() override { fs::remove_all(directory_); }
-
     // Sets "exclusions" the way an administrator's tool does, from another process.
     void setExclusionsElsewhere(const Value& value) {
         pid_t pid = fork();
@@ -39,21 +33,15 @@ class BXDUserPrefsTest : public ::testing::Test {
         ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
     }
 
-    fs::path directory_;
+    test::TempDir directory_{"bx-userprefs"};
 };
 
-TEST_F(BXDUserPrefsTest, AbsentPreferenceIsNullAndExcludesNothing) {
+TEST_F(BXDUserPrefsTest, AbsentPreferenceIsNullAndAChangeMadeByAnotherProcessIsSeenByTheSameObject) {
     PreferencesStore store(directory_, "host");
     BXDUserPrefs prefs(store);
     EXPECT_STREQ(prefs.domain(), "com.quorvel.bexil.userprefs");
     EXPECT_TRUE(prefs.exclusions().isNull());
     EXPECT_TRUE(BXDUserPrefs::exclusionRuleSets(prefs.exclusions()).empty());
-}
-
-TEST_F(BXDUserPrefsTest, ChangeMadeByAnotherProcessIsSeenByTheSameObject) {
-    PreferencesStore store(directory_, "host");
-    BXDUserPrefs prefs(store);
-    EXPECT_TRUE(prefs.exclusions().isNull());
 
     Value first = Value::array({rule("RZExtensionPointIdentifier", "com.example.ads")});
     setExclusionsElsewhere(first);
@@ -65,12 +53,8 @@ TEST_F(BXDUserPrefsTest, ChangeMadeByAnotherProcessIsSeenByTheSameObject) {
 
     setExclusionsElsewhere(Value::null());
     EXPECT_TRUE(prefs.exclusions().isNull());
-}
 
-// The preference is handed over exactly as stored; deciding what a strange shape means is left to the caller.
-TEST_F(BXDUserPrefsTest, StoredValueIsReturnedUnchecked) {
-    PreferencesStore store(directory_, "host");
-    BXDUserPrefs prefs(store);
+    // The preference is handed over exactly as stored; what a strange shape means is the caller's call.
     setExclusionsElsewhere(Value::string("everything"));
     EXPECT_EQ(prefs.exclusions(), Value::string("everything"));
 }

@@ -53,6 +53,7 @@ class TempDir {
     TempDir(const TempDir&) = delete;
     TempDir& operator=(const TempDir&) = delete;
     const fs::path& path() const { return path_; }
+    operator const fs::path&() const { return path_; }
     fs::path operator/(const fs::path& relative) const { return path_ / relative; }
 
   private:
