@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/codesign/CodeSigningIdentity.h"
 #include "platform/codesign/EntitlementsDirectory.h"
@@ -25,8 +26,6 @@ std::string selfExecutable() { return fs::read_symlink("/proc/self/exe").string(
 class CodeSigningIdentityTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        root_ = fs::temp_directory_path() / ("bx-codesign-" + std::to_string(getpid()));
-        fs::remove_all(root_);
         fs::create_directories(root_ / "entitlements.d");
         chmod(root_.c_str(), 0755);
         chmod((root_ / "entitlements.d").c_str(), 0755);
@@ -38,10 +37,7 @@ class CodeSigningIdentityTest : public ::testing::Test {
         ASSERT_EQ(bind(listener_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
         ASSERT_EQ(listen(listener_, 8), 0);
     }
-    void TearDown() override {
-        close(listener_);
-        fs::remove_all(root_);
-    }
+    void TearDown() override { close(listener_); }
 
     fs::path entitlementsDir() const { return root_ / "entitlements.d"; }
 
@@ -71,7 +67,8 @@ class CodeSigningIdentityTest : public ::testing::Test {
         return child;
     }
 
-    fs::path root_;
+    test::TempDir tmp_{"bx-codesign"};
+    fs::path root_ = tmp_.path();
     std::string socketPath_;
     int listener_ = -1;
 };
