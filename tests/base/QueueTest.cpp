@@ -175,7 +175,7 @@ TEST(SerialQueueTest, TenThousandQueuesShareAFewThreads) {
     EXPECT_LE(processThreadCount(), threadsBefore + 4);
 }
 
-TEST(SerialQueueTest, AsyncAfterNeverFiresEarlyAndStaysInOrder) {
+TEST(SerialQueueTest, AsyncAfterNeverFiresEarlyAndAsyncNeverRunsOnTheCallersStack) {
     EventLoop loop(1);
     SerialQueue queue("timers", loop);
     constexpr auto kDelay = 50ms;
@@ -200,18 +200,14 @@ TEST(SerialQueueTest, AsyncAfterNeverFiresEarlyAndStaysInOrder) {
     EXPECT_GE(fired.get_future().get() - submitted, kDelay);
     ASSERT_EQ(order.size(), 3u);
     EXPECT_EQ(order.back(), "late");
-}
 
-TEST(SerialQueueTest, AsyncNeverRunsTheBlockOnTheCallersStack) {
-    EventLoop loop(1);
-    SerialQueue queue("reentry", loop);
-    std::vector<int> order;
+    std::vector<int> reentry;
     queue.sync([&] {
-        queue.async([&] { order.push_back(2); });
-        order.push_back(1);
+        queue.async([&] { reentry.push_back(2); });
+        reentry.push_back(1);
     });
     queue.sync([] {});  // everything submitted before has run
-    EXPECT_EQ(order, (std::vector<int>{1, 2}));
+    EXPECT_EQ(reentry, (std::vector<int>{1, 2}));
 }
 
 // ---- dispatch -------------------------------------------------------------------------------------------------------
@@ -382,7 +378,7 @@ TEST(SerialQueueTest, DestroyingTheLoopDropsPendingBlocksWithoutRunningThem) {
     EXPECT_FALSE(ran.load());
 }
 
-TEST(EventLoopTest, RunOnCurrentThreadRunsWorkHereUntilStopped) {
+TEST(EventLoopTest, RunOnCurrentThreadRunsWorkHereUntilStoppedFromThereOrAnotherThread) {
     EventLoop loop(0);
     SerialQueue queue("main", loop);
     const auto caller = std::this_thread::get_id();
@@ -407,17 +403,15 @@ TEST(EventLoopTest, RunOnCurrentThreadRunsWorkHereUntilStopped) {
     for (auto id : ranOn) EXPECT_EQ(id, caller);
     EXPECT_EQ(loop.runningThreadCount(), 0u);
     loop.runOnCurrentThread();  // a stopped loop stays stopped: returns at once
-}
 
-TEST(EventLoopTest, StopFromAnotherThreadEndsRunOnCurrentThread) {
-    EventLoop loop(0);
+    EventLoop other(0);
     std::thread stopper([&] {
-        while (loop.runningThreadCount() == 0) std::this_thread::sleep_for(1ms);
-        loop.stop();
+        while (other.runningThreadCount() == 0) std::this_thread::sleep_for(1ms);
+        other.stop();
     });
-    loop.runOnCurrentThread();
+    other.runOnCurrentThread();
     stopper.join();
-    EXPECT_TRUE(loop.isStopped());
+    EXPECT_TRUE(other.isStopped());
 }
 
 TEST(EventLoopTest, SharedLoopRunsQueuesOnItsOwnThread) {
