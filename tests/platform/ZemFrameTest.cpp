@@ -137,16 +137,14 @@ TEST(ZemFrame, EncodeRefusesNonDictionariesBadSerialsAndOversizedPayloads) {
     EXPECT_EQ(frame.size(), ZemFrame::kMaxFrameBytes);
 }
 
-TEST(ZemFrame, PayloadThatIsNotADictionaryIsAProtocolError) {
+TEST(ZemFrame, PayloadThatIsNotADictionaryIsAProtocolErrorAndDescriptionsNameKindSerialsAndSize) {
     ZemFrame frame({ZemFrameKind::Message, 1, 0, 2}, Bytes{0x0A, 0x00});
     Result<Value> v = frame.decodePayload();
     ASSERT_FALSE(v.ok());
     EXPECT_TRUE(isZemError(v.error(), ZemErrorCode::NotDictionary));
     ZemFrame broken({ZemFrameKind::Message, 1, 0, 1}, Bytes{0x0B});
     EXPECT_TRUE(isZemError(broken.decodePayload().error(), ZemErrorCode::Truncated));
-}
 
-TEST(ZemFrame, DescriptionNamesKindSerialsAndSize) {
     EXPECT_EQ(ZemFrame({ZemFrameKind::Request, 12, 0, 3}, Bytes(3)).description(), "request #12 (3 bytes)");
     EXPECT_EQ(ZemFrame({ZemFrameKind::Reply, 4, 12, 0}, Bytes{}).description(), "reply #4 to #12 (0 bytes)");
 }
