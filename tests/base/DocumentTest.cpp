@@ -130,7 +130,8 @@ TEST(DocumentRoundTrip, NestedContainersOfMixedKindsBigDataAndManyEntries) {
         map.set("com.example.plugin-" + std::to_string(i),
                 dict({{"election", Value::int64(i % 3)}, {"extension", dict({{"n", Value::int64(i)}})}}));
     }
-    Value document = dict({{"version", Value::int64(16)}, {"blob", Value::data(std::move(blob))}, {"data", map.take()}});
+    Value document =
+        dict({{"version", Value::int64(16)}, {"blob", Value::data(std::move(blob))}, {"data", map.take()}});
     EXPECT_EQ(roundTrip(document), document);
 }
 
@@ -451,7 +452,8 @@ TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporary) {
     EXPECT_EQ(*Document::readFile(path_), old);
 }
 
-TEST_F(DocumentFileTest, DirectorySyncFailureIsReportedWithTheNewDocumentInPlaceAndAnUnrepresentableValueTouchesNoFile) {
+TEST_F(DocumentFileTest,
+       DirectorySyncFailureIsReportedWithTheNewDocumentInPlaceAndAnUnrepresentableValueTouchesNoFile) {
     ASSERT_FALSE(Document::writeFileAtomically(path_, Value::int64(1)));
     FailingFileSystem fs("fsync", EIO, 1);  // the file's fsync succeeds, the directory's fails
     std::optional<Error> error = Document::writeFileAtomically(path_, Value::int64(2), fs);

@@ -24,8 +24,7 @@ using Reply = BXDaemonClient::Reply;
 // A service on a private directory that answers every request with `answer` and remembers what it got.
 class CapturingService {
   public:
-    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName)
-        : queue_("capture", loop_) {
+    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName) : queue_("capture", loop_) {
         auto listener = ZemListener::create(service, queue_, nullptr);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;

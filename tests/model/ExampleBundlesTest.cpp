@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "TestSupport.h"
 #include "base/Document.h"
 #include "model/BXBundle.h"
 
@@ -37,13 +38,14 @@ struct Example {
     std::optional<Value> entitlements;
 };
 
-Value str(const char* s) { return Value::string(s); }
-Value dict(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
+using test::dict;
+using test::Entries;
+using test::str;
 
 // The top-level keys every example bundle carries, plus `more`.
 Value bundleInfo(const char* identifier, const char* name, const char* version, std::optional<const char*> executable,
-                 std::vector<std::pair<std::string, Value>> more) {
-    std::vector<std::pair<std::string, Value>> entries = {
+                 Entries more) {
+    Entries entries = {
         {"BDBundleName", str(name)},
         {"BDBundleDisplayName", str(name)},
         {"BDBundleVersion", str("1")},
@@ -55,33 +57,30 @@ Value bundleInfo(const char* identifier, const char* name, const char* version, 
     return dict(std::move(entries));
 }
 
-Value attributes(const char* version, std::vector<std::pair<std::string, Value>> more = {}) {
+Value attributes(const char* version, Entries more = {}) {
     more.emplace_back("RZExtensionVersion", str(version));
     return dict(std::move(more));
 }
 
 // The plug-in dictionary of the mis-configured examples before each loses or gains its one fault. Their point has
 // no SDK, so nothing fills in what they leave out.
-std::vector<std::pair<std::string, Value>> undeclaredPoint(const char* principal) {
+Entries undeclaredPoint(const char* principal) {
     return {{"RZExtensionPointIdentifier", str("com.example.undeclared")},
             {"RZExtensionProtocol", str("GreetingProvider")},
             {"PrincipalClass", str(principal)},
             {"RZExtensionAttributes", attributes("1.0")}};
 }
 
-Value misconfigured(const char* identifier, const char* name, const char* executable,
-                    std::vector<std::pair<std::string, Value>> extension) {
+Value misconfigured(const char* identifier, const char* name, const char* executable, Entries extension) {
     return bundleInfo(identifier, name, "1.0", executable, {{"RZExtension", dict(std::move(extension))}});
 }
 
-std::vector<std::pair<std::string, Value>> without(std::vector<std::pair<std::string, Value>> entries,
-                                                   const std::string& key) {
+Entries without(Entries entries, const std::string& key) {
     std::erase_if(entries, [&](const auto& entry) { return entry.first == key; });
     return entries;
 }
 
-std::vector<std::pair<std::string, Value>> with(std::vector<std::pair<std::string, Value>> entries,
-                                                const std::string& key, Value value) {
+Entries with(Entries entries, const std::string& key, Value value) {
     entries.emplace_back(key, std::move(value));
     return entries;
 }

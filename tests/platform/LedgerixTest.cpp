@@ -694,10 +694,7 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchangedAContainerThatCan
     fs::path good = writePlugIn(bundles_ / "A.app/PlugIns/Good.bxplugin", {.identifier = "com.example.good"});
     auto original = registerOK(good);
     ASSERT_TRUE(original);
-    auto write = [](const fs::path& file, const std::string& text) {
-        fs::create_directories(file.parent_path());
-        std::ofstream(file, std::ios::binary | std::ios::trunc) << text;
-    };
+    const auto write = test::writeText;
     for (const char* name : {"Empty", "ArrayRoot", "NoPlugIn", "StringPlugIn"})
         fs::create_directories(bundles_ / (std::string(name) + ".bxplugin"));
     write(bundles_ / "File.bxplugin", "not a directory");

@@ -200,8 +200,8 @@ TEST(LogRegistryTest, ChannelsAreCreatedTogetherOnceOnFirstUse) {
     LogRegistry registry(nullptr, counting);
     EXPECT_EQ(made.load(), 0);  // nothing before the first use
 
-    Channel& (LogRegistry::*const channels[])() = {&LogRegistry::ops, &LogRegistry::traffic,
-                                                      &LogRegistry::extension, &LogRegistry::lx};
+    Channel& (LogRegistry::*const channels[])() = {&LogRegistry::ops, &LogRegistry::traffic, &LogRegistry::extension,
+                                                   &LogRegistry::lx};
     std::vector<std::thread> threads;
     std::vector<Channel*> seen(8);
     for (size_t t = 0; t < 8; ++t) threads.emplace_back([&, t] { seen[t] = &(registry.*channels[t % 4])(); });

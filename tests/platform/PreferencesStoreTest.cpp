@@ -20,7 +20,6 @@ constexpr const char* kDomain = "com.example.prefs";
 
 class PreferencesStoreTest : public ::testing::Test {
   protected:
-
     // Runs `body` in a child process and waits for it; the child's exit status must be 0.
     template <class F>
     void inChild(F body) {

@@ -16,9 +16,7 @@ namespace fs = std::filesystem;
 
 class SandboxExtensionsTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        test::writeText(root_ / "bundle" / "Resources" / "a.txt", "a");
-    }
+    void SetUp() override { test::writeText(root_ / "bundle" / "Resources" / "a.txt", "a"); }
 
     fs::path keyPath() const { return root_ / "runtime" / "sandbox" / "extension-key"; }
 

@@ -115,7 +115,6 @@ TEST(BXHostAccessPolicyAllow, MalformedHostEntitlementNameRefusesEveryHost) {
 
 class PolicyBundlesTest : public ::testing::Test {
   protected:
-
     // An application bundle directory with an information dictionary.
     fs::path makeApp(const std::string& name, std::optional<std::string> identifier) {
         fs::path app = root_ / name;
