@@ -60,7 +60,8 @@ pid_t BxdProcess::spawn(const std::vector<std::string>& arguments, const std::ve
     for (char** e = environ; *e; ++e) env.emplace_back(*e);
     for (const auto& e : baseEnvironment()) env.push_back(e);
     for (const auto& e : environment) env.push_back(e);
-    std::vector<std::string> args{binary().string()};
+    std::vector<std::string> args = launcher_;
+    args.push_back(binary().string());
     args.insert(args.end(), arguments.begin(), arguments.end());
 
     pid_t child = fork();
