@@ -83,19 +83,18 @@ class SystemPlugInTest : public ::testing::Test {
         setenv("BX_PREFERENCES_DIR", preferences.c_str(), 1);
         bxd_.exportEnvironment();
 
-        std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent",
-                                             "--ro-bind", "/usr", "/usr",
-                                             "--symlink", "usr/lib", "/lib",
-                                             "--symlink", "usr/lib64", "/lib64",
-                                             "--symlink", "usr/bin", "/bin",
-                                             "--symlink", "usr/sbin", "/sbin",
-                                             "--ro-bind", "/etc", "/etc",
-                                             "--proc", "/proc",
-                                             "--dev", "/dev",
-                                             "--bind", root.string(), root.string(),
-                                             "--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR,
-                                             "--ro-bind", system_.string(), "/System",
-                                             "--ro-bind", systemX.string(), "/SystemX"};
+        // Only the system's programs and libraries, this test's temporary root and the build tree, at their own
+        // paths, plus the two directories that stand for /System and /SystemX.
+        std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc", "--dev", "/dev"};
+        auto with = [&launcher](std::initializer_list<std::string> words) { launcher.insert(launcher.end(), words); };
+        with({"--ro-bind", "/usr", "/usr"});
+        with({"--ro-bind", "/etc", "/etc"});
+        for (const char* directory : {"lib", "lib64", "bin", "sbin"})
+            with({"--symlink", std::string("usr/") + directory, std::string("/") + directory});
+        with({"--bind", root.string(), root.string()});
+        with({"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR});
+        with({"--ro-bind", system_.string(), "/System"});
+        with({"--ro-bind", systemX.string(), "/SystemX"});
         // Machines without user namespaces or mount rights cannot make the private root; say so instead of failing.
         std::string probe;
         for (const std::string& word : launcher) probe += quoted(word) + " ";
@@ -110,8 +109,8 @@ class SystemPlugInTest : public ::testing::Test {
             GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << text.str();
         }
         bxd_.setLauncher(std::move(launcher));
-        ASSERT_TRUE(bxd_.start({"-d", (root / "annotations.vrec").string()},
-                               {"BX_PREFERENCES_DIR=" + preferences.string()}))
+        ASSERT_TRUE(
+            bxd_.start({"-d", (root / "annotations.vrec").string()}, {"BX_PREFERENCES_DIR=" + preferences.string()}))
             << bxd_.log();
         client_ = std::make_unique<TestClient>();
     }
@@ -176,7 +175,8 @@ class SystemPlugInTest : public ::testing::Test {
 TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplications) {
     // A link planted in /System that leads out of it does not make a system plug-in: residence is decided on the
     // bundle's real path.
-    fs::create_directory_symlink(bundles_ / "OutsideApplication.bxplugin", system_ / "Library/PlugIns/Planted.bxplugin");
+    fs::create_directory_symlink(bundles_ / "OutsideApplication.bxplugin",
+                                 system_ / "Library/PlugIns/Planted.bxplugin");
     std::string hello = (bundles_ / "Greeter.app/PlugIns/Hello.bxplugin").string();
     add({kSystemClock, hello, "/SystemX/Library/PlugIns/OutsideApplication.bxplugin",
          "/System/Library/PlugIns/Planted.bxplugin"});

@@ -72,9 +72,9 @@ class UninstallTest : public ::testing::Test {
         // This test program is the manager, through the daemon's trusted entitlements directory.
         fs::path file = bxd_.entitlementsDir() / "uninstall-test.vrec";
         ASSERT_FALSE(Document::writeFileAtomically(
-            file, Value::dictionary(
-                      {{"Executable", Value::string(fs::canonical("/proc/self/exe").string())},
-                       {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
+            file,
+            Value::dictionary({{"Executable", Value::string(fs::canonical("/proc/self/exe").string())},
+                               {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
         ASSERT_EQ(chmod(file.c_str(), 0644), 0);
 
         ASSERT_TRUE(bxd_.start({"-d", (bxd_.root() / "annotations.vrec").string()})) << bxd_.log();
@@ -119,10 +119,10 @@ class UninstallTest : public ::testing::Test {
 
     // The UUID of the served plug-in with `identifier`.
     std::string uuidOf(const std::string& identifier) {
-        Value reply = client_->replyTo(Value::dictionary(
-            {{"request", Value::string("match")},
-             {"version", Value::uint64(3)},
-             {"rules", Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}})}}));
+        Value reply = client_->replyTo(
+            Value::dictionary({{"request", Value::string("match")},
+                               {"version", Value::uint64(3)},
+                               {"rules", Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}})}}));
         for (const Value& form : reply.get("matches").items()) return std::string(form.get("uuid").stringView());
         ADD_FAILURE() << "no plug-in " << identifier << " served: " << reply.description();
         return {};
