@@ -31,7 +31,8 @@ using test::TestClient;
 using Ids = std::vector<std::string>;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
-constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8;
+constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
+constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 const std::string kClock = "com.example.system.clock";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kSystemClock = "/System/Library/PlugIns/Clock.bxplugin";
@@ -197,6 +198,17 @@ TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplication
     // The greeting rule matches the system plug-in and the application's; system only keeps the first.
     Value greeting = Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")}});
     EXPECT_EQ(identifiers(client_->replyTo(matchRequest(greeting, kSystemOnly))), (Ids{kClock}));
+    // Privileged discovery ignores the system-only flag, but does not bring the pretenders back.
+    fs::path grant = bxd_.entitlementsDir() / "system-test.vrec";
+    ASSERT_FALSE(Document::writeFileAtomically(
+        grant,
+        Value::dictionary({{"Executable", str(fs::canonical("/proc/self/exe").string())},
+                           {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
+    ASSERT_EQ(chmod(grant.c_str(), 0644), 0);
+    TestClient manager;  // entitlements are read when a client connects
+    Value privileged = manager.replyTo(matchRequest(std::nullopt, kSystemOnly | kDiscoverAll));
+    EXPECT_EQ(errorCode(privileged), 0) << errorText(privileged) << "\n" << bxd_.log();
+    EXPECT_EQ(identifiers(privileged), (Ids{kHello, kClock}));
 
     // Both pretenders were registered and are refused as mis-configured whenever they are looked up.
     for (const std::string& path : {std::string("/SystemX/Library/PlugIns/OutsideApplication.bxplugin"),
