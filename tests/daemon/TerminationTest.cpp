@@ -252,19 +252,21 @@ TEST(ServiceManagerTermination, APidReusedWhileAnotherInstanceEndsIsLeftAlone) {
         const std::string namespaces = "unshare --user --map-root-user --pid --fork --mount-proc ";
         if (std::system((namespaces + "true >/dev/null 2>&1").c_str()) != 0)
             GTEST_SKIP() << "cannot make user and pid namespaces here";
-        int status = std::system((std::string(kInPidNamespace) + "=1 " + namespaces + "'" +
-                                  fs::canonical("/proc/self/exe").string() + "' --gtest_filter=" + name + " >'" +
+        int status = std::system((std::string(kInPidNamespace) + "=" + std::to_string(getpid()) + " " + namespaces +
+                                  "'" + fs::canonical("/proc/self/exe").string() + "' --gtest_filter=" + name + " >'" +
                                   output.string() + "' 2>&1")
                                      .c_str());
         std::ifstream in(output);
         std::stringstream text;
         text << in.rdbuf();
         fs::remove(output);
+        fs::remove_all(fs::temp_directory_path() / ("bx-pid-reuse-" + std::to_string(getpid())));
         EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << text.str();
         return;
     }
 
-    fs::path runtime = fs::temp_directory_path() / ("bx-pid-reuse-" + std::to_string(getppid()));
+    // Named after the process outside, since every run is pid 1 in here.
+    fs::path runtime = fs::temp_directory_path() / ("bx-pid-reuse-" + std::string(getenv(kInPidNamespace)));
     RunningInstances instances("instances", runtime);
     int report[2];
     ASSERT_EQ(pipe2(report, O_CLOEXEC), 0);
