@@ -3,6 +3,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -10,6 +11,7 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <sstream>
 #include <thread>
 
 #include "TestSupport.h"
@@ -201,6 +203,99 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     waitpid(busy, nullptr, 0);
     EXPECT_TRUE(wardend.busyExtensionInstances({"com.example.greeter.hello"}).empty());
     EXPECT_FALSE(plugIn->checkBusy(wardend));
+}
+
+// A plug-in instance that takes a while to end, as one that saves its state does: on SIGTERM it writes its pid to
+// `report`, lingers, then exits.
+pid_t startLingeringInstance(int report) {
+    sigset_t term, previous;
+    sigemptyset(&term);
+    sigaddset(&term, SIGTERM);
+    // Blocked before the fork, so no SIGTERM can reach the child before it waits for one.
+    sigprocmask(SIG_BLOCK, &term, &previous);
+    pid_t parent = getpid();
+    pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (getppid() != parent) _exit(0);
+        int received = 0;
+        sigwait(&term, &received);
+        pid_t self = getpid();
+        if (write(report, &self, sizeof self) != sizeof self) _exit(1);
+        usleep(500 * 1000);
+        _exit(0);
+    }
+    sigprocmask(SIG_SETMASK, &previous, nullptr);
+    return child;
+}
+
+constexpr const char* kInPidNamespace = "BX_TEST_IN_PID_NAMESPACE";
+
+// While the service manager waits for one instance to end, another instance of the same plug-in may end by itself
+// and its pid go to an unrelated process. The record still names the old process (by its start time), so the new
+// one must be left alone. Choosing the next pid needs a pid namespace of one's own, so the test runs itself again
+// as the first process of new user and pid namespaces.
+TEST(ServiceManagerTermination, APidReusedWhileAnotherInstanceEndsIsLeftAlone) {
+    const std::string name = std::string(::testing::UnitTest::GetInstance()->current_test_suite()->name()) + "." +
+                             ::testing::UnitTest::GetInstance()->current_test_info()->name();
+    if (!getenv(kInPidNamespace)) {
+        fs::path output = fs::temp_directory_path() / ("bx-pid-reuse-" + std::to_string(getpid()) + ".txt");
+        const std::string namespaces = "unshare --user --map-root-user --pid --fork --mount-proc ";
+        if (std::system((namespaces + "true >/dev/null 2>&1").c_str()) != 0)
+            GTEST_SKIP() << "cannot make user and pid namespaces here";
+        int status = std::system((std::string(kInPidNamespace) + "=" + std::to_string(getpid()) + " " + namespaces +
+                                  "'" + fs::canonical("/proc/self/exe").string() + "' --gtest_filter=" + name + " >'" +
+                                  output.string() + "' 2>&1")
+                                     .c_str());
+        std::ifstream in(output);
+        std::stringstream text;
+        text << in.rdbuf();
+        fs::remove(output);
+        fs::remove_all(fs::temp_directory_path() / ("bx-pid-reuse-" + std::to_string(getpid())));
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << text.str();
+        return;
+    }
+
+    // Named after the process outside, since every run is pid 1 in here.
+    fs::path runtime = fs::temp_directory_path() / ("bx-pid-reuse-" + std::string(getenv(kInPidNamespace)));
+    RunningInstances instances("instances", runtime);
+    int report[2];
+    ASSERT_EQ(pipe2(report, O_CLOEXEC), 0);
+    pid_t first = startLingeringInstance(report[1]), second = startLingeringInstance(report[1]);
+    SleeperGuard guard{first, second};
+    ASSERT_TRUE(instances.record("com.example.greeter.hello", first));
+    ASSERT_TRUE(instances.record("com.example.greeter.hello", second));
+    // Start times count clock ticks: the process that takes over a pid below must start in a later one.
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+
+    EventLoop loop(1);
+    SerialQueue queue("pid-reuse", loop);
+    std::promise<void> done;
+    ServiceManager(instances).removeExternalService("com.example.greeter.hello", "1", queue,
+                                                    [&done](int) { done.set_value(); });
+
+    // The instance signalled first lingers; meanwhile the other one ends and a new process gets its pid.
+    pollfd readable{report[0], POLLIN, 0};
+    ASSERT_EQ(poll(&readable, 1, 10000), 1) << "no instance was signalled";
+    pid_t signalled = 0;
+    ASSERT_EQ(read(report[0], &signalled, sizeof signalled), static_cast<ssize_t>(sizeof signalled));
+    pid_t ended = signalled == first ? second : first;
+    kill(ended, SIGKILL);
+    waitpid(ended, nullptr, 0);
+    {
+        std::ofstream next("/proc/sys/kernel/ns_last_pid");
+        next << ended - 1;
+    }
+    pid_t successor = startSleeper();
+    SleeperGuard successorGuard{successor};
+    ASSERT_EQ(successor, ended) << "the pid was not reused";
+
+    ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
+    int status = 0;
+    EXPECT_EQ(waitpid(successor, &status, WNOHANG), 0) << "the process that took over the pid was signalled";
+    close(report[0]);
+    close(report[1]);
+    fs::remove_all(runtime);
 }
 
 }  // namespace

@@ -57,10 +57,18 @@ void BxdProcess::exportEnvironment() const {
 
 pid_t BxdProcess::spawn(const std::vector<std::string>& arguments, const std::vector<std::string>& environment) {
     std::vector<std::string> env;
+    // A later entry replaces an earlier one of the same name. Programs read the first of two, and this process's
+    // own environment may still name an earlier test's directories (exportEnvironment() leaves them behind).
+    auto put = [&env](const std::string& entry) {
+        std::string prefix = entry.substr(0, entry.find('=') + 1);
+        std::erase_if(env, [&prefix](const std::string& e) { return e.compare(0, prefix.size(), prefix) == 0; });
+        env.push_back(entry);
+    };
     for (char** e = environ; *e; ++e) env.emplace_back(*e);
-    for (const auto& e : baseEnvironment()) env.push_back(e);
-    for (const auto& e : environment) env.push_back(e);
-    std::vector<std::string> args{binary().string()};
+    for (const auto& e : baseEnvironment()) put(e);
+    for (const auto& e : environment) put(e);
+    std::vector<std::string> args = launcher_;
+    args.push_back(binary().string());
     args.insert(args.end(), arguments.begin(), arguments.end());
 
     pid_t child = fork();

@@ -23,6 +23,9 @@ class BxdProcess {
     // Returns false when it did not come up within `timeout`.
     bool start(const std::vector<std::string>& arguments = {}, const std::vector<std::string>& environment = {},
                std::chrono::milliseconds timeout = std::chrono::seconds(10));
+    // Starts bxd through `command` from now on (a launcher that ends by executing the program and arguments that
+    // follow it, such as a sandbox tool); pid(), stop() and running() then concern the launcher's process.
+    void setLauncher(std::vector<std::string> command) { launcher_ = std::move(command); }
     // Runs bxd to completion (for option errors) and returns its exit status; standard error goes to log().
     int runToExit(const std::vector<std::string>& arguments);
     // Sends `signal` and waits for the process; returns the wait status.
@@ -52,6 +55,7 @@ class BxdProcess {
     std::filesystem::path root_;
     std::filesystem::path logFile_;
     pid_t pid_ = -1;
+    std::vector<std::string> launcher_;
 };
 
 }  // namespace bexil::test

@@ -136,6 +136,7 @@ TEST(BxdService, ASecondDaemonOnTheSameNameFailsAndAStaleSocketIsReplaced) {
     BxdProcess first;
     ASSERT_TRUE(first.start()) << first.log();
     // Same private directories, same name: the live daemon keeps its socket.
+    first.exportEnvironment();
     std::string serviceDir = first.serviceDir().string();
     pid_t second = fork();
     if (second == 0) {
@@ -150,7 +151,6 @@ TEST(BxdService, ASecondDaemonOnTheSameNameFailsAndAStaleSocketIsReplaced) {
     waitpid(second, &status, 0);
     ASSERT_TRUE(WIFEXITED(status));
     EXPECT_EQ(WEXITSTATUS(status), 1);
-    first.exportEnvironment();
     {
         TestClient client;
         EXPECT_EQ(errorCode(client.replyTo(request("bogus"))), 4);

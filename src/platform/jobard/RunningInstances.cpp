@@ -1,11 +1,12 @@
 #include "platform/jobard/RunningInstances.h"
-#include "base/StandardPaths.h"
 
 #include <unistd.h>
 
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
+
+#include "base/StandardPaths.h"
 
 namespace bexil {
 
@@ -64,7 +65,7 @@ std::vector<RunningInstances::Instance> RunningInstances::live(const std::string
             fs::remove(entry.path(), ec);  // the process is gone, or its pid now names another one
             continue;
         }
-        found.push_back(Instance{static_cast<pid_t>(pid), entry.path()});
+        found.push_back(Instance{static_cast<pid_t>(pid), entry.path(), recorded});
     }
     return found;
 }

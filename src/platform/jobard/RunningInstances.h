@@ -19,6 +19,9 @@ class RunningInstances {
     struct Instance {
         pid_t pid;
         std::filesystem::path record;
+        // The start time the record holds: whoever acts on the instance later compares against it, since by then
+        // the pid may name another process.
+        unsigned long long startTime;
     };
 
     // $BX_RUNTIME_DIR, else /run/bexil for root, else $XDG_RUNTIME_DIR/bexil.

@@ -29,11 +29,12 @@ bool waitForExit(int pidfd, std::chrono::milliseconds timeout) {
 }
 
 // Ends one instance: SIGTERM, then SIGKILL after the grace period. Returns 0 or an errno value.
-int terminate(const RunningInstances::Instance& instance, unsigned long long recordedStart) {
+int terminate(const RunningInstances::Instance& instance) {
     int pidfd = pidfdOpen(instance.pid);
     if (pidfd < 0) return errno == ESRCH ? 0 : errno;
-    // The pidfd pins one process; make sure it is still the one the record names before signalling it.
-    if (RunningInstances::startTime(instance.pid) != recordedStart) {
+    // The pidfd pins one process; make sure it is still the one the record names before signalling it. Earlier
+    // instances may have taken seconds to end, time enough for this one to end too and its pid to be reused.
+    if (RunningInstances::startTime(instance.pid) != instance.startTime) {
         close(pidfd);
         return 0;
     }
@@ -63,8 +64,7 @@ void ServiceManager::removeExternalService(const std::string& bundleIdentifier, 
     std::thread([running = std::move(running), queue, completion = std::move(completion)]() mutable {
         int error = 0;
         for (const RunningInstances::Instance& instance : running) {
-            std::optional<unsigned long long> started = RunningInstances::startTime(instance.pid);
-            int result = started ? terminate(instance, *started) : 0;
+            int result = terminate(instance);
             std::error_code ignored;
             std::filesystem::remove(instance.record, ignored);
             if (result != 0 && error == 0) error = result;
