@@ -1,16 +1,28 @@
 // End-to-end load on the real bxd: N client processes each make M blocking round trips through the daemon, and, in
 // the same run, the same number of round trips with equally sized messages through a raw epoll echo server over a
-// Unix stream socket. It prints p50 and p99 round trip and requests per second of both, and bxd's ratio to raw.
+// Unix stream socket. It prints p50 and p99 round trip and requests per second of each, and each one's ratio to raw.
 //
-// The daemon is the real binary, started here in a private temporary service directory. Its clients speak the wire
-// protocol directly (a request frame written with ZemFrame, the reply frame read back), so what is measured is the
-// daemon and the kernel, not a client library. The request names no operation bxd knows, which takes it through the
-// whole path: frame cutting, decoding, the request queue, the envelope checks, the handler table, the error reply
-// and its encoding. The raw side sends as many bytes as bxd's request frame and answers with as many as its reply.
+//     cmake --build --preset release --target bxd bxd_load_bench
+//     build/release/bench/bxd_load_bench [--clients 1,8] [--requests M] [--rounds R] [--mode raw,frames,lib]
+//                                        [--payload BYTES] [--bxd PATH]
+//
+// The daemon is the real binary, started here in a private temporary service directory. It is driven two ways:
+//   frames  the clients speak the wire protocol directly (a request frame written with ZemFrame, the reply frame read
+//           back), so what is measured is the daemon and the kernel, not a client library;
+//   lib     the clients are applications of the shared library libbexil: each holds one DaemonClient and waits for
+//           every reply with its wait(), as a program that needs the answer before going on does. The difference
+//           to "frames" is the library's own cost: building the request, its event-loop thread, the hand-over of
+//           the reply to the waiting thread.
+// Both send the request the library builds for "ready" with no plug-ins, byte for byte the same: bxd answers it
+// without touching a plug-in (the reply it gave is printed with the figures), after the whole path of any request:
+// frame cutting, decoding, the request queue, the envelope checks, the handler table, the reply and its encoding. The
+// raw side sends as many bytes as that request frame and answers with as many as bxd's reply. --payload pads the
+// hand-written request (frames and raw only: the library sends no padding).
 //
 // Clients, the echo server and bxd are all processes forked from this one, so `taskset -c 0 bxd_load_bench ...`
 // pins every one of them to one CPU (the CPU cost alone), while an unpinned run shows what wake-ups across CPUs add.
-// Rounds alternate raw and bxd so that drift in the machine's speed hits both alike.
+// Rounds alternate raw, frames and lib so that drift in the machine's speed hits all alike. The default runs 1 and
+// then 8 clients, each for 3 rounds of 20,000 requests per client and side.
 
 #include <fcntl.h>
 #include <getopt.h>
@@ -37,6 +49,7 @@
 #include <vector>
 
 #include "base/Value.h"
+#include "bexil/DaemonClient.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 
@@ -56,15 +69,32 @@ constexpr auto kStartTimeout = std::chrono::seconds(10);
 // The largest payload a run may ask for; far below the frame limit, and big enough for any realistic request.
 constexpr size_t kMaxPayloadBytes = 1024 * 1024;
 
-enum class Mode { Bxd, Raw, Both };
+// The three ways a round trip is made: through the echo server, through bxd with hand-written frames, through bxd
+// with libbexil.
+enum class Side { Raw, Frames, Library };
+constexpr Side kSides[] = {Side::Raw, Side::Frames, Side::Library};
+
+const char* sideName(Side side) {
+    switch (side) {
+        case Side::Raw:
+            return "raw unix ping-pong";
+        case Side::Frames:
+            return "bxd, hand-written frames";
+        case Side::Library:
+            return "bxd, through libbexil";
+    }
+    return "";
+}
 
 struct Options {
-    unsigned clients = 1;
+    std::vector<unsigned> clients{1, 8};
     unsigned requests = 20000;
-    size_t payload = 64;
+    size_t payload = 0;
     unsigned rounds = 3;
-    Mode mode = Mode::Both;
+    bool sides[3] = {true, true, true};  // indexed by Side
     std::string bxdPath;
+
+    bool wants(Side side) const { return sides[static_cast<int>(side)]; }
 };
 
 [[noreturn]] void die(const char* what) {
@@ -74,8 +104,9 @@ struct Options {
 
 [[noreturn]] void usage() {
     fputs(
-        "Usage: bxd_load_bench [--clients N] [--requests M] [--payload BYTES] [--rounds R] [--mode bxd|raw|both]\n"
-        "                      [--bxd PATH]\n",
+        "Usage: bxd_load_bench [--clients N[,N...]] [--requests M] [--rounds R] [--mode SIDE[,SIDE...]]\n"
+        "                      [--payload BYTES] [--bxd PATH]\n"
+        "SIDE is raw, frames or lib (also: bxd = frames, both = raw,frames, all = every side).\n",
         stderr);
     exit(2);
 }
@@ -86,6 +117,21 @@ unsigned long parseNumber(const char* text, unsigned long max) {
     unsigned long value = strtoul(text, &end, 10);
     if (errno != 0 || end == text || *end != '\0' || value == 0 || value > max) usage();
     return value;
+}
+
+std::vector<std::string> splitList(const char* text) {
+    std::vector<std::string> items;
+    std::string item;
+    for (const char* p = text;; ++p) {
+        if (*p == ',' || *p == '\0') {
+            items.push_back(item);
+            item.clear();
+            if (*p == '\0') break;
+        } else {
+            item += *p;
+        }
+    }
+    return items;
 }
 
 Options parseOptions(int argc, char** argv) {
@@ -103,7 +149,9 @@ Options parseOptions(int argc, char** argv) {
     while ((c = getopt_long(argc, argv, "", kLong, nullptr)) != -1) {
         switch (c) {
             case 'c':
-                options.clients = static_cast<unsigned>(parseNumber(optarg, 1024));
+                options.clients.clear();
+                for (const std::string& count : splitList(optarg))
+                    options.clients.push_back(static_cast<unsigned>(parseNumber(count.c_str(), 1024)));
                 break;
             case 'n':
                 options.requests = static_cast<unsigned>(parseNumber(optarg, 100'000'000));
@@ -114,16 +162,20 @@ Options parseOptions(int argc, char** argv) {
             case 'r':
                 options.rounds = static_cast<unsigned>(parseNumber(optarg, 100));
                 break;
-            case 'm':
-                if (strcmp(optarg, "bxd") == 0)
-                    options.mode = Mode::Bxd;
-                else if (strcmp(optarg, "raw") == 0)
-                    options.mode = Mode::Raw;
-                else if (strcmp(optarg, "both") == 0)
-                    options.mode = Mode::Both;
-                else
-                    usage();
+            case 'm': {
+                bool sides[3] = {false, false, false};
+                for (const std::string& side : splitList(optarg)) {
+                    if (side == "raw" || side == "both" || side == "all") sides[static_cast<int>(Side::Raw)] = true;
+                    if (side == "frames" || side == "bxd" || side == "both" || side == "all")
+                        sides[static_cast<int>(Side::Frames)] = true;
+                    if (side == "lib" || side == "all") sides[static_cast<int>(Side::Library)] = true;
+                    if (side != "raw" && side != "frames" && side != "bxd" && side != "lib" && side != "both" &&
+                        side != "all")
+                        usage();
+                }
+                std::copy(std::begin(sides), std::end(sides), std::begin(options.sides));
                 break;
+            }
             case 'b':
                 options.bxdPath = optarg;
                 break;
@@ -132,6 +184,10 @@ Options parseOptions(int argc, char** argv) {
         }
     }
     if (optind < argc) usage();
+    if (options.payload > 0 && options.wants(Side::Library)) {
+        fputs("bxd_load_bench: --payload pads hand-written requests only; use it with --mode raw,frames\n", stderr);
+        exit(2);
+    }
     if (options.bxdPath.empty()) {
         // Built side by side: build/<preset>/bench/bxd_load_bench and build/<preset>/src/daemon/bxd.
         fs::path self = fs::read_symlink("/proc/self/exe");
@@ -299,21 +355,67 @@ void writeLe32(uint8_t* p, uint32_t v) {
 
 // What one client sends and how it checks what comes back.
 struct Exchange {
-    std::string socketPath;
-    bool zem = false;
-    std::vector<uint8_t> request;  // a whole message, header included
-    size_t replyBytes = 0;         // the whole reply, header included
+    Side side = Side::Raw;
+    std::string socketPath;        // raw and frames
+    std::string serviceDirectory;  // lib: where the library looks for bxd's service
+    std::vector<uint8_t> request;  // raw and frames: a whole message, header included
+    size_t replyBytes = 0;         // raw and frames: the whole reply, header included
+    std::string expectedReply;     // frames and lib: the description of the reply bxd gave the probe
 };
 
-// The first reply of each client is decoded in full: the run measures nothing unless bxd really answered.
-void checkFirstReply(const std::vector<uint8_t>& frame, uint32_t payloadLength) {
+// The first reply of each client is decoded in full: the run measures nothing unless bxd really answered, and
+// answered what it answered the probe.
+void checkFirstReply(const Exchange& exchange, const std::string& description) {
+    if (description != exchange.expectedReply) {
+        fprintf(stderr, "bxd_load_bench: %s: bxd's reply %s is not the probe's %s\n", sideName(exchange.side),
+                description.c_str(), exchange.expectedReply.c_str());
+        exit(1);
+    }
+}
+
+std::string describeReplyFrame(const std::vector<uint8_t>& frame, uint32_t payloadLength) {
     Result<Value> body =
         ZemCodec::decode(std::span<const uint8_t>(frame.data() + ZemFrame::kHeaderBytes, payloadLength));
-    const Value* code = body ? body->find("errorcode") : nullptr;
-    if (!code || code->getUInt64() != std::optional<uint64_t>(4)) {
-        fprintf(stderr, "bxd_load_bench: bxd's reply is not the expected error: %s\n",
-                body ? body->description().c_str() : body.error().description().c_str());
-        exit(1);
+    return body ? body->description() : "undecodable: " + body.error().description();
+}
+
+// The request the library builds for "ready" with no plug-ins, key for key in its order; the hand-written side sends
+// it with `padding` more bytes in a "pad" entry when asked.
+Value readyRequest(size_t padding) {
+    MutableDictionary body;
+    body.set("request", Value::string("ready"));
+    body.set("version", Value::uint64(3));
+    body.set("flags", Value::uint64(0));
+    body.set("uuids", Value::emptyArray());
+    if (padding > 0) body.set("pad", Value::data(std::vector<uint8_t>(padding, 0xA5)));
+    return body.take();
+}
+
+// A client process of the library side: an application with one DaemonClient that waits for every reply.
+void runLibraryClient(const Exchange& exchange, unsigned warmUp, unsigned count, int startPipe, uint32_t* latencies,
+                      int64_t* span) {
+    setenv("BX_SERVICE_DIR", exchange.serviceDirectory.c_str(), 1);
+    // Never destroyed: the process ends with _exit when this returns, and the kernel closes the connection. Closing
+    // it through the library would log a line about the cancelled connection into the figures' output.
+    DaemonClient& client = *new DaemonClient(kServiceName);
+    char go;
+    if (read(startPipe, &go, 1) < 0) die("start pipe");
+    const std::vector<Uuid> none;
+    for (unsigned i = 0; i < warmUp + count; ++i) {
+        Clock::time_point start = Clock::now();
+        DaemonClient::Reply reply = client.wait([&](DaemonClient::Callback done) { client.ready(none, done); });
+        Clock::time_point end = Clock::now();
+        if (reply.connectionFailed) {
+            fprintf(stderr, "bxd_load_bench: libbexil lost bxd: %s\n", reply.error->description().c_str());
+            exit(1);
+        }
+        if (i == 0) checkFirstReply(exchange, reply.message.description());
+        if (i == warmUp) span[0] = start.time_since_epoch().count();
+        if (i >= warmUp) {
+            auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
+            latencies[i - warmUp] = static_cast<uint32_t>(std::min<int64_t>(ns, UINT32_MAX));
+        }
+        if (i + 1 == warmUp + count) span[1] = end.time_since_epoch().count();
     }
 }
 
@@ -321,6 +423,10 @@ void checkFirstReply(const std::vector<uint8_t>& frame, uint32_t payloadLength) 
 // stores each timed round trip in nanoseconds into `latencies`; `span` gets the first send and the last reply.
 void runClient(const Exchange& exchange, unsigned warmUp, unsigned count, int startPipe, uint32_t* latencies,
                int64_t* span) {
+    if (exchange.side == Side::Library) {
+        runLibraryClient(exchange, warmUp, count, startPipe, latencies, span);
+        return;
+    }
     int fd = connectTo(exchange.socketPath);
     if (fd < 0) die("connect");
     std::vector<uint8_t> request = exchange.request;
@@ -331,7 +437,7 @@ void runClient(const Exchange& exchange, unsigned warmUp, unsigned count, int st
     uint64_t serial = 0;
     for (unsigned i = 0; i < warmUp + count; ++i) {
         Clock::time_point start = Clock::now();
-        if (exchange.zem) {
+        if (exchange.side == Side::Frames) {
             ZemFrameHeader header{ZemFrameKind::Request, ++serial, 0,
                                   static_cast<uint32_t>(request.size() - ZemFrame::kHeaderBytes)};
             ZemFrame::encodeHeader(header,
@@ -353,7 +459,7 @@ void runClient(const Exchange& exchange, unsigned warmUp, unsigned count, int st
                         static_cast<unsigned long long>(serial));
                 exit(1);
             }
-            if (i == 0) checkFirstReply(reply, header2->payloadLength);
+            if (i == 0) checkFirstReply(exchange, describeReplyFrame(reply, header2->payloadLength));
         } else {
             writeAll(fd, request.data(), request.size());
             readMessage(fd, reply, kRawHeaderBytes, [](const uint8_t* h) { return readLe32(h); });
@@ -374,9 +480,9 @@ struct RoundResult {
     double seconds = 0;  // from the first timed send of any client to the last timed reply of any client
 };
 
-RoundResult runRound(const Exchange& exchange, const Options& options) {
-    const size_t total = static_cast<size_t>(options.clients) * options.requests;
-    size_t bytes = total * sizeof(uint32_t) + options.clients * 2 * sizeof(int64_t);
+RoundResult runRound(const Exchange& exchange, unsigned clients, const Options& options) {
+    const size_t total = static_cast<size_t>(clients) * options.requests;
+    size_t bytes = (total + 1) * sizeof(uint32_t) + clients * 2 * sizeof(int64_t);
     void* shared = mmap(nullptr, bytes, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     if (shared == MAP_FAILED) die("mmap");
     auto* latencies = static_cast<uint32_t*>(shared);
@@ -385,7 +491,7 @@ RoundResult runRound(const Exchange& exchange, const Options& options) {
     if (pipe2(start, O_CLOEXEC) != 0) die("pipe");
 
     std::vector<pid_t> children;
-    for (unsigned c = 0; c < options.clients; ++c) {
+    for (unsigned c = 0; c < clients; ++c) {
         pid_t child = fork();
         if (child < 0) die("fork");
         if (child == 0) {
@@ -413,7 +519,7 @@ RoundResult runRound(const Exchange& exchange, const Options& options) {
     RoundResult result;
     result.latencies.assign(latencies, latencies + total);
     int64_t first = INT64_MAX, last = INT64_MIN;
-    for (unsigned c = 0; c < options.clients; ++c) {
+    for (unsigned c = 0; c < clients; ++c) {
         first = std::min(first, spans[2 * c]);
         last = std::max(last, spans[2 * c + 1]);
     }
@@ -481,34 +587,23 @@ unsigned cpusAvailable() {
 
 int main(int argc, char** argv) {
     Options options = parseOptions(argc, argv);
-    const bool wantBxd = options.mode != Mode::Raw;
-    const bool wantRaw = options.mode != Mode::Bxd;
-
-    // The request bxd gets, and the reply it gives to a request name it does not know.
-    MutableDictionary body;
-    body.set("request", Value::string("bench"));
-    body.set("version", Value::uint64(3));
-    body.set("pad", Value::data(std::vector<uint8_t>(options.payload, 0xA5)));
-    Exchange bxd;
-    bxd.zem = true;
-    if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, body.take(), bxd.request)) die("encoding the request");
-    MutableDictionary expectedReply;
-    expectedReply.set("errorcode", Value::uint64(4));
-    expectedReply.set("error", Value::string("unrecognized request"));
-    std::vector<uint8_t> replyFrame;
-    if (ZemFrame::encode(ZemFrameKind::Reply, 0, 1, expectedReply.take(), replyFrame)) die("encoding the reply");
-    bxd.replyBytes = replyFrame.size();
-
-    Exchange raw;
-    raw.request.assign(bxd.request.size(), 0x5A);
-    writeLe32(raw.request.data(), static_cast<uint32_t>(raw.request.size() - kRawHeaderBytes));
-    raw.replyBytes = bxd.replyBytes;
 
     std::string pattern = (fs::temp_directory_path() / "bxd-load-XXXXXX").string();
     if (!mkdtemp(pattern.data())) die("mkdtemp");
     fs::path root = pattern;
     for (const char* sub : {"service", "state", "runtime", "entitlements.d"}) fs::create_directories(root / sub);
-    bxd.socketPath = (root / "service" / kServiceName).string();
+
+    Exchange exchanges[3];
+    Exchange& raw = exchanges[static_cast<int>(Side::Raw)];
+    Exchange& frames = exchanges[static_cast<int>(Side::Frames)];
+    Exchange& library = exchanges[static_cast<int>(Side::Library)];
+    raw.side = Side::Raw;
+    frames.side = Side::Frames;
+    library.side = Side::Library;
+    if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, readyRequest(options.payload), frames.request))
+        die("encoding the request");
+    frames.socketPath = (root / "service" / kServiceName).string();
+    library.serviceDirectory = (root / "service").string();
     raw.socketPath = (root / "echo.sock").string();
 
     signal(SIGPIPE, SIG_IGN);
@@ -519,22 +614,48 @@ int main(int argc, char** argv) {
         std::error_code ignored;
         fs::remove_all(root, ignored);
     };
-    if (wantBxd) {
-        if (access(options.bxdPath.c_str(), X_OK) != 0) {
-            fprintf(stderr, "bxd_load_bench: no bxd at %s (use --bxd PATH)\n", options.bxdPath.c_str());
-            cleanUp();
-            return 1;
-        }
-        bxdPid = startBxd(options.bxdPath, root);
-        if (!waitUntilConnectable(bxd.socketPath, bxdPid)) {
-            fprintf(stderr, "bxd_load_bench: bxd did not come up; its log:\n");
-            std::string command = "cat '" + (root / "bxd.log").string() + "' >&2";
-            if (system(command.c_str()) != 0) fprintf(stderr, "(no log)\n");
-            cleanUp();
-            return 1;
-        }
+    // bxd runs even for the raw side alone: its reply to the probe sets the size of the raw side's replies.
+    if (access(options.bxdPath.c_str(), X_OK) != 0) {
+        fprintf(stderr, "bxd_load_bench: no bxd at %s (use --bxd PATH)\n", options.bxdPath.c_str());
+        cleanUp();
+        return 1;
     }
-    if (wantRaw) {
+    bxdPid = startBxd(options.bxdPath, root);
+    if (!waitUntilConnectable(frames.socketPath, bxdPid)) {
+        fprintf(stderr, "bxd_load_bench: bxd did not come up; its log:\n");
+        std::string command = "cat '" + (root / "bxd.log").string() + "' >&2";
+        if (system(command.c_str()) != 0) fprintf(stderr, "(no log)\n");
+        cleanUp();
+        return 1;
+    }
+
+    // The probe: one hand-written request, whose reply every later first reply must equal.
+    {
+        int fd = connectTo(frames.socketPath);
+        if (fd < 0) die("connect");
+        writeAll(fd, frames.request.data(), frames.request.size());
+        std::vector<uint8_t> reply(ZemFrame::kHeaderBytes);
+        uint32_t payloadLength = 0;
+        readMessage(fd, reply, ZemFrame::kHeaderBytes, [&](const uint8_t* h) {
+            Result<ZemFrameHeader> header =
+                ZemFrame::decodeHeader(std::span<const uint8_t, ZemFrame::kHeaderBytes>(h, ZemFrame::kHeaderBytes));
+            if (!header || header->kind != ZemFrameKind::Reply || header->inReplyTo != 1) {
+                fprintf(stderr, "bxd_load_bench: bad reply to the probe\n");
+                exit(1);
+            }
+            payloadLength = header->payloadLength;
+            return payloadLength;
+        });
+        close(fd);
+        frames.replyBytes = ZemFrame::kHeaderBytes + payloadLength;
+        frames.expectedReply = describeReplyFrame(reply, payloadLength);
+        library.expectedReply = frames.expectedReply;
+    }
+
+    raw.request.assign(frames.request.size(), 0x5A);
+    writeLe32(raw.request.data(), static_cast<uint32_t>(raw.request.size() - kRawHeaderBytes));
+    raw.replyBytes = frames.replyBytes;
+    if (options.wants(Side::Raw)) {
         echoPid = fork();
         if (echoPid < 0) die("fork");
         if (echoPid == 0) runEchoServer(raw.socketPath, raw.replyBytes);
@@ -545,37 +666,63 @@ int main(int argc, char** argv) {
         }
     }
 
-    std::vector<uint32_t> bxdLatencies, rawLatencies;
-    double bxdSeconds = 0, rawSeconds = 0;
-    for (unsigned round = 0; round < options.rounds; ++round) {
-        if (wantRaw) {
-            RoundResult r = runRound(raw, options);
-            rawLatencies.insert(rawLatencies.end(), r.latencies.begin(), r.latencies.end());
-            rawSeconds += r.seconds;
+    struct Measured {
+        unsigned clients;
+        Summary summaries[3];
+    };
+    std::vector<Measured> results;
+    for (unsigned clients : options.clients) {
+        std::vector<uint32_t> latencies[3];
+        double seconds[3] = {0, 0, 0};
+        for (unsigned round = 0; round < options.rounds; ++round) {
+            for (Side side : kSides) {
+                if (!options.wants(side)) continue;
+                int i = static_cast<int>(side);
+                RoundResult r = runRound(exchanges[i], clients, options);
+                latencies[i].insert(latencies[i].end(), r.latencies.begin(), r.latencies.end());
+                seconds[i] += r.seconds;
+            }
         }
-        if (wantBxd) {
-            RoundResult r = runRound(bxd, options);
-            bxdLatencies.insert(bxdLatencies.end(), r.latencies.begin(), r.latencies.end());
-            bxdSeconds += r.seconds;
+        Measured measured{clients, {}};
+        for (Side side : kSides) {
+            int i = static_cast<int>(side);
+            measured.summaries[i] = summarise(std::move(latencies[i]), seconds[i]);
         }
+        results.push_back(measured);
     }
     cleanUp();
 
-    printf(
-        "bxd_load_bench: %u client%s x %u requests x %u rounds, payload %zu bytes (request %zu bytes, reply %zu "
-        "bytes), %u CPU%s usable\n",
-        options.clients, options.clients == 1 ? "" : "s", options.requests, options.rounds, options.payload,
-        bxd.request.size(), bxd.replyBytes, cpusAvailable(), cpusAvailable() == 1 ? "" : "s");
-    printf("%-24s %10s %10s %12s\n", "", "p50 us", "p99 us", "requests/s");
-    Summary rawSummary = summarise(std::move(rawLatencies), rawSeconds);
-    Summary bxdSummary = summarise(std::move(bxdLatencies), bxdSeconds);
-    if (wantRaw)
-        printf("%-24s %10.2f %10.2f %12.0f\n", "raw unix ping-pong", rawSummary.p50Us, rawSummary.p99Us,
-               rawSummary.perSecond);
-    if (wantBxd)
-        printf("%-24s %10.2f %10.2f %12.0f\n", "bxd", bxdSummary.p50Us, bxdSummary.p99Us, bxdSummary.perSecond);
-    if (wantRaw && wantBxd)
-        printf("%-24s %9.2fx %9.2fx %11.2fx\n", "bxd / raw", bxdSummary.p50Us / rawSummary.p50Us,
-               bxdSummary.p99Us / rawSummary.p99Us, bxdSummary.perSecond / rawSummary.perSecond);
+    printf("bxd_load_bench: %u rounds x %u requests per client and side, %u CPU%s usable\n", options.rounds,
+           options.requests, cpusAvailable(), cpusAvailable() == 1 ? "" : "s");
+    printf("request: \"ready\" with no plug-ins%s, %zu bytes; reply %zu bytes: %s\n",
+           options.payload > 0 ? " and padding" : "", frames.request.size(), frames.replyBytes,
+           frames.expectedReply.c_str());
+    struct Ratio {
+        const char* name;
+        Side over;
+        Side under;
+    };
+    const Ratio ratios[] = {
+        {"frames / raw", Side::Frames, Side::Raw},
+        {"libbexil / raw", Side::Library, Side::Raw},
+        {"libbexil / frames", Side::Library, Side::Frames},
+    };
+    for (const Measured& measured : results) {
+        char title[32];
+        snprintf(title, sizeof title, "%u client%s", measured.clients, measured.clients == 1 ? "" : "s");
+        printf("\n%-26s %10s %10s %12s\n", title, "p50 us", "p99 us", "requests/s");
+        for (Side side : kSides) {
+            if (!options.wants(side)) continue;
+            const Summary& summary = measured.summaries[static_cast<int>(side)];
+            printf("%-26s %10.2f %10.2f %12.0f\n", sideName(side), summary.p50Us, summary.p99Us, summary.perSecond);
+        }
+        for (const Ratio& ratio : ratios) {
+            if (!options.wants(ratio.over) || !options.wants(ratio.under)) continue;
+            const Summary& over = measured.summaries[static_cast<int>(ratio.over)];
+            const Summary& under = measured.summaries[static_cast<int>(ratio.under)];
+            printf("%-26s %9.2fx %9.2fx %11.2fx\n", ratio.name, over.p50Us / under.p50Us, over.p99Us / under.p99Us,
+                   over.perSecond / under.perSecond);
+        }
+    }
     return 0;
 }

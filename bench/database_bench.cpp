@@ -1,13 +1,29 @@
 // findPlugIn: a cached look-up against one that builds the record from the registry (the cache is emptied before
-// every look-up, which costs next to nothing), in one run so that the ratio holds on a noisy machine. The registry and
-// the bundles live under the temporary directory.
+// every look-up, which costs next to nothing), in one run so that the ratio holds on a noisy machine: first on the
+// three plug-ins of the example application, then on a registry of 100,000 plug-ins (ten to an application, on 50
+// extension points). With the large registry, BM_CacheMemory fills the cache with every record and reports what that
+// costs per record: the growth of the heap's in-use bytes (mallinfo2) and of the resident set while filling, and the
+// in-use bytes that emptying the cache gives back (the records alone, without what the registry's own page cache
+// grew by), and how much of that is the registry's record of the plug-in, which each cached record keeps (the same
+// look-ups held as registry records only). The small registry lives under the temporary directory, the large one on
+// /dev/shm when there is one (see LargeRegistry.h).
+//
+//     cmake --build --preset release --target database_bench
+//     build/release/bench/database_bench [--benchmark_filter=Large|Memory]
+//
+// DATABASE_BENCH_PLUGINS=N changes the size of the large registry (built once per run, in about half a minute).
 
 #include <benchmark/benchmark.h>
+#include <malloc.h>
 #include <stdlib.h>
+#include <unistd.h>
 
 #include <filesystem>
+#include <fstream>
 #include <memory>
+#include <random>
 
+#include "LargeRegistry.h"
 #include "database/BXDatabase.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
@@ -68,6 +84,111 @@ void BM_FindPlugInUncached(benchmark::State& state) {
     }
 }
 BENCHMARK(BM_FindPlugInUncached);
+
+struct LargeFixture {
+    static constexpr int kPoints = 50;
+    fs::path root;
+    int count = 100000;
+    bench::LargeRegistry registry;
+    std::shared_ptr<LedgerixWorkspace> workspace;
+    std::unique_ptr<BXDatabase> database;
+
+    LargeFixture() {
+        if (const char* n = getenv("DATABASE_BENCH_PLUGINS")) count = std::max(100, atoi(n));
+        root = bench::makeScratchDirectory("database-bench-large");
+        registry = bench::LargeRegistry::build(root / "bundles", root / "state", count, kPoints, false);
+        fprintf(stderr, "built a registry of %d plug-ins: bundles %.1f s, registrations %.1f s\n", count,
+                registry.writeSeconds, registry.registerSeconds);
+        LedgerixWorkspace::Options options;
+        options.stateDirectory = root / "state";
+        workspace = *LedgerixWorkspace::open(options);
+        database = BXDatabase::create((root / "annotations").string(), workspace, [](std::string_view) {});
+    }
+    ~LargeFixture() {
+        database.reset();
+        workspace.reset();
+        std::error_code ec;
+        fs::remove_all(root, ec);
+    }
+
+    void fill() {
+        if (database->cachedCount() == registry.uuids.size()) return;
+        for (const Uuid& uuid : registry.uuids)
+            if (!database->findPlugIn(uuid)) abort();
+    }
+    void empty() {
+        database->sync().sync([&] { database->purgeCachesToLimit(0); });
+    }
+};
+
+LargeFixture& largeFixture() {
+    static LargeFixture instance;
+    return instance;
+}
+
+// Bytes handed out by malloc: small chunks from the arenas plus the large ones it maps on their own (such as the
+// cache's bucket array).
+size_t heapInUse() {
+    struct mallinfo2 info = mallinfo2();
+    return info.uordblks + info.hblkhd;
+}
+
+size_t residentBytes() {
+    std::ifstream statm("/proc/self/statm");
+    size_t pages = 0, resident = 0;
+    statm >> pages >> resident;
+    return resident * static_cast<size_t>(sysconf(_SC_PAGESIZE));
+}
+
+void BM_CacheMemory(benchmark::State& state) {
+    LargeFixture& f = largeFixture();
+    double perRecordHeap = 0, perRecordResident = 0, perRecordFreed = 0, perRecordProxy = 0;
+    for (auto _ : state) {
+        f.empty();
+        size_t heapBefore = heapInUse(), residentBefore = residentBytes();
+        f.fill();
+        size_t heapFull = heapInUse(), residentFull = residentBytes();
+        f.empty();
+        size_t heapEmptied = heapInUse();
+        double n = static_cast<double>(f.registry.uuids.size());
+        perRecordHeap = (static_cast<double>(heapFull) - static_cast<double>(heapBefore)) / n;
+        perRecordResident = (static_cast<double>(residentFull) - static_cast<double>(residentBefore)) / n;
+        perRecordFreed = (static_cast<double>(heapFull) - static_cast<double>(heapEmptied)) / n;
+
+        // The share of the registry's record, which every cached record keeps: the same look-ups held as proxies.
+        std::vector<std::shared_ptr<const LXBexilProxy>> proxies;
+        proxies.reserve(f.registry.uuids.size());
+        size_t heapNoProxies = heapInUse();
+        for (const Uuid& uuid : f.registry.uuids) proxies.push_back(f.workspace->pluginProxyForUUID(uuid));
+        perRecordProxy = (static_cast<double>(heapInUse()) - static_cast<double>(heapNoProxies)) / n;
+    }
+    state.counters["records"] = static_cast<double>(f.registry.uuids.size());
+    state.counters["heap_B_per_record"] = perRecordHeap;
+    state.counters["rss_B_per_record"] = perRecordResident;
+    state.counters["freed_B_per_record"] = perRecordFreed;
+    state.counters["registry_record_B"] = perRecordProxy;
+}
+BENCHMARK(BM_CacheMemory)->Iterations(1)->Unit(benchmark::kMillisecond);
+
+void BM_FindPlugInCachedLarge(benchmark::State& state) {
+    LargeFixture& f = largeFixture();
+    f.fill();
+    std::mt19937 random(7);
+    for (auto _ : state)
+        benchmark::DoNotOptimize(f.database->findPlugIn(f.registry.uuids[random() % f.registry.uuids.size()]));
+    state.counters["cached"] = static_cast<double>(f.database->cachedCount());
+}
+BENCHMARK(BM_FindPlugInCachedLarge);
+
+void BM_FindPlugInUncachedLarge(benchmark::State& state) {
+    LargeFixture& f = largeFixture();
+    std::mt19937 random(7);
+    for (auto _ : state) {
+        f.empty();
+        benchmark::DoNotOptimize(f.database->findPlugIn(f.registry.uuids[random() % f.registry.uuids.size()]));
+    }
+}
+BENCHMARK(BM_FindPlugInUncachedLarge);
 
 }  // namespace
 
