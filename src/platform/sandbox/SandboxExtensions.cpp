@@ -72,6 +72,28 @@ std::optional<std::vector<uint8_t>> readKey(const fs::path& path) {
     return key;
 }
 
+// The canonical form of an existing path, or none with errno set. The C library's realpath asks the kernel about
+// every component in turn, and each question walks the path from the root again, so a token for a file deep in an
+// application cost dozens of lookups. Opening the path once without access to its contents (which needs what
+// resolving it needs: search permission on every directory) and reading back the name the kernel resolved costs two
+// walks whatever the depth. Without /proc, or when the answer is no plain path, the library's way decides.
+std::optional<std::string> canonicalPath(const std::string& path) {
+    int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
+    if (fd < 0) return std::nullopt;
+    std::string link = "/proc/self/fd/" + std::to_string(fd);
+    char resolved[PATH_MAX + 1];
+    ssize_t n = ::readlink(link.c_str(), resolved, sizeof resolved);
+    ::close(fd);
+    constexpr std::string_view kDeleted = " (deleted)";
+    if (n > 0 && static_cast<size_t>(n) < sizeof resolved && resolved[0] == '/') {
+        std::string_view name(resolved, static_cast<size_t>(n));
+        if (!name.ends_with(kDeleted)) return std::string(name);
+    }
+    std::unique_ptr<char, decltype(&free)> canonical(realpath(path.c_str(), nullptr), &free);
+    if (!canonical) return std::nullopt;
+    return std::string(canonical.get());
+}
+
 }  // namespace
 
 fs::path SandboxExtensions::defaultKeyPath() {
@@ -166,9 +188,9 @@ std::optional<std::string> SandboxExtensions::issueFileExtension(std::string_vie
         errno = EINVAL;
         return std::nullopt;
     }
-    std::unique_ptr<char, decltype(&free)> canonical(realpath(path.c_str(), nullptr), &free);
+    std::optional<std::string> canonical = canonicalPath(path);
     if (!canonical) return std::nullopt;
-    std::string resolved(canonical.get());
+    std::string resolved = std::move(*canonical);
     if (resolved.size() > kMaxPathLength) {
         errno = ENAMETOOLONG;
         return std::nullopt;
