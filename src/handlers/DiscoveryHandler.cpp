@@ -124,7 +124,8 @@ void Transaction::matchPlugIns() {
 
         const std::shared_ptr<BXBundle>& clientBundle = client()->bundle();
         for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
-            std::string uuidText = plugIn->uuid() ? plugIn->uuid()->string() : std::string();
+            // Only the logs name the candidate, and they are rare: the text is made when one is written.
+            auto uuidText = [&plugIn] { return plugIn->uuid() ? plugIn->uuid()->string() : std::string(); };
             if (!all) {
                 // Plug-ins outside the system volume are visible only inside an application, and not at all when
                 // the caller asked for system plug-ins only.
@@ -137,7 +138,7 @@ void Transaction::matchPlugIns() {
             bool excluded = false;
             for (const Value& exclusion : exclusions) {
                 if (plugIn->match(exclusion, context)) {
-                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText);
+                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText());
                     excluded = true;
                     break;
                 }
@@ -146,14 +147,15 @@ void Transaction::matchPlugIns() {
 
             if (!all) {
                 if (std::optional<std::string> reason = plugIn->allowForClient(*client(), context)) {
-                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText, *reason);
+                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(),
+                                     *reason);
                     continue;
                 }
             }
 
             Result<MutableDictionary> exported = plugIn->exportForm();
             if (!exported) {
-                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText,
+                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText(),
                                  exported.error());
                 continue;
             }
@@ -207,8 +209,9 @@ void Transaction::matchPlugIns() {
     log::ops().info("match returned %u plug-ins", kept);
     std::vector<Value> forms;
     forms.reserve(kept);
+    // The builders are not used again: their entries move into the reply rather than being copied.
     for (const Form& form : results)
-        if (form) forms.push_back(form->value());
+        if (form) forms.push_back(form->take());
     if (std::optional<Value> encoded =
             BXDaemonClient::convertToZEMVersion(Value::array(std::move(forms)), static_cast<int64_t>(version())))
         reply().set("matches", std::move(*encoded));
