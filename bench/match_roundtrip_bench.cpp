@@ -420,7 +420,6 @@ void runSize(const Options& options, int count) {
         fs::path local = run / "local";
         copyState(registry / "state", local / "state");
         setenv("BX_STATE_DIR", (local / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (local / "runtime").c_str(), 1);
         LedgerixWorkspace::Options lx;
         lx.stateDirectory = local / "state";
         lx.durability = LedgerixWorkspace::Durability::Process;
@@ -506,6 +505,13 @@ int main(int argc, char** argv) {
         fprintf(stderr, "match_roundtrip_bench: no bxd at %s (use --bxd PATH)\n", options.bxdPath.c_str());
         return 1;
     }
+    // The in-process side's token key: one file for the whole run (the process keeps writing it back where it
+    // first put it), removed at the end.
+    std::string pattern = (fs::temp_directory_path() / "bexil-match-runtime-XXXXXX").string();
+    if (!mkdtemp(pattern.data())) die("mkdtemp");
+    setenv("BX_RUNTIME_DIR", pattern.c_str(), 1);
     for (int count : options.counts) runSize(options, count);
+    std::error_code ignored;
+    fs::remove_all(pattern, ignored);
     return 0;
 }
