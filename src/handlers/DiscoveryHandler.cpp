@@ -107,8 +107,14 @@ void Transaction::matchPlugIns() {
 
     BXDServer* database = server();
     BXMatchContext context{.annotations = &database->annotationSource()};
+    // The accepted forms in the order of acceptance; a form that a later duplicate beat is left as an empty slot,
+    // so the positions that `accepted` records stay valid.
     std::vector<Form> results;
+    size_t kept = 0;
     {
+        // The positions in `results` of the live forms of each identifier, in the order of `results`: duplicate
+        // resolution looks only at the forms of the candidate's own identifier.
+        std::unordered_map<std::string, std::vector<size_t>> accepted;
         // Everything per candidate lives in this scope, so the records and rejected forms are gone before the
         // reply is encoded.
         std::unordered_map<std::string, Form> replacements;
@@ -118,7 +124,8 @@ void Transaction::matchPlugIns() {
 
         const std::shared_ptr<BXBundle>& clientBundle = client()->bundle();
         for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
-            std::string uuidText = plugIn->uuid() ? plugIn->uuid()->string() : std::string();
+            // Only the logs name the candidate, and they are rare: the text is made when one is written.
+            auto uuidText = [&plugIn] { return plugIn->uuid() ? plugIn->uuid()->string() : std::string(); };
             if (!all) {
                 // Plug-ins outside the system volume are visible only inside an application, and not at all when
                 // the caller asked for system plug-ins only.
@@ -131,7 +138,7 @@ void Transaction::matchPlugIns() {
             bool excluded = false;
             for (const Value& exclusion : exclusions) {
                 if (plugIn->match(exclusion, context)) {
-                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText);
+                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText());
                     excluded = true;
                     break;
                 }
@@ -140,14 +147,15 @@ void Transaction::matchPlugIns() {
 
             if (!all) {
                 if (std::optional<std::string> reason = plugIn->allowForClient(*client(), context)) {
-                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText, *reason);
+                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(),
+                                     *reason);
                     continue;
                 }
             }
 
             Result<MutableDictionary> exported = plugIn->exportForm();
             if (!exported) {
-                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText,
+                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText(),
                                  exported.error());
                 continue;
             }
@@ -155,15 +163,18 @@ void Transaction::matchPlugIns() {
             // Duplicate resolution against the forms of the same identifier accepted so far.
             std::string identifier = plugIn->identifier().value_or("");
             std::string version = versionOf(*plugIn);
+            std::vector<size_t>& sameIdentifier = accepted[identifier];
             bool dropped = false;
-            for (auto it = results.begin(); it != results.end(); ++it) {
-                if (textOf(**it, kIdentifierKey) != identifier) continue;
-                ComparisonResult order = compareVersionString(version, textOf(**it, kVersionKey));
+            for (auto at = sameIdentifier.begin(); at != sameIdentifier.end(); ++at) {
+                Form& other = results[*at];
+                ComparisonResult order = compareVersionString(version, textOf(*other, kVersionKey));
                 bool same = order == ComparisonResult::Same;
                 if ((flags & kDiscoverAllVersions) && (!same || (flags & kDiscoverAllInstances))) continue;
-                bool wins = same ? winsTieBreak(*plugIn, **it) : order == ComparisonResult::Descending;
+                bool wins = same ? winsTieBreak(*plugIn, *other) : order == ComparisonResult::Descending;
                 if (wins) {
-                    results.erase(it);
+                    other.reset();
+                    sameIdentifier.erase(at);
+                    --kept;
                 } else {
                     dropped = true;
                 }
@@ -174,13 +185,16 @@ void Transaction::matchPlugIns() {
             Form form = std::make_shared<MutableDictionary>(std::move(*exported));
             database->addAnnotationForPlugInIn(*plugIn, *form);
             plugIn->augmentForm(*form);
+            sameIdentifier.push_back(results.size());
             results.push_back(form);
+            ++kept;
             // A later plug-in naming the same identifier takes the entry over.
             for (const std::string& replaced : replacedIdentifiers(*plugIn)) replacements[replaced] = form;
         }
 
         if (!replacements.empty()) {
             for (const Form& form : results) {
+                if (!form) continue;
                 std::string identifier = textOf(*form, kIdentifierKey);
                 auto replacing = replacements.find(identifier);
                 if (replacing == replacements.end()) continue;
@@ -192,10 +206,12 @@ void Transaction::matchPlugIns() {
         }
     }
 
-    log::ops().info("match returned %u plug-ins", results.size());
+    log::ops().info("match returned %u plug-ins", kept);
     std::vector<Value> forms;
-    forms.reserve(results.size());
-    for (const Form& form : results) forms.push_back(form->value());
+    forms.reserve(kept);
+    // The builders are not used again: their entries move into the reply rather than being copied.
+    for (const Form& form : results)
+        if (form) forms.push_back(form->take());
     if (std::optional<Value> encoded =
             BXDaemonClient::convertToZEMVersion(Value::array(std::move(forms)), static_cast<int64_t>(version())))
         reply().set("matches", std::move(*encoded));

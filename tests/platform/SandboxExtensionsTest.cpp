@@ -39,6 +39,12 @@ TEST_F(SandboxExtensionsTest, IssuedTokenNamesTheCanonicalPathAndIsConsumable) {
     consumer.release(handle);
     EXPECT_FALSE(consumer.consumedPath(handle));
     consumer.release(handle);  // releasing twice is harmless
+
+    // Through a symbolic link to the bundle: the token names (and signs) the file the link leads to.
+    fs::create_directory_symlink(root_ / "bundle", root_ / "link");
+    EXPECT_EQ(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass,
+                                        (root_ / "link" / "Resources" / "a.txt").string()),
+              token);
 }
 
 TEST_F(SandboxExtensionsTest, AlteredOrForeignTokensAreRefused) {
@@ -79,6 +85,14 @@ TEST_F(SandboxExtensionsTest, MissingPathsAndBadClassesGetNoToken) {
     errno = 0;
     EXPECT_FALSE(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass, (root_ / "missing").string()));
     EXPECT_EQ(errno, ENOENT);
+    fs::create_symlink(root_ / "missing", root_ / "dangling");
+    errno = 0;
+    EXPECT_FALSE(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass, (root_ / "dangling").string()));
+    EXPECT_EQ(errno, ENOENT);
+    errno = 0;
+    EXPECT_FALSE(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass,
+                                           (root_ / "bundle" / "Resources" / "a.txt" / "x").string()));
+    EXPECT_EQ(errno, ENOTDIR);
     errno = 0;
     EXPECT_FALSE(issuer.issueFileExtension("a;b", (root_ / "bundle").string()));
     EXPECT_EQ(errno, EINVAL);

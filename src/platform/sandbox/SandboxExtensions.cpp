@@ -2,6 +2,7 @@
 #include "base/StandardPaths.h"
 
 #include <fcntl.h>
+#include <openssl/core_names.h>
 #include <openssl/crypto.h>
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
@@ -71,6 +72,28 @@ std::optional<std::vector<uint8_t>> readKey(const fs::path& path) {
     return key;
 }
 
+// The canonical form of an existing path, or none with errno set. The C library's realpath asks the kernel about
+// every component in turn, and each question walks the path from the root again, so a token for a file deep in an
+// application cost dozens of lookups. Opening the path once without access to its contents (which needs what
+// resolving it needs: search permission on every directory) and reading back the name the kernel resolved costs two
+// walks whatever the depth. Without /proc, or when the answer is no plain path, the library's way decides.
+std::optional<std::string> canonicalPath(const std::string& path) {
+    int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
+    if (fd < 0) return std::nullopt;
+    std::string link = "/proc/self/fd/" + std::to_string(fd);
+    char resolved[PATH_MAX + 1];
+    ssize_t n = ::readlink(link.c_str(), resolved, sizeof resolved);
+    ::close(fd);
+    constexpr std::string_view kDeleted = " (deleted)";
+    if (n > 0 && static_cast<size_t>(n) < sizeof resolved && resolved[0] == '/') {
+        std::string_view name(resolved, static_cast<size_t>(n));
+        if (!name.ends_with(kDeleted)) return std::string(name);
+    }
+    std::unique_ptr<char, decltype(&free)> canonical(realpath(path.c_str(), nullptr), &free);
+    if (!canonical) return std::nullopt;
+    return std::string(canonical.get());
+}
+
 }  // namespace
 
 fs::path SandboxExtensions::defaultKeyPath() {
@@ -98,15 +121,59 @@ bool SandboxExtensions::ensureIssuingKeyLocked() {
     }
     if (!writeKey(keyPath_, key)) return false;
     issuingKey_ = std::move(key);
+    issuingMac_.reset();
     return true;
+}
+
+void SandboxExtensions::MacStateFree::operator()(evp_mac_ctx_st* state) const { EVP_MAC_CTX_free(state); }
+
+namespace {
+
+// Class and path are joined by a NUL, which neither can contain, so no two pairs sign the same bytes.
+std::string signedMessage(std::string_view extensionClass, std::string_view path) {
+    std::string message;
+    message.reserve(extensionClass.size() + 1 + path.size());
+    message += extensionClass;
+    message += '\0';
+    message += path;
+    return message;
+}
+
+// A fresh HMAC-SHA-256 state keyed with `key`, or none when the library cannot make one.
+EVP_MAC_CTX* keyedMac(const std::vector<uint8_t>& key) {
+    // Fetching looks the algorithm up in the library's tables: once per process is enough.
+    static EVP_MAC* const hmac = EVP_MAC_fetch(nullptr, "HMAC", nullptr);
+    if (hmac == nullptr) return nullptr;
+    EVP_MAC_CTX* state = EVP_MAC_CTX_new(hmac);
+    if (state == nullptr) return nullptr;
+    char digest[] = "SHA256";
+    OSSL_PARAM params[] = {OSSL_PARAM_construct_utf8_string(OSSL_MAC_PARAM_DIGEST, digest, 0), OSSL_PARAM_END};
+    if (EVP_MAC_init(state, key.data(), key.size(), params) != 1) {
+        EVP_MAC_CTX_free(state);
+        return nullptr;
+    }
+    return state;
+}
+
+}  // namespace
+
+std::string SandboxExtensions::issuingSignatureLocked(std::string_view extensionClass, std::string_view path) {
+    if (!issuingMac_) issuingMac_.reset(keyedMac(issuingKey_));
+    EVP_MAC_CTX* state = issuingMac_ ? EVP_MAC_CTX_dup(issuingMac_.get()) : nullptr;
+    if (state == nullptr) return signature(issuingKey_, extensionClass, path);
+    std::string message = signedMessage(extensionClass, path);
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    size_t length = 0;
+    bool ok = EVP_MAC_update(state, reinterpret_cast<const unsigned char*>(message.data()), message.size()) == 1 &&
+              EVP_MAC_final(state, digest, &length, sizeof digest) == 1;
+    EVP_MAC_CTX_free(state);
+    if (!ok) return signature(issuingKey_, extensionClass, path);
+    return hex(digest, length);
 }
 
 std::string SandboxExtensions::signature(const std::vector<uint8_t>& key, std::string_view extensionClass,
                                          std::string_view path) const {
-    // Class and path are joined by a NUL, which neither can contain, so no two pairs sign the same bytes.
-    std::string message(extensionClass);
-    message += '\0';
-    message += path;
+    std::string message = signedMessage(extensionClass, path);
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned int length = 0;
     HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(message.data()),
@@ -121,16 +188,16 @@ std::optional<std::string> SandboxExtensions::issueFileExtension(std::string_vie
         errno = EINVAL;
         return std::nullopt;
     }
-    std::unique_ptr<char, decltype(&free)> canonical(realpath(path.c_str(), nullptr), &free);
+    std::optional<std::string> canonical = canonicalPath(path);
     if (!canonical) return std::nullopt;
-    std::string resolved(canonical.get());
+    std::string resolved = std::move(*canonical);
     if (resolved.size() > kMaxPathLength) {
         errno = ENAMETOOLONG;
         return std::nullopt;
     }
     std::lock_guard lock(mutex_);
     if (!ensureIssuingKeyLocked()) return std::nullopt;
-    return std::string(extensionClass) + kSeparator + signature(issuingKey_, extensionClass, resolved) + kSeparator +
+    return std::string(extensionClass) + kSeparator + issuingSignatureLocked(extensionClass, resolved) + kSeparator +
            resolved;
 }
 

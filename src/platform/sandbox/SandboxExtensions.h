@@ -9,11 +9,15 @@
 #include <cstdint>
 #include <filesystem>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
+
+// The library's keyed MAC state (EVP_MAC_CTX); only the source knows the library.
+struct evp_mac_ctx_st;
 
 namespace bexil {
 
@@ -53,10 +57,19 @@ class SandboxExtensions {
     bool ensureIssuingKeyLocked();
     std::string signature(const std::vector<uint8_t>& key, std::string_view extensionClass,
                           std::string_view path) const;
+    // The same signature with the issuing key, from a MAC state keyed once. REQUIRES: mutex_ held, a key made.
+    std::string issuingSignatureLocked(std::string_view extensionClass, std::string_view path);
+
+    struct MacStateFree {
+        void operator()(evp_mac_ctx_st* state) const;
+    };
 
     const std::filesystem::path keyPath_;
     mutable std::mutex mutex_;
     std::vector<uint8_t> issuingKey_;
+    // HMAC-SHA-256 keyed with issuingKey_ (none until first needed, or when the library cannot make one): copying
+    // it per token spares setting up the algorithm and the key each time, which was most of a token's cost.
+    std::unique_ptr<evp_mac_ctx_st, MacStateFree> issuingMac_;
     std::map<int64_t, std::string> consumed_;
     int64_t nextHandle_ = 1;
 };

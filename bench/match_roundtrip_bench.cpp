@@ -1,0 +1,517 @@
+// Discovery through the real bxd: "match" requests over the wire against registries of 1,000 to 100,000 plug-ins
+// spread over applications (10 plug-ins each) and 50 extension points. One point holds exactly kOnThePoint plug-ins
+// at every size, so the point match returns the same number of forms however large the registry is; the rest are
+// spread round-robin over the other 49 points. Every plug-in declares one shared resource, so each form carries a
+// resource token as well as its annotations.
+//
+// For each size it prints:
+//  - the point match: p50 / p99 round trip through bxd, and the same work done in this process (the database's
+//    query, the rules, export, annotations, tokens and the encoding of the forms) as the server-side figure;
+//  - the match with no rules (every visible plug-in): round trip and server-side time per returned plug-in, the
+//    reply's size in bytes and the count at which it would pass the frame limit. Only for sizes up to --all-max,
+//    since past some count the reply cannot be sent at all.
+//
+// Registries take a while to build (the 100,000 one minutes), so they are built once with the registry library
+// under --cache (default: <tmp>/bexil-match-bench-cache) and reused; each run copies the state directory so that
+// what bxd writes (elections, annotations) never leaks into the next run. The client speaks the wire protocol
+// directly (ZemFrame out, one reply frame back), so the client library's cost is not measured.
+//
+// --wrapper "perf record -g -o FILE" starts bxd under a profiler.
+
+#include <fcntl.h>
+#include <getopt.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/Document.h"
+#include "base/Value.h"
+#include "database/BXDatabase.h"
+#include "platform/ledgerix/LedgerixWorkspace.h"
+#include "platform/zem/ZemCodec.h"
+#include "platform/zem/ZemFrame.h"
+#include "policy/BXDPlugIn.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using namespace bexil;
+using Clock = std::chrono::steady_clock;
+
+constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
+constexpr int kPlugInsPerApplication = 10;
+constexpr int kPoints = 50;
+constexpr int kOnThePoint = 20;
+constexpr auto kStartTimeout = std::chrono::seconds(60);
+
+std::string pointName(int point) { return "com.example.bench.point" + std::to_string(point); }
+
+struct Options {
+    std::vector<int> counts = {1000, 10000, 100000};
+    unsigned requests = 2000;
+    unsigned allRequests = 20;
+    int allMax = 10000;
+    fs::path cache;
+    std::string bxdPath;
+    std::string wrapper;
+    bool serverSide = true;
+};
+
+[[noreturn]] void die(const char* what) {
+    fprintf(stderr, "match_roundtrip_bench: %s: %s\n", what, errno ? strerror(errno) : "failed");
+    exit(1);
+}
+
+[[noreturn]] void usage() {
+    fputs(
+        "Usage: match_roundtrip_bench [--counts N,N,...] [--requests M] [--all-requests M] [--all-max N]\n"
+        "                             [--cache DIR] [--bxd PATH] [--wrapper CMD] [--no-server-side]\n",
+        stderr);
+    exit(2);
+}
+
+Options parseOptions(int argc, char** argv) {
+    static const option kLong[] = {
+        {"counts", required_argument, nullptr, 'c'},       {"requests", required_argument, nullptr, 'n'},
+        {"all-requests", required_argument, nullptr, 'a'}, {"all-max", required_argument, nullptr, 'm'},
+        {"cache", required_argument, nullptr, 'C'},        {"bxd", required_argument, nullptr, 'b'},
+        {"wrapper", required_argument, nullptr, 'w'},      {"no-server-side", no_argument, nullptr, 's'},
+        {nullptr, 0, nullptr, 0},
+    };
+    Options options;
+    options.cache = fs::temp_directory_path() / "bexil-match-bench-cache";
+    int c;
+    while ((c = getopt_long(argc, argv, "", kLong, nullptr)) != -1) {
+        switch (c) {
+            case 'c': {
+                options.counts.clear();
+                std::stringstream list(optarg);
+                std::string item;
+                while (std::getline(list, item, ',')) {
+                    int count = atoi(item.c_str());
+                    // Each point but the wanted one must get plug-ins too.
+                    if (count < kOnThePoint * kPlugInsPerApplication) usage();
+                    options.counts.push_back(count);
+                }
+                break;
+            }
+            case 'n':
+                options.requests = static_cast<unsigned>(std::max(1, atoi(optarg)));
+                break;
+            case 'a':
+                options.allRequests = static_cast<unsigned>(std::max(1, atoi(optarg)));
+                break;
+            case 'm':
+                options.allMax = atoi(optarg);
+                break;
+            case 'C':
+                options.cache = optarg;
+                break;
+            case 'b':
+                options.bxdPath = optarg;
+                break;
+            case 'w':
+                options.wrapper = optarg;
+                break;
+            case 's':
+                options.serverSide = false;
+                break;
+            default:
+                usage();
+        }
+    }
+    if (optind < argc || options.counts.empty()) usage();
+    if (options.bxdPath.empty()) {
+        fs::path self = fs::read_symlink("/proc/self/exe");
+        options.bxdPath = (self.parent_path() / ".." / "src" / "daemon" / "bxd").lexically_normal().string();
+    }
+    return options;
+}
+
+// ---- the registry ----------------------------------------------------------------------------------------------
+
+// The point of plug-in `index`: kOnThePoint of them, evenly spread, are on point 0; the rest go round the others.
+int pointOf(int index, int count) {
+    int every = count / kOnThePoint;
+    if (index % every == 0 && index / every < kOnThePoint) return 0;
+    return 1 + index % (kPoints - 1);
+}
+
+void writeDocument(const fs::path& file, const Value& value) { std::ofstream(file) << Document::write(value).value(); }
+
+// Builds the registry of `count` plug-ins under `dir` (apps/ and state/) unless a finished one is there.
+fs::path prepareRegistry(const fs::path& cache, int count) {
+    fs::path dir = cache / std::to_string(count);
+    if (fs::exists(dir / "ready")) return dir;
+    std::error_code ignored;
+    fs::remove_all(dir, ignored);
+    fs::create_directories(dir / "state");
+    fprintf(stderr, "building a registry of %d plug-ins in %s ...\n", count, dir.c_str());
+    Clock::time_point start = Clock::now();
+
+    LedgerixWorkspace::Options options;
+    options.stateDirectory = dir / "state";
+    options.durability = LedgerixWorkspace::Durability::Process;
+    std::shared_ptr<LedgerixWorkspace> workspace = *LedgerixWorkspace::open(options);
+    for (int i = 0; i < count; ++i) {
+        fs::path app = dir / "apps" / ("A" + std::to_string(i / kPlugInsPerApplication) + ".app");
+        // An application without its information document is a placeholder, whose plug-ins discovery skips.
+        if (i % kPlugInsPerApplication == 0) {
+            fs::create_directories(app);
+            writeDocument(app / "Info.vrec",
+                          Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.bench.a" +
+                                                                                  std::to_string(i))}}));
+        }
+        fs::path bundle = app / "PlugIns" / ("P" + std::to_string(i) + ".bxplugin");
+        fs::create_directories(bundle / "Resources");
+        writeDocument(
+            bundle / "Info.vrec",
+            Value::dictionary({
+                {"BDBundleIdentifier", Value::string("com.example.bench.p" + std::to_string(i))},
+                {"BDBundleVersion", Value::string("1")},
+                {"BDBundleName", Value::string("Plug-in " + std::to_string(i))},
+                {"RZExtension",
+                 Value::dictionary({
+                     {"RZExtensionPointIdentifier", Value::string(pointName(pointOf(i, count)))},
+                     {"RZExtensionProtocol", Value::string("#Data")},
+                     {"RZExtensionAttributes", Value::dictionary({{"RZExtensionVersion", Value::string("1.0")}})},
+                     {"Shared", Value::array({Value::string("Resources")})},
+                 })},
+            }));
+        if (!workspace->registerPlugin(bundle.string())) die("registering a plug-in");
+        if ((i + 1) % 10000 == 0) fprintf(stderr, "  %d registered\n", i + 1);
+    }
+    workspace.reset();
+    std::ofstream(dir / "ready") << "ok\n";
+    fprintf(stderr, "built in %.1f s\n", std::chrono::duration<double>(Clock::now() - start).count());
+    return dir;
+}
+
+// ---- the wire ------------------------------------------------------------------------------------------------
+
+int connectTo(const std::string& path) {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) die("socket");
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    if (path.size() >= sizeof address.sun_path) die("socket path too long");
+    memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+void writeAll(int fd, const uint8_t* bytes, size_t length) {
+    while (length > 0) {
+        ssize_t n = write(fd, bytes, length);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) die("write");
+        bytes += n;
+        length -= static_cast<size_t>(n);
+    }
+}
+
+void readExactly(int fd, uint8_t* bytes, size_t length) {
+    while (length > 0) {
+        ssize_t n = read(fd, bytes, length);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) die("read (bxd closed the connection)");
+        bytes += n;
+        length -= static_cast<size_t>(n);
+    }
+}
+
+struct Connection {
+    int fd = -1;
+    uint64_t serial = 0;
+    std::vector<uint8_t> request;
+    std::vector<uint8_t> reply;
+
+    // Sends `body` and waits for its reply frame; returns the reply frame's size, header included.
+    size_t roundTrip(const Value& body) {
+        request.clear();
+        if (ZemFrame::encode(ZemFrameKind::Request, ++serial, 0, body, request)) die("encoding the request");
+        writeAll(fd, request.data(), request.size());
+        reply.resize(ZemFrame::kHeaderBytes);
+        readExactly(fd, reply.data(), ZemFrame::kHeaderBytes);
+        Result<ZemFrameHeader> header = ZemFrame::decodeHeader(
+            std::span<const uint8_t, ZemFrame::kHeaderBytes>(reply.data(), ZemFrame::kHeaderBytes));
+        if (!header || header->kind != ZemFrameKind::Reply || header->inReplyTo != serial) die("unexpected reply");
+        reply.resize(ZemFrame::kHeaderBytes + header->payloadLength);
+        readExactly(fd, reply.data() + ZemFrame::kHeaderBytes, header->payloadLength);
+        return reply.size();
+    }
+
+    // The number of forms in the last reply; exits on an error reply.
+    size_t matches() const {
+        Result<Value> body = ZemCodec::decode(
+            std::span<const uint8_t>(reply.data() + ZemFrame::kHeaderBytes, reply.size() - ZemFrame::kHeaderBytes));
+        if (!body || body->find("errorcode")) {
+            fprintf(stderr, "match_roundtrip_bench: bad reply: %s\n",
+                    body ? body->description().c_str() : body.error().description().c_str());
+            exit(1);
+        }
+        const Value& forms = body->get("matches");
+        // Every form must carry its annotations and its resource token, or the figures measure less than they say.
+        for (const Value& form : forms.items()) {
+            if (!form.get("annotations").isDictionary() || !form.get("extensions").get("Resources").isString()) {
+                fprintf(stderr, "match_roundtrip_bench: incomplete form: %s\n", form.description().c_str());
+                exit(1);
+            }
+        }
+        return forms.items().size();
+    }
+};
+
+Value matchRequest(const Value& rules) {
+    return Value::dictionary({{"request", Value::string("match")},
+                              {"version", Value::uint64(3)},
+                              {"rules", rules},
+                              {"flags", Value::uint64(0)}});
+}
+
+pid_t startBxd(const Options& options, const fs::path& run) {
+    pid_t child = fork();
+    if (child < 0) die("fork");
+    if (child == 0) {
+        setenv("BX_SERVICE_DIR", (run / "service").c_str(), 1);
+        setenv("BX_STATE_DIR", (run / "state").c_str(), 1);
+        setenv("BX_RUNTIME_DIR", (run / "runtime").c_str(), 1);
+        setenv("BX_ENTITLEMENTS_DIR", (run / "entitlements.d").c_str(), 1);
+        setenv("BX_LOG_SINK", "stderr", 1);
+        setenv("BXD_LOG_LEVEL", "error", 1);
+        int log = open((run / "bxd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+        if (log >= 0) {
+            dup2(log, STDERR_FILENO);
+            dup2(log, STDOUT_FILENO);
+        }
+        std::vector<std::string> words;
+        std::stringstream wrapper(options.wrapper);
+        for (std::string word; wrapper >> word;) words.push_back(word);
+        words.push_back(options.bxdPath);
+        std::vector<char*> argv;
+        for (std::string& word : words) argv.push_back(word.data());
+        argv.push_back(nullptr);
+        execvp(argv[0], argv.data());
+        _exit(127);
+    }
+    return child;
+}
+
+void stopProcess(pid_t pid) {
+    if (pid <= 0) return;
+    kill(pid, SIGTERM);
+    waitpid(pid, nullptr, 0);
+}
+
+// ---- figures ---------------------------------------------------------------------------------------------------
+
+struct Percentiles {
+    double p50Us = 0, p99Us = 0;
+};
+
+Percentiles percentiles(std::vector<double> us) {
+    std::sort(us.begin(), us.end());
+    auto at = [&](double fraction) { return us[std::min(us.size() - 1, static_cast<size_t>(fraction * us.size()))]; };
+    return {at(0.50), at(0.99)};
+}
+
+double elapsedUs(Clock::time_point start) {
+    return std::chrono::duration<double, std::micro>(Clock::now() - start).count();
+}
+
+// What the match handler does for every candidate, in this process, down to the encoded reply: the server-side
+// cost without the socket, the request queue and the envelope. Returns the times of `rounds` runs and the count.
+std::pair<std::vector<double>, size_t> serverSide(BXDatabase& database, const Value& rules, unsigned rounds) {
+    BXMatchContext context{.annotations = &database.annotationSource()};
+    std::vector<double> times;
+    size_t matched = 0;
+    std::vector<uint8_t> out;
+    for (unsigned round = 0; round <= rounds; ++round) {
+        Clock::time_point start = Clock::now();
+        std::optional<BXDatabase::PlugInSet> candidates = database.findPlugIns(rules);
+        std::vector<Value> forms;
+        for (const auto& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
+            if (!plugIn->onSystemVolume() && !plugIn->containingUrl()) continue;
+            if (!plugIn->match(rules, context)) continue;
+            Result<MutableDictionary> form = plugIn->exportForm();
+            if (!form) continue;
+            database.addAnnotationForPlugInIn(*plugIn, *form);
+            plugIn->augmentForm(*form);
+            forms.push_back(form->value());
+        }
+        matched = forms.size();
+        out.clear();
+        if (ZemFrame::encode(ZemFrameKind::Reply, 0, 1, Value::dictionary({{"matches", Value::array(std::move(forms))}}),
+                             out))
+            die("encoding the forms");
+        // The first round builds the records; the figures are those of a warm daemon.
+        if (round > 0) times.push_back(elapsedUs(start));
+    }
+    return {times, matched};
+}
+
+void copyState(const fs::path& from, const fs::path& to) {
+    fs::create_directories(to);
+    fs::copy(from, to, fs::copy_options::recursive | fs::copy_options::overwrite_existing);
+}
+
+// The CPU time (user and system) `pid` has used so far, in microseconds: less disturbed by other work on the
+// machine than the wall-clock round trip, so it is the figure to compare builds by.
+double cpuUs(pid_t pid) {
+    std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+    std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+    size_t end = text.rfind(')');
+    if (end == std::string::npos) return 0;
+    std::istringstream fields(text.substr(end + 2));
+    std::string field;
+    unsigned long long user = 0, system = 0;
+    // After the name: state is field 3; utime and stime are fields 14 and 15.
+    for (int i = 3; i <= 15 && fields >> field; ++i) {
+        if (i == 14) user = std::stoull(field);
+        if (i == 15) system = std::stoull(field);
+    }
+    return static_cast<double>(user + system) * 1e6 / static_cast<double>(sysconf(_SC_CLK_TCK));
+}
+
+double loadAverage() {
+    double load = 0;
+    if (FILE* f = fopen("/proc/loadavg", "r")) {
+        if (fscanf(f, "%lf", &load) != 1) load = 0;
+        fclose(f);
+    }
+    return load;
+}
+
+void runSize(const Options& options, int count) {
+    fs::path registry = prepareRegistry(options.cache, count);
+    std::string pattern = (fs::temp_directory_path() / "bexil-match-run-XXXXXX").string();
+    if (!mkdtemp(pattern.data())) die("mkdtemp");
+    fs::path run = pattern;
+    for (const char* sub : {"service", "runtime", "entitlements.d"}) fs::create_directories(run / sub);
+    copyState(registry / "state", run / "state");
+
+    const Value pointRules = Value::dictionary({{"RZExtensionPointIdentifier", Value::string(pointName(0))}});
+    const Value noRules = Value::dictionary({});
+    const bool all = count <= options.allMax;
+    printf("== %d plug-ins registered (load average %.2f)\n", count, loadAverage());
+
+    if (options.serverSide) {
+        // In-process, on a private copy so that bxd later starts from the same state.
+        fs::path local = run / "local";
+        copyState(registry / "state", local / "state");
+        setenv("BX_STATE_DIR", (local / "state").c_str(), 1);
+        LedgerixWorkspace::Options lx;
+        lx.stateDirectory = local / "state";
+        lx.durability = LedgerixWorkspace::Durability::Process;
+        std::shared_ptr<LedgerixWorkspace> workspace = *LedgerixWorkspace::open(lx);
+        std::unique_ptr<BXDatabase> database =
+            BXDatabase::create((local / "annotations").string(), workspace, [](std::string_view) {});
+        auto [pointTimes, pointCount] = serverSide(*database, pointRules, options.requests);
+        Percentiles p = percentiles(pointTimes);
+        printf("server-side point match: %zu forms, p50 %.1f us, p99 %.1f us\n", pointCount, p.p50Us, p.p99Us);
+        if (all) {
+            auto [allTimes, allCount] = serverSide(*database, noRules, options.allRequests);
+            Percentiles a = percentiles(allTimes);
+            printf("server-side match all: %zu forms, p50 %.0f us = %.2f us per plug-in\n", allCount, a.p50Us,
+                   a.p50Us / static_cast<double>(allCount));
+        }
+    }
+
+    pid_t bxd = startBxd(options, run);
+    std::string socketPath = (run / "service" / kServiceName).string();
+    Connection connection;
+    for (Clock::time_point deadline = Clock::now() + kStartTimeout; connection.fd < 0;) {
+        if (Clock::now() > deadline || waitpid(bxd, nullptr, WNOHANG) != 0) die("bxd did not come up (see bxd.log)");
+        connection.fd = connectTo(socketPath);
+        if (connection.fd < 0) std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+
+    // The first point match builds the candidates' records; a few more settle the caches.
+    for (int i = 0; i < 20; ++i) connection.roundTrip(matchRequest(pointRules));
+    size_t pointCount = connection.matches();
+    std::vector<double> times;
+    times.reserve(options.requests);
+    size_t pointBytes = 0;
+    double cpuBefore = cpuUs(bxd);
+    for (unsigned i = 0; i < options.requests; ++i) {
+        Clock::time_point start = Clock::now();
+        pointBytes = connection.roundTrip(matchRequest(pointRules));
+        times.push_back(elapsedUs(start));
+    }
+    double pointCpu = (cpuUs(bxd) - cpuBefore) / options.requests;
+    Percentiles p = percentiles(times);
+    printf("round trip point match: %zu forms, %zu bytes, p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request "
+           "(load %.2f)\n",
+           pointCount, pointBytes, p.p50Us, p.p99Us, pointCpu, loadAverage());
+
+    if (all) {
+        Clock::time_point cold = Clock::now();
+        connection.roundTrip(matchRequest(noRules));
+        double coldUs = elapsedUs(cold);
+        size_t allCount = connection.matches();
+        std::vector<double> allTimes;
+        size_t bytes = 0;
+        double allCpuBefore = cpuUs(bxd);
+        for (unsigned i = 0; i < options.allRequests; ++i) {
+            Clock::time_point start = Clock::now();
+            bytes = connection.roundTrip(matchRequest(noRules));
+            allTimes.push_back(elapsedUs(start));
+        }
+        double allCpu = (cpuUs(bxd) - allCpuBefore) / options.allRequests / static_cast<double>(allCount);
+        Percentiles a = percentiles(allTimes);
+        double perForm = static_cast<double>(bytes) / static_cast<double>(allCount);
+        printf("round trip match all: %zu forms, %zu bytes (%.0f per form; the %zu-byte frame limit is passed at "
+               "about %.0f forms), first (cold) %.0f us, p50 %.0f us = %.2f us per plug-in, p99 %.0f us, bxd CPU "
+               "%.2f us per plug-in (load %.2f)\n",
+               allCount, bytes, perForm, ZemFrame::kMaxFrameBytes,
+               static_cast<double>(ZemFrame::kMaxFrameBytes) / perForm, coldUs, a.p50Us,
+               a.p50Us / static_cast<double>(allCount), a.p99Us, allCpu, loadAverage());
+    }
+    fflush(stdout);
+
+    close(connection.fd);
+    stopProcess(bxd);
+    std::error_code ignored;
+    fs::remove_all(run, ignored);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    Options options = parseOptions(argc, argv);
+    setvbuf(stdout, nullptr, _IOLBF, 0);
+    signal(SIGPIPE, SIG_IGN);
+    if (access(options.bxdPath.c_str(), X_OK) != 0) {
+        fprintf(stderr, "match_roundtrip_bench: no bxd at %s (use --bxd PATH)\n", options.bxdPath.c_str());
+        return 1;
+    }
+    // The in-process side's token key: one file for the whole run (the process keeps writing it back where it
+    // first put it), removed at the end.
+    std::string pattern = (fs::temp_directory_path() / "bexil-match-runtime-XXXXXX").string();
+    if (!mkdtemp(pattern.data())) die("mkdtemp");
+    setenv("BX_RUNTIME_DIR", pattern.c_str(), 1);
+    for (int count : options.counts) runSize(options, count);
+    std::error_code ignored;
+    fs::remove_all(pattern, ignored);
+    return 0;
+}
