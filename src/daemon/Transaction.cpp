@@ -1,12 +1,16 @@
 #include "daemon/Transaction.h"
 
+#include <fmt/format.h>
+
 #include <array>
 
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
 #include "platform/log/Log.h"
 #include "platform/trace/Probes.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemConnection.h"
+#include "platform/zem/ZemFrame.h"
 
 namespace bexil {
 
@@ -92,20 +96,31 @@ void Transaction::runHandler(std::string_view name) {
     fail(4, "unrecognized request");
 }
 
+// The code travels as an unsigned 64-bit number: the signed 32-bit code widened with its sign.
+static Value wireErrorCode(int code) { return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(code))); }
+
 void Transaction::done() {
     if (answered_.exchange(true)) {
         log::ops().fault("transaction answered twice for client %d", client_->pid());
         return;
     }
     Value reply = reply_.take();
+    // A reply larger than a frame can carry would be dropped by the connection and leave the client waiting for
+    // ever; it is answered as an internal failure instead. Measuring walks the reply once without allocating.
+    if (Result<size_t> size = ZemCodec::encodedSize(reply); size && *size > ZemFrame::kMaxPayloadBytes) {
+        log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", *size,
+                         client_->pid(), ZemFrame::kMaxPayloadBytes);
+        reply =
+            Value::dictionary({{"errorcode", wireErrorCode(4)},
+                               {"error", Value::string(fmt::format("reply of {} bytes exceeds the frame limit of {} "
+                                                                   "bytes",
+                                                                   *size, ZemFrame::kMaxPayloadBytes))}});
+    }
     if (trace::requestOutputEnabled()) trace::requestOutput(client_->pid(), reply.description().c_str());
     std::shared_ptr<ZemConnection> connection = client_->connection();
     if (!connection) return;  // the peer is gone: there is nobody to answer
     connection->sendReply(request_, reply);
 }
-
-// The code travels as an unsigned 64-bit number: the signed 32-bit code widened with its sign.
-static Value wireErrorCode(int code) { return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(code))); }
 
 void Transaction::fail(int code, std::string_view message) {
     reply_.set("errorcode", wireErrorCode(code));

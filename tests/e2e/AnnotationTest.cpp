@@ -313,6 +313,25 @@ TEST_F(AnnotationTest, AnotherProcessObservesTheChangeNotification) {
     EXPECT_EQ(calls.load(), 1);
 }
 
+TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
+    // Each annotation fits in a request, but the two together make a discovery reply larger than one frame.
+    TestClient client;
+    std::string bulk(9u << 20, 'x');
+    for (const Uuid& uuid : {hello_, bonjour_}) {
+        Value extension = Value::dictionary({{"bulk", Value::string(bulk)}});
+        Value reply = client.replyTo(annotateRequest(Value::dictionary({{"extension", extension}}), {uuid}));
+        ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
+    }
+    Value reply = client.replyTo(request("match", {}));
+    EXPECT_EQ(errorCode(reply), 4);
+    EXPECT_NE(errorText(reply).find("exceeds the frame limit"), std::string::npos) << errorText(reply);
+    EXPECT_TRUE(bxd_.waitForLog("exceeds the frame limit of")) << bxd_.log();
+    // The connection stays usable.
+    reply = client.replyTo(
+        request("match", {{"rules", Value::dictionary({{"RZExtensionIdentifier", Value::string("none")}})}}));
+    EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
+}
+
 TEST_F(AnnotationTest, AnnotationsSurviveARestart) {
     Value extension = Value::dictionary({{"colour", Value::string("green")}});
     {
