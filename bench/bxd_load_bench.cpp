@@ -48,6 +48,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "BxdBench.h"
 #include "base/Value.h"
 #include "bexil/DaemonClient.h"
 #include "platform/zem/ZemCodec.h"
@@ -57,6 +58,7 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace bexil;
+using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
@@ -96,11 +98,6 @@ struct Options {
 
     bool wants(Side side) const { return sides[static_cast<int>(side)]; }
 };
-
-[[noreturn]] void die(const char* what) {
-    fprintf(stderr, "bxd_load_bench: %s: %s\n", what, errno ? strerror(errno) : "failed");
-    exit(1);
-}
 
 [[noreturn]] void usage() {
     fputs(
@@ -188,37 +185,11 @@ Options parseOptions(int argc, char** argv) {
         fputs("bxd_load_bench: --payload pads hand-written requests only; use it with --mode raw,frames\n", stderr);
         exit(2);
     }
-    if (options.bxdPath.empty()) {
-        // Built side by side: build/<preset>/bench/bxd_load_bench and build/<preset>/src/daemon/bxd.
-        fs::path self = fs::read_symlink("/proc/self/exe");
-        options.bxdPath = (self.parent_path() / ".." / "src" / "daemon" / "bxd").lexically_normal().string();
-    }
+    if (options.bxdPath.empty()) options.bxdPath = bench::defaultBxdPath();
     return options;
 }
 
 // ---- socket helpers -------------------------------------------------------------------------------------------
-
-sockaddr_un unixAddress(const std::string& path) {
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    if (path.size() >= sizeof address.sun_path) {
-        errno = ENAMETOOLONG;
-        die(path.c_str());
-    }
-    memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    return address;
-}
-
-int connectTo(const std::string& path) {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0) die("socket");
-    sockaddr_un address = unixAddress(path);
-    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-        close(fd);
-        return -1;
-    }
-    return fd;
-}
 
 bool waitUntilConnectable(const std::string& path, pid_t server) {
     auto deadline = Clock::now() + kStartTimeout;
@@ -232,16 +203,6 @@ bool waitUntilConnectable(const std::string& path, pid_t server) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return false;
-}
-
-void writeAll(int fd, const uint8_t* bytes, size_t length) {
-    while (length > 0) {
-        ssize_t n = write(fd, bytes, length);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) die("write");
-        bytes += n;
-        length -= static_cast<size_t>(n);
-    }
 }
 
 // Reads one message of a length-prefixed protocol into `buffer`: first enough for its header, then the length the
@@ -554,16 +515,7 @@ pid_t startBxd(const std::string& binary, const fs::path& root) {
     pid_t child = fork();
     if (child < 0) die("fork");
     if (child == 0) {
-        setenv("BX_SERVICE_DIR", (root / "service").c_str(), 1);
-        setenv("BX_STATE_DIR", (root / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (root / "runtime").c_str(), 1);
-        setenv("BX_ENTITLEMENTS_DIR", (root / "entitlements.d").c_str(), 1);
-        setenv("BX_LOG_SINK", "stderr", 1);
-        int log = open((root / "bxd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-        if (log >= 0) {
-            dup2(log, STDERR_FILENO);
-            dup2(log, STDOUT_FILENO);
-        }
+        bench::enterPrivateBxdEnvironment(root);
         execl(binary.c_str(), binary.c_str(), static_cast<char*>(nullptr));
         _exit(127);
     }
@@ -586,6 +538,7 @@ unsigned cpusAvailable() {
 }  // namespace
 
 int main(int argc, char** argv) {
+    bench::programName = "bxd_load_bench";
     Options options = parseOptions(argc, argv);
 
     std::string pattern = (fs::temp_directory_path() / "bxd-load-XXXXXX").string();

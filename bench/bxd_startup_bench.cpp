@@ -38,6 +38,7 @@
 #include <thread>
 #include <vector>
 
+#include "BxdBench.h"
 #include "LargeRegistry.h"
 #include "base/Value.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
@@ -47,6 +48,7 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace bexil;
+using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
@@ -62,11 +64,6 @@ struct Options {
     int runs = 10;
     std::string bxdPath;
 };
-
-[[noreturn]] void die(const char* what) {
-    fprintf(stderr, "bxd_startup_bench: %s: %s\n", what, errno ? strerror(errno) : "failed");
-    exit(1);
-}
 
 [[noreturn]] void usage() {
     fputs("Usage: bxd_startup_bench [--plugins N] [--points P] [--runs R] [--bxd PATH]\n", stderr);
@@ -110,34 +107,8 @@ Options parseOptions(int argc, char** argv) {
         }
     }
     if (optind < argc) usage();
-    if (options.bxdPath.empty()) {
-        // Built side by side: build/<preset>/bench/bxd_startup_bench and build/<preset>/src/daemon/bxd.
-        fs::path self = fs::read_symlink("/proc/self/exe");
-        options.bxdPath = (self.parent_path() / ".." / "src" / "daemon" / "bxd").lexically_normal().string();
-    }
+    if (options.bxdPath.empty()) options.bxdPath = bench::defaultBxdPath();
     return options;
-}
-
-sockaddr_un unixAddress(const std::string& path) {
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    if (path.size() >= sizeof address.sun_path) {
-        errno = ENAMETOOLONG;
-        die(path.c_str());
-    }
-    memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    return address;
-}
-
-int connectTo(const std::string& path) {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0) die("socket");
-    sockaddr_un address = unixAddress(path);
-    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-        close(fd);
-        return -1;
-    }
-    return fd;
 }
 
 // One request frame that bxd answers at once (a request name it does not know), and the check of its reply.
@@ -147,32 +118,14 @@ void roundTrip(int fd) {
     body.set("version", Value::uint64(3));
     std::vector<uint8_t> frame;
     if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, body.take(), frame)) die("encoding the request");
-    for (size_t done = 0; done < frame.size();) {
-        ssize_t n = write(fd, frame.data() + done, frame.size() - done);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) die("write");
-        done += static_cast<size_t>(n);
-    }
+    writeAll(fd, frame.data(), frame.size());
     std::vector<uint8_t> reply(ZemFrame::kHeaderBytes);
-    size_t have = 0;
-    size_t want = ZemFrame::kHeaderBytes;
-    bool headerSeen = false;
-    for (;;) {
-        if (have >= want) {
-            if (headerSeen) break;
-            headerSeen = true;
-            Result<ZemFrameHeader> header = ZemFrame::decodeHeader(
-                std::span<const uint8_t, ZemFrame::kHeaderBytes>(reply.data(), ZemFrame::kHeaderBytes));
-            if (!header || header->kind != ZemFrameKind::Reply || header->inReplyTo != 1) die("reply header");
-            want += header->payloadLength;
-            reply.resize(want);
-            if (have >= want) break;
-        }
-        ssize_t n = read(fd, reply.data() + have, want - have);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) die("read (bxd closed the connection)");
-        have += static_cast<size_t>(n);
-    }
+    readExactly(fd, reply.data(), ZemFrame::kHeaderBytes);
+    Result<ZemFrameHeader> header =
+        ZemFrame::decodeHeader(std::span<const uint8_t, ZemFrame::kHeaderBytes>(reply.data(), ZemFrame::kHeaderBytes));
+    if (!header || header->kind != ZemFrameKind::Reply || header->inReplyTo != 1) die("reply header");
+    reply.resize(ZemFrame::kHeaderBytes + header->payloadLength);
+    readExactly(fd, reply.data() + ZemFrame::kHeaderBytes, header->payloadLength);
 }
 
 // A named figure of a process's /proc/<pid>/<file> ("VmRSS:" in status, "rchar:" in io), or -1.
@@ -293,6 +246,7 @@ double fileMiB(const fs::path& path) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    bench::programName = "bxd_startup_bench";
     Options options = parseOptions(argc, argv);
     if (access(options.bxdPath.c_str(), X_OK) != 0) {
         fprintf(stderr, "bxd_startup_bench: no bxd at %s (use --bxd PATH)\n", options.bxdPath.c_str());

@@ -41,6 +41,7 @@
 #include <thread>
 #include <vector>
 
+#include "BxdBench.h"
 #include "base/Document.h"
 #include "base/Value.h"
 #include "database/BXDatabase.h"
@@ -53,6 +54,7 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace bexil;
+using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
@@ -73,11 +75,6 @@ struct Options {
     std::string wrapper;
     bool serverSide = true;
 };
-
-[[noreturn]] void die(const char* what) {
-    fprintf(stderr, "match_roundtrip_bench: %s: %s\n", what, errno ? strerror(errno) : "failed");
-    exit(1);
-}
 
 [[noreturn]] void usage() {
     fputs(
@@ -138,10 +135,7 @@ Options parseOptions(int argc, char** argv) {
         }
     }
     if (optind < argc || options.counts.empty()) usage();
-    if (options.bxdPath.empty()) {
-        fs::path self = fs::read_symlink("/proc/self/exe");
-        options.bxdPath = (self.parent_path() / ".." / "src" / "daemon" / "bxd").lexically_normal().string();
-    }
+    if (options.bxdPath.empty()) options.bxdPath = bench::defaultBxdPath();
     return options;
 }
 
@@ -206,40 +200,6 @@ fs::path prepareRegistry(const fs::path& cache, int count) {
 
 // ---- the wire ------------------------------------------------------------------------------------------------
 
-int connectTo(const std::string& path) {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0) die("socket");
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    if (path.size() >= sizeof address.sun_path) die("socket path too long");
-    memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-        close(fd);
-        return -1;
-    }
-    return fd;
-}
-
-void writeAll(int fd, const uint8_t* bytes, size_t length) {
-    while (length > 0) {
-        ssize_t n = write(fd, bytes, length);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) die("write");
-        bytes += n;
-        length -= static_cast<size_t>(n);
-    }
-}
-
-void readExactly(int fd, uint8_t* bytes, size_t length) {
-    while (length > 0) {
-        ssize_t n = read(fd, bytes, length);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) die("read (bxd closed the connection)");
-        bytes += n;
-        length -= static_cast<size_t>(n);
-    }
-}
-
 struct Connection {
     int fd = -1;
     uint64_t serial = 0;
@@ -293,17 +253,8 @@ pid_t startBxd(const Options& options, const fs::path& run) {
     pid_t child = fork();
     if (child < 0) die("fork");
     if (child == 0) {
-        setenv("BX_SERVICE_DIR", (run / "service").c_str(), 1);
-        setenv("BX_STATE_DIR", (run / "state").c_str(), 1);
-        setenv("BX_RUNTIME_DIR", (run / "runtime").c_str(), 1);
-        setenv("BX_ENTITLEMENTS_DIR", (run / "entitlements.d").c_str(), 1);
-        setenv("BX_LOG_SINK", "stderr", 1);
+        bench::enterPrivateBxdEnvironment(run);
         setenv("BXD_LOG_LEVEL", "error", 1);
-        int log = open((run / "bxd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-        if (log >= 0) {
-            dup2(log, STDERR_FILENO);
-            dup2(log, STDOUT_FILENO);
-        }
         std::vector<std::string> words;
         std::stringstream wrapper(options.wrapper);
         for (std::string word; wrapper >> word;) words.push_back(word);
@@ -498,6 +449,7 @@ void runSize(const Options& options, int count) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    bench::programName = "match_roundtrip_bench";
     Options options = parseOptions(argc, argv);
     setvbuf(stdout, nullptr, _IOLBF, 0);
     signal(SIGPIPE, SIG_IGN);

@@ -1,0 +1,93 @@
+#pragma once
+
+// What the benchmarks that drive the real bxd over its socket share: the fatal-error exit, where bxd is found, the
+// Unix socket plumbing, blocking whole writes and reads, and the private environment a child bxd starts in.
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <string>
+
+namespace bexil::bench {
+
+// The name error messages start with; each program sets it first thing in main.
+inline const char* programName = "bench";
+
+[[noreturn]] inline void die(const char* what) {
+    fprintf(stderr, "%s: %s: %s\n", programName, what, errno ? strerror(errno) : "failed");
+    exit(1);
+}
+
+// Built side by side: build/<preset>/bench/<program> and build/<preset>/src/daemon/bxd.
+inline std::string defaultBxdPath() {
+    std::filesystem::path self = std::filesystem::read_symlink("/proc/self/exe");
+    return (self.parent_path() / ".." / "src" / "daemon" / "bxd").lexically_normal().string();
+}
+
+inline sockaddr_un unixAddress(const std::string& path) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    if (path.size() >= sizeof address.sun_path) {
+        errno = ENAMETOOLONG;
+        die(path.c_str());
+    }
+    memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    return address;
+}
+
+// A connected stream socket, or -1 while nothing listens at `path` yet.
+inline int connectTo(const std::string& path) {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) die("socket");
+    sockaddr_un address = unixAddress(path);
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+inline void writeAll(int fd, const uint8_t* bytes, size_t length) {
+    while (length > 0) {
+        ssize_t n = write(fd, bytes, length);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) die("write");
+        bytes += n;
+        length -= static_cast<size_t>(n);
+    }
+}
+
+inline void readExactly(int fd, uint8_t* bytes, size_t length) {
+    while (length > 0) {
+        ssize_t n = read(fd, bytes, length);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) die("read (bxd closed the connection)");
+        bytes += n;
+        length -= static_cast<size_t>(n);
+    }
+}
+
+// In a forked child about to exec bxd: points its BX_* directories at service/, state/, runtime/ and
+// entitlements.d/ under `root` and sends its log (and standard output) to root/bxd.log.
+inline void enterPrivateBxdEnvironment(const std::filesystem::path& root) {
+    setenv("BX_SERVICE_DIR", (root / "service").c_str(), 1);
+    setenv("BX_STATE_DIR", (root / "state").c_str(), 1);
+    setenv("BX_RUNTIME_DIR", (root / "runtime").c_str(), 1);
+    setenv("BX_ENTITLEMENTS_DIR", (root / "entitlements.d").c_str(), 1);
+    setenv("BX_LOG_SINK", "stderr", 1);
+    int log = open((root / "bxd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+    if (log >= 0) {
+        dup2(log, STDERR_FILENO);
+        dup2(log, STDOUT_FILENO);
+    }
+}
+
+}  // namespace bexil::bench
