@@ -18,6 +18,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 
@@ -26,13 +27,11 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
 using test::TestClient;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr int kRounds = 20;
 constexpr int kLongestRunMs = 150;
-
-int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
 
 // The annotation a client sets in its `n`th change: an election and client data whose size varies, so that a
 // document mixing two writes or cut short cannot pass for a whole one.
@@ -84,10 +83,7 @@ struct Writer {
 class AnnotationCrashTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        bundles_ = bxd_.root() / "bundles";
-        fs::create_directories(bundles_);
-        fs::copy(kExamples / "Greeter.app", bundles_ / "Greeter.app", fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
+        bundles_ = test::copyExampleGreeter(bxd_.root());
         bxd_.exportEnvironment();
         ASSERT_TRUE(start()) << bxd_.log();
 

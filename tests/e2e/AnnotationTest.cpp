@@ -14,6 +14,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
@@ -28,8 +29,9 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
+using test::errorText;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kChangeNotification = "com.quorvel.bexil.annotation-change";
 // The annotation keys of the example plug-ins: their identifiers, except where a plug-in names another to replace.
 constexpr const char* kHelloKey = "com.example.greeter.hello";
@@ -53,12 +55,6 @@ Value annotateRequest(const Value& annotations, const std::vector<Uuid>& uuids) 
     return request("annotate", {{"annotations", annotations}, {"uuids", uuidArray(uuids)}});
 }
 
-int64_t errorCode(const Value& reply) {
-    const Value* code = reply.find("errorcode");
-    return code && code->numberAsInt64() ? *code->numberAsInt64() : 0;
-}
-std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
-
 std::string slurp(const fs::path& path) {
     std::ifstream in(path);
     std::stringstream text;
@@ -69,10 +65,7 @@ std::string slurp(const fs::path& path) {
 class AnnotationTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        bundles_ = bxd_.root() / "bundles";
-        fs::create_directories(bundles_);
-        fs::copy(kExamples / "Greeter.app", bundles_ / "Greeter.app", fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
+        bundles_ = test::copyExampleGreeter(bxd_.root());
         bxd_.exportEnvironment();
         ASSERT_TRUE(start()) << bxd_.log();
 
@@ -94,15 +87,7 @@ class AnnotationTest : public ::testing::Test {
     }
 
     std::optional<Uuid> registeredUuid(const std::string& path) {
-        LedgerixWorkspace::Options options;
-        options.stateDirectory = bxd_.root() / "state";
-        auto registry = LedgerixWorkspace::open(options);
-        if (!registry) {
-            ADD_FAILURE() << registry.error().description();
-            return std::nullopt;
-        }
-        auto proxy = (*registry)->pluginProxyForURL(path);
-        return proxy ? proxy->pluginUUID() : std::nullopt;
+        return test::registeredUuid(bxd_.root() / "state", path);
     }
 
     // The annotation map of the document on disk (null when there is no document or no map).

@@ -16,6 +16,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
@@ -27,6 +28,8 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
+using test::errorText;
 using Ids = std::vector<std::string>;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
@@ -50,9 +53,6 @@ Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0
     if (flags) entries.emplace_back("flags", Value::uint64(flags));
     return Value::dictionary(std::move(entries));
 }
-
-int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
-std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
 // The identifiers of the reply's forms, sorted.
 Ids identifiers(const Value& reply) {

@@ -11,6 +11,7 @@
 #include <variant>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
@@ -24,6 +25,8 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
+using test::errorText;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
@@ -39,12 +42,6 @@ Value pathsRequest(const char* name, const std::vector<std::string>& paths) {
     for (const auto& p : paths) values.push_back(Value::string(p));
     return pathsRequest(name, std::move(values));
 }
-
-int64_t errorCode(const Value& reply) {
-    const Value* code = reply.find("errorcode");
-    return code && code->numberAsInt64() ? *code->numberAsInt64() : 0;
-}
-std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
 class RegistrationTest : public ::testing::Test {
   protected:
@@ -62,15 +59,7 @@ class RegistrationTest : public ::testing::Test {
 
     // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
     std::optional<Uuid> registeredUuid(const std::string& path) {
-        LedgerixWorkspace::Options options;
-        options.stateDirectory = bxd_.root() / "state";
-        auto registry = LedgerixWorkspace::open(options);
-        if (!registry) {
-            ADD_FAILURE() << registry.error().description();
-            return std::nullopt;
-        }
-        auto proxy = (*registry)->pluginProxyForURL(path);
-        return proxy ? proxy->pluginUUID() : std::nullopt;
+        return test::registeredUuid(bxd_.root() / "state", path);
     }
 
     // Gives this test program the manager entitlement through the daemon's trusted entitlements directory.

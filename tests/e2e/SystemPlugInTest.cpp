@@ -19,6 +19,7 @@
 #include <thread>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 
@@ -27,6 +28,8 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
+using test::errorText;
 using test::TestClient;
 using Ids = std::vector<std::string>;
 
@@ -38,9 +41,6 @@ const std::string kHello = "com.example.greeter.hello";
 const std::string kSystemClock = "/System/Library/PlugIns/Clock.bxplugin";
 
 Value str(std::string_view s) { return Value::string(s); }
-
-int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
-std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
 Value matchRequest(std::optional<Value> rules, uint64_t flags) {
     std::vector<std::pair<std::string, Value>> entries = {{"request", str("match")}, {"version", Value::uint64(3)}};

@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "BxdProcess.h"
+#include "E2eSupport.h"
 #include "TestClient.h"
 #include "base/Document.h"
 #include "platform/jobard/RunningInstances.h"
@@ -23,15 +24,13 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::BxdProcess;
+using test::errorCode;
+using test::errorText;
 using test::TestClient;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kBonjour = "com.example.greeter.bonjour";
-
-int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
-std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
 // A stand-in for a running plug-in: a child that sleeps until it is signalled, lets go of the test's output and
 // dies with the test however the test ends.
@@ -63,10 +62,7 @@ int endingSignal(pid_t pid, std::chrono::milliseconds timeout) {
 class UninstallTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        bundles_ = bxd_.root() / "bundles";
-        fs::create_directories(bundles_);
-        fs::copy(kExamples / "Greeter.app", bundles_ / "Greeter.app", fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
+        bundles_ = test::copyExampleGreeter(bxd_.root());
         bxd_.exportEnvironment();
 
         // This test program is the manager, through the daemon's trusted entitlements directory.
