@@ -30,7 +30,9 @@ namespace fs = std::filesystem;
 using test::BxdProcess;
 using test::errorCode;
 using test::errorText;
-using Ids = std::vector<std::string>;
+using test::identifiers;
+using test::Ids;
+using test::matchRequest;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
@@ -45,22 +47,6 @@ const std::string kClipper = "com.example.notes.clipper";
 Value str(std::string_view s) { return Value::string(s); }
 
 using test::TestClient;
-
-Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0, uint64_t version = 3) {
-    std::vector<std::pair<std::string, Value>> entries = {{"request", str("match")},
-                                                          {"version", Value::uint64(version)}};
-    if (rules) entries.emplace_back("rules", *rules);
-    if (flags) entries.emplace_back("flags", Value::uint64(flags));
-    return Value::dictionary(std::move(entries));
-}
-
-// The identifiers of the reply's forms, sorted.
-Ids identifiers(const Value& reply) {
-    Ids ids;
-    for (const Value& form : reply.get("matches").items()) ids.emplace_back(form.get("identifier").stringView());
-    std::sort(ids.begin(), ids.end());
-    return ids;
-}
 
 // The forms of the reply whose identifier is `identifier`.
 std::vector<Value> formsOf(const Value& reply, const std::string& identifier) {

@@ -5,10 +5,13 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "base/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
@@ -41,6 +44,25 @@ inline std::optional<Uuid> registeredUuid(const std::filesystem::path& stateDire
     }
     auto proxy = (*registry)->pluginProxyForURL(path);
     return proxy ? proxy->pluginUUID() : std::nullopt;
+}
+
+// A "match" request with the given rules (none: the key is absent) and flag word (0: the key is absent).
+inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0, uint64_t version = 3) {
+    std::vector<std::pair<std::string, Value>> entries = {{"request", Value::string("match")},
+                                                          {"version", Value::uint64(version)}};
+    if (rules) entries.emplace_back("rules", *rules);
+    if (flags) entries.emplace_back("flags", Value::uint64(flags));
+    return Value::dictionary(std::move(entries));
+}
+
+using Ids = std::vector<std::string>;
+
+// The identifiers of a discovery reply's forms, sorted.
+inline Ids identifiers(const Value& reply) {
+    Ids ids;
+    for (const Value& form : reply.get("matches").items()) ids.emplace_back(form.get("identifier").stringView());
+    std::sort(ids.begin(), ids.end());
+    return ids;
 }
 
 }  // namespace bexil::test

@@ -30,8 +30,10 @@ namespace fs = std::filesystem;
 using test::BxdProcess;
 using test::errorCode;
 using test::errorText;
+using test::identifiers;
+using test::Ids;
+using test::matchRequest;
 using test::TestClient;
-using Ids = std::vector<std::string>;
 
 const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
@@ -41,20 +43,6 @@ const std::string kHello = "com.example.greeter.hello";
 const std::string kSystemClock = "/System/Library/PlugIns/Clock.bxplugin";
 
 Value str(std::string_view s) { return Value::string(s); }
-
-Value matchRequest(std::optional<Value> rules, uint64_t flags) {
-    std::vector<std::pair<std::string, Value>> entries = {{"request", str("match")}, {"version", Value::uint64(3)}};
-    if (rules) entries.emplace_back("rules", *rules);
-    if (flags) entries.emplace_back("flags", Value::uint64(flags));
-    return Value::dictionary(std::move(entries));
-}
-
-Ids identifiers(const Value& reply) {
-    Ids ids;
-    for (const Value& form : reply.get("matches").items()) ids.emplace_back(form.get("identifier").stringView());
-    std::sort(ids.begin(), ids.end());
-    return ids;
-}
 
 std::string quoted(const std::string& word) { return "'" + word + "'"; }
 
