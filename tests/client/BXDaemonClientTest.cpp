@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <future>
 #include <mutex>
+#include <optional>
 
 #include "TestSupport.h"
 #include "base/EventLoop.h"
@@ -24,7 +25,8 @@ using Reply = BXDaemonClient::Reply;
 // A service on a private directory that answers every request with `answer` and remembers what it got.
 class CapturingService {
   public:
-    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName) : queue_("capture", loop_) {
+    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName)
+        : queue_("capture", *loop_) {
         auto listener = ZemListener::create(service, queue_, nullptr);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;
@@ -46,9 +48,14 @@ class CapturingService {
         });
         listener_->resume();
     }
+    // A client may still be connecting while the test ends, so its accept can race this destructor: cancel on the
+    // service's own queue, then end the loop's thread before the members its handlers use are destroyed.
     ~CapturingService() {
-        listener_->cancel();
-        for (auto& peer : peers_) peer->cancel();
+        queue_.sync([this] {
+            listener_->cancel();
+            for (auto& peer : peers_) peer->cancel();
+        });
+        loop_.reset();
     }
 
     void setAnswer(Value answer) { answer_ = std::move(answer); }
@@ -60,7 +67,7 @@ class CapturingService {
   private:
     test::TempDir dir_{"bexil-client-test"};
     test::ScopedEnv serviceDir_{"BX_SERVICE_DIR", dir_.path().string()};
-    EventLoop loop_{1};
+    std::optional<EventLoop> loop_{std::in_place, 1};
     SerialQueue queue_;
     std::shared_ptr<ZemListener> listener_;
     std::mutex mutex_;
