@@ -369,14 +369,9 @@ TEST(DocumentWrite, UnrepresentableValuesAreErrorsNamingWhere) {
 
 class DocumentFileTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        directory_ = std::filesystem::path(BEXIL_BINARY_DIR) / "document-test" /
-                     ::testing::UnitTest::GetInstance()->current_test_info()->name();
-        std::filesystem::remove_all(directory_);
-        std::filesystem::create_directories(directory_);
-        path_ = directory_ / "Annotations.vrec";
-    }
-    void TearDown() override { std::filesystem::remove_all(directory_); }
+    test::TempDir tmp_{"bexil-document"};
+    std::filesystem::path directory_ = tmp_.path();
+    std::filesystem::path path_ = directory_ / "Annotations.vrec";
 
     std::string contents() const { return test::readText(path_); }
     std::vector<std::string> names() const {
@@ -386,9 +381,6 @@ class DocumentFileTest : public ::testing::Test {
         std::sort(out.begin(), out.end());
         return out;
     }
-
-    std::filesystem::path directory_;
-    std::filesystem::path path_;
 };
 
 TEST_F(DocumentFileTest, WriteThenReadGivesTheValueBack) {

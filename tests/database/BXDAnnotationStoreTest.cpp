@@ -41,18 +41,12 @@ struct KeyedRecord {
 class AnnotationStoreTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        directory_ = fs::path(BEXIL_BINARY_DIR) / "annotation-store-test" /
-                     ::testing::UnitTest::GetInstance()->current_test_info()->name();
-        fs::remove_all(directory_);
-        fs::create_directories(directory_);
+        directory_ = tmp_.path();
         path_ = directory_ / "Bexil-Annotations";
         legacyPath_ = directory_ / "state" / "containers" / "com.quorvel.bxd" / "Bexil-Annotations";
         stateDir_.emplace("BX_STATE_DIR", (directory_ / "state").string());
     }
-    void TearDown() override {
-        stateDir_.reset();
-        fs::remove_all(directory_);
-    }
+    void TearDown() override { stateDir_.reset(); }
 
     static Value document(Value data, int64_t version = 16) {
         return dict({{"version", integer(version)}, {"data", std::move(data)}});
@@ -71,6 +65,7 @@ class AnnotationStoreTest : public ::testing::Test {
     }
     std::string store() const { return path_.string(); }
 
+    test::TempDir tmp_{"bexil-annotation-store"};
     fs::path directory_, path_, legacyPath_;
     std::optional<ScopedEnv> stateDir_;
     log::CaptureSink capture_;
