@@ -1,9 +1,7 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <cstdio>
 #include <regex>
 #include <string>
 #include <thread>
@@ -26,54 +24,42 @@ struct CountingObject {
     }
 };
 
-// Runs `body` with standard error redirected to a file and returns what was written there.
+// Everything written to the descriptor that `body` gets, read back after `body` closed it.
 template <class F>
-std::string captureStandardError(F body) {
-    char path[] = "/tmp/bexil-log-test-XXXXXX";
-    int file = mkstemp(path);
-    EXPECT_GE(file, 0);
-    unlink(path);
-    int saved = dup(STDERR_FILENO);
-    dup2(file, STDERR_FILENO);
-    body();
-    dup2(saved, STDERR_FILENO);
-    close(saved);
+std::string writtenThroughPipe(F body) {
+    int fds[2];
+    EXPECT_EQ(pipe(fds), 0);
+    body(fds[1]);
+    close(fds[1]);
     std::string out;
-    char buf[4096];
-    lseek(file, 0, SEEK_SET);
-    for (ssize_t n; (n = read(file, buf, sizeof buf)) > 0;) out.append(buf, static_cast<size_t>(n));
-    close(file);
+    char buf[512];
+    for (ssize_t n; (n = read(fds[0], buf, sizeof buf)) > 0;) out.append(buf, static_cast<size_t>(n));
+    close(fds[0]);
     return out;
 }
 
-TEST(LogLevelTest, NamesAndJournalPriorities) {
-    for (Level level : {Level::Debug, Level::Info, Level::Default, Level::Error, Level::Fault})
+// The names BXD_LOG_LEVEL accepts (exactly, in lower case) and the journal priority of each level.
+TEST(LogLevelTest, NamesParseBackAndEachLevelHasItsJournalPriority) {
+    const std::pair<Level, int> levels[] = {
+        {Level::Debug, 7}, {Level::Info, 6}, {Level::Default, 5}, {Level::Error, 3}, {Level::Fault, 2}};
+    for (const auto& [level, priority] : levels) {
         EXPECT_EQ(parseLevel(levelName(level)), level);
+        EXPECT_EQ(journalPriority(level), priority) << levelName(level);
+    }
     EXPECT_FALSE(parseLevel("warning").has_value());
     EXPECT_FALSE(parseLevel("INFO").has_value());
-    EXPECT_EQ(journalPriority(Level::Debug), 7);
-    EXPECT_EQ(journalPriority(Level::Info), 6);
-    EXPECT_EQ(journalPriority(Level::Default), 5);
-    EXPECT_EQ(journalPriority(Level::Error), 3);
-    EXPECT_EQ(journalPriority(Level::Fault), 2);
 }
 
-TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndFormattedAndAnUnknownOneMeansInfoReportedOnce) {
+// The setting decides what is enabled, and a disabled message is not even formatted; an unset setting means info,
+// and so does an unknown one, which is reported once on the default log.
+TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndAnUnknownOneMeansInfoReportedOnce) {
     LogRegistry registry("error");
-    EXPECT_EQ(registry.threshold(), Level::Error);
-    EXPECT_FALSE(registry.ops().enabled(Level::Info));
     EXPECT_FALSE(registry.ops().enabled(Level::Default));
     EXPECT_TRUE(registry.ops().enabled(Level::Error));
-    EXPECT_TRUE(registry.ops().enabled(Level::Fault));
-
     std::atomic<int> calls{0};
     registry.ops().info("skipped %@", CountingObject{&calls});
     EXPECT_EQ(calls.load(), 0);
-
     EXPECT_EQ(LogRegistry(nullptr).threshold(), Level::Info);
-    EXPECT_EQ(LogRegistry("").threshold(), Level::Info);
-    EXPECT_EQ(LogRegistry("debug").threshold(), Level::Debug);
-    EXPECT_EQ(LogRegistry("fault").threshold(), Level::Fault);
 
     CaptureSink capture;
     LogRegistry loud("loud");
@@ -82,74 +68,67 @@ TEST(LogThresholdTest, LevelSettingDecidesWhatIsEnabledAndFormattedAndAnUnknownO
     loud.traffic().info("second");
     auto reports = capture.matching("BXD_LOG_LEVEL");
     ASSERT_EQ(reports.size(), 1u);
+    EXPECT_EQ(reports[0].message,
+              "unknown BXD_LOG_LEVEL value \"loud\" (expected debug, info, default, error or fault); using info");
     EXPECT_EQ(reports[0].level, Level::Error);
-    EXPECT_NE(reports[0].message.find("\"loud\""), std::string::npos);
     EXPECT_EQ(reports[0].category, "");
-
-    CaptureSink quiet;
-    LogRegistry fine("default");
-    EXPECT_FALSE(quiet.contains("BXD_LOG_LEVEL"));
 }
 
-TEST(LogThresholdTest, StandardErrorCarriesOnlyMessagesAtOrAboveTheThreshold) {
-    if (SystemLogSink().destination() == SystemLogSink::Destination::Journal)
-        GTEST_SKIP() << "messages go to the journal on this machine";
-    LogRegistry registry("default");
-    std::string out = captureStandardError([&] {
-        registry.ops().info("below the threshold %d", 1);
-        registry.ops().notice("at the threshold %d", 2);
-        registry.lx().error("above the threshold %s", "x");
+// A line is "<UTC time to the microsecond> <level> <category or ->: <message>", one line per message (a newline
+// inside is escaped), and standard error carries only what is at or above the threshold.
+TEST(LogSinkTest, StreamLinesCarryTimeLevelCategoryAndOneMessageAtOrAboveTheThreshold) {
+    std::string out = writtenThroughPipe([](int fd) {
+        SystemLogSink sink(SystemLogSink::Destination::Stream, fd);
+        sink.write(LogRecord{Level::Error, "com.quorvel.Bexil", "ops", "two\nlines", std::chrono::system_clock::now()});
+        sink.write(LogRecord{Level::Info, "", "", "from the default log", std::chrono::system_clock::now()});
     });
-    EXPECT_EQ(out.find("below the threshold"), std::string::npos);
-    EXPECT_NE(out.find(" default ops: at the threshold 2\n"), std::string::npos);
-    EXPECT_NE(out.find(" error lx: above the threshold x\n"), std::string::npos);
-}
-
-TEST(LogSinkTest, StreamLinesCarryTimeLevelCategoryAndOneMessage) {
-    int fds[2];
-    ASSERT_EQ(pipe(fds), 0);
-    SystemLogSink sink(SystemLogSink::Destination::Stream, fds[1]);
-    sink.write(LogRecord{Level::Error, "com.quorvel.Bexil", "ops", "two\nlines", std::chrono::system_clock::now()});
-    sink.write(LogRecord{Level::Info, "", "", "from the default log", std::chrono::system_clock::now()});
-    close(fds[1]);
-    std::string out;
-    char buf[512];
-    for (ssize_t n; (n = read(fds[0], buf, sizeof buf)) > 0;) out.append(buf, static_cast<size_t>(n));
-    close(fds[0]);
     std::regex expected(
         "\\d{4}-\\d\\d-\\d\\dT\\d\\d:\\d\\d:\\d\\d\\.\\d{6}Z error ops: two\\\\nlines\n"
         "\\d{4}-\\d\\d-\\d\\dT\\d\\d:\\d\\d:\\d\\d\\.\\d{6}Z info -: from the default log\n");
     EXPECT_TRUE(std::regex_match(out, expected)) << out;
+
+    if (SystemLogSink().destination() == SystemLogSink::Destination::Journal)
+        GTEST_SKIP() << "messages go to the journal on this machine";
+    LogRegistry registry("default");
+    out = writtenThroughPipe([&](int fd) {
+        int saved = dup(STDERR_FILENO);
+        dup2(fd, STDERR_FILENO);
+        registry.ops().info("below the threshold %d", 1);
+        registry.lx().notice("at the threshold %d", 2);
+        dup2(saved, STDERR_FILENO);
+        close(saved);
+    });
+    EXPECT_EQ(out.find("below the threshold"), std::string::npos);
+    EXPECT_NE(out.find(" default lx: at the threshold 2\n"), std::string::npos) << out;
 }
 
+// A capture sees every channel at every level, whatever the threshold, with its category and formatted text.
 TEST(LogCaptureTest, RecordsLevelSubsystemCategoryAndFormattedText) {
     CaptureSink capture;
-    LogRegistry registry("fault");  // the capture sees debug lines even though the system sink would not
+    LogRegistry registry("fault");
     registry.ops().debug("client %d requested %{public}s", 42, "match");
     registry.traffic().info("reply %@", Value::string("ok"));
     registry.extension().notice("rule %s", "x");
     registry.lx().error("registry %u", 3u);
-    registry.ops().fault("broken %d", 1);
 
     auto all = capture.entries();
-    ASSERT_EQ(all.size(), 5u);
+    ASSERT_EQ(all.size(), 4u);
     EXPECT_EQ(all[0].level, Level::Debug);
     EXPECT_EQ(all[0].subsystem, "com.quorvel.Bexil");
-    EXPECT_EQ(all[0].category, "ops");
     EXPECT_EQ(all[0].message, "client 42 requested match");
-    EXPECT_EQ(all[1].category, "traffic");
     EXPECT_EQ(all[1].message, "reply ok");
     EXPECT_EQ(all[2].level, Level::Default);
-    EXPECT_EQ(all[2].category, "extension");
-    EXPECT_EQ(all[3].category, "lx");
-    EXPECT_EQ(all[4].level, Level::Fault);
-    EXPECT_TRUE(capture.contains("broken 1"));
+    EXPECT_EQ(all[3].level, Level::Error);
+    std::vector<std::string> categories;
+    for (const auto& entry : all) categories.push_back(entry.category);
+    EXPECT_EQ(categories, (std::vector<std::string>{"ops", "traffic", "extension", "lx"}));
     EXPECT_EQ(capture.count("re"), 3u);  // "requested", "reply", "registry"
-    EXPECT_FALSE(capture.contains("absent"));
     capture.clear();
     EXPECT_TRUE(capture.entries().empty());
 }
 
+// A capture keeps what is at or above its own minimum, only while it lives; when it goes, the levels it enabled are
+// disabled again.
 TEST(LogCaptureTest, MinimumLevelAndLifetimeBoundWhatIsKept) {
     LogRegistry registry("fault");
     CaptureSink errorsOnly(Level::Error);
@@ -163,7 +142,6 @@ TEST(LogCaptureTest, MinimumLevelAndLifetimeBoundWhatIsKept) {
     EXPECT_FALSE(errorsOnly.contains("scoped debug"));
     EXPECT_TRUE(errorsOnly.contains("scoped error"));
     EXPECT_TRUE(errorsOnly.contains("after the scope"));
-    // With only an error-level capture left, debug is disabled again and formats nothing.
     EXPECT_FALSE(registry.ops().enabled(Level::Debug));
 }
 
@@ -191,6 +169,7 @@ TEST(LogCaptureTest, ConcurrentWritersLoseAndTearNothing) {
     for (int n : perThread) EXPECT_EQ(n, kPerThread);
 }
 
+// Threads racing to first use must make each channel once and all get the same one.
 TEST(LogRegistryTest, ChannelsAreCreatedTogetherOnceOnFirstUse) {
     std::atomic<int> made{0};
     auto counting = [&](const std::atomic<int>& threshold, std::string_view subsystem, std::string_view category) {
@@ -198,7 +177,7 @@ TEST(LogRegistryTest, ChannelsAreCreatedTogetherOnceOnFirstUse) {
         return LogRegistry::defaultFactory()(threshold, subsystem, category);
     };
     LogRegistry registry(nullptr, counting);
-    EXPECT_EQ(made.load(), 0);  // nothing before the first use
+    EXPECT_EQ(made.load(), 0);
 
     Channel& (LogRegistry::*const channels[])() = {&LogRegistry::ops, &LogRegistry::traffic, &LogRegistry::extension,
                                                    &LogRegistry::lx};
@@ -208,14 +187,9 @@ TEST(LogRegistryTest, ChannelsAreCreatedTogetherOnceOnFirstUse) {
     for (auto& th : threads) th.join();
     EXPECT_EQ(made.load(), 4);
     for (size_t t = 0; t < 4; ++t) EXPECT_EQ(seen[t], seen[t + 4]);
-    EXPECT_EQ(registry.ops().category(), "ops");
-    EXPECT_EQ(registry.traffic().category(), "traffic");
-    EXPECT_EQ(registry.extension().category(), "extension");
-    EXPECT_EQ(registry.lx().category(), "lx");
-    EXPECT_EQ(registry.lx().subsystem(), "com.quorvel.Bexil");
-    EXPECT_EQ(made.load(), 4);
 }
 
+// Losing a category must not lose its messages: they go to the default log, which says so once.
 TEST(LogRegistryTest, RefusedCategoryFallsBackToTheDefaultLogAndSaysSo) {
     CaptureSink capture;
     auto refuseTraffic = [](const std::atomic<int>& threshold, std::string_view subsystem,
@@ -231,26 +205,13 @@ TEST(LogRegistryTest, RefusedCategoryFallsBackToTheDefaultLogAndSaysSo) {
     ASSERT_EQ(reports.size(), 1u);
     EXPECT_EQ(reports[0].message, "unable to create lumen for category traffic");
     EXPECT_EQ(reports[0].level, Level::Error);
-    EXPECT_EQ(reports[0].category, "");
     EXPECT_EQ(reports[0].subsystem, "");
 
-    // The channel keeps working, its messages now on the default log.
     registry.traffic().info("reply for %d", 7);
     auto reply = capture.find("reply for 7");
     ASSERT_TRUE(reply.has_value());
     EXPECT_EQ(reply->category, "");
-    registry.traffic();
     EXPECT_EQ(capture.count("unable to create lumen"), 1u);
-}
-
-TEST(LogRegistryTest, ProcessWideChannelsAreStable) {
-    EXPECT_EQ(&ops(), &ops());
-    EXPECT_EQ(ops().category(), "ops");
-    EXPECT_EQ(lx().subsystem(), "com.quorvel.Bexil");
-    EXPECT_EQ(defaultLog().category(), "");
-    CaptureSink capture;
-    ops().info("client %d requested %{public}s", 9, "lock");
-    EXPECT_TRUE(capture.contains("client 9 requested lock"));
 }
 
 }  // namespace
