@@ -1,14 +1,10 @@
 #include <gtest/gtest.h>
 #include <spawn.h>
-#include <stdlib.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <string>
 #include <vector>
 
@@ -30,15 +26,30 @@ constexpr int kProbePassed = 42;
 using test::dict;
 using test::writeText;
 
-std::string real(const fs::path& path) { return fs::canonical(path).string(); }
+std::shared_ptr<const DirectoryBundle> atDirectory(const fs::path& path) {
+    return DirectoryBundle::create(path, BundleLookup::Directory);
+}
+std::shared_ptr<const DirectoryBundle> ofExecutable(const fs::path& path) {
+    return DirectoryBundle::create(path, BundleLookup::ContainingExecutable);
+}
+std::optional<std::string> rootOf(const std::shared_ptr<const DirectoryBundle>& bundle) {
+    return bundle->stringProperty(BundleStringProperty::BundlePath);
+}
+std::optional<std::string> executableOf(const std::shared_ptr<const DirectoryBundle>& bundle) {
+    return bundle->stringProperty(BundleStringProperty::ExecutablePath);
+}
+
+// A bundle that names nothing must answer nothing at all.
+void expectNothing(const std::shared_ptr<const DirectoryBundle>& bundle) {
+    EXPECT_FALSE(rootOf(bundle));
+    EXPECT_FALSE(executableOf(bundle));
+    EXPECT_FALSE(bundle->stringProperty(BundleStringProperty::SupportPath));
+    EXPECT_FALSE(bundle->infoDictionary());
+}
 
 // A fresh directory under the system's temporary directory, removed with everything in it afterwards.
 class BundleDirectoryTest : public ::testing::Test {
-protected:
-    fs::path makeDirectory(const fs::path& relative) {
-        fs::create_directories(root_ / relative);
-        return root_ / relative;
-    }
+  protected:
     void writeInfo(const fs::path& bundle, const Value& info) {
         fs::create_directories(bundle);
         ASSERT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", info).has_value());
@@ -57,110 +68,83 @@ protected:
         return bundle;
     }
 
-    static void expectNothing(const PlatformBundle& bundle) {
-        EXPECT_FALSE(bundle.stringProperty(BundleStringProperty::BundlePath));
-        EXPECT_FALSE(bundle.stringProperty(BundleStringProperty::ExecutablePath));
-        EXPECT_FALSE(bundle.stringProperty(BundleStringProperty::SupportPath));
-        EXPECT_FALSE(bundle.infoDictionary());
-    }
-
     test::TempDir tmp_{"bexil-bundle"};
     fs::path root_ = tmp_.path();
 };
 
-TEST_F(BundleDirectoryTest, ExampleApplicationAnswersItsRootExecutableAndInformation) {
-    auto bundle = DirectoryBundle::create(kExamples / "Greeter.app", BundleLookup::Directory);
-    std::string app = real(kExamples / "Greeter.app");
-    EXPECT_EQ(bundle->stringProperty(BundleStringProperty::BundlePath), app);
+// A bundle reports its real root whatever form of the path it was opened by, and the executable its document names.
+TEST_F(BundleDirectoryTest, BundleAnswersItsRealRootExecutableAndInformation) {
+    std::string app = fs::canonical(kExamples / "Greeter.app").string();
+    auto bundle = atDirectory(kExamples / "Greeter.app");
+    EXPECT_EQ(rootOf(bundle), app);
     EXPECT_EQ(bundle->stringProperty(BundleStringProperty::SupportPath), app);
-    EXPECT_EQ(bundle->stringProperty(BundleStringProperty::ExecutablePath), app + "/greeter");
+    EXPECT_EQ(executableOf(bundle), app + "/greeter");
     ASSERT_TRUE(bundle->infoDictionary());
     EXPECT_EQ(bundle->infoDictionary()->get("BDBundleIdentifier"), Value::string("com.example.greeter"));
     EXPECT_EQ(bundle->problem(), "");
-    EXPECT_NE(bundle->description().find(app), std::string::npos);
-}
 
-TEST_F(BundleDirectoryTest, RelativeAndUnnormalisedPathsReportTheRealRoot) {
     makeBundle("Real.app", "tool");
     fs::create_directory_symlink(root_ / "Real.app", root_ / "Link.app");
-    auto viaLink = DirectoryBundle::create(root_ / "Link.app", BundleLookup::Directory);
-    EXPECT_EQ(viaLink->stringProperty(BundleStringProperty::BundlePath), (root_ / "Real.app").string());
+    EXPECT_EQ(rootOf(atDirectory(root_ / "Link.app")), (root_ / "Real.app").string());
+    EXPECT_EQ(rootOf(atDirectory(root_ / "Real.app" / "." / ".." / "Real.app")), (root_ / "Real.app").string());
 
-    auto dotted = DirectoryBundle::create(root_ / "Real.app" / "." / ".." / "Real.app", BundleLookup::Directory);
-    EXPECT_EQ(dotted->stringProperty(BundleStringProperty::BundlePath), (root_ / "Real.app").string());
-}
-
-TEST_F(BundleDirectoryTest, BundleWithoutExecutableKeyOrInformationHasNoExecutable) {
-    auto data = DirectoryBundle::create(kExamples / "Notes.app/PlugIns/Stationery.bxplugin", BundleLookup::Directory);
-    EXPECT_TRUE(data->stringProperty(BundleStringProperty::BundlePath));
-    EXPECT_FALSE(data->stringProperty(BundleStringProperty::ExecutablePath));
+    // Without an executable key, or without information at all, a bundle has no executable.
+    auto data = atDirectory(kExamples / "Notes.app/PlugIns/Stationery.bxplugin");
     EXPECT_TRUE(data->infoDictionary());
-    // A directory without Info.vrec is a bundle without information.
-    fs::path plain = makeDirectory("Plain");
-    auto bundle = DirectoryBundle::create(plain, BundleLookup::Directory);
-    EXPECT_EQ(bundle->stringProperty(BundleStringProperty::BundlePath), plain.string());
-    EXPECT_FALSE(bundle->stringProperty(BundleStringProperty::ExecutablePath));
-    EXPECT_FALSE(bundle->infoDictionary());
-    EXPECT_EQ(bundle->problem(), "");
-    EXPECT_NE(bundle->description().find("without Info.vrec"), std::string::npos);
+    EXPECT_FALSE(executableOf(data));
+    fs::create_directories(root_ / "Plain");
+    auto plain = atDirectory(root_ / "Plain");
+    EXPECT_EQ(rootOf(plain), (root_ / "Plain").string());
+    EXPECT_FALSE(executableOf(plain));
+    EXPECT_FALSE(plain->infoDictionary());
+    EXPECT_EQ(plain->problem(), "");
+    EXPECT_EQ(plain->description(), "<bundle " + (root_ / "Plain").string() + " without Info.vrec>");
 }
 
 TEST_F(BundleDirectoryTest, PathsThatNameNoBundleAnswerNothing) {
-    for (const fs::path& path : {root_ / "missing", root_ / "missing" / "deeper", fs::path("")}) {
-        SCOPED_TRACE(path.string());
-        auto bundle = DirectoryBundle::create(path, BundleLookup::Directory);
-        expectNothing(*bundle);
-        EXPECT_NE(bundle->description().find("no bundle at"), std::string::npos);
-        expectNothing(*DirectoryBundle::create(path, BundleLookup::ContainingExecutable));
+    for (const fs::path& path : {root_ / "missing", fs::path("")}) {
+        expectNothing(atDirectory(path));
+        expectNothing(ofExecutable(path));
     }
+    EXPECT_EQ(atDirectory("")->description(), "<no bundle at : empty path>");
     // A NUL byte would cut the path short at the system call; the bundle at the shorter path must not answer.
     makeBundle("Cut.app", "tool");
-    fs::path cut = (root_ / "Cut.app").string() + std::string(1, '\0') + "/elsewhere";
-    expectNothing(*DirectoryBundle::create(cut, BundleLookup::Directory));
-    expectNothing(*DirectoryBundle::create((root_ / "Cut.app/tool").string() + std::string(1, '\0'),
-                                           BundleLookup::ContainingExecutable));
+    expectNothing(atDirectory((root_ / "Cut.app").string() + std::string(1, '\0') + "/elsewhere"));
+    expectNothing(ofExecutable((root_ / "Cut.app/tool").string() + std::string(1, '\0')));
 
     writeText(root_ / "file", "not a directory");
-    auto file = DirectoryBundle::create(root_ / "file", BundleLookup::Directory);
-    expectNothing(*file);
+    auto file = atDirectory(root_ / "file");
+    expectNothing(file);
     EXPECT_NE(file->description().find("not a directory"), std::string::npos);
 }
 
-TEST_F(BundleDirectoryTest, UnreadableInformationLeavesTheBundleWithoutItAndSaysWhyAndOtherRootsAreHandedOverAsRead) {
-    fs::path malformed = makeDirectory("Malformed.app");
-    writeText(malformed / "Info.vrec", "<vrec><dict><key>BDBundleIdentifier</key></dict>");
-    auto bundle = DirectoryBundle::create(malformed, BundleLookup::Directory);
-    EXPECT_EQ(bundle->stringProperty(BundleStringProperty::BundlePath), malformed.string());
-    EXPECT_FALSE(bundle->infoDictionary());
-    EXPECT_NE(bundle->problem().find("BexilDocument"), std::string::npos) << bundle->problem();
+// Information that cannot be read leaves the bundle without it and says why; a root other than a dictionary is
+// handed over as read, but names no executable.
+TEST_F(BundleDirectoryTest, UnreadableInformationLeavesTheBundleWithoutItAndSaysWhy) {
+    writeText(root_ / "Malformed.app/Info.vrec", "<vrec><dict><key>BDBundleIdentifier</key></dict>");
+    writeText(root_ / "Huge.app/Info.vrec", std::string(DirectoryBundle::kMaxInfoBytes + 1, ' '));
+    fs::create_directories(root_ / "Folder.app/Info.vrec");
+    const std::pair<const char*, const char*> cases[] = {
+        {"Malformed.app", "BexilDocument"}, {"Huge.app", "larger than"}, {"Folder.app", "not a regular file"}};
+    for (const auto& [name, problem] : cases) {
+        auto bundle = atDirectory(root_ / name);
+        EXPECT_EQ(rootOf(bundle), (root_ / name).string());
+        EXPECT_FALSE(bundle->infoDictionary()) << name;
+        EXPECT_NE(bundle->problem().find(problem), std::string::npos) << bundle->problem();
+    }
 
-    fs::path huge = makeDirectory("Huge.app");
-    writeText(huge / "Info.vrec", std::string(DirectoryBundle::kMaxInfoBytes + 1, ' '));
-    auto big = DirectoryBundle::create(huge, BundleLookup::Directory);
-    EXPECT_FALSE(big->infoDictionary());
-    EXPECT_NE(big->problem().find("larger than"), std::string::npos) << big->problem();
-
-    fs::path folder = makeDirectory("Folder.app/Info.vrec");
-    auto notFile = DirectoryBundle::create(folder.parent_path(), BundleLookup::Directory);
-    EXPECT_FALSE(notFile->infoDictionary());
-    EXPECT_NE(notFile->problem().find("not a regular file"), std::string::npos);
-
-    fs::path listed = root_ / "List.app";
-    writeInfo(listed, Value::array({Value::string("BDBundleExecutable"), Value::string("tool")}));
-    writeExecutable(listed / "tool");
-    auto list = DirectoryBundle::create(listed, BundleLookup::Directory);
+    writeInfo(root_ / "List.app", Value::array({Value::string("BDBundleExecutable"), Value::string("tool")}));
+    writeExecutable(root_ / "List.app/tool");
+    auto list = atDirectory(root_ / "List.app");
     ASSERT_TRUE(list->infoDictionary());
     EXPECT_TRUE(list->infoDictionary()->isArray());
-    EXPECT_FALSE(list->stringProperty(BundleStringProperty::ExecutablePath));
+    EXPECT_FALSE(executableOf(list));
 }
 
+// The executable name is never followed out of the bundle.
 TEST_F(BundleDirectoryTest, ExecutableMustBeAnExistingFileInsideTheBundle) {
     writeExecutable(root_ / "outside");
-    struct Case {
-        const char* name;
-        Value executable;
-    };
-    const Case cases[] = {
+    const std::pair<const char*, Value> cases[] = {
         {"Climbs", Value::string("../outside")},
         {"ClimbsAfterDescending", Value::string("bin/../../outside")},
         {"Absolute", Value::string((root_ / "outside").string())},
@@ -169,34 +153,29 @@ TEST_F(BundleDirectoryTest, ExecutableMustBeAnExistingFileInsideTheBundle) {
         {"NotAString", Value::int64(7)},
         {"Missing", Value::string("tool")},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        fs::path bundle = root_ / c.name;
-        writeInfo(bundle, dict({{"BDBundleExecutable", c.executable}}));
-        auto opened = DirectoryBundle::create(bundle, BundleLookup::Directory);
-        EXPECT_EQ(opened->stringProperty(BundleStringProperty::BundlePath), bundle.string());
-        EXPECT_FALSE(opened->stringProperty(BundleStringProperty::ExecutablePath));
-        EXPECT_NE(opened->problem(), "");
+    for (const auto& [name, executable] : cases) {
+        writeInfo(root_ / name, dict({{"BDBundleExecutable", executable}}));
+        auto bundle = atDirectory(root_ / name);
+        EXPECT_EQ(rootOf(bundle), (root_ / name).string());
+        EXPECT_FALSE(executableOf(bundle)) << name;
+        EXPECT_NE(bundle->problem(), "") << name;
     }
     // A name that wanders but stays inside is normalised.
     fs::path wandering = makeBundle("Wandering.app", "bin/tool");
     writeInfo(wandering, dict({{"BDBundleExecutable", Value::string("bin/./../bin/tool")}}));
-    EXPECT_EQ(DirectoryBundle::create(wandering, BundleLookup::Directory)
-                  ->stringProperty(BundleStringProperty::ExecutablePath),
-              (wandering / "bin/tool").string());
+    EXPECT_EQ(executableOf(atDirectory(wandering)), (wandering / "bin/tool").string());
 }
 
 TEST_F(BundleDirectoryTest, SymbolicLinkLoopsGiveNothingInsteadOfHanging) {
     fs::create_symlink(root_ / "b", root_ / "a");
     fs::create_symlink(root_ / "a", root_ / "b");
-    expectNothing(*DirectoryBundle::create(root_ / "a", BundleLookup::Directory));
-    expectNothing(*DirectoryBundle::create(root_ / "a", BundleLookup::ContainingExecutable));
-    expectNothing(*DirectoryBundle::create(root_ / "a" / "tool", BundleLookup::ContainingExecutable));
+    expectNothing(atDirectory(root_ / "a"));
+    expectNothing(ofExecutable(root_ / "a" / "tool"));
 
-    fs::path looping = makeDirectory("Looping.app");
-    fs::create_symlink(looping / "Info.vrec", looping / "Info.vrec");
-    auto bundle = DirectoryBundle::create(looping, BundleLookup::Directory);
-    EXPECT_EQ(bundle->stringProperty(BundleStringProperty::BundlePath), looping.string());
+    fs::create_directories(root_ / "Looping.app");
+    fs::create_symlink(root_ / "Looping.app/Info.vrec", root_ / "Looping.app/Info.vrec");
+    auto bundle = atDirectory(root_ / "Looping.app");
+    EXPECT_EQ(rootOf(bundle), (root_ / "Looping.app").string());
     EXPECT_FALSE(bundle->infoDictionary());
     EXPECT_NE(bundle->problem(), "");
 
@@ -204,9 +183,8 @@ TEST_F(BundleDirectoryTest, SymbolicLinkLoopsGiveNothingInsteadOfHanging) {
     fs::path selfish = root_ / "Selfish.app";
     writeInfo(selfish, dict({{"BDBundleExecutable", Value::string("tool")}}));
     fs::create_symlink(selfish / "tool", selfish / "tool");
-    EXPECT_FALSE(DirectoryBundle::create(selfish, BundleLookup::Directory)
-                     ->stringProperty(BundleStringProperty::ExecutablePath));
-    expectNothing(*DirectoryBundle::create(selfish / "tool", BundleLookup::ContainingExecutable));
+    EXPECT_FALSE(executableOf(atDirectory(selfish)));
+    expectNothing(ofExecutable(selfish / "tool"));
 }
 
 TEST_F(BundleDirectoryTest, ExecutableLeadsUpToTheBundleThatNamesIt) {
@@ -217,22 +195,20 @@ TEST_F(BundleDirectoryTest, ExecutableLeadsUpToTheBundleThatNamesIt) {
     writeExecutable(app / "libexec/tools/deep/other");
     writeText(app / "libexec/tools/deep/Info.vrec", "<vrec><string>broken");
 
-    auto found = DirectoryBundle::create(app / "libexec/tools/deep/tool", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(found->stringProperty(BundleStringProperty::BundlePath), app.string());
-    EXPECT_EQ(found->stringProperty(BundleStringProperty::ExecutablePath), (app / "libexec/tools/deep/tool").string());
+    auto found = ofExecutable(app / "libexec/tools/deep/tool");
+    EXPECT_EQ(rootOf(found), app.string());
+    EXPECT_EQ(executableOf(found), (app / "libexec/tools/deep/tool").string());
     ASSERT_TRUE(found->infoDictionary());
     EXPECT_EQ(found->infoDictionary()->get("BDBundleIdentifier"), Value::string("com.example.deep"));
-
-    // The decoy's own executable finds the decoy.
-    auto decoy = DirectoryBundle::create(app / "libexec/tools/deep/other", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(decoy->stringProperty(BundleStringProperty::BundlePath), (app / "libexec/tools").string());
+    // The nearest bundle that names the file wins: the decoy's own executable finds the decoy.
+    EXPECT_EQ(rootOf(ofExecutable(app / "libexec/tools/deep/other")), (app / "libexec/tools").string());
 
     // A file that no document names finds nothing, even inside a bundle; so does a directory.
     writeExecutable(app / "libexec/stray");
-    auto stray = DirectoryBundle::create(app / "libexec/stray", BundleLookup::ContainingExecutable);
-    expectNothing(*stray);
+    auto stray = ofExecutable(app / "libexec/stray");
+    expectNothing(stray);
     EXPECT_NE(stray->description().find("names it"), std::string::npos);
-    expectNothing(*DirectoryBundle::create(app, BundleLookup::ContainingExecutable));
+    expectNothing(ofExecutable(app));
 }
 
 TEST_F(BundleDirectoryTest, ExecutableLookupSeesThroughSymbolicLinks) {
@@ -240,25 +216,12 @@ TEST_F(BundleDirectoryTest, ExecutableLookupSeesThroughSymbolicLinks) {
     // The document names a link inside the bundle; the real file is what the walk starts from.
     writeInfo(app, dict({{"BDBundleExecutable", Value::string("current")}}));
     fs::create_symlink("bin/tool-1.2", app / "current");
-    auto viaTarget = DirectoryBundle::create(app / "bin/tool-1.2", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(viaTarget->stringProperty(BundleStringProperty::BundlePath), app.string());
-    EXPECT_EQ(viaTarget->stringProperty(BundleStringProperty::ExecutablePath), (app / "current").string());
-
+    auto viaTarget = ofExecutable(app / "bin/tool-1.2");
+    EXPECT_EQ(rootOf(viaTarget), app.string());
+    EXPECT_EQ(executableOf(viaTarget), (app / "current").string());
     // A link from elsewhere to the executable finds the bundle too.
     fs::create_symlink(app / "bin/tool-1.2", root_ / "launcher");
-    auto viaLauncher = DirectoryBundle::create(root_ / "launcher", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(viaLauncher->stringProperty(BundleStringProperty::BundlePath), app.string());
-}
-
-TEST_F(BundleDirectoryTest, ExamplePlugInsAreTheirOwnBundlesNotTheirApplications) {
-    fs::path greeter = kExamples / "Greeter.app";
-    auto app = DirectoryBundle::create(greeter / "greeter", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(app->stringProperty(BundleStringProperty::BundlePath), real(greeter));
-
-    fs::path bonjour = greeter / "PlugIns/Bonjour.bxplugin";
-    auto plugIn = DirectoryBundle::create(bonjour / "bin/bonjour", BundleLookup::ContainingExecutable);
-    EXPECT_EQ(plugIn->stringProperty(BundleStringProperty::BundlePath), real(bonjour));
-    EXPECT_EQ(plugIn->infoDictionary()->get("BDBundleIdentifier"), Value::string("com.example.greeter.bonjour"));
+    EXPECT_EQ(rootOf(ofExecutable(root_ / "launcher")), app.string());
 }
 
 // The main bundle is found from the running program's own executable. This test copies its own program into a
@@ -266,14 +229,14 @@ TEST_F(BundleDirectoryTest, ExamplePlugInsAreTheirOwnBundlesNotTheirApplications
 TEST(MainBundle, IsTheBundleThatNamesTheRunningProgram) {
     if (const char* expected = std::getenv(kMainBundleVariable)) {
         auto main = DirectoryBundle::createMain();
-        EXPECT_EQ(main->stringProperty(BundleStringProperty::BundlePath), std::string(expected));
-        EXPECT_EQ(main->stringProperty(BundleStringProperty::ExecutablePath), std::string(expected) + "/bin/probe");
+        EXPECT_EQ(rootOf(main), std::string(expected));
+        EXPECT_EQ(executableOf(main), std::string(expected) + "/bin/probe");
         // A distinctive status, so that the parent knows this check ran and did not just match no test.
         std::fflush(nullptr);
         std::_Exit(::testing::Test::HasFailure() ? 1 : kProbePassed);
     }
     // This program itself lies in no bundle.
-    EXPECT_FALSE(DirectoryBundle::createMain()->stringProperty(BundleStringProperty::BundlePath));
+    EXPECT_FALSE(rootOf(DirectoryBundle::createMain()));
 
     test::TempDir root("bexil-main");
     fs::path bundle = root / "Probe.app";
