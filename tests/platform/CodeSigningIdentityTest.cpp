@@ -29,17 +29,20 @@ class CodeSigningIdentityTest : public ::testing::Test {
         fs::create_directories(root_ / "entitlements.d");
         chmod(root_.c_str(), 0755);
         chmod((root_ / "entitlements.d").c_str(), 0755);
-        socketPath_ = (root_ / "sock").string();
         listener_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
-        strncpy(addr.sun_path, socketPath_.c_str(), sizeof addr.sun_path - 1);
+        sockaddr_un addr = address();
         ASSERT_EQ(bind(listener_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
         ASSERT_EQ(listen(listener_, 8), 0);
     }
     void TearDown() override { close(listener_); }
 
     fs::path entitlementsDir() const { return root_ / "entitlements.d"; }
+    sockaddr_un address() const {
+        sockaddr_un addr{};
+        addr.sun_family = AF_UNIX;
+        strncpy(addr.sun_path, (root_ / "sock").c_str(), sizeof addr.sun_path - 1);
+        return addr;
+    }
 
     void writeEntitlements(const std::string& name, const std::string& executable, Value entitlements,
                            mode_t mode = 0644) {
@@ -54,9 +57,7 @@ class CodeSigningIdentityTest : public ::testing::Test {
         pid_t child = fork();
         if (child == 0) {
             int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-            sockaddr_un addr{};
-            addr.sun_family = AF_UNIX;
-            strncpy(addr.sun_path, socketPath_.c_str(), sizeof addr.sun_path - 1);
+            sockaddr_un addr = address();
             if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
             if (!exitAtOnce) {
                 char c;
@@ -69,7 +70,6 @@ class CodeSigningIdentityTest : public ::testing::Test {
 
     test::TempDir tmp_{"bx-codesign"};
     fs::path root_ = tmp_.path();
-    std::string socketPath_;
     int listener_ = -1;
 };
 
@@ -128,14 +128,13 @@ TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
     const std::string self = selfExecutable();
     EntitlementsDirectory dir(entitlementsDir(), geteuid());
 
-    writeEntitlements("group-writable.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}), 0664);
-    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    for (mode_t writableByOthers : {0664, 0646}) {
+        writeEntitlements("writable.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}),
+                          writableByOthers);
+        EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u) << writableByOthers;
+        fs::remove(entitlementsDir() / "writable.vrec");
+    }
     EXPECT_TRUE(capture.contains("ignoring untrusted entitlements file"));
-    fs::remove(entitlementsDir() / "group-writable.vrec");
-
-    writeEntitlements("world-writable.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}), 0646);
-    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
-    fs::remove(entitlementsDir() / "world-writable.vrec");
 
     if (geteuid() == 0) {
         // Owned by somebody who is neither root nor the daemon's user.
