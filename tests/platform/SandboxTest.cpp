@@ -1,0 +1,152 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+
+#include "TestSupport.h"
+#include "platform/sandbox/ProcessSandbox.h"
+#include "platform/sandbox/SandboxExtensions.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+
+// ---- Whether a process is sandboxed ----
+
+// A process table of our own: "self" and the processes a test adds each get a status file and a user namespace
+// link.
+class ProcessSandboxTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        fs::create_directories(root_ / "namespaces");
+        std::ofstream(root_ / "namespaces" / "ours") << "";
+        std::ofstream(root_ / "namespaces" / "theirs") << "";
+        process("self", "0", "ours");
+    }
+
+    void process(const std::string& name, const std::string& seccomp, const std::string& space) {
+        fs::path dir = root_ / name;
+        fs::create_directories(dir / "ns");
+        std::ofstream(dir / "status") << "Name:\tclient\nUmask:\t0022\nSeccomp:\t" << seccomp
+                                      << "\nSeccomp_filters:\t0\n";
+        fs::remove(dir / "ns" / "user");
+        fs::create_symlink(root_ / "namespaces" / space, dir / "ns" / "user");
+    }
+
+    test::TempDir tmp_{"bxsandbox-test"};
+    fs::path root_ = tmp_.path();
+};
+
+// A seccomp filter or strict mode, or another user namespace, is a sandbox; what cannot be read counts as one too.
+TEST_F(ProcessSandboxTest, SeccompOrAnotherUserNamespaceOrUnknownStateIsSandboxed) {
+    process("40", "0", "ours");
+    process("41", "1", "ours");
+    process("42", "2", "ours");
+    process("43", "0", "theirs");
+    process("44", "garbage", "ours");
+    process("45", "0", "ours");
+    fs::remove(root_ / "45" / "ns" / "user");
+    fs::create_directories(root_ / "46");
+    std::ofstream(root_ / "46" / "status") << "Name:\told-kernel\n";
+    EXPECT_FALSE(processIsSandboxed(40, root_));
+    for (pid_t pid : {41, 42, 43, 44, 45, 46, 47}) EXPECT_TRUE(processIsSandboxed(pid, root_)) << pid;
+}
+
+TEST(ProcessSandbox, TheTestProcessItselfAsTheRealProcessTableSeesIt) {
+    std::ifstream status("/proc/self/status");
+    std::string line;
+    bool filtered = false;
+    while (std::getline(status, line))
+        if (line.rfind("Seccomp:", 0) == 0) filtered = line.find('0') == std::string::npos;
+    EXPECT_EQ(processIsSandboxed(getpid()), filtered);
+}
+
+// ---- Extension tokens ----
+
+class SandboxExtensionsTest : public ::testing::Test {
+  protected:
+    void SetUp() override { test::writeText(root_ / "bundle" / "Resources" / "a.txt", "a"); }
+
+    fs::path keyPath() const { return root_ / "runtime" / "sandbox" / "extension-key"; }
+    std::optional<std::string> issue(SandboxExtensions& issuer, const fs::path& path) {
+        return issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass, path.string());
+    }
+
+    test::TempDir tmp_{"sandbox-test"};
+    fs::path root_ = tmp_.path();
+};
+
+TEST_F(SandboxExtensionsTest, IssuedTokenNamesTheCanonicalPathAndIsConsumable) {
+    SandboxExtensions issuer(keyPath());
+    auto token = issue(issuer, root_ / "bundle" / "Resources" / ".." / "Resources" / "a.txt");
+    ASSERT_TRUE(token);
+    EXPECT_EQ(fs::status(keyPath()).permissions() & fs::perms::all, fs::perms::owner_read | fs::perms::owner_write);
+
+    // Another process (here: another object over the same key file) checks and records it.
+    SandboxExtensions consumer(keyPath());
+    int64_t handle = consumer.consume(*token);
+    ASSERT_GT(handle, 0);
+    EXPECT_EQ(consumer.consumedPath(handle), (root_ / "bundle" / "Resources" / "a.txt").string());
+    consumer.release(handle);
+    EXPECT_FALSE(consumer.consumedPath(handle));
+    consumer.release(handle);  // releasing twice is harmless
+
+    // Through a symbolic link to the bundle: the token names (and signs) the file the link leads to.
+    fs::create_directory_symlink(root_ / "bundle", root_ / "link");
+    EXPECT_EQ(issue(issuer, root_ / "link" / "Resources" / "a.txt"), token);
+
+    // A removed key file is written back with the same key: still the same run.
+    fs::remove_all(root_ / "runtime");
+    EXPECT_EQ(issue(issuer, root_ / "bundle" / "Resources" / "a.txt"), token);
+    EXPECT_GT(SandboxExtensions(keyPath()).consume(*token), 0);
+}
+
+TEST_F(SandboxExtensionsTest, AlteredOrForeignTokensAreRefused) {
+    SandboxExtensions consumer(keyPath());
+    errno = 0;
+    EXPECT_EQ(consumer.consume("com.quorvel.sandbox.read-only;00;/tmp"), -1) << "no key yet";
+    EXPECT_EQ(errno, ENOENT);
+
+    SandboxExtensions issuer(keyPath());
+    auto token = issue(issuer, root_ / "bundle");
+    ASSERT_TRUE(token);
+    std::string otherPath = *token;
+    otherPath.replace(otherPath.rfind("bundle"), 6, "bundlf");
+    std::string otherClass = *token;
+    otherClass.replace(0, 1, "x");
+    for (const std::string& bad : {otherPath, otherClass, std::string(""), std::string(";;"), std::string("a;b;c"),
+                                   token->substr(0, token->size() / 2)}) {
+        errno = 0;
+        EXPECT_EQ(issuer.consume(bad), -1) << bad;
+        EXPECT_EQ(errno, EPERM) << bad;
+    }
+
+    // A new run makes a new key: tokens of the earlier run stop working.
+    SandboxExtensions nextRun(keyPath());
+    ASSERT_TRUE(issue(nextRun, root_ / "bundle"));
+    EXPECT_EQ(nextRun.consume(*token), -1);
+}
+
+TEST_F(SandboxExtensionsTest, MissingPathsAndBadClassesGetNoToken) {
+    SandboxExtensions issuer(keyPath());
+    fs::create_symlink(root_ / "missing", root_ / "dangling");
+    const std::pair<fs::path, int> cases[] = {{root_ / "missing", ENOENT},
+                                              {root_ / "dangling", ENOENT},
+                                              {root_ / "bundle" / "Resources" / "a.txt" / "x", ENOTDIR}};
+    for (const auto& [path, code] : cases) {
+        errno = 0;
+        EXPECT_FALSE(issue(issuer, path)) << path;
+        EXPECT_EQ(errno, code) << path;
+    }
+    errno = 0;
+    EXPECT_FALSE(issuer.issueFileExtension("a;b", (root_ / "bundle").string()));
+    EXPECT_EQ(errno, EINVAL);
+    EXPECT_FALSE(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass, std::string("/tmp\0x", 6)));
+    EXPECT_FALSE(fs::exists(keyPath())) << "no key is made before a token is issued";
+}
+
+}  // namespace
+}  // namespace bexil
