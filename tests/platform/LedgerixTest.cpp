@@ -586,6 +586,8 @@ TEST_F(LedgerixQueryTest, RulesThatAreNotPlainEqualityLetEveryPlugInThrough) {
     EXPECT_EQ(filtered(str("not a dictionary")).size(), 30u);
 }
 
+// A point rule may be answered from the attributes or the top of the information, and an identifier rule by a
+// plug-in without an identifier: such plug-ins are never left out by the pre-selection.
 TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandidates) {
     registerOK(writePlugIn(
         bundles_ / "W1.bxplugin",
@@ -593,8 +595,7 @@ TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandid
     registerOK(writePlugIn(
         bundles_ / "W2.bxplugin",
         {.identifier = "com.example.w2", .extraInfo = {{"RZExtensionPointIdentifier", str("com.example.yyy")}}}));
-    auto noId = writePlugIn(bundles_ / "W3.bxplugin", {.identifier = ""});
-    registerOK(noId);
+    registerOK(writePlugIn(bundles_ / "W3.bxplugin", {.identifier = ""}));
     auto seen = filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.b")}}));
     EXPECT_EQ(seen.size(), 12u);
     EXPECT_NE(std::find(seen.begin(), seen.end(), "com.example.w1"), seen.end());

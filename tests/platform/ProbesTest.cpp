@@ -87,10 +87,5 @@ TEST(ProbesTest, EveryProbeIsInTheBinaryWithItsArgumentTypes) {
     EXPECT_NE(notes["request-input"].semaphore, notes["request-output"].semaphore);
 }
 
-TEST(ProbesTest, MessageProbesAreDisabledWithoutATracer) {
-    EXPECT_FALSE(trace::requestInputEnabled());
-    EXPECT_FALSE(trace::requestOutputEnabled());
-}
-
 }  // namespace
 }  // namespace bexil
