@@ -178,13 +178,6 @@ TEST_F(BundleDirectoryTest, SymbolicLinkLoopsGiveNothingInsteadOfHanging) {
     EXPECT_EQ(rootOf(bundle), (root_ / "Looping.app").string());
     EXPECT_FALSE(bundle->infoDictionary());
     EXPECT_NE(bundle->problem(), "");
-
-    // The executable itself a loop: it names nothing that exists.
-    fs::path selfish = root_ / "Selfish.app";
-    writeInfo(selfish, dict({{"BDBundleExecutable", Value::string("tool")}}));
-    fs::create_symlink(selfish / "tool", selfish / "tool");
-    EXPECT_FALSE(executableOf(atDirectory(selfish)));
-    expectNothing(ofExecutable(selfish / "tool"));
 }
 
 TEST_F(BundleDirectoryTest, ExecutableLeadsUpToTheBundleThatNamesIt) {

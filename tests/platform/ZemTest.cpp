@@ -67,20 +67,20 @@ Value sample(int i = 0) {
 
 // ---- Values ----
 
-// Every kind comes back with its kind and bits (an int64 never as a uint64, NaN payloads and -0.0 intact), in a
-// canonical encoding whose size encodedSize() predicts.
+// Every kind comes back with its kind and bits (NaN payloads intact, an int64 never as a uint64), in a canonical
+// encoding whose size encodedSize() predicts. The kinds and limits the zem_decoder fuzz corpus already round-trips
+// (null, booleans, the integer extremes, -0.0, short strings and data, dates, UUIDs, empty containers) are not
+// repeated here.
 TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
     const double nan = std::numeric_limits<double>::quiet_NaN();
     Bytes blob(1 << 20);
     for (size_t i = 0; i < blob.size(); ++i) blob[i] = static_cast<uint8_t>(i * 131 + (i >> 9));
     const Value values[] = {
-        Value::null(), Value::boolean(false), Value::boolean(true), Value::int64(-1),
-        Value::int64(std::numeric_limits<int64_t>::min()), Value::int64(std::numeric_limits<int64_t>::max()),
-        Value::uint64(std::numeric_limits<uint64_t>::max()), Value::real(nan), Value::real(-nan), Value::real(-0.0),
+        Value::int64(std::numeric_limits<int64_t>::max()), Value::real(nan), Value::real(-nan),
         Value::string(""), Value::string(std::string("nul\0inside", 10)),
         Value::string("\xF0\x9F\x98\x80 \xE2\x82\xAC \xC3\xA9 \xF4\x8F\xBF\xBF"), Value::data(Bytes{}),
-        Value::date(Date{nan}), Value::uuid(Uuid::random()), Value::emptyArray(), Value::emptyDictionary(),
-        Value::dictionary({{"", Value::null()}}), sample(), Value::dictionary({{"blob", Value::data(blob)}}),
+        Value::date(Date{nan}), Value::dictionary({{"", Value::null()}}), sample(),
+        Value::dictionary({{"blob", Value::data(blob)}}),
         nested(ZemCodec::kMaxDepth, Value::string("bottom")),  // exactly at the nesting limit
     };
     for (const Value& v : values) {
