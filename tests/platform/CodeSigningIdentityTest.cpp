@@ -144,6 +144,20 @@ TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
         fs::remove(entitlementsDir() / "foreign.vrec");
     }
 
+    // A symbolic link is judged as itself, even when it leads to a trusted file: the link could be repointed.
+    writeEntitlements("target.vrec.off", self, Value::dictionary({{kManager, Value::boolean(true)}}));
+    fs::create_symlink(entitlementsDir() / "target.vrec.off", entitlementsDir() / "link.vrec");
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    fs::remove(entitlementsDir() / "link.vrec");
+
+    // A directory that others may write to makes every file in it untrusted, however good the file.
+    writeEntitlements("good.vrec", self, Value::dictionary({{kManager, Value::boolean(true)}}));
+    chmod(entitlementsDir().c_str(), 0777);
+    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
+    EXPECT_TRUE(capture.contains("is not trusted (owner or mode); no program has entitlements"));
+    chmod(entitlementsDir().c_str(), 0755);
+    fs::remove(entitlementsDir() / "good.vrec");
+
     // A trusted file naming an executable that others may write grants nothing either.
     fs::path copy = root_ / "writable-program";
     fs::copy_file(self, copy);
