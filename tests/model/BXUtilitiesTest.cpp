@@ -55,7 +55,7 @@ TEST(CompareVersionString, OrdersDigitRunsByValueAndEverythingElseByCode) {
         {"1a", "1.", Descending},     // a run ends where the other string has a non-digit
         {"1.0", "1", Descending},     // a prefix orders first
         {"", "0", Ascending},
-        {"01", "1", Descending},      // equal values: the longer run orders last, keeping the order total
+        {"01", "1", Descending},  // equal values: the longer run orders last, keeping the order total
         // Runs longer than any integer type still compare by value.
         {"99999999999999999999999", "100000000000000000000000", Ascending},
     };

@@ -34,8 +34,7 @@ inline Value shareInfo(Entries extraPlugIn = {}) {
     });
 }
 
-inline std::shared_ptr<BXPlugInCore> makeRecord(const char* path, Value info,
-                                                std::optional<Uuid> uuid = std::nullopt) {
+inline std::shared_ptr<BXPlugInCore> makeRecord(const char* path, Value info, std::optional<Uuid> uuid = std::nullopt) {
     return BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.mail.share", std::string(path), info,
                                                            std::nullopt, uuid);
 }
