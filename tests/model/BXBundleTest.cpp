@@ -109,15 +109,10 @@ TEST(BXBundleQueries, MissingBundlesAnswerNothingAndLogWhyTheyHaveNoInformation)
     EXPECT_EQ(BXBundle::initWithExecutablePath("/nonexistent/tool")->executablePath(), std::nullopt);
 }
 
-class BXBundleFileTest : public ::testing::Test {
-  protected:
-    test::TempDir tmp_{"bexil-bxbundle"};
-    fs::path root_ = tmp_.path();
-};
-
 // Information that cannot be read is logged as not retrieved, information that is not a dictionary as not converted,
 // and an identifier that is not a string is no identifier.
-TEST_F(BXBundleFileTest, UnreadableOrMisshapenInformationAnswersNothingAndSaysWhy) {
+TEST(BXBundleQueries, UnreadableOrMisshapenInformationAnswersNothingAndSaysWhy) {
+    test::TempDir root_("bexil-bxbundle");
     fs::path bundle = root_ / "Broken.app";
     test::writeText(bundle / "Info.vrec", "<vrec><dict><key>BDBundleIdentifier</key>");
     log::CaptureSink capture;
@@ -150,7 +145,8 @@ TEST_F(BXBundleFileTest, UnreadableOrMisshapenInformationAnswersNothingAndSaysWh
     EXPECT_TRUE(numbered->infoDictionary());
 }
 
-TEST_F(BXBundleFileTest, SymbolicLinkLoopAnswersNothing) {
+TEST(BXBundleQueries, SymbolicLinkLoopAnswersNothing) {
+    test::TempDir root_("bexil-bxbundle");
     fs::create_symlink(root_ / "b.app", root_ / "a.app");
     fs::create_symlink(root_ / "a.app", root_ / "b.app");
     for (const auto& bundle : {BXBundle::initWithPath((root_ / "a.app").string()),
