@@ -27,30 +27,27 @@ class BXSandboxExtensionTest : public ::testing::Test {
     std::string token_;
 };
 
-TEST_F(BXSandboxExtensionTest, ConsumesOnceAndExpelsOnce) {
-    BXSandboxExtension extension(token_, sandbox_.get());
-    EXPECT_EQ(extension.handle(), 0);
-    extension.expel();  // nothing consumed yet: nothing happens
-    extension.consume();
-    int64_t handle = extension.handle();
-    ASSERT_GT(handle, 0);
-    extension.consume();
-    EXPECT_EQ(extension.handle(), handle) << "a second consume does not consume again";
-    EXPECT_TRUE(sandbox_->consumedPath(handle));
-    extension.expel();
-    EXPECT_EQ(extension.handle(), 0);
-    EXPECT_FALSE(sandbox_->consumedPath(handle));
-}
-
-TEST_F(BXSandboxExtensionTest, DestructionReleasesAndRefusedTokensStayUnconsumed) {
+// A token is consumed once however often consume is called, released once by expel or destruction, and a token
+// the sandbox refuses stays unconsumed.
+TEST_F(BXSandboxExtensionTest, ConsumesOnceAndReleasesOnExpelOrDestruction) {
     int64_t handle = 0;
     {
         BXSandboxExtension extension(token_, sandbox_.get());
+        extension.expel();  // nothing consumed yet: nothing happens
+        extension.consume();
+        handle = extension.handle();
+        ASSERT_GT(handle, 0);
+        extension.consume();
+        EXPECT_EQ(extension.handle(), handle) << "a second consume does not consume again";
+        EXPECT_TRUE(sandbox_->consumedPath(handle));
+        extension.expel();
+        EXPECT_EQ(extension.handle(), 0);
+        EXPECT_FALSE(sandbox_->consumedPath(handle));
         extension.consume();
         handle = extension.handle();
         ASSERT_TRUE(sandbox_->consumedPath(handle));
     }
-    EXPECT_FALSE(sandbox_->consumedPath(handle));
+    EXPECT_FALSE(sandbox_->consumedPath(handle)) << "destruction releases what was consumed";
 
     BXSandboxExtension forged(token_ + "x", sandbox_.get());
     forged.consume();
