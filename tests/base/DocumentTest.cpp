@@ -261,7 +261,8 @@ TEST(DocumentWrite, UnrepresentableValuesAreErrorsNamingWhere) {
     Uuid uuid = *Uuid::parse("01234567-89AB-CDEF-0123-456789ABCDEF");
     const std::vector<std::pair<Value, std::string>> cases = {
         {dict({{"data", dict({{"p", Value::array({Value::int64(1), Value::uuid(uuid)})}})}}),
-         "a uuid (01234567-89AB-CDEF-0123-456789ABCDEF), which a document cannot represent, at root[\"data\"][\"p\"][1]"},
+         "a uuid (01234567-89AB-CDEF-0123-456789ABCDEF), which a document cannot represent, at "
+         "root[\"data\"][\"p\"][1]"},
         {Value::array({Value::string("ok"), Value::string("bell\x07")}),
          "a string with character U+0007, which XML 1.0 cannot carry, at byte 4 of \"bell\\x07\" at root[1]"},
         {dict({{std::string("a\0b", 3), Value::null()}}), "a key with character U+0000"},

@@ -38,7 +38,7 @@ int processThreadCount() {
 
 // Counts down to zero from any thread; the test waits for zero.
 class Countdown {
-public:
+  public:
     explicit Countdown(int count) : count_(count) {}
     void arrive() {
         std::lock_guard lock(mutex_);
@@ -49,7 +49,7 @@ public:
         return zero_.wait_for(lock, kPatience, [&] { return count_ == 0; });
     }
 
-private:
+  private:
     std::mutex mutex_;
     std::condition_variable zero_;
     int count_;
@@ -57,7 +57,7 @@ private:
 
 // Records the highest number of blocks seen running at once.
 class InFlight {
-public:
+  public:
     void enter() {
         int now = ++current_;
         int seen = highest_.load();
@@ -67,7 +67,7 @@ public:
     void leave() { --current_; }
     int highest() const { return highest_.load(); }
 
-private:
+  private:
     std::atomic<int> current_{0};
     std::atomic<int> highest_{0};
 };

@@ -26,8 +26,7 @@ using Reply = BXDaemonClient::Reply;
 // A service on a private directory that answers every request with `answer` and remembers what it got.
 class CapturingService {
   public:
-    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName)
-        : queue_("capture", *loop_) {
+    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName) : queue_("capture", *loop_) {
         auto listener = ZemListener::create(service, queue_, nullptr);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;
@@ -114,22 +113,34 @@ TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyIts
     const Value bulk = Value::dictionary({{kFirst.string(), Value::emptyDictionary()}});
     using Call = std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>;
     const std::vector<std::tuple<const char*, Call, test::Entries>> cases = {
-        {"add", [](auto& c, auto h) { c.addPlugInsReply(strings({"/a", "/b"}), h); },
+        {"add",
+         [](auto& c, auto h) {
+             c.addPlugInsReply(strings({"/a", "/b"}), h);
+         },
          {{"paths", strings({"/a", "/b"})}}},
         {"remove", [](auto& c, auto h) { c.removePlugInsReply(strings({"/x"}), h); }, {{"paths", strings({"/x"})}}},
-        {"bulk", [](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); },
+        {"bulk",
+         [](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); },
          {{"flags", Value::uint64(0x8000000000000001ull)}}},
-        {"match", [&](auto& c, auto h) { c.matchPlugInsFlagsReply(rules, 0x201, h); },
+        {"match",
+         [&](auto& c, auto h) { c.matchPlugInsFlagsReply(rules, 0x201, h); },
          {{"rules", rules}, {"flags", Value::uint64(0x201)}}},
-        {"ready", [](auto& c, auto h) { c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h); },
+        {"ready",
+         [](auto& c, auto h) {
+             c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h);
+         },
          {{"uuids", uuids({kSecond, kFirst})}, {"flags", Value::uint64(7)}}},
-        {"access", [](auto& c, auto h) { c.accessPlugInsFlagsReply({kFirst, kFirst}, 0, h); },
+        {"access",
+         [](auto& c, auto h) {
+             c.accessPlugInsFlagsReply({kFirst, kFirst}, 0, h);
+         },
          {{"uuids", uuids({kFirst, kFirst})}, {"flags", Value::uint64(0)}}},
-        {"annotate", [&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); },
+        {"annotate",
+         [&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); },
          {{"uuids", uuids({kFirst})}, {"annotations", annotations}}},
-        {"bulk-annotate", [&](auto& c, auto h) { c.bulkSetPluginAnnotationsReply(bulk, h); },
-         {{"annotations", bulk}}},
-        {"lock", [](auto& c, auto h) { c.holdPluginsFlagsReply(strings({"/Apps/A.app"}), 0x3, h); },
+        {"bulk-annotate", [&](auto& c, auto h) { c.bulkSetPluginAnnotationsReply(bulk, h); }, {{"annotations", bulk}}},
+        {"lock",
+         [](auto& c, auto h) { c.holdPluginsFlagsReply(strings({"/Apps/A.app"}), 0x3, h); },
          {{"paths", strings({"/Apps/A.app"})}, {"flags", Value::uint64(3)}}},
         {"lock", [](auto& c, auto h) { c.releaseHoldReply(kSecond, h); }, {{"uuids", uuids({kSecond})}}},
     };

@@ -308,7 +308,8 @@ TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
     failing.heal();
     annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
     EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(), document(dict({{"a", dict({{"election", integer(2)}})}, {"b", dict({{"election", integer(1)}})}})));
+    EXPECT_EQ(onDisk(),
+              document(dict({{"a", dict({{"election", integer(2)}})}, {"b", dict({{"election", integer(1)}})}})));
 }
 
 TEST_F(AnnotationStoreTest, UnrepresentableValueFailsEverySaveUntilItIsRemoved) {

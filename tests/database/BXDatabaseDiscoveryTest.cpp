@@ -162,12 +162,13 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering
 // its low eight bits; a plug-in never elected counts as 0 and one entitled to automatic election as 1. A malformed
 // wanted election switches filtering off rather than hiding everything.
 TEST_F(BXDatabaseDiscoveryTest, ElectionOrListOfElectionsKeepsElectedAndAutoElectedPlugIns) {
-    workspace_->answer = LXProxyList{plugIn("zero"),  plugIn("one"),     plugIn("two"),     plugIn("never"),
-                                     plugIn("auto", autoElect()), plugIn("wrapped"), plugIn("negative")};
+    workspace_->answer =
+        LXProxyList{plugIn("zero"),    plugIn("one"),     plugIn("two"), plugIn("never"), plugIn("auto", autoElect()),
+                    plugIn("wrapped"), plugIn("negative")};
     for (auto [name, election] : {std::pair{"zero", 0}, {"one", 1}, {"two", 2}, {"wrapped", 256}, {"negative", -1}})
         storeElection(std::string("com.example.") + name, Value::int64(election));
-    const Ids everything = {"com.example.auto",     "com.example.negative", "com.example.never", "com.example.one",
-                            "com.example.two",      "com.example.wrapped",  "com.example.zero"};
+    const Ids everything = {"com.example.auto", "com.example.negative", "com.example.never", "com.example.one",
+                            "com.example.two",  "com.example.wrapped",  "com.example.zero"};
     const std::vector<std::pair<Value, Ids>> cases = {
         {str("1"), {"com.example.auto", "com.example.one"}},
         {str("=2"), {"com.example.two"}},
@@ -185,7 +186,8 @@ TEST_F(BXDatabaseDiscoveryTest, ElectionOrListOfElectionsKeepsElectedAndAutoElec
         {Value::array({str("1"), str("")}), everything},
         {dict({}), everything},
     };
-    for (const auto& [wanted, expected] : cases) EXPECT_EQ(find(electionQuery(wanted)), expected) << wanted.description();
+    for (const auto& [wanted, expected] : cases)
+        EXPECT_EQ(find(electionQuery(wanted)), expected) << wanted.description();
     // The whole query, election included, went to the registry as given.
     EXPECT_EQ(workspace_->lastQuery, electionQuery(dict({})));
 }
