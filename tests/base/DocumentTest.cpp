@@ -2,7 +2,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <cmath>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -40,69 +39,36 @@ Value nestedArrays(size_t depth) {
 
 // ---- round trips ----
 
-TEST(DocumentRoundTrip, ScalarsAtTheirEdgesComeBackWithTheirKind) {
-    std::vector<Value> values = {
-        Value::null(),
-        Value::boolean(false),
-        Value::int64(std::numeric_limits<int64_t>::min()),
+// The document fuzzer round-trips every value it reads from its corpus (null, booleans, int64 min, uint64 max, -0,
+// NaN, infinities, the first and last writable dates, empty and padded data, nested empty containers); these are
+// the edges it does not hold, and the text of dates, which it cannot judge.
+TEST(DocumentRoundTrip, EdgeValuesComeBackWithTheirKindAndDatesUseTheShortReadableForm) {
+    std::mt19937 random(7);
+    std::vector<uint8_t> blob(1024 * 1024 + 1);
+    for (uint8_t& b : blob) b = static_cast<uint8_t>(random());
+    const std::vector<Value> values = {
         Value::int64(std::numeric_limits<int64_t>::max()),
-        Value::uint64(std::numeric_limits<uint64_t>::max()),
         Value::real(0.1),
         Value::real(std::numeric_limits<double>::denorm_min()),
-        Value::real(-std::numeric_limits<double>::infinity()),
-        Value::string(""),
-        Value::string("  \n\t  "),  // whitespace-only text is not dropped as formatting
         Value::string("<&>\"' ]]> &amp; <!-- no comment -->"),
         Value::string("line\r\nends\rand\nmore\r"),  // a raw CR would become LF on reading
-        Value::string("h\xC3\xA9llo \xF0\x9F\x98\x80 \xE2\x80\xA8"),
-        // Every base64 padding length.
-        bytes({}),
+        Value::string("\xE2\x80\xA8"),
+        // The base64 groups without and with one or two padding characters, and a big blob.
+        bytes({0xFF, 0xFE, 0x3C}),
         bytes({0}),
         bytes({0, 1}),
-        bytes({0xFF, 0xFE, 0x3C}),
+        Value::data(std::move(blob)),
     };
     for (const Value& v : values) {
         Value back = roundTrip(v);
         EXPECT_EQ(back, v) << v.description();
         EXPECT_EQ(back.kind(), v.kind()) << v.description();
     }
-    // == cannot see these: the bits must survive.
-    EXPECT_TRUE(std::signbit(*roundTrip(Value::real(-0.0)).getReal()));
-    EXPECT_TRUE(std::isnan(roundTrip(Value::real(std::nan(""))).getReal().value_or(0)));
-}
-
-TEST(DocumentRoundTrip, DatesComeBackAsTheSameDoubleAndUseTheShortReadableForm) {
-    const double dates[] = {
-        0,
-        1795428205.1234567891,  // finer than microseconds: the fraction is written out exactly
-        -1.5,                   // a negative fraction
-        -62167219200,           // 0000-01-01T00:00:00Z
-        253402300799.999,       // the last writable millisecond
-    };
-    for (double d : dates) {
-        Value back = roundTrip(Value::date(Date{d}));
-        ASSERT_TRUE(back.getDate()) << d;
-        EXPECT_EQ(std::bit_cast<uint64_t>(back.getDate()->secondsSince1970), std::bit_cast<uint64_t>(d)) << d;
-    }
     for (auto [seconds, form] :
          {std::pair{1795428205.0, "2026-11-23T10:03:25Z"}, {1795428205.25, "2026-11-23T10:03:25.25Z"}}) {
         std::string text = Document::write(Value::date(Date{seconds})).value();
         EXPECT_NE(text.find(std::string("<date>") + form + "</date>"), std::string::npos) << text;
     }
-}
-
-TEST(DocumentRoundTrip, NestedContainersOfMixedKindsAndBigData) {
-    std::mt19937 random(7);
-    std::vector<uint8_t> blob(1024 * 1024 + 1);
-    for (uint8_t& b : blob) b = static_cast<uint8_t>(random());
-    Value document = dict({{"blob", Value::data(std::move(blob))},
-                           {"empty-array", Value::emptyArray()},
-                           {"empty-dict", Value::emptyDictionary()},
-                           {"", Value::string("empty key")},
-                           {"list", Value::array({Value::boolean(true), Value::date(Date{1795428205.5}),
-                                                  Value::array({Value::array({Value::int64(-7)})}),
-                                                  dict({{"k<&>", Value::string("v")}})})}});
-    EXPECT_EQ(roundTrip(document), document);
 }
 
 TEST(DocumentRoundTrip, WritesTheDocumentedLayout) {
@@ -318,9 +284,8 @@ TEST_F(DocumentFileTest, ReadErrorsNameTheFile) {
 
 using test::FailingFileSystem;
 
-// Each step of the atomic replace can fail; before the rename nothing of the attempt may show, afterwards the
-// next successful write replaces the file.
-TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporary) {
+// Each step of the atomic replace can fail; before the rename nothing of the attempt may show.
+TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporaryAfterItTheNewOne) {
     Value old = dict({{"version", Value::int64(16)}, {"data", dict({{"old", Value::boolean(true)}})}});
     ASSERT_FALSE(Document::writeFileAtomically(path_, old));
     const std::string oldText = contents();
@@ -346,25 +311,18 @@ TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporary) {
         EXPECT_EQ(contents(), oldText) << c.call;
         EXPECT_EQ(names(), std::vector<std::string>{"Annotations.vrec"}) << c.call;
     }
-    ASSERT_FALSE(Document::writeFileAtomically(path_, replacement));
-    EXPECT_EQ(*Document::readFile(path_), replacement);
-    EXPECT_EQ(names(), std::vector<std::string>{"Annotations.vrec"});
-}
-
-TEST_F(DocumentFileTest,
-       DirectorySyncFailureIsReportedWithTheNewDocumentInPlaceAndAnUnrepresentableValueTouchesNoFile) {
-    ASSERT_FALSE(Document::writeFileAtomically(path_, Value::int64(1)));
-    FailingFileSystem fs("fsync", EIO, 1);  // the file's fsync succeeds, the directory's fails
-    std::optional<Error> error = Document::writeFileAtomically(path_, Value::int64(2), fs);
+    // After the rename only the directory's fsync is left: its failure is reported with the new document in place.
+    FailingFileSystem directorySync("fsync", EIO, 1);
+    std::optional<Error> error = Document::writeFileAtomically(path_, replacement, directorySync);
     ASSERT_TRUE(error);
     EXPECT_EQ(error->code(), EIO);
     EXPECT_NE(message(*error).find("fsync directory"), std::string::npos) << message(*error);
-    EXPECT_EQ(*Document::readFile(path_), Value::int64(2));
-
+    EXPECT_EQ(*Document::readFile(path_), replacement);
+    // A value that cannot be written touches no file at all.
     error = Document::writeFileAtomically(path_, dict({{"id", Value::uuid(Uuid::random())}}));
     ASSERT_TRUE(error);
     EXPECT_EQ(error->code(), kDocumentUnrepresentable);
-    EXPECT_EQ(*Document::readFile(path_), Value::int64(2));
+    EXPECT_EQ(*Document::readFile(path_), replacement);
     EXPECT_EQ(names(), std::vector<std::string>{"Annotations.vrec"});
 }
 
