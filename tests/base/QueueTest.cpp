@@ -243,22 +243,6 @@ TEST(SerialQueueTest, DispatchRunsAtOnceOnTheLoopUnlessBlocksAreQueuedAndIsQueue
 
 // ---- isCurrent and sync -------------------------------------------------------------------------------------------
 
-TEST(SerialQueueTest, IsCurrentOnlyInsideItsOwnBlocksAndIsRestoredAfterANestedSync) {
-    EventLoop loop(2);
-    SerialQueue a("a", loop);
-    SerialQueue b("b", loop);
-    EXPECT_FALSE(a.isCurrent());
-    std::vector<bool> seen;  // a in a, b in a, a in nested b, b in nested b, a after the nested sync
-    a.sync([&] {
-        seen = {a.isCurrent(), b.isCurrent()};
-        b.sync([&] { seen.insert(seen.end(), {a.isCurrent(), b.isCurrent()}); });
-        seen.push_back(a.isCurrent());
-    });
-    EXPECT_EQ(seen, (std::vector<bool>{true, false, false, true, true}));
-    // A copy of the handle is the same queue.
-    EXPECT_TRUE(a.sync([copy = a] { return copy.isCurrent(); }));
-}
-
 // The message of the InternalInconsistency that `attempt` throws, or "no exception".
 template <typename F>
 std::string refusal(F&& attempt) {
@@ -270,7 +254,7 @@ std::string refusal(F&& attempt) {
     return "no exception";
 }
 
-TEST(SerialQueueTest, SyncReturnsRethrowsAndRefusesWhatWouldDeadlock) {
+TEST(SerialQueueTest, SyncReturnsRethrowsNestsAndRefusesWhatWouldDeadlock) {
     EventLoop loop(2);
     SerialQueue a("service", loop);
     SerialQueue b("other", loop);
@@ -281,8 +265,17 @@ TEST(SerialQueueTest, SyncReturnsRethrowsAndRefusesWhatWouldDeadlock) {
     EXPECT_NE(direct.find("\"service\""), std::string::npos) << direct;
     std::string indirect = a.sync([&] { return b.sync([&] { return refusal([&] { a.sync([] {}); }); }); });
     EXPECT_NE(indirect.find("\"service\""), std::string::npos) << indirect;
-    // Both queues still work after a block threw and after the refusals; with two threads nesting is fine.
-    EXPECT_EQ(a.sync([&] { return b.sync([] { return 5; }); }), 5);
+    // Both queues still work after a block threw and after the refusals; with two threads nesting is fine, only
+    // the innermost queue is current inside, and the outer one is current again once the nested sync returns.
+    EXPECT_FALSE(a.isCurrent());
+    std::vector<bool> seen = a.sync([&] {
+        std::vector<bool> inner = b.sync([&] { return std::vector<bool>{a.isCurrent(), b.isCurrent()}; });
+        inner.insert(inner.end(), {a.isCurrent(), b.isCurrent()});
+        return inner;
+    });
+    EXPECT_EQ(seen, (std::vector<bool>{false, true, true, false}));
+    // A copy of the handle is the same queue.
+    EXPECT_TRUE(a.sync([copy = a] { return copy.isCurrent(); }));
 
     // From the only thread of a loop, a sync to another queue would wait for ever.
     EventLoop narrow(1);
