@@ -4,12 +4,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <optional>
 #include <random>
 #include <string>
@@ -17,6 +15,7 @@
 #include <utility>
 #include <vector>
 
+#include "CapturedLog.h"
 #include "TestSupport.h"
 #include "base/Document.h"
 #include "database/BXDAnnotationStore.h"
@@ -27,10 +26,11 @@ namespace {
 
 namespace fs = std::filesystem;
 
+using test::capturedLine;
 using test::dict;
 using test::FailingFileSystem;
-using test::ScopedEnv;
 Value integer(int64_t i) { return Value::int64(i); }
+Value elected(int64_t election) { return dict({{"election", integer(election)}}); }
 
 // A record that reads and writes annotations under a key of its own, as the daemon's plug-in records do.
 struct KeyedRecord {
@@ -38,24 +38,13 @@ struct KeyedRecord {
     std::string annotationKey() const { return key; }
 };
 
+// A store at a private path, with a state directory of its own where the legacy document lives.
 class AnnotationStoreTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        directory_ = tmp_.path();
-        path_ = directory_ / "Bexil-Annotations";
-        legacyPath_ = directory_ / "state" / "containers" / "com.quorvel.bxd" / "Bexil-Annotations";
-        stateDir_.emplace("BX_STATE_DIR", (directory_ / "state").string());
-    }
-    void TearDown() override { stateDir_.reset(); }
-
     static Value document(Value data, int64_t version = 16) {
         return dict({{"version", integer(version)}, {"data", std::move(data)}});
     }
-    static void put(const fs::path& path, const Value& root) {
-        fs::create_directories(path.parent_path());
-        ASSERT_FALSE(Document::writeFileAtomically(path, root));
-    }
-    static void putText(const fs::path& path, const std::string& text) { test::writeText(path, text); }
+    static void put(const fs::path& path, const Value& root) { test::writeText(path, Document::write(root).value()); }
     static std::string text(const fs::path& path) { return test::readText(path); }
     // The document on disk, which must load.
     Value onDisk() const {
@@ -66,67 +55,58 @@ class AnnotationStoreTest : public ::testing::Test {
     std::string store() const { return path_.string(); }
 
     test::TempDir tmp_{"bexil-annotation-store"};
-    fs::path directory_, path_, legacyPath_;
-    std::optional<ScopedEnv> stateDir_;
+    fs::path directory_ = tmp_.path();
+    fs::path path_ = directory_ / "Bexil-Annotations";
+    fs::path legacyPath_ = directory_ / "state" / "containers" / "com.quorvel.bxd" / "Bexil-Annotations";
+    test::ScopedEnv stateDir_{"BX_STATE_DIR", (directory_ / "state").string()};
     log::CaptureSink capture_;
 };
 
 // ---- loading at start ----
 
 TEST_F(AnnotationStoreTest, MissingDocumentStartsEmptySilentlyWritesOnlyAtTheFirstChangeAndLoadsBack) {
+    Value saved = dict({{"com.example.a", elected(1)}, {"b", dict({{"extension", dict({{"k", integer(2)}})}})}});
     {
         BXDAnnotationStore annotations(store());
         EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
         EXPECT_TRUE(capture_.entries().empty());
         EXPECT_FALSE(fs::exists(path_));
-        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "com.example.a");
-        annotations.setAnnotationForIdentifier(dict({{"extension", dict({{"k", Value::string("v")}})}}), "b");
+        for (const DictionaryEntry& entry : saved.entries())
+            annotations.setAnnotationForIdentifier(entry.value, entry.key);
     }
-    Value saved = dict({{"com.example.a", dict({{"election", integer(1)}})},
-                        {"b", dict({{"extension", dict({{"k", Value::string("v")}})}})}});
     EXPECT_EQ(onDisk(), document(saved));
-    BXDAnnotationStore reloaded(store());
-    EXPECT_EQ(reloaded.annotations(), saved);
-    EXPECT_TRUE(reloaded.annotationForIdentifier("c").isNull());
+    EXPECT_EQ(BXDAnnotationStore(store()).annotations(), saved);
 }
 
 // Every way a present document can be unusable: it is logged as an error, the map starts empty, the document is
 // kept for inspection until something is written, and the store then serves and saves as usual.
 TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTheFirstChange) {
-    put(path_, document(dict({{"a", dict({{"election", integer(1)}, {"extension", dict({{"x", integer(9)}})}})}})));
-    const std::string good = text(path_);
-    const std::string versionError = "Error Domain=Bexil Code=7 \"found database version ";
-    struct Case {
-        std::string contents;
-        std::string expected;  // part of the logged error
-    };
-    const std::vector<Case> cases = {
-        {Document::write(document(dict({}), 15)).value(), versionError + "15 needed version 16\""},
-        {Document::write(dict({{"data", dict({})}})).value(), versionError + "0 needed version 16\""},
-        {Document::write(dict({{"version", Value::string("16")}})).value(), versionError + "0 needed version 16\""},
+    const std::string good = Document::write(document(dict({{"a", elected(1)}}))).value();
+    const std::string version = "Error Domain=Bexil Code=7 \"found database version ";
+    const std::vector<std::pair<std::string, std::string>> cases = {
+        {Document::write(document(dict({}), 15)).value(), version + "15 needed version 16\""},
+        {Document::write(dict({{"data", dict({})}})).value(), version + "0 needed version 16\""},
+        {Document::write(dict({{"version", Value::string("16")}})).value(), version + "0 needed version 16\""},
         {good.substr(0, good.size() / 2), "Error Domain=BexilDocument"},
         {"<vrec><array><integer>16</integer></array></vrec>", "the root is a array, not a dictionary"},
         {Document::write(dict({{"version", integer(16)}, {"data", Value::string("x")}})).value(),
          "root[\"data\"] is a string, not a dictionary"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.contents);
-        putText(path_, c.contents);
+    for (const auto& [contents, expected] : cases) {
+        SCOPED_TRACE(contents);
+        test::writeText(path_, contents);
         capture_.clear();
         BXDAnnotationStore annotations(store());
         EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
-        std::vector<log::CaptureSink::Entry> lines = capture_.matching("unable to load annotation database:");
-        ASSERT_EQ(lines.size(), 1u);
-        EXPECT_EQ(lines[0].level, log::Level::Error);
-        EXPECT_EQ(lines[0].category, "ops");
-        EXPECT_TRUE(lines[0].message.starts_with("unable to load annotation database:" + path_.string() + " error:"))
-            << lines[0].message;
-        EXPECT_TRUE(lines[0].message.ends_with(" (resetting)")) << lines[0].message;
-        EXPECT_NE(lines[0].message.find(c.expected), std::string::npos) << lines[0].message;
-        EXPECT_EQ(text(path_), c.contents);
+        EXPECT_EQ(capture_.count("unable to load annotation database:"), 1u);
+        std::string line = capturedLine(capture_, "unable to load annotation database:");
+        EXPECT_TRUE(line.starts_with("error ops: unable to load annotation database:" + store() + " error:")) << line;
+        EXPECT_TRUE(line.ends_with(expected.starts_with(version) ? expected + " (resetting)" : " (resetting)")) << line;
+        EXPECT_NE(line.find(expected), std::string::npos) << line;
+        EXPECT_EQ(text(path_), contents);
 
-        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
-        EXPECT_EQ(onDisk(), document(dict({{"b", dict({{"election", integer(1)}})}})));
+        annotations.setAnnotationForIdentifier(elected(1), "b");
+        EXPECT_EQ(onDisk(), document(dict({{"b", elected(1)}})));
     }
     // A version-16 document without "data" is an empty map, not a failure.
     put(path_, dict({{"version", integer(16)}}));
@@ -136,24 +116,18 @@ TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTh
 
     fs::remove(path_);
     fs::create_directories(path_);  // a directory where the file should be
-    BXDAnnotationStore unreadable(store());
+    EXPECT_EQ(BXDAnnotationStore(store()).annotations(), Value::emptyDictionary());
     EXPECT_TRUE(capture_.contains("error:Error Domain=POSIX Code=" + std::to_string(EISDIR)));
-    EXPECT_EQ(unreadable.annotations(), Value::emptyDictionary());
 }
 
 TEST_F(AnnotationStoreTest, LoadFailureLeavesTheMapUnchanged) {
     BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "kept");
-    Value before = annotations.annotations();
-
-    fs::path other = directory_ / "other";
-    put(other, document(dict({{"x", Value::emptyDictionary()}}), 17));
-    EXPECT_EQ(annotations.loadDb(other), BXError(7, "found database version 17 needed version 16"));
-    EXPECT_EQ(annotations.annotations(), before);
-    std::optional<Error> error = annotations.loadDb(directory_ / "absent");
-    ASSERT_TRUE(error.has_value());
-    EXPECT_EQ(error->code(), ENOENT);
-    EXPECT_EQ(annotations.annotations(), before);
+    annotations.setAnnotationForIdentifier(elected(1), "kept");
+    put(directory_ / "other", document(dict({{"x", Value::emptyDictionary()}}), 17));
+    EXPECT_EQ(annotations.loadDb(directory_ / "other"), BXError(7, "found database version 17 needed version 16"));
+    std::optional<Error> absent = annotations.loadDb(directory_ / "absent");
+    EXPECT_EQ(absent ? absent->code() : 0, ENOENT);
+    EXPECT_EQ(annotations.annotations(), dict({{"kept", elected(1)}}));
 }
 
 // ---- the legacy document (in the daemon's container under the state directory) ----
@@ -169,23 +143,17 @@ TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissing
     const std::string legacyText = text(legacyPath_);
     for (bool badDocument : {false, true}) {
         SCOPED_TRACE(badDocument ? "bad document" : "no document");
-        if (badDocument)
-            putText(path_, "<vrec><dict>");
-        else
-            fs::remove(path_);
+        if (badDocument) test::writeText(path_, "<vrec><dict>");
+        if (!badDocument) fs::remove(path_);
         capture_.clear();
-        BXDAnnotationStore annotations(store());
-        EXPECT_EQ(annotations.annotations(), legacy);
-        std::optional<log::CaptureSink::Entry> line = capture_.find("migrating shared annotations");
-        ASSERT_TRUE(line.has_value());
-        EXPECT_EQ(line->level, log::Level::Info);
-        EXPECT_EQ(line->message, "migrating shared annotations");
+        EXPECT_EQ(BXDAnnotationStore(store()).annotations(), legacy);
+        EXPECT_EQ(capturedLine(capture_, "migrating"), "info ops: migrating shared annotations");
         EXPECT_EQ(capture_.contains("(resetting)"), badDocument);
         EXPECT_EQ(onDisk(), document(legacy));
         EXPECT_EQ(text(legacyPath_), legacyText) << "the legacy document is only ever read";
     }
 
-    Value current = dict({{"current", dict({{"election", integer(1)}})}});
+    Value current = dict({{"current", elected(1)}});
     put(path_, document(current));
     capture_.clear();
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), current);
@@ -193,19 +161,17 @@ TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissing
 }
 
 TEST_F(AnnotationStoreTest, UnsavableMigrationIsLoggedAndServedFromMemory) {
-    Value legacy = dict({{"legacy", dict({{"election", integer(1)}})}});
+    Value legacy = dict({{"legacy", elected(1)}});
     put(legacyPath_, document(legacy));
     FailingFileSystem failing("fsync", EIO);
 
     BXDAnnotationStore annotations(store(), failing);
     EXPECT_EQ(annotations.annotations(), legacy);
     EXPECT_TRUE(annotations.diskBehind());
-    std::optional<log::CaptureSink::Entry> line = capture_.find("unable to save migrated annotations to ");
-    ASSERT_TRUE(line.has_value());
-    EXPECT_EQ(line->level, log::Level::Error);
-    EXPECT_TRUE(line->message.starts_with("unable to save migrated annotations to " + path_.string() +
-                                          " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
-        << line->message;
+    EXPECT_TRUE(capturedLine(capture_, "unable to save migrated")
+                    .starts_with("error ops: unable to save migrated annotations to " + store() +
+                                 " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
+        << capturedLine(capture_, "unable to save migrated");
     EXPECT_FALSE(fs::exists(path_));
 }
 
@@ -245,7 +211,7 @@ TEST_F(AnnotationStoreTest, SettingMergesOneLevelDeepAndNullRemovesTheWholeEntry
     BXDAnnotationStore annotations(store());
     KeyedRecord plugIn{"p"}, sameKey{"p"};
 
-    annotations.setAnnotationForPlugIn(dict({{"election", integer(2)}}), plugIn);
+    annotations.setAnnotationForPlugIn(elected(2), plugIn);
     annotations.setAnnotationForPlugIn(dict({{"extension", dict({{"c", integer(3)}})}}), sameKey);
     annotations.setAnnotationForPlugIn(Value::emptyDictionary(), plugIn);
     Value expected =
@@ -256,28 +222,23 @@ TEST_F(AnnotationStoreTest, SettingMergesOneLevelDeepAndNullRemovesTheWholeEntry
     // An entry that is not a dictionary reads as none, survives other saves, and is replaced when set.
     EXPECT_TRUE(annotations.annotationForIdentifier("odd").isNull());
     EXPECT_EQ(onDisk().get("data").get("odd"), Value::string("not a dictionary"));
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "odd");
-    EXPECT_EQ(onDisk().get("data").get("odd"), dict({{"election", integer(2)}}));
+    annotations.setAnnotationForIdentifier(elected(2), "odd");
 
     annotations.setAnnotationForPlugIn(Value(), plugIn);
     EXPECT_TRUE(annotations.annotationForPlugIn(sameKey).isNull());
-    EXPECT_EQ(onDisk().get("data"), dict({{"odd", dict({{"election", integer(2)}})}}));
-    // Setting after removal starts from nothing; removing what is not there is harmless.
-    annotations.setAnnotationForPlugIn(dict({{"election", integer(3)}}), plugIn);
-    EXPECT_EQ(annotations.annotationForPlugIn(plugIn), dict({{"election", integer(3)}}));
+    EXPECT_EQ(onDisk().get("data"), dict({{"odd", elected(2)}}));
+    // Setting after removal starts from nothing; removing what is not there is harmless; a new key stores even an
+    // empty annotation.
+    annotations.setAnnotationForPlugIn(elected(3), plugIn);
     annotations.setAnnotationForIdentifier(Value(), "never-set");
-    EXPECT_EQ(onDisk().get("data").count(), 2u);
-    // A new key stores even an empty annotation.
     annotations.setAnnotationForIdentifier(Value::emptyDictionary(), "blank");
-    EXPECT_EQ(onDisk().get("data").get("blank"), Value::emptyDictionary());
-}
+    EXPECT_EQ(onDisk().get("data"),
+              dict({{"odd", elected(2)}, {"p", elected(3)}, {"blank", Value::emptyDictionary()}}));
 
-TEST_F(AnnotationStoreTest, AnnotationOfAnotherKindIsABrokenInvariantAndChangesNothing) {
-    BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "p");
+    // An annotation of another kind is a broken invariant and changes nothing.
     for (Value bad : {Value::string("x"), Value::emptyArray()})
         EXPECT_THROW(annotations.setAnnotationForIdentifier(bad, "p"), InternalInconsistency);
-    EXPECT_EQ(annotations.annotationForIdentifier("p"), dict({{"election", integer(1)}}));
+    EXPECT_EQ(annotations.annotationForIdentifier("p"), elected(3));
 }
 
 // ---- failed writes ----
@@ -285,48 +246,41 @@ TEST_F(AnnotationStoreTest, AnnotationOfAnotherKindIsABrokenInvariantAndChangesN
 // Which step of the atomic replace fails is the document layer's concern (its tests fail each one); here any
 // failure must keep the old document on disk and the change in memory until the next save writes it.
 TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
-    {
-        BXDAnnotationStore annotations(store());
-        annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "a");
-    }
-    std::string before = text(path_);
+    put(path_, document(dict({{"a", elected(1)}})));
+    const std::string before = text(path_);
     FailingFileSystem failing("write", EIO);
     BXDAnnotationStore annotations(store(), failing);
 
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "a");
-    EXPECT_EQ(annotations.annotationForIdentifier("a"), dict({{"election", integer(2)}}));
+    annotations.setAnnotationForIdentifier(elected(2), "a");
+    EXPECT_EQ(annotations.annotationForIdentifier("a"), elected(2));
     EXPECT_TRUE(annotations.diskBehind());
     EXPECT_EQ(text(path_), before);
-    std::optional<log::CaptureSink::Entry> line = capture_.find("unable to save annotations:");
-    ASSERT_TRUE(line.has_value());
-    EXPECT_EQ(line->level, log::Level::Error);
-    EXPECT_EQ(line->category, "ops");
-    EXPECT_TRUE(line->message.starts_with("unable to save annotations:" + path_.string() +
-                                          " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
-        << line->message;
+    EXPECT_TRUE(capturedLine(capture_, "unable to save annotations:")
+                    .starts_with("error ops: unable to save annotations:" + store() +
+                                 " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
+        << capturedLine(capture_, "unable to save annotations:");
 
     failing.heal();
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "b");
+    annotations.setAnnotationForIdentifier(elected(1), "b");
     EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(),
-              document(dict({{"a", dict({{"election", integer(2)}})}, {"b", dict({{"election", integer(1)}})}})));
+    EXPECT_EQ(onDisk(), document(dict({{"a", elected(2)}, {"b", elected(1)}})));
 }
 
 TEST_F(AnnotationStoreTest, UnrepresentableValueFailsEverySaveUntilItIsRemoved) {
     BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(1)}}), "good");
-    std::string before = text(path_);
+    annotations.setAnnotationForIdentifier(elected(1), "good");
+    const std::string before = text(path_);
 
     Value withUuid = dict({{"extension", dict({{"id", Value::uuid(Uuid::random())}})}});
     annotations.setAnnotationForIdentifier(withUuid, "bad");
-    annotations.setAnnotationForIdentifier(dict({{"election", integer(2)}}), "good");
-    EXPECT_EQ(capture_.count("unable to save annotations:" + path_.string() + " error:Error Domain=BexilDocument"), 2u);
+    annotations.setAnnotationForIdentifier(elected(2), "good");
+    EXPECT_EQ(capture_.count("unable to save annotations:" + store() + " error:Error Domain=BexilDocument"), 2u);
     EXPECT_EQ(text(path_), before);
     EXPECT_EQ(annotations.annotationForIdentifier("bad"), withUuid);
 
     annotations.setAnnotationForIdentifier(Value(), "bad");
     EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(), document(dict({{"good", dict({{"election", integer(2)}})}})));
+    EXPECT_EQ(onDisk(), document(dict({{"good", elected(2)}})));
 }
 
 // ---- crashes ----
@@ -340,7 +294,7 @@ TEST_F(AnnotationStoreTest, LeftoversOfInterruptedWritesAreRemovedAtStart) {
     fs::path stale = directory_ / ("Bexil-Annotations.tmp-" + std::to_string(dead) + "-00aa");
     fs::path live = directory_ / ("Bexil-Annotations.tmp-" + std::to_string(getppid()) + "-00bb");
     fs::path foreign = directory_ / ("Other.tmp-" + std::to_string(dead) + "-00cc");
-    for (const fs::path& p : {stale, live, foreign}) putText(p, "partial");
+    for (const fs::path& p : {stale, live, foreign}) test::writeText(p, "partial");
 
     BXDAnnotationStore annotations(store());
     EXPECT_FALSE(fs::exists(stale));
