@@ -21,11 +21,8 @@ TEST(ValueSharing, CopiesShareStorageAndBuildersNeverEditTheirSource) {
     MutableDictionary builder(original);
     builder.set("a", Value::string("changed"));
     builder.remove("b");
-    Value changed = builder.take();
-    EXPECT_EQ(original.get("a"), Value::string("one"));
-    EXPECT_EQ(original.get("b"), Value::int64(2));
-    EXPECT_EQ(changed.get("a"), Value::string("changed"));
-    EXPECT_FALSE(changed.contains("b"));
+    EXPECT_EQ(builder.take(), dict({{"a", Value::string("changed")}}));
+    EXPECT_EQ(original, dict({{"a", Value::string("one")}, {"b", Value::int64(2)}}));
 }
 
 TEST(ValueSharing, SharedAcrossThreadsWithoutRaces) {
@@ -121,7 +118,6 @@ TEST(ValueNumbers, ConversionsRefuseWhatDoesNotFit) {
     // Strict accessors do not convert.
     EXPECT_FALSE(Value::int64(1).getBool());
     EXPECT_FALSE(Value::int64(1).getUInt64());
-    EXPECT_EQ(Value::string("abc").stringView(), "abc");
     EXPECT_EQ(Value::int64(1).stringView(), "");
 }
 

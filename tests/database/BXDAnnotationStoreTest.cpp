@@ -390,9 +390,7 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
     // Every round saved at least twice; some kills must have hit a write in the middle, or this proved nothing.
     EXPECT_EQ(killedWithProgress, kKills);
     EXPECT_GE(interruptedWrites, 1);
-    RecordProperty("interrupted_writes", interruptedWrites);
-    RecordProperty("steps", static_cast<int>(lastStep));
-
+    // The next start removes what the killed writers left, whatever they named it.
     BXDAnnotationStore survivor(store());
     for (const auto& entry : fs::directory_iterator(directory_))
         EXPECT_EQ(entry.path().filename().string().find(".tmp-"), std::string::npos) << entry.path();
