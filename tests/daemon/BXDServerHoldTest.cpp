@@ -2,12 +2,11 @@
 
 #include <filesystem>
 
+#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDServer.h"
-#include "platform/ledgerix/LXApplicationProxy.h"
-#include "platform/ledgerix/LXBexilProxy.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {
@@ -15,27 +14,8 @@ namespace {
 
 namespace fs = std::filesystem;
 
-Value str(std::string_view s) { return Value::string(s); }
-
-// A daemon record of a well-formed plug-in inside an application, under the UUID given.
-std::shared_ptr<BXDPlugIn> record(const std::string& name, Uuid uuid) {
-    LXApplicationProxy::Fields app;
-    app.bundleURL = "/Applications/Greeter.app";
-    LXBexilProxy::Fields fields;
-    std::string identifier = "com.example." + name;
-    fields.bundleURL = "/Applications/Greeter.app/PlugIns/" + name + ".bxplugin";
-    fields.pluginIdentifier = identifier;
-    fields.pluginUUID = uuid;
-    fields.containingBundle = std::make_shared<LXApplicationProxy>(app, LXApplicationProxy::PlugInList{});
-    fields.dataContainerURL = "/var/lib/bexil/containers/" + identifier;
-    fields.infoVrec = Value::dictionary({
-        {"BDBundleIdentifier", str(identifier)},
-        {"RZExtension", Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")},
-                                           {"RZExtensionProtocol", str("GreetingProvider")},
-                                           {"PrincipalClass", str("Greeting")},
-                                           {"RZExtensionAttributes", Value::emptyDictionary()}})},
-    });
-    return BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+std::shared_ptr<BXDPlugIn> record(const std::string& name, const Uuid& uuid) {
+    return test::plugInRecord("com.example." + name, uuid);
 }
 
 // A server over private directories; its listener is bound but never resumed.

@@ -14,6 +14,7 @@
 #include <sstream>
 #include <thread>
 
+#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
@@ -175,20 +176,7 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
 
     // The plug-in record asks by its bundle identifier and describes the busy instance by it alone.
-    LXBexilProxy::Fields fields;
-    // A data plug-in on the system volume passes the record's checks without a container or an application.
-    fields.bundleURL = "/System/Library/PlugIns/Hello.bxplugin";
-    fields.isOnSystemPartition = true;
-    fields.pluginIdentifier = "com.example.greeter.hello";
-    fields.bundleIdentifier = "com.example.greeter.hello";
-    fields.pluginUUID = Uuid::random();
-    fields.infoVrec = Value::dictionary(
-        {{"BDBundleIdentifier", Value::string("com.example.greeter.hello")},
-         {"RZExtension", Value::dictionary({
-                             {"RZExtensionProtocol", Value::string("#Data")},
-                             {"RZExtensionAttributes", Value::dictionary({{"RZExtensionVersion", Value::string("1")}})},
-                         })}});
-    auto plugIn = BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+    auto plugIn = test::plugInRecord("com.example.greeter.hello", Uuid::random());
     ASSERT_NE(plugIn, nullptr);
     std::optional<Value> description = plugIn->checkBusy(wardend);
     ASSERT_TRUE(description);
