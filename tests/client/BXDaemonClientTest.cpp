@@ -7,6 +7,7 @@
 #include <future>
 #include <mutex>
 #include <optional>
+#include <tuple>
 
 #include "TestSupport.h"
 #include "base/EventLoop.h"
@@ -25,8 +26,7 @@ using Reply = BXDaemonClient::Reply;
 // A service on a private directory that answers every request with `answer` and remembers what it got.
 class CapturingService {
   public:
-    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName)
-        : queue_("capture", *loop_) {
+    explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName) : queue_("capture", *loop_) {
         auto listener = ZemListener::create(service, queue_, nullptr);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;
@@ -91,113 +91,83 @@ class BXDaemonClientRequestTest : public ::testing::Test {
     Value sent(const std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>& call) {
         BXDaemonClient client;
         auto reply = sendAndWait([&](auto handler) { call(client, std::move(handler)); }, std::chrono::seconds(10));
-        EXPECT_TRUE(reply.has_value());
-        if (reply) {
-            EXPECT_TRUE(std::holds_alternative<Value>(*reply));
-        }
+        EXPECT_TRUE(reply.has_value() && std::holds_alternative<Value>(*reply));
         return service_.lastRequest();
-    }
-    static void expectEnvelope(const Value& request, const char* name) {
-        EXPECT_EQ(request.get("request").stringView(), name);
-        ASSERT_TRUE(request.get("version").getUInt64().has_value()) << "version must travel as uint64";
-        EXPECT_EQ(*request.get("version").getUInt64(), 3u);
-    }
-    static std::vector<Uuid> uuidsOf(const Value& request) {
-        std::vector<Uuid> out;
-        for (const Value& v : request.get("uuids").items()) out.push_back(v.getUuid() ? *v.getUuid() : Uuid());
-        return out;
     }
 
     CapturingService service_;
 };
 
-TEST_F(BXDaemonClientRequestTest, CreationDefaultsToTheDaemonServiceQueueAndVersion3) {
-    BXDaemonClient client;
-    EXPECT_EQ(client.serviceName(), "com.quorvel.bexil.bxd");
-    EXPECT_EQ(client.replyQueue().label(), "bxd_client");
-    EXPECT_EQ(client.protocolVersion(), 3);
-    EXPECT_EQ(client.bxd()->serviceName(), "com.quorvel.bexil.bxd");
+Value uuids(std::initializer_list<Uuid> items) {
+    MutableArray array;
+    for (const Uuid& item : items) array.append(Value::uuid(item));
+    return array.take();
 }
 
-TEST_F(BXDaemonClientRequestTest, PathRequestsCarryPathsOnlyFlagRequestsUnsignedFlags) {
-    Value add = sent([](auto& c, auto h) { c.addPlugInsReply(strings({"/a", "/b"}), h); });
-    expectEnvelope(add, "add");
-    EXPECT_EQ(add.get("paths"), strings({"/a", "/b"}));
-    EXPECT_EQ(add.count(), 3u);
-
-    Value remove = sent([](auto& c, auto h) { c.removePlugInsReply(strings({"/x"}), h); });
-    expectEnvelope(remove, "remove");
-    EXPECT_EQ(remove.get("paths"), strings({"/x"}));
-    EXPECT_EQ(remove.count(), 3u);
-
-    Value bulk = sent([](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); });
-    expectEnvelope(bulk, "bulk");
-    EXPECT_EQ(bulk.get("flags").getUInt64(), std::optional<uint64_t>(0x8000000000000001ull));
-    EXPECT_EQ(bulk.count(), 3u);
-
-    Value rules = Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.*")}});
-    Value match = sent([&](auto& c, auto h) { c.matchPlugInsFlagsReply(rules, 0x201, h); });
-    expectEnvelope(match, "match");
-    EXPECT_EQ(match.get("rules"), rules);
-    EXPECT_EQ(match.get("flags").getUInt64(), std::optional<uint64_t>(0x201));
-    EXPECT_EQ(match.count(), 4u);
+// The whole message of each request method, so that a missing or extra key shows; hold and release are both "lock"
+// requests, told apart by paths or uuids. Numbers must also travel as uint64, which == alone would not see.
+TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyItsArguments) {
+    EXPECT_EQ(BXDaemonClient().serviceName(), "com.quorvel.bexil.bxd");
+    const Value rules = Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.*")}});
+    const Value annotations = Value::dictionary({{"election", Value::int64(1)}});
+    const Value bulk = Value::dictionary({{kFirst.string(), Value::emptyDictionary()}});
+    using Call = std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>;
+    const std::vector<std::tuple<const char*, Call, test::Entries>> cases = {
+        {"add",
+         [](auto& c, auto h) {
+             c.addPlugInsReply(strings({"/a", "/b"}), h);
+         },
+         {{"paths", strings({"/a", "/b"})}}},
+        {"remove", [](auto& c, auto h) { c.removePlugInsReply(strings({"/x"}), h); }, {{"paths", strings({"/x"})}}},
+        {"bulk",
+         [](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); },
+         {{"flags", Value::uint64(0x8000000000000001ull)}}},
+        {"match",
+         [&](auto& c, auto h) { c.matchPlugInsFlagsReply(rules, 0x201, h); },
+         {{"rules", rules}, {"flags", Value::uint64(0x201)}}},
+        {"ready",
+         [](auto& c, auto h) {
+             c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h);
+         },
+         {{"uuids", uuids({kSecond, kFirst})}, {"flags", Value::uint64(7)}}},
+        {"access",
+         [](auto& c, auto h) {
+             c.accessPlugInsFlagsReply({kFirst, kFirst}, 0, h);
+         },
+         {{"uuids", uuids({kFirst, kFirst})}, {"flags", Value::uint64(0)}}},
+        {"annotate",
+         [&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); },
+         {{"uuids", uuids({kFirst})}, {"annotations", annotations}}},
+        {"bulk-annotate", [&](auto& c, auto h) { c.bulkSetPluginAnnotationsReply(bulk, h); }, {{"annotations", bulk}}},
+        {"lock",
+         [](auto& c, auto h) { c.holdPluginsFlagsReply(strings({"/Apps/A.app"}), 0x3, h); },
+         {{"paths", strings({"/Apps/A.app"})}, {"flags", Value::uint64(3)}}},
+        {"lock", [](auto& c, auto h) { c.releaseHoldReply(kSecond, h); }, {{"uuids", uuids({kSecond})}}},
+    };
+    for (const auto& [name, call, arguments] : cases) {
+        test::Entries expected = arguments;
+        expected.emplace_back("request", Value::string(name));
+        expected.emplace_back("version", Value::uint64(3));
+        Value request = sent(call);
+        EXPECT_EQ(request, test::dict(expected)) << name;
+        for (const char* number : {"version", "flags"}) {
+            if (request.contains(number)) {
+                EXPECT_TRUE(request.get(number).getUInt64()) << name << " " << number;
+            }
+        }
+    }
 }
 
-TEST_F(BXDaemonClientRequestTest, UuidAndAnnotationRequestsKeepTheOrderGiven) {
-    Value ready = sent([](auto& c, auto h) { c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h); });
-    expectEnvelope(ready, "ready");
-    EXPECT_EQ(uuidsOf(ready), (std::vector<Uuid>{kSecond, kFirst}));
-    EXPECT_EQ(ready.get("flags").getUInt64(), std::optional<uint64_t>(7));
-
-    Value access = sent([](auto& c, auto h) { c.accessPlugInsFlagsReply({kFirst, kFirst}, 0, h); });
-    expectEnvelope(access, "access");
-    EXPECT_EQ(uuidsOf(access), (std::vector<Uuid>{kFirst, kFirst}));
-    EXPECT_TRUE(access.get("flags").getUInt64().has_value());
-
-    Value annotations = Value::dictionary({{"election", Value::int64(1)}});
-    Value annotate = sent([&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); });
-    expectEnvelope(annotate, "annotate");
-    EXPECT_EQ(uuidsOf(annotate), std::vector<Uuid>{kFirst});
-    EXPECT_EQ(annotate.get("annotations"), annotations);
-    EXPECT_EQ(annotate.count(), 4u);
-
-    Value bulk = Value::dictionary({{kFirst.string(), Value::emptyDictionary()}});
-    Value bulkAnnotate = sent([&](auto& c, auto h) { c.bulkSetPluginAnnotationsReply(bulk, h); });
-    expectEnvelope(bulkAnnotate, "bulk-annotate");
-    EXPECT_EQ(bulkAnnotate.get("annotations"), bulk);
-    EXPECT_FALSE(bulkAnnotate.contains("uuids"));
-}
-
-TEST_F(BXDaemonClientRequestTest, HoldAndReleaseAreBothLockRequests) {
-    Value hold = sent([](auto& c, auto h) { c.holdPluginsFlagsReply(strings({"/Apps/A.app"}), 0x3, h); });
-    expectEnvelope(hold, "lock");
-    EXPECT_EQ(hold.get("paths"), strings({"/Apps/A.app"}));
-    EXPECT_EQ(hold.get("flags").getUInt64(), std::optional<uint64_t>(3));
-    EXPECT_FALSE(hold.contains("uuids"));
-
-    Value release = sent([](auto& c, auto h) { c.releaseHoldReply(kSecond, h); });
-    expectEnvelope(release, "lock");
-    EXPECT_EQ(uuidsOf(release), std::vector<Uuid>{kSecond});
-    EXPECT_FALSE(release.contains("paths"));
-    EXPECT_FALSE(release.contains("flags"));
-}
-
-TEST_F(BXDaemonClientRequestTest, ChangedProtocolVersionTravelsAndGatesDecoding) {
+TEST_F(BXDaemonClientRequestTest, ChangedProtocolVersionTravelsAndGatesDecodingAndRepliesRunOnTheReplyQueue) {
     BXDaemonClient client;
     client.setProtocolVersion(2);
-    auto reply = sendAndWait([&](auto h) { client.bulkPluginsReply(0, h); }, std::chrono::seconds(10));
-    ASSERT_TRUE(reply.has_value());
-    EXPECT_EQ(service_.lastRequest().get("version").getUInt64(), std::optional<uint64_t>(2));
-    EXPECT_FALSE(client.convertFromZEM(Value::emptyArray()).has_value());
-}
-
-TEST_F(BXDaemonClientRequestTest, ReplyCallbacksRunOnTheReplyQueue) {
-    BXDaemonClient client;
     std::promise<bool> onQueue;
     client.bulkPluginsReply(0, [&](const Reply&) { onQueue.set_value(client.replyQueue().isCurrent()); });
     auto future = onQueue.get_future();
     ASSERT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
     EXPECT_TRUE(future.get());
+    EXPECT_EQ(service_.lastRequest().get("version").getUInt64(), std::optional<uint64_t>(2));
+    EXPECT_FALSE(client.convertFromZEM(Value::emptyArray()).has_value());
 }
 
 TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThatIsCode4) {
@@ -217,32 +187,20 @@ TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThat
 
 Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
 
-TEST(BXDaemonClientErrorTest, EmptyReplyAndZeroCodeAreSuccessACodeIsABexilErrorWithItsMessageOrTheGenericText) {
+// Only the low 32 bits of "errorcode" count, read as a signed number; zero is success, a code without a message
+// gets the generic text, and a message without a code is a broken invariant.
+TEST(BXDaemonClientErrorTest, TheLow32BitsOfTheCodeMakeTheErrorWithItsMessageOrTheGenericText) {
     EXPECT_FALSE(BXDaemonClient::errorInReply(Value::emptyDictionary()).has_value());
-    EXPECT_FALSE(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0)}})).has_value());
-
-    auto error = BXDaemonClient::errorInReply(
-        replyWith({{"errorcode", Value::uint64(9)}, {"error", Value::string("no plugin at /x")}}));
-    ASSERT_TRUE(error.has_value());
-    EXPECT_TRUE(error->isBexil());
-    EXPECT_EQ(error->code(), 9);
-    EXPECT_EQ(error->localizedDescription(), std::optional<std::string>("no plugin at /x"));
-
-    auto generic = BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(14)}}));
-    ASSERT_TRUE(generic.has_value());
-    EXPECT_EQ(generic->code(), 14);
-    EXPECT_EQ(generic->localizedDescription(), std::optional<std::string>("unknown error returned by Bexil subsystem"));
-}
-
-TEST(BXDaemonClientErrorTest, OnlyTheLow32BitsOfTheCodeCountAndAMessageWithoutCodeIsABrokenInvariant) {
-    // A negative 32-bit code widened with its sign, and a code with junk in the high half.
-    auto negative = BXDaemonClient::errorInReply(
-        replyWith({{"errorcode", Value::uint64(0xFFFFFFFFFFFFFFFEull)}, {"error", Value::string("m")}}));
-    ASSERT_TRUE(negative.has_value());
-    EXPECT_EQ(negative->code(), -2);
-    auto highOnly = BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0x100000000ull)}}));
-    EXPECT_FALSE(highOnly.has_value()) << "low half 0 and no message is success";
-
+    EXPECT_FALSE(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0x100000000ull)}})));
+    EXPECT_EQ(BXDaemonClient::errorInReply(
+                  replyWith({{"errorcode", Value::uint64(9)}, {"error", Value::string("no plugin at /x")}})),
+              BXError(9, "no plugin at /x"));
+    EXPECT_EQ(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(14)}})),
+              BXError(14, "unknown error returned by Bexil subsystem"));
+    // A negative 32-bit code widened with its sign.
+    EXPECT_EQ(BXDaemonClient::errorInReply(
+                  replyWith({{"errorcode", Value::uint64(0xFFFFFFFFFFFFFFFEull)}, {"error", Value::string("m")}})),
+              BXError(-2, "m"));
     try {
         (void)BXDaemonClient::errorInReply(replyWith({{"error", Value::string("oops")}}));
         FAIL() << "expected InternalInconsistency";
@@ -296,9 +254,13 @@ Value formFor(const char* identifier, const Uuid& uuid) {
     return form.take();
 }
 
-TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrder) {
+// Forms become records in reply order; a form that cannot be read is left out, while an error reply, a reply
+// without matches and a client speaking an older version are errors.
+TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrderUnreadableOnesAreLeftOutAndBadRepliesAreErrors) {
     BXDaemonClient client("com.example.unused");
-    Value matches = Value::array({formFor("com.example.b", kSecond), formFor("com.example.a", kFirst)});
+    MutableDictionary noPath(formFor("com.example.c", kFirst));
+    noPath.remove("path");
+    Value matches = Value::array({formFor("com.example.b", kSecond), noPath.take(), formFor("com.example.a", kFirst)});
     auto plugIns = plugInsFromMatchReply(client, Value::dictionary({{"matches", matches}}));
     ASSERT_TRUE(plugIns.ok());
     ASSERT_EQ(plugIns->size(), 2u);
@@ -307,31 +269,15 @@ TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrder) {
     EXPECT_EQ((*plugIns)[1]->uuid(), std::optional<Uuid>(kFirst));
     ASSERT_TRUE((*plugIns)[1]->annotations().has_value());
     EXPECT_EQ((*plugIns)[1]->annotations()->get("election"), Value::int64(1));
-}
 
-TEST(BXPlugInMatchesTest, UnreadableFormsAreLeftOutAndBadRepliesAreErrors) {
-    BXDaemonClient client("com.example.unused");
-    MutableDictionary noPath(formFor("com.example.c", kFirst));
-    noPath.remove("path");
-    auto some = plugInsFromMatchReply(
-        client, Value::dictionary({{"matches", Value::array({noPath.take(), formFor("com.example.d", kSecond)})}}));
-    ASSERT_TRUE(some.ok());
-    ASSERT_EQ(some->size(), 1u);
-    EXPECT_EQ((*some)[0]->identifier(), std::optional<std::string>("com.example.d"));
-
-    auto failed = plugInsFromMatchReply(
-        client, Value::dictionary({{"errorcode", Value::uint64(11)}, {"error", Value::string("denied")}}));
-    ASSERT_FALSE(failed.ok());
-    EXPECT_EQ(failed.error().code(), 11);
-
-    auto missing = plugInsFromMatchReply(client, Value::emptyDictionary());
-    ASSERT_FALSE(missing.ok());
-    EXPECT_EQ(missing.error().code(), 4);
-
+    auto codeOf = [&](const Value& reply) {
+        auto result = plugInsFromMatchReply(client, reply);
+        return result.ok() ? 0 : result.error().code();
+    };
+    EXPECT_EQ(codeOf(Value::dictionary({{"errorcode", Value::uint64(11)}, {"error", Value::string("denied")}})), 11);
+    EXPECT_EQ(codeOf(Value::emptyDictionary()), 4);
     client.setProtocolVersion(2);
-    auto oldVersion = plugInsFromMatchReply(client, Value::dictionary({{"matches", Value::emptyArray()}}));
-    ASSERT_FALSE(oldVersion.ok());
-    EXPECT_EQ(oldVersion.error().code(), 7);
+    EXPECT_EQ(codeOf(Value::dictionary({{"matches", Value::emptyArray()}})), 7);
 }
 
 }  // namespace

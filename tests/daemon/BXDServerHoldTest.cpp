@@ -2,12 +2,11 @@
 
 #include <filesystem>
 
+#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDServer.h"
-#include "platform/ledgerix/LXApplicationProxy.h"
-#include "platform/ledgerix/LXBexilProxy.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {
@@ -15,27 +14,8 @@ namespace {
 
 namespace fs = std::filesystem;
 
-Value str(std::string_view s) { return Value::string(s); }
-
-// A daemon record of a well-formed plug-in inside an application, under the UUID given.
-std::shared_ptr<BXDPlugIn> record(const std::string& name, Uuid uuid) {
-    LXApplicationProxy::Fields app;
-    app.bundleURL = "/Applications/Greeter.app";
-    LXBexilProxy::Fields fields;
-    std::string identifier = "com.example." + name;
-    fields.bundleURL = "/Applications/Greeter.app/PlugIns/" + name + ".bxplugin";
-    fields.pluginIdentifier = identifier;
-    fields.pluginUUID = uuid;
-    fields.containingBundle = std::make_shared<LXApplicationProxy>(app, LXApplicationProxy::PlugInList{});
-    fields.dataContainerURL = "/var/lib/bexil/containers/" + identifier;
-    fields.infoVrec = Value::dictionary({
-        {"BDBundleIdentifier", str(identifier)},
-        {"RZExtension", Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")},
-                                           {"RZExtensionProtocol", str("GreetingProvider")},
-                                           {"PrincipalClass", str("Greeting")},
-                                           {"RZExtensionAttributes", Value::emptyDictionary()}})},
-    });
-    return BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+std::shared_ptr<BXDPlugIn> record(const std::string& name, const Uuid& uuid) {
+    return test::plugInRecord("com.example." + name, uuid);
 }
 
 // A server over private directories; its listener is bound but never resumed.
@@ -60,38 +40,26 @@ class BXDServerHoldTest : public ::testing::Test {
     std::unique_ptr<BXDServer> server_;
 };
 
-TEST_F(BXDServerHoldTest, NoHoldsHoldNothing) {
-    std::shared_ptr<BXDPlugIn> hello = record("hello", Uuid::random());
-    ASSERT_NE(hello, nullptr);
-    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
-    // An empty hold (an application without plug-ins) holds nothing either.
-    place({});
-    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
-}
-
-TEST_F(BXDServerHoldTest, HoldNamesPlugInsByUuidNotByRecord) {
+// A hold names plug-ins by UUID, so a record rebuilt for the same registry plug-in is held too; an empty hold (an
+// application without plug-ins) holds nothing, and a hold without a living client goes with the next release of
+// dead clients' holds.
+TEST_F(BXDServerHoldTest, HoldsNamePlugInsByUuidAndGoWithTheirClient) {
     Uuid helloUuid = Uuid::random();
     std::shared_ptr<BXDPlugIn> hello = record("hello", helloUuid);
     std::shared_ptr<BXDPlugIn> bonjour = record("bonjour", Uuid::random());
     std::shared_ptr<BXDPlugIn> night = record("night", Uuid::random());
     ASSERT_TRUE(hello && bonjour && night);
+    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+    place({});
+    EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+
     place({bonjour});
     place({night, hello});
     EXPECT_TRUE(server_->holdOnPlugIn(*hello)) << "found in a later hold";
     EXPECT_TRUE(server_->holdOnPlugIn(*bonjour));
-    // A record rebuilt for the same registry plug-in is the same plug-in.
-    std::shared_ptr<BXDPlugIn> rebuilt = record("hello", helloUuid);
-    ASSERT_NE(rebuilt, nullptr);
-    EXPECT_TRUE(server_->holdOnPlugIn(*rebuilt));
+    EXPECT_TRUE(server_->holdOnPlugIn(*record("hello", helloUuid)));
     EXPECT_FALSE(server_->holdOnPlugIn(*record("other", Uuid::random())));
-}
 
-TEST_F(BXDServerHoldTest, ReleasedHoldNoLongerCounts) {
-    std::shared_ptr<BXDPlugIn> hello = record("hello", Uuid::random());
-    ASSERT_NE(hello, nullptr);
-    place({hello});
-    ASSERT_TRUE(server_->holdOnPlugIn(*hello));
-    // A hold without a living client goes with the next release of dead clients' holds.
     server_->unholdClient(nullptr);
     EXPECT_FALSE(server_->holdOnPlugIn(*hello));
 }

@@ -14,6 +14,7 @@
 #include <sstream>
 #include <thread>
 
+#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
@@ -111,8 +112,12 @@ class TerminationTest : public ::testing::Test {
     std::unique_ptr<BXDServer> server_;
 };
 
-TEST_F(TerminationTest, RecordedInstancesAreTerminatedAndEveryReplyIsAwaited) {
+TEST_F(TerminationTest, RecordedInstancesAreTerminatedAndEveryReplyIsAwaitedEvenNone) {
     log::CaptureSink capture;
+    terminate({});
+    EXPECT_TRUE(capture.contains("waiting for 0 termination replies"));
+    EXPECT_TRUE(capture.contains("sending termination reply"));
+
     pid_t a = startSleeper();
     pid_t b = startSleeper(/*ignoreTerm=*/true);  // needs the SIGKILL after the grace period
     SleeperGuard guard{a, b};
@@ -133,13 +138,6 @@ TEST_F(TerminationTest, RecordedInstancesAreTerminatedAndEveryReplyIsAwaited) {
     EXPECT_TRUE(capture.contains("(3) jobard:3 "));
     // The records of the ended instances are gone.
     EXPECT_TRUE(instances().live("com.example.greeter.hello").empty());
-}
-
-TEST_F(TerminationTest, EmptyListRepliesAtOnce) {
-    log::CaptureSink capture;
-    terminate({});
-    EXPECT_TRUE(capture.contains("waiting for 0 termination replies"));
-    EXPECT_TRUE(capture.contains("sending termination reply"));
 }
 
 TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
@@ -178,20 +176,7 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
 
     // The plug-in record asks by its bundle identifier and describes the busy instance by it alone.
-    LXBexilProxy::Fields fields;
-    // A data plug-in on the system volume passes the record's checks without a container or an application.
-    fields.bundleURL = "/System/Library/PlugIns/Hello.bxplugin";
-    fields.isOnSystemPartition = true;
-    fields.pluginIdentifier = "com.example.greeter.hello";
-    fields.bundleIdentifier = "com.example.greeter.hello";
-    fields.pluginUUID = Uuid::random();
-    fields.infoVrec = Value::dictionary(
-        {{"BDBundleIdentifier", Value::string("com.example.greeter.hello")},
-         {"RZExtension", Value::dictionary({
-                             {"RZExtensionProtocol", Value::string("#Data")},
-                             {"RZExtensionAttributes", Value::dictionary({{"RZExtensionVersion", Value::string("1")}})},
-                         })}});
-    auto plugIn = BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+    auto plugIn = test::plugInRecord("com.example.greeter.hello", Uuid::random());
     ASSERT_NE(plugIn, nullptr);
     std::optional<Value> description = plugIn->checkBusy(wardend);
     ASSERT_TRUE(description);
