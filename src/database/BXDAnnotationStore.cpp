@@ -66,7 +66,7 @@ std::optional<Error> BXDAnnotationStore::loadDb(const std::filesystem::path& url
     if (!root.ok()) return fail(root.error());
     if (!root->isDictionary())
         return fail(Error(std::string(BXDocumentErrorDomain), kDocumentMalformed,
-                          url.string() + ": the root is a " + valueKindName(root->kind()) + ", not a dictionary"));
+                          url.string() + ": the root is of type " + valueKindName(root->kind()) + ", not a dictionary"));
 
     // A version that is not a number counts as absent, and absent counts as 0.
     int64_t version = root->get(kVersionKey).numberAsInt64().value_or(0);
@@ -81,7 +81,7 @@ std::optional<Error> BXDAnnotationStore::loadDb(const std::filesystem::path& url
     if (!data->isDictionary())
         return fail(
             Error(std::string(BXDocumentErrorDomain), kDocumentMalformed,
-                  url.string() + ": root[\"data\"] is a " + valueKindName(data->kind()) + ", not a dictionary"));
+                  url.string() + ": root[\"data\"] is of type " + valueKindName(data->kind()) + ", not a dictionary"));
     annotations_ = *data;
     return std::nullopt;
 }
@@ -113,7 +113,7 @@ Value BXDAnnotationStore::annotationForIdentifier(std::string_view key) const {
 
 void BXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, std::string_view key) {
     if (!annotation.isNull() && !annotation.isDictionary())
-        throw InternalInconsistency("annotation for \"" + std::string(key) + "\" is a " +
+        throw InternalInconsistency("annotation for \"" + std::string(key) + "\" is of type " +
                                     valueKindName(annotation.kind()) + ", not a dictionary");
 
     MutableDictionary map(annotations_);

@@ -88,9 +88,9 @@ TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTh
         {Document::write(dict({{"data", dict({})}})).value(), version + "0 needed version 16\""},
         {Document::write(dict({{"version", Value::string("16")}})).value(), version + "0 needed version 16\""},
         {good.substr(0, good.size() / 2), "Error Domain=BexilDocument"},
-        {"<vrec><array><integer>16</integer></array></vrec>", "the root is a array, not a dictionary"},
+        {"<vrec><array><integer>16</integer></array></vrec>", "the root is of type array, not a dictionary"},
         {Document::write(dict({{"version", integer(16)}, {"data", Value::string("x")}})).value(),
-         "root[\"data\"] is a string, not a dictionary"},
+         "root[\"data\"] is of type string, not a dictionary"},
     };
     for (const auto& [contents, expected] : cases) {
         SCOPED_TRACE(contents);
