@@ -26,9 +26,7 @@ namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using test::BxdProcess;
-using test::errorCode;
-using test::TestClient;
+using namespace test;
 
 constexpr int kRounds = 20;
 constexpr int kLongestRunMs = 150;
@@ -63,11 +61,8 @@ struct Writer {
                 std::lock_guard lock(mutex);
                 inFlight = change;
             }
-            TestClient::Reply reply = client.roundTrip(Value::dictionary({{"request", Value::string("annotate")},
-                                                                          {"version", Value::uint64(3)},
-                                                                          {"annotations", change},
-                                                                          {"uuids", Value::array({uuid})}}),
-                                                       std::chrono::seconds(5));
+            TestClient::Reply reply = client.roundTrip(
+                request("annotate", {{"annotations", change}, {"uuids", Value::array({uuid})}}), std::chrono::seconds(5));
             if (!std::holds_alternative<Value>(reply)) return;  // the daemon was killed
             std::lock_guard lock(mutex);
             if (errorCode(std::get<Value>(reply)) != 0) {
@@ -80,24 +75,17 @@ struct Writer {
     }
 };
 
-class AnnotationCrashTest : public ::testing::Test {
+class AnnotationCrashTest : public DaemonTest {
   protected:
     void SetUp() override {
-        bundles_ = test::copyExampleGreeter(bxd_.root());
-        bxd_.exportEnvironment();
+        copyExamples({"Greeter.app"});
         ASSERT_TRUE(start()) << bxd_.log();
-
-        TestClient client;
-        Value added = client.replyTo(Value::dictionary(
-            {{"request", Value::string("add")},
-             {"version", Value::uint64(3)},
-             {"paths", Value::array({Value::string((bundles_ / "Greeter.app/PlugIns/Hello.bxplugin").string()),
-                                     Value::string((bundles_ / "Greeter.app/PlugIns/Bonjour.bxplugin").string())})}}));
-        ASSERT_EQ(errorCode(added), 0) << added.description();
+        add({plugIn("Greeter.app/PlugIns/Hello.bxplugin"), plugIn("Greeter.app/PlugIns/Bonjour.bxplugin")});
         // Bonjour replaces the system clock, so its annotation is the clock's.
         writers_[0].identifier = writers_[0].annotationKey = "com.example.greeter.hello";
         writers_[1].identifier = "com.example.greeter.bonjour";
         writers_[1].annotationKey = "com.example.system.clock";
+        TestClient client;
         for (Writer& writer : writers_) {
             std::optional<Uuid> uuid = Uuid::parse(servedForm(client, writer.identifier).get("uuid").stringView());
             ASSERT_TRUE(uuid) << writer.identifier << " is not served";
@@ -105,14 +93,8 @@ class AnnotationCrashTest : public ::testing::Test {
         }
     }
 
-    bool start() { return bxd_.start({"-d", document().string()}); }
-    fs::path document() const { return bxd_.root() / "annotations.vrec"; }
-
     static Value servedForm(TestClient& client, const std::string& identifier) {
-        Value reply = client.replyTo(
-            Value::dictionary({{"request", Value::string("match")},
-                               {"version", Value::uint64(3)},
-                               {"rules", Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}})}}));
+        Value reply = client.replyTo(matchRequest(identifierRule(identifier)));
         for (const Value& form : reply.get("matches").items()) return form;
         return Value();
     }
@@ -157,8 +139,6 @@ class AnnotationCrashTest : public ::testing::Test {
         }
     }
 
-    BxdProcess bxd_;
-    fs::path bundles_;
     Writer writers_[2];
 };
 

@@ -1,49 +1,58 @@
 #pragma once
 
-// Shorthands the end-to-end tests share: the error fields of a reply, the example bundles in a test's own
-// directory, and what the daemon's registry holds.
+// What the end-to-end tests share: request builders, the error fields of a reply, the programs they run, and a
+// fixture with a private daemon, copies of the example bundles and the usual requests.
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 
 #include <algorithm>
 #include <cstdint>
+#include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "BxdProcess.h"
+#include "TestClient.h"
+#include "base/Document.h"
 #include "base/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 
 namespace bexil::test {
 
+inline const std::filesystem::path kExamples = std::filesystem::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
+inline constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
+inline constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
+
+inline std::filesystem::path toolBinary() { return std::filesystem::path(BEXIL_BINARY_DIR) / "tools/bexil/bexil"; }
+inline std::filesystem::path matchClientBinary() {
+    return std::filesystem::path(BEXIL_BINARY_DIR) / "tests/bx_match_client";
+}
+
 // A reply's error code, 0 when it has none.
 inline int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
 inline std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
-// Copies the example Greeter application into bundles/ under `root`; returns that directory, canonical.
-inline std::filesystem::path copyExampleGreeter(const std::filesystem::path& root) {
-    namespace fs = std::filesystem;
-    fs::path bundles = root / "bundles";
-    fs::create_directories(bundles);
-    fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles" / "Greeter.app", bundles / "Greeter.app",
-             fs::copy_options::recursive);
-    return fs::canonical(bundles);
+// A request of the current protocol version named `name`, with `fields` beside the envelope.
+inline Value request(std::string_view name, std::vector<std::pair<std::string, Value>> fields = {}) {
+    fields.emplace_back("request", Value::string(name));
+    fields.emplace_back("version", Value::uint64(3));
+    return Value::dictionary(std::move(fields));
 }
-
-// The UUID under which the registry in `stateDirectory` holds the bundle at `path`, read from its store.
-inline std::optional<Uuid> registeredUuid(const std::filesystem::path& stateDirectory, const std::string& path) {
-    LedgerixWorkspace::Options options;
-    options.stateDirectory = stateDirectory;
-    auto registry = LedgerixWorkspace::open(options);
-    if (!registry) {
-        ADD_FAILURE() << registry.error().description();
-        return std::nullopt;
-    }
-    auto proxy = (*registry)->pluginProxyForURL(path);
-    return proxy ? proxy->pluginUUID() : std::nullopt;
+inline Value strings(const std::vector<std::string>& texts) {
+    std::vector<Value> values;
+    for (const std::string& text : texts) values.push_back(Value::string(text));
+    return Value::array(std::move(values));
+}
+inline Value pathsRequest(std::string_view name, const std::vector<std::string>& paths) {
+    return request(name, {{"paths", strings(paths)}});
 }
 
 // A "match" request with the given rules (none: the key is absent) and flag word (0: the key is absent).
@@ -53,6 +62,9 @@ inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t fl
     if (rules) entries.emplace_back("rules", *rules);
     if (flags) entries.emplace_back("flags", Value::uint64(flags));
     return Value::dictionary(std::move(entries));
+}
+inline Value identifierRule(const std::string& identifier) {
+    return Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}});
 }
 
 using Ids = std::vector<std::string>;
@@ -64,5 +76,97 @@ inline Ids identifiers(const Value& reply) {
     std::sort(ids.begin(), ids.end());
     return ids;
 }
+// The forms of a discovery reply whose identifier is `identifier`.
+inline std::vector<Value> formsOf(const Value& reply, const std::string& identifier) {
+    std::vector<Value> forms;
+    for (const Value& form : reply.get("matches").items())
+        if (form.get("identifier").stringView() == identifier) forms.push_back(form);
+    return forms;
+}
+
+inline std::string slurp(const std::filesystem::path& path) {
+    std::ifstream in(path);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+struct Outcome {
+    int status = -1;
+    std::string out;
+    std::string err;
+};
+
+// A private daemon (not started yet) with its own preferences directory exported to this process, so the tool
+// and the daemon agree on it, plus the bundles, entitlements and requests most end-to-end tests need.
+class DaemonTest : public ::testing::Test {
+  protected:
+    DaemonTest() {
+        std::filesystem::create_directories(preferences());
+        setenv("BX_PREFERENCES_DIR", preferences().c_str(), 1);
+        bxd_.exportEnvironment();
+    }
+
+    std::filesystem::path preferences() const { return bxd_.root() / "preferences"; }
+    std::filesystem::path document() const { return bxd_.root() / "annotations.vrec"; }
+
+    // Copies the named example bundles into bundles/ under the daemon's root (made canonical).
+    void copyExamples(std::initializer_list<const char*> names) {
+        std::filesystem::create_directories(bxd_.root() / "bundles");
+        bundles_ = std::filesystem::canonical(bxd_.root() / "bundles");
+        for (const char* name : names)
+            std::filesystem::copy(kExamples / name, bundles_ / name, std::filesystem::copy_options::recursive);
+    }
+    std::string plugIn(const std::string& relative) const { return (bundles_ / relative).string(); }
+
+    bool start(std::vector<std::string> arguments = {}) {
+        arguments.insert(arguments.begin(), {"-d", document().string()});
+        return bxd_.start(arguments);
+    }
+
+    // Registers `paths` and expects success.
+    void add(const std::vector<std::string>& paths) {
+        TestClient client;
+        Value reply = client.replyTo(pathsRequest("add", paths));
+        ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    }
+
+    // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
+    std::optional<Uuid> registeredUuid(const std::string& path) const {
+        LedgerixWorkspace::Options options;
+        options.stateDirectory = bxd_.root() / "state";
+        auto registry = LedgerixWorkspace::open(options);
+        if (!registry) {
+            ADD_FAILURE() << registry.error().description();
+            return std::nullopt;
+        }
+        auto proxy = (*registry)->pluginProxyForURL(path);
+        return proxy ? proxy->pluginUUID() : std::nullopt;
+    }
+
+    // Gives `executable` entitlements through the daemon's trusted entitlements directory; they are read when a
+    // client connects.
+    void grant(const std::filesystem::path& executable, const Value& entitlements, const std::string& name = "self") {
+        std::filesystem::path file = bxd_.entitlementsDir() / (name + ".vrec");
+        ASSERT_FALSE(Document::writeFileAtomically(
+            file, Value::dictionary({{"Executable", Value::string(executable.string())}, {"Entitlements", entitlements}})));
+        ASSERT_EQ(chmod(file.c_str(), 0644), 0);
+    }
+    void grantSelf(const Value& entitlements) { grant(std::filesystem::canonical("/proc/self/exe"), entitlements); }
+    void grantSelfManager() { grantSelf(Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})); }
+
+    // Runs a shell command line with this process's environment; standard output and error are kept apart.
+    Outcome shell(const std::string& command) const {
+        std::filesystem::path out = bxd_.root() / "out.txt", err = bxd_.root() / "err.txt";
+        int raw = std::system((command + " >'" + out.string() + "' 2>'" + err.string() + "'").c_str());
+        return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
+    }
+    Outcome bexil(const std::string& arguments) const {
+        return shell("timeout 60 '" + toolBinary().string() + "' " + arguments);
+    }
+
+    BxdProcess bxd_;
+    std::filesystem::path bundles_;
+};
 
 }  // namespace bexil::test

@@ -4,18 +4,12 @@
 // paths, and shares the process ids with the test, so clients outside talk to it as to any daemon.
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 
-#include <algorithm>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
 #include <map>
 #include <memory>
 #include <set>
-#include <sstream>
 #include <thread>
 
 #include "BxdProcess.h"
@@ -27,106 +21,62 @@ namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using test::BxdProcess;
-using test::errorCode;
-using test::errorText;
-using test::identifiers;
-using test::Ids;
-using test::matchRequest;
-using test::TestClient;
+using namespace test;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
-constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
-constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 const std::string kClock = "com.example.system.clock";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kSystemClock = "/System/Library/PlugIns/Clock.bxplugin";
 
-Value str(std::string_view s) { return Value::string(s); }
-
 std::string quoted(const std::string& word) { return "'" + word + "'"; }
 
-class SystemPlugInTest : public ::testing::Test {
+class SystemPlugInTest : public DaemonTest {
   protected:
     void SetUp() override {
-        fs::path root = bxd_.root();
-        bundles_ = root / "bundles";
-        fs::create_directories(bundles_);
-        fs::copy(kExamples / "Greeter.app", bundles_ / "Greeter.app", fs::copy_options::recursive);
-        fs::copy(kExamples / "OutsideApplication.bxplugin", bundles_ / "OutsideApplication.bxplugin",
-                 fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
-
+        copyExamples({"Greeter.app", "OutsideApplication.bxplugin"});
         // What the daemon sees at /System and /SystemX.
-        system_ = fs::canonical(root) / "system";
-        fs::create_directories(system_ / "Library" / "PlugIns");
+        system_ = bundles_.parent_path() / "system";
+        fs::path systemX = bundles_.parent_path() / "systemx";
+        fs::create_directories(system_ / "Library/PlugIns");
+        fs::create_directories(systemX / "Library/PlugIns");
         fs::copy(kExamples / "System/Library/PlugIns/Clock.bxplugin", system_ / "Library/PlugIns/Clock.bxplugin",
                  fs::copy_options::recursive);
-        fs::path systemX = fs::canonical(root) / "systemx";
-        fs::create_directories(systemX / "Library" / "PlugIns");
         fs::copy(kExamples / "OutsideApplication.bxplugin", systemX / "Library/PlugIns/OutsideApplication.bxplugin",
                  fs::copy_options::recursive);
 
-        fs::path preferences = root / "preferences";
-        fs::create_directories(preferences);
-        setenv("BX_PREFERENCES_DIR", preferences.c_str(), 1);
-        bxd_.exportEnvironment();
-
         // Only the system's programs and libraries, this test's temporary root and the build tree, at their own
         // paths, plus the two directories that stand for /System and /SystemX.
-        std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc", "--dev", "/dev"};
-        auto with = [&launcher](std::initializer_list<std::string> words) { launcher.insert(launcher.end(), words); };
-        with({"--ro-bind", "/usr", "/usr"});
-        with({"--ro-bind", "/etc", "/etc"});
+        std::string root = bxd_.root().string();
+        std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc",
+                                             "--dev", "/dev", "--ro-bind", "/usr", "/usr", "--ro-bind", "/etc", "/etc",
+                                             "--bind", root, root, "--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR,
+                                             "--ro-bind", system_.string(), "/System", "--ro-bind", systemX.string(),
+                                             "/SystemX"};
         for (const char* directory : {"lib", "lib64", "bin", "sbin"})
-            with({"--symlink", std::string("usr/") + directory, std::string("/") + directory});
-        with({"--bind", root.string(), root.string()});
-        with({"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR});
-        with({"--ro-bind", system_.string(), "/System"});
-        with({"--ro-bind", systemX.string(), "/SystemX"});
+            launcher.insert(launcher.end(), {"--symlink", std::string("usr/") + directory, std::string("/") + directory});
         // Machines without user namespaces or mount rights cannot make the private root; say so instead of failing.
         std::string probe;
         for (const std::string& word : launcher) probe += quoted(word) + " ";
-        fs::path probeOutput = root / "bwrap-probe.txt";
-        int status = std::system((probe + "/usr/bin/test -d /System/Library/PlugIns/Clock.bxplugin >" +
-                                  quoted(probeOutput.string()) + " 2>&1")
-                                     .c_str());
-        if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-            std::ifstream in(probeOutput);
-            std::stringstream text;
-            text << in.rdbuf();
-            GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << text.str();
-        }
+        Outcome made = shell(probe + "/usr/bin/test -d /System/Library/PlugIns/Clock.bxplugin");
+        if (made.status != 0) GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << made.err;
         bxd_.setLauncher(std::move(launcher));
-        ASSERT_TRUE(
-            bxd_.start({"-d", (root / "annotations.vrec").string()}, {"BX_PREFERENCES_DIR=" + preferences.string()}))
-            << bxd_.log();
+        ASSERT_TRUE(start()) << bxd_.log();
         client_ = std::make_unique<TestClient>();
-    }
-
-    void add(const std::vector<std::string>& paths) {
-        std::vector<Value> values;
-        for (const std::string& path : paths) values.push_back(str(path));
-        Value reply = client_->replyTo(Value::dictionary(
-            {{"request", str("add")}, {"version", Value::uint64(3)}, {"paths", Value::array(std::move(values))}}));
-        ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
     }
 
     // The forms of every registered instance of the clock, keyed by path.
     std::map<std::string, Value> clockInstances() {
-        Value reply = client_->replyTo(matchRequest(clockRules(), kAllVersions | kAllInstances));
+        Value reply = client_->replyTo(matchRequest(identifierRule(kClock), kAllVersions | kAllInstances));
         std::map<std::string, Value> forms;
         for (const Value& form : reply.get("matches").items()) forms[std::string(form.get("path").stringView())] = form;
         return forms;
     }
     // The path of the one clock a client gets without flags.
     std::string servedClock() {
-        Value reply = client_->replyTo(matchRequest(clockRules(), 0));
+        Value reply = client_->replyTo(matchRequest(identifierRule(kClock)));
         EXPECT_EQ(reply.get("matches").count(), 1u) << reply.description();
         return reply.get("matches").count() ? std::string(reply.get("matches").items()[0].get("path").stringView())
                                             : std::string();
     }
-    static Value clockRules() { return Value::dictionary({{"RZExtensionIdentifier", str(kClock)}}); }
 
     // Changes the bundle's information document, so that adding it again registers it anew (a new registration
     // time, and a place after every plug-in registered before).
@@ -154,19 +104,18 @@ class SystemPlugInTest : public ::testing::Test {
         FAIL() << "could not register the clocks within one second";
     }
 
-    BxdProcess bxd_;
     std::unique_ptr<TestClient> client_;
-    fs::path bundles_;
     fs::path system_;
     int builds_ = 0;
 };
 
+// Guards residence: outside applications only plug-ins whose real path is below /System are served (not one below
+// /SystemX, nor a link planted in /System that leads out of it), marked system-resident and auto-elected; the
+// system-only flag keeps just them, and privileged discovery ignores that flag without bringing pretenders back.
 TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplications) {
-    // A link planted in /System that leads out of it does not make a system plug-in: residence is decided on the
-    // bundle's real path.
     fs::create_directory_symlink(bundles_ / "OutsideApplication.bxplugin",
                                  system_ / "Library/PlugIns/Planted.bxplugin");
-    std::string hello = (bundles_ / "Greeter.app/PlugIns/Hello.bxplugin").string();
+    std::string hello = plugIn("Greeter.app/PlugIns/Hello.bxplugin");
     add({kSystemClock, hello, "/SystemX/Library/PlugIns/OutsideApplication.bxplugin",
          "/System/Library/PlugIns/Planted.bxplugin"});
 
@@ -184,15 +133,9 @@ TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplication
     }
     EXPECT_EQ(identifiers(client_->replyTo(matchRequest(std::nullopt, kSystemOnly))), (Ids{kClock}));
     // The greeting rule matches the system plug-in and the application's; system only keeps the first.
-    Value greeting = Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")}});
+    Value greeting = Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.greeting")}});
     EXPECT_EQ(identifiers(client_->replyTo(matchRequest(greeting, kSystemOnly))), (Ids{kClock}));
-    // Privileged discovery ignores the system-only flag, but does not bring the pretenders back.
-    fs::path grant = bxd_.entitlementsDir() / "system-test.vrec";
-    ASSERT_FALSE(Document::writeFileAtomically(
-        grant,
-        Value::dictionary({{"Executable", str(fs::canonical("/proc/self/exe").string())},
-                           {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
-    ASSERT_EQ(chmod(grant.c_str(), 0644), 0);
+    grantSelfManager();
     TestClient manager;  // entitlements are read when a client connects
     Value privileged = manager.replyTo(matchRequest(std::nullopt, kSystemOnly | kDiscoverAll));
     EXPECT_EQ(errorCode(privileged), 0) << errorText(privileged) << "\n" << bxd_.log();
@@ -206,6 +149,8 @@ TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplication
             << bxd_.log();
 }
 
+// Guards the tie between equal versions of a system plug-in and an application's copy: within one registration
+// second the system's wins whichever was met first; a later registration of the application's wins.
 TEST_F(SystemPlugInTest, SameVersionGoesToTheSystemPlugInUnlessTheApplicationsIsRegisteredLater) {
     // The application's copy of the clock: same identifier, same version.
     fs::path appClock = bundles_ / "Greeter.app/PlugIns/Clock.bxplugin";

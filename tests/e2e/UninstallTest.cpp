@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/prctl.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -23,12 +22,8 @@ namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using test::BxdProcess;
-using test::errorCode;
-using test::errorText;
-using test::TestClient;
+using namespace test;
 
-constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kBonjour = "com.example.greeter.bonjour";
 
@@ -59,23 +54,14 @@ int endingSignal(pid_t pid, std::chrono::milliseconds timeout) {
     return -1;
 }
 
-class UninstallTest : public ::testing::Test {
+class UninstallTest : public DaemonTest {
   protected:
     void SetUp() override {
-        bundles_ = test::copyExampleGreeter(bxd_.root());
-        bxd_.exportEnvironment();
-
-        // This test program is the manager, through the daemon's trusted entitlements directory.
-        fs::path file = bxd_.entitlementsDir() / "uninstall-test.vrec";
-        ASSERT_FALSE(Document::writeFileAtomically(
-            file,
-            Value::dictionary({{"Executable", Value::string(fs::canonical("/proc/self/exe").string())},
-                               {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
-        ASSERT_EQ(chmod(file.c_str(), 0644), 0);
-
-        ASSERT_TRUE(bxd_.start({"-d", (bxd_.root() / "annotations.vrec").string()})) << bxd_.log();
+        copyExamples({"Greeter.app"});
+        grantSelfManager();
+        ASSERT_TRUE(start()) << bxd_.log();
         client_ = std::make_unique<TestClient>();
-        ASSERT_EQ(errorCode(request("add", {hello(), bonjour()})), 0) << bxd_.log();
+        request("add", {hello(), bonjour()});
     }
     void TearDown() override {
         for (pid_t pid : instances_) {
@@ -84,14 +70,9 @@ class UninstallTest : public ::testing::Test {
         }
     }
 
-    Value request(const char* name, const std::vector<std::string>& paths) {
-        std::vector<Value> values;
-        for (const std::string& path : paths) values.push_back(Value::string(path));
-        Value reply = client_->replyTo(Value::dictionary({{"request", Value::string(name)},
-                                                          {"version", Value::uint64(3)},
-                                                          {"paths", Value::array(std::move(values))}}));
-        EXPECT_EQ(errorCode(reply), 0) << name << ": " << errorText(reply);
-        return reply;
+    void request(const char* name, const std::vector<std::string>& paths) {
+        Value reply = client_->replyTo(pathsRequest(name, paths));
+        EXPECT_EQ(errorCode(reply), 0) << name << ": " << errorText(reply) << bxd_.log();
     }
 
     // Starts an instance of the plug-in with `bundleIdentifier` and records it as its runtime would.
@@ -115,21 +96,16 @@ class UninstallTest : public ::testing::Test {
 
     // The UUID of the served plug-in with `identifier`.
     std::string uuidOf(const std::string& identifier) {
-        Value reply = client_->replyTo(
-            Value::dictionary({{"request", Value::string("match")},
-                               {"version", Value::uint64(3)},
-                               {"rules", Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}})}}));
+        Value reply = client_->replyTo(matchRequest(identifierRule(identifier)));
         for (const Value& form : reply.get("matches").items()) return std::string(form.get("uuid").stringView());
         ADD_FAILURE() << "no plug-in " << identifier << " served: " << reply.description();
         return {};
     }
 
-    std::string hello() const { return (bundles_ / "Greeter.app/PlugIns/Hello.bxplugin").string(); }
-    std::string bonjour() const { return (bundles_ / "Greeter.app/PlugIns/Bonjour.bxplugin").string(); }
+    std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
+    std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
 
-    BxdProcess bxd_;
     std::unique_ptr<TestClient> client_;
-    fs::path bundles_;
     RunningInstances running_{"instances", bxd_.root() / "runtime"};
     std::vector<pid_t> instances_;
 };
