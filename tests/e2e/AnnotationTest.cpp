@@ -1,6 +1,7 @@
 // Changing plug-in annotations through the real daemon: "annotate" and "bulk-annotate" as a client sees them, the
 // annotation document the daemon writes, the change notification it posts, and the bexil tool's annotation
-// subcommands end to end. (Observing a post from another process: SystemNotificationsTest.)
+// subcommands end to end. (Observing a post from another process: SystemNotificationsTest; loading the document
+// at start: AnnotationCrashTest, whose restarted daemon must serve what the document holds.)
 
 #include <gtest/gtest.h>
 
@@ -42,11 +43,9 @@ class AnnotationTest : public DaemonTest {
         ASSERT_TRUE(start()) << bxd_.log();
         client_ = std::make_unique<TestClient>();
         add({plugIn("Greeter.app/PlugIns/Hello.bxplugin"), plugIn("Greeter.app/PlugIns/Bonjour.bxplugin")});
-        std::optional<Uuid> hello = registeredUuid(plugIn("Greeter.app/PlugIns/Hello.bxplugin"));
-        std::optional<Uuid> bonjour = registeredUuid(plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"));
-        ASSERT_TRUE(hello && bonjour);
-        hello_ = *hello;
-        bonjour_ = *bonjour;
+        hello_ = registeredUuid(plugIn("Greeter.app/PlugIns/Hello.bxplugin")).value_or(Uuid());
+        bonjour_ = registeredUuid(plugIn("Greeter.app/PlugIns/Bonjour.bxplugin")).value_or(Uuid());
+        ASSERT_FALSE(hello_.isNil() || bonjour_.isNil());
     }
 
     // The annotation stored under `key` in the document on disk (null when there is none).
@@ -59,11 +58,6 @@ class AnnotationTest : public DaemonTest {
     // How often the change notification was posted, read from its counter file as any process can.
     uint64_t notifications() const {
         return SystemNotifications(bxd_.root() / "runtime" / "notify").state("com.quorvel.bexil.annotation-change");
-    }
-    void expectFailure(const Value& message, int64_t code, const std::string& text) {
-        Value reply = client_->replyTo(message);
-        EXPECT_EQ(errorCode(reply), code) << text;
-        EXPECT_EQ(errorText(reply), text);
     }
 
     std::unique_ptr<TestClient> client_;
@@ -187,18 +181,6 @@ TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
     EXPECT_NE(errorText(reply).find("exceeds the frame limit"), std::string::npos) << errorText(reply);
     EXPECT_TRUE(bxd_.waitForLog("exceeds the frame limit of")) << bxd_.log();
     EXPECT_EQ(errorCode(client_->replyTo(matchRequest(identifierRule("none")))), 0);
-}
-
-// Guards loading at start: had the restarted daemon not loaded the document, the election written before the
-// restart would be gone from the document it saves after a bulk change.
-TEST_F(AnnotationTest, AnnotationsSurviveARestart) {
-    ASSERT_EQ(errorCode(client_->replyTo(annotateRequest(election(2), {hello_}))), 0);
-    bxd_.stop();
-    ASSERT_TRUE(start()) << bxd_.log();
-    Value replacement = Value::dictionary({{"colour", Value::string("violet")}});
-    Value reply = TestClient().replyTo(bulkRequest(Value::dictionary({{hello_.string(), replacement}})));
-    ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_EQ(stored(kHelloKey), Value::dictionary({{"election", Value::int64(2)}, {"extension", replacement}}));
 }
 
 // Guards the tool's annotation subcommands against the real daemon: elect, annotate with a JSON file, unelect,

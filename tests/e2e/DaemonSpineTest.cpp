@@ -10,6 +10,7 @@
 #include <array>
 #include <cstring>
 #include <thread>
+#include <utility>
 
 #include "BxdProcess.h"
 #include "E2eSupport.h"
@@ -38,27 +39,25 @@ const Value kBogus = test::request("bogus");
 class RawSocket {
   public:
     explicit RawSocket(const std::string& path) : fd_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
+        sockaddr_un addr{AF_UNIX, {}};
         strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
         EXPECT_EQ(connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0) << strerror(errno);
     }
     ~RawSocket() { closeNow(); }
     void write(const std::vector<uint8_t>& bytes) { (void)!::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL); }
     void closeNow() {
-        if (fd_ >= 0) ::close(fd_);
-        fd_ = -1;
+        if (fd_ >= 0) ::close(std::exchange(fd_, -1));
     }
-    // True when the daemon closed the connection (read returns 0 or an error) within five seconds.
+    // True when the daemon closed the connection (a read gives 0 or an error other than the time limit) in 5 s.
     bool closedByPeer() {
         timeval tv{5, 0};
         setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
         char buf[4096];
-        for (;;) {
-            ssize_t n = ::recv(fd_, buf, sizeof buf, 0);
-            if (n == 0) return true;
-            if (n < 0) return errno != EAGAIN && errno != EWOULDBLOCK;
-        }
+        ssize_t n = 0;
+        do {
+            n = ::recv(fd_, buf, sizeof buf, 0);
+        } while (n > 0);
+        return n == 0 || (errno != EAGAIN && errno != EWOULDBLOCK);
     }
 
   private:
@@ -101,15 +100,22 @@ TEST(BxdOptions, UsageErrorsExitWithStatus2BeforeBuildingAnything) {
     }
 }
 
-// Guards option handling that reaches the server: each -v is reported, the last -c wins and is taken unvalidated
-// (a negative number wraps), and -S names the socket.
-TEST(BxdOptions, VerboseCacheLimitAndServiceNameReachTheServer) {
+// Guards option handling that reaches the server (each -v is reported, the last -c wins and is taken unvalidated so
+// a negative number wraps, -S names the socket) and the end of the real process: SIGTERM tells the clients and the
+// daemon exits instead of dying by the signal.
+TEST(BxdOptions, OptionsReachTheServerAndSigtermEndsIt) {
     BxdProcess bxd;
     ASSERT_TRUE(bxd.start({"-v", "-v", "-c", "5", "-c", "-1", "-S", "com.example.private"})) << bxd.log();
     EXPECT_EQ(bxd.countInLog("verbose option -v is ineffective; use log config --subsystem com.quorvel.bexil"), 2u);
     EXPECT_NE(bxd.log().find("bxd is launching"), std::string::npos);
     EXPECT_TRUE(bxd.waitForLog("service com.example.private, cache limit 4294967295,")) << bxd.log();
-    EXPECT_TRUE(std::filesystem::exists(bxd.socketPath("com.example.private")));
+
+    bxd.exportEnvironment();
+    TestClient client("com.example.private");
+    EXPECT_EQ(errorCode(client.replyTo(kBogus)), 4);
+    int status = bxd.stop(SIGTERM);
+    EXPECT_TRUE(WIFEXITED(status)) << status;
+    EXPECT_TRUE(bxd.waitForLog("termination imminent")) << bxd.log();
 }
 
 // ---- service ownership ----
@@ -252,18 +258,6 @@ TEST_F(BxdEnvelope, ClientsThatDieOrNeverReadDoNotHoldUpOthers) {
     lazy.closeNow();
     writer.join();
     EXPECT_TRUE(bxd_->running());
-}
-
-// Guards the SIGTERM path of the real process: it tells its clients and exits instead of dying by the signal.
-TEST(BxdTermination, SigtermTellsClientsAndEndsTheDaemon) {
-    BxdProcess bxd;
-    ASSERT_TRUE(bxd.start()) << bxd.log();
-    bxd.exportEnvironment();
-    TestClient client;
-    client.replyTo(kBogus);
-    int status = bxd.stop(SIGTERM);
-    EXPECT_TRUE(WIFEXITED(status)) << status;
-    EXPECT_TRUE(bxd.waitForLog("termination imminent")) << bxd.log();
 }
 
 }  // namespace

@@ -120,8 +120,8 @@ TEST_F(DiscoveryTest, DiscoverAllNeedsTheManagerEntitlementAndNoSandboxAndSkipsH
     EXPECT_EQ(all.size(), 5u);
     EXPECT_EQ(std::count(all.begin(), all.end(), kNightTheme), 1);
 
-    grant(matchClientBinary(), Value::dictionary({{kManagerEntitlement, Value::boolean(true)}}), "match-client");
-    Outcome sandboxed = shell("unshare --user '" + matchClientBinary().string() + "' 0x200");
+    grant(kMatchClient, Value::dictionary({{kManagerEntitlement, Value::boolean(true)}}), "match-client");
+    Outcome sandboxed = shell("unshare --user '" + kMatchClient.string() + "' 0x200");
     EXPECT_EQ(sandboxed.status, 1) << sandboxed.out << sandboxed.err;
     EXPECT_EQ(sandboxed.out, "error 11: unauthorized discovery flag (BXDiscoverAll)\n");
 }
@@ -132,7 +132,7 @@ TEST_F(DiscoveryTest, ClientInsideAnApplicationSeesThePlugInDedicatedToIt) {
     startWithExamples();
     fs::path inside = bundles_ / "Greeter.app" / "greeter";
     fs::remove(inside);
-    fs::copy_file(matchClientBinary(), inside);
+    fs::copy_file(kMatchClient, inside);
     fs::permissions(inside, fs::perms::owner_all);
     Outcome own = shell("'" + inside.string() + "'");
     EXPECT_EQ(own.status, 0) << own.err;

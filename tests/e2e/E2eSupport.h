@@ -8,14 +8,11 @@
 #include <sys/wait.h>
 
 #include <algorithm>
-#include <cstdint>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <optional>
 #include <sstream>
 #include <string>
-#include <utility>
 #include <vector>
 
 #include "BxdProcess.h"
@@ -31,10 +28,7 @@ inline const std::filesystem::path kExamples = std::filesystem::path(BEXIL_SOURC
 inline constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 inline constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
 
-inline std::filesystem::path toolBinary() { return std::filesystem::path(BEXIL_BINARY_DIR) / "tools/bexil/bexil"; }
-inline std::filesystem::path matchClientBinary() {
-    return std::filesystem::path(BEXIL_BINARY_DIR) / "tests/bx_match_client";
-}
+inline const std::filesystem::path kMatchClient = std::filesystem::path(BEXIL_BINARY_DIR) / "tests/bx_match_client";
 
 // A reply's error code, 0 when it has none.
 inline int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
@@ -46,13 +40,10 @@ inline Value request(std::string_view name, std::vector<std::pair<std::string, V
     fields.emplace_back("version", Value::uint64(3));
     return Value::dictionary(std::move(fields));
 }
-inline Value strings(const std::vector<std::string>& texts) {
-    std::vector<Value> values;
-    for (const std::string& text : texts) values.push_back(Value::string(text));
-    return Value::array(std::move(values));
-}
 inline Value pathsRequest(std::string_view name, const std::vector<std::string>& paths) {
-    return request(name, {{"paths", strings(paths)}});
+    std::vector<Value> values;
+    for (const std::string& path : paths) values.push_back(Value::string(path));
+    return request(name, {{"paths", Value::array(std::move(values))}});
 }
 
 // A "match" request with the given rules (none: the key is absent) and flag word (0: the key is absent).
@@ -93,8 +84,7 @@ inline std::string slurp(const std::filesystem::path& path) {
 
 struct Outcome {
     int status = -1;
-    std::string out;
-    std::string err;
+    std::string out, err;
 };
 
 // A private daemon (not started yet) with its own preferences directory exported to this process, so the tool
@@ -126,9 +116,15 @@ class DaemonTest : public ::testing::Test {
 
     // Registers `paths` and expects success.
     void add(const std::vector<std::string>& paths) {
-        TestClient client;
-        Value reply = client.replyTo(pathsRequest("add", paths));
+        Value reply = TestClient().replyTo(pathsRequest("add", paths));
         ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    }
+
+    // Sends `message` on a new connection and expects the failure `code` with `text`.
+    void expectFailure(const Value& message, int64_t code, const std::string& text) {
+        Value reply = TestClient().replyTo(message);
+        EXPECT_EQ(errorCode(reply), code) << text;
+        EXPECT_EQ(errorText(reply), text);
     }
 
     // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
@@ -162,7 +158,7 @@ class DaemonTest : public ::testing::Test {
         return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
     }
     Outcome bexil(const std::string& arguments) const {
-        return shell("timeout 60 '" + toolBinary().string() + "' " + arguments);
+        return shell("timeout 60 '" BEXIL_BINARY_DIR "/tools/bexil/bexil' " + arguments);
     }
 
     BxdProcess bxd_;

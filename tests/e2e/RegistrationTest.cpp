@@ -24,11 +24,6 @@ class RegistrationTest : public DaemonTest {
     }
     std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
     std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
-    void expectFailure(const Value& message, int64_t code, const std::string& text) {
-        Value reply = TestClient().replyTo(message);
-        EXPECT_EQ(errorCode(reply), code) << text;
-        EXPECT_EQ(errorText(reply), text);
-    }
 };
 
 // Guards "add": an empty list succeeds with nothing registered; the plug-ins of an application and one outside any
