@@ -1,4 +1,5 @@
-// The daemon as a client sees it: options and exit statuses, the request envelope, and peers that misbehave.
+// The daemon as a client sees it: options and exit statuses, owning and being activated on its service socket, the
+// request envelope, and peers that misbehave.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -8,13 +9,13 @@
 #include <unistd.h>
 
 #include <array>
+#include <cstdlib>
 #include <cstring>
 #include <thread>
 #include <utility>
 
 #include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "TestClient.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 
@@ -143,6 +144,34 @@ TEST(BxdService, ASecondDaemonOnTheSameNameFailsAndAStaleSocketIsReplaced) {
     EXPECT_TRUE(served);
     kill(third, SIGKILL);
     waitpid(third, nullptr, 0);
+}
+
+// Guards socket activation: the socket exists before the daemon, and the first connection starts bxd on the socket
+// it is passed.
+TEST(BxdService, FirstConnectionStartsBxdOnTheActivatedSocket) {
+    if (access("/usr/bin/systemd-socket-activate", X_OK) != 0) GTEST_SKIP() << "systemd-socket-activate not installed";
+    BxdProcess environment;  // private directories only; bxd is started by the activator
+    environment.exportEnvironment();
+    std::string socketPath = environment.socketPath(), log = (environment.root() / "activated.log").string();
+    pid_t activator = fork();
+    if (activator == 0) {
+        dup2(open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644), STDERR_FILENO);
+        std::string listen = "--listen=" + socketPath;
+        execl("/usr/bin/systemd-socket-activate", "systemd-socket-activate", listen.c_str(),
+              "--fdname=com.quorvel.bexil.bxd", "-E", "BX_LOG_SINK", "-E", "BX_SERVICE_DIR", "-E", "BXD_LOG_LEVEL",
+              BxdProcess::binary().c_str(), nullptr);
+        _exit(127);
+    }
+    for (int i = 0; i < 500 && !std::filesystem::exists(socketPath); ++i)
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    ASSERT_TRUE(std::filesystem::exists(socketPath));
+    int status = std::system(BEXIL_BINARY_DIR "/tests/bx_zem_ping bogus >/dev/null");
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    kill(activator, SIGTERM);
+    waitpid(activator, nullptr, 0);
+    EXPECT_NE(test::slurp(log).find("listening on service com.quorvel.bexil.bxd (socket passed by systemd)"),
+              std::string::npos)
+        << test::slurp(log);
 }
 
 // ---- the request envelope (one daemon for the suite) ----

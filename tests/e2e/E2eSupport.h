@@ -1,6 +1,6 @@
 #pragma once
 
-// What the end-to-end tests share: request builders, the error fields of a reply, the programs they run, and a
+// What the end-to-end tests share: a client connection, request builders, the error fields of a reply, and a
 // fixture with a private daemon, copies of the example bundles and the usual requests.
 
 #include <gtest/gtest.h>
@@ -8,21 +8,60 @@
 #include <sys/wait.h>
 
 #include <algorithm>
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <future>
+#include <memory>
 #include <optional>
 #include <sstream>
 #include <string>
+#include <variant>
 #include <vector>
 
 #include "BxdProcess.h"
-#include "TestClient.h"
 #include "base/Document.h"
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
 #include "base/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
+#include "platform/zem/ZemConnection.h"
 
 namespace bexil::test {
+
+// A client connection with its own loop and queue, and a blocking round trip with a time limit.
+class TestClient {
+  public:
+    using Reply = std::variant<Value, ZemError>;
+
+    explicit TestClient(const std::string& service = "com.quorvel.bexil.bxd")
+        : loop_(1), queue_("test-client", loop_), connection_(ZemConnection::createClient(service, queue_)) {
+        connection_->setEventHandler([](const ZemConnection::Event&) {});
+        connection_->resume();
+    }
+    ~TestClient() { connection_->cancel(); }
+
+    // The reply, or the connection error in its place (ConnectionInvalid when none came within `timeout`).
+    Reply roundTrip(const Value& message, std::chrono::seconds timeout = std::chrono::seconds(10)) {
+        auto promise = std::make_shared<std::promise<Reply>>();
+        auto future = promise->get_future();
+        connection_->sendWithReply(message, queue_, [promise](const Reply& reply) { promise->set_value(reply); });
+        if (future.wait_for(timeout) != std::future_status::ready) return ZemError(ZemError::Kind::ConnectionInvalid);
+        return future.get();
+    }
+    // The reply dictionary; a connection error fails the test and gives a null Value.
+    Value replyTo(const Value& message) {
+        Reply reply = roundTrip(message);
+        EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
+        return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
+    }
+
+  private:
+    EventLoop loop_;
+    SerialQueue queue_;
+    std::shared_ptr<ZemConnection> connection_;
+};
 
 inline const std::filesystem::path kExamples = std::filesystem::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 inline constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";

@@ -1,14 +1,22 @@
 // Registering and unregistering plug-in bundles through the real daemon: "add", "remove", "bulk" as a client sees
-// them, checked against the registry the daemon keeps in its state directory. How the registry treats path forms,
-// re-registration, bad bundles and bundles gone from disk is LedgerixTest's.
+// them, checked against the registry the daemon keeps in its state directory, and the running instances of a
+// removed plug-in ended: real child processes of this test, recorded under the runtime directory the way plug-in
+// runtimes record them. How the registry treats path forms, re-registration (a changed build is announced as an
+// uninstall, which takes the same path as "remove"), bad bundles and bundles gone from disk is LedgerixTest's.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include <csignal>
 #include <filesystem>
+#include <thread>
 
 #include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "TestClient.h"
+#include "platform/jobard/RunningInstances.h"
 
 namespace bexil {
 namespace {
@@ -16,14 +24,66 @@ namespace {
 namespace fs = std::filesystem;
 using namespace test;
 
+const std::string kHello = "com.example.greeter.hello";
+const std::string kBonjour = "com.example.greeter.bonjour";
+
+// A stand-in for a running plug-in: a child that sleeps until it is signalled, lets go of the test's output and
+// dies with the test however the test ends.
+pid_t startInstance() {
+    pid_t parent = getpid();
+    pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (getppid() != parent) _exit(0);
+        int devnull = open("/dev/null", O_RDWR);
+        dup2(devnull, STDOUT_FILENO);
+        dup2(devnull, STDERR_FILENO);
+        for (;;) pause();
+    }
+    return child;
+}
+
 class RegistrationTest : public DaemonTest {
   protected:
     void SetUp() override {
         copyExamples({"Greeter.app", "OutsideApplication.bxplugin"});
         ASSERT_TRUE(start()) << bxd_.log();
     }
+    void TearDown() override {
+        for (pid_t pid : instances_) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+    }
     std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
     std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
+
+    // Starts an instance of the plug-in with `bundleIdentifier` and records it as its runtime would.
+    pid_t run(const std::string& bundleIdentifier) {
+        pid_t pid = startInstance();
+        instances_.push_back(pid);
+        EXPECT_TRUE(running_.record(bundleIdentifier, pid));
+        return pid;
+    }
+    bool recorded(const std::string& bundleIdentifier, pid_t pid) const {
+        return fs::exists(running_.directory() / bundleIdentifier / std::to_string(pid));
+    }
+    // The signal that ended `pid` (reaped), 0 when it exited otherwise, or -1 while it still runs after `timeout`.
+    int endingSignal(pid_t pid, std::chrono::milliseconds timeout) {
+        auto deadline = std::chrono::steady_clock::now() + timeout;
+        do {
+            int status = 0;
+            if (waitpid(pid, &status, WNOHANG) == pid) {
+                std::erase(instances_, pid);
+                return WIFSIGNALED(status) ? WTERMSIG(status) : 0;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        } while (std::chrono::steady_clock::now() < deadline);
+        return -1;
+    }
+
+    RunningInstances running_{"instances", bxd_.root() / "runtime"};
+    std::vector<pid_t> instances_;
 };
 
 // Guards "add": an empty list succeeds with nothing registered; the plug-ins of an application and one outside any
@@ -78,20 +138,33 @@ TEST_F(RegistrationTest, RemoveNeedsTheManagerEntitlement) {
 }
 
 // Guards an entitled "remove" against a restarted daemon: it knows the bundles registered before, unregisters and
-// announces them, and reports a path it does not know.
-TEST_F(RegistrationTest, EntitledRemoveWorksAcrossARestart) {
+// announces the plug-in, asks the service manager (by the plug-in's version) to end its instances, which get
+// SIGTERM (no SIGKILL needed) and lose their records while another plug-in's instance runs on, and reports a path
+// it does not know.
+TEST_F(RegistrationTest, EntitledRemoveWorksAcrossARestartAndEndsThePlugInsInstances) {
     grantSelfManager();
     add({hello(), bonjour()});
     bxd_.stop();
     ASSERT_TRUE(start()) << bxd_.log();
+    std::string helloUuid = registeredUuid(hello()).value_or(Uuid()).string();
+    pid_t first = run(kHello), second = run(kHello), other = run(kBonjour);
 
-    TestClient client;
-    Value reply = client.replyTo(pathsRequest("remove", {hello()}));
+    Value reply = TestClient().replyTo(pathsRequest("remove", {hello()}));
     EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << bxd_.log();
     EXPECT_FALSE(registeredUuid(hello()));
     EXPECT_TRUE(registeredUuid(bonjour()));
-    EXPECT_TRUE(bxd_.waitForLog("plug-in UNINSTALLED:com.example.greeter.hello")) << bxd_.log();
-    EXPECT_TRUE(bxd_.waitForLog("removal complete for")) << bxd_.log();
+    EXPECT_EQ(endingSignal(first, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
+    EXPECT_EQ(endingSignal(second, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
+    EXPECT_FALSE(recorded(kHello, first) || recorded(kHello, second));
+    const std::string lines[] = {"plug-in UNINSTALLED:" + kHello,
+                                 "requesting termination for " + kHello + "(1) jobard:1 " + helloUuid,
+                                 "one or more plug-ins have been terminated for uuid=" + helloUuid,
+                                 "removal complete for"};
+    for (const std::string& line : lines) EXPECT_TRUE(bxd_.waitForLog(line)) << line << "\n" << bxd_.log();
+    EXPECT_EQ(endingSignal(other, std::chrono::milliseconds(0)), -1);
+    EXPECT_TRUE(recorded(kBonjour, other));
+    EXPECT_EQ(bxd_.countInLog("requesting termination for " + kBonjour), 0u) << bxd_.log();
+
     expectFailure(pathsRequest("remove", {hello()}), 9, "no plugin at " + hello());
 }
 

@@ -14,7 +14,6 @@
 
 #include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "TestClient.h"
 #include "base/Document.h"
 
 namespace bexil {
