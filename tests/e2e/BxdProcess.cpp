@@ -9,7 +9,7 @@
 #include <csignal>
 #include <cstring>
 #include <fstream>
-#include <sstream>
+#include <iterator>
 #include <thread>
 
 extern char** environ;
@@ -55,7 +55,7 @@ void BxdProcess::exportEnvironment() const {
     }
 }
 
-pid_t BxdProcess::spawn(const std::vector<std::string>& arguments, const std::vector<std::string>& environment) {
+pid_t BxdProcess::spawn(const std::vector<std::string>& arguments) {
     std::vector<std::string> env;
     // A later entry replaces an earlier one of the same name. Programs read the first of two, and this process's
     // own environment may still name an earlier test's directories (exportEnvironment() leaves them behind).
@@ -66,7 +66,6 @@ pid_t BxdProcess::spawn(const std::vector<std::string>& arguments, const std::ve
     };
     for (char** e = environ; *e; ++e) env.emplace_back(*e);
     for (const auto& e : baseEnvironment()) put(e);
-    for (const auto& e : environment) put(e);
     std::vector<std::string> args = launcher_;
     args.push_back(binary().string());
     args.insert(args.end(), arguments.begin(), arguments.end());
@@ -97,13 +96,12 @@ static bool canConnect(const std::string& path) {
     return ok;
 }
 
-bool BxdProcess::start(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
-                       std::chrono::milliseconds timeout) {
+bool BxdProcess::start(const std::vector<std::string>& arguments) {
     std::string service = "com.quorvel.bexil.bxd";
     for (size_t i = 0; i + 1 < arguments.size(); ++i)
         if (arguments[i] == "-S") service = arguments[i + 1];
-    pid_ = spawn(arguments, environment);
-    auto deadline = std::chrono::steady_clock::now() + timeout;
+    pid_ = spawn(arguments);
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
     while (std::chrono::steady_clock::now() < deadline) {
         if (!running()) return false;
         if (waitForLog("listening on service", std::chrono::milliseconds(1)) && canConnect(socketPath(service)))
@@ -114,7 +112,7 @@ bool BxdProcess::start(const std::vector<std::string>& arguments, const std::vec
 }
 
 int BxdProcess::runToExit(const std::vector<std::string>& arguments) {
-    pid_t child = spawn(arguments, {});
+    pid_t child = spawn(arguments);
     int status = 0;
     waitpid(child, &status, 0);
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
@@ -136,9 +134,7 @@ bool BxdProcess::running() const {
 
 std::string BxdProcess::log() const {
     std::ifstream in(logFile_);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
+    return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 size_t BxdProcess::countInLog(const std::string& text) const {

@@ -19,20 +19,18 @@ class BxdProcess {
     BxdProcess();
     ~BxdProcess();
 
-    // Starts bxd with `arguments` and waits until its socket accepts connections (or the process exits).
-    // Returns false when it did not come up within `timeout`.
-    bool start(const std::vector<std::string>& arguments = {}, const std::vector<std::string>& environment = {},
-               std::chrono::milliseconds timeout = std::chrono::seconds(10));
+    // Starts bxd with `arguments` and waits until its socket accepts connections; false when the process exited
+    // or did not come up within ten seconds.
+    bool start(const std::vector<std::string>& arguments = {});
     // Starts bxd through `command` from now on (a launcher that ends by executing the program and arguments that
-    // follow it, such as a sandbox tool); pid(), stop() and running() then concern the launcher's process.
+    // follow it, such as a sandbox tool); stop() and running() then concern the launcher's process.
     void setLauncher(std::vector<std::string> command) { launcher_ = std::move(command); }
     // Runs bxd to completion (for option errors) and returns its exit status; standard error goes to log().
     int runToExit(const std::vector<std::string>& arguments);
     // Sends `signal` and waits for the process; returns the wait status.
     int stop(int signal = SIGTERM);
-
     bool running() const;
-    pid_t pid() const { return pid_; }
+
     // Everything bxd wrote to standard error so far.
     std::string log() const;
     // Waits until log() contains `text`; false after `timeout`.
@@ -50,7 +48,7 @@ class BxdProcess {
 
   private:
     std::vector<std::string> baseEnvironment() const;
-    pid_t spawn(const std::vector<std::string>& arguments, const std::vector<std::string>& environment);
+    pid_t spawn(const std::vector<std::string>& arguments);
 
     std::filesystem::path root_;
     std::filesystem::path logFile_;

@@ -55,13 +55,21 @@ class DiscoveryTest : public DaemonTest {
     }
 };
 
-// Guards the wiring of "match" to the rule matcher and its re-check of attribute rules beyond what the registry
-// pre-selects, an empty result that still carries "matches", and the refusals of malformed requests.
-TEST_F(DiscoveryTest, RulesSelectAndMalformedRequestsAreRefused) {
+// Guards the wiring of "match": without rules every visible plug-in (not the one dedicated to another application)
+// with its annotations and, for shared resources, sandbox extensions (their kinds: BXDPlugInExtensionsTest); the
+// daemon's re-check of attribute rules beyond what the registry pre-selects; an empty result that still carries
+// "matches"; and the refusals of malformed requests.
+TEST_F(DiscoveryTest, MatchSelectsVisiblePlugInsByRulesAndRefusesMalformedRequests) {
     startWithExamples();
     TestClient client;
-    Value greeting = Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")}});
-    EXPECT_EQ(identifiers(client.replyTo(matchRequest(greeting))), (Ids{kBonjour, kHello}));
+    Value reply = client.replyTo(matchRequest());
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
+    EXPECT_EQ(identifiers(reply), (Ids{kBonjour, kHello, kClipper, kStationery}));
+    for (const Value& form : reply.get("matches").items())
+        EXPECT_TRUE(form.get("annotations").isDictionary() && !form.contains("overrider")) << form.description();
+    Value helloExtensions = formsOf(reply, kHello).at(0).get("extensions");
+    EXPECT_TRUE(helloExtensions.contains("Resources/greetings.txt")) << helloExtensions.description();
+
     Value french = client.replyTo(matchRequest(
         Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")}, {"Language", str("fr")}})));
     EXPECT_EQ(identifiers(french), (Ids{kBonjour}));
@@ -72,29 +80,11 @@ TEST_F(DiscoveryTest, RulesSelectAndMalformedRequestsAreRefused) {
     EXPECT_EQ(none.get("matches").count(), 0u);
     EXPECT_TRUE(bxd_.waitForLog("match returned 0 plug-ins")) << bxd_.log();
 
-    Value rules = client.replyTo(matchRequest(str("RZExtensionIdentifier=x")));
-    EXPECT_EQ(errorCode(rules), 4);
-    EXPECT_EQ(errorText(rules), "invalid request format (bad rules dictionary)");
-    EXPECT_FALSE(rules.contains("matches"));
+    expectFailure(matchRequest(str("RZExtensionIdentifier=x")), 4, "invalid request format (bad rules dictionary)");
     // A version 2 client is answered, but the result has no encoding for it.
     Value old = client.replyTo(matchRequest(std::nullopt, 0, 2));
     EXPECT_EQ(errorCode(old), 0) << errorText(old);
     EXPECT_FALSE(old.contains("matches")) << old.description();
-}
-
-// Guards the forms the daemon sends: every visible plug-in (not the one dedicated to another application) with
-// its annotations and, for shared resources, sandbox extensions (their kinds: BXDPlugInExtensionsTest).
-TEST_F(DiscoveryTest, NoRulesReturnsEveryVisiblePlugInWithAnnotationsAndExtensions) {
-    startWithExamples();
-    Value reply = TestClient().replyTo(matchRequest());
-    ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_EQ(identifiers(reply), (Ids{kBonjour, kHello, kClipper, kStationery}));
-    for (const Value& form : reply.get("matches").items()) {
-        EXPECT_TRUE(form.get("annotations").isDictionary()) << form.description();
-        EXPECT_FALSE(form.contains("overrider"));
-    }
-    Value helloExtensions = formsOf(reply, kHello).at(0).get("extensions");
-    EXPECT_TRUE(helloExtensions.contains("Resources/greetings.txt")) << helloExtensions.description();
 }
 
 // Guards privileged discovery: refused without the manager entitlement and to an entitled program in another user
@@ -102,13 +92,8 @@ TEST_F(DiscoveryTest, NoRulesReturnsEveryVisiblePlugInWithAnnotationsAndExtensio
 // what an entitled host sees. Unknown flag bits are ignored.
 TEST_F(DiscoveryTest, DiscoverAllNeedsTheManagerEntitlementAndNoSandboxAndSkipsHostPolicy) {
     startWithExamples();
-    {
-        TestClient client;
-        Value refused = client.replyTo(matchRequest(std::nullopt, kDiscoverAll));
-        EXPECT_EQ(errorCode(refused), 11);
-        EXPECT_EQ(errorText(refused), "unauthorized discovery flag (BXDiscoverAll)");
-        EXPECT_EQ(identifiers(client.replyTo(matchRequest(std::nullopt, 0x10000))).size(), 4u);
-    }
+    expectFailure(matchRequest(std::nullopt, kDiscoverAll), 11, "unauthorized discovery flag (BXDiscoverAll)");
+    EXPECT_EQ(identifiers(TestClient().replyTo(matchRequest(std::nullopt, 0x10000))).size(), 4u);
     grantSelf(Value::dictionary(
         {{kManagerEntitlement, Value::boolean(true)},
          {"com.quorvel.developer.bexil.allowedplugins", identifierRule(kHello)}}));

@@ -159,11 +159,12 @@ class DaemonTest : public ::testing::Test {
         ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
     }
 
-    // Sends `message` on a new connection and expects the failure `code` with `text`.
+    // Sends `message` on a new connection and expects the failure `code` with `text`, and no other key.
     void expectFailure(const Value& message, int64_t code, const std::string& text) {
         Value reply = TestClient().replyTo(message);
         EXPECT_EQ(errorCode(reply), code) << text;
         EXPECT_EQ(errorText(reply), text);
+        EXPECT_EQ(reply.count(), 2u) << reply.description();
     }
 
     // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
