@@ -13,6 +13,7 @@
 #include <memory>
 #include <mutex>
 #include <random>
+#include <tuple>
 #include <thread>
 
 #include "BxdProcess.h"
@@ -98,36 +99,6 @@ TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
     EXPECT_EQ(bxd_.countInLog(" election := "), 2u) << "only the request with an election logs one";
 }
 
-// Guards the checks of "annotate": each bad field has its own text and nothing of a refused request is applied;
-// a plug-in list that fails part way keeps the changes made before the failure but posts nothing.
-TEST_F(AnnotationTest, MalformedAnnotateRequestsAndPartialFailures) {
-    const std::vector<Uuid> both{hello_, bonjour_};
-    expectFailure(request("annotate", {{"uuids", uuidArray(both)}}), 4,
-                  "invalid request format (bad annotations dictionary)");
-    expectFailure(request("annotate", {{"annotations", Value::array({})}, {"uuids", uuidArray(both)}}), 4,
-                  "invalid request format (bad annotations dictionary)");
-    // A bad election fails even when the extension beside it is fine.
-    Value goodExtension = Value::dictionary({{"colour", Value::string("red")}});
-    expectFailure(annotateRequest(Value::dictionary({{"election", Value::string("1")}, {"extension", goodExtension}}),
-                                  both),
-                  4, "invalid request format (annotation election)");
-    expectFailure(annotateRequest(Value::dictionary({{"extension", Value::string("x")}}), both), 4,
-                  "invalid request format (annotation extension)");
-    expectFailure(request("annotate", {{"annotations", election(2)}}), 4, "invalid request format (uuid)");
-    expectFailure(request("annotate", {{"annotations", election(2)}, {"uuids", Value::uuid(hello_)}}), 4,
-                  "invalid request format (uuid)");
-    expectFailure(request("annotate",
-                          {{"annotations", election(2)}, {"uuids", Value::array({Value::string(hello_.string())})}}),
-                  4, "invalid request (bad uuid array)");
-    EXPECT_TRUE(stored(kHelloKey).isNull());
-
-    expectFailure(annotateRequest(election(3), {hello_, Uuid::random(), bonjour_}), 4,
-                  "no such plugin (uuid not found)");
-    EXPECT_EQ(stored(kHelloKey), election(3)) << "the plug-in before the unknown one was changed and saved";
-    EXPECT_TRUE(stored(kBonjourKey).isNull()) << "the walk stopped at the unknown plug-in";
-    EXPECT_EQ(notifications(), 0u);
-}
-
 // Guards "bulk-annotate": client data is replaced whole while the election stays, one post per request (also for
 // an empty map), and its log lines.
 TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
@@ -153,23 +124,47 @@ TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
     EXPECT_TRUE(bxd_.waitForLog("bulk change requested for 0 plug-ins")) << bxd_.log();
 }
 
-// Guards the checks of "bulk-annotate", each with its code and text, the value checked before the key, and that a
-// refused request changes nothing.
-TEST_F(AnnotationTest, MalformedBulkEntriesAreRefusedWithTheirCodes) {
-    const std::string dictionaryText = "invalid request format (bad annotations dictionary)";
-    expectFailure(request("bulk-annotate"), 4, dictionaryText);
-    expectFailure(bulkRequest(Value::string("x")), 4, dictionaryText);
-    Value data = Value::dictionary({{"k", Value::string("v")}});
-    expectFailure(bulkRequest(Value::dictionary({{hello_.string(), Value::string("v")}})), 18,
-                  "annotations values must be dictionaries");
-    expectFailure(bulkRequest(Value::dictionary({{"not-a-uuid", Value::int64(1)}})), 18,
-                  "annotations values must be dictionaries");
-    for (const char* key : {"not-a-uuid", "11111111-2222-4333-8444-55555555555"})
-        expectFailure(bulkRequest(Value::dictionary({{key, data}})), 18, "invalid plug-in UUID value");
-    expectFailure(bulkRequest(Value::dictionary({{Uuid::random().string(), data}})), 2,
-                  "no plug-in with the requested uuid");
+// Guards the checks of "annotate" and "bulk-annotate": each bad field has its own code and text (a bad election
+// fails even beside a good extension), and a refused request changes and posts nothing.
+TEST_F(AnnotationTest, MalformedRequestsAreRefusedWithTheirCodesAndChangeNothing) {
+    const std::vector<Uuid> both{hello_, bonjour_};
+    const Value data = Value::dictionary({{"k", Value::string("v")}});
+    const std::string badAnnotations = "invalid request format (bad annotations dictionary)";
+    const std::string badValue = "annotations values must be dictionaries", badKey = "invalid plug-in UUID value";
+    const std::tuple<Value, int64_t, std::string> cases[] = {
+        {request("annotate", {{"uuids", uuidArray(both)}}), 4, badAnnotations},
+        {request("annotate", {{"annotations", Value::array({})}, {"uuids", uuidArray(both)}}), 4, badAnnotations},
+        {annotateRequest(Value::dictionary({{"election", Value::string("1")}, {"extension", data}}), both), 4,
+         "invalid request format (annotation election)"},
+        {annotateRequest(Value::dictionary({{"extension", Value::string("x")}}), both), 4,
+         "invalid request format (annotation extension)"},
+        {request("annotate", {{"annotations", election(2)}}), 4, "invalid request format (uuid)"},
+        {request("annotate", {{"annotations", election(2)}, {"uuids", Value::uuid(hello_)}}), 4,
+         "invalid request format (uuid)"},
+        {request("annotate", {{"annotations", election(2)}, {"uuids", Value::array({Value::string(hello_.string())})}}),
+         4, "invalid request (bad uuid array)"},
+        {request("bulk-annotate"), 4, badAnnotations},
+        {bulkRequest(Value::string("x")), 4, badAnnotations},
+        {bulkRequest(Value::dictionary({{hello_.string(), Value::string("v")}})), 18, badValue},
+        // The value is checked before the key.
+        {bulkRequest(Value::dictionary({{"not-a-uuid", Value::int64(1)}})), 18, badValue},
+        {bulkRequest(Value::dictionary({{"not-a-uuid", data}})), 18, badKey},
+        {bulkRequest(Value::dictionary({{"11111111-2222-4333-8444-55555555555", data}})), 18, badKey},
+        {bulkRequest(Value::dictionary({{Uuid::random().string(), data}})), 2, "no plug-in with the requested uuid"},
+    };
+    for (const auto& [message, code, text] : cases) expectFailure(message, code, text);
     EXPECT_EQ(notifications(), 0u);
     EXPECT_TRUE(stored(kHelloKey).isNull());
+}
+
+// Guards the walk over the plug-in list of "annotate": a failure part way keeps the changes made before it (they
+// are saved) but posts nothing.
+TEST_F(AnnotationTest, AFailingLaterPlugInKeepsEarlierChangesButPostsNothing) {
+    expectFailure(annotateRequest(election(3), {hello_, Uuid::random(), bonjour_}), 4,
+                  "no such plugin (uuid not found)");
+    EXPECT_EQ(stored(kHelloKey), election(3));
+    EXPECT_TRUE(stored(kBonjourKey).isNull()) << "the walk stopped at the unknown plug-in";
+    EXPECT_EQ(notifications(), 0u);
 }
 
 // Guards the frame limit on the reply side: annotations that fit one request each but together make a discovery

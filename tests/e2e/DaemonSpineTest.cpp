@@ -174,33 +174,18 @@ TEST(BxdService, FirstConnectionStartsBxdOnTheActivatedSocket) {
         << test::slurp(log);
 }
 
-// ---- the request envelope (one daemon for the suite) ----
+// ---- the request envelope ----
 
-class BxdEnvelope : public ::testing::Test {
+class BxdEnvelope : public test::DaemonTest {
   protected:
-    static void SetUpTestSuite() {
-        bxd_ = new BxdProcess();
-        ASSERT_TRUE(bxd_->start()) << bxd_->log();
-        bxd_->exportEnvironment();
-    }
-    static void TearDownTestSuite() {
-        delete bxd_;
-        bxd_ = nullptr;
-    }
-    static BxdProcess* bxd_;
+    void SetUp() override { ASSERT_TRUE(start()) << bxd_.log(); }
 };
-BxdProcess* BxdEnvelope::bxd_ = nullptr;
 
 // Guards the envelope checks before dispatch: versions 2 and 3 reach the handler table, anything else (below,
 // above, absent, high bits set, another kind) is code 7 naming the low 32 bits; then the request name, which must
 // match exactly, and the known requests without a handler yet.
 TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
-    TestClient client;
-    for (uint64_t accepted : {2u, 3u}) {
-        Value reply = client.replyTo(versioned("bogus", Value::uint64(accepted)));
-        EXPECT_EQ(errorCode(reply), 4);
-        EXPECT_EQ(errorText(reply), "unrecognized request");
-    }
+    for (uint64_t accepted : {2u, 3u}) expectFailure(versioned("bogus", Value::uint64(accepted)), 4, "unrecognized request");
     const std::pair<std::optional<Value>, const char*> refused[] = {
         {Value::uint64(1), "1"},
         {Value::uint64(4), "4"},
@@ -208,22 +193,13 @@ TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
         {Value::uint64((uint64_t{1} << 32) | 3), "3"},
         {Value::string("3"), "0"},
     };
-    for (const auto& [version, named] : refused) {
-        Value reply = client.replyTo(versioned("add", version));
-        EXPECT_EQ(errorCode(reply), 7) << named;
-        EXPECT_EQ(errorText(reply), std::string("unsupported protocol version ") + named + " (current 3)");
-    }
+    for (const auto& [version, named] : refused)
+        expectFailure(versioned("add", version), 7, std::string("unsupported protocol version ") + named + " (current 3)");
 
-    Value noType = client.replyTo(Value::dictionary({{"version", Value::uint64(3)}}));
-    EXPECT_EQ(errorCode(noType), 4);
-    EXPECT_EQ(errorText(noType), "invalid request format (missing type)");
-    EXPECT_EQ(noType.count(), 2u) << "a failure reply holds exactly the two failure keys";
-    for (const char* name : {"Add", ""}) EXPECT_EQ(errorText(client.replyTo(test::request(name))), "unrecognized request");
-    for (const char* name : {"ready", "access", "lock"}) {
-        Value reply = client.replyTo(test::request(name));
-        EXPECT_EQ(errorCode(reply), 4) << name;
-        EXPECT_EQ(errorText(reply), std::string("the \"") + name + "\" operation is not available yet");
-    }
+    expectFailure(Value::dictionary({{"version", Value::uint64(3)}}), 4, "invalid request format (missing type)");
+    for (const char* name : {"Add", ""}) expectFailure(test::request(name), 4, "unrecognized request");
+    for (const char* name : {"ready", "access", "lock"})
+        expectFailure(test::request(name), 4, std::string("the \"") + name + "\" operation is not available yet");
 }
 
 // Guards the per-client request counter: the line comes at the 1000th request, not before.
@@ -231,16 +207,16 @@ TEST_F(BxdEnvelope, EveryThousandthRequestOfAClientIsCounted) {
     TestClient client;
     for (int i = 1; i <= 999; ++i) client.roundTrip(kBogus);
     std::string line = "client " + std::to_string(getpid()) + " used 1000 requests so far";
-    EXPECT_EQ(bxd_->countInLog(line), 0u);
+    EXPECT_EQ(bxd_.countInLog(line), 0u);
     client.roundTrip(kBogus);
-    EXPECT_TRUE(bxd_->waitForLog(line)) << "missing 1000th request line";
+    EXPECT_TRUE(bxd_.waitForLog(line)) << "missing 1000th request line";
 }
 
 // Guards the daemon against peers that break the protocol: garbage and a valid payload that is not a dictionary
 // get the connection closed, half a frame followed by a hang-up is logged, and the daemon serves on.
 // (An announced frame over the size limit is refused by the frame reader: ZemFrameReader unit tests.)
 TEST_F(BxdEnvelope, MisbehavingPeersAreDroppedAndOthersServed) {
-    const std::string path = bxd_->socketPath();
+    const std::string path = bxd_.socketPath();
     {
         RawSocket garbage(path);
         garbage.write(std::vector<uint8_t>(100, 0x41));
@@ -263,21 +239,21 @@ TEST_F(BxdEnvelope, MisbehavingPeersAreDroppedAndOthersServed) {
         notDictionary.write(bytes);
         EXPECT_TRUE(notDictionary.closedByPeer());
     }
-    EXPECT_TRUE(bxd_->waitForLog("closed its connection in the middle of a frame"));
+    EXPECT_TRUE(bxd_.waitForLog("closed its connection in the middle of a frame"));
     EXPECT_EQ(errorText(TestClient().replyTo(kBogus)), "unrecognized request");
 }
 
 // Guards the reply path against clients that stop reading: one that dies with 2000 requests queued is noticed as
 // dead, one that never reads its 20000 replies does not hold up another client.
 TEST_F(BxdEnvelope, ClientsThatDieOrNeverReadDoNotHoldUpOthers) {
-    const std::string path = bxd_->socketPath();
+    const std::string path = bxd_.socketPath();
     pid_t child = fork();
     if (child == 0) {
         RawSocket(path).write(burst(2000));
         _exit(0);  // dies without reading a single reply
     }
     waitpid(child, nullptr, 0);
-    EXPECT_TRUE(bxd_->waitForLog("client " + std::to_string(child) + " is dead"));
+    EXPECT_TRUE(bxd_.waitForLog("client " + std::to_string(child) + " is dead"));
 
     RawSocket lazy(path);
     std::vector<uint8_t> many = burst(20000);
@@ -286,7 +262,7 @@ TEST_F(BxdEnvelope, ClientsThatDieOrNeverReadDoNotHoldUpOthers) {
     for (int i = 0; i < 50; ++i) EXPECT_EQ(errorText(client.replyTo(kBogus)), "unrecognized request");
     lazy.closeNow();
     writer.join();
-    EXPECT_TRUE(bxd_->running());
+    EXPECT_TRUE(bxd_.running());
 }
 
 }  // namespace

@@ -82,7 +82,7 @@ TEST_F(DiscoveryTest, MatchSelectsVisiblePlugInsByRulesAndRefusesMalformedReques
 
     expectFailure(matchRequest(str("RZExtensionIdentifier=x")), 4, "invalid request format (bad rules dictionary)");
     // A version 2 client is answered, but the result has no encoding for it.
-    Value old = client.replyTo(matchRequest(std::nullopt, 0, 2));
+    Value old = client.replyTo(Value::dictionary({{"request", str("match")}, {"version", Value::uint64(2)}}));
     EXPECT_EQ(errorCode(old), 0) << errorText(old);
     EXPECT_FALSE(old.contains("matches")) << old.description();
 }

@@ -14,7 +14,7 @@
 #include <future>
 #include <memory>
 #include <optional>
-#include <sstream>
+#include <iterator>
 #include <string>
 #include <variant>
 #include <vector>
@@ -66,7 +66,6 @@ class TestClient {
 inline const std::filesystem::path kExamples = std::filesystem::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
 inline constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 inline constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
-
 inline const std::filesystem::path kMatchClient = std::filesystem::path(BEXIL_BINARY_DIR) / "tests/bx_match_client";
 
 // A reply's error code, 0 when it has none.
@@ -86,12 +85,11 @@ inline Value pathsRequest(std::string_view name, const std::vector<std::string>&
 }
 
 // A "match" request with the given rules (none: the key is absent) and flag word (0: the key is absent).
-inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0, uint64_t version = 3) {
-    std::vector<std::pair<std::string, Value>> entries = {{"request", Value::string("match")},
-                                                          {"version", Value::uint64(version)}};
-    if (rules) entries.emplace_back("rules", *rules);
-    if (flags) entries.emplace_back("flags", Value::uint64(flags));
-    return Value::dictionary(std::move(entries));
+inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0) {
+    std::vector<std::pair<std::string, Value>> fields;
+    if (rules) fields.emplace_back("rules", *rules);
+    if (flags) fields.emplace_back("flags", Value::uint64(flags));
+    return request("match", std::move(fields));
 }
 inline Value identifierRule(const std::string& identifier) {
     return Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}});
@@ -116,9 +114,7 @@ inline std::vector<Value> formsOf(const Value& reply, const std::string& identif
 
 inline std::string slurp(const std::filesystem::path& path) {
     std::ifstream in(path);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
+    return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 struct Outcome {
