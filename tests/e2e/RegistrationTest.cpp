@@ -1,8 +1,6 @@
-// Registering and unregistering plug-in bundles through the real daemon: "add", "remove", "bulk" as a client sees
-// them, checked against the registry the daemon keeps in its state directory, and the running instances of a
-// removed plug-in ended: real child processes of this test, recorded under the runtime directory the way plug-in
-// runtimes record them. How the registry treats path forms, re-registration (a changed build is announced as an
-// uninstall, which takes the same path as "remove"), bad bundles and bundles gone from disk is LedgerixTest's.
+// "add", "remove" and "bulk" through the real daemon, checked against the registry in its state directory, and the
+// running instances (real child processes) of a removed plug-in ended. Path forms, re-registration (a changed build
+// is an uninstall, as for "remove"), bad bundles and bundles gone from disk are LedgerixTest's.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -88,7 +86,7 @@ class RegistrationTest : public DaemonTest {
 
 // Guards "add": an empty list succeeds with nothing registered; the plug-ins of an application and one outside any
 // application (refused only when looked up: SystemPlugInTest) are registered and announced, and adding a bundle
-// again keeps its UUID.
+// again keeps its UUID. And "bulk", which always succeeds and logs the flags it does not support.
 TEST_F(RegistrationTest, AddRegistersPlugInsAndReAddKeepsTheirUuids) {
     add({});
     EXPECT_EQ(bxd_.countInLog("plug-in INSTALLED:"), 0u);
@@ -100,6 +98,9 @@ TEST_F(RegistrationTest, AddRegistersPlugInsAndReAddKeepsTheirUuids) {
     EXPECT_TRUE(bxd_.waitForLog("plug-in INSTALLED:com.example.greeter.hello")) << bxd_.log();
     add({hello()});
     EXPECT_EQ(registeredUuid(hello()), helloUuid);
+
+    EXPECT_EQ(errorCode(TestClient().replyTo(request("bulk", {{"flags", Value::uint64(0x2a)}}))), 0);
+    EXPECT_TRUE(bxd_.waitForLog("bulk options 0x2a not supported")) << bxd_.log();
 }
 
 // Guards the path checks of "add" with their codes and texts: a malformed list is code 4, a path that is not
@@ -125,25 +126,18 @@ TEST_F(RegistrationTest, BadPathsAreRefusedAndTheWalkStopsAtTheFirst) {
     EXPECT_EQ(bxd_.countInLog("Ledgerix failed to register the plug-in"), 0u) << "the database's text stays inside";
 }
 
-// Guards the entitlement check of "remove": without the manager entitlement it is refused and logged and nothing
-// is removed; the path's form is checked first.
-TEST_F(RegistrationTest, RemoveNeedsTheManagerEntitlement) {
-    add({hello()});
+// Guards "remove": refused and logged without the manager entitlement (the path's form is checked first); with it,
+// a restarted daemon still knows the bundles, unregisters and announces the plug-in, has the service manager end
+// its instances by the plug-in's version (SIGTERM suffices, records go) while another plug-in's instance runs on,
+// and reports a path it does not know.
+TEST_F(RegistrationTest, RemoveNeedsTheEntitlementAndEndsThePlugInsInstancesAfterARestart) {
+    add({hello(), bonjour()});
+    expectFailure(pathsRequest("remove", {"Hello.bxplugin"}), 9, "absolute path required: Hello.bxplugin");
     expectFailure(pathsRequest("remove", {hello()}), 11, "caller lacks entitlement for this operation");
     EXPECT_TRUE(bxd_.waitForLog("refused request from pid=" + std::to_string(getpid()) + " to remove plug-in at " +
                                 hello() + " - client lacks required entitlement"))
         << bxd_.log();
-    EXPECT_TRUE(registeredUuid(hello()));
-    expectFailure(pathsRequest("remove", {"Hello.bxplugin"}), 9, "absolute path required: Hello.bxplugin");
-}
-
-// Guards an entitled "remove" against a restarted daemon: it knows the bundles registered before, unregisters and
-// announces the plug-in, asks the service manager (by the plug-in's version) to end its instances, which get
-// SIGTERM (no SIGKILL needed) and lose their records while another plug-in's instance runs on, and reports a path
-// it does not know.
-TEST_F(RegistrationTest, EntitledRemoveWorksAcrossARestartAndEndsThePlugInsInstances) {
     grantSelfManager();
-    add({hello(), bonjour()});
     bxd_.stop();
     ASSERT_TRUE(start()) << bxd_.log();
     std::string helloUuid = registeredUuid(hello()).value_or(Uuid()).string();
@@ -166,12 +160,6 @@ TEST_F(RegistrationTest, EntitledRemoveWorksAcrossARestartAndEndsThePlugInsInsta
     EXPECT_EQ(bxd_.countInLog("requesting termination for " + kBonjour), 0u) << bxd_.log();
 
     expectFailure(pathsRequest("remove", {hello()}), 9, "no plugin at " + hello());
-}
-
-// Guards "bulk": it always succeeds and logs the flags it does not support.
-TEST_F(RegistrationTest, BulkAlwaysSucceedsAndLogsItsFlags) {
-    EXPECT_EQ(errorCode(TestClient().replyTo(request("bulk", {{"flags", Value::uint64(0x2a)}}))), 0);
-    EXPECT_TRUE(bxd_.waitForLog("bulk options 0x2a not supported")) << bxd_.log();
 }
 
 }  // namespace
