@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <tuple>
 
 #include "BxdProcess.h"
 #include "E2eSupport.h"
@@ -20,56 +21,42 @@ size_t lines(const std::string& text) { return static_cast<size_t>(std::count(te
 
 using ClientToolTest = DaemonTest;
 
-// Guards the tool's message and status 69 when no daemon listens on the service it was told to use.
-TEST_F(ClientToolTest, DaemonNotRunningIsOneLineAndStatus69) {
-    Outcome run = bexil("match");
-    EXPECT_EQ(run.status, 69);
-    EXPECT_EQ(run.err, "bexil: bxd is not running on service com.quorvel.bexil.bxd (" + bxd_.socketPath() + ")\n");
-    EXPECT_TRUE(run.out.empty());
-
+// Guards the tool's exit statuses and one-line errors: 69 naming the service's socket when no daemon listens; 64 for
+// usage errors (a bad argument, a missing option, an unknown subcommand, a missing argument), which send nothing
+// (the daemon logs every request it dispatches); the daemon's code for its errors, in one line naming the request
+// (--json prints the raw reply instead); 0 and nothing on standard error for success.
+TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
+    Outcome down = bexil("match");
+    EXPECT_EQ(down.status, 69);
+    EXPECT_EQ(down.err, "bexil: bxd is not running on service com.quorvel.bexil.bxd (" + bxd_.socketPath() + ")\n");
     EXPECT_EQ(bexil("--service com.example.other bulk").err,
               "bexil: bxd is not running on service com.example.other (" + bxd_.socketPath("com.example.other") + ")\n");
-}
 
-// Guards usage errors: status 64 and one "bexil: " line for a bad argument, a missing option, an unknown
-// subcommand and a missing argument, and no request reaches the daemon (it logs every request it dispatches).
-TEST_F(ClientToolTest, BadArgumentsAreRefusedBeforeAnythingIsSent) {
     ASSERT_TRUE(start());
-    const std::pair<const char*, const char*> cases[] = {
-        {"ready not-a-uuid", "not a UUID"},
-        {"match --rules-file /nonexistent/rules.json", "/nonexistent/rules.json"},
-        {"annotate 11111111-2222-4333-8444-555555555555", "needs --election or --extension"},
-        {"frobnicate", ""},
-        {"add", ""},
+    const std::string uuid = "11111111-2222-4333-8444-555555555555";
+    // Each row: arguments, exit status, text the one line on standard error must hold.
+    const std::tuple<std::string, int, std::string> cases[] = {
+        {"ready not-a-uuid", 64, "not a UUID"},
+        {"match --rules-file /nonexistent/rules.json", 64, "/nonexistent/rules.json"},
+        {"annotate " + uuid, 64, "needs --election or --extension"},
+        {"frobnicate", 64, ""},
+        {"add", 64, ""},
+        {"ready " + uuid, 4, "bexil: ready failed (code 4): "},
+        {"add /no/such.bxplugin", 9, "bexil: add failed (code 9): invalid plugin path: /no/such.bxplugin\n"},
     };
-    for (const auto& [arguments, expected] : cases) {
+    for (const auto& [arguments, status, text] : cases) {
         Outcome run = bexil(arguments);
-        EXPECT_EQ(run.status, 64) << arguments << ": " << run.err;
+        EXPECT_EQ(run.status, status) << arguments << ": " << run.err;
         EXPECT_EQ(lines(run.err), 1u) << arguments << ": " << run.err;
         EXPECT_EQ(run.err.rfind("bexil: ", 0), 0u) << run.err;
-        EXPECT_NE(run.err.find(expected), std::string::npos) << arguments << ": " << run.err;
+        EXPECT_NE(run.err.find(text), std::string::npos) << arguments << ": " << run.err;
     }
-    EXPECT_EQ(bxd_.countInLog(" requested "), 0u) << bxd_.log();
-}
+    EXPECT_EQ(bxd_.countInLog(" requested "), 2u) << "only the last two reached the daemon\n" << bxd_.log();
 
-// Guards how daemon replies become the tool's result: an error is one line naming the request with the daemon's
-// code as exit status (also in --json, which prints the raw reply), and success prints nothing on standard error.
-TEST_F(ClientToolTest, DaemonErrorsBecomeOneLineAndTheCodeAsStatus) {
-    ASSERT_TRUE(start());
-    Outcome ready = bexil("ready 11111111-2222-4333-8444-555555555555");
-    EXPECT_EQ(ready.status, 4) << ready.err;
-    EXPECT_EQ(lines(ready.err), 1u) << ready.err;
-    EXPECT_EQ(ready.err.rfind("bexil: ready failed (code 4): ", 0), 0u) << ready.err;
-
-    Outcome missing = bexil("add /no/such.bxplugin");
-    EXPECT_EQ(missing.status, 9) << missing.err;
-    EXPECT_EQ(missing.err, "bexil: add failed (code 9): invalid plugin path: /no/such.bxplugin\n");
-
-    Outcome json = bexil("--json ready 11111111-2222-4333-8444-555555555555");
+    Outcome json = bexil("--json ready " + uuid);
     EXPECT_EQ(json.status, 4);
     EXPECT_NE(json.out.find("\"errorcode\": 4"), std::string::npos) << json.out;
     EXPECT_NE(json.out.find("\"error\": "), std::string::npos) << json.out;
-
     Outcome bulk = bexil("bulk");
     EXPECT_EQ(bulk.status, 0) << bulk.err;
     EXPECT_EQ(bulk.err, "");
