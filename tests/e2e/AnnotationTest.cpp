@@ -5,20 +5,13 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <iostream>
 #include <map>
-#include <memory>
 #include <mutex>
 #include <random>
 #include <tuple>
-#include <thread>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "base/Document.h"
 #include "platform/notify/SystemNotifications.h"
 
 namespace bexil {

@@ -4,11 +4,8 @@
 
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <fstream>
 #include <tuple>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
 
 namespace bexil {

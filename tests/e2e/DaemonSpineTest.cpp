@@ -1,20 +1,10 @@
 // The daemon as a client sees it: options and exit statuses, owning and being activated on its service socket, the
 // request envelope, and peers that misbehave.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <array>
-#include <cstdlib>
-#include <cstring>
-#include <thread>
-#include <utility>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"

@@ -4,12 +4,8 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <filesystem>
-#include <thread>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "base/Document.h"
 
 namespace bexil {
 namespace {

@@ -9,12 +9,13 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <iterator>
 #include <memory>
 #include <optional>
-#include <iterator>
 #include <string>
 #include <variant>
 #include <vector>

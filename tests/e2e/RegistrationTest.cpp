@@ -2,17 +2,11 @@
 // running instances (real child processes) of a removed plug-in ended. Path forms, re-registration (a changed build
 // is an uninstall, as for "remove"), bad bundles and bundles gone from disk are LedgerixTest's.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/prctl.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <csignal>
-#include <filesystem>
-#include <thread>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
 #include "platform/jobard/RunningInstances.h"
 
