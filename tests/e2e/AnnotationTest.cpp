@@ -68,8 +68,9 @@ class AnnotationTest : public DaemonTest {
 // posts one notification per request; a request without known keys (or without the plug-in list it then does not
 // need) succeeds and touches nothing.
 TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
-    EXPECT_EQ(errorCode(client_->replyTo(request("annotate", {{"annotations", Value::dictionary({{"x", election(1)}})}}))),
-              0);
+    EXPECT_EQ(
+        errorCode(client_->replyTo(request("annotate", {{"annotations", Value::dictionary({{"x", election(1)}})}}))),
+        0);
     EXPECT_EQ(errorCode(client_->replyTo(annotateRequest(Value::emptyDictionary(), {hello_}))), 0);
     EXPECT_EQ(notifications(), 0u);
     EXPECT_EQ(bxd_.countInLog("annotation change"), 0u);
@@ -86,8 +87,8 @@ TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
     std::string pid = std::to_string(getpid());
     for (const auto& [key, uuid] : {std::pair{kHelloKey, hello_}, std::pair{"com.example.greeter.bonjour", bonjour_}}) {
         std::string who = "client " + pid + " plug-in " + key + "(" + uuid.string() + ")";
-        EXPECT_TRUE(bxd_.waitForLog(who + " election := 0")) << bxd_.log();
-        EXPECT_TRUE(bxd_.waitForLog(who + " annotation change: ")) << bxd_.log();
+        expectLog(who + " election := 0");
+        expectLog(who + " annotation change: ");
     }
     EXPECT_EQ(bxd_.countInLog(" election := "), 2u) << "only the request with an election logs one";
 }
@@ -96,8 +97,8 @@ TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
 // an empty map), and its log lines.
 TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
     Value old = Value::dictionary({{"old", Value::boolean(true)}, {"shared", Value::int64(1)}});
-    ASSERT_EQ(errorCode(client_->replyTo(annotateRequest(
-                  Value::dictionary({{"election", Value::int64(1)}, {"extension", old}}), {hello_}))),
+    ASSERT_EQ(errorCode(client_->replyTo(
+                  annotateRequest(Value::dictionary({{"election", Value::int64(1)}, {"extension", old}}), {hello_}))),
               0);
     Value replacement = Value::dictionary({{"shared", Value::int64(2)}});
     Value bonjourData = Value::dictionary({{"nested", Value::array({Value::string("a"), Value::real(1.5)})}});
@@ -107,10 +108,9 @@ TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
     EXPECT_EQ(notifications(), 2u);
     EXPECT_EQ(stored(kHelloKey), Value::dictionary({{"election", Value::int64(1)}, {"extension", replacement}}));
     EXPECT_EQ(stored(kBonjourKey), Value::dictionary({{"extension", bonjourData}}));
-    EXPECT_TRUE(bxd_.waitForLog("bulk change requested for 2 plug-ins")) << bxd_.log();
-    EXPECT_TRUE(bxd_.waitForLog("client " + std::to_string(getpid()) + " bulk plug-in " + kHelloKey + "(" +
-                                hello_.string() + ") annotation change: "))
-        << bxd_.log();
+    expectLog("bulk change requested for 2 plug-ins");
+    expectLog("client " + std::to_string(getpid()) + " bulk plug-in " + kHelloKey + "(" + hello_.string() +
+              ") annotation change: ");
 
     EXPECT_EQ(errorCode(client_->replyTo(bulkRequest(Value::emptyDictionary()))), 0);
     EXPECT_EQ(notifications(), 3u) << "an empty bulk change is posted too";
@@ -168,7 +168,7 @@ TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
     Value reply = client_->replyTo(matchRequest());
     EXPECT_EQ(errorCode(reply), 4);
     EXPECT_NE(errorText(reply).find("exceeds the frame limit"), std::string::npos) << errorText(reply);
-    EXPECT_TRUE(bxd_.waitForLog("exceeds the frame limit of")) << bxd_.log();
+    expectLog("exceeds the frame limit of");
     EXPECT_EQ(errorCode(client_->replyTo(matchRequest(identifierRule("none")))), 0);
 }
 
@@ -194,8 +194,9 @@ TEST_F(AnnotationTest, ToolSubcommandsChangeAnnotationsEndToEnd) {
     fs::path bulkFile = bxd_.root() / "bulk.json";
     std::ofstream(bulkFile) << "{\"" << bonjour_.string() << "\": {\"from\": \"bulk\"}}";
     run("bulk-annotate '" + bulkFile.string() + "'");
-    EXPECT_EQ(stored(kBonjourKey), Value::dictionary({{"election", Value::int64(0)},
-                                                      {"extension", Value::dictionary({{"from", Value::string("bulk")}})}}));
+    EXPECT_EQ(stored(kBonjourKey),
+              Value::dictionary({{"election", Value::int64(0)},
+                                 {"extension", Value::dictionary({{"from", Value::string("bulk")}})}}));
     EXPECT_EQ(notifications(), 4u);
 }
 
@@ -205,10 +206,10 @@ TEST_F(AnnotationTest, ToolSubcommandsChangeAnnotationsEndToEnd) {
 // document mixing two writes or cut short cannot pass for a whole one.
 Value numberedAnnotation(const std::string& writer, int64_t n) {
     std::string text(static_cast<size_t>(n * 37 % 301), static_cast<char>('a' + n % 26));
-    return Value::dictionary(
-        {{"election", Value::int64(n)},
-         {"extension", Value::dictionary({{"n", Value::int64(n)}, {"writer", Value::string(writer)},
-                                          {"text", Value::string(text)}})}});
+    return Value::dictionary({{"election", Value::int64(n)},
+                              {"extension", Value::dictionary({{"n", Value::int64(n)},
+                                                               {"writer", Value::string(writer)},
+                                                               {"text", Value::string(text)}})}});
 }
 
 // One client changing the annotation of one plug-in until the daemon goes away.
@@ -252,7 +253,8 @@ class AnnotationCrashTest : public AnnotationTest {
             Result<Value> root = Document::readFile(document());
             ASSERT_TRUE(root.ok()) << "round " << round << ": " << root.error().description();
             ASSERT_TRUE(root->get("data").isDictionary()) << root->description();
-            for (const DictionaryEntry& entry : root->get("data").entries()) stored[std::string(entry.key)] = entry.value;
+            for (const DictionaryEntry& entry : root->get("data").entries())
+                stored[std::string(entry.key)] = entry.value;
         }
         for (Writer& writer : writers_) {
             Value onDisk = stored.count(writer.annotationKey) ? stored[writer.annotationKey] : Value();
@@ -272,8 +274,8 @@ class AnnotationCrashTest : public AnnotationTest {
         ASSERT_TRUE(start()) << bxd_.log();
         TestClient client;
         for (Writer& writer : writers_) {
-            std::vector<Value> forms = formsOf(client.replyTo(matchRequest(identifierRule(writer.identifier))),
-                                               writer.identifier);
+            std::vector<Value> forms =
+                formsOf(client.replyTo(matchRequest(identifierRule(writer.identifier))), writer.identifier);
             ASSERT_EQ(forms.size(), 1u) << "round " << round << ", " << writer.identifier;
             Value expected = writer.acknowledged.isNull() ? Value::emptyDictionary() : writer.acknowledged;
             EXPECT_EQ(forms[0].get("annotations"), expected) << "round " << round << ", " << writer.identifier;
@@ -290,8 +292,10 @@ class AnnotationCrashTest : public AnnotationTest {
 TEST_F(AnnotationCrashTest, DocumentHoldsAWholeAcknowledgedOrInFlightChangeAfterEveryKill) {
     constexpr int kRounds = 20;
     unsigned seed = std::random_device{}();
-    if (const char* fixed = std::getenv("E2E_CRASH_SEED")) seed = static_cast<unsigned>(std::strtoul(fixed, nullptr, 10));
-    std::cout << "annotation crash seed " << seed << " (E2E_CRASH_SEED=" << seed << " kills at the same moments again)\n";
+    if (const char* fixed = std::getenv("E2E_CRASH_SEED"))
+        seed = static_cast<unsigned>(std::strtoul(fixed, nullptr, 10));
+    std::cout << "annotation crash seed " << seed << " (E2E_CRASH_SEED=" << seed
+              << " kills at the same moments again)\n";
     RecordProperty("seed", std::to_string(seed));
     std::mt19937 random(seed);
     std::uniform_int_distribution<int> runMs(0, 150);

@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -33,11 +34,7 @@ class BxdProcess {
         for (const char* sub : {"service", "state", "runtime", "entitlements.d"})
             std::filesystem::create_directories(root_ / sub);
         // The daemon trusts entitlement files only in a directory nobody else may write to, whatever the umask.
-        std::filesystem::permissions(entitlementsDir(), std::filesystem::perms::owner_all |
-                                                            std::filesystem::perms::group_read |
-                                                            std::filesystem::perms::group_exec |
-                                                            std::filesystem::perms::others_read |
-                                                            std::filesystem::perms::others_exec);
+        chmod(entitlementsDir().c_str(), 0755);
     }
     ~BxdProcess() {
         if (running()) stop(SIGKILL);

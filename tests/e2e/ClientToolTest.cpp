@@ -1,6 +1,6 @@
 // The bexil tool and libbexil against the real bxd: exit statuses, one-line errors, the daemon-not-running line,
 // arguments refused before anything is sent, and an application built from an installed copy of the library.
-// (How each argument is checked: ToolArgumentsTest.)
+// (How each argument is checked: ToolArgumentsTest; the exclusions subcommand: DiscoveryTest.)
 
 #include <gtest/gtest.h>
 
@@ -26,8 +26,9 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
     Outcome down = bexil("match");
     EXPECT_EQ(down.status, 69);
     EXPECT_EQ(down.err, "bexil: bxd is not running on service com.quorvel.bexil.bxd (" + bxd_.socketPath() + ")\n");
-    EXPECT_EQ(bexil("--service com.example.other bulk").err,
-              "bexil: bxd is not running on service com.example.other (" + bxd_.socketPath("com.example.other") + ")\n");
+    EXPECT_EQ(
+        bexil("--service com.example.other bulk").err,
+        "bexil: bxd is not running on service com.example.other (" + bxd_.socketPath("com.example.other") + ")\n");
 
     ASSERT_TRUE(start());
     const std::string uuid = "11111111-2222-4333-8444-555555555555";
@@ -59,25 +60,6 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
     EXPECT_EQ(bulk.err, "");
 }
 
-// Guards the local exclusions file: added rules show in --json, a refused --set keeps the old rules, --clear
-// empties it; no daemon is needed.
-TEST_F(ClientToolTest, ExclusionsAreReadAndWrittenLocally) {
-    EXPECT_NE(bexil("exclusions").out.find("no exclusions"), std::string::npos);
-
-    EXPECT_EQ(bexil("exclusions --add RZExtensionPointIdentifier=com.example.ads").status, 0);
-    EXPECT_NE(bexil("--json exclusions").out.find("\"RZExtensionPointIdentifier\": \"com.example.ads\""),
-              std::string::npos);
-
-    fs::path bad = bxd_.root() / "bad.json";
-    std::ofstream(bad) << "{\"exclusions\": [\"not a rule\"]}";
-    EXPECT_EQ(bexil("exclusions --set " + bad.string()).status, 64);
-    EXPECT_NE(bexil("--json exclusions").out.find("com.example.ads"), std::string::npos)
-        << "a refused --set must not lose the old rules";
-
-    EXPECT_EQ(bexil("exclusions --clear").status, 0);
-    EXPECT_EQ(bexil("--json exclusions").out, "[]\n");
-}
-
 // Guards the installed library: the install holds the tool, its manual, the public header (and no private one),
 // the pkg-config and CMake files, and the example application builds with pkg-config alone and talks to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
@@ -89,9 +71,9 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
         shell("cmake --install '" + std::string(BEXIL_BINARY_DIR) + "' --prefix '" + prefix.string() + "'");
     ASSERT_EQ(install.status, 0) << install.err;
     fs::path libdir = fs::exists(prefix / "lib/pkgconfig/bexil.pc") ? prefix / "lib" : prefix / "lib64";
-    for (const fs::path& installed : {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h",
-                                      prefix / "bin/bexil", prefix / "share/man/man1/bexil.1",
-                                      libdir / "cmake/Bexil/BexilConfig.cmake"})
+    for (const fs::path& installed :
+         {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h", prefix / "bin/bexil",
+          prefix / "share/man/man1/bexil.1", libdir / "cmake/Bexil/BexilConfig.cmake"})
         ASSERT_TRUE(fs::exists(installed)) << installed;
     for (const auto& entry : fs::recursive_directory_iterator(prefix / "include")) {
         if (!entry.is_regular_file()) continue;

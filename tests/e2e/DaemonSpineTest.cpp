@@ -168,16 +168,16 @@ class BxdEnvelope : public test::DaemonTest {
 // above, absent, high bits set, another kind) is code 7 naming the low 32 bits; then the request name, which must
 // match exactly, and the known requests without a handler yet.
 TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
-    for (uint64_t accepted : {2u, 3u}) expectFailure(versioned("bogus", Value::uint64(accepted)), 4, "unrecognized request");
+    for (uint64_t accepted : {2u, 3u})
+        expectFailure(versioned("bogus", Value::uint64(accepted)), 4, "unrecognized request");
     const std::pair<std::optional<Value>, const char*> refused[] = {
-        {Value::uint64(1), "1"},
-        {Value::uint64(4), "4"},
-        {std::nullopt, "0"},
-        {Value::uint64((uint64_t{1} << 32) | 3), "3"},
+        {Value::uint64(1), "1"},   {Value::uint64(4), "4"},
+        {std::nullopt, "0"},       {Value::uint64((uint64_t{1} << 32) | 3), "3"},
         {Value::string("3"), "0"},
     };
     for (const auto& [version, named] : refused)
-        expectFailure(versioned("add", version), 7, std::string("unsupported protocol version ") + named + " (current 3)");
+        expectFailure(versioned("add", version), 7,
+                      std::string("unsupported protocol version ") + named + " (current 3)");
 
     expectFailure(Value::dictionary({{"version", Value::uint64(3)}}), 4, "invalid request format (missing type)");
     for (const char* name : {"Add", ""}) expectFailure(test::request(name), 4, "unrecognized request");
@@ -192,7 +192,7 @@ TEST_F(BxdEnvelope, EveryThousandthRequestOfAClientIsCounted) {
     std::string line = "client " + std::to_string(getpid()) + " used 1000 requests so far";
     EXPECT_EQ(bxd_.countInLog(line), 0u);
     client.roundTrip(kBogus);
-    EXPECT_TRUE(bxd_.waitForLog(line)) << "missing 1000th request line";
+    expectLog(line);
 }
 
 // Guards the daemon against peers that break the protocol: garbage and a valid payload that is not a dictionary
@@ -222,7 +222,7 @@ TEST_F(BxdEnvelope, MisbehavingPeersAreDroppedAndOthersServed) {
         notDictionary.write(bytes);
         EXPECT_TRUE(notDictionary.closedByPeer());
     }
-    EXPECT_TRUE(bxd_.waitForLog("closed its connection in the middle of a frame"));
+    expectLog("closed its connection in the middle of a frame");
     EXPECT_EQ(errorText(TestClient().replyTo(kBogus)), "unrecognized request");
 }
 
@@ -236,7 +236,7 @@ TEST_F(BxdEnvelope, ClientsThatDieOrNeverReadDoNotHoldUpOthers) {
         _exit(0);  // dies without reading a single reply
     }
     waitpid(child, nullptr, 0);
-    EXPECT_TRUE(bxd_.waitForLog("client " + std::to_string(child) + " is dead"));
+    expectLog("client " + std::to_string(child) + " is dead");
 
     RawSocket lazy(path);
     std::vector<uint8_t> many = burst(20000);

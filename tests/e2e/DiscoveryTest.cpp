@@ -74,7 +74,7 @@ TEST_F(DiscoveryTest, MatchSelectsVisiblePlugInsByRulesAndRefusesMalformedReques
     EXPECT_EQ(errorCode(none), 0);
     ASSERT_TRUE(none.contains("matches"));
     EXPECT_EQ(none.get("matches").count(), 0u);
-    EXPECT_TRUE(bxd_.waitForLog("match returned 0 plug-ins")) << bxd_.log();
+    expectLog("match returned 0 plug-ins");
 
     expectFailure(matchRequest(str("RZExtensionIdentifier=x")), 4, "invalid request format (bad rules dictionary)");
     // A version 2 client is answered, but the result has no encoding for it.
@@ -90,12 +90,11 @@ TEST_F(DiscoveryTest, DiscoverAllNeedsTheManagerEntitlementAndNoSandboxAndSkipsH
     startWithExamples();
     expectFailure(matchRequest(std::nullopt, kDiscoverAll), 11, "unauthorized discovery flag (BXDiscoverAll)");
     EXPECT_EQ(identifiers(TestClient().replyTo(matchRequest(std::nullopt, 0x10000))).size(), 4u);
-    grantSelf(Value::dictionary(
-        {{kManagerEntitlement, Value::boolean(true)},
-         {"com.quorvel.developer.bexil.allowedplugins", identifierRule(kHello)}}));
+    grantSelf(Value::dictionary({{kManagerEntitlement, Value::boolean(true)},
+                                 {"com.quorvel.developer.bexil.allowedplugins", identifierRule(kHello)}}));
     TestClient client;
     EXPECT_EQ(identifiers(client.replyTo(matchRequest())), (Ids{kHello}));
-    EXPECT_TRUE(bxd_.waitForLog("the host's plug-in entitlement does not allow this plug-in")) << bxd_.log();
+    expectLog("the host's plug-in entitlement does not allow this plug-in");
     EXPECT_EQ(identifiers(client.replyTo(matchRequest(std::nullopt, kDiscoverAll))).size(), 5u)
         << "every plug-in, also the one dedicated to another application";
 
@@ -116,29 +115,33 @@ TEST_F(DiscoveryTest, ClientInsideAnApplicationSeesThePlugInDedicatedToIt) {
     Outcome own = shell("'" + inside.string() + "'");
     EXPECT_EQ(own.status, 0) << own.err;
     EXPECT_NE(own.out.find(kNightTheme + "\n"), std::string::npos) << own.out;
-    EXPECT_TRUE(bxd_.waitForLog("is inside bundle " + plugIn("Greeter.app") + " (com.example.greeter)")) << bxd_.log();
-    // This test program, outside any bundle, has none.
-    TestClient().replyTo(matchRequest());
-    EXPECT_EQ(bxd_.countInLog("is inside bundle"), 1u) << bxd_.log();
+    expectLog("is inside bundle " + plugIn("Greeter.app") + " (com.example.greeter)");
 }
 
-// Guards the tool against the daemon: exclusions it writes to the preferences are read at the next match, even
-// under privileged discovery, and clearing them brings the plug-ins back; "match" prints a table with a heading,
-// identifiers and paths, or one line for nothing.
+// Guards the tool against the daemon: exclusions it writes to the preferences (and lists) are read at the next
+// match, even under privileged discovery; a refused --set keeps them, clearing them brings the plug-ins back;
+// "match" prints a table with a heading, identifiers and paths, or one line for nothing.
 TEST_F(DiscoveryTest, ToolExclusionsApplyToTheNextMatchAndMatchPrintsATable) {
     startWithExamples();
     grantSelfManager();
     TestClient client;
-    ASSERT_EQ(identifiers(client.replyTo(matchRequest())).size(), 4u);
+    EXPECT_NE(bexil("exclusions").out.find("no exclusions"), std::string::npos);
 
     Outcome add = bexil("exclusions --add RZExtensionIdentifier=" + kBonjour);
     ASSERT_EQ(add.status, 0) << add.err;
+    EXPECT_NE(bexil("--json exclusions").out.find("\"RZExtensionIdentifier\": \"" + kBonjour + "\""),
+              std::string::npos);
     EXPECT_EQ(identifiers(client.replyTo(matchRequest())), (Ids{kHello, kClipper, kStationery}));
     Ids all = identifiers(client.replyTo(matchRequest(std::nullopt, kDiscoverAll)));
     EXPECT_EQ(std::count(all.begin(), all.end(), kBonjour), 0) << "exclusions hold under discover-all";
-    EXPECT_TRUE(bxd_.waitForLog("globally excluded")) << bxd_.log();
+    expectLog("globally excluded");
 
+    fs::path bad = bxd_.root() / "bad.json";
+    std::ofstream(bad) << "{\"exclusions\": [\"not a rule\"]}";
+    EXPECT_EQ(bexil("exclusions --set " + bad.string()).status, 64);
+    EXPECT_EQ(identifiers(client.replyTo(matchRequest())).size(), 3u) << "a refused --set keeps the old rules";
     ASSERT_EQ(bexil("exclusions --clear").status, 0);
+    EXPECT_EQ(bexil("--json exclusions").out, "[]\n");
     EXPECT_EQ(identifiers(client.replyTo(matchRequest())).size(), 4u);
 
     Outcome run = bexil("match RZExtensionPointIdentifier=com.example.greeting");
@@ -187,9 +190,8 @@ TEST_F(DiscoveryTest, ReplacingPlugInIsLinkedToThePlugInItReplaces) {
     EXPECT_EQ(hello.get("overrider"), replacing.get("uuid"));
     EXPECT_EQ(replacing.get("overriding").stringView(), kHello);
     EXPECT_FALSE(replacing.contains("overrider"));
-    EXPECT_TRUE(bxd_.waitForLog("plug-in " + std::string(replacing.get("uuid").stringView()) + " overrides " +
-                                std::string(hello.get("uuid").stringView())))
-        << bxd_.log();
+    expectLog("plug-in " + std::string(replacing.get("uuid").stringView()) + " overrides " +
+              std::string(hello.get("uuid").stringView()));
 }
 
 }  // namespace

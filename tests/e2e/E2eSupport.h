@@ -150,6 +150,11 @@ class DaemonTest : public ::testing::Test {
         return bxd_.start(arguments);
     }
 
+    // Expects the daemon to log `text` within five seconds.
+    void expectLog(const std::string& text) const {
+        EXPECT_TRUE(bxd_.waitForLog(text)) << "no log line with: " << text << "\n" << bxd_.log();
+    }
+
     // Registers `paths` and expects success.
     void add(const std::vector<std::string>& paths) {
         Value reply = TestClient().replyTo(pathsRequest("add", paths));
@@ -182,7 +187,8 @@ class DaemonTest : public ::testing::Test {
     void grant(const std::filesystem::path& executable, const Value& entitlements, const std::string& name = "self") {
         std::filesystem::path file = bxd_.entitlementsDir() / (name + ".vrec");
         ASSERT_FALSE(Document::writeFileAtomically(
-            file, Value::dictionary({{"Executable", Value::string(executable.string())}, {"Entitlements", entitlements}})));
+            file,
+            Value::dictionary({{"Executable", Value::string(executable.string())}, {"Entitlements", entitlements}})));
         ASSERT_EQ(chmod(file.c_str(), 0644), 0);
     }
     void grantSelf(const Value& entitlements) { grant(std::filesystem::canonical("/proc/self/exe"), entitlements); }

@@ -89,12 +89,12 @@ TEST_F(RegistrationTest, AddRegistersPlugInsAndReAddKeepsTheirUuids) {
     std::optional<Uuid> helloUuid = registeredUuid(hello());
     ASSERT_TRUE(helloUuid && registeredUuid(plugIn("Greeter.app/PlugIns/NightTheme.bxplugin")) &&
                 registeredUuid(outside));
-    EXPECT_TRUE(bxd_.waitForLog("plug-in INSTALLED:com.example.greeter.hello")) << bxd_.log();
+    expectLog("plug-in INSTALLED:com.example.greeter.hello");
     add({hello()});
     EXPECT_EQ(registeredUuid(hello()), helloUuid);
 
     EXPECT_EQ(errorCode(TestClient().replyTo(request("bulk", {{"flags", Value::uint64(0x2a)}}))), 0);
-    EXPECT_TRUE(bxd_.waitForLog("bulk options 0x2a not supported")) << bxd_.log();
+    expectLog("bulk options 0x2a not supported");
 }
 
 // Guards the path checks of "add" with their codes and texts: a malformed list is code 4, a path that is not
@@ -116,7 +116,7 @@ TEST_F(RegistrationTest, BadPathsAreRefusedAndTheWalkStopsAtTheFirst) {
 
     std::string application = plugIn("Greeter.app");
     expectFailure(pathsRequest("add", {application}), 2, "unable to register plug-in at " + application);
-    EXPECT_TRUE(bxd_.waitForLog("failed to register plug-in at " + application));
+    expectLog("failed to register plug-in at " + application);
     EXPECT_EQ(bxd_.countInLog("Ledgerix failed to register the plug-in"), 0u) << "the database's text stays inside";
 }
 
@@ -128,9 +128,8 @@ TEST_F(RegistrationTest, RemoveNeedsTheEntitlementAndEndsThePlugInsInstancesAfte
     add({hello(), bonjour()});
     expectFailure(pathsRequest("remove", {"Hello.bxplugin"}), 9, "absolute path required: Hello.bxplugin");
     expectFailure(pathsRequest("remove", {hello()}), 11, "caller lacks entitlement for this operation");
-    EXPECT_TRUE(bxd_.waitForLog("refused request from pid=" + std::to_string(getpid()) + " to remove plug-in at " +
-                                hello() + " - client lacks required entitlement"))
-        << bxd_.log();
+    expectLog("refused request from pid=" + std::to_string(getpid()) + " to remove plug-in at " + hello() +
+              " - client lacks required entitlement");
     grantSelfManager();
     bxd_.stop();
     ASSERT_TRUE(start()) << bxd_.log();
@@ -144,11 +143,10 @@ TEST_F(RegistrationTest, RemoveNeedsTheEntitlementAndEndsThePlugInsInstancesAfte
     EXPECT_EQ(endingSignal(first, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
     EXPECT_EQ(endingSignal(second, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
     EXPECT_FALSE(recorded(kHello, first) || recorded(kHello, second));
-    const std::string lines[] = {"plug-in UNINSTALLED:" + kHello,
-                                 "requesting termination for " + kHello + "(1) jobard:1 " + helloUuid,
-                                 "one or more plug-ins have been terminated for uuid=" + helloUuid,
-                                 "removal complete for"};
-    for (const std::string& line : lines) EXPECT_TRUE(bxd_.waitForLog(line)) << line << "\n" << bxd_.log();
+    const std::string lines[] = {
+        "plug-in UNINSTALLED:" + kHello, "requesting termination for " + kHello + "(1) jobard:1 " + helloUuid,
+        "one or more plug-ins have been terminated for uuid=" + helloUuid, "removal complete for"};
+    for (const std::string& line : lines) expectLog(line);
     EXPECT_EQ(endingSignal(other, std::chrono::milliseconds(0)), -1);
     EXPECT_TRUE(recorded(kBonjour, other));
     EXPECT_EQ(bxd_.countInLog("requesting termination for " + kBonjour), 0u) << bxd_.log();
