@@ -296,7 +296,6 @@ TEST_F(AnnotationCrashTest, DocumentHoldsAWholeAcknowledgedOrInFlightChangeAfter
         seed = static_cast<unsigned>(std::strtoul(fixed, nullptr, 10));
     std::cout << "annotation crash seed " << seed << " (E2E_CRASH_SEED=" << seed
               << " kills at the same moments again)\n";
-    RecordProperty("seed", std::to_string(seed));
     std::mt19937 random(seed);
     std::uniform_int_distribution<int> runMs(0, 150);
     // Bonjour replaces the system clock, so its annotation is the clock's.
@@ -318,9 +317,7 @@ TEST_F(AnnotationCrashTest, DocumentHoldsAWholeAcknowledgedOrInFlightChangeAfter
     }
     if (!HasFailure()) restartAndCheckServed(kRounds);
     EXPECT_EQ(bxd_.countInLog("unable to load annotation database"), 0u) << bxd_.log();
-    int64_t changes = writers_[0].counter + writers_[1].counter;
-    std::cout << changes << " changes sent over " << kRounds << " kills\n";
-    EXPECT_GT(changes, int64_t{kRounds}) << "the clients hardly wrote anything";
+    EXPECT_GT(writers_[0].counter + writers_[1].counter, int64_t{kRounds}) << "the clients hardly wrote anything";
 }
 
 }  // namespace

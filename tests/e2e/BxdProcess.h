@@ -59,12 +59,6 @@ class BxdProcess {
     // Starts bxd through `command` from now on (a launcher that ends by executing the program and arguments that
     // follow it, such as a sandbox tool); stop() and running() then concern the launcher's process.
     void setLauncher(std::vector<std::string> command) { launcher_ = std::move(command); }
-    // Runs bxd to completion (for option errors) and returns its exit status; standard error goes to log().
-    int runToExit(const std::vector<std::string>& arguments) {
-        int status = 0;
-        waitpid(spawn(arguments), &status, 0);
-        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    }
     // Sends `signal` and waits for the process; returns the wait status.
     int stop(int signal = SIGTERM) {
         if (pid_ <= 0) return -1;

@@ -83,11 +83,21 @@ TEST_F(DiscoveryTest, MatchSelectsVisiblePlugInsByRulesAndRefusesMalformedReques
     EXPECT_FALSE(old.contains("matches")) << old.description();
 }
 
-// Guards privileged discovery: refused without the manager entitlement and to an entitled program in another user
-// namespace (sandboxed); granted, it skips the visibility checks and the host's rule set, which otherwise restricts
-// what an entitled host sees. Unknown flag bits are ignored.
-TEST_F(DiscoveryTest, DiscoverAllNeedsTheManagerEntitlementAndNoSandboxAndSkipsHostPolicy) {
+// Guards who sees what: a client inside an application (found from its executable) sees the plug-in dedicated to
+// it, which other clients do not (the policy's other cases: PolicyBundlesTest); privileged discovery is refused
+// without the manager entitlement and to an entitled program in another user namespace (sandboxed); granted, it
+// skips the visibility checks and the host's rule set, which otherwise restricts what an entitled host sees.
+// Unknown flag bits are ignored.
+TEST_F(DiscoveryTest, DedicatedPlugInsAndPrivilegedDiscoveryAreSeenOnlyByTheirClients) {
     startWithExamples();
+    fs::path inside = bundles_ / "Greeter.app" / "greeter";
+    fs::remove(inside);
+    fs::copy_file(kMatchClient, inside);
+    Outcome own = shell("'" + inside.string() + "'");
+    EXPECT_EQ(own.status, 0) << own.err;
+    EXPECT_NE(own.out.find(kNightTheme + "\n"), std::string::npos) << own.out;
+    expectLog("is inside bundle " + plugIn("Greeter.app") + " (com.example.greeter)");
+
     expectFailure(matchRequest(std::nullopt, kDiscoverAll), 11, "unauthorized discovery flag (BXDiscoverAll)");
     EXPECT_EQ(identifiers(TestClient().replyTo(matchRequest(std::nullopt, 0x10000))).size(), 4u);
     grantSelf(Value::dictionary({{kManagerEntitlement, Value::boolean(true)},
@@ -102,20 +112,6 @@ TEST_F(DiscoveryTest, DiscoverAllNeedsTheManagerEntitlementAndNoSandboxAndSkipsH
     Outcome sandboxed = shell("unshare --user '" + kMatchClient.string() + "' 0x200");
     EXPECT_EQ(sandboxed.status, 1) << sandboxed.out << sandboxed.err;
     EXPECT_EQ(sandboxed.out, "error 11: unauthorized discovery flag (BXDiscoverAll)\n");
-}
-
-// Guards how the daemon finds a client's application from its executable and that a dedicated plug-in is shown
-// to that application only (the policy's other cases: PolicyBundlesTest).
-TEST_F(DiscoveryTest, ClientInsideAnApplicationSeesThePlugInDedicatedToIt) {
-    startWithExamples();
-    fs::path inside = bundles_ / "Greeter.app" / "greeter";
-    fs::remove(inside);
-    fs::copy_file(kMatchClient, inside);
-    fs::permissions(inside, fs::perms::owner_all);
-    Outcome own = shell("'" + inside.string() + "'");
-    EXPECT_EQ(own.status, 0) << own.err;
-    EXPECT_NE(own.out.find(kNightTheme + "\n"), std::string::npos) << own.out;
-    expectLog("is inside bundle " + plugIn("Greeter.app") + " (com.example.greeter)");
 }
 
 // Guards the tool against the daemon: exclusions it writes to the preferences (and lists) are read at the next
