@@ -2,8 +2,11 @@
 // request envelope, and peers that misbehave.
 
 #include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 
 #include <array>
+#include <cstring>
 
 #include "E2eSupport.h"
 #include "platform/zem/ZemCodec.h"
