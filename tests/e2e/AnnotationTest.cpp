@@ -40,7 +40,6 @@ class AnnotationTest : public DaemonTest {
     void SetUp() override {
         copyExamples({"Greeter.app"});
         ASSERT_TRUE(start()) << bxd_.log();
-        client_ = std::make_unique<TestClient>();
         add({plugIn("Greeter.app/PlugIns/Hello.bxplugin"), plugIn("Greeter.app/PlugIns/Bonjour.bxplugin")});
         hello_ = registeredUuid(plugIn("Greeter.app/PlugIns/Hello.bxplugin")).value_or(Uuid());
         bonjour_ = registeredUuid(plugIn("Greeter.app/PlugIns/Bonjour.bxplugin")).value_or(Uuid());
@@ -59,7 +58,6 @@ class AnnotationTest : public DaemonTest {
         return SystemNotifications(bxd_.root() / "runtime" / "notify").state("com.quorvel.bexil.annotation-change");
     }
 
-    std::unique_ptr<TestClient> client_;
     Uuid hello_;
     Uuid bonjour_;
 };
@@ -68,18 +66,14 @@ class AnnotationTest : public DaemonTest {
 // posts one notification per request; a request without known keys (or without the plug-in list it then does not
 // need) succeeds and touches nothing.
 TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
-    EXPECT_EQ(
-        errorCode(client_->replyTo(request("annotate", {{"annotations", Value::dictionary({{"x", election(1)}})}}))),
-        0);
-    EXPECT_EQ(errorCode(client_->replyTo(annotateRequest(Value::emptyDictionary(), {hello_}))), 0);
+    succeed(request("annotate", {{"annotations", Value::dictionary({{"x", election(1)}})}}));
+    succeed(annotateRequest(Value::emptyDictionary(), {hello_}));
     EXPECT_EQ(notifications(), 0u);
     EXPECT_EQ(bxd_.countInLog("annotation change"), 0u);
 
     Value extension = Value::dictionary({{"colour", Value::string("blue")}});
-    Value first = client_->replyTo(annotateRequest(Value::dictionary({{"extension", extension}}), {hello_}));
-    ASSERT_EQ(errorCode(first), 0) << errorText(first);
-    EXPECT_FALSE(first.contains("error"));
-    ASSERT_EQ(errorCode(client_->replyTo(annotateRequest(election(0), {hello_, bonjour_}))), 0);
+    succeed(annotateRequest(Value::dictionary({{"extension", extension}}), {hello_}));
+    succeed(annotateRequest(election(0), {hello_, bonjour_}));
     EXPECT_EQ(notifications(), 2u) << "one post for each request, not one per plug-in";
     EXPECT_EQ(stored(kHelloKey), Value::dictionary({{"election", Value::int64(0)}, {"extension", extension}}));
     EXPECT_EQ(stored(kBonjourKey), election(0));
@@ -97,14 +91,10 @@ TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
 // an empty map), and its log lines.
 TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
     Value old = Value::dictionary({{"old", Value::boolean(true)}, {"shared", Value::int64(1)}});
-    ASSERT_EQ(errorCode(client_->replyTo(
-                  annotateRequest(Value::dictionary({{"election", Value::int64(1)}, {"extension", old}}), {hello_}))),
-              0);
+    succeed(annotateRequest(Value::dictionary({{"election", Value::int64(1)}, {"extension", old}}), {hello_}));
     Value replacement = Value::dictionary({{"shared", Value::int64(2)}});
     Value bonjourData = Value::dictionary({{"nested", Value::array({Value::string("a"), Value::real(1.5)})}});
-    Value reply = client_->replyTo(
-        bulkRequest(Value::dictionary({{hello_.string(), replacement}, {bonjour_.string(), bonjourData}})));
-    ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
+    succeed(bulkRequest(Value::dictionary({{hello_.string(), replacement}, {bonjour_.string(), bonjourData}})));
     EXPECT_EQ(notifications(), 2u);
     EXPECT_EQ(stored(kHelloKey), Value::dictionary({{"election", Value::int64(1)}, {"extension", replacement}}));
     EXPECT_EQ(stored(kBonjourKey), Value::dictionary({{"extension", bonjourData}}));
@@ -112,7 +102,7 @@ TEST_F(AnnotationTest, BulkReplacesClientDataAndKeepsTheElection) {
     expectLog("client " + std::to_string(getpid()) + " bulk plug-in " + kHelloKey + "(" + hello_.string() +
               ") annotation change: ");
 
-    EXPECT_EQ(errorCode(client_->replyTo(bulkRequest(Value::emptyDictionary()))), 0);
+    succeed(bulkRequest(Value::emptyDictionary()));
     EXPECT_EQ(notifications(), 3u) << "an empty bulk change is posted too";
 }
 
@@ -159,17 +149,15 @@ TEST_F(AnnotationTest, MalformedRequestsAreRefusedAndPartialFailuresPostNothing)
 // Guards the frame limit on the reply side: annotations that fit one request each but together make a discovery
 // reply larger than a frame give an error reply, and the connection stays usable.
 TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
-    std::string bulk(9u << 20, 'x');
-    for (const Uuid& uuid : {hello_, bonjour_}) {
-        Value extension = Value::dictionary({{"bulk", Value::string(bulk)}});
-        ASSERT_EQ(errorCode(client_->replyTo(annotateRequest(Value::dictionary({{"extension", extension}}), {uuid}))),
-                  0);
-    }
-    Value reply = client_->replyTo(matchRequest());
+    Value extension = Value::dictionary({{"bulk", Value::string(std::string(9u << 20, 'x'))}});
+    for (const Uuid& uuid : {hello_, bonjour_})
+        succeed(annotateRequest(Value::dictionary({{"extension", extension}}), {uuid}));
+    TestClient client;
+    Value reply = client.replyTo(matchRequest());
     EXPECT_EQ(errorCode(reply), 4);
     EXPECT_NE(errorText(reply).find("exceeds the frame limit"), std::string::npos) << errorText(reply);
     expectLog("exceeds the frame limit of");
-    EXPECT_EQ(errorCode(client_->replyTo(matchRequest(identifierRule("none")))), 0);
+    EXPECT_EQ(errorCode(client.replyTo(matchRequest(identifierRule("none")))), 0) << "the connection stays usable";
 }
 
 // Guards the tool's annotation subcommands against the real daemon: elect, annotate with a JSON file, unelect,

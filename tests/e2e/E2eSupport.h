@@ -155,11 +155,14 @@ class DaemonTest : public ::testing::Test {
         EXPECT_TRUE(bxd_.waitForLog(text)) << "no log line with: " << text << "\n" << bxd_.log();
     }
 
-    // Registers `paths` and expects success.
-    void add(const std::vector<std::string>& paths) {
-        Value reply = TestClient().replyTo(pathsRequest("add", paths));
-        ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    // Sends `message` on a new connection, expects a reply without error and returns it.
+    Value succeed(const Value& message) const {
+        Value reply = TestClient().replyTo(message);
+        EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+        EXPECT_FALSE(reply.contains("error")) << reply.description();
+        return reply;
     }
+    void add(const std::vector<std::string>& paths) const { succeed(pathsRequest("add", paths)); }
 
     // Sends `message` on a new connection and expects the failure `code` with `text`, and no other key.
     void expectFailure(const Value& message, int64_t code, const std::string& text) {
