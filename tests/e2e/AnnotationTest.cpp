@@ -1,7 +1,6 @@
-// Changing plug-in annotations through the real daemon: "annotate" and "bulk-annotate" as a client sees them, the
-// annotation document the daemon writes, the change notification it posts (observing it from another process:
-// SystemNotificationsTest), the bexil tool's annotation subcommands, and the document surviving the daemon being
-// killed at any moment.
+// Plug-in annotations through the real daemon: "annotate" and "bulk-annotate", the document written, the change
+// notification posted (observed from another process: SystemNotificationsTest), the tool's annotation subcommands,
+// and the document surviving the daemon being killed at any moment.
 
 #include <gtest/gtest.h>
 
@@ -78,9 +77,8 @@ TEST_F(AnnotationTest, ElectionForSeveralPlugInsIsMergedLoggedAndNotifiedOnce) {
     EXPECT_EQ(stored(kHelloKey), Value::dictionary({{"election", Value::int64(0)}, {"extension", extension}}));
     EXPECT_EQ(stored(kBonjourKey), election(0));
 
-    std::string pid = std::to_string(getpid());
     for (const auto& [key, uuid] : {std::pair{kHelloKey, hello_}, std::pair{"com.example.greeter.bonjour", bonjour_}}) {
-        std::string who = "client " + pid + " plug-in " + key + "(" + uuid.string() + ")";
+        std::string who = "client " + std::to_string(getpid()) + " plug-in " + key + "(" + uuid.string() + ")";
         expectLog(who + " election := 0");
         expectLog(who + " annotation change: ");
     }

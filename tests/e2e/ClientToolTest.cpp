@@ -65,8 +65,8 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path prefix = bxd_.root() / "prefix", work = bxd_.root() / "example";
     fs::create_directories(work);
-    fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples/client/list-plugins.cpp", work);
-    fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples/client/Makefile", work);
+    for (const char* file : {"list-plugins.cpp", "Makefile"})
+        fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples/client" / file, work);
     Outcome install =
         shell("cmake --install '" + std::string(BEXIL_BINARY_DIR) + "' --prefix '" + prefix.string() + "'");
     ASSERT_EQ(install.status, 0) << install.err;

@@ -15,10 +15,7 @@
 namespace bexil {
 namespace {
 
-using test::BxdProcess;
-using test::errorCode;
-using test::errorText;
-using test::TestClient;
+using namespace test;
 
 // A request named `name` whose version field is `version` (none: the key is absent).
 Value versioned(std::string_view name, std::optional<Value> version) {
@@ -27,7 +24,7 @@ Value versioned(std::string_view name, std::optional<Value> version) {
     if (version) d.set("version", *version);
     return d.take();
 }
-const Value kBogus = test::request("bogus");
+const Value kBogus = request("bogus");
 
 // A raw stream socket to the daemon, for bytes that no well-behaved client would send.
 class RawSocket {
@@ -114,8 +111,7 @@ TEST(BxdService, ASecondDaemonOnTheSameNameFailsAndAStaleSocketIsReplaced) {
     first.exportEnvironment();
     const std::string bxd = "'" + BxdProcess::binary().string() + "' 2>/dev/null";
     int status = std::system(bxd.c_str());
-    ASSERT_TRUE(WIFEXITED(status));
-    EXPECT_EQ(WEXITSTATUS(status), 1);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 1) << status;
     EXPECT_EQ(errorCode(TestClient().replyTo(kBogus)), 4) << "the first daemon still serves";
 
     first.stop(SIGKILL);
@@ -159,14 +155,14 @@ TEST(BxdService, FirstConnectionStartsBxdOnTheActivatedSocket) {
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
     kill(activator, SIGTERM);
     waitpid(activator, nullptr, 0);
-    EXPECT_NE(test::slurp(log).find("listening on service com.quorvel.bexil.bxd (socket passed by systemd)"),
+    EXPECT_NE(slurp(log).find("listening on service com.quorvel.bexil.bxd (socket passed by systemd)"),
               std::string::npos)
-        << test::slurp(log);
+        << slurp(log);
 }
 
 // ---- the request envelope ----
 
-class BxdEnvelope : public test::DaemonTest {
+class BxdEnvelope : public DaemonTest {
   protected:
     void SetUp() override { ASSERT_TRUE(start()) << bxd_.log(); }
 };
@@ -187,9 +183,9 @@ TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
                       std::string("unsupported protocol version ") + named + " (current 3)");
 
     expectFailure(Value::dictionary({{"version", Value::uint64(3)}}), 4, "invalid request format (missing type)");
-    for (const char* name : {"Add", ""}) expectFailure(test::request(name), 4, "unrecognized request");
+    for (const char* name : {"Add", ""}) expectFailure(request(name), 4, "unrecognized request");
     for (const char* name : {"ready", "access", "lock"})
-        expectFailure(test::request(name), 4, std::string("the \"") + name + "\" operation is not available yet");
+        expectFailure(request(name), 4, std::string("the \"") + name + "\" operation is not available yet");
 }
 
 // Guards the per-client request counter: the line comes at the 1000th request, not before.

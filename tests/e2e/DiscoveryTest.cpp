@@ -3,8 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-
 #include "E2eSupport.h"
 
 namespace bexil {
@@ -86,8 +84,7 @@ TEST_F(DiscoveryTest, MatchSelectsVisiblePlugInsByRulesAndRefusesMalformedReques
 TEST_F(DiscoveryTest, DedicatedPlugInsAndPrivilegedDiscoveryAreSeenOnlyByTheirClients) {
     startWithExamples();
     fs::path inside = bundles_ / "Greeter.app" / "greeter";
-    fs::remove(inside);
-    fs::copy_file(kMatchClient, inside);
+    fs::copy_file(kMatchClient, inside, fs::copy_options::overwrite_existing);
     Outcome own = shell("'" + inside.string() + "'");
     EXPECT_EQ(own.status, 0) << own.err;
     EXPECT_NE(own.out.find(kNightTheme + "\n"), std::string::npos) << own.out;
@@ -118,13 +115,12 @@ TEST_F(DiscoveryTest, ToolExclusionsApplyToTheNextMatchAndMatchPrintsATable) {
     TestClient client;
     EXPECT_NE(bexil("exclusions").out.find("no exclusions"), std::string::npos);
 
-    Outcome add = bexil("exclusions --add RZExtensionIdentifier=" + kBonjour);
-    ASSERT_EQ(add.status, 0) << add.err;
+    ASSERT_EQ(bexil("exclusions --add RZExtensionIdentifier=" + kBonjour).status, 0);
     EXPECT_NE(bexil("--json exclusions").out.find("\"RZExtensionIdentifier\": \"" + kBonjour + "\""),
               std::string::npos);
     EXPECT_EQ(identifiers(client.replyTo(matchRequest())), (Ids{kHello, kClipper, kStationery}));
-    Ids all = identifiers(client.replyTo(matchRequest(std::nullopt, kDiscoverAll)));
-    EXPECT_EQ(std::count(all.begin(), all.end(), kBonjour), 0) << "exclusions hold under discover-all";
+    EXPECT_EQ(identifiers(client.replyTo(matchRequest(std::nullopt, kDiscoverAll))).size(), 4u)
+        << "exclusions hold under discover-all";
     expectLog("globally excluded");
 
     fs::path bad = bxd_.root() / "bad.json";

@@ -1,7 +1,7 @@
 // System plug-ins through the real daemon. The daemon runs inside a private root made by bubblewrap, where a
-// temporary directory of the test is mounted at /System (and another at /SystemX), so nothing is ever created at
-// the real machine's /System. The private root sees the test's temporary root and the build tree at their own
-// paths, and shares the process ids with the test, so clients outside talk to it as to any daemon.
+// temporary directory of the test is mounted at /System (and its bundles directory below /SystemX), so nothing is
+// ever created at the real machine's /System. The private root sees the test's temporary root and the build tree at
+// their own paths, and shares the process ids with the test, so clients outside talk to it as to any daemon.
 
 #include <gtest/gtest.h>
 
@@ -52,19 +52,18 @@ class SystemPlugInTest : public DaemonTest {
         if (made.status != 0) GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << made.err;
         bxd_.setLauncher(std::move(launcher));
         ASSERT_TRUE(start()) << bxd_.log();
-        client_ = std::make_unique<TestClient>();
     }
 
     // The forms of every registered instance of the clock, keyed by path.
     std::map<std::string, Value> clockInstances() {
-        Value reply = client_->replyTo(matchRequest(identifierRule(kClock), kAllVersions | kAllInstances));
+        Value reply = TestClient().replyTo(matchRequest(identifierRule(kClock), kAllVersions | kAllInstances));
         std::map<std::string, Value> forms;
         for (const Value& form : reply.get("matches").items()) forms[std::string(form.get("path").stringView())] = form;
         return forms;
     }
     // The path of the one clock a client gets without flags.
     std::string servedClock() {
-        std::vector<Value> forms = formsOf(client_->replyTo(matchRequest(identifierRule(kClock))), kClock);
+        std::vector<Value> forms = formsOf(TestClient().replyTo(matchRequest(identifierRule(kClock))), kClock);
         EXPECT_EQ(forms.size(), 1u);
         return forms.empty() ? std::string() : std::string(forms[0].get("path").stringView());
     }
@@ -95,7 +94,6 @@ class SystemPlugInTest : public DaemonTest {
         FAIL() << "could not register the clocks within one second";
     }
 
-    std::unique_ptr<TestClient> client_;
     fs::path system_;
     int builds_ = 0;
 };
@@ -109,11 +107,11 @@ TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplication
     add({kSystemClock, plugIn("Greeter.app/PlugIns/Hello.bxplugin"),
          "/SystemX/Library/PlugIns/OutsideApplication.bxplugin", "/System/Library/PlugIns/Planted.bxplugin"});
 
-    Value all = client_->replyTo(matchRequest());
+    Value all = TestClient().replyTo(matchRequest());
     EXPECT_EQ(identifiers(all), (Ids{kHello, kClock})) << all.description();
     // The system plug-in asks for automatic election, which its first look-up made.
     EXPECT_EQ(formsOf(all, kClock).at(0).get("annotations"), Value::dictionary({{"election", Value::int64(1)}}));
-    EXPECT_EQ(identifiers(client_->replyTo(matchRequest(std::nullopt, kSystemOnly))), (Ids{kClock}));
+    EXPECT_EQ(identifiers(TestClient().replyTo(matchRequest(std::nullopt, kSystemOnly))), (Ids{kClock}));
     grantSelfManager();
     TestClient manager;  // entitlements are read when a client connects
     EXPECT_EQ(identifiers(manager.replyTo(matchRequest(std::nullopt, kSystemOnly | kDiscoverAll))),
