@@ -144,8 +144,7 @@ TEST_F(DiscoveryTest, ToolExclusionsApplyToTheNextMatchAndMatchPrintsATable) {
 // to the later registration; only all versions together with all instances gives every copy.
 TEST_F(DiscoveryTest, BestVersionWinsAndEqualVersionsGoToTheLaterRegistration) {
     startWithExamples();
-    // Registration times are whole seconds; the copies must be registered in a later one.
-    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    sleepToNextSecond();  // the copies are registered later than the examples
     std::string again = helloCopy("HelloAgain", "1.2");
     add({again, helloCopy("HelloNext", "1.10")});
     TestClient client;

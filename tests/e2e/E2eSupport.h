@@ -113,6 +113,12 @@ inline std::vector<Value> formsOf(const Value& reply, const std::string& identif
     return forms;
 }
 
+// Sleeps past the next whole second, so what is registered next has a later (whole-second) registration time.
+inline void sleepToNextSecond() {
+    auto now = std::chrono::system_clock::now().time_since_epoch();
+    std::this_thread::sleep_for(std::chrono::ceil<std::chrono::seconds>(now) + std::chrono::milliseconds(5) - now);
+}
+
 inline std::string slurp(const std::filesystem::path& path) {
     std::ifstream in(path);
     return std::string(std::istreambuf_iterator<char>(in), {});

@@ -5,8 +5,6 @@
 #include <gtest/gtest.h>
 #include <sys/prctl.h>
 
-#include <csignal>
-
 #include "E2eSupport.h"
 #include "platform/jobard/RunningInstances.h"
 

@@ -83,9 +83,7 @@ class SystemPlugInTest : public DaemonTest {
     void addWithinOneSecond(const std::vector<fs::path>& bundles, const std::vector<std::string>& paths) {
         for (int attempt = 0; attempt < 3; ++attempt) {
             for (const fs::path& bundle : bundles) rebuild(bundle);
-            auto now = std::chrono::system_clock::now().time_since_epoch();
-            auto next = std::chrono::ceil<std::chrono::seconds>(now) + std::chrono::milliseconds(5);
-            std::this_thread::sleep_for(next - now);
+            sleepToNextSecond();
             add(paths);
             std::set<int64_t> times;
             for (const auto& [path, form] : clockInstances()) times.insert(*form.get("lastmodified").numberAsInt64());
@@ -144,7 +142,7 @@ TEST_F(SystemPlugInTest, SameVersionGoesToTheSystemPlugInUnlessTheApplicationsIs
     EXPECT_EQ(servedClock(), kSystemClock);
 
     // The system's met first, the application's registered a second later: the later registration wins.
-    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    sleepToNextSecond();
     rebuild(appClock);
     add({appClock.string()});
     both = clockInstances();
