@@ -1,58 +1,99 @@
 #pragma once
 
-// Shorthands the end-to-end tests share: the error fields of a reply, the example bundles in a test's own
-// directory, and what the daemon's registry holds.
+// What the end-to-end tests share: a client connection, request builders, the error fields of a reply, and a
+// fixture with a private daemon, copies of the example bundles and the usual requests.
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 
 #include <algorithm>
-#include <cstdint>
+#include <chrono>
+#include <cstdlib>
 #include <filesystem>
+#include <fstream>
+#include <future>
+#include <iterator>
+#include <memory>
 #include <optional>
 #include <string>
-#include <utility>
+#include <variant>
 #include <vector>
 
+#include "BxdProcess.h"
+#include "base/Document.h"
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
 #include "base/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
+#include "platform/zem/ZemConnection.h"
 
 namespace bexil::test {
+
+// A client connection with its own loop and queue, and a blocking round trip with a time limit.
+class TestClient {
+  public:
+    using Reply = std::variant<Value, ZemError>;
+
+    explicit TestClient(const std::string& service = "com.quorvel.bexil.bxd")
+        : loop_(1), queue_("test-client", loop_), connection_(ZemConnection::createClient(service, queue_)) {
+        connection_->setEventHandler([](const ZemConnection::Event&) {});
+        connection_->resume();
+    }
+    ~TestClient() { connection_->cancel(); }
+
+    // The reply, or the connection error in its place (ConnectionInvalid when none came within `timeout`).
+    Reply roundTrip(const Value& message, std::chrono::seconds timeout = std::chrono::seconds(10)) {
+        auto promise = std::make_shared<std::promise<Reply>>();
+        auto future = promise->get_future();
+        connection_->sendWithReply(message, queue_, [promise](const Reply& reply) { promise->set_value(reply); });
+        if (future.wait_for(timeout) != std::future_status::ready) return ZemError(ZemError::Kind::ConnectionInvalid);
+        return future.get();
+    }
+    // The reply dictionary; a connection error fails the test and gives a null Value.
+    Value replyTo(const Value& message) {
+        Reply reply = roundTrip(message);
+        EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
+        return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
+    }
+
+  private:
+    EventLoop loop_;
+    SerialQueue queue_;
+    std::shared_ptr<ZemConnection> connection_;
+};
+
+inline const std::filesystem::path kExamples = std::filesystem::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
+inline constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
+inline constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
+inline const std::filesystem::path kMatchClient = std::filesystem::path(BEXIL_BINARY_DIR) / "tests/bx_match_client";
 
 // A reply's error code, 0 when it has none.
 inline int64_t errorCode(const Value& reply) { return reply.get("errorcode").numberAsInt64().value_or(0); }
 inline std::string errorText(const Value& reply) { return std::string(reply.get("error").stringView()); }
 
-// Copies the example Greeter application into bundles/ under `root`; returns that directory, canonical.
-inline std::filesystem::path copyExampleGreeter(const std::filesystem::path& root) {
-    namespace fs = std::filesystem;
-    fs::path bundles = root / "bundles";
-    fs::create_directories(bundles);
-    fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles" / "Greeter.app", bundles / "Greeter.app",
-             fs::copy_options::recursive);
-    return fs::canonical(bundles);
+// A request of the current protocol version named `name`, with `fields` beside the envelope.
+inline Value request(std::string_view name, std::vector<std::pair<std::string, Value>> fields = {}) {
+    fields.emplace_back("request", Value::string(name));
+    fields.emplace_back("version", Value::uint64(3));
+    return Value::dictionary(std::move(fields));
 }
-
-// The UUID under which the registry in `stateDirectory` holds the bundle at `path`, read from its store.
-inline std::optional<Uuid> registeredUuid(const std::filesystem::path& stateDirectory, const std::string& path) {
-    LedgerixWorkspace::Options options;
-    options.stateDirectory = stateDirectory;
-    auto registry = LedgerixWorkspace::open(options);
-    if (!registry) {
-        ADD_FAILURE() << registry.error().description();
-        return std::nullopt;
-    }
-    auto proxy = (*registry)->pluginProxyForURL(path);
-    return proxy ? proxy->pluginUUID() : std::nullopt;
+inline Value pathsRequest(std::string_view name, const std::vector<std::string>& paths) {
+    std::vector<Value> values;
+    for (const std::string& path : paths) values.push_back(Value::string(path));
+    return request(name, {{"paths", Value::array(std::move(values))}});
 }
 
 // A "match" request with the given rules (none: the key is absent) and flag word (0: the key is absent).
-inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0, uint64_t version = 3) {
-    std::vector<std::pair<std::string, Value>> entries = {{"request", Value::string("match")},
-                                                          {"version", Value::uint64(version)}};
-    if (rules) entries.emplace_back("rules", *rules);
-    if (flags) entries.emplace_back("flags", Value::uint64(flags));
-    return Value::dictionary(std::move(entries));
+inline Value matchRequest(std::optional<Value> rules = std::nullopt, uint64_t flags = 0) {
+    std::vector<std::pair<std::string, Value>> fields;
+    if (rules) fields.emplace_back("rules", *rules);
+    if (flags) fields.emplace_back("flags", Value::uint64(flags));
+    return request("match", std::move(fields));
+}
+inline Value identifierRule(const std::string& identifier) {
+    return Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}});
 }
 
 using Ids = std::vector<std::string>;
@@ -64,5 +105,116 @@ inline Ids identifiers(const Value& reply) {
     std::sort(ids.begin(), ids.end());
     return ids;
 }
+// The forms of a discovery reply whose identifier is `identifier`.
+inline std::vector<Value> formsOf(const Value& reply, const std::string& identifier) {
+    std::vector<Value> forms;
+    for (const Value& form : reply.get("matches").items())
+        if (form.get("identifier").stringView() == identifier) forms.push_back(form);
+    return forms;
+}
+
+// Sleeps past the next whole second, so what is registered next has a later (whole-second) registration time.
+inline void sleepToNextSecond() {
+    auto now = std::chrono::system_clock::now().time_since_epoch();
+    std::this_thread::sleep_for(std::chrono::ceil<std::chrono::seconds>(now) + std::chrono::milliseconds(5) - now);
+}
+
+inline std::string slurp(const std::filesystem::path& path) {
+    std::ifstream in(path);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+struct Outcome {
+    int status = -1;
+    std::string out, err;
+};
+
+// A private daemon (not started yet) with its own preferences directory exported to this process, so the tool
+// and the daemon agree on it, plus the bundles, entitlements and requests most end-to-end tests need.
+class DaemonTest : public ::testing::Test {
+  protected:
+    DaemonTest() {
+        std::filesystem::create_directories(preferences());
+        setenv("BX_PREFERENCES_DIR", preferences().c_str(), 1);
+        bxd_.exportEnvironment();
+    }
+
+    std::filesystem::path preferences() const { return bxd_.root() / "preferences"; }
+    std::filesystem::path document() const { return bxd_.root() / "annotations.vrec"; }
+
+    // Copies the named example bundles into bundles/ under the daemon's root (made canonical).
+    void copyExamples(std::initializer_list<const char*> names) {
+        std::filesystem::create_directories(bxd_.root() / "bundles");
+        bundles_ = std::filesystem::canonical(bxd_.root() / "bundles");
+        for (const char* name : names)
+            std::filesystem::copy(kExamples / name, bundles_ / name, std::filesystem::copy_options::recursive);
+    }
+    std::string plugIn(const std::string& relative) const { return (bundles_ / relative).string(); }
+
+    bool start(std::vector<std::string> arguments = {}) {
+        arguments.insert(arguments.begin(), {"-d", document().string()});
+        return bxd_.start(arguments);
+    }
+
+    // Expects the daemon to log `text` within five seconds.
+    void expectLog(const std::string& text) const {
+        EXPECT_TRUE(bxd_.waitForLog(text)) << "no log line with: " << text << "\n" << bxd_.log();
+    }
+
+    // Sends `message` on a new connection, expects a reply without error and returns it.
+    Value succeed(const Value& message) const {
+        Value reply = TestClient().replyTo(message);
+        EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+        EXPECT_FALSE(reply.contains("error")) << reply.description();
+        return reply;
+    }
+    void add(const std::vector<std::string>& paths) const { succeed(pathsRequest("add", paths)); }
+
+    // Sends `message` on a new connection and expects the failure `code` with `text`, and no other key.
+    void expectFailure(const Value& message, int64_t code, const std::string& text) {
+        Value reply = TestClient().replyTo(message);
+        EXPECT_EQ(errorCode(reply), code) << text;
+        EXPECT_EQ(errorText(reply), text);
+        EXPECT_EQ(reply.count(), 2u) << reply.description();
+    }
+
+    // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
+    std::optional<Uuid> registeredUuid(const std::string& path) const {
+        LedgerixWorkspace::Options options;
+        options.stateDirectory = bxd_.root() / "state";
+        auto registry = LedgerixWorkspace::open(options);
+        if (!registry) {
+            ADD_FAILURE() << registry.error().description();
+            return std::nullopt;
+        }
+        auto proxy = (*registry)->pluginProxyForURL(path);
+        return proxy ? proxy->pluginUUID() : std::nullopt;
+    }
+
+    // Gives `executable` entitlements through the daemon's trusted entitlements directory; they are read when a
+    // client connects.
+    void grant(const std::filesystem::path& executable, const Value& entitlements, const std::string& name = "self") {
+        std::filesystem::path file = bxd_.entitlementsDir() / (name + ".vrec");
+        ASSERT_FALSE(Document::writeFileAtomically(
+            file,
+            Value::dictionary({{"Executable", Value::string(executable.string())}, {"Entitlements", entitlements}})));
+        ASSERT_EQ(chmod(file.c_str(), 0644), 0);
+    }
+    void grantSelf(const Value& entitlements) { grant(std::filesystem::canonical("/proc/self/exe"), entitlements); }
+    void grantSelfManager() { grantSelf(Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})); }
+
+    // Runs a shell command line with this process's environment; standard output and error are kept apart.
+    Outcome shell(const std::string& command) const {
+        std::filesystem::path out = bxd_.root() / "out.txt", err = bxd_.root() / "err.txt";
+        int raw = std::system((command + " >'" + out.string() + "' 2>'" + err.string() + "'").c_str());
+        return {WIFEXITED(raw) ? WEXITSTATUS(raw) : -1, slurp(out), slurp(err)};
+    }
+    Outcome bexil(const std::string& arguments) const {
+        return shell("timeout 60 '" BEXIL_BINARY_DIR "/tools/bexil/bexil' " + arguments);
+    }
+
+    BxdProcess bxd_;
+    std::filesystem::path bundles_;
+};
 
 }  // namespace bexil::test

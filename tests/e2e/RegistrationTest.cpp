@@ -1,256 +1,153 @@
-// Registering and unregistering plug-in bundles through the real daemon: "add", "remove", "bulk" as a client sees
-// them, checked against the registry the daemon keeps in its state directory.
+// "add", "remove" and "bulk" through the real daemon, checked against the registry in its state directory, and the
+// running instances (real child processes) of a removed plug-in ended. Path forms, re-registration (a changed build
+// is an uninstall, as for "remove"), bad bundles and bundles gone from disk are LedgerixTest's.
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <sys/stat.h>
+#include <sys/prctl.h>
 
-#include <filesystem>
-#include <fstream>
-#include <future>
-#include <variant>
-
-#include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "TestClient.h"
-#include "base/Document.h"
-#include "base/EventLoop.h"
-#include "base/SerialQueue.h"
-#include "platform/ledgerix/LXBexilProxy.h"
-#include "platform/ledgerix/LedgerixWorkspace.h"
-#include "platform/zem/ZemConnection.h"
+#include "platform/jobard/RunningInstances.h"
 
 namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using test::BxdProcess;
-using test::errorCode;
-using test::errorText;
+using namespace test;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
-constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
+const std::string kHello = "com.example.greeter.hello";
+const std::string kBonjour = "com.example.greeter.bonjour";
 
-using test::TestClient;
-
-Value pathsRequest(const char* name, std::vector<Value> paths) {
-    return Value::dictionary(
-        {{"request", Value::string(name)}, {"version", Value::uint64(3)}, {"paths", Value::array(std::move(paths))}});
+// A stand-in for a running plug-in: a child that sleeps until it is signalled, lets go of the test's output and
+// dies with the test however the test ends.
+pid_t startInstance() {
+    pid_t parent = getpid();
+    pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (getppid() != parent) _exit(0);
+        int devnull = open("/dev/null", O_RDWR);
+        dup2(devnull, STDOUT_FILENO);
+        dup2(devnull, STDERR_FILENO);
+        for (;;) pause();
+    }
+    return child;
 }
-Value pathsRequest(const char* name, const std::vector<std::string>& paths) {
-    std::vector<Value> values;
-    for (const auto& p : paths) values.push_back(Value::string(p));
-    return pathsRequest(name, std::move(values));
-}
 
-class RegistrationTest : public ::testing::Test {
+class RegistrationTest : public DaemonTest {
   protected:
     void SetUp() override {
-        bundles_ = bxd_.root() / "bundles";
-        fs::create_directories(bundles_);
-        for (const char* bundle : {"Greeter.app", "Notes.app", "OutsideApplication.bxplugin"})
-            fs::copy(kExamples / bundle, bundles_ / bundle, fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
-        bxd_.exportEnvironment();
+        copyExamples({"Greeter.app", "OutsideApplication.bxplugin"});
         ASSERT_TRUE(start()) << bxd_.log();
     }
-
-    bool start() { return bxd_.start({"-d", (bxd_.root() / "annotations").string()}); }
-
-    // The UUID under which the daemon's registry holds the bundle at `path`, read from its store.
-    std::optional<Uuid> registeredUuid(const std::string& path) {
-        return test::registeredUuid(bxd_.root() / "state", path);
+    void TearDown() override {
+        for (pid_t pid : instances_) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
     }
-
-    // Gives this test program the manager entitlement through the daemon's trusted entitlements directory.
-    void grantManagerEntitlement() {
-        fs::path self = fs::canonical("/proc/self/exe");
-        fs::path file = bxd_.entitlementsDir() / "registration-test.vrec";
-        ASSERT_FALSE(Document::writeFileAtomically(
-            file,
-            Value::dictionary({{"Executable", Value::string(self.string())},
-                               {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
-        ASSERT_EQ(chmod(file.c_str(), 0644), 0);
-    }
-
-    std::string plugIn(const std::string& relative) const { return (bundles_ / relative).string(); }
     std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
     std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
-    std::string nightTheme() const { return plugIn("Greeter.app/PlugIns/NightTheme.bxplugin"); }
 
-    BxdProcess bxd_;
-    fs::path bundles_;
+    // Starts an instance of the plug-in with `bundleIdentifier` and records it as its runtime would.
+    pid_t run(const std::string& bundleIdentifier) {
+        pid_t pid = startInstance();
+        instances_.push_back(pid);
+        EXPECT_TRUE(running_.record(bundleIdentifier, pid));
+        return pid;
+    }
+    bool recorded(const std::string& bundleIdentifier, pid_t pid) const {
+        return fs::exists(running_.directory() / bundleIdentifier / std::to_string(pid));
+    }
+    // The signal that ended `pid` (reaped), 0 when it exited otherwise, or -1 while it still runs after `timeout`.
+    int endingSignal(pid_t pid, std::chrono::milliseconds timeout) {
+        auto deadline = std::chrono::steady_clock::now() + timeout;
+        do {
+            int status = 0;
+            if (waitpid(pid, &status, WNOHANG) == pid) {
+                std::erase(instances_, pid);
+                return WIFSIGNALED(status) ? WTERMSIG(status) : 0;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        } while (std::chrono::steady_clock::now() < deadline);
+        return -1;
+    }
+
+    RunningInstances running_{"instances", bxd_.root() / "runtime"};
+    std::vector<pid_t> instances_;
 };
 
-TEST_F(RegistrationTest, AddRegistersAnApplicationsPlugInsAndReAddKeepsTheirUuids) {
-    TestClient client;
-    Value reply = client.replyTo(pathsRequest("add", {hello(), bonjour(), nightTheme()}));
-    EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_FALSE(reply.contains("error"));
-    std::optional<Uuid> helloUuid = registeredUuid(hello());
-    std::optional<Uuid> bonjourUuid = registeredUuid(bonjour());
-    ASSERT_TRUE(helloUuid && bonjourUuid && registeredUuid(nightTheme()));
-    EXPECT_TRUE(bxd_.waitForLog("plug-in INSTALLED:com.example.greeter.hello")) << bxd_.log();
-
-    // Registration resolves the path first, so a path through ".." and a doubled slash names the same bundle.
-    std::string roundabout = plugIn("Greeter.app/PlugIns/../PlugIns//Hello.bxplugin");
-    reply = client.replyTo(pathsRequest("add", {roundabout, bonjour()}));
-    EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_EQ(registeredUuid(hello()), helloUuid);
-    EXPECT_EQ(registeredUuid(bonjour()), bonjourUuid);
-}
-
-TEST_F(RegistrationTest, EmptyPathListSucceedsAndRegistersNothing) {
-    TestClient client;
-    EXPECT_EQ(errorCode(client.replyTo(pathsRequest("add", std::vector<std::string>{}))), 0);
+// Guards "add": an empty list succeeds with nothing registered; the plug-ins of an application and one outside any
+// application (refused only when looked up: SystemPlugInTest) are registered and announced, and adding a bundle
+// again keeps its UUID. And "bulk", which always succeeds and logs the flags it does not support.
+TEST_F(RegistrationTest, AddRegistersPlugInsAndReAddKeepsTheirUuids) {
+    add({});
     EXPECT_EQ(bxd_.countInLog("plug-in INSTALLED:"), 0u);
-}
-
-TEST_F(RegistrationTest, MalformedPathListsAreCode4) {
-    TestClient client;
-    Value noPaths =
-        client.replyTo(Value::dictionary({{"request", Value::string("add")}, {"version", Value::uint64(3)}}));
-    EXPECT_EQ(errorCode(noPaths), 4);
-    EXPECT_EQ(errorText(noPaths), "invalid request format");
-
-    Value notArray = client.replyTo(Value::dictionary(
-        {{"request", Value::string("add")}, {"version", Value::uint64(3)}, {"paths", Value::string(hello())}}));
-    EXPECT_EQ(errorCode(notArray), 4);
-    EXPECT_EQ(errorText(notArray), "invalid request format");
-
-    Value number = client.replyTo(pathsRequest("add", std::vector<Value>{Value::string(hello()), Value::uint64(7)}));
-    EXPECT_EQ(errorCode(number), 4);
-    EXPECT_EQ(errorText(number), "invalid request format");
-    EXPECT_TRUE(registeredUuid(hello())) << "the element before the bad one was handled";
-}
-
-TEST_F(RegistrationTest, PathsMustBeAbsoluteAndResolve) {
-    TestClient client;
-    Value relative = client.replyTo(pathsRequest("add", {"bundles/Greeter.app/PlugIns/Hello.bxplugin"}));
-    EXPECT_EQ(errorCode(relative), 9);
-    EXPECT_EQ(errorText(relative), "absolute path required: bundles/Greeter.app/PlugIns/Hello.bxplugin");
-
-    Value empty = client.replyTo(pathsRequest("add", {""}));
-    EXPECT_EQ(errorCode(empty), 9);
-    EXPECT_EQ(errorText(empty), "absolute path required: ");
-
-    // A valid, a missing and a valid path: the first is registered, the walk stops at the second.
-    std::string missing = plugIn("Greeter.app/PlugIns/Missing.bxplugin");
-    Value reply = client.replyTo(pathsRequest("add", {hello(), missing, bonjour()}));
-    EXPECT_EQ(errorCode(reply), 9);
-    EXPECT_EQ(errorText(reply), "invalid plugin path: " + missing);
-    EXPECT_TRUE(registeredUuid(hello()));
-    EXPECT_FALSE(registeredUuid(bonjour()));
-
-    std::string tooLong = "/" + std::string(5000, 'x');
-    Value longReply = client.replyTo(pathsRequest("add", {tooLong}));
-    EXPECT_EQ(errorCode(longReply), 9);
-    EXPECT_EQ(errorText(longReply), "invalid plugin path: " + tooLong);
-}
-
-TEST_F(RegistrationTest, BundlesTheRegistryRefusesAreCode2) {
-    TestClient client;
-    // An application is not a plug-in.
-    std::string application = plugIn("Greeter.app");
-    Value reply = client.replyTo(pathsRequest("add", {application}));
-    EXPECT_EQ(errorCode(reply), 2);
-    EXPECT_EQ(errorText(reply), "unable to register plug-in at " + application);
-    EXPECT_TRUE(bxd_.waitForLog("failed to register plug-in at " + application));
-    EXPECT_EQ(bxd_.countInLog("Ledgerix failed to register the plug-in"), 0u) << "the database's text stays inside";
-
-    // A bundle whose information document is not a document.
-    std::ofstream(plugIn("Greeter.app/PlugIns/Hello.bxplugin/Info.vrec"), std::ios::trunc) << "<vrec><dict><key>";
-    reply = client.replyTo(pathsRequest("add", {hello()}));
-    EXPECT_EQ(errorCode(reply), 2);
-    EXPECT_EQ(errorText(reply), "unable to register plug-in at " + hello());
-
-    // A plain directory with no information document at all.
-    fs::create_directories(bundles_ / "Empty.bxplugin");
-    reply = client.replyTo(pathsRequest("add", {plugIn("Empty.bxplugin")}));
-    EXPECT_EQ(errorCode(reply), 2);
-}
-
-TEST_F(RegistrationTest, PlugInOutsideAnyApplicationRegistersButIsNeverServed) {
-    // The registry records what is on disk; the daemon's own checks refuse the record when it is looked up, which
-    // the discovery and readiness requests do. Registration itself succeeds.
-    TestClient client;
     std::string outside = plugIn("OutsideApplication.bxplugin");
-    Value reply = client.replyTo(pathsRequest("add", {outside}));
-    EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_TRUE(registeredUuid(outside));
+    add({hello(), bonjour(), outside});
+    std::optional<Uuid> helloUuid = registeredUuid(hello());
+    ASSERT_TRUE(helloUuid && registeredUuid(bonjour()) && registeredUuid(outside));
+    expectLog("plug-in INSTALLED:com.example.greeter.hello");
+    add({hello()});
+    EXPECT_EQ(registeredUuid(hello()), helloUuid);
+
+    succeed(request("bulk", {{"flags", Value::uint64(0x2a)}}));
+    expectLog("bulk options 0x2a not supported");
 }
 
-TEST_F(RegistrationTest, RemoveNeedsTheManagerEntitlement) {
-    TestClient adder;
-    ASSERT_EQ(errorCode(adder.replyTo(pathsRequest("add", {hello()}))), 0);
+// Guards the path checks of "add" with their codes and texts: a malformed list is code 4, a path that is not
+// absolute or does not resolve (also one over the path limit) is code 9, a bundle the registry refuses is code 2
+// without the database's own text. The walk handles the paths before the bad one and stops there.
+TEST_F(RegistrationTest, BadPathsAreRefusedAndTheWalkStopsAtTheFirst) {
+    expectFailure(request("add"), 4, "invalid request format");
+    expectFailure(request("add", {{"paths", Value::string(hello())}}), 4, "invalid request format");
+    expectFailure(request("add", {{"paths", Value::array({Value::string(hello()), Value::uint64(7)})}}), 4,
+                  "invalid request format");
+    EXPECT_TRUE(registeredUuid(hello())) << "the element before the bad one was handled";
 
-    TestClient client;
-    Value refused = client.replyTo(pathsRequest("remove", {hello()}));
-    EXPECT_EQ(errorCode(refused), 11);
-    EXPECT_EQ(errorText(refused), "caller lacks entitlement for this operation");
-    EXPECT_TRUE(bxd_.waitForLog("refused request from pid=" + std::to_string(getpid()) + " to remove plug-in at " +
-                                hello() + " - client lacks required entitlement"))
-        << bxd_.log();
-    EXPECT_TRUE(registeredUuid(hello()));
+    expectFailure(pathsRequest("add", {"bundles/Hello.bxplugin"}), 9, "absolute path required: bundles/Hello.bxplugin");
+    std::string missing = plugIn("Greeter.app/PlugIns/Missing.bxplugin");
+    expectFailure(pathsRequest("add", {hello(), missing, bonjour()}), 9, "invalid plugin path: " + missing);
+    EXPECT_FALSE(registeredUuid(bonjour())) << "the walk stopped at the missing path";
+    std::string tooLong = "/" + std::string(5000, 'x');
+    expectFailure(pathsRequest("add", {tooLong}), 9, "invalid plugin path: " + tooLong);
 
-    // The path's form is checked before the entitlement.
-    Value relative = client.replyTo(pathsRequest("remove", {"Hello.bxplugin"}));
-    EXPECT_EQ(errorCode(relative), 9);
+    std::string application = plugIn("Greeter.app");
+    expectFailure(pathsRequest("add", {application}), 2, "unable to register plug-in at " + application);
+    expectLog("failed to register plug-in at " + application);
+    EXPECT_EQ(bxd_.countInLog("Ledgerix failed to register the plug-in"), 0u) << "the database's text stays inside";
 }
 
-TEST_F(RegistrationTest, EntitledRemoveUnregistersAndReportsUnknownPaths) {
-    grantManagerEntitlement();
-    TestClient client;
-    ASSERT_EQ(errorCode(client.replyTo(pathsRequest("add", {hello(), bonjour()}))), 0);
-
-    Value reply = client.replyTo(pathsRequest("remove", {hello()}));
-    EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << bxd_.log();
-    EXPECT_FALSE(registeredUuid(hello()));
-    EXPECT_TRUE(registeredUuid(bonjour()));
-    EXPECT_TRUE(bxd_.waitForLog("plug-in UNINSTALLED:com.example.greeter.hello")) << bxd_.log();
-    EXPECT_TRUE(bxd_.waitForLog("removal complete for")) << bxd_.log();
-
-    Value again = client.replyTo(pathsRequest("remove", {hello()}));
-    EXPECT_EQ(errorCode(again), 9);
-    EXPECT_EQ(errorText(again), "no plugin at " + hello());
-
-    // A bundle deleted from disk is still unregistered, by the path the client sent.
-    fs::remove_all(bonjour());
-    reply = client.replyTo(pathsRequest("remove", {bonjour()}));
-    EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
-    EXPECT_FALSE(registeredUuid(bonjour()));
-}
-
-TEST_F(RegistrationTest, BulkAlwaysSucceedsAndLogsItsFlags) {
-    TestClient client;
-    Value withFlags = client.replyTo(Value::dictionary(
-        {{"request", Value::string("bulk")}, {"version", Value::uint64(3)}, {"flags", Value::uint64(0x2a)}}));
-    EXPECT_EQ(errorCode(withFlags), 0);
-    EXPECT_TRUE(bxd_.waitForLog("bulk options 0x2a not supported")) << bxd_.log();
-    Value without =
-        client.replyTo(Value::dictionary({{"request", Value::string("bulk")}, {"version", Value::uint64(3)}}));
-    EXPECT_EQ(errorCode(without), 0);
-    EXPECT_TRUE(bxd_.waitForLog("bulk options 0x0 not supported")) << bxd_.log();
-}
-
-TEST_F(RegistrationTest, RegistrationsSurviveARestart) {
-    grantManagerEntitlement();
-    std::optional<Uuid> before;
-    {
-        TestClient client;
-        ASSERT_EQ(errorCode(client.replyTo(pathsRequest("add", {hello(), bonjour()}))), 0);
-        before = registeredUuid(hello());
-        ASSERT_TRUE(before);
-    }
+// Guards "remove": refused and logged without the manager entitlement (the path's form is checked first); with it,
+// a restarted daemon still knows the bundles, unregisters and announces the plug-in, has the service manager end
+// its instances by the plug-in's version (SIGTERM suffices, records go) while another plug-in's instance runs on,
+// and reports a path it does not know.
+TEST_F(RegistrationTest, RemoveNeedsTheEntitlementAndEndsThePlugInsInstancesAfterARestart) {
+    add({hello(), bonjour()});
+    expectFailure(pathsRequest("remove", {"Hello.bxplugin"}), 9, "absolute path required: Hello.bxplugin");
+    expectFailure(pathsRequest("remove", {hello()}), 11, "caller lacks entitlement for this operation");
+    expectLog("refused request from pid=" + std::to_string(getpid()) + " to remove plug-in at " + hello() +
+              " - client lacks required entitlement");
+    grantSelfManager();
     bxd_.stop();
     ASSERT_TRUE(start()) << bxd_.log();
+    std::string helloUuid = registeredUuid(hello()).value_or(Uuid()).string();
+    pid_t first = run(kHello), second = run(kHello), other = run(kBonjour);
 
-    TestClient client;
-    // Re-adding after the restart keeps the UUID; removing works because the new daemon knows the bundle.
-    ASSERT_EQ(errorCode(client.replyTo(pathsRequest("add", {hello()}))), 0);
-    EXPECT_EQ(registeredUuid(hello()), before);
-    Value removed = client.replyTo(pathsRequest("remove", {bonjour()}));
-    EXPECT_EQ(errorCode(removed), 0) << errorText(removed);
+    succeed(pathsRequest("remove", {hello()}));
+    EXPECT_FALSE(registeredUuid(hello()));
+    EXPECT_TRUE(registeredUuid(bonjour()));
+    EXPECT_EQ(endingSignal(first, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
+    EXPECT_EQ(endingSignal(second, std::chrono::seconds(10)), SIGTERM) << bxd_.log();
+    EXPECT_FALSE(recorded(kHello, first) || recorded(kHello, second));
+    const std::string lines[] = {
+        "plug-in UNINSTALLED:" + kHello, "requesting termination for " + kHello + "(1) jobard:1 " + helloUuid,
+        "one or more plug-ins have been terminated for uuid=" + helloUuid, "removal complete for"};
+    for (const std::string& line : lines) expectLog(line);
+    EXPECT_EQ(endingSignal(other, std::chrono::milliseconds(0)), -1);
+    EXPECT_TRUE(recorded(kBonjour, other));
+    EXPECT_EQ(bxd_.countInLog("requesting termination for " + kBonjour), 0u) << bxd_.log();
+
+    expectFailure(pathsRequest("remove", {hello()}), 9, "no plugin at " + hello());
 }
 
 }  // namespace

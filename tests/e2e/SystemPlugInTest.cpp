@@ -1,132 +1,72 @@
 // System plug-ins through the real daemon. The daemon runs inside a private root made by bubblewrap, where a
-// temporary directory of the test is mounted at /System (and another at /SystemX), so nothing is ever created at
-// the real machine's /System. The private root sees the test's temporary root and the build tree at their own
-// paths, and shares the process ids with the test, so clients outside talk to it as to any daemon.
+// temporary directory of the test is mounted at /System (and its bundles directory below /SystemX), so nothing is
+// ever created at the real machine's /System. The private root sees the test's temporary root and the build tree at
+// their own paths, and shares the process ids with the test, so clients outside talk to it as to any daemon.
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 
-#include <algorithm>
-#include <chrono>
-#include <filesystem>
-#include <fstream>
 #include <map>
-#include <memory>
 #include <set>
-#include <sstream>
-#include <thread>
 
-#include "BxdProcess.h"
 #include "E2eSupport.h"
-#include "TestClient.h"
-#include "base/Document.h"
 
 namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
-using test::BxdProcess;
-using test::errorCode;
-using test::errorText;
-using test::identifiers;
-using test::Ids;
-using test::matchRequest;
-using test::TestClient;
+using namespace test;
 
-const fs::path kExamples = fs::path(BEXIL_SOURCE_DIR) / "examples" / "bundles";
-constexpr uint64_t kAllVersions = 0x1, kAllInstances = 0x4, kSystemOnly = 0x8, kDiscoverAll = 0x200;
-constexpr const char* kManagerEntitlement = "com.quorvel.private.bexil.manager";
 const std::string kClock = "com.example.system.clock";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kSystemClock = "/System/Library/PlugIns/Clock.bxplugin";
 
-Value str(std::string_view s) { return Value::string(s); }
-
-std::string quoted(const std::string& word) { return "'" + word + "'"; }
-
-class SystemPlugInTest : public ::testing::Test {
+class SystemPlugInTest : public DaemonTest {
   protected:
     void SetUp() override {
-        fs::path root = bxd_.root();
-        bundles_ = root / "bundles";
-        fs::create_directories(bundles_);
-        fs::copy(kExamples / "Greeter.app", bundles_ / "Greeter.app", fs::copy_options::recursive);
-        fs::copy(kExamples / "OutsideApplication.bxplugin", bundles_ / "OutsideApplication.bxplugin",
-                 fs::copy_options::recursive);
-        bundles_ = fs::canonical(bundles_);
-
-        // What the daemon sees at /System and /SystemX.
-        system_ = fs::canonical(root) / "system";
-        fs::create_directories(system_ / "Library" / "PlugIns");
+        copyExamples({"Greeter.app", "OutsideApplication.bxplugin"});
+        // What the daemon sees at /System; /SystemX/Library/PlugIns shows the bundles directory.
+        system_ = bundles_.parent_path() / "system";
+        fs::create_directories(system_ / "Library/PlugIns");
         fs::copy(kExamples / "System/Library/PlugIns/Clock.bxplugin", system_ / "Library/PlugIns/Clock.bxplugin",
                  fs::copy_options::recursive);
-        fs::path systemX = fs::canonical(root) / "systemx";
-        fs::create_directories(systemX / "Library" / "PlugIns");
-        fs::copy(kExamples / "OutsideApplication.bxplugin", systemX / "Library/PlugIns/OutsideApplication.bxplugin",
-                 fs::copy_options::recursive);
-
-        fs::path preferences = root / "preferences";
-        fs::create_directories(preferences);
-        setenv("BX_PREFERENCES_DIR", preferences.c_str(), 1);
-        bxd_.exportEnvironment();
 
         // Only the system's programs and libraries, this test's temporary root and the build tree, at their own
-        // paths, plus the two directories that stand for /System and /SystemX.
+        // paths, plus the directories that stand for /System and /SystemX.
+        std::string root = bxd_.root().string();
         std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc", "--dev", "/dev"};
-        auto with = [&launcher](std::initializer_list<std::string> words) { launcher.insert(launcher.end(), words); };
-        with({"--ro-bind", "/usr", "/usr"});
-        with({"--ro-bind", "/etc", "/etc"});
-        for (const char* directory : {"lib", "lib64", "bin", "sbin"})
-            with({"--symlink", std::string("usr/") + directory, std::string("/") + directory});
-        with({"--bind", root.string(), root.string()});
-        with({"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR});
-        with({"--ro-bind", system_.string(), "/System"});
-        with({"--ro-bind", systemX.string(), "/SystemX"});
+        const std::string mounts[][3] = {{"--ro-bind", "/usr", "/usr"},
+                                         {"--ro-bind", "/etc", "/etc"},
+                                         {"--bind", root, root},
+                                         {"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR},
+                                         {"--ro-bind", system_.string(), "/System"},
+                                         {"--ro-bind", bundles_.string(), "/SystemX/Library/PlugIns"},
+                                         {"--symlink", "usr/lib", "/lib"},
+                                         {"--symlink", "usr/lib64", "/lib64"},
+                                         {"--symlink", "usr/bin", "/bin"},
+                                         {"--symlink", "usr/sbin", "/sbin"}};
+        for (const auto& mount : mounts) launcher.insert(launcher.end(), std::begin(mount), std::end(mount));
         // Machines without user namespaces or mount rights cannot make the private root; say so instead of failing.
         std::string probe;
-        for (const std::string& word : launcher) probe += quoted(word) + " ";
-        fs::path probeOutput = root / "bwrap-probe.txt";
-        int status = std::system((probe + "/usr/bin/test -d /System/Library/PlugIns/Clock.bxplugin >" +
-                                  quoted(probeOutput.string()) + " 2>&1")
-                                     .c_str());
-        if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-            std::ifstream in(probeOutput);
-            std::stringstream text;
-            text << in.rdbuf();
-            GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << text.str();
-        }
+        for (const std::string& word : launcher) probe += "'" + word + "' ";
+        Outcome made = shell(probe + "/usr/bin/test -d /System/Library/PlugIns/Clock.bxplugin");
+        if (made.status != 0) GTEST_SKIP() << "bubblewrap cannot make a private root with /System here: " << made.err;
         bxd_.setLauncher(std::move(launcher));
-        ASSERT_TRUE(
-            bxd_.start({"-d", (root / "annotations.vrec").string()}, {"BX_PREFERENCES_DIR=" + preferences.string()}))
-            << bxd_.log();
-        client_ = std::make_unique<TestClient>();
-    }
-
-    void add(const std::vector<std::string>& paths) {
-        std::vector<Value> values;
-        for (const std::string& path : paths) values.push_back(str(path));
-        Value reply = client_->replyTo(Value::dictionary(
-            {{"request", str("add")}, {"version", Value::uint64(3)}, {"paths", Value::array(std::move(values))}}));
-        ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+        ASSERT_TRUE(start()) << bxd_.log();
     }
 
     // The forms of every registered instance of the clock, keyed by path.
     std::map<std::string, Value> clockInstances() {
-        Value reply = client_->replyTo(matchRequest(clockRules(), kAllVersions | kAllInstances));
+        Value reply = TestClient().replyTo(matchRequest(identifierRule(kClock), kAllVersions | kAllInstances));
         std::map<std::string, Value> forms;
         for (const Value& form : reply.get("matches").items()) forms[std::string(form.get("path").stringView())] = form;
         return forms;
     }
     // The path of the one clock a client gets without flags.
     std::string servedClock() {
-        Value reply = client_->replyTo(matchRequest(clockRules(), 0));
-        EXPECT_EQ(reply.get("matches").count(), 1u) << reply.description();
-        return reply.get("matches").count() ? std::string(reply.get("matches").items()[0].get("path").stringView())
-                                            : std::string();
+        std::vector<Value> forms = formsOf(TestClient().replyTo(matchRequest(identifierRule(kClock))), kClock);
+        EXPECT_EQ(forms.size(), 1u);
+        return forms.empty() ? std::string() : std::string(forms[0].get("path").stringView());
     }
-    static Value clockRules() { return Value::dictionary({{"RZExtensionIdentifier", str(kClock)}}); }
 
     // Changes the bundle's information document, so that adding it again registers it anew (a new registration
     // time, and a place after every plug-in registered before).
@@ -143,9 +83,7 @@ class SystemPlugInTest : public ::testing::Test {
     void addWithinOneSecond(const std::vector<fs::path>& bundles, const std::vector<std::string>& paths) {
         for (int attempt = 0; attempt < 3; ++attempt) {
             for (const fs::path& bundle : bundles) rebuild(bundle);
-            auto now = std::chrono::system_clock::now().time_since_epoch();
-            auto next = std::chrono::ceil<std::chrono::seconds>(now) + std::chrono::milliseconds(5);
-            std::this_thread::sleep_for(next - now);
+            sleepToNextSecond();
             add(paths);
             std::set<int64_t> times;
             for (const auto& [path, form] : clockInstances()) times.insert(*form.get("lastmodified").numberAsInt64());
@@ -154,58 +92,38 @@ class SystemPlugInTest : public ::testing::Test {
         FAIL() << "could not register the clocks within one second";
     }
 
-    BxdProcess bxd_;
-    std::unique_ptr<TestClient> client_;
-    fs::path bundles_;
     fs::path system_;
     int builds_ = 0;
 };
 
+// Guards residence: outside applications only plug-ins whose real path is below /System are served (not one below
+// /SystemX, nor a link planted in /System that leads out of it), auto-elected; the system-only flag keeps just
+// them, and privileged discovery ignores that flag without bringing pretenders back.
 TEST_F(SystemPlugInTest, OnlyPlugInsReallyBelowSystemAreServedOutsideApplications) {
-    // A link planted in /System that leads out of it does not make a system plug-in: residence is decided on the
-    // bundle's real path.
     fs::create_directory_symlink(bundles_ / "OutsideApplication.bxplugin",
                                  system_ / "Library/PlugIns/Planted.bxplugin");
-    std::string hello = (bundles_ / "Greeter.app/PlugIns/Hello.bxplugin").string();
-    add({kSystemClock, hello, "/SystemX/Library/PlugIns/OutsideApplication.bxplugin",
-         "/System/Library/PlugIns/Planted.bxplugin"});
+    add({kSystemClock, plugIn("Greeter.app/PlugIns/Hello.bxplugin"),
+         "/SystemX/Library/PlugIns/OutsideApplication.bxplugin", "/System/Library/PlugIns/Planted.bxplugin"});
 
-    Value all = client_->replyTo(matchRequest(std::nullopt, 0));
-    ASSERT_EQ(errorCode(all), 0) << errorText(all);
+    Value all = TestClient().replyTo(matchRequest());
     EXPECT_EQ(identifiers(all), (Ids{kHello, kClock})) << all.description();
-    for (const Value& form : all.get("matches").items()) {
-        bool clock = form.get("identifier").stringView() == kClock;
-        EXPECT_EQ(form.get("path").stringView(), clock ? kSystemClock : hello);
-        EXPECT_EQ(form.get("systemResident"), Value::boolean(clock)) << form.description();
-        // The system plug-in asks for automatic election, which its first look-up made.
-        if (clock) {
-            EXPECT_EQ(form.get("annotations"), Value::dictionary({{"election", Value::int64(1)}}));
-        }
-    }
-    EXPECT_EQ(identifiers(client_->replyTo(matchRequest(std::nullopt, kSystemOnly))), (Ids{kClock}));
-    // The greeting rule matches the system plug-in and the application's; system only keeps the first.
-    Value greeting = Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.greeting")}});
-    EXPECT_EQ(identifiers(client_->replyTo(matchRequest(greeting, kSystemOnly))), (Ids{kClock}));
-    // Privileged discovery ignores the system-only flag, but does not bring the pretenders back.
-    fs::path grant = bxd_.entitlementsDir() / "system-test.vrec";
-    ASSERT_FALSE(Document::writeFileAtomically(
-        grant,
-        Value::dictionary({{"Executable", str(fs::canonical("/proc/self/exe").string())},
-                           {"Entitlements", Value::dictionary({{kManagerEntitlement, Value::boolean(true)}})}})));
-    ASSERT_EQ(chmod(grant.c_str(), 0644), 0);
+    // The system plug-in asks for automatic election, which its first look-up made.
+    EXPECT_EQ(formsOf(all, kClock).at(0).get("annotations"), Value::dictionary({{"election", Value::int64(1)}}));
+    EXPECT_EQ(identifiers(TestClient().replyTo(matchRequest(std::nullopt, kSystemOnly))), (Ids{kClock}));
+    grantSelfManager();
     TestClient manager;  // entitlements are read when a client connects
-    Value privileged = manager.replyTo(matchRequest(std::nullopt, kSystemOnly | kDiscoverAll));
-    EXPECT_EQ(errorCode(privileged), 0) << errorText(privileged) << "\n" << bxd_.log();
-    EXPECT_EQ(identifiers(privileged), (Ids{kHello, kClock}));
+    EXPECT_EQ(identifiers(manager.replyTo(matchRequest(std::nullopt, kSystemOnly | kDiscoverAll))),
+              (Ids{kHello, kClock}));
 
     // Both pretenders were registered and are refused as mis-configured whenever they are looked up.
     for (const std::string& path : {std::string("/SystemX/Library/PlugIns/OutsideApplication.bxplugin"),
                                     (bundles_ / "OutsideApplication.bxplugin").string()})
-        EXPECT_TRUE(bxd_.waitForLog("ignoring mis-configured plug-in at " + path +
-                                    ": plug-ins outside containing apps must be in /System"))
-            << bxd_.log();
+        expectLog("ignoring mis-configured plug-in at " + path +
+                  ": plug-ins outside containing apps must be in /System");
 }
 
+// Guards the tie between equal versions of a system plug-in and an application's copy: within one registration
+// second the system's wins whichever was met first; a later registration of the application's wins.
 TEST_F(SystemPlugInTest, SameVersionGoesToTheSystemPlugInUnlessTheApplicationsIsRegisteredLater) {
     // The application's copy of the clock: same identifier, same version.
     fs::path appClock = bundles_ / "Greeter.app/PlugIns/Clock.bxplugin";
@@ -217,7 +135,6 @@ TEST_F(SystemPlugInTest, SameVersionGoesToTheSystemPlugInUnlessTheApplicationsIs
     std::map<std::string, Value> both = clockInstances();
     ASSERT_EQ(both.size(), 2u);
     EXPECT_EQ(both[kSystemClock].get("systemResident"), Value::boolean(true));
-    EXPECT_EQ(both[appClock.string()].get("systemResident"), Value::boolean(false));
     EXPECT_EQ(servedClock(), kSystemClock);
 
     // The system's met first, both in the same second: the one met first stays.
@@ -225,7 +142,7 @@ TEST_F(SystemPlugInTest, SameVersionGoesToTheSystemPlugInUnlessTheApplicationsIs
     EXPECT_EQ(servedClock(), kSystemClock);
 
     // The system's met first, the application's registered a second later: the later registration wins.
-    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    sleepToNextSecond();
     rebuild(appClock);
     add({appClock.string()});
     both = clockInstances();
