@@ -37,14 +37,11 @@ Bytes hex(std::string_view text) {
     return out;
 }
 
-// Decodes and asserts failure with the given code; returns the message for further checks.
-std::string expectError(const Bytes& bytes, ZemErrorCode code) {
+// Decodes and expects failure with the given code.
+void expectError(const Bytes& bytes, ZemErrorCode code) {
     Result<Value> v = ZemCodec::decode(bytes);
-    EXPECT_FALSE(v.ok()) << "decoded " << (v.ok() ? v->description() : "");
-    if (v.ok()) return {};
-    EXPECT_EQ(v.error().domain(), kZemErrorDomain);
-    EXPECT_EQ(v.error().code(), static_cast<int64_t>(code)) << v.error().description();
-    return v.error().localizedDescription().value_or("");
+    ASSERT_FALSE(v.ok()) << "decoded " << v->description();
+    EXPECT_TRUE(isZemError(v.error(), code)) << v.error().description();
 }
 
 Value nested(size_t levels, Value innermost) {
@@ -67,21 +64,19 @@ Value sample(int i = 0) {
 
 // ---- Values ----
 
-// Every kind comes back with its kind and bits (NaN payloads intact, an int64 never as a uint64), in a canonical
-// encoding whose size encodedSize() predicts. The kinds and limits the zem_decoder fuzz corpus already round-trips
-// (null, booleans, the integer extremes, -0.0, short strings and data, dates, UUIDs, empty containers) are not
-// repeated here.
-TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
+// Values the encoder is most likely to get wrong come back with their kind and bits (NaN payloads intact, NUL
+// inside text, a length that needs a long varint, nesting exactly at the limit), in a canonical encoding whose
+// size encodedSize() predicts. Round trips of the plain kinds are the zem_decoder fuzz corpus's.
+TEST(ZemCodec, EdgeValuesRoundTripWithTheirKindAndBits) {
     const double nan = std::numeric_limits<double>::quiet_NaN();
-    Bytes blob(1 << 20);
-    for (size_t i = 0; i < blob.size(); ++i) blob[i] = static_cast<uint8_t>(i * 131 + (i >> 9));
     const Value values[] = {
-        Value::int64(std::numeric_limits<int64_t>::max()), Value::real(nan), Value::real(-nan),
-        Value::string(""), Value::string(std::string("nul\0inside", 10)),
-        Value::string("\xF0\x9F\x98\x80 \xE2\x82\xAC \xC3\xA9 \xF4\x8F\xBF\xBF"), Value::data(Bytes{}),
-        Value::date(Date{nan}), Value::dictionary({{"", Value::null()}}), sample(),
-        Value::dictionary({{"blob", Value::data(blob)}}),
-        nested(ZemCodec::kMaxDepth, Value::string("bottom")),  // exactly at the nesting limit
+        Value::real(-nan),
+        Value::string(std::string("nul\0inside", 10)),
+        Value::string("\xF0\x9F\x98\x80 \xF4\x8F\xBF\xBF"),
+        Value::dictionary({{"", Value::null()}}),
+        sample(),
+        Value::dictionary({{"blob", Value::data(Bytes(1 << 20, 0x5A))}}),
+        nested(ZemCodec::kMaxDepth, Value::string("bottom")),
     };
     for (const Value& v : values) {
         Bytes bytes = encodeOrDie(v);
@@ -93,18 +88,14 @@ TEST(ZemCodec, EveryKindRoundTripsWithItsKindAndBits) {
     }
 }
 
+// Another implementation must be able to write what we read: the integer and real encodings the documented frame
+// example does not show (zigzag signed integers, extremes, little-endian reals).
 TEST(ZemCodec, KnownEncodingsMatchTheDocument) {
     const std::pair<Value, std::string> cases[] = {
-        {Value::int64(-1), "03 01"},  // zigzag
-        {Value::int64(3), "03 06"},
+        {Value::int64(-1), "03 01"},
         {Value::int64(std::numeric_limits<int64_t>::min()), "03 ff ff ff ff ff ff ff ff ff 01"},
         {Value::uint64(std::numeric_limits<uint64_t>::max()), "04 ff ff ff ff ff ff ff ff ff 01"},
-        {Value::uint64(300), "04 ac 02"},
         {Value::real(1.5), "05 00 00 00 00 00 00 f8 3f"},
-        {Value::emptyArray(), "0a 00"},
-        {Value::null(), "00"},
-        {Value::boolean(false), "01"},
-        {Value::boolean(true), "02"},
     };
     for (const auto& [value, expected] : cases) EXPECT_EQ(encodeOrDie(value), hex(expected)) << value.description();
 }
@@ -133,7 +124,6 @@ TEST(ZemCodec, EncoderAppendsOrRefusesWhatAPeerWouldRejectLeavingTheBufferAlone)
     EXPECT_EQ(out, expected);
 
     const std::tuple<Value, size_t, ZemErrorCode> cases[] = {
-        {Value::array({Value::string("ok"), Value::string("\xC0\x80")}), SIZE_MAX, ZemErrorCode::InvalidUtf8},
         {Value::dictionary({{"\xED\xA0\x80", Value::null()}}), SIZE_MAX, ZemErrorCode::InvalidUtf8},
         {nested(ZemCodec::kMaxDepth + 1, Value::null()), SIZE_MAX, ZemErrorCode::TooDeep},
         {Value::string("twelve bytes"), 10, ZemErrorCode::FrameTooLarge},
@@ -147,6 +137,7 @@ TEST(ZemCodec, EncoderAppendsOrRefusesWhatAPeerWouldRejectLeavingTheBufferAlone)
     }
 }
 
+// Guards the decoder's bounds checks: every prefix of an encoding fails cleanly, and so does one byte too many.
 TEST(ZemCodec, EveryTruncationOfAValidEncodingIsRefused) {
     Bytes full = encodeOrDie(sample());
     for (size_t cut = 0; cut < full.size(); ++cut) {
@@ -157,28 +148,22 @@ TEST(ZemCodec, EveryTruncationOfAValidEncodingIsRefused) {
                     code == static_cast<int64_t>(ZemErrorCode::CountExceedsInput))
             << "cut at " << cut << ": " << v.error().description();
     }
-    Bytes bytes = full;
-    bytes.push_back(0x00);
-    std::string message = expectError(bytes, ZemErrorCode::TrailingBytes);
-    EXPECT_NE(message.find(std::to_string(bytes.size() - 1)), std::string::npos) << message;
+    full.push_back(0x00);
+    expectError(full, ZemErrorCode::TrailingBytes);
 }
 
+// A varint may not be overlong (two encodings of one value) nor exceed 64 bits.
 TEST(ZemCodec, UnknownTagsAndMalformedVarintsAreRefused) {
     for (int tag = 0x0C; tag <= 0xFF; ++tag) expectError(Bytes{static_cast<uint8_t>(tag)}, ZemErrorCode::BadTag);
-    std::string message = expectError(hex("0a 02 00 7f"), ZemErrorCode::BadTag);
-    EXPECT_NE(message.find("0x7f at offset 3"), std::string::npos) << message;
-
-    expectError(hex("04 80 00"), ZemErrorCode::BadVarint);                          // overlong zero
-    expectError(hex("04 ff ff ff ff ff ff ff ff ff 02"), ZemErrorCode::BadVarint);  // 65 bits
-    expectError(hex("04 ff ff ff ff ff ff ff ff ff 81 01"), ZemErrorCode::BadVarint);
-    expectError(hex("04 ff ff"), ZemErrorCode::Truncated);
+    expectError(hex("0a 02 00 7f"), ZemErrorCode::BadTag);
+    expectError(hex("04 80 00"), ZemErrorCode::BadVarint);
+    expectError(hex("04 ff ff ff ff ff ff ff ff ff 02"), ZemErrorCode::BadVarint);
 }
 
+// Text on the wire must be valid UTF-8 wherever it appears; the rows are the faults a validator most often misses.
 TEST(ZemCodec, MalformedUtf8IsRefusedInStringsAndKeys) {
     const std::string bad[] = {
-        "\x80",              // not a lead byte
         "\xC0\x80",          // overlong NUL
-        "\xE2\x28\xA1",      // lead byte without its continuation
         "\xED\xA0\x80",      // surrogate U+D800
         "\xF4\x90\x80\x80",  // above U+10FFFF
         "\xE2\x82",          // sequence cut short by the end of the text
@@ -195,9 +180,9 @@ TEST(ZemCodec, MalformedUtf8IsRefusedInStringsAndKeys) {
     }
 }
 
+// A duplicate key would make the two ends disagree on a value.
 TEST(ZemCodec, DuplicateKeysAreRefusedInSortedAndUnsortedInput) {
-    std::string message = expectError(hex("0b 02 01 61 00 01 61 01"), ZemErrorCode::DuplicateKey);
-    EXPECT_NE(message.find("\"a\" at offset 5"), std::string::npos) << message;
+    expectError(hex("0b 02 01 61 00 01 61 01"), ZemErrorCode::DuplicateKey);
     // "a", "c", "a": the order breaks after a sorted run, and the duplicate is of a key from that run.
     expectError(hex("0b 03 01 61 00 01 63 00 01 61 00"), ZemErrorCode::DuplicateKey);
 }
@@ -212,7 +197,6 @@ TEST(ZemCodec, NestingCountsAndLengthsBeyondTheInputFailBeforeAllocating) {
     expectError(hex("0a 80 80 80 80 10 00"), ZemErrorCode::CountExceedsInput);  // 2^32 items in 7 bytes
     expectError(hex("0b 03 00 00 00 00 00"), ZemErrorCode::CountExceedsInput);  // 3 entries need 6 bytes
     expectError(hex("06 80 80 80 80 80 80 80 80 80 01"), ZemErrorCode::Truncated);  // 2^63 bytes of string
-    expectError(hex("07 ff ff ff ff ff ff ff ff 7f 41"), ZemErrorCode::Truncated);
     // A chain of arrays each claiming nearly as many items as bytes remain: every count passes its check, so
     // reserving by the claim would take 200 x 16 MB before the input runs out.
     Bytes chain;
@@ -237,6 +221,7 @@ Bytes documentedBytes(const std::string& name) {
     return hex(text);
 }
 
+// The frames in docs/protocol.md are what other implementations are written against.
 TEST(ZemCodec, DocumentedExampleMatchesEncoder) {
     Value request = Value::dictionary({
         {"request", Value::string("match")},
@@ -270,63 +255,36 @@ Result<ZemFrameHeader> decodeHeader(const Bytes& bytes) {
     return ZemFrame::decodeHeader(std::span<const uint8_t, ZemFrame::kHeaderBytes>(bytes.data(), 24));
 }
 
-struct Stream {
+// `count` request frames with serials 1, 2, ...; frame i carries sample(i).
+Bytes sampleFrames(int count) {
     Bytes bytes;
-    std::vector<ZemFrameHeader> headers;
-};
+    for (int i = 1; i <= count; ++i)
+        EXPECT_FALSE(ZemFrame::encode(ZemFrameKind::Request, static_cast<uint64_t>(i), 0, sample(i), bytes));
+    return bytes;
+}
 
-// A stream of frames of every kind and of various sizes, with the headers it holds; frame i carries sample(i).
-Stream sampleStream(int frames) {
-    Stream s;
-    for (int i = 1; i <= frames; ++i) {
-        auto kind = static_cast<ZemFrameKind>(1 + i % 3);
-        uint64_t inReplyTo = kind == ZemFrameKind::Reply ? static_cast<uint64_t>(i - 1) : 0;
-        size_t before = s.bytes.size();
-        EXPECT_FALSE(ZemFrame::encode(kind, static_cast<uint64_t>(i), inReplyTo, sample(i), s.bytes));
-        s.headers.push_back({kind, static_cast<uint64_t>(i), inReplyTo,
-                             static_cast<uint32_t>(s.bytes.size() - before - ZemFrame::kHeaderBytes)});
+// Takes every complete frame from `reader`, checking that frame i is request #i carrying sample(i).
+size_t drainAndCheck(ZemFrameReader& reader) {
+    size_t taken = 0;
+    while (auto frame = reader.next()) {
+        ++taken;
+        EXPECT_EQ(frame->header().serial, taken);
+        Result<Value> v = frame->decodePayload();
+        EXPECT_TRUE(v.ok() && strictlyEqual(*v, sample(static_cast<int>(taken)))) << "frame " << taken;
     }
-    return s;
+    return taken;
 }
 
-std::vector<ZemFrame> drain(ZemFrameReader& reader) {
-    std::vector<ZemFrame> frames;
-    while (auto f = reader.next()) frames.push_back(std::move(*f));
-    return frames;
-}
-
-void expectStream(const Stream& s, const std::vector<ZemFrame>& frames) {
-    ASSERT_EQ(frames.size(), s.headers.size());
-    for (size_t i = 0; i < frames.size(); ++i) {
-        EXPECT_EQ(frames[i].header(), s.headers[i]) << "frame " << i;
-        Result<Value> v = frames[i].decodePayload();
-        ASSERT_TRUE(v.ok()) << v.error().description();
-        EXPECT_TRUE(strictlyEqual(*v, sample(static_cast<int>(i) + 1))) << "frame " << i;
-    }
-}
-
-TEST(ZemFrame, HeaderRoundTripsWithLittleEndianFields) {
-    ZemFrameHeader h{ZemFrameKind::Reply, 0x0102030405060708ULL, 0x1112131415161718ULL, 0x00A0B0C0};
-    std::array<uint8_t, ZemFrame::kHeaderBytes> bytes;
-    ZemFrame::encodeHeader(h, bytes);
-    EXPECT_EQ(Bytes(bytes.begin(), bytes.end()),
-              header(ZemFrame::kMagic, 1, 3, 0, 0x00A0B0C0, 0x0102030405060708ULL, 0x1112131415161718ULL));
-    Result<ZemFrameHeader> back = ZemFrame::decodeHeader(bytes);
-    ASSERT_TRUE(back.ok());
-    EXPECT_EQ(*back, h);
-}
-
+// A bad header is refused with the code that says what is wrong, the size limit at its boundary.
 TEST(ZemFrame, BadHeadersAreRefusedWithTheirOwnCode) {
     const uint8_t m = ZemFrame::kMagic;
     const std::pair<Bytes, ZemErrorCode> cases[] = {
         {header('Z', 1, 2, 0, 2, 1, 0), ZemErrorCode::BadMagic},
         {header(m, 2, 2, 0, 2, 1, 0), ZemErrorCode::UnsupportedVersion},
-        {header(m, 1, 0, 0, 2, 1, 0), ZemErrorCode::UnknownKind},
         {header(m, 1, 4, 0, 2, 1, 0), ZemErrorCode::UnknownKind},
         {header(m, 1, 2, 1, 2, 1, 0), ZemErrorCode::BadHeader},  // reserved bits set
         {header(m, 1, 2, 0, 2, 0, 0), ZemErrorCode::BadHeader},  // request without serial
         {header(m, 1, 3, 0, 2, 5, 0), ZemErrorCode::BadHeader},  // reply to nothing
-        {header(m, 1, 1, 0, 2, 5, 4), ZemErrorCode::BadHeader},  // message claiming to be a reply
         {header(m, 1, 2, 0, ZemFrame::kMaxPayloadBytes + 1, 1, 0), ZemErrorCode::FrameTooLarge},
         {header(m, 1, 2, 0, 0xFFFFFFFF, 1, 0), ZemErrorCode::FrameTooLarge},
     };
@@ -339,6 +297,7 @@ TEST(ZemFrame, BadHeadersAreRefusedWithTheirOwnCode) {
     EXPECT_TRUE(decodeHeader(header(m, 1, 1, 0, ZemFrame::kMaxPayloadBytes, 0, 0)).ok());
 }
 
+// The sender refuses what the receiver would, leaving its buffer alone; a frame of exactly the limit is sent.
 TEST(ZemFrame, EncodeRefusesNonDictionariesBadSerialsAndOversizedPayloads) {
     Bytes out = {7};
     auto error = ZemFrame::encode(ZemFrameKind::Message, 1, 0, Value::array({}), out);
@@ -358,57 +317,21 @@ TEST(ZemFrame, EncodeRefusesNonDictionariesBadSerialsAndOversizedPayloads) {
     EXPECT_EQ(frame.size(), ZemFrame::kMaxFrameBytes);
 }
 
-// A payload must be one dictionary: anything else is a protocol error, an empty one (a complete frame with its
-// header alone) included. Descriptions name kind, serials and size for the logs.
-TEST(ZemFrame, PayloadThatIsNotADictionaryIsAProtocolErrorAndDescriptionsNameKindSerialsAndSize) {
-    EXPECT_TRUE(isZemError(ZemFrame({ZemFrameKind::Message, 1, 0, 2}, Bytes{0x0A, 0x00}).decodePayload().error(),
-                           ZemErrorCode::NotDictionary));
-    ZemFrameReader reader;
-    ASSERT_FALSE(reader.feed(header(ZemFrame::kMagic, 1, 1, 0, 0, 1, 0)));
-    auto empty = reader.next();
-    ASSERT_TRUE(empty);
-    EXPECT_TRUE(empty->payload().empty());
-    EXPECT_TRUE(isZemError(empty->decodePayload().error(), ZemErrorCode::Truncated));
-
-    EXPECT_EQ(ZemFrame({ZemFrameKind::Request, 12, 0, 3}, Bytes(3)).description(), "request #12 (3 bytes)");
-    EXPECT_EQ(ZemFrame({ZemFrameKind::Reply, 4, 12, 0}, Bytes{}).description(), "reply #4 to #12 (0 bytes)");
-}
-
-// Whole or a byte at a time (each frame taken as soon as it is complete), the reader yields the same frames.
-// Other chunkings are the zem_frame fuzz target's.
-TEST(ZemFrameReader, SameFramesWholeOrAByteAtATime) {
-    Stream s = sampleStream(40);
-    ZemFrameReader whole;
-    ASSERT_FALSE(whole.feed(s.bytes));
-    expectStream(s, drain(whole));
-    EXPECT_FALSE(whole.hasPartialFrame());
-    EXPECT_EQ(whole.bufferedBytes(), 0u);
-
-    ZemFrameReader bytewise;
-    std::vector<ZemFrame> frames;
-    for (uint8_t byte : s.bytes) {
-        ASSERT_FALSE(bytewise.feed(std::span<const uint8_t>(&byte, 1)));
-        while (auto f = bytewise.next()) frames.push_back(std::move(*f));
-    }
-    expectStream(s, frames);
-}
-
 // Part of a frame, even part of a header, is pending: a peer closing now cut a frame short.
 TEST(ZemFrameReader, PartOfAFrameStaysPendingUntilTheRestArrives) {
-    Stream s = sampleStream(1);
-    size_t half = s.bytes.size() / 2;
+    Bytes bytes = sampleFrames(1);
+    size_t half = bytes.size() / 2;
     ZemFrameReader reader;
-    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(s.bytes.data(), 5)));
+    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(bytes.data(), 5)));
     EXPECT_TRUE(reader.hasPartialFrame());
-    EXPECT_EQ(reader.bufferedBytes(), 5u);
-    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(s.bytes.data() + 5, half - 5)));
+    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(bytes.data() + 5, half - 5)));
     EXPECT_FALSE(reader.next());
-    EXPECT_EQ(reader.bufferedBytes(), half - ZemFrame::kHeaderBytes);
-    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(s.bytes.data() + half, s.bytes.size() - half)));
-    expectStream(s, drain(reader));
+    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(bytes.data() + half, bytes.size() - half)));
+    EXPECT_EQ(drainAndCheck(reader), 1u);
     EXPECT_FALSE(reader.hasPartialFrame());
 }
 
+// A peer announcing a huge frame is refused as soon as its header is complete, before anything is buffered for it.
 TEST(ZemFrameReader, OversizedFrameIsRefusedFromItsHeaderAlone) {
     ZemFrameReader reader;
     Bytes h = header(ZemFrame::kMagic, 1, 2, 0, ZemFrame::kMaxPayloadBytes + 1, 9, 0);
@@ -419,21 +342,21 @@ TEST(ZemFrameReader, OversizedFrameIsRefusedFromItsHeaderAlone) {
     EXPECT_EQ(*error->localizedDescription(), "frame of 16777217 bytes exceeds limit kMaxFrameBytes (16777216)");
 }
 
+// A stream is trusted up to its first bad header and never after it.
 TEST(ZemFrameReader, FramesBeforeABadHeaderSurviveAndTheErrorSticks) {
-    Stream s = sampleStream(3);
-    Bytes bytes = s.bytes;
+    Bytes bytes = sampleFrames(3);
     Bytes bad = header(0x00, 1, 2, 0, 2, 1, 0);
     bytes.insert(bytes.end(), bad.begin(), bad.end());
-    Stream more = sampleStream(2);
-    bytes.insert(bytes.end(), more.bytes.begin(), more.bytes.end());
+    Bytes more = sampleFrames(2);
+    bytes.insert(bytes.end(), more.begin(), more.end());
 
     ZemFrameReader reader;
     auto error = reader.feed(bytes);
     ASSERT_TRUE(error);
     EXPECT_TRUE(isZemError(*error, ZemErrorCode::BadMagic));
-    expectStream(s, drain(reader));
+    EXPECT_EQ(drainAndCheck(reader), 3u);
     // Nothing after the bad header is trusted, now or later.
-    EXPECT_EQ(reader.feed(more.bytes), error);
+    EXPECT_EQ(reader.feed(more), error);
     EXPECT_FALSE(reader.next());
 }
 
