@@ -131,53 +131,30 @@ class LedgerixTest : public ::testing::Test {
 
 using LedgerixRegistrationTest = LedgerixTest;
 
+// Guards what the registry records beside the bundle's dictionaries (which discovery shows end to end): the
+// entitlements, the containing application, and the data container private to its owner.
 TEST_F(LedgerixRegistrationTest, RecordCarriesWhatTheBundleAndItsApplicationSay) {
-    const fs::path bonjour = kExamples / "Greeter.app/PlugIns/Bonjour.bxplugin";
-    auto before = Date::now();
-    auto proxy = registerOK(bonjour);
-    ASSERT_TRUE(proxy);
-    EXPECT_EQ(proxy->bundleURL(), fs::canonical(bonjour).string());
-    EXPECT_EQ(proxy->pluginIdentifier(), "com.example.greeter.bonjour");
-    EXPECT_EQ(proxy->bundleVersion(), "1");
-    EXPECT_EQ(proxy->localizedName(), "Bonjour");
-    ASSERT_TRUE(proxy->registrationDate());
-    EXPECT_GE(proxy->registrationDate()->secondsSince1970, before.secondsSince1970 - 1);
-    ASSERT_TRUE(proxy->entitlements());
+    auto proxy = registerOK(kExamples / "Greeter.app/PlugIns/Bonjour.bxplugin");
+    ASSERT_TRUE(proxy && proxy->entitlements());
     EXPECT_TRUE(proxy->entitlements()->contains("com.quorvel.developer.replace-plugin"));
-
-    // The three scopes of the keyed look-up, and the kind restriction.
-    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("BDBundleVersion", std::nullopt, LXInfoScope::Info),
-              str("1"));
-    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("PrincipalClass", std::nullopt, LXInfoScope::PlugIn),
-              str("BonjourGreeting"));
-    EXPECT_EQ(proxy->objectForInfoDictionaryKeyOfClassInScope("Language", std::nullopt, LXInfoScope::Attributes),
-              str("fr"));
-    EXPECT_FALSE(proxy->objectForInfoDictionaryKeyOfClassInScope("Language", std::nullopt, LXInfoScope::Info));
-    EXPECT_FALSE(
-        proxy->objectForInfoDictionaryKeyOfClassInScope("Language", ValueKind::Array, LXInfoScope::Attributes));
 
     ASSERT_TRUE(proxy->containingBundle());
     EXPECT_EQ(proxy->containingBundle()->bundleURL(), fs::canonical(kExamples / "Greeter.app").string());
-    EXPECT_FALSE(proxy->containingBundle()->isPlaceholder());
-
-    // A plug-in that carries code gets its data container, with a tmp directory, private to its owner.
     ASSERT_TRUE(proxy->dataContainerURL());
     EXPECT_EQ(*proxy->dataContainerURL(), (state_ / "containers/com.example.greeter.bonjour").string());
     EXPECT_TRUE(fs::is_directory(*proxy->dataContainerURL() + "/tmp"));
     EXPECT_EQ(fs::status(*proxy->dataContainerURL()).permissions() & fs::perms::all, fs::perms::owner_all);
 }
 
+// Guards the container rule (only code with an identifier gets one) and the application record: one per
+// application, listing its plug-ins in path order, forgotten with its last plug-in.
 TEST_F(LedgerixRegistrationTest, DataOrNamelessPlugInGetsNoContainerAndApplicationIsRecordedOnce) {
     auto stationery = registerOK(kExamples / "Notes.app/PlugIns/Stationery.bxplugin");
     auto clipper = registerOK(kExamples / "Notes.app/PlugIns/Clipper.wexa");
-    ASSERT_TRUE(stationery && clipper);
+    auto nameless = registerOK(kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin");
+    ASSERT_TRUE(stationery && clipper && nameless);
     EXPECT_FALSE(stationery->dataContainerURL());
     EXPECT_TRUE(clipper->dataContainerURL());
-    EXPECT_FALSE(stationery->entitlements());
-    // Nor does a plug-in without an identifier, which is recorded all the same.
-    auto nameless = registerOK(kExamples / "Misconfigured.app/PlugIns/MissingIdentifier.bxplugin");
-    ASSERT_TRUE(nameless);
-    EXPECT_FALSE(nameless->pluginIdentifier());
     EXPECT_FALSE(nameless->dataContainerURL());
 
     auto app = workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string());
@@ -186,22 +163,18 @@ TEST_F(LedgerixRegistrationTest, DataOrNamelessPlugInGetsNoContainerAndApplicati
     // In path order: Clipper.wexa before Stationery.bxplugin.
     EXPECT_EQ(app->plugins()[0]->pluginUUID(), clipper->pluginUUID());
     EXPECT_EQ(app->plugins()[1]->pluginUUID(), stationery->pluginUUID());
-    // The containing bundle of a record lists the same plug-ins, read when asked.
-    EXPECT_EQ(stationery->containingBundle()->plugins().size(), 2u);
 
-    // Unregistering the last plug-in forgets the application.
     EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Clipper.wexa").string()));
-    EXPECT_EQ(workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string())->plugins().size(), 1u);
     EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Stationery.bxplugin").string()));
     EXPECT_FALSE(workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string()));
 }
 
+// Guards look-up: by UUID, and by any spelling of the path (URL, trailing slash, "..", a link) as the same record.
 TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
     fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {.identifier = "com.example.one"});
     auto proxy = registerOK(bundle);
     ASSERT_TRUE(proxy);
-    auto byUuid = workspace_->pluginProxyForUUID(*proxy->pluginUUID());
-    ASSERT_TRUE(byUuid);
+    ASSERT_TRUE(workspace_->pluginProxyForUUID(*proxy->pluginUUID()));
     EXPECT_FALSE(workspace_->pluginProxyForUUID(Uuid::random()));
 
     fs::create_directory_symlink(bundle, dir_ / "link.bxplugin");
@@ -212,14 +185,11 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
         ASSERT_TRUE(found) << form;
         EXPECT_EQ(found->pluginUUID(), proxy->pluginUUID()) << form;
     }
-    // Dropping the derived caches changes no answer; records handed out before stay valid.
-    workspace_->LXClearSchemaCaches();
-    EXPECT_EQ(workspace_->pluginProxyForUUID(*proxy->pluginUUID())->bundleURL(), bundle.string());
-    EXPECT_TRUE(byUuid->infoVrec());
     EXPECT_FALSE(workspace_->pluginProxyForURL("relative/One.bxplugin"));
-    EXPECT_FALSE(workspace_->applicationProxyForBundleURL((bundles_ / "Nowhere.app").string()));
 }
 
+// Guards unregistering a bundle already deleted (announced, looked-up-able during the announcement), and the
+// refusal of a path that is not registered.
 TEST_F(LedgerixRegistrationTest, UnregisterWorksAfterTheBundleIsGoneAndRefusesUnknownPaths) {
     fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {});
     auto proxy = registerOK(bundle);
@@ -239,26 +209,14 @@ TEST_F(LedgerixRegistrationTest, UnregisterWorksAfterTheBundleIsGoneAndRefusesUn
     EXPECT_EQ(error->code(), kLXNotRegistered);
 }
 
-TEST_F(LedgerixRegistrationTest, ResidenceOutsideApplicationsOnTheSystemVolumeAndInPlaceholderApplications) {
-    // The workspace's root stands for "/", so <root>/System/ is the system volume here.
-    auto system = registerOK(writePlugIn(root_ / "System/Library/PlugIns/Clock.bxplugin", {.identifier = "a.clock"}));
-    auto lookalike = registerOK(writePlugIn(root_ / "SystemX/Clock.bxplugin", {.identifier = "b.clock"}));
-    auto outside = registerOK(writePlugIn(bundles_ / "Loose.bxplugin", {.identifier = "c.loose"}));
-    auto notAnApp = registerOK(writePlugIn(bundles_ / "Folder/PlugIns/In.bxplugin", {.identifier = "d.in"}));
-    ASSERT_TRUE(system && lookalike && outside && notAnApp);
-    EXPECT_TRUE(system->isOnSystemPartition());
-    EXPECT_FALSE(lookalike->isOnSystemPartition());
-    // Outside applications the registry records the plug-in all the same; whether it may be used is not its call.
-    EXPECT_FALSE(outside->containingBundle());
-    EXPECT_FALSE(notAnApp->containingBundle());
-
-    // An application without information is a placeholder until it is complete.
+// Guards the placeholder state: an application without information is a placeholder until it is complete, and
+// registering again records that it now is.
+TEST_F(LedgerixRegistrationTest, ApplicationWithoutInformationIsAPlaceholderUntilComplete) {
     auto proxy = registerOK(writePlugIn(bundles_ / "Half.app/PlugIns/P.bxplugin", {}));
     ASSERT_TRUE(proxy && proxy->containingBundle());
     EXPECT_TRUE(proxy->containingBundle()->isPlaceholder());
     EXPECT_EQ(proxy->containingBundle()->localizedName(), "Half");
 
-    // Once the application is complete, registering again records that.
     ASSERT_FALSE(Document::writeFileAtomically(bundles_ / "Half.app/Info.vrec",
                                                Value::dictionary({{"BDBundleIdentifier", str("com.example.half")}})));
     auto again = registerOK(bundles_ / "Half.app/PlugIns/P.bxplugin");
@@ -267,6 +225,7 @@ TEST_F(LedgerixRegistrationTest, ResidenceOutsideApplicationsOnTheSystemVolumeAn
     EXPECT_EQ(again->containingBundle()->bundleIdentifier(), "com.example.half");
 }
 
+// Guards the registry's locking: two threads registering and looking up at once lose nothing and damage nothing.
 TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     constexpr int kPerThread = 25;
     std::vector<fs::path> paths;
@@ -290,37 +249,27 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
-TEST(LXBexilProxyTest, DictionariesReadFromTextOrValuesAndOldStyleFallsBack) {
-    LXBexilProxy::Fields garbled;
-    garbled.infoVrecDocument = "<not a document";
-    garbled.entitlementsDocument = Document::write(Value::array({})).value();
-    LXBexilProxy broken(garbled);
-    EXPECT_FALSE(broken.infoVrec());
-    EXPECT_FALSE(broken.entitlements()) << "a root that is not a dictionary reads as absent";
-    EXPECT_FALSE(broken.objectForInfoDictionaryKeyOfClassInScope("x", std::nullopt, LXInfoScope::Attributes));
-
+// Guards old-style bundles: their "Bexil" dictionary stands in for the plug-in dictionary.
+TEST(LXBexilProxyTest, OldStyleBundleFallsBackToItsBexilDictionary) {
     LXBexilProxy::Fields oldStyle;
     Value bexil = Value::dictionary({{"RZExtensionAttributes", Value::dictionary({{"a", str("b")}})}});
     oldStyle.infoVrec = Value::dictionary({{"Bexil", bexil}});
-    oldStyle.infoVrecDocument = "<ignored when a value is given";
     LXBexilProxy proxy(oldStyle);
-    EXPECT_EQ(proxy.bexilDictionary(), bexil);
     EXPECT_EQ(proxy.objectForInfoDictionaryKeyOfClassInScope("a", ValueKind::String, LXInfoScope::Attributes),
               str("b"));
 }
 
-// ---- Registering again ----
-
 // Registering a bundle again is silent when nothing changed, keeps the UUID when only the content changed, and
 // makes a new record under a new UUID for a new version; every change is announced as uninstall then install, the
 // uninstall while the old record is still there, so that whoever caches records by UUID rebuilds them.
-TEST_F(LedgerixTest, RegisteringAgainKeepsTheUuidUnlessTheVersionChanges) {
+using LedgerixReRegistrationTest = LedgerixTest;
+
+TEST_F(LedgerixReRegistrationTest, NewVersionIsUninstallThenInstallUnderANewUuid) {
     fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {.version = "1"});
     auto first = registerOK(bundle);
     auto unchanged = registerOK(bundle);
     ASSERT_TRUE(first && unchanged);
     EXPECT_EQ(unchanged->pluginUUID(), first->pluginUUID());
-    EXPECT_EQ(unchanged->registrationDate(), first->registrationDate());
     EXPECT_EQ(observer_->snapshot().size(), 1u);
 
     writePlugIn(bundle, {.version = "1", .entitlements = Value::dictionary({{"k", Value::boolean(true)}})});
@@ -332,43 +281,20 @@ TEST_F(LedgerixTest, RegisteringAgainKeepsTheUuidUnlessTheVersionChanges) {
     writePlugIn(bundle, {.version = "2"});
     auto newVersion = registerOK(bundle);
     ASSERT_TRUE(newVersion);
-    EXPECT_NE(newVersion->pluginUUID(), first->pluginUUID());
-    EXPECT_EQ(newVersion->bundleVersion(), "2");
     const std::string one = first->pluginUUID()->string(), two = newVersion->pluginUUID()->string();
     EXPECT_EQ(observer_->snapshot(), (std::vector<std::string>{"install " + one, "uninstall " + one, "install " + one,
                                                                "uninstall " + one, "install " + two}));
     EXPECT_EQ(observer_->uninstallsSeenRegistered, 2);
     EXPECT_FALSE(workspace_->pluginProxyForUUID(*first->pluginUUID()));
     EXPECT_EQ(count(), 1u);
-
-    // Observers that are gone are skipped.
-    observer_.reset();
-    EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
 }
 
 // ---- Persistence and damage ----
 
 using LedgerixPersistenceTest = LedgerixTest;
 
-TEST_F(LedgerixPersistenceTest, RecordsSurviveReopening) {
-    auto hello = registerOK(kExamples / "Greeter.app/PlugIns/Hello.bxplugin");
-    auto clock = registerOK(writePlugIn(root_ / "System/Library/PlugIns/Clock.bxplugin", {.identifier = "s.clock"}));
-    ASSERT_TRUE(hello && clock);
-    open();
-    auto hello2 = workspace_->pluginProxyForUUID(*hello->pluginUUID());
-    auto clock2 = workspace_->pluginProxyForURL(clock->bundleURL().value());
-    ASSERT_TRUE(hello2 && clock2);
-    EXPECT_EQ(hello2->registrationDate(), hello->registrationDate());
-    EXPECT_EQ(hello2->infoVrec(), hello->infoVrec());
-    EXPECT_EQ(hello2->dataContainerURL(), hello->dataContainerURL());
-    EXPECT_EQ(hello2->containingBundle()->bundleURL(), hello->containingBundle()->bundleURL());
-    EXPECT_EQ(clock2->pluginUUID(), clock->pluginUUID());
-    EXPECT_TRUE(clock2->isOnSystemPartition());
-    // Registering the unchanged bundle after a restart still keeps its UUID.
-    EXPECT_EQ(registerOK(kExamples / "Greeter.app/PlugIns/Hello.bxplugin")->pluginUUID(), hello->pluginUUID());
-    EXPECT_EQ(observer_->snapshot().size(), 0u);
-}
-
+// Guards durability: a registry killed at a random moment while registering reopens intact and keeps every
+// registration it had reported done.
 TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReported) {
     constexpr int kBundles = 40;
     std::vector<fs::path> paths;
@@ -437,35 +363,28 @@ TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReporte
     EXPECT_TRUE(anyReported) << "the child never got a registration done before being killed";
 }
 
-// A database that is garbage, or cut short (which a light open would not notice), is moved aside untouched at
-// open and an empty, working registry started in its place.
+// A database cut short (which a light open would not notice) is moved aside untouched at open and an empty, working
+// registry started in its place.
 TEST_F(LedgerixPersistenceTest, DamagedDatabaseIsMovedAsideAtOpenAndRegistryStartsEmpty) {
     const fs::path file = state_ / "registry.sqlite3";
-    const std::function<void()> damages[] = {
-        [&] { std::ofstream(file, std::ios::binary | std::ios::trunc) << std::string(8192, 'x'); },
-        [&] { fs::resize_file(file, fs::file_size(file) / 2); },
-    };
-    for (const auto& damage : damages) {
-        open();
-        fillAndClose();
-        ASSERT_FALSE(fs::exists(state_ / "registry.sqlite3-wal")) << "closing should have checkpointed the log";
-        damage();
-        const std::string damaged = test::readText(file);
+    fillAndClose();
+    ASSERT_FALSE(fs::exists(state_ / "registry.sqlite3-wal")) << "closing should have checkpointed the log";
+    fs::resize_file(file, fs::file_size(file) / 2);
+    const std::string damaged = test::readText(file);
 
-        log::CaptureSink sink(log::Level::Error);
-        open();
-        EXPECT_EQ(count(), 0u);
-        EXPECT_FALSE(workspace_->checkIntegrity());
-        EXPECT_TRUE(sink.contains("is damaged"));
-        bool keptAside = false;
-        for (const auto& entry : fs::directory_iterator(state_))
-            if (entry.path().filename().string().starts_with("registry.sqlite3.corrupt-"))
-                keptAside = keptAside || test::readText(entry.path()) == damaged;
-        EXPECT_TRUE(keptAside);
-        EXPECT_TRUE(registerOK(writePlugIn(bundles_ / "One.bxplugin", {})));
-    }
+    log::CaptureSink sink(log::Level::Error);
+    open();
+    EXPECT_EQ(count(), 0u);
+    EXPECT_TRUE(sink.contains("is damaged"));
+    bool keptAside = false;
+    for (const auto& entry : fs::directory_iterator(state_))
+        if (entry.path().filename().string().starts_with("registry.sqlite3.corrupt-"))
+            keptAside = keptAside || test::readText(entry.path()) == damaged;
+    EXPECT_TRUE(keptAside);
+    EXPECT_TRUE(registerOK(writePlugIn(bundles_ / "One.bxplugin", {})));
 }
 
+// Guards damage a light open misses: a failing read marks the file, and the next open checks it and moves it aside.
 TEST_F(LedgerixPersistenceTest, DamageFoundWhileRunningIsCheckedAndMovedAsideAtNextOpen) {
     fillAndClose();
     // Overwrite the middle of the file, leaving the header and the schema page intact: a light open passes.
@@ -478,18 +397,16 @@ TEST_F(LedgerixPersistenceTest, DamageFoundWhileRunningIsCheckedAndMovedAsideAtN
         stream.write(garbage.data(), static_cast<std::streamsize>(garbage.size()));
     }
     open();
-    log::CaptureSink sink(log::Level::Error);
     EXPECT_FALSE(workspace_->installedPlugins()) << "reading a damaged table must fail, not answer wrongly";
-    EXPECT_TRUE(sink.contains("will be checked when next opened"));
     EXPECT_TRUE(fs::exists(state_ / "registry.sqlite3.needs-check"));
 
     open();
-    EXPECT_TRUE(sink.contains("is damaged ("));
     EXPECT_EQ(count(), 0u);
     EXPECT_FALSE(fs::exists(state_ / "registry.sqlite3.needs-check"));
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
+// Guards downgrades: a database written by a newer version is refused and left alone, never moved aside as damage.
 TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     workspace_.reset();
     fs::path file = state_ / "registry.sqlite3";
@@ -504,23 +421,6 @@ TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     EXPECT_EQ(opened.error().code(), kLXStoreFailure);
     EXPECT_NE(opened.error().localizedDescription()->find("schema version 99"), std::string::npos);
     EXPECT_TRUE(fs::exists(file)) << "a newer database must be left alone";
-}
-
-TEST_F(LedgerixPersistenceTest, DefaultWorkspaceIsSharedAndLivesInTheStateDirectoryThatFollowsTheEnvironment) {
-    {
-        test::ScopedEnv state("BX_STATE_DIR", (dir_ / "default").string());
-        EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(), dir_ / "default");
-        auto first = LXApplicationWorkspace::defaultWorkspace();
-        auto second = LXApplicationWorkspace::defaultWorkspace();
-        ASSERT_TRUE(first.ok()) << first.error().description();
-        ASSERT_TRUE(second.ok());
-        EXPECT_EQ(first.value(), second.value());
-        EXPECT_TRUE(fs::exists(dir_ / "default/registry.sqlite3"));
-    }
-    test::ScopedEnv state("BX_STATE_DIR", std::nullopt);
-    test::ScopedEnv xdg("XDG_STATE_HOME", "/xdg/state");
-    EXPECT_EQ(LedgerixWorkspace::defaultStateDirectory(),
-              fs::path(geteuid() == 0 ? "/var/lib/bexil" : "/xdg/state/bexil"));
 }
 
 // ---- Discovery queries ----
@@ -553,7 +453,8 @@ class LedgerixQueryTest : public LedgerixTest {
 };
 
 // Plain equality on the extension point or the identifier pre-selects through the index (the filter sees only
-// those plug-ins); digit runs compare by value, lists are alternatives, and two rules narrow together.
+// those plug-ins); digit runs compare by value, lists are alternatives, and two rules narrow together. Any other
+// rule must not narrow the candidates.
 TEST_F(LedgerixQueryTest, PlainEqualityRulesPreselectWhatTheFilterSees) {
     std::optional<LXProxyList> result;
     auto seen = filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.b")}}), &result,
@@ -561,28 +462,19 @@ TEST_F(LedgerixQueryTest, PlainEqualityRulesPreselectWhatTheFilterSees) {
     EXPECT_EQ(seen.size(), 10u);
     for (const std::string& id : seen) EXPECT_EQ(std::stoi(id.substr(13)) % 3, 1) << id;
     EXPECT_EQ(result->size(), 9u);  // the filter's refusal counts
-    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("=com.example.a")}})).size(), 10u);
     EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.v1")}})).size(), 10u);
-    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionIdentifier", str("com.example.q007")}})),
-              std::vector<std::string>{"com.example.q7"});
-
+    // A list is alternatives; with a point rule beside it, both narrow together.
     Value ids = Value::array({str("com.example.q3"), str("=com.example.q4"), str("com.example.q99")});
-    EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionIdentifier", ids}})),
-              (std::vector<std::string>{"com.example.q3", "com.example.q4"}));
     EXPECT_EQ(filtered(Value::dictionary(
                   {{"RZExtensionIdentifier", ids}, {"RZExtensionPointIdentifier", str("com.example.a")}})),
               std::vector<std::string>{"com.example.q3"});
-}
 
-// Any rule that can hold otherwise than by equality pins nothing, and every plug-in reaches the filter.
-TEST_F(LedgerixQueryTest, RulesThatAreNotPlainEqualityLetEveryPlugInThrough) {
-    for (Value pattern : {str(">=com.example.b"), str("<>com.example.a"), str("?ZQ-CONFORMS:public.item"),
-                          Value::boolean(true), Value::array({}), Value::array({str("com.example.a"), Value::int64(1)}),
+    // Any rule that can hold otherwise than by equality pins nothing, and every plug-in reaches the filter.
+    for (Value pattern : {str("<>com.example.a"), Value::boolean(true), Value::array({}),
                           Value::array({str("com.example.a"), str("<com.example.b")})}) {
         EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", pattern}})).size(), 30u)
             << pattern.description();
     }
-    EXPECT_EQ(filtered(Value::dictionary({{"RZUserElection", str("1")}})).size(), 30u);
     EXPECT_EQ(filtered(str("not a dictionary")).size(), 30u);
 }
 
@@ -605,6 +497,7 @@ TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandid
     EXPECT_EQ(seen, (std::vector<std::string>{"com.example.q1", ""}));
 }
 
+// Guards the filter call: it gets each plug-in's own entitlements and may re-enter the registry without deadlock.
 TEST_F(LedgerixQueryTest, FilterSeesEntitlementsAndMayCallTheRegistry) {
     int withEntitlements = 0;
     auto matches = workspace_->pluginsMatchingQueryApplyFilter(
@@ -627,25 +520,20 @@ TEST_F(LedgerixQueryTest, FilterSeesEntitlementsAndMayCallTheRegistry) {
 
 using LedgerixBadBundleTest = LedgerixTest;
 
+// Guards every refusal's code (one bundle per kind of fault, plus identifiers that would put the container outside
+// the containers directory) and that no refusal changes the registry, not even one at a registered path.
 TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchangedAContainerThatCannotBeMadeIncluded) {
     // A good registration that must survive every failure below, including failures at its own path.
     fs::path good = writePlugIn(bundles_ / "A.app/PlugIns/Good.bxplugin", {.identifier = "com.example.good"});
     auto original = registerOK(good);
     ASSERT_TRUE(original);
     const auto write = test::writeText;
-    for (const char* name : {"ArrayRoot", "NoPlugIn", "StringPlugIn"})
-        fs::create_directories(bundles_ / (std::string(name) + ".bxplugin"));
-    write(bundles_ / "File.bxplugin", "not a directory");
+    fs::create_directories(bundles_ / "NoPlugIn.bxplugin");
     write(bundles_ / "Garbled.bxplugin/Info.vrec", "<vrec version=\"1\"><dict><key>x</key>");
-    ASSERT_FALSE(Document::writeFileAtomically(bundles_ / "ArrayRoot.bxplugin/Info.vrec", Value::array({str("x")})));
     ASSERT_FALSE(Document::writeFileAtomically(bundles_ / "NoPlugIn.bxplugin/Info.vrec",
                                                Value::dictionary({{"BDBundleIdentifier", str("x.y")}})));
-    ASSERT_FALSE(Document::writeFileAtomically(
-        bundles_ / "StringPlugIn.bxplugin/Info.vrec",
-        Value::dictionary({{"BDBundleIdentifier", str("x.y")}, {"RZExtension", str("nope")}})));
     writePlugIn(bundles_ / "BadEntitlements.bxplugin", {.identifier = "x.bad1"});
     write(bundles_ / "BadEntitlements.bxplugin/Entitlements.vrec", "garbage");
-    writePlugIn(bundles_ / "ArrayEntitlements.bxplugin", {.identifier = "x.bad2", .entitlements = Value::array({})});
     writePlugIn(bundles_ / "HugeEntitlements.bxplugin", {.identifier = "x.bad3"});
     write(bundles_ / "HugeEntitlements.bxplugin/Entitlements.vrec", std::string(2 << 20, ' '));
     writePlugIn(bundles_ / "Escape.bxplugin", {.identifier = "../../escape"});
@@ -660,14 +548,10 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchangedAContainerThatCan
     const Case cases[] = {
         {"relative/Thing.bxplugin", kLXBadPath},
         {std::string("/tmp/nul\0byte", 13), kLXBadPath},
-        {(bundles_ / "File.bxplugin").string(), kLXBadPath},
         {(bundles_ / "LoopA.bxplugin").string(), kLXBadPath},
         {(bundles_ / "Garbled.bxplugin").string(), kLXBadInfo},
-        {(bundles_ / "ArrayRoot.bxplugin").string(), kLXBadInfo},
         {(bundles_ / "NoPlugIn.bxplugin").string(), kLXNotAPlugIn},
-        {(bundles_ / "StringPlugIn.bxplugin").string(), kLXNotAPlugIn},
         {(bundles_ / "BadEntitlements.bxplugin").string(), kLXBadEntitlements},
-        {(bundles_ / "ArrayEntitlements.bxplugin").string(), kLXBadEntitlements},
         {(bundles_ / "HugeEntitlements.bxplugin").string(), kLXBadEntitlements},
         {(bundles_ / "Escape.bxplugin").string(), kLXBadIdentifier},
         {(bundles_ / "Dots.bxplugin").string(), kLXBadIdentifier},
@@ -677,7 +561,6 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchangedAContainerThatCan
         ASSERT_FALSE(result.ok()) << c.path;
         EXPECT_EQ(result.error().domain(), LXErrorDomain) << c.path;
         EXPECT_EQ(result.error().code(), c.code) << c.path << ": " << result.error().description();
-        EXPECT_TRUE(result.error().localizedDescription().has_value());
     }
     EXPECT_FALSE(fs::exists(dir_ / "escape"));
 
