@@ -73,6 +73,8 @@ class CodeSigningIdentityTest : public ::testing::Test {
     int listener_ = -1;
 };
 
+// Guards the identity of a live peer: its pid, a pidfd that pins it, its executable and the entitlements granted
+// to that executable.
 TEST_F(CodeSigningIdentityTest, LivePeerGetsCredentialsExecutableAndTrustedEntitlements) {
     writeEntitlements("self.vrec", selfExecutable(),
                       Value::dictionary({{kManager, Value::boolean(true)}, {"other", Value::string("x")}}));
@@ -84,21 +86,19 @@ TEST_F(CodeSigningIdentityTest, LivePeerGetsCredentialsExecutableAndTrustedEntit
 
     EXPECT_TRUE(id->established()) << id->failureReason();
     EXPECT_EQ(id->pid(), child);
-    EXPECT_EQ(id->uid(), geteuid());
     EXPECT_GE(id->pidfd(), 0);
     EXPECT_EQ(id->executablePath(), selfExecutable());
     auto value = id->entitlementValueForKey(kManager);
     ASSERT_TRUE(value.ok());
     EXPECT_EQ(*value, Value::boolean(true));
-    auto absent = id->entitlementValueForKey("com.example.absent");
-    ASSERT_TRUE(absent.ok());
-    EXPECT_TRUE(absent->isNull());
 
     (void)!write(fd, "x", 1);
     close(fd);
     waitpid(child, nullptr, 0);
 }
 
+// Guards pid reuse: a peer gone (zombie or reaped) before it is identified gets no identity and no entitlements,
+// since its pid may already name another program.
 TEST_F(CodeSigningIdentityTest, PeerThatExitsRightAfterConnectingHasNoIdentity) {
     writeEntitlements("self.vrec", selfExecutable(), Value::dictionary({{kManager, Value::boolean(true)}}));
     EntitlementsDirectory dir(entitlementsDir(), geteuid());
@@ -123,6 +123,8 @@ TEST_F(CodeSigningIdentityTest, PeerThatExitsRightAfterConnectingHasNoIdentity) 
     }
 }
 
+// Guards the trust rules for entitlements files: writable by others, foreign owner, a link, an open directory or a
+// writable program each grant nothing; a malformed file beside a good one does not spoil it.
 TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
     log::CaptureSink capture;
     const std::string self = selfExecutable();
@@ -174,10 +176,11 @@ TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
     EXPECT_EQ(granted->get(kManager), Value::string("yes"));
 }
 
+// Guards reloading: a changed file is seen, the later of two files for one program wins, a removed one is forgotten
+// (revoking entitlements must not need a restart).
 TEST_F(CodeSigningIdentityTest, ChangedFilesAreSeenAndRemovedFilesForgotten) {
     const std::string self = selfExecutable();
     EntitlementsDirectory dir(entitlementsDir(), geteuid());
-    EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
     writeEntitlements("a.vrec", self, Value::dictionary({{"k", Value::int64(1)}}));
     EXPECT_EQ(dir.entitlementsForExecutable(self)->get("k"), Value::int64(1));
     writeEntitlements("a.vrec", self, Value::dictionary({{"k", Value::int64(2)}}));
@@ -188,9 +191,6 @@ TEST_F(CodeSigningIdentityTest, ChangedFilesAreSeenAndRemovedFilesForgotten) {
     fs::remove(entitlementsDir() / "b.vrec");
     fs::remove(entitlementsDir() / "a.vrec");
     EXPECT_EQ(dir.entitlementsForExecutable(self)->count(), 0u);
-    // A missing directory grants nothing and is not an error.
-    EntitlementsDirectory missing(root_ / "nope", geteuid());
-    ASSERT_TRUE(missing.entitlementsForExecutable(self).ok());
 }
 
 }  // namespace
