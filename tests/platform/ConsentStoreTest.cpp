@@ -12,18 +12,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// A bundle whose information dictionary is given by the test.
-class FakeBundle : public PlatformBundle {
-  public:
-    explicit FakeBundle(std::optional<Value> info) : info_(std::move(info)) {}
-    std::optional<std::string> stringProperty(BundleStringProperty) const override { return std::nullopt; }
-    std::optional<Value> infoDictionary() const override { return info_; }
-    std::string description() const override { return "<fake bundle>"; }
-
-  private:
-    std::optional<Value> info_;
-};
-
 class ConsentStoreTest : public ::testing::Test {
   protected:
     fs::path file() const { return directory_ / "state" / "consent.vrec"; }
@@ -83,20 +71,6 @@ TEST_F(ConsentStoreTest, UnusableFileOrEntryFailsTheQueryAndIsNeverOverwritten) 
     auto other = store.informationForBundleIdentifier("com.example.Other");
     ASSERT_TRUE(other);
     EXPECT_TRUE(other->empty());
-}
-
-// Guards the bundle query: by the bundle's identifier, and no answer at all for a bundle without a usable one.
-TEST_F(ConsentStoreTest, BundleQueryGoesByItsIdentifier) {
-    ConsentStore store(file());
-    ASSERT_FALSE(store.setGranted("com.example.App", "camera", true));
-    FakeBundle app(Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.App")}}));
-    auto records = store.copyInformationForBundle(app);
-    ASSERT_TRUE(records);
-    EXPECT_EQ(*records, (std::vector<ConsentRecord>{{"camera", true}}));
-
-    for (std::optional<Value> info : {std::optional<Value>(),
-                                      std::optional<Value>(Value::dictionary({{"BDBundleIdentifier", Value::string("")}}))})
-        EXPECT_FALSE(store.copyInformationForBundle(FakeBundle(info)));
 }
 
 }  // namespace

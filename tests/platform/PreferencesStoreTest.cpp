@@ -2,7 +2,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <string>
 
@@ -37,23 +36,6 @@ class PreferencesStoreTest : public ::testing::Test {
     test::TempDir root_{"bx-prefs"};
     fs::path directory_ = root_ / "preferences";
 };
-
-// Guards the basic contract: absent reads as null, a set keeps the other keys, null removes, and the file is an
-// ordinary document named by domain and host (a host name can never add a directory to the path).
-TEST_F(PreferencesStoreTest, AbsentFileAndKeyReadAsNullSetValueKeepsOtherKeysAndNullRemoves) {
-    PreferencesStore store(directory_, "host");
-    EXPECT_TRUE(store.copyValueAfterSync(kDomain, "a").isNull());
-    ASSERT_FALSE(store.setValue(kDomain, "a", Value::string("one")));
-    ASSERT_FALSE(store.setValue(kDomain, "b", Value::array({Value::int64(1)})));
-    EXPECT_EQ(store.copyValueAfterSync(kDomain, "a"), Value::string("one"));
-    ASSERT_FALSE(store.setValue(kDomain, "a", Value::null()));
-    auto domain = store.readDomain(kDomain);
-    ASSERT_TRUE(domain);
-    EXPECT_EQ(*domain, Value::dictionary({{"b", Value::array({Value::int64(1)})}}));
-    EXPECT_EQ(store.fileForDomain(kDomain), directory_ / "com.example.prefs.host.vrec");
-    EXPECT_EQ(Document::readFile(store.fileForDomain(kDomain)).value(), *domain);
-    EXPECT_EQ(PreferencesStore::currentHostName().find('/'), std::string::npos);
-}
 
 // A reader that already cached the domain sees what another process wrote at its next read, without being made
 // again; values of the same length written in quick succession are told apart too.
