@@ -408,17 +408,24 @@ class LedgerixQueryTest : public LedgerixTest {
         const char* points[] = {"com.example.a", "com.example.b", "com.example.v01"};
         for (int i = 0; i < 30; ++i) {
             TestBundle shape{.identifier = "com.example.q" + std::to_string(i), .point = points[i % 3]};
-            if (i % 5 == 0) shape.entitlements = Value::dictionary({{"tag", Value::int64(i)}});
+            if (i % 5 == 0) shape.entitlements = Value::dictionary({{"tag", str(shape.identifier)}});
             registerOK(writePlugIn(bundles_ / ("Q.app/PlugIns/Q" + std::to_string(i) + ".bxplugin"), shape));
         }
     }
 
-    // Runs the query and returns the identifiers the filter saw; the filter keeps what `keep` says.
+    // Runs the query and returns the identifiers the filter saw; the filter keeps what `keep` says. Each call of
+    // the filter re-enters the registry (which must not deadlock) and checks that it got the plug-in's own
+    // entitlements.
     std::vector<std::string> filtered(const Value& query, std::optional<LXProxyList>* result = nullptr,
                                       std::function<bool(std::string_view)> keep = nullptr) {
         std::vector<std::string> seen;
         auto matches = workspace_->pluginsMatchingQueryApplyFilter(
-            query, [&](std::string_view identifier, const std::optional<Value>&) {
+            query, [&](std::string_view identifier, const std::optional<Value>& entitlements) {
+                EXPECT_TRUE(workspace_->installedPlugins());
+                if (entitlements) {
+                    ++withEntitlements_;
+                    EXPECT_EQ(entitlements->get("tag"), str(std::string(identifier)));
+                }
                 seen.emplace_back(identifier);
                 return keep ? keep(identifier) : true;
             });
@@ -426,6 +433,8 @@ class LedgerixQueryTest : public LedgerixTest {
         if (result) *result = matches;
         return seen;
     }
+
+    int withEntitlements_ = 0;
 };
 
 // Plain equality on the extension point or the identifier pre-selects through the index (the filter sees only
@@ -438,6 +447,7 @@ TEST_F(LedgerixQueryTest, PlainEqualityRulesPreselectWhatTheFilterSees) {
     EXPECT_EQ(seen.size(), 10u);
     for (const std::string& id : seen) EXPECT_EQ(std::stoi(id.substr(13)) % 3, 1) << id;
     EXPECT_EQ(result->size(), 9u);  // the filter's refusal counts
+    EXPECT_EQ(withEntitlements_, 2);  // q10 and q25 serve point b and carry entitlements
     EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.v1")}})).size(), 10u);
     // A list is alternatives; with a point rule beside it, both narrow together.
     Value ids = Value::array({str("com.example.q3"), str("=com.example.q4"), str("com.example.q99")});
@@ -471,25 +481,6 @@ TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandid
     // Without an identifier a plug-in may still answer an identifier rule from its dictionaries.
     seen = filtered(Value::dictionary({{"RZExtensionIdentifier", str("com.example.q1")}}));
     EXPECT_EQ(seen, (std::vector<std::string>{"com.example.q1", ""}));
-}
-
-// Guards the filter call: it gets each plug-in's own entitlements and may re-enter the registry without deadlock.
-TEST_F(LedgerixQueryTest, FilterSeesEntitlementsAndMayCallTheRegistry) {
-    int withEntitlements = 0;
-    auto matches = workspace_->pluginsMatchingQueryApplyFilter(
-        Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.a")}}),
-        [&](std::string_view identifier, const std::optional<Value>& entitlements) {
-            // Re-entering the registry from the filter must not deadlock.
-            EXPECT_TRUE(workspace_->installedPlugins());
-            if (entitlements) {
-                ++withEntitlements;
-                EXPECT_EQ(entitlements->get("tag"), Value::int64(std::stoi(std::string(identifier.substr(13)))));
-            }
-            return true;
-        });
-    ASSERT_TRUE(matches);
-    EXPECT_EQ(matches->size(), 10u);
-    EXPECT_EQ(withEntitlements, 2);  // q0 and q15 serve point a and carry entitlements
 }
 
 // ---- Bundles the registry refuses ----

@@ -48,16 +48,8 @@ TEST_F(TypeRegistryTest, ConformanceFollowsSubclassesTransitivelyAndOnlyUpwards)
     EXPECT_FALSE(types.conformsTo("this", "line"));
 }
 
-// Guards aliases (resolved on both sides of a question) and a subclass cycle, which must end the search.
-TEST_F(TypeRegistryTest, AliasesResolveToTheirCanonicalTypeOnBothSidesAndCyclesEndTheSearch) {
-    fs::path dir = dataDir("a");
-    write(dir, "aliases", "image/x-png image/png\n");
-    write(dir, "subclasses", "image/png image/x-raster\n");
-    TypeRegistry types({dir});
-    EXPECT_EQ(types.canonicalType("IMAGE/X-PNG"), "image/png");
-    EXPECT_TRUE(types.conformsTo("image/x-png", "image/png"));
-    EXPECT_TRUE(types.conformsTo("image/png", "image/x-png"));
-
+// Guards against a subclass cycle making the search loop for ever.
+TEST_F(TypeRegistryTest, SubclassCycleEndsTheSearch) {
     fs::path cyclic = dataDir("cyclic");
     write(cyclic, "subclasses", "a/one a/two\na/two a/three\na/three a/one\n");
     TypeRegistry cycle({cyclic});
@@ -78,7 +70,8 @@ TEST_F(TypeRegistryTest, ImplicitParentsApplyOnlyToMediaTypes) {
     EXPECT_FALSE(types.conformsTo("", ""));
 }
 
-// Guards the search path: the first directory's alias wins, subclasses of all add up, a missing one is skipped.
+// Guards aliases (resolved on both sides of a question, without regard to case) and the search path: the first
+// directory's alias wins, subclasses of all add up, a missing one is skipped.
 TEST_F(TypeRegistryTest, EarlierDirectoriesWinAliasesAndSubclassesAddUp) {
     fs::path first = dataDir("first");
     fs::path second = dataDir("second");
@@ -87,7 +80,8 @@ TEST_F(TypeRegistryTest, EarlierDirectoriesWinAliasesAndSubclassesAddUp) {
     write(first, "subclasses", "image/png image/x-raster\n");
     write(second, "subclasses", "image/png image/x-web\n");
     TypeRegistry types({first, root_ / "missing", second});
-    EXPECT_EQ(types.canonicalType("image/x-old"), "image/png");
+    EXPECT_EQ(types.canonicalType("IMAGE/X-OLD"), "image/png");
+    EXPECT_TRUE(types.conformsTo("image/png", "image/x-old"));
     EXPECT_TRUE(types.conformsTo("image/x-old", "image/x-raster"));
     EXPECT_TRUE(types.conformsTo("image/x-old", "image/x-web"));
     EXPECT_FALSE(types.conformsTo("image/x-old", "image/gif"));
