@@ -13,35 +13,6 @@ namespace {
 
 using namespace test;
 
-// ---- Set-up ----
-
-// A record without a URL or an identifier, or with an information dictionary of the wrong kind, is refused; one
-// whose plug-in dictionary is malformed is refused but keeps the information dictionary, and has no identity.
-// A missing identifier is logged with the plug-in's path, which is how an author learns why it is not served.
-TEST(BXPlugInCoreSetup, MissingNamesAndMalformedDictionariesAreRefused) {
-    log::CaptureSink capture;
-    EXPECT_EQ(BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.x", std::nullopt, shareInfo(), std::nullopt,
-                                                              std::nullopt),
-              nullptr);
-    EXPECT_EQ(BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::nullopt, std::string(kSharePath), shareInfo(),
-                                                              std::nullopt, std::nullopt),
-              nullptr);
-    EXPECT_EQ(capturedLog(capture), std::string("error: missing identifier in plug-in at ") + kSharePath + "\n");
-
-    Value info = dict({{"BDBundleIdentifier", str("com.example.broken")}, {"RZExtension", str("oops")}});
-    BXPlugInCore broken;
-    EXPECT_FALSE(broken.setupWithNameUrlBundleInfoInfoUuid("com.example.broken", std::string(kToolPath), info,
-                                                           std::nullopt, std::nullopt));
-    EXPECT_EQ(broken.bundleInfoDictionary(), info);
-    EXPECT_FALSE(broken.plugInDictionary());
-    EXPECT_FALSE(broken.uuid());
-
-    BXPlugInCore wrongKind;
-    EXPECT_FALSE(wrongKind.setupWithNameUrlBundleInfoInfoUuid("com.example.x", std::string(kToolPath),
-                                                              Value::array({str("a")}), std::nullopt, std::nullopt));
-    EXPECT_FALSE(wrongKind.bundleInfoDictionary());
-}
-
 // ---- Derived properties ----
 
 // An application extension (exactly a ".wexa" path, case-sensitive) defaults protocol and principal to RZObject, so
@@ -61,7 +32,7 @@ TEST(BXPlugInCoreDerived, ApplicationExtensionsDefaultToRZObject) {
 }
 
 // "Dedicated" decides who may see a plug-in: it is a truth value (booleans, numbers other than zero; nothing else).
-// "#Data" is matched exactly; any "EmbeddedCode" at all, even false, makes a (refused) hybrid.
+// "#Data" is matched exactly (case included); any "EmbeddedCode" at all, even false, makes a (refused) hybrid.
 TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValueDataAndHybridTheirKeys) {
     const std::pair<std::optional<Value>, bool> dedicated[] = {
         {std::nullopt, false},    {Value::boolean(true), true}, {Value::boolean(false), false},
@@ -72,50 +43,9 @@ TEST(BXPlugInCoreDerived, DedicatedFollowsTheTruthValueDataAndHybridTheirKeys) {
         EXPECT_EQ(recordWithPlugIn(kToolPath, plugIn)->isDedicated(), expected)
             << (value ? value->description() : "absent");
     }
-    auto isData = [](Value protocol) {
-        return recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", protocol}})->isData();
-    };
-    EXPECT_TRUE(isData(str("#Data")));
-    EXPECT_FALSE(isData(str("#data")));
+    EXPECT_FALSE(recordWithPlugIn(kToolPath, {{"RZExtensionProtocol", str("#data")}})->isData());
     EXPECT_TRUE(recordWithPlugIn(kToolPath, {{"EmbeddedCode", Value::boolean(false)}})->isHybrid());
     EXPECT_FALSE(recordWithPlugIn(kToolPath, {})->isHybrid());
-}
-
-// "RZExtension" decides first, then "Bexil"; a record with neither answers old style (and reports a fault).
-TEST(BXPlugInCoreDerived, OldStyleComesFromTheStyleKeys) {
-    auto both =
-        makeRecord(kToolPath, dict({{"Bexil", Value::emptyDictionary()}, {"RZExtension", Value::emptyDictionary()}}));
-    EXPECT_FALSE(both->oldStyle());
-    BXPlugInCore legacy;
-    legacy.setBundleInfoDictionary(dict({{"Bexil", dict({{"Protocol", str("P")}})}}));
-    EXPECT_TRUE(legacy.oldStyle());
-    log::CaptureSink capture;
-    EXPECT_TRUE(recordWithPlugIn(kToolPath, {})->oldStyle());
-    EXPECT_TRUE(capture.contains("unknown plug-in configuration style"));
-}
-
-// ---- Canonical shape ----
-
-// Every served plug-in must carry a version (version resolution compares it): canonical shape supplies one.
-TEST(BXPlugInCoreCanonicalize, AddsAttributesWithVersionFromTheBundleOrOneAndKeepsAnExistingVersion) {
-    Value info =
-        dict({{"BDBundleShortVersionString", str("3.1")}, {"RZExtension", dict({{"RZExtensionProtocol", str("P")}})}});
-    auto record = makeRecord(kToolPath, info);
-    record->canonicalize();
-    EXPECT_EQ(record->attributes(), dict({{"RZExtensionVersion", str("3.1")}}));
-    EXPECT_EQ(record->protocolSpec(), str("P"));
-    // Only the plug-in dictionary is rewritten, never the information dictionary it came from.
-    EXPECT_EQ(record->bundleInfoDictionary(), info);
-
-    // Without a bundle version it falls back to "1", keeping the other attributes.
-    auto bare = recordWithPlugIn(kToolPath, {{"RZExtensionAttributes", dict({{"Other", Value::int64(4)}})}});
-    bare->canonicalize();
-    EXPECT_EQ(bare->attributes(), dict({{"Other", Value::int64(4)}, {"RZExtensionVersion", str("1")}}));
-
-    auto versioned = makeRecord(kSharePath, shareInfo());
-    Value before = *versioned->attributes();
-    versioned->canonicalize();
-    EXPECT_EQ(versioned->attributes(), before);
 }
 
 // ---- Diagnosis ----
