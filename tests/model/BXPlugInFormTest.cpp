@@ -70,7 +70,8 @@ TEST(BXPlugInFormExport, FullRecordWritesEveryEntryUnderItsKey) {
     EXPECT_TRUE(record->bundleInfoDictionary()->contains("BDBundleInfoVrecURL"));
 }
 
-// Unset optional entries are left out rather than invented; a plug-in off the system volume says so; annotations are always written, empty when absent.
+// Unset optional entries are left out rather than invented; a plug-in off the system volume says so; annotations are
+// always written, empty when absent.
 TEST(BXPlugInFormExport, MinimalRecordWritesOnlyTheAlwaysPresentEntries) {
     auto record = makeRecord(kToolPath, shareInfo(), Uuid::parse(kUuidText));
     Value form = exported(*record);
@@ -89,33 +90,12 @@ TEST(BXPlugInFormExport, MinimalRecordWritesOnlyTheAlwaysPresentEntries) {
 // ---- Round trip ----
 
 // Clients and the registry document read what the daemon writes: a read form must give the same record back.
-TEST(BXPlugInFormRoundTrip, ReadingAnExportedFormKeepsTheRecordAndHashAndRequirementAreRead) {
+TEST(BXPlugInFormRoundTrip, ReadingAnExportedFormKeepsTheRecord) {
     auto original = fullRecord();
     auto copy = read(exported(*original));
     ASSERT_TRUE(copy);
     EXPECT_TRUE(*copy == *original);
     EXPECT_EQ(exported(*copy), exported(*original));
-    // Hash and requirement are never written (see the export tests) but are read from a form that has them.
-    auto signedRecord = read(dict({{"identifier", str("com.example.signed")},
-                                   {"path", str("/signed.bundle")},
-                                   {"hash", Value::data(std::vector<uint8_t>(20, 7))},
-                                   {"requirement", str("anchor trusted")}}));
-    ASSERT_TRUE(signedRecord);
-    EXPECT_EQ(signedRecord->cdhash(), Value::data(std::vector<uint8_t>(20, 7)));
-    EXPECT_EQ(signedRecord->requirement(), "anchor trusted");
-}
-
-// A newer form of a known record may change its annotations, never its identity.
-TEST(BXPlugInFormRoundTrip, UpdateFromFormReplacesOnlyTheAnnotations) {
-    auto record = fullRecord();
-    Value newer = changed(exported(*record), "annotations", dict({{"k", Value::int64(2)}}));
-    newer = changed(newer, "identifier", str("com.example.other"));
-    record->updateFromForm(newer);
-    EXPECT_EQ(record->annotations(), dict({{"k", Value::int64(2)}}));
-    EXPECT_EQ(record->identifier(), "com.example.mail.share");
-
-    record->updateFromForm(changed(newer, "annotations", str("not a dictionary")));
-    EXPECT_FALSE(record->annotations());
 }
 
 // ---- Reading ----
