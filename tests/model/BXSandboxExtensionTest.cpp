@@ -12,7 +12,8 @@ namespace {
 TEST(BXSandboxExtension, ConsumesOnceAndReleasesOnExpelOrDestruction) {
     test::TempDir root("sandbox-extension-test");
     SandboxExtensions sandbox(root / "extension-key");
-    std::optional<std::string> token = sandbox.issueFileExtension(SandboxExtensions::kReadOnlyClass, root.path().string());
+    std::optional<std::string> token =
+        sandbox.issueFileExtension(SandboxExtensions::kReadOnlyClass, root.path().string());
     ASSERT_TRUE(token);
     int64_t handle = 0;
     {
