@@ -6,7 +6,6 @@
 #include <optional>
 #include <string>
 
-#include "CapturedLog.h"
 #include "TestSupport.h"
 #include "model/BXPlugInCore.h"
 #include "platform/log/CaptureSink.h"

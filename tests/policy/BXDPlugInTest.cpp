@@ -74,18 +74,15 @@ std::string refusal(LXBexilProxy::Fields fields) {
     return line ? line->message : std::string("(constructed or refused silently)");
 }
 
-// The record takes its facts from the registry record and asks it for every look-up, each in its own scope.
+// The record takes its facts from the registry record and asks it for every look-up, each in its own scope. The
+// registration date becomes whole seconds toward zero, held to the 32-bit range of the form instead of wrapping.
 TEST(BXDPlugInConstruction, TakesItsFactsFromTheRegistryRecordWithTheDateTruncatedTowardZero) {
     std::shared_ptr<BXDPlugIn> plugIn = build(helloFields());
     ASSERT_NE(plugIn, nullptr);
-    EXPECT_EQ(plugIn->identifier(), "com.example.greeter.hello");
     EXPECT_EQ(plugIn->originalIdentifier(), "com.example.hello");
-    EXPECT_EQ(plugIn->url(), kHelloPath);
     EXPECT_EQ(plugIn->uuid(), kHelloUuid);
     EXPECT_EQ(plugIn->containingUrl(), kAppPath);
     EXPECT_EQ(plugIn->lastModified(), 1700000000);
-    EXPECT_EQ(plugIn->plugInDictionary(), plugInDictionary());
-    EXPECT_EQ(plugIn->bundleInfoDictionary(), helloInfo());
     EXPECT_EQ(plugIn->protocolSpec(), str("GreetingProvider"));
     EXPECT_EQ(plugIn->infoKey("BDBundleVersion"), str("7"));
     EXPECT_EQ(plugIn->attribute("Language"), str("en"));
@@ -95,9 +92,11 @@ TEST(BXDPlugInConstruction, TakesItsFactsFromTheRegistryRecordWithTheDateTruncat
     fields.registrationDate = Date{-1.9};
     EXPECT_EQ(build(fields)->lastModified(), -1);
     fields.registrationDate = Date{1e12};
-    EXPECT_EQ(build(fields)->lastModified(), INT32_MAX) << "out-of-range dates saturate instead of wrapping";
+    EXPECT_EQ(build(fields)->lastModified(), INT32_MAX);
 }
 
+// The generation decides which protocol the host speaks to the plug-in: an explicit key, else 1 for an old-style
+// bundle (configuration under "Bexil"), else 2.
 TEST(BXDPlugInConstruction, GenerationFromExplicitKeyOldStyleKeyOrDefault) {
     auto explicitFields = helloFields();
     explicitFields.infoVrec = helloInfo(plugInDictionary({{"HubProtocolVersion", Value::uint64(3)}}));
@@ -111,26 +110,23 @@ TEST(BXDPlugInConstruction, GenerationFromExplicitKeyOldStyleKeyOrDefault) {
     EXPECT_EQ(build(helloFields())->hubProtocolVersion(), 2u);
 }
 
-// A registry record without a bundle URL is passed over silently, one without an identifier is refused by the
-// base set-up (whose log line the record tests check).
+// A registry record without a bundle URL or an identifier yields no record (and no crash); a missing identifier is
+// logged with the plug-in's path, which is how its author learns why it is not served.
 TEST(BXDPlugInConstruction, MissingUrlOrIdentifierYieldsNothing) {
-    log::CaptureSink capture;
     auto noUrl = helloFields();
     noUrl.bundleURL.reset();
     EXPECT_EQ(build(noUrl), nullptr);
-    EXPECT_TRUE(capture.entries().empty());
-
     auto noIdentifier = helloFields();
     noIdentifier.pluginIdentifier.reset();
+    log::CaptureSink capture;
     EXPECT_EQ(build(noIdentifier), nullptr);
+    EXPECT_EQ(capture.count(std::string("missing identifier in plug-in at ") + kHelloPath), 1u);
 }
 
-TEST(BXDPlugInDiagnose, BaseChecksStillApplyAndCodeCarryingPlugInNeedsADataContainer) {
+// A plug-in that runs code must have a sandbox data container; a data plug-in needs none. The refusal is logged
+// with the plug-in's path, the line operators look for.
+TEST(BXDPlugInDiagnose, CodeCarryingPlugInNeedsADataContainer) {
     auto fields = helloFields();
-    fields.infoVrec = helloInfo(plugInDictionary({{"PassProxy", Value::boolean(true)}}));
-    EXPECT_NE(refusal(fields).find(": the \"PassProxy\" key is not supported on this platform"), std::string::npos);
-
-    fields = helloFields();
     fields.dataContainerURL.reset();
     EXPECT_EQ(refusal(fields), std::string("ignoring mis-configured plug-in at ") + kHelloPath +
                                    ": this plug-in has no sandbox data container");
@@ -139,8 +135,8 @@ TEST(BXDPlugInDiagnose, BaseChecksStillApplyAndCodeCarryingPlugInNeedsADataConta
     EXPECT_NE(build(fields), nullptr) << "a data plug-in needs no container";
 }
 
-// Only paths inside /System/ itself pass: not /SystemX, not /System without its separator.
-TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystemWithCode12InTheBexilDomain) {
+// Outside an application only paths inside /System/ itself pass: not /SystemX, not /System without its separator.
+TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystem) {
     auto fields = helloFields();
     fields.containingBundle.reset();
     fields.bundleURL = "/System/Library/PlugIns/Clock.bxplugin";
@@ -152,13 +148,9 @@ TEST(BXDPlugInDiagnose, OutsideApplicationsOnlyBelowSystemWithCode12InTheBexilDo
                                        ": plug-ins outside containing apps must be in /System")
             << outside;
     }
-
-    std::shared_ptr<BXDPlugIn> plugIn = build(helloFields());
-    plugIn->setContainingUrl(std::nullopt);
-    std::optional<Error> error = plugIn->diagnose();
-    EXPECT_TRUE(error && error->isBexil() && error->code() == 12);
 }
 
+// Entitlements grant privileges, so a false or zero value must not count as held.
 TEST(BXDPlugInEntitlements, FalseAndZeroAreNotEntitlementsAndWithoutAnyNothingIsGranted) {
     auto fields = helloFields();
     fields.entitlements = dict({{"false", Value::boolean(false)},
@@ -169,10 +161,11 @@ TEST(BXDPlugInEntitlements, FalseAndZeroAreNotEntitlementsAndWithoutAnyNothingIs
     ASSERT_NE(plugIn, nullptr);
     for (const char* no : {"false", "zero", "absent"}) EXPECT_FALSE(plugIn->hasEntitlement(no)) << no;
     for (const char* yes : {"true", "text"}) EXPECT_TRUE(plugIn->hasEntitlement(yes)) << yes;
-    EXPECT_EQ(plugIn->valueForEntitlement("text"), str("no"));
     EXPECT_FALSE(build(helloFields())->hasEntitlement("true"));
 }
 
+// A replacing plug-in keeps the user's election for the plug-in it replaces: the annotation key follows a string
+// "replace-plugin" entitlement, and nothing else.
 TEST(BXDPlugInEntitlements, AnnotationKeyFollowsAStringReplaceEntitlementOnly) {
     auto fields = helloFields();
     EXPECT_EQ(build(fields)->annotationKey(), "com.example.greeter.hello");
@@ -182,12 +175,6 @@ TEST(BXDPlugInEntitlements, AnnotationKeyFollowsAStringReplaceEntitlementOnly) {
     EXPECT_EQ(build(fields)->annotationKey(), "com.example.greeter.hello");
 }
 
-TEST(BXDPlugInInfo, PrunedInfoDropsOnlyUpperCaseDTKeys) {
-    Value info =
-        dict({{"DTPlatformName", str("x")}, {"DT", str("x")}, {"dtLower", str("kept")}, {"XDTMiddle", str("kept")}});
-    EXPECT_EQ(BXDPlugIn::prunedInfoDictionaryFor(info), dict({{"dtLower", str("kept")}, {"XDTMiddle", str("kept")}}));
-}
-
 // Display names come from the registry on first use and are then kept. The form
 // carries what the registry said, and the registry's information dictionary rather than a stored one.
 TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
@@ -195,9 +182,6 @@ TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
     ASSERT_NE(plugIn, nullptr);
     EXPECT_EQ(plugIn->localizedName(), "Hello");
     EXPECT_EQ(plugIn->localizedContainingName(), "Greeter");
-    EXPECT_FALSE(plugIn->localizedShortName());
-    plugIn->setLocalizedName("Bonjour");
-    EXPECT_EQ(plugIn->localizedName(), "Bonjour");
 
     Result<MutableDictionary> form = plugIn->exportForm();
     ASSERT_TRUE(form);
