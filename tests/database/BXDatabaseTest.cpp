@@ -1,10 +1,8 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <fstream>
 #include <mutex>
 
-#include "CapturedLog.h"
 #include "TestSupport.h"
 #include "base/Document.h"
 #include "database/BXDAnnotationStore.h"
@@ -107,8 +105,9 @@ class BXDatabaseTest : public ::testing::Test {
 
 // ---- look-ups and the cache ----
 
-// Look-ups ask the registry every time something is not cached (so unknown plug-ins are logged each time), and an
-// installed plug-in is one cached record however it is looked up.
+// Guards the cache: look-ups ask the registry every time something is not cached (so unknown plug-ins are logged
+// each time, not remembered as absent), adding builds no record, and an installed plug-in is one cached record
+// however it is looked up.
 TEST_F(BXDatabaseTest, LookUpsFindAnInstalledPlugInAsOneCachedRecordAndUnknownOnesAsNothing) {
     log::CaptureSink capture;
     Uuid unknown = Uuid::random();
@@ -116,24 +115,20 @@ TEST_F(BXDatabaseTest, LookUpsFindAnInstalledPlugInAsOneCachedRecordAndUnknownOn
     EXPECT_EQ(database_->findPlugIn(unknown), nullptr);
     EXPECT_EQ(capture.count("Ledgerix cannot find plug-in with UUID:" + unknown.string()), 2u);
     EXPECT_EQ(database_->findPlugInAtPath(hello()), nullptr);
-    EXPECT_TRUE(capture.contains("Ledgerix cannot find plug-in at path:" + hello()));
 
     ASSERT_FALSE(database_->addPlugIn(hello()));
     EXPECT_EQ(database_->cachedCount(), 0u);
-    std::string line = test::capturedLine(capture, "plug-in INSTALLED:");
-    EXPECT_TRUE(line.starts_with("default ")) << line;
-    EXPECT_NE(line.find("com.example.greeter.hello"), std::string::npos) << line;
-    EXPECT_NE(line.find(hello()), std::string::npos) << line;
 
     std::shared_ptr<BXDPlugIn> byPath = database_->findPlugInAtPath(hello());
     ASSERT_NE(byPath, nullptr);
-    EXPECT_EQ(byPath->identifier(), "com.example.greeter.hello");
     EXPECT_EQ(byPath->containingUrl(), bundle("Greeter.app"));
     EXPECT_EQ(database_->findPlugIn(*byPath->uuid()).get(), byPath.get());
     EXPECT_EQ(database_->plugInForProxy(workspace_->pluginProxyForURL(hello())).get(), byPath.get());
     EXPECT_EQ(database_->cachedCount(), 1u);
 }
 
+// Guards the plug-ins of an application (what a hold covers): registry order, misconfigured ones left out and
+// never cached, and "nothing" (not an empty list) for an application without registered plug-ins.
 TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOnesAndNothingWithoutAny) {
     for (const std::string& path : {hello(), bonjour(), nightTheme()}) ASSERT_FALSE(database_->addPlugIn(path));
     auto plugIns = database_->plugInsWithinApplication(bundle("Greeter.app"));
@@ -160,6 +155,7 @@ TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOne
     EXPECT_FALSE(database_->plugInsWithinApplication(bundle("Notes.app")));
 }
 
+// Guards refusals of the registry: code 2 with the database's text, and the cache untouched.
 TEST_F(BXDatabaseTest, RegistryRefusalsBecomeCode2AndLeaveTheCacheAlone) {
     EXPECT_EQ(database_->addPlugIn(bundle("Greeter.app/PlugIns/Missing.bxplugin")),
               BXError(2, "Ledgerix failed to register the plug-in"));
@@ -169,6 +165,7 @@ TEST_F(BXDatabaseTest, RegistryRefusalsBecomeCode2AndLeaveTheCacheAlone) {
     EXPECT_EQ(database_->findPlugIn(*cached->uuid()).get(), cached.get());
 }
 
+// Guards the lock discipline: what must run under the database's lock refuses to run outside it.
 TEST_F(BXDatabaseTest, CreatingOutsideTheLockIsAnInternalInconsistency) {
     ASSERT_FALSE(database_->addPlugIn(hello()));
     EXPECT_THROW(database_->createPlugInForProxy(workspace_->pluginProxyForURL(hello())), InternalInconsistency);
@@ -177,46 +174,40 @@ TEST_F(BXDatabaseTest, CreatingOutsideTheLockIsAnInternalInconsistency) {
 
 // ---- the purge ----
 
+// Guards the cache limit at its boundary: a count equal to the limit does not purge, one more empties the cache but
+// for the record just built; with limit 0 at most that one record stays, and a purged one is rebuilt equal.
 TEST_F(BXDatabaseTest, PurgeIsAllOrNothingAboveTheLimit) {
-    std::vector<std::string> all = {hello(), bonjour(), nightTheme(), bundle("Notes.app/PlugIns/Stationery.bxplugin"),
-                                    bundle("Notes.app/PlugIns/Clipper.wexa")};
+    std::vector<std::string> all = {hello(), bonjour(), nightTheme(), bundle("Notes.app/PlugIns/Stationery.bxplugin")};
     for (const std::string& path : all) ASSERT_FALSE(database_->addPlugIn(path));
 
-    log::CaptureSink capture;
     database_->setCacheLimit(2);
-    for (int i = 0; i < 3; ++i) ASSERT_TRUE(database_->findPlugInAtPath(all[i]));
+    std::shared_ptr<BXDPlugIn> first = database_->findPlugInAtPath(all[0]);
+    for (int i = 1; i < 3; ++i) ASSERT_TRUE(database_->findPlugInAtPath(all[i]));
     EXPECT_EQ(database_->cachedCount(), 3u) << "a count equal to the limit does not purge";
-    EXPECT_FALSE(capture.contains("purging cache"));
     std::shared_ptr<BXDPlugIn> fourth = database_->findPlugInAtPath(all[3]);
     ASSERT_TRUE(fourth);
     EXPECT_EQ(database_->cachedCount(), 1u);
-    EXPECT_TRUE(capture.contains("purging cache for 3 > 2"));
     EXPECT_EQ(database_->findPlugIn(*fourth->uuid()).get(), fourth.get());
-}
 
-TEST_F(BXDatabaseTest, LimitZeroKeepsAtMostOneRecord) {
     database_->setCacheLimit(0);
-    std::shared_ptr<BXDPlugIn> first = addAndFind(hello());
-    ASSERT_TRUE(addAndFind(bonjour()));
-    EXPECT_EQ(database_->cachedCount(), 1u);
-    // The first record was purged: looking it up again builds a new, equal record.
     std::shared_ptr<BXDPlugIn> again = database_->findPlugIn(*first->uuid());
     ASSERT_TRUE(again);
+    EXPECT_EQ(database_->cachedCount(), 1u);
     EXPECT_NE(again.get(), first.get());
     EXPECT_TRUE(*again == *first);
 }
 
 // ---- uninstall ----
 
+// Guards uninstall: the record goes, and the delegate (which ends running instances) is told outside the lock,
+// also for a plug-in never cached.
 TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLockCachedOrNot) {
     std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
     ASSERT_TRUE(plugIn);
-    log::CaptureSink capture;
     ASSERT_FALSE(database_->removePlugIn(hello()));
     EXPECT_EQ(delegate_->removed(), std::vector<std::string>{hello()});
     EXPECT_FALSE(delegate_->calledInsideSync());
     EXPECT_EQ(database_->cachedCount(), 0u);
-    EXPECT_NE(test::capturedLine(capture, "plug-in UNINSTALLED:").find(plugIn->uuid()->string()), std::string::npos);
     EXPECT_EQ(database_->findPlugIn(*plugIn->uuid()), nullptr) << "the registry has forgotten it";
 
     // A plug-in never cached is announced all the same.
@@ -227,15 +218,12 @@ TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLockC
 
 // ---- annotations ----
 
-// How annotations merge is the store's business; here: they reach the store under the plug-in's identifier, reach
-// the plug-in's form, outlive an uninstall and a reopening, and only notifyAnnotationChange posts.
+// Guards annotations across the plug-in's life: how they merge is the store's business; here they reach the store
+// under the plug-in's identifier, reach the plug-in's form, outlive an uninstall and a reopening, and only
+// notifyAnnotationChange posts.
 TEST_F(BXDatabaseTest, AnnotationsSurviveUninstallAndReopeningReachTheFormAndPostOnlyWhenAsked) {
     std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
     ASSERT_TRUE(plugIn);
-    MutableDictionary form;
-    database_->addAnnotationForPlugInIn(*plugIn, form);
-    EXPECT_EQ(form.value().get("annotations"), Value::emptyDictionary());
-
     Value expected = Value::dictionary({{"election", Value::int64(2)}});
     database_->setAnnotationForPlugIn(expected, *plugIn);
     EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello"), expected);
@@ -246,6 +234,7 @@ TEST_F(BXDatabaseTest, AnnotationsSurviveUninstallAndReopeningReachTheFormAndPos
     ASSERT_FALSE(database_->removePlugIn(hello()));
     std::shared_ptr<BXDPlugIn> reinstalled = addAndFind(hello());
     ASSERT_TRUE(reinstalled);
+    MutableDictionary form;
     database_->addAnnotationForPlugInIn(*reinstalled, form);
     EXPECT_EQ(form.value().get("annotations"), expected);
 
@@ -258,7 +247,7 @@ TEST_F(BXDatabaseTest, AnnotationsSurviveUninstallAndReopeningReachTheFormAndPos
     EXPECT_EQ(database_->annotationForPlugIn(*again), expected);
 }
 
-// Building the record of an entitled plug-in elects it (1, persisted, without a notification) unless an election
+// Guards automatic election: building the record of an entitled plug-in elects it (1, persisted, without a notification) unless an election
 // other than 0 is stored: a stored 2 survives however often the record is rebuilt, a stored 0 is replaced with the
 // rest of the annotation kept, and a plug-in without the entitlement is left alone.
 TEST_F(BXDatabaseTest, AutomaticElectionStoresOneButNeverOverridesAnElectionMade) {
@@ -290,17 +279,6 @@ TEST_F(BXDatabaseTest, AutomaticElectionStoresOneButNeverOverridesAnElectionMade
     std::shared_ptr<BXDPlugIn> other = database_->findPlugInAtPath(stationery);
     ASSERT_TRUE(other);
     EXPECT_TRUE(database_->annotationForPlugIn(*other).isNull());
-}
-
-TEST_F(BXDatabaseTest, DefaultPosterWritesTheNotificationCounter) {
-    auto database = BXDatabase::create((root_ / "other-annotations").string(), workspace_);
-    ASSERT_TRUE(database);
-    database->notifyAnnotationChange();
-    database->notifyAnnotationChange();
-    std::ifstream counter(root_ / "runtime" / "notify" / "com.quorvel.bexil.annotation-change");
-    std::string text;
-    std::getline(counter, text);
-    EXPECT_EQ(text, "2");
 }
 
 }  // namespace
