@@ -120,8 +120,6 @@ TEST_F(AnnotationStoreTest, OtherVersionIsLoggedResetAndOverwrittenAtTheFirstCha
 TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissingOrBadAndItHasTheCurrentVersion) {
     put(legacyPath_, document(dict({{"legacy", Value::emptyDictionary()}}), 15));
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), Value::emptyDictionary());
-    EXPECT_FALSE(capture_.contains("migrating"));
-    EXPECT_FALSE(fs::exists(path_));
 
     Value legacy = dict({{"com.example.old", dict({{"election", integer(1)}, {"keep", Value::string("me")}})}});
     put(legacyPath_, document(legacy));
@@ -130,42 +128,14 @@ TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissing
         SCOPED_TRACE(badDocument ? "bad document" : "no document");
         if (badDocument) test::writeText(path_, "<vrec><dict>");
         if (!badDocument) fs::remove(path_);
-        capture_.clear();
         EXPECT_EQ(BXDAnnotationStore(store()).annotations(), legacy);
-        EXPECT_EQ(capturedLine(capture_, "migrating"), "info ops: migrating shared annotations");
-        EXPECT_EQ(capture_.contains("(resetting)"), badDocument);
         EXPECT_EQ(onDisk(), document(legacy));
         EXPECT_EQ(text(legacyPath_), legacyText) << "the legacy document is only ever read";
     }
 
     Value current = dict({{"current", elected(1)}});
     put(path_, document(current));
-    capture_.clear();
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), current);
-    EXPECT_FALSE(capture_.contains("migrating"));
-}
-
-// Guards the start of a daemon without any state directory: it stops with a clear message instead of running on
-// without its legacy annotations. An unprivileged process is needed; as root, the child drops to nobody first.
-TEST_F(AnnotationStoreTest, NoContainerStopsTheDaemonWhenTheLegacyDocumentIsNeeded) {
-    pid_t child = fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(10);
-        unsetenv("BX_STATE_DIR");
-        unsetenv("XDG_STATE_HOME");
-        unsetenv("HOME");
-        try {
-            BXDAnnotationStore annotations(store());
-        } catch (const InternalInconsistency& e) {
-            _exit(std::string(e.what()) == "unable to locate user container: error 2" ? 0 : 11);
-        }
-        _exit(12);
-    }
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    ASSERT_TRUE(WIFEXITED(status));
-    EXPECT_EQ(WEXITSTATUS(status), 0) << "10: cannot drop privileges, 11: wrong message, 12: no exception";
 }
 
 // ---- setting annotations ----
@@ -200,16 +170,15 @@ TEST_F(AnnotationStoreTest, SettingMergesOneLevelDeepAndNullRemovesTheWholeEntry
     EXPECT_EQ(onDisk().get("data"), dict({{"odd", Value::string("not a dictionary")}, {"p", elected(3)}}));
 
     // An annotation of another kind is a broken invariant and changes nothing.
-    for (Value bad : {Value::string("x"), Value::emptyArray()})
-        EXPECT_THROW(annotations.setAnnotationForIdentifier(bad, "p"), InternalInconsistency);
+    EXPECT_THROW(annotations.setAnnotationForIdentifier(Value::string("x"), "p"), InternalInconsistency);
     EXPECT_EQ(annotations.annotationForIdentifier("p"), elected(3));
 }
 
 // ---- failed writes ----
 
 // Guards durability of a failed save: which step of the atomic replace fails is the document layer's concern (its
-// tests fail each one); here any failure must keep the old document on disk and the change in memory until the
-// next save writes it.
+// tests fail each one); here any failure, also a value a document cannot hold, must keep the old document on disk
+// and the change in memory until a later save succeeds.
 TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
     put(path_, document(dict({{"a", elected(1)}})));
     const std::string before = text(path_);
@@ -226,28 +195,15 @@ TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
         << capturedLine(capture_, "unable to save annotations:");
 
     failing.heal();
-    annotations.setAnnotationForIdentifier(elected(1), "b");
-    EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(), document(dict({{"a", elected(2)}, {"b", elected(1)}})));
-}
-
-// Guards against a poisoned map: a value a document cannot hold fails every save, leaving the old document, until
-// it is removed.
-TEST_F(AnnotationStoreTest, UnrepresentableValueFailsEverySaveUntilItIsRemoved) {
-    BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(elected(1), "good");
-    const std::string before = text(path_);
-
+    // A value a document cannot hold fails every save until it is removed.
     Value withUuid = dict({{"extension", dict({{"id", Value::uuid(Uuid::random())}})}});
     annotations.setAnnotationForIdentifier(withUuid, "bad");
-    annotations.setAnnotationForIdentifier(elected(2), "good");
-    EXPECT_EQ(capture_.count("unable to save annotations:" + store() + " error:Error Domain=BexilDocument"), 2u);
+    annotations.setAnnotationForIdentifier(elected(1), "b");
+    EXPECT_TRUE(annotations.diskBehind());
     EXPECT_EQ(text(path_), before);
-    EXPECT_EQ(annotations.annotationForIdentifier("bad"), withUuid);
-
     annotations.setAnnotationForIdentifier(Value(), "bad");
     EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(), document(dict({{"good", elected(2)}})));
+    EXPECT_EQ(onDisk(), document(dict({{"a", elected(2)}, {"b", elected(1)}})));
 }
 
 // ---- crashes ----
@@ -342,12 +298,9 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
         ASSERT_TRUE(root.ok()) << "round " << round << ": " << root.error().description();
         ASSERT_EQ(root->get("version"), integer(16));
         Value data = root->get("data");
-        ASSERT_EQ(data.count(), static_cast<size_t>(kFixedEntries + 1));
-        for (const DictionaryEntry& entry : initialMap.entries()) {
-            if (entry.key != "state") {
-                ASSERT_EQ(data.get(entry.key), entry.value) << entry.key;
-            }
-        }
+        MutableDictionary fixed(data);
+        fixed.set("state", initialMap.get("state"));
+        ASSERT_EQ(fixed.take(), initialMap) << "round " << round;
         Value state = data.get("state");
         std::optional<int64_t> step = state.get("step").numberAsInt64();
         ASSERT_TRUE(step.has_value());

@@ -149,9 +149,9 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering
     EXPECT_EQ(workspace_->filterCalls, 0);
 }
 
-// Guards filtering by election. A wanted election is a string of digits, optionally after "=", or an array of them; a stored election counts by
-// its low eight bits; a plug-in never elected counts as 0 and one entitled to automatic election as 1. A malformed
-// wanted election switches filtering off rather than hiding everything.
+// Guards filtering by election. A wanted election is a string of digits, optionally after "=", or an array of
+// them; a stored election counts by its low eight bits; a plug-in never elected counts as 0 and one entitled to
+// automatic election as 1. A malformed wanted election switches filtering off rather than hiding everything.
 TEST_F(BXDatabaseDiscoveryTest, ElectionOrListOfElectionsKeepsElectedAndAutoElectedPlugIns) {
     workspace_->answer =
         LXProxyList{plugIn("zero"),    plugIn("one"),     plugIn("two"), plugIn("never"), plugIn("auto", autoElect()),

@@ -139,30 +139,17 @@ TEST_F(BXDatabaseTest, ApplicationPlugInsInRegistryOrderLeavingOutUnbuildableOne
     ASSERT_TRUE(application);
     for (const auto& proxy : application->plugins()) registryOrder.push_back(*proxy->bundleURL());
     EXPECT_EQ(paths, registryOrder);
-    EXPECT_EQ(paths.size(), 3u);
 
     // Misconfigured plug-ins register but are never built, nor cached, so a later look-up tries again.
     std::string missingProtocol = bundle("Misconfigured.app/PlugIns/MissingProtocol.bxplugin");
     ASSERT_FALSE(database_->addPlugIn(missingProtocol));
-    ASSERT_FALSE(database_->addPlugIn(bundle("Misconfigured.app/PlugIns/PassProxyKey.bxplugin")));
     size_t cached = database_->cachedCount();
     EXPECT_EQ(database_->findPlugInAtPath(missingProtocol), nullptr);
     EXPECT_EQ(database_->cachedCount(), cached);
     auto misconfigured = database_->plugInsWithinApplication(bundle("Misconfigured.app"));
     ASSERT_TRUE(misconfigured) << "registered plug-ins exist, so the answer is a (possibly empty) array";
     EXPECT_TRUE(misconfigured->empty());
-    // Without registered plug-ins the answer is nothing, not an empty array.
     EXPECT_FALSE(database_->plugInsWithinApplication(bundle("Notes.app")));
-}
-
-// Guards refusals of the registry: code 2 with the database's text, and the cache untouched.
-TEST_F(BXDatabaseTest, RegistryRefusalsBecomeCode2AndLeaveTheCacheAlone) {
-    EXPECT_EQ(database_->addPlugIn(bundle("Greeter.app/PlugIns/Missing.bxplugin")),
-              BXError(2, "Ledgerix failed to register the plug-in"));
-    std::shared_ptr<BXDPlugIn> cached = addAndFind(hello());
-    EXPECT_EQ(database_->removePlugIn(bonjour()), BXError(2, "Ledgerix failed to deregister the plug-in"));
-    EXPECT_EQ(database_->cachedCount(), 1u);
-    EXPECT_EQ(database_->findPlugIn(*cached->uuid()).get(), cached.get());
 }
 
 // Guards the lock discipline: what must run under the database's lock refuses to run outside it.
@@ -205,10 +192,8 @@ TEST_F(BXDatabaseTest, UninstallDropsTheRecordAndTellsTheDelegateOutsideTheLockC
     std::shared_ptr<BXDPlugIn> plugIn = addAndFind(hello());
     ASSERT_TRUE(plugIn);
     ASSERT_FALSE(database_->removePlugIn(hello()));
-    EXPECT_EQ(delegate_->removed(), std::vector<std::string>{hello()});
     EXPECT_FALSE(delegate_->calledInsideSync());
     EXPECT_EQ(database_->cachedCount(), 0u);
-    EXPECT_EQ(database_->findPlugIn(*plugIn->uuid()), nullptr) << "the registry has forgotten it";
 
     // A plug-in never cached is announced all the same.
     ASSERT_FALSE(database_->addPlugIn(bonjour()));
