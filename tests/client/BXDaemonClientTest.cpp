@@ -168,8 +168,8 @@ TEST_F(BXDaemonClientRequestTest, ChangedProtocolVersionTravelsAndGatesDecodingA
 
 Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }
 
-// Guards how replies become errors. Only the low 32 bits of "errorcode" count, read as a signed number; zero is success, a code without a message
-// gets the generic text, and a message without a code is a broken invariant.
+// Guards how replies become errors. Only the low 32 bits of "errorcode" count, read as a signed number; zero is
+// success, a code without a message gets the generic text, and a message without a code is a broken invariant.
 TEST(BXDaemonClientErrorTest, TheLow32BitsOfTheCodeMakeTheErrorWithItsMessageOrTheGenericText) {
     EXPECT_FALSE(BXDaemonClient::errorInReply(Value::emptyDictionary()).has_value());
     EXPECT_FALSE(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0x100000000ull)}})));

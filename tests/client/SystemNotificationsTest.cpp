@@ -6,7 +6,6 @@
 
 #include <atomic>
 #include <filesystem>
-#include <fstream>
 #include <future>
 
 #include "TestSupport.h"
@@ -74,13 +73,11 @@ TEST_F(SystemNotificationsTest, ObserverSeesPostsOfAnotherProcessButNotOtherName
     EXPECT_EQ(cancelledCalls, 0);
 }
 
-// Guards the counter: concurrent posters in several processes lose no increment, and garbage in the file restarts it.
+// Guards the counter: concurrent posters in several processes lose no increment, and garbage in the file makes the
+// next post start over instead of failing.
 TEST_F(SystemNotificationsTest, CounterSurvivesConcurrentPostersAndStrayContent) {
     SystemNotifications notifications(dir_);
-    ASSERT_FALSE(notifications.post("n").has_value());
-    // Someone wrote garbage into the counter file: the next post starts over instead of failing.
-    { std::ofstream(dir_ / "n") << "not a number"; }
-    EXPECT_EQ(notifications.state("n"), 0u);
+    test::writeText(dir_ / "n", "not a number");
     ASSERT_FALSE(notifications.post("n").has_value());
     EXPECT_EQ(notifications.state("n"), 1u);
 

@@ -40,9 +40,9 @@ class BXDServerHoldTest : public ::testing::Test {
     std::unique_ptr<BXDServer> server_;
 };
 
-// Guards holds (which keep plug-ins from being ended while an application updates): a hold names plug-ins by UUID, so a record rebuilt for the same registry plug-in is held too; an empty hold (an
-// application without plug-ins) holds nothing, and a hold without a living client goes with the next release of
-// dead clients' holds.
+// Guards holds (which keep plug-ins from being ended while an application updates): a hold names plug-ins by
+// UUID, so a record rebuilt for the same registry plug-in is held too; an empty hold (an application without
+// plug-ins) holds nothing, and a hold without a living client goes with the next release of dead clients' holds.
 TEST_F(BXDServerHoldTest, HoldsNamePlugInsByUuidAndGoWithTheirClient) {
     Uuid helloUuid = Uuid::random();
     std::shared_ptr<BXDPlugIn> hello = record("hello", helloUuid);

@@ -130,8 +130,9 @@ class BXDatabaseDiscoveryTest : public ::testing::Test {
 using Ids = std::vector<std::string>;
 
 // Guards discovery without a query: every usable plug-in (not one without a bundle, nor one of a placeholder
-// application still being installed), and the cheaper installed list rather than the filtered query.
-TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering) {
+// application still being installed) from the cheaper installed list rather than the filtered query; the result is
+// a set (one registry record listed twice is one plug-in) of the records cached, which the next query hands out.
+TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInOnceFromTheCache) {
     LXBexilProxy::Fields noUrl;
     noUrl.pluginIdentifier = "com.example.nowhere";
     noUrl.pluginUUID = Uuid::random();
@@ -139,14 +140,21 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInWithoutFiltering
     pendingFields.bundleURL = "/Applications/Pending.app/PlugIns/Pending.bxplugin";
     pendingFields.pluginIdentifier = "com.example.pending";
     pendingFields.containingBundle = application(/*placeholder=*/true);
-    workspace_->answer = LXProxyList{plugIn("hello"), std::make_shared<LXBexilProxy>(noUrl),
-                                     std::make_shared<LXBexilProxy>(pendingFields), plugIn("bonjour")};
+    auto hello = plugIn("hello");
+    workspace_->answer = LXProxyList{hello, std::make_shared<LXBexilProxy>(noUrl),
+                                     std::make_shared<LXBexilProxy>(pendingFields), plugIn("bonjour"), hello};
     storeElection("com.example.hello", Value::int64(0));
 
     EXPECT_EQ(find(Value::emptyDictionary()), (Ids{"com.example.bonjour", "com.example.hello"}));
     EXPECT_EQ(find(Value()), (Ids{"com.example.bonjour", "com.example.hello"})) << "no query is an empty one";
     EXPECT_EQ(workspace_->installedCalls, 2);
     EXPECT_EQ(workspace_->filterCalls, 0);
+
+    std::optional<BXDatabase::PlugInSet> first = database_->findPlugIns(Value());
+    std::optional<BXDatabase::PlugInSet> second = database_->findPlugIns(electionQuery(str("0")));
+    ASSERT_TRUE(first && second);
+    ASSERT_EQ(second->size(), 2u);
+    for (size_t i = 0; i < 2; ++i) EXPECT_EQ((*first)[i].get(), (*second)[i].get());
 }
 
 // Guards filtering by election. A wanted election is a string of digits, optionally after "=", or an array of
@@ -197,23 +205,6 @@ TEST_F(BXDatabaseDiscoveryTest, RegistryWithoutAnswerGivesNothingRatherThanEmpty
     EXPECT_FALSE(database_->findPlugIns(electionQuery(str("1"))));
     workspace_->answer = LXProxyList{};
     EXPECT_EQ(database_->findPlugIns(electionQuery(str("1"))), BXDatabase::PlugInSet{});
-}
-
-// Guards the result: a set (one plug-in listed twice is one), built from the cache on the next query.
-TEST_F(BXDatabaseDiscoveryTest, ResultIsASetOfCachedRecordsFromTheCache) {
-    LXProxyList twelve;
-    for (int i = 0; i < 12; ++i) twelve.push_back(plugIn("p" + std::to_string(i)));
-    // The same registry record twice (same UUID) is one plug-in.
-    twelve.push_back(twelve.front());
-    workspace_->answer = twelve;
-
-    std::optional<BXDatabase::PlugInSet> first = database_->findPlugIns(electionQuery(str("0")));
-    ASSERT_TRUE(first);
-    EXPECT_EQ(first->size(), 12u);
-    std::optional<BXDatabase::PlugInSet> second = database_->findPlugIns(Value::emptyDictionary());
-    ASSERT_TRUE(second);
-    // The second query hands out the very records the first one cached.
-    for (size_t i = 0; i < 12; ++i) EXPECT_EQ((*first)[i].get(), (*second)[i].get());
 }
 
 }  // namespace
