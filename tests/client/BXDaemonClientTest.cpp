@@ -173,9 +173,6 @@ Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Val
 TEST(BXDaemonClientErrorTest, TheLow32BitsOfTheCodeMakeTheErrorWithItsMessageOrTheGenericText) {
     EXPECT_FALSE(BXDaemonClient::errorInReply(Value::emptyDictionary()).has_value());
     EXPECT_FALSE(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(0x100000000ull)}})));
-    EXPECT_EQ(BXDaemonClient::errorInReply(
-                  replyWith({{"errorcode", Value::uint64(9)}, {"error", Value::string("no plugin at /x")}})),
-              BXError(9, "no plugin at /x"));
     EXPECT_EQ(BXDaemonClient::errorInReply(replyWith({{"errorcode", Value::uint64(14)}})),
               BXError(14, "unknown error returned by Bexil subsystem"));
     // A negative 32-bit code widened with its sign.
@@ -192,25 +189,17 @@ TEST(BXDaemonClientErrorTest, TheLow32BitsOfTheCodeMakeTheErrorWithItsMessageOrT
 
 // ---- conversions ----
 
-Value everyKind() {
-    MutableDictionary d;
-    d.set("null", Value::null());
-    d.set("bool", Value::boolean(true));
-    d.set("int", Value::int64(-5));
-    d.set("uint", Value::uint64(UINT64_MAX));
-    d.set("real", Value::real(2.5));
-    d.set("string", Value::string("héllo"));
-    d.set("data", Value::data(std::vector<uint8_t>{0, 1, 255}));
-    d.set("date", Value::date(Date{1.5e9}));
-    d.set("uuid", Value::uuid(kFirst));
-    d.set("array", Value::array({Value::string("a"), Value::emptyDictionary()}));
-    return Value::array({d.take()});
-}
-
-// Guards the message form: every kind survives version 3 with its kind, and no other version is encoded.
+// Guards the message form: the kinds the end-to-end requests do not carry survive version 3 with their kind, and
+// no other version is encoded.
 TEST(BXDaemonClientConversionTest, MessageFormRoundTripsEveryKindAtVersion3AndEveryOtherVersionYieldsNone) {
     BXDaemonClient client("com.example.unused");
-    Value original = everyKind();
+    Value original = Value::array({test::dict({{"null", Value::null()},
+                                               {"int", Value::int64(-5)},
+                                               {"uint", Value::uint64(UINT64_MAX)},
+                                               {"real", Value::real(2.5)},
+                                               {"data", Value::data(std::vector<uint8_t>{0, 1, 255})},
+                                               {"date", Value::date(Date{1.5e9})},
+                                               {"uuid", Value::uuid(kFirst)}})});
     auto encoded = BXDaemonClient::convertToZEMVersion(original, 3);
     ASSERT_TRUE(encoded.has_value());
     auto decoded = client.convertFromZEM(*encoded);

@@ -14,15 +14,12 @@
 #include <sstream>
 #include <thread>
 
-#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
 #include "platform/jobard/ServiceManager.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
-#include "platform/wardend/ProcessAssertions.h"
-#include "policy/BXDPlugIn.h"
 
 namespace bexil {
 namespace {
@@ -154,39 +151,6 @@ TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
     terminate({proxy("com.example.greeter.hello", "1"), proxy("com.example.greeter.bonjour", "1")});
     EXPECT_EQ(capture.count("jobard reported no plug-ins on record"), 2u);
     EXPECT_FALSE(fs::exists(stale));
-}
-
-// Guards the busy check that keeps a plug-in in use from being ended: only live asserted instances count, and a
-// name cannot reach outside the records' directory.
-TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
-    test::TempDir runtime("bx-assertions");
-    RunningInstances assertions("assertions", runtime.path());
-    ProcessAssertions wardend(assertions);
-    pid_t busy = startSleeper();
-    pid_t finished = startSleeper();
-    SleeperGuard guard{busy, finished};
-    ASSERT_TRUE(assertions.record("com.example.greeter.hello", busy));
-    ASSERT_TRUE(assertions.record("com.example.greeter.bonjour", finished));
-    kill(finished, SIGKILL);
-    waitpid(finished, nullptr, 0);
-
-    std::vector<Value> found =
-        wardend.busyExtensionInstances({"com.example.greeter.hello", "com.example.greeter.bonjour", "../escape"});
-    ASSERT_EQ(found.size(), 1u);
-    EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
-
-    // The plug-in record asks by its bundle identifier and describes the busy instance by it alone.
-    auto plugIn = test::plugInRecord("com.example.greeter.hello", Uuid::random());
-    ASSERT_NE(plugIn, nullptr);
-    std::optional<Value> description = plugIn->checkBusy(wardend);
-    ASSERT_TRUE(description);
-    EXPECT_EQ(
-        *description,
-        Value::dictionary({{ProcessAssertions::kBundleIdentifierKey, Value::string("com.example.greeter.hello")}}));
-
-    kill(busy, SIGKILL);
-    waitpid(busy, nullptr, 0);
-    EXPECT_FALSE(plugIn->checkBusy(wardend));
 }
 
 // A plug-in instance that takes a while to end, as one that saves its state does: on SIGTERM it writes its pid to
