@@ -1,10 +1,8 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
-#include <limits>
 #include <random>
 
 #include "TestSupport.h"
@@ -264,12 +262,6 @@ TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporaryAft
     EXPECT_EQ(error->code(), EIO);
     EXPECT_NE(message(*error).find("fsync directory"), std::string::npos) << message(*error);
     EXPECT_EQ(*Document::readFile(path_), replacement);
-    // A value that cannot be written touches no file at all.
-    error = Document::writeFileAtomically(path_, dict({{"id", Value::uuid(Uuid::random())}}));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code(), kDocumentUnrepresentable);
-    EXPECT_EQ(*Document::readFile(path_), replacement);
-    EXPECT_EQ(names(), std::vector<std::string>{"Annotations.vrec"});
 }
 
 // Guards the permissions of a new document: the umask applies, nothing wider is forced.

@@ -281,26 +281,6 @@ TEST(SerialQueueTest, DestroyingTheLoopDropsPendingBlocksWithoutRunningThem) {
     EXPECT_FALSE(ran.load());
 }
 
-// Guards the daemon's main thread: it runs queued work itself until stop(). (Stopping from another thread, as the
-// SIGTERM handler does, is proven by BxdOptions.OptionsReachTheServerAndSigtermEndsIt.)
-TEST(EventLoopTest, RunOnCurrentThreadRunsWorkHereUntilStopped) {
-    EventLoop loop(0);
-    SerialQueue queue("main", loop);
-    const auto caller = std::this_thread::get_id();
-    std::vector<std::thread::id> ranOn;  // touched only on the queue
-    bool sawLoopThread = false;
-    for (int i = 0; i < 3; ++i) queue.async([&] { ranOn.push_back(std::this_thread::get_id()); });
-    queue.async([&] {
-        sawLoopThread = loop.runsOnCurrentThread() && loop.runningThreadCount() == 1;
-        loop.stop();
-    });
-    EXPECT_FALSE(loop.runsOnCurrentThread());
-    loop.runOnCurrentThread();  // returns only once stop() was called
-    EXPECT_TRUE(loop.isStopped());
-    EXPECT_TRUE(sawLoopThread);
-    EXPECT_EQ(ranOn, std::vector<std::thread::id>(3, caller));
-}
-
 // Guards socket and timer handlers: bound to a queue, they never run beside its blocks.
 TEST(EventLoopTest, HandlersBoundToAQueueRunAsItsBlocks) {
     EventLoop loop(2);

@@ -3,7 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <filesystem>
 #include <future>
 #include <mutex>
 #include <optional>
@@ -20,7 +19,6 @@
 namespace bexil {
 namespace {
 
-namespace fs = std::filesystem;
 using Reply = BXDaemonClient::Reply;
 
 // A service on a private directory that answers every request with `answer` and remembers what it got.

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <mutex>
 
 #include "TestSupport.h"
 #include "database/BXDAnnotationStore.h"
