@@ -220,7 +220,7 @@ Value formFor(const char* identifier, const Uuid& uuid) {
 }
 
 // Guards discovery results: forms become records in reply order; a form that cannot be read is left out, while an
-// error reply, a reply without matches and a client speaking an older version are errors.
+// error reply and a reply without matches are errors.
 TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrderUnreadableOnesAreLeftOutAndBadRepliesAreErrors) {
     BXDaemonClient client("com.example.unused");
     MutableDictionary noPath(formFor("com.example.c", kFirst));
@@ -240,8 +240,6 @@ TEST(BXPlugInMatchesTest, FormsBecomeRecordsInReplyOrderUnreadableOnesAreLeftOut
     };
     EXPECT_EQ(codeOf(Value::dictionary({{"errorcode", Value::uint64(11)}, {"error", Value::string("denied")}})), 11);
     EXPECT_EQ(codeOf(Value::emptyDictionary()), 4);
-    client.setProtocolVersion(2);
-    EXPECT_EQ(codeOf(Value::dictionary({{"matches", Value::emptyArray()}})), 7);
 }
 
 }  // namespace
