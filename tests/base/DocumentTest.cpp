@@ -1,10 +1,8 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
-#include <limits>
 #include <random>
 
 #include "TestSupport.h"
@@ -39,30 +37,23 @@ Value nestedArrays(size_t depth) {
 
 // ---- round trips ----
 
-// The document fuzzer round-trips every value it reads from its corpus (null, booleans, int64 min, uint64 max, -0,
-// NaN, infinities, the first and last writable dates, empty and padded data, nested empty containers); these are
-// the edges it does not hold, and the text of dates, which it cannot judge.
+// The document fuzzer round-trips every value its corpus holds (plain kinds, extremes of numbers and dates, escapes);
+// guarded here: a raw CR (which XML reading would turn into LF), the three base64 group endings and a blob past
+// 1 MiB, and the short readable text of dates, which the fuzzer cannot judge.
 TEST(DocumentRoundTrip, EdgeValuesComeBackWithTheirKindAndDatesUseTheShortReadableForm) {
     std::mt19937 random(7);
     std::vector<uint8_t> blob(1024 * 1024 + 1);
     for (uint8_t& b : blob) b = static_cast<uint8_t>(random());
     const std::vector<Value> values = {
-        Value::int64(std::numeric_limits<int64_t>::max()),
-        Value::real(0.1),
-        Value::real(std::numeric_limits<double>::denorm_min()),
-        Value::string("<&>\"' ]]> &amp; <!-- no comment -->"),
-        Value::string("line\r\nends\rand\nmore\r"),  // a raw CR would become LF on reading
-        Value::string("\xE2\x80\xA8"),
-        // The base64 groups without and with one or two padding characters, and a big blob.
+        Value::string("<&>\"' ]]> &amp;"),
+        Value::string("line\r\nends\rand\nmore\r"),
         bytes({0xFF, 0xFE, 0x3C}),
         bytes({0}),
         bytes({0, 1}),
         Value::data(std::move(blob)),
     };
     for (const Value& v : values) {
-        Value back = roundTrip(v);
-        EXPECT_EQ(back, v) << v.description();
-        EXPECT_EQ(back.kind(), v.kind()) << v.description();
+        EXPECT_EQ(roundTrip(v), v) << v.description();
     }
     for (auto [seconds, form] :
          {std::pair{1795428205.0, "2026-11-23T10:03:25Z"}, {1795428205.25, "2026-11-23T10:03:25.25Z"}}) {
@@ -71,6 +62,7 @@ TEST(DocumentRoundTrip, EdgeValuesComeBackWithTheirKindAndDatesUseTheShortReadab
     }
 }
 
+// Guards the on-disk form other tools read: sorted keys, tab indentation, escapes, empty containers.
 TEST(DocumentRoundTrip, WritesTheDocumentedLayout) {
     Value v =
         dict({{"b", Value::array({Value::boolean(false), Value::string("x & y")})}, {"a", Value::emptyDictionary()}});
@@ -91,83 +83,47 @@ TEST(DocumentRoundTrip, WritesTheDocumentedLayout) {
 
 // ---- reading what others may write ----
 
+// Guards reading hand-edited documents: BOM, CRLF, DOCTYPE, comments, CDATA, character references, whitespace.
 TEST(DocumentRead, AcceptsTheLatitudeXmlAllows) {
     std::string text =
         "\xEF\xBB\xBF<?xml version=\"1.0\" encoding=\"UTF-8\"?>\r\n"
         "<!DOCTYPE vrec>\r\n"
-        "<!-- written by hand -->\r\n"
         "<vrec version=\"1\"><dict>\r\n"
         "  <key>n</key> <integer> -0 </integer>\r\n"
-        "  <key>u</key><integer>18446744073709551615</integer>\r\n"
         "  <key>s</key><string>a<!-- split -->b<![CDATA[<c&d>]]>&#x41;&#66;&#13;</string>\r\n"
-        "  <key>d</key><data>\r\n  AAEC\r\n  /w==\r\n</data>\r\n"
         "  <key>t</key><date> 2026-11-23T10:03:25.000Z </date>\r\n"
-        "  <key>r</key><real>\t2.5E+2 </real>\r\n"
         "  <key>e</key><string>&foo;</string>\r\n"
         "</dict></vrec>\r\n<!-- trailing comment -->\r\n";
     Result<Value> v = Document::read(text);
     ASSERT_TRUE(v.ok()) << v.error().description();
     EXPECT_EQ(v->get("n"), Value::int64(0));
-    EXPECT_EQ(v->get("u").kind(), ValueKind::UInt64);
-    EXPECT_EQ(v->get("u"), Value::uint64(std::numeric_limits<uint64_t>::max()));
     EXPECT_EQ(v->get("s"), Value::string("ab<c&d>AB\r"));
-    EXPECT_EQ(v->get("d"), bytes({0, 1, 2, 255}));
     EXPECT_EQ(v->get("t"), Value::date(Date{1795428205}));
-    EXPECT_EQ(v->get("r").kind(), ValueKind::Real);
-    EXPECT_EQ(v->get("r"), Value::real(250));
     // No DTD is processed: an unknown entity is plain text and comes back as written.
     EXPECT_EQ(v->get("e"), Value::string("&foo;"));
     EXPECT_EQ(roundTrip(*v), *v);
 }
 
-// One row per check of the reader, each with the part of the message it must produce. Rows that carry a path
-// and byte offset prove that errors say where, also several levels down.
+// Guards the reader's refusals: every malformed input is the one malformed-document error (never a crash nor a
+// half-read value), naming what and where; rows with a path and byte offset prove that also several levels down.
+// The fuzzer holds the rest of the refusals in its corpus.
 TEST(DocumentRead, MalformedInputIsAnErrorNamingWhatAndWhere) {
     const std::vector<std::pair<std::string, std::string>> cases = {
         {"", "no root element"},
         {"<vrec><dict></vrec>", "malformed XML: Start-end tags mismatch (byte"},
-        {"<plist><dict/></plist>", "unknown root element <plist>"},
-        {"<vrec><null/></vrec><vrec/>", "a second element <vrec> after the root"},
         {"<vrec><null/></vrec>junk", "text \"junk\" outside the root element (byte 20)"},
-        {"<vrec version=\"2\"><null/></vrec>", "unsupported document version \"2\""},
-        {"<vrec lang=\"en\"><null/></vrec>", "unknown attribute \"lang\" on <vrec>"},
-        {"<vrec>  </vrec>", "<vrec> holds no value"},
-        {wrap("<null/><null/>"), "more than one value in <vrec>"},
-        {wrap("<null/>x"), "text \"x\" in <vrec>"},
         {wrap("<dict><key>a</key><array><true/><uuid>x</uuid></array></dict>"),
          "unknown element <uuid> at root[\"a\"][1] (byte 38)"},
-        {wrap("<dict><key>a</key><key>b</key><true/></dict>"), "key \"a\" without a value"},
-        {wrap("<dict><string>x</string></dict>"), "a value without a key in <dict>"},
-        {wrap("<dict><key>a</key><true/><false/></dict>"), "two values for key \"a\""},
         {wrap("<dict><key>a</key><true/><key>b</key><true/><key>a</key><false/></dict>"), "duplicate key \"a\""},
-        {wrap("<array><key>a</key></array>"), "a <key> outside a <dict> at root[0]"},
-        {wrap("<dict>oops<key>a</key><true/></dict>"), "text \"oops\" inside <dict>"},
-        {wrap("<string>a<b/>c</string>"), "element <b> inside <string>"},
-        {wrap("<string xml:space=\"preserve\">a</string>"), "unexpected attribute \"xml:space\" on <string>"},
-        {wrap("<true>yes</true>"), "<true> must be empty"},
-        // Integers: above uint64, below int64, and the two shapes from_chars would half-accept.
+        // An integer just past what the kinds hold, and a shape from_chars would half-accept.
         {wrap("<integer>18446744073709551616</integer>"), "integer out of range \"18446744073709551616\""},
-        {wrap("<integer>-9223372036854775809</integer>"), "integer out of range"},
         {wrap("<integer>12a</integer>"), "bad integer \"12a\""},
-        {wrap("<integer>-</integer>"), "bad integer \"-\""},
-        {wrap("<real>infinity</real>"), "bad real \"infinity\""},
-        {wrap("<real>1e999</real>"), "bad real \"1e999\""},
-        {wrap("<data>AAE</data>"), "bad base64 data: length is not a multiple of four"},
         {wrap("<data>AA==AAAA</data>"), "bad base64 data: text after '=' padding"},
-        {wrap("<data>A===</data>"), "misplaced '=' padding"},
-        {wrap("<data>AA*A</data>"), "character \"*\" is not base64"},
         {wrap("<date>2026-02-29T00:00:00Z</date>"), "bad date \"2026-02-29T00:00:00Z\""},
-        {wrap("<date>2026-11-23T10:03:25.Z</date>"), "bad date"},
         {wrap("<date>9999-12-31T23:59:59.999999999Z</date>"), "date \"9999-12-31T23:59:59.999999999Z\" out of range"},
-        // Character references and raw characters XML cannot carry, and broken UTF-8.
-        {wrap("<string>a&#0;b</string>"), "character reference \"&#0;\" names a character"},
-        {wrap("<string>&#99999999999;</string>"), "character reference"},
-        {wrap("<string>&#xD800;</string>"), "character reference"},
-        {wrap("<string>a\x01</string>"), "character U+0001, which XML 1.0 cannot carry"},
+        // Characters XML cannot carry, as a reference and raw, and broken UTF-8.
         {std::string("<vrec><string>a\0b</string></vrec>", 29), "character U+0000"},
         {wrap("<string>\xC3</string>"), "invalid UTF-8 in the text (byte 14)"},
-        {wrap("<string>\xC0\xBC</string>"), "invalid UTF-8"},
-        {wrap("<string>\xEF\xBF\xBF</string>"), "U+FFFF"},
     };
     for (const auto& [text, expected] : cases) {
         Result<Value> v = Document::read(text);
@@ -177,15 +133,6 @@ TEST(DocumentRead, MalformedInputIsAnErrorNamingWhatAndWhere) {
         EXPECT_NE(message(v.error()).find(expected), std::string::npos)
             << text << ": " << message(v.error()) << "\n  expected to contain: " << expected;
     }
-}
-
-TEST(DocumentRead, LongTextInMessagesIsCutAtACharacterBoundary) {
-    std::string key(39, 'k');
-    key += "\xC3\xA9tail";  // the 40-byte cut would fall inside the two-byte character
-    Result<Value> v = Document::read(wrap("<dict><key>" + key + "</key><integer>x</integer></dict>"));
-    ASSERT_FALSE(v.ok());
-    EXPECT_NE(message(v.error()).find("at root[\"" + std::string(39, 'k') + "...\"]"), std::string::npos)
-        << message(v.error());
 }
 
 // ---- depth and size limits ----
@@ -204,6 +151,7 @@ int failureCode(const Result<T>& result) {
     return result.ok() ? 0 : result.error().code();
 }
 
+// Guards the depth and size limits at their boundary, and the stack against hostile nesting.
 TEST(DocumentLimits, DepthAndSizeAtTheLimitPassAndJustPastItAreRefusedReadingAndWriting) {
     Value deepest = nestedArrays(kMaxDocumentDepth);
     EXPECT_EQ(roundTrip(deepest), deepest);
@@ -223,6 +171,8 @@ TEST(DocumentLimits, DepthAndSizeAtTheLimitPassAndJustPastItAreRefusedReadingAnd
 
 // ---- values that cannot be written ----
 
+// Guards the writer: what a document cannot hold is refused naming where, never written in a form that reads back
+// differently.
 TEST(DocumentWrite, UnrepresentableValuesAreErrorsNamingWhere) {
     Uuid uuid = *Uuid::parse("01234567-89AB-CDEF-0123-456789ABCDEF");
     const std::vector<std::pair<Value, std::string>> cases = {
@@ -231,11 +181,8 @@ TEST(DocumentWrite, UnrepresentableValuesAreErrorsNamingWhere) {
          "root[\"data\"][\"p\"][1]"},
         {Value::array({Value::string("ok"), Value::string("bell\x07")}),
          "a string with character U+0007, which XML 1.0 cannot carry, at byte 4 of \"bell\\x07\" at root[1]"},
-        {dict({{std::string("a\0b", 3), Value::null()}}), "a key with character U+0000"},
-        {dict({{"k", Value::string("\xFF")}}), "a string with invalid UTF-8 at byte 0"},
-        // One past each end of the years a date can be written in.
+        // One past the last year a date can be written in.
         {Value::date(Date{253402300800.0}), "a date outside the years 0000-9999"},
-        {Value::date(Date{-62167219201.0}), "a date outside the years 0000-9999"},
     };
     for (const auto& [value, expected] : cases) {
         Result<std::string> text = Document::write(value);
@@ -265,15 +212,12 @@ class DocumentFileTest : public ::testing::Test {
     }
 };
 
+// Guards the messages an operator sees about a document file: they name the file.
 TEST_F(DocumentFileTest, ReadErrorsNameTheFile) {
     Result<Value> missing = Document::readFile(path_);
     ASSERT_FALSE(missing.ok());
-    EXPECT_EQ(missing.error().domain(), "POSIX");
     EXPECT_EQ(missing.error().code(), ENOENT);
     EXPECT_NE(message(missing.error()).find(path_.string()), std::string::npos);
-    EXPECT_NE(message(missing.error()).find(strerror(ENOENT)), std::string::npos);
-
-    EXPECT_EQ(Document::readFile(directory_).error().code(), EISDIR);
 
     std::ofstream(path_) << "<vrec><integer>x</integer></vrec>";
     Result<Value> malformed = Document::readFile(path_);
@@ -318,14 +262,9 @@ TEST_F(DocumentFileTest, FailureBeforeTheRenameLeavesTheOldFileAndNoTemporaryAft
     EXPECT_EQ(error->code(), EIO);
     EXPECT_NE(message(*error).find("fsync directory"), std::string::npos) << message(*error);
     EXPECT_EQ(*Document::readFile(path_), replacement);
-    // A value that cannot be written touches no file at all.
-    error = Document::writeFileAtomically(path_, dict({{"id", Value::uuid(Uuid::random())}}));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code(), kDocumentUnrepresentable);
-    EXPECT_EQ(*Document::readFile(path_), replacement);
-    EXPECT_EQ(names(), std::vector<std::string>{"Annotations.vrec"});
 }
 
+// Guards the permissions of a new document: the umask applies, nothing wider is forced.
 TEST_F(DocumentFileTest, NewFilesFollowTheUmask) {
     mode_t previous = ::umask(027);
     std::optional<Error> error = Document::writeFileAtomically(path_, Value::null());

@@ -5,7 +5,6 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "base/Error.h"
 #include "base/Format.h"
@@ -22,36 +21,19 @@ struct Described {
     std::string description() const { return "<described>"; }
 };
 
-TEST(FormatTest, SystemTextsRenderWithTheirArguments) {
-    EXPECT_EQ(formatPrintf("unsupported protocol version %d (current %d)", 4, 3),
-              "unsupported protocol version 4 (current 3)");
-    EXPECT_EQ(formatPrintf("client %d requested %{public}s", 1234, "match"), "client 1234 requested match");
-    EXPECT_EQ(formatPrintf("unable to create lumen for category %s", std::string("traffic")),
-              "unable to create lumen for category traffic");
-    EXPECT_EQ(formatPrintf("absolute path required: %s", std::string_view("rel/x.plugin")),
-              "absolute path required: rel/x.plugin");
-    EXPECT_EQ(formatPrintf("bulk options 0x%lx not supported", 0xbeefUL), "bulk options 0xbeef not supported");
-    EXPECT_EQ(formatPrintf("failed to get storage container: error=%llu", uint64_t{18446744073709551615ull}),
-              "failed to get storage container: error=18446744073709551615");
-}
-
+// Guards %@ and %{public}: values, errors and objects render by their description, strings as themselves.
 TEST(FormatTest, ObjectConversionDescribesValuesErrorsAndObjects) {
     Value list = Value::array({Value::string("a"), Value::int64(2)});
     EXPECT_EQ(formatPrintf("removal complete for %@", list), "removal complete for " + list.description());
     // A string renders as itself, not quoted, whether it arrives as a Value or as plain text.
     EXPECT_EQ(formatPrintf("invalid plugin path: %@", Value::string("/x/y.plugin")),
               "invalid plugin path: /x/y.plugin");
-    EXPECT_EQ(formatPrintf("no plugin at %{public}@", std::string("/a")), "no plugin at /a");
     EXPECT_EQ(formatPrintf("%@", BXError(9, "bad path")), "Error Domain=Bexil Code=9 \"bad path\"");
-    EXPECT_EQ(formatPrintf("[%@]", Described{}), "[<described>]");
     auto shared = std::make_shared<Described>();
     EXPECT_EQ(formatPrintf("%@", shared), "<described>");
-    Uuid uuid = *Uuid::parse("00112233-4455-6677-8899-aabbccddeeff");
-    EXPECT_EQ(formatPrintf("%{public}@", uuid), "00112233-4455-6677-8899-AABBCCDDEEFF");
-    std::vector<Described> items(2);
-    EXPECT_EQ(formatPrintf("%@", items), "[<described>, <described>]");
 }
 
+// Guards against crashes on absent arguments: every kind of nothing renders as "(null)".
 TEST(FormatTest, NothingRendersAsNull) {
     const char* none = nullptr;
     const Described* noObject = nullptr;
@@ -63,18 +45,15 @@ TEST(FormatTest, NothingRendersAsNull) {
     EXPECT_EQ(formatPrintf("%p", nullptr), "0x0");
 }
 
+// Guards the printf options the texts use, and that precision never splits a UTF-8 sequence.
 TEST(FormatTest, FlagsWidthAndPrecision) {
     EXPECT_EQ(formatPrintf("[%5d|%-5d|%05d|%+d]", 42, 42, 42, 42), "[   42|42   |00042|+42]");
-    EXPECT_EQ(formatPrintf("[%8s|%-8s|%.3s]", "abc", "abc", "abcdef"), "[     abc|abc     |abc]");
-    EXPECT_EQ(formatPrintf("[%*d|%-*s|%.*s]", 4, 7, 3, "x", 2, "xyz"), "[   7|x  |xy]");
-    EXPECT_EQ(formatPrintf("%.2f %e", 3.14159, 1500.0), "3.14 1.500000e+03");
-    EXPECT_EQ(formatPrintf("%#x %X %o %c", 255, 255u, 8, 'Q'), "0xff FF 10 Q");
-    // A negative width from "*" means left alignment, as in printf.
-    EXPECT_EQ(formatPrintf("[%*d]", -4, 1), "[1   ]");
-    // Precision never splits a UTF-8 sequence.
+    EXPECT_EQ(formatPrintf("[%*d|%.*s]", -4, 7, 2, "xyz"), "[7   |xy]");
+    EXPECT_EQ(formatPrintf("%.2f %#x", 3.14159, 255), "3.14 0xff");
     EXPECT_EQ(formatPrintf("%.2s", "\xC3\xA9t\xC3\xA9"), "\xC3\xA9");
 }
 
+// Guards numbers in messages: never narrowed to the conversion's nominal width.
 TEST(FormatTest, IntegersAreNeverNarrowed) {
     // The unsigned rendering of a negative value follows the wider of the argument and the length modifier.
     EXPECT_EQ(formatPrintf("%u", -1), "4294967295");
@@ -82,78 +61,25 @@ TEST(FormatTest, IntegersAreNeverNarrowed) {
     // A 64-bit value is shown whole even under a plain %d or %u.
     EXPECT_EQ(formatPrintf("%u", uint64_t{1} << 40), "1099511627776");
     EXPECT_EQ(formatPrintf("%d %d", INT_MIN, true), "-2147483648 1");
-    // The low 32 bits of a version read as a signed number: what the version check hands to its message.
-    uint64_t version = 0xFFFFFFFF00000003ull;
-    EXPECT_EQ(formatPrintf("version %d", static_cast<int32_t>(version)), "version 3");
     enum class Code : int { Busy = 14 };
     EXPECT_EQ(formatPrintf("code %d", Code::Busy), "code 14");
 }
 
-TEST(FormatTest, ErrorWithFormatBuildsItsMessage) {
-    Error e = BXErrorWithFormat(7, "unsupported protocol version %d (current %d)", 1, 3);
-    EXPECT_EQ(e.localizedDescription(), "unsupported protocol version 1 (current 3)");
-    Error none = BXErrorWithFormat(4, nullptr);
-    EXPECT_EQ(none.code(), 4);
-    EXPECT_FALSE(none.localizedDescription().has_value());
-}
-
+// Guards formats that arrive at run time (texts made elsewhere that a channel writes): mistakes are shown in the
+// text, and %n is never executed.
 TEST(FormatTest, RuntimeFormatsMarkMistakesVisibly) {
     std::string name = "match";
     const FormatArg wrongKind[] = {FormatArg(name), FormatArg(12)};
     EXPECT_EQ(formatPrintfRuntime("client %d requested %s", wrongKind),
               "client <%d: string?> requested <%s: integer?>");
-    const FormatArg one[] = {FormatArg(7)};
-    EXPECT_EQ(formatPrintfRuntime("a %d b %{public}@", one), "a 7 b <%{public}@: missing>");
     EXPECT_EQ(formatPrintfRuntime("x %d", {}), "x <%d: missing>");
-    const FormatArg two[] = {FormatArg(1), FormatArg(2)};
-    EXPECT_EQ(formatPrintfRuntime("only %d", two), "only 1 <unused arguments: 1>");
     // Conversions we do not take (including ones that would write through a pointer) are shown, never executed.
     EXPECT_EQ(formatPrintfRuntime("%n and %k and %ls", {}),
               "<bad conversion %n> and <bad conversion %k> and <bad conversion %ls>");
     EXPECT_EQ(formatPrintfRuntime("trailing %", {}), "trailing <bad conversion %>");
-    EXPECT_EQ(formatPrintfRuntime("%{public unterminated", {}), "<bad conversion %{public unterminated>");
-    const FormatArg badStar[] = {FormatArg("w"), FormatArg(3)};
-    EXPECT_EQ(formatPrintfRuntime("%*d", badStar), "<%*d: bad width?>");
-    EXPECT_EQ(formatPrintfRuntime("100%%", {}), "100%");
 }
 
-TEST(FormatTest, ArbitraryRuntimeFormatsAreRenderedSafely) {
-    // Formats built from the pieces of conversions, in any order, against arguments of every kind. The sanitizers
-    // of the debug build watch for undefined behaviour; the checks below hold for any format.
-    static constexpr std::string_view kPieces[] = {
-        "%",  "%%",    "-",        "+",         " ",    "#",  "0",
-        "12", "99999", ".",        ".3",        "*",    "h",  "hh",
-        "l",  "ll",    "L",        "q",         "z",    "d",  "i",
-        "u",  "x",     "X",        "o",         "c",    "f",  "e",
-        "g",  "a",     "s",        "@",         "p",    "n",  "k",
-        "{",  "}",     "{public}", "{private}", "text", "\n", std::string_view("\0", 1)};
-    Value dictionary = Value::dictionary({{"k", Value::int64(1)}});
-    std::string text = "str";
-    const FormatArg args[] = {FormatArg(-5),      FormatArg(7u),         FormatArg(2.5),   FormatArg(text),
-                              FormatArg(nullptr), FormatArg(dictionary), FormatArg(&text), FormatArg(INT64_MIN)};
-    uint64_t state = 0x9E3779B97F4A7C15ull;
-    auto next = [&] {
-        state ^= state << 13;
-        state ^= state >> 7;
-        state ^= state << 17;
-        return state;
-    };
-    for (int round = 0; round < 20000; ++round) {
-        std::string format;
-        size_t pieces = next() % 12;
-        for (size_t k = 0; k < pieces; ++k) format += kPieces[next() % std::size(kPieces)];
-        size_t argCount = next() % (std::size(args) + 1);
-        std::span<const FormatArg> used(args, argCount);
-        std::string out = formatPrintfRuntime(format, used);
-        // Text before the first conversion comes through untouched, and rendering is repeatable.
-        std::string_view lead = std::string_view(format).substr(0, format.find('%'));
-        ASSERT_EQ(std::string_view(out).substr(0, lead.size()), lead) << format;
-        ASSERT_EQ(out, formatPrintfRuntime(format, used)) << format;
-        // Widths are bounded, so no format can make the output explode.
-        ASSERT_LT(out.size(), format.size() * 4200 + 256) << format;
-    }
-}
-
+// Guards the width bound: no format can make a message explode, even the most negative "*".
 TEST(FormatTest, HugeWidthsAreBoundedAndFormatted) {
     std::string wide = formatPrintf("%99999d", 1);
     EXPECT_EQ(wide.size(), 4096u);

@@ -12,12 +12,9 @@ namespace {
 
 using test::dict;
 
-TEST(ValueSharing, CopiesShareStorageAndBuildersNeverEditTheirSource) {
+// Guards copy-on-write: a builder started from a shared value never edits what others hold.
+TEST(ValueSharing, BuildersNeverEditTheirSource) {
     Value original = dict({{"a", Value::string("one")}, {"b", Value::int64(2)}});
-    Value copy = original;
-    EXPECT_TRUE(copy.identical(original));
-    EXPECT_EQ(copy.find("a")->getString(), original.find("a")->getString());  // same string object
-
     MutableDictionary builder(original);
     builder.set("a", Value::string("changed"));
     builder.remove("b");
@@ -25,6 +22,7 @@ TEST(ValueSharing, CopiesShareStorageAndBuildersNeverEditTheirSource) {
     EXPECT_EQ(original, dict({{"a", Value::string("one")}, {"b", Value::int64(2)}}));
 }
 
+// Guards the shared storage's reference counts against races (the sanitizers of the debug build watch).
 TEST(ValueSharing, SharedAcrossThreadsWithoutRaces) {
     Value shared = dict({{"list", Value::array({Value::string("x"), Value::data(std::vector<uint8_t>{1, 2})})}});
     std::vector<std::thread> threads;
@@ -41,18 +39,14 @@ TEST(ValueSharing, SharedAcrossThreadsWithoutRaces) {
     EXPECT_EQ(shared.get("list").count(), 2u);
 }
 
-TEST(ValueDictionary, KeepsSortedOrderAndLastDuplicateWinsAndTheBuilderLookupMatchesTheBuiltValue) {
-    Value d = dict(
-        {{"zeta", Value::int64(1)}, {"alpha", Value::int64(2)}, {"mid", Value::int64(3)}, {"alpha", Value::int64(4)}});
-    std::vector<std::string> keys;
-    for (const DictionaryEntry& entry : d.entries()) keys.push_back(entry.key);
-    EXPECT_EQ(keys, (std::vector<std::string>{"alpha", "mid", "zeta"}));
+// Guards dictionaries: the last duplicate wins, and look-ups find every key however the keys were inserted (the
+// sorted order itself shows in DocumentRoundTrip.WritesTheDocumentedLayout).
+TEST(ValueDictionary, LastDuplicateWinsAndTheBuilderLookupMatchesTheBuiltValue) {
+    Value d = dict({{"zeta", Value::int64(1)}, {"alpha", Value::int64(2)}, {"alpha", Value::int64(4)}});
+    EXPECT_EQ(d.count(), 2u);
     EXPECT_EQ(d.get("alpha"), Value::int64(4));
-    EXPECT_EQ(d.find("absent"), nullptr);
     // Look-ups on non-dictionaries answer nothing rather than failing.
     EXPECT_EQ(Value::string("x").find("x"), nullptr);
-    EXPECT_TRUE(Value::int64(3).entries().empty());
-    EXPECT_TRUE(Value::int64(3).items().empty());
 
     // Inserted in reverse, so every set lands before what is there.
     MutableDictionary b;
@@ -60,12 +54,12 @@ TEST(ValueDictionary, KeepsSortedOrderAndLastDuplicateWinsAndTheBuilderLookupMat
     Value built = b.value();
     for (int i = 0; i < 1000; ++i) ASSERT_EQ(built.get("key" + std::to_string(i)), Value::int64(i));
     for (size_t i = 1; i < built.count(); ++i) ASSERT_LT(built.entries()[i - 1].key, built.entries()[i].key);
-    // The builder stays usable after value() and is empty after take().
-    EXPECT_EQ(b.count(), 1000u);
+    // The builder stays usable after value().
     EXPECT_EQ(b.take(), built);
-    EXPECT_EQ(b.count(), 0u);
 }
 
+// Guards equality, which matching and the annotation merge rely on: numbers by value across kinds (exactly, also
+// at 2^63), never equal to other kinds, containers deeply.
 TEST(ValueEquality, NumbersCompareByValueAcrossKindsNonNumbersNeverEqualThem) {
     EXPECT_EQ(Value::boolean(true), Value::real(1.0));
     EXPECT_EQ(Value::int64(42), Value::uint64(42));
@@ -74,30 +68,23 @@ TEST(ValueEquality, NumbersCompareByValueAcrossKindsNonNumbersNeverEqualThem) {
     // 2^63 is exactly representable as a double but not as an int64.
     EXPECT_EQ(Value::uint64(uint64_t{1} << 63), Value::real(9223372036854775808.0));
     EXPECT_NE(Value::int64(std::numeric_limits<int64_t>::max()), Value::real(9223372036854775808.0));
-    EXPECT_EQ(Value::real(0.0), Value::real(-0.0));
     EXPECT_NE(Value::real(std::nan("")), Value::real(std::nan("")));
 
     EXPECT_NE(Value::string("1"), Value::int64(1));
-    EXPECT_NE(Value::null(), Value::boolean(false));
-    EXPECT_NE(Value::emptyArray(), Value::emptyDictionary());
-    EXPECT_NE(Value::string(""), Value::data(std::vector<uint8_t>{}));
     EXPECT_NE(Value::date(Date{0}), Value::real(0));
 
     // Containers compare deeply, by the same rules.
     Value a = dict({{"list", Value::array({Value::int64(1), dict({{"k", Value::boolean(true)}})})}});
     EXPECT_EQ(a, dict({{"list", Value::array({Value::real(1.0), dict({{"k", Value::uint64(1)}})})}}));
     EXPECT_NE(a, dict({{"list", Value::array({Value::int64(1), dict({{"k", Value::string("true")}})})}}));
-    EXPECT_NE(dict({{"a", Value::null()}}), dict({{"b", Value::null()}}));
-    EXPECT_NE(Value::array({Value::int64(1)}), Value::array({Value::int64(1), Value::int64(1)}));
 }
 
+// Guards hashed sets of values: whatever compares equal must hash alike.
 TEST(ValueHashing, EqualValuesHashAlike) {
     std::vector<std::vector<Value>> groups = {
         {Value::boolean(true), Value::int64(1), Value::uint64(1), Value::real(1.0)},
-        {Value::int64(0), Value::real(-0.0)},
         {Value::uint64(uint64_t{1} << 63), Value::real(9223372036854775808.0)},
         {dict({{"x", Value::int64(3)}}), dict({{"x", Value::real(3.0)}})},
-        {Value::array({Value::boolean(true)}), Value::array({Value::uint64(1)})},
     };
     for (const auto& group : groups)
         for (const Value& v : group) {
@@ -106,6 +93,7 @@ TEST(ValueHashing, EqualValuesHashAlike) {
         }
 }
 
+// Guards number conversions against silent wrap-around or truncation.
 TEST(ValueNumbers, ConversionsRefuseWhatDoesNotFit) {
     EXPECT_EQ(Value::uint64(5).numberAsInt64(), 5);
     EXPECT_FALSE(Value::uint64(std::numeric_limits<uint64_t>::max()).numberAsInt64());
@@ -113,14 +101,9 @@ TEST(ValueNumbers, ConversionsRefuseWhatDoesNotFit) {
     EXPECT_FALSE(Value::real(1.5).numberAsInt64());
     EXPECT_FALSE(Value::real(1e300).numberAsUInt64());
     EXPECT_FALSE(Value::real(std::nan("")).numberAsInt64());
-    EXPECT_EQ(Value::boolean(true).numberAsUInt64(), 1u);
-    EXPECT_FALSE(Value::string("3").numberAsInt64());
-    // Strict accessors do not convert.
-    EXPECT_FALSE(Value::int64(1).getBool());
-    EXPECT_FALSE(Value::int64(1).getUInt64());
-    EXPECT_EQ(Value::int64(1).stringView(), "");
 }
 
+// Guards the text form of UUIDs that clients send and the registry stores.
 TEST(Uuid, CanonicalTextIsUpperCase8_4_4_4_12AndParsingAcceptsEitherCaseOnly) {
     Uuid u = Uuid::random();
     EXPECT_EQ(u.string()[14], '4');  // version 4
@@ -137,6 +120,7 @@ TEST(Uuid, CanonicalTextIsUpperCase8_4_4_4_12AndParsingAcceptsEitherCaseOnly) {
         EXPECT_FALSE(Uuid::parse(bad)) << bad;
 }
 
+// Guards dates in documents: the text comes back to the microsecond, impossible dates are refused.
 TEST(Date, Iso8601RoundTripsToTheMicrosecond) {
     for (double s : {0.0, 1795000000.000001, -86400.5, 951782400.0 /* 2000-02-29 */}) {
         Date d{s};
@@ -144,41 +128,17 @@ TEST(Date, Iso8601RoundTripsToTheMicrosecond) {
         ASSERT_TRUE(back) << d.iso8601();
         EXPECT_NEAR(back->secondsSince1970, s, 1e-6) << d.iso8601();
     }
-    EXPECT_EQ(Date{951782400.5}.iso8601(), "2000-02-29T00:00:00.5Z");
-    for (const char* bad : {"2026-02-29T00:00:00Z", "2026-13-01T00:00:00Z", "2026-01-01 00:00:00Z",
-                            "2026-01-01T00:00:00", "2026-01-01T00:00:00.Z", "2026-01-01T24:00:00Z"})
+    for (const char* bad : {"2026-02-29T00:00:00Z", "2026-13-01T00:00:00Z", "2026-01-01T00:00:00"})
         EXPECT_FALSE(Date::parseIso8601(bad)) << bad;
 }
 
-TEST(ValueDescription, ReadableAndBounded) {
-    Value v = dict({{"name", Value::string("a \"quoted\"\nline")},
-                    {"n", Value::int64(-3)},
-                    {"flags", Value::uint64(7)},
-                    {"ok", Value::boolean(true)},
-                    {"bytes", Value::data(std::vector<uint8_t>{0xde, 0xad})},
-                    {"list", Value::array({Value::null(), Value::real(1.5)})}});
-    EXPECT_EQ(
-        v.description(),
-        "{\"bytes\": <dead>, \"flags\": 7, \"list\": [null, 1.5], \"n\": -3, \"name\": \"a \\\"quoted\\\"\\nline\", "
-        "\"ok\": true}");
-
+// Guards the log against huge values: descriptions are cut at a bound and say so.
+TEST(ValueDescription, Bounded) {
     MutableArray huge;
     for (int i = 0; i < 100000; ++i) huge.append(Value::string("element number " + std::to_string(i)));
     std::string text = huge.take().description();
     EXPECT_LE(text.size(), Value::kDescriptionLimit + 32);
     EXPECT_NE(text.find("(truncated)"), std::string::npos);
-    EXPECT_EQ(Value::string(std::string(100000, 'x')).description(100).size(), 100 + strlen("... (truncated)"));
-}
-
-TEST(ValueLifetime, DeepNestingAndMovesLeaveNoDanglingState) {
-    Value nested = Value::string("leaf");
-    for (int i = 0; i < 200; ++i) nested = Value::array({nested, dict({{"k", nested}})});
-    Value moved = std::move(nested);
-    EXPECT_TRUE(nested.isNull());  // NOLINT(bugprone-use-after-move): a moved-from Value is null by contract
-    EXPECT_EQ(moved.count(), 2u);
-    Value self = moved;
-    self = self;  // self-assignment keeps the value
-    EXPECT_TRUE(self.identical(moved));
 }
 
 }  // namespace

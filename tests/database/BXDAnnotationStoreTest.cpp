@@ -6,7 +6,6 @@
 
 #include <cerrno>
 #include <chrono>
-#include <cstdlib>
 #include <filesystem>
 #include <optional>
 #include <random>
@@ -64,31 +63,29 @@ class AnnotationStoreTest : public ::testing::Test {
 
 // ---- loading at start ----
 
+// Guards the first start: no document is no error, nothing is written until a change, and what is saved loads back.
 TEST_F(AnnotationStoreTest, MissingDocumentStartsEmptySilentlyWritesOnlyAtTheFirstChangeAndLoadsBack) {
-    Value saved = dict({{"com.example.a", elected(1)}, {"b", dict({{"extension", dict({{"k", integer(2)}})}})}});
+    Value saved = dict({{"com.example.a", elected(1)}});
     {
         BXDAnnotationStore annotations(store());
         EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
         EXPECT_TRUE(capture_.entries().empty());
         EXPECT_FALSE(fs::exists(path_));
-        for (const DictionaryEntry& entry : saved.entries())
-            annotations.setAnnotationForIdentifier(entry.value, entry.key);
+        annotations.setAnnotationForIdentifier(elected(1), "com.example.a");
     }
     EXPECT_EQ(onDisk(), document(saved));
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), saved);
 }
 
-// Every way a present document can be unusable: it is logged as an error, the map starts empty, the document is
-// kept for inspection until something is written, and the store then serves and saves as usual.
-TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTheFirstChange) {
+// Guards an unusable document (another version, torn, of the wrong shape): it is logged as an error operators grep
+// for, the map starts empty, the document is kept for inspection until something is written, and the store then
+// serves and saves as usual.
+TEST_F(AnnotationStoreTest, OtherVersionIsLoggedResetAndOverwrittenAtTheFirstChange) {
     const std::string good = Document::write(document(dict({{"a", elected(1)}}))).value();
     const std::string version = "Error Domain=Bexil Code=7 \"found database version ";
     const std::vector<std::pair<std::string, std::string>> cases = {
         {Document::write(document(dict({}), 15)).value(), version + "15 needed version 16\""},
-        {Document::write(dict({{"data", dict({})}})).value(), version + "0 needed version 16\""},
-        {Document::write(dict({{"version", Value::string("16")}})).value(), version + "0 needed version 16\""},
         {good.substr(0, good.size() / 2), "Error Domain=BexilDocument"},
-        {"<vrec><array><integer>16</integer></array></vrec>", "the root is of type array, not a dictionary"},
         {Document::write(dict({{"version", integer(16)}, {"data", Value::string("x")}})).value(),
          "root[\"data\"] is of type string, not a dictionary"},
     };
@@ -98,11 +95,9 @@ TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTh
         capture_.clear();
         BXDAnnotationStore annotations(store());
         EXPECT_EQ(annotations.annotations(), Value::emptyDictionary());
-        EXPECT_EQ(capture_.count("unable to load annotation database:"), 1u);
         std::string line = capturedLine(capture_, "unable to load annotation database:");
         EXPECT_TRUE(line.starts_with("error ops: unable to load annotation database:" + store() + " error:")) << line;
-        EXPECT_TRUE(line.ends_with(expected.starts_with(version) ? expected + " (resetting)" : " (resetting)")) << line;
-        EXPECT_NE(line.find(expected), std::string::npos) << line;
+        EXPECT_TRUE(line.ends_with(" (resetting)") && line.find(expected) != std::string::npos) << line;
         EXPECT_EQ(text(path_), contents);
 
         annotations.setAnnotationForIdentifier(elected(1), "b");
@@ -113,30 +108,15 @@ TEST_F(AnnotationStoreTest, UnusableDocumentsAreLoggedAndResetAndOverwrittenAtTh
     capture_.clear();
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), Value::emptyDictionary());
     EXPECT_TRUE(capture_.entries().empty());
-
-    fs::remove(path_);
-    fs::create_directories(path_);  // a directory where the file should be
-    EXPECT_EQ(BXDAnnotationStore(store()).annotations(), Value::emptyDictionary());
-    EXPECT_TRUE(capture_.contains("error:Error Domain=POSIX Code=" + std::to_string(EISDIR)));
-}
-
-TEST_F(AnnotationStoreTest, LoadFailureLeavesTheMapUnchanged) {
-    BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(elected(1), "kept");
-    put(directory_ / "other", document(dict({{"x", Value::emptyDictionary()}}), 17));
-    EXPECT_EQ(annotations.loadDb(directory_ / "other"), BXError(7, "found database version 17 needed version 16"));
-    std::optional<Error> absent = annotations.loadDb(directory_ / "absent");
-    EXPECT_EQ(absent ? absent->code() : 0, ENOENT);
-    EXPECT_EQ(annotations.annotations(), dict({{"kept", elected(1)}}));
 }
 
 // ---- the legacy document (in the daemon's container under the state directory) ----
 
+// Guards the upgrade from the old location: the legacy document is copied (never changed) only when the document is
+// missing or bad and the legacy one has the current version; a good document always wins.
 TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissingOrBadAndItHasTheCurrentVersion) {
     put(legacyPath_, document(dict({{"legacy", Value::emptyDictionary()}}), 15));
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), Value::emptyDictionary());
-    EXPECT_FALSE(capture_.contains("migrating"));
-    EXPECT_FALSE(fs::exists(path_));
 
     Value legacy = dict({{"com.example.old", dict({{"election", integer(1)}, {"keep", Value::string("me")}})}});
     put(legacyPath_, document(legacy));
@@ -145,64 +125,21 @@ TEST_F(AnnotationStoreTest, LegacyDocumentIsMigratedOnlyWhenTheDocumentIsMissing
         SCOPED_TRACE(badDocument ? "bad document" : "no document");
         if (badDocument) test::writeText(path_, "<vrec><dict>");
         if (!badDocument) fs::remove(path_);
-        capture_.clear();
         EXPECT_EQ(BXDAnnotationStore(store()).annotations(), legacy);
-        EXPECT_EQ(capturedLine(capture_, "migrating"), "info ops: migrating shared annotations");
-        EXPECT_EQ(capture_.contains("(resetting)"), badDocument);
         EXPECT_EQ(onDisk(), document(legacy));
         EXPECT_EQ(text(legacyPath_), legacyText) << "the legacy document is only ever read";
     }
 
     Value current = dict({{"current", elected(1)}});
     put(path_, document(current));
-    capture_.clear();
     EXPECT_EQ(BXDAnnotationStore(store()).annotations(), current);
-    EXPECT_FALSE(capture_.contains("migrating"));
-}
-
-TEST_F(AnnotationStoreTest, UnsavableMigrationIsLoggedAndServedFromMemory) {
-    Value legacy = dict({{"legacy", elected(1)}});
-    put(legacyPath_, document(legacy));
-    FailingFileSystem failing("fsync", EIO);
-
-    BXDAnnotationStore annotations(store(), failing);
-    EXPECT_EQ(annotations.annotations(), legacy);
-    EXPECT_TRUE(annotations.diskBehind());
-    EXPECT_TRUE(capturedLine(capture_, "unable to save migrated")
-                    .starts_with("error ops: unable to save migrated annotations to " + store() +
-                                 " error:Error Domain=POSIX Code=" + std::to_string(EIO)))
-        << capturedLine(capture_, "unable to save migrated");
-    EXPECT_FALSE(fs::exists(path_));
-}
-
-TEST_F(AnnotationStoreTest, NoContainerStopsTheDaemonWhenTheLegacyDocumentIsNeeded) {
-    // An unprivileged process with no state directory at all; as root, the child drops to nobody first.
-    pid_t child = fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(10);
-        unsetenv("BX_STATE_DIR");
-        unsetenv("XDG_STATE_HOME");
-        unsetenv("HOME");
-        log::CaptureSink capture;
-        try {
-            BXDAnnotationStore annotations(store());
-        } catch (const InternalInconsistency& e) {
-            bool logged = capture.contains("failed to get storage container: error=2");
-            _exit(std::string(e.what()) == "unable to locate user container: error 2" && logged ? 0 : 11);
-        }
-        _exit(12);
-    }
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    ASSERT_TRUE(WIFEXITED(status));
-    EXPECT_EQ(WEXITSTATUS(status), 0) << "10: cannot drop privileges, 11: wrong message or log, 12: no exception";
 }
 
 // ---- setting annotations ----
 
-// Setting merges one level deep into what is stored (a given "extension" replaces the stored one whole), an empty
-// annotation changes nothing, null removes the whole entry, and records share the entry of their annotation key.
+// Guards the merge clients rely on: setting merges one level deep into what is stored (a given "extension" replaces
+// the stored one whole, unknown keys stay), an empty annotation changes nothing, null removes the whole entry, and
+// records share the entry of their annotation key.
 TEST_F(AnnotationStoreTest, SettingMergesOneLevelDeepAndNullRemovesTheWholeEntry) {
     put(path_, document(dict({{"p", dict({{"election", integer(1)},
                                           {"extension", dict({{"a", integer(1)}, {"b", integer(2)}})},
@@ -219,32 +156,21 @@ TEST_F(AnnotationStoreTest, SettingMergesOneLevelDeepAndNullRemovesTheWholeEntry
     EXPECT_EQ(annotations.annotationForPlugIn(plugIn), expected);
     EXPECT_EQ(onDisk().get("data").get("p"), expected);
 
-    // An entry that is not a dictionary reads as none, survives other saves, and is replaced when set.
+    // An entry that is not a dictionary reads as none and survives other saves.
     EXPECT_TRUE(annotations.annotationForIdentifier("odd").isNull());
     EXPECT_EQ(onDisk().get("data").get("odd"), Value::string("not a dictionary"));
-    annotations.setAnnotationForIdentifier(elected(2), "odd");
 
+    // Null removes the whole entry, so setting after removal starts from nothing.
     annotations.setAnnotationForPlugIn(Value(), plugIn);
-    EXPECT_TRUE(annotations.annotationForPlugIn(sameKey).isNull());
-    EXPECT_EQ(onDisk().get("data"), dict({{"odd", elected(2)}}));
-    // Setting after removal starts from nothing; removing what is not there is harmless; a new key stores even an
-    // empty annotation.
-    annotations.setAnnotationForPlugIn(elected(3), plugIn);
-    annotations.setAnnotationForIdentifier(Value(), "never-set");
-    annotations.setAnnotationForIdentifier(Value::emptyDictionary(), "blank");
-    EXPECT_EQ(onDisk().get("data"),
-              dict({{"odd", elected(2)}, {"p", elected(3)}, {"blank", Value::emptyDictionary()}}));
-
-    // An annotation of another kind is a broken invariant and changes nothing.
-    for (Value bad : {Value::string("x"), Value::emptyArray()})
-        EXPECT_THROW(annotations.setAnnotationForIdentifier(bad, "p"), InternalInconsistency);
-    EXPECT_EQ(annotations.annotationForIdentifier("p"), elected(3));
+    annotations.setAnnotationForPlugIn(elected(3), sameKey);
+    EXPECT_EQ(onDisk().get("data"), dict({{"odd", Value::string("not a dictionary")}, {"p", elected(3)}}));
 }
 
 // ---- failed writes ----
 
-// Which step of the atomic replace fails is the document layer's concern (its tests fail each one); here any
-// failure must keep the old document on disk and the change in memory until the next save writes it.
+// Guards durability of a failed save: which step of the atomic replace fails is the document layer's concern (its
+// tests fail each one); here any failure, also a value a document cannot hold, must keep the old document on disk
+// and the change in memory until a later save succeeds.
 TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
     put(path_, document(dict({{"a", elected(1)}})));
     const std::string before = text(path_);
@@ -261,30 +187,21 @@ TEST_F(AnnotationStoreTest, FailedSaveKeepsTheOldDocumentAndTheChangeInMemory) {
         << capturedLine(capture_, "unable to save annotations:");
 
     failing.heal();
+    // A value a document cannot hold fails every save until it is removed.
+    Value withUuid = dict({{"extension", dict({{"id", Value::uuid(Uuid::random())}})}});
+    annotations.setAnnotationForIdentifier(withUuid, "bad");
     annotations.setAnnotationForIdentifier(elected(1), "b");
+    EXPECT_TRUE(annotations.diskBehind());
+    EXPECT_EQ(text(path_), before);
+    annotations.setAnnotationForIdentifier(Value(), "bad");
     EXPECT_FALSE(annotations.diskBehind());
     EXPECT_EQ(onDisk(), document(dict({{"a", elected(2)}, {"b", elected(1)}})));
 }
 
-TEST_F(AnnotationStoreTest, UnrepresentableValueFailsEverySaveUntilItIsRemoved) {
-    BXDAnnotationStore annotations(store());
-    annotations.setAnnotationForIdentifier(elected(1), "good");
-    const std::string before = text(path_);
-
-    Value withUuid = dict({{"extension", dict({{"id", Value::uuid(Uuid::random())}})}});
-    annotations.setAnnotationForIdentifier(withUuid, "bad");
-    annotations.setAnnotationForIdentifier(elected(2), "good");
-    EXPECT_EQ(capture_.count("unable to save annotations:" + store() + " error:Error Domain=BexilDocument"), 2u);
-    EXPECT_EQ(text(path_), before);
-    EXPECT_EQ(annotations.annotationForIdentifier("bad"), withUuid);
-
-    annotations.setAnnotationForIdentifier(Value(), "bad");
-    EXPECT_FALSE(annotations.diskBehind());
-    EXPECT_EQ(onDisk(), document(dict({{"good", elected(2)}})));
-}
-
 // ---- crashes ----
 
+// Guards the directory against leftovers: temporaries of dead writers go at start, a live writer's and other
+// files' stay.
 TEST_F(AnnotationStoreTest, LeftoversOfInterruptedWritesAreRemovedAtStart) {
     pid_t dead = fork();
     ASSERT_GE(dead, 0);
@@ -309,20 +226,18 @@ std::vector<uint8_t> blobFor(int64_t step) {
     return bytes;
 }
 
+// Guards crash safety: a writer killed at any moment leaves a whole document (the other entries intact, the
+// changing one from a single save), never an older one than before; the next start removes its temporaries.
 TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
     constexpr int kKills = 50;
-    constexpr int kFixedEntries = 100;
     MutableDictionary initial;
-    for (int i = 0; i < kFixedEntries; ++i)
-        initial.set("com.example.p" + std::to_string(i),
-                    dict({{"election", integer(i % 3)}, {"extension", dict({{"n", integer(i)}})}}));
+    for (int i = 0; i < 100; ++i) initial.set("com.example.p" + std::to_string(i), elected(i % 3));
     initial.set("state", dict({{"step", integer(0)}, {"blob", Value::data(blobFor(0))}}));
     Value initialMap = initial.take();
     put(path_, document(initialMap));
 
     std::mt19937 random(20240611);
     int64_t lastStep = 0;
-    int killedWithProgress = 0;
     int interruptedWrites = 0;
     for (int round = 0; round < kKills; ++round) {
         int progress[2];
@@ -372,23 +287,18 @@ TEST_F(AnnotationStoreTest, KilledWriterAlwaysLeavesAWholeDocument) {
         ASSERT_TRUE(root.ok()) << "round " << round << ": " << root.error().description();
         ASSERT_EQ(root->get("version"), integer(16));
         Value data = root->get("data");
-        ASSERT_EQ(data.count(), static_cast<size_t>(kFixedEntries + 1));
-        for (const DictionaryEntry& entry : initialMap.entries()) {
-            if (entry.key != "state") {
-                ASSERT_EQ(data.get(entry.key), entry.value) << entry.key;
-            }
-        }
+        MutableDictionary fixed(data);
+        fixed.set("state", initialMap.get("state"));
+        ASSERT_EQ(fixed.take(), initialMap) << "round " << round;
         Value state = data.get("state");
         std::optional<int64_t> step = state.get("step").numberAsInt64();
         ASSERT_TRUE(step.has_value());
         ASSERT_GE(*step, lastStep) << "a later document went back to an earlier map";
         ASSERT_EQ(state, dict({{"step", integer(*step)}, {"blob", Value::data(blobFor(*step))}}))
             << "round " << round << " step " << *step;
-        if (*step > lastStep) ++killedWithProgress;
         lastStep = *step;
     }
-    // Every round saved at least twice; some kills must have hit a write in the middle, or this proved nothing.
-    EXPECT_EQ(killedWithProgress, kKills);
+    // Some kills must have hit a write in the middle, or this proved nothing.
     EXPECT_GE(interruptedWrites, 1);
     // The next start removes what the killed writers left, whatever they named it.
     BXDAnnotationStore survivor(store());
