@@ -14,49 +14,22 @@
 #include <sstream>
 #include <thread>
 
+#include "ChildProcess.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
 #include "platform/jobard/ServiceManager.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
+#include "platform/wardend/ProcessAssertions.h"
 
 namespace bexil {
 namespace {
 
 namespace fs = std::filesystem;
 
-// A child process that sleeps until it is signalled. It lets go of the test's output (so nothing waiting for that
-// output waits for it) and dies with the test, whatever way the test ends.
-pid_t startSleeper(bool ignoreTerm = false) {
-    pid_t parent = getpid();
-    pid_t child = fork();
-    if (child == 0) {
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
-        if (getppid() != parent) _exit(0);
-        int devnull = open("/dev/null", O_RDWR);
-        dup2(devnull, STDOUT_FILENO);
-        dup2(devnull, STDERR_FILENO);
-        if (ignoreTerm) signal(SIGTERM, SIG_IGN);
-        for (;;) pause();
-    }
-    return child;
-}
-
-// Kills and reaps the sleepers it was given when the test ends, also when an assertion ends it early.
-class SleeperGuard {
-  public:
-    explicit SleeperGuard(std::initializer_list<pid_t> pids) : pids_(pids) {}
-    ~SleeperGuard() {
-        for (pid_t pid : pids_) {
-            kill(pid, SIGKILL);
-            waitpid(pid, nullptr, 0);
-        }
-    }
-
-  private:
-    std::vector<pid_t> pids_;
-};
+using test::SleeperGuard;
+using test::startSleeper;
 
 bool reapWithin(pid_t pid, std::chrono::seconds timeout) {
     auto deadline = std::chrono::steady_clock::now() + timeout;
@@ -151,6 +124,26 @@ TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
     terminate({proxy("com.example.greeter.hello", "1"), proxy("com.example.greeter.bonjour", "1")});
     EXPECT_EQ(capture.count("jobard reported no plug-ins on record"), 2u);
     EXPECT_FALSE(fs::exists(stale));
+}
+
+// The busy check's platform service: only live asserted instances count, and a name cannot reach outside the
+// records' directory.
+TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
+    test::TempDir runtime("bx-assertions");
+    RunningInstances assertions("assertions", runtime.path());
+    ProcessAssertions wardend(assertions);
+    pid_t busy = startSleeper();
+    pid_t finished = startSleeper();
+    SleeperGuard guard{busy, finished};
+    ASSERT_TRUE(assertions.record("com.example.greeter.hello", busy));
+    ASSERT_TRUE(assertions.record("com.example.greeter.bonjour", finished));
+    kill(finished, SIGKILL);
+    waitpid(finished, nullptr, 0);
+
+    std::vector<Value> found =
+        wardend.busyExtensionInstances({"com.example.greeter.hello", "com.example.greeter.bonjour", "../escape"});
+    ASSERT_EQ(found.size(), 1u);
+    EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
 }
 
 // A plug-in instance that takes a while to end, as one that saves its state does: on SIGTERM it writes its pid to

@@ -3,8 +3,8 @@
 // is an uninstall, as for "remove"), bad bundles and bundles gone from disk are LedgerixTest's.
 
 #include <gtest/gtest.h>
-#include <sys/prctl.h>
 
+#include "ChildProcess.h"
 #include "E2eSupport.h"
 #include "platform/jobard/RunningInstances.h"
 
@@ -16,22 +16,6 @@ using namespace test;
 
 const std::string kHello = "com.example.greeter.hello";
 const std::string kBonjour = "com.example.greeter.bonjour";
-
-// A stand-in for a running plug-in: a child that sleeps until it is signalled, lets go of the test's output and
-// dies with the test however the test ends.
-pid_t startInstance() {
-    pid_t parent = getpid();
-    pid_t child = fork();
-    if (child == 0) {
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
-        if (getppid() != parent) _exit(0);
-        int devnull = open("/dev/null", O_RDWR);
-        dup2(devnull, STDOUT_FILENO);
-        dup2(devnull, STDERR_FILENO);
-        for (;;) pause();
-    }
-    return child;
-}
 
 class RegistrationTest : public DaemonTest {
   protected:
@@ -50,7 +34,7 @@ class RegistrationTest : public DaemonTest {
 
     // Starts an instance of the plug-in with `bundleIdentifier` and records it as its runtime would.
     pid_t run(const std::string& bundleIdentifier) {
-        pid_t pid = startInstance();
+        pid_t pid = startSleeper();
         instances_.push_back(pid);
         EXPECT_TRUE(running_.record(bundleIdentifier, pid));
         return pid;
