@@ -22,6 +22,7 @@
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
 #include "platform/wardend/ProcessAssertions.h"
+#include "policy/BXDPlugIn.h"
 
 namespace bexil {
 namespace {
@@ -144,6 +145,27 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
         wardend.busyExtensionInstances({"com.example.greeter.hello", "com.example.greeter.bonjour", "../escape"});
     ASSERT_EQ(found.size(), 1u);
     EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
+
+    // The daemon's record asks by its bundle identifier and describes the busy instance by that alone. A data
+    // plug-in on the system volume passes the record's checks without a container or an application.
+    LXBexilProxy::Fields fields;
+    fields.bundleURL = "/System/Library/PlugIns/Hello.bxplugin";
+    fields.isOnSystemPartition = true;
+    fields.bundleIdentifier = fields.pluginIdentifier = "com.example.greeter.hello";
+    fields.pluginUUID = Uuid::random();
+    fields.infoVrec = Value::dictionary(
+        {{"BDBundleIdentifier", Value::string("com.example.greeter.hello")},
+         {"RZExtension", Value::dictionary({{"RZExtensionProtocol", Value::string("#Data")},
+                                            {"RZExtensionAttributes",
+                                             Value::dictionary({{"RZExtensionVersion", Value::string("1")}})}})}});
+    auto plugIn = BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+    ASSERT_NE(plugIn, nullptr);
+    EXPECT_EQ(
+        plugIn->checkBusy(wardend),
+        Value::dictionary({{ProcessAssertions::kBundleIdentifierKey, Value::string("com.example.greeter.hello")}}));
+    kill(busy, SIGKILL);
+    waitpid(busy, nullptr, 0);
+    EXPECT_FALSE(plugIn->checkBusy(wardend));
 }
 
 // A plug-in instance that takes a while to end, as one that saves its state does: on SIGTERM it writes its pid to
