@@ -14,6 +14,7 @@
 #include "client/BXDaemonClient.h"
 #include "client/BXDaemonClientSync.h"
 #include "client/BXPlugInMatches.h"
+#include "platform/log/CaptureSink.h"
 #include "platform/zem/ZemListener.h"
 
 namespace bexil {
@@ -148,14 +149,38 @@ TEST_F(BXDaemonClientRequestTest, EachRequestCarriesItsNameVersion3AndExactlyIts
     }
 }
 
-// Guards the client's threading promise: reply handlers run on its reply queue.
-TEST_F(BXDaemonClientRequestTest, RepliesRunOnTheReplyQueue) {
+// Guards the client's threading promise, reply handlers run on its reply queue, and its trace: the request and
+// the reply are logged on the traffic channel, which is what a developer turns on to see the conversation.
+TEST_F(BXDaemonClientRequestTest, RepliesRunOnTheReplyQueueAndTheConversationIsTraced) {
+    log::CaptureSink capture;
     BXDaemonClient client;
     std::promise<bool> onQueue;
     client.bulkPluginsReply(0, [&](const Reply&) { onQueue.set_value(client.replyQueue().isCurrent()); });
     auto future = onQueue.get_future();
     ASSERT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
     EXPECT_TRUE(future.get());
+    auto requests = capture.matching("request: ");
+    ASSERT_EQ(requests.size(), 1u);
+    EXPECT_EQ(requests[0].category, "traffic");
+    EXPECT_EQ(capture.count("reply: "), 1u);
+}
+
+// Guards the connection-failure path of the library: a service that is not there answers the request (no hang)
+// with the connection error, which is code 4 with the platform's description and is logged as a communications
+// error.
+TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThatIsCode4) {
+    test::TempDir empty("bexil-client-empty");
+    test::ScopedEnv serviceDir("BX_SERVICE_DIR", empty.path().string());
+    log::CaptureSink capture;
+    BXDaemonClient client("com.example.nobody");
+    auto reply = sendAndWait([&](auto h) { client.bulkPluginsReply(0, h); }, std::chrono::seconds(10));
+    ASSERT_TRUE(reply.has_value()) << "a missing service must answer, not hang";
+    ASSERT_TRUE(std::holds_alternative<ZemError>(*reply));
+    auto error = BXDaemonClient::errorInReply(*reply);
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(error->code(), 4);
+    EXPECT_EQ(error->localizedDescription(), std::get<ZemError>(*reply).description());
+    EXPECT_TRUE(capture.contains("Communications error: " + std::get<ZemError>(*reply).description()));
 }
 
 // ---- errorInReply ----

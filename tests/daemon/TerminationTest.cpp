@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "ChildProcess.h"
+#include "PlugInRecord.h"
 #include "TestSupport.h"
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
@@ -146,19 +147,8 @@ TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     ASSERT_EQ(found.size(), 1u);
     EXPECT_EQ(found[0].get("pid"), Value::int64(busy));
 
-    // The daemon's record asks by its bundle identifier and describes the busy instance by that alone. A data
-    // plug-in on the system volume passes the record's checks without a container or an application.
-    LXBexilProxy::Fields fields;
-    fields.bundleURL = "/System/Library/PlugIns/Hello.bxplugin";
-    fields.isOnSystemPartition = true;
-    fields.bundleIdentifier = fields.pluginIdentifier = "com.example.greeter.hello";
-    fields.pluginUUID = Uuid::random();
-    fields.infoVrec = Value::dictionary(
-        {{"BDBundleIdentifier", Value::string("com.example.greeter.hello")},
-         {"RZExtension", Value::dictionary({{"RZExtensionProtocol", Value::string("#Data")},
-                                            {"RZExtensionAttributes",
-                                             Value::dictionary({{"RZExtensionVersion", Value::string("1")}})}})}});
-    auto plugIn = BXDPlugIn::initWithLXData(std::make_shared<LXBexilProxy>(std::move(fields)));
+    // The daemon's record asks by its bundle identifier and describes the busy instance by that alone.
+    auto plugIn = test::plugInRecord("com.example.greeter.hello", Uuid::random());
     ASSERT_NE(plugIn, nullptr);
     EXPECT_EQ(
         plugIn->checkBusy(wardend),

@@ -9,6 +9,7 @@
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXApplicationWorkspace.h"
 #include "platform/ledgerix/LXBexilProxy.h"
+#include "platform/log/CaptureSink.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {
@@ -144,7 +145,12 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInOnceFromTheCache
                                      std::make_shared<LXBexilProxy>(pendingFields), plugIn("bonjour"), hello};
     storeElection("com.example.hello", Value::int64(0));
 
+    log::CaptureSink capture;
     EXPECT_EQ(find(Value::emptyDictionary()), (Ids{"com.example.bonjour", "com.example.hello"}));
+    // The skips and the cache figures (records cached before / after) are what an operator reads to see why a
+    // plug-in is missing or why discovery was slow.
+    EXPECT_EQ(capture.count("skipping lx proxy "), 2u);
+    EXPECT_TRUE(capture.contains("LX reported 2 plug-ins (cache 0/2)"));
     EXPECT_EQ(find(Value()), (Ids{"com.example.bonjour", "com.example.hello"})) << "no query is an empty one";
     EXPECT_EQ(workspace_->installedCalls, 2);
     EXPECT_EQ(workspace_->filterCalls, 0);

@@ -60,6 +60,17 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
     EXPECT_EQ(bulk.err, "");
 }
 
+// Guards the help texts: every subcommand has one with an example, and the top one lists the exit statuses.
+TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
+    for (const char* sub : {"add", "remove", "bulk", "match", "ready", "access", "annotate", "elect", "unelect",
+                            "bulk-annotate", "hold", "release", "exclusions"}) {
+        Outcome run = bexil(std::string(sub) + " --help");
+        EXPECT_EQ(run.status, 0) << sub;
+        EXPECT_NE(run.out.find("example: bexil"), std::string::npos) << sub << ": " << run.out;
+    }
+    EXPECT_NE(bexil("--help").out.find("69 bxd not running"), std::string::npos);
+}
+
 // Guards the installed library: the install holds the tool, its manual, the public header (and no private one),
 // the pkg-config and CMake files, and the example application builds with pkg-config alone and talks to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {

@@ -208,12 +208,18 @@ TEST_F(BXMatchRulesTest, ConformanceOperatorsAndUnknownOperators) {
 
 // A dictionary pattern runs the value (an activation rule) against it; a value that is no rule does not match.
 TEST_F(BXMatchRulesTest, DictionaryPatternsRunTheActivationRule) {
+    log::CaptureSink capture;
     Value onePng = dict({{"attachments", arr({str("image/png")})}});
     Value twoPngs = dict({{"attachments", arr({str("image/png"), str("image/x-png")})}});
     EXPECT_TRUE(rule("ActivationRule", onePng));
     EXPECT_FALSE(rule("ActivationRule", twoPngs));
     EXPECT_FALSE(rule("Language", onePng));
     EXPECT_FALSE(rule("Missing", onePng));
+    // Each evaluated pair is traced on the extension channel (what a developer turns on to see why a rule failed);
+    // an absent value is not evaluated at all.
+    auto lines = capture.matching("evaluating RZExtension filter: ");
+    ASSERT_EQ(lines.size(), 3u);
+    EXPECT_EQ(lines[0].category, "extension");
 }
 
 }  // namespace
