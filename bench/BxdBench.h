@@ -14,7 +14,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <optional>
 #include <string>
+#include <vector>
 
 namespace bexil::bench {
 
@@ -24,6 +26,31 @@ inline const char* programName = "bench";
 [[noreturn]] inline void die(const char* what) {
     fprintf(stderr, "%s: %s: %s\n", programName, what, errno ? strerror(errno) : "failed");
     exit(1);
+}
+
+// The service bxd listens on when it is given no -S.
+inline constexpr const char* kBxdServiceName = "com.quorvel.bexil.bxd";
+
+// A decimal number from 1 to `max`, or none when `text` is anything else (the caller prints its usage).
+inline std::optional<unsigned long> parsePositive(const char* text, unsigned long max) {
+    char* end = nullptr;
+    errno = 0;
+    unsigned long value = strtoul(text, &end, 10);
+    if (errno != 0 || end == text || *end != '\0' || *text == '-' || value == 0 || value > max) return std::nullopt;
+    return value;
+}
+
+// The items of a comma-separated list, empty ones included.
+inline std::vector<std::string> splitList(const char* text) {
+    std::vector<std::string> items(1);
+    for (const char* p = text; *p != '\0'; ++p) {
+        if (*p == ',') {
+            items.emplace_back();
+        } else {
+            items.back() += *p;
+        }
+    }
+    return items;
 }
 
 // Built side by side: build/<preset>/bench/<program> and build/<preset>/src/daemon/bxd.

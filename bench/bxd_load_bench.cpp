@@ -61,7 +61,6 @@ using namespace bexil;
 using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
-constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
 // Round trips each client makes before timing starts (connection set-up, caches, the daemon's first allocations).
 constexpr unsigned kWarmUpRequests = 200;
 // The raw protocol's header: a little-endian u32 with the number of bytes that follow.
@@ -109,26 +108,9 @@ struct Options {
 }
 
 unsigned long parseNumber(const char* text, unsigned long max) {
-    char* end = nullptr;
-    errno = 0;
-    unsigned long value = strtoul(text, &end, 10);
-    if (errno != 0 || end == text || *end != '\0' || value == 0 || value > max) usage();
-    return value;
-}
-
-std::vector<std::string> splitList(const char* text) {
-    std::vector<std::string> items;
-    std::string item;
-    for (const char* p = text;; ++p) {
-        if (*p == ',' || *p == '\0') {
-            items.push_back(item);
-            item.clear();
-            if (*p == '\0') break;
-        } else {
-            item += *p;
-        }
-    }
-    return items;
+    std::optional<unsigned long> value = parsePositive(text, max);
+    if (!value) usage();
+    return *value;
 }
 
 Options parseOptions(int argc, char** argv) {
@@ -358,7 +340,7 @@ void runLibraryClient(const Exchange& exchange, unsigned warmUp, unsigned count,
     setenv("BX_SERVICE_DIR", exchange.serviceDirectory.c_str(), 1);
     // Never destroyed: the process ends with _exit when this returns, and the kernel closes the connection. Closing
     // it through the library would log a line about the cancelled connection into the figures' output.
-    DaemonClient& client = *new DaemonClient(kServiceName);
+    DaemonClient& client = *new DaemonClient(kBxdServiceName);
     char go;
     if (read(startPipe, &go, 1) < 0) die("start pipe");
     const std::vector<Uuid> none;
@@ -555,7 +537,7 @@ int main(int argc, char** argv) {
     library.side = Side::Library;
     if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, readyRequest(options.payload), frames.request))
         die("encoding the request");
-    frames.socketPath = (root / "service" / kServiceName).string();
+    frames.socketPath = (root / "service" / kBxdServiceName).string();
     library.serviceDirectory = (root / "service").string();
     raw.socketPath = (root / "echo.sock").string();
 

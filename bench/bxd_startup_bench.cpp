@@ -51,7 +51,6 @@ using namespace bexil;
 using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
-constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
 // How long one start may take before the run is given up.
 constexpr auto kStartTimeout = std::chrono::seconds(30);
 // How long the daemon idles after its first reply before its memory is read, so that work it does in the
@@ -71,11 +70,9 @@ struct Options {
 }
 
 int parseNumber(const char* text, long max) {
-    char* end = nullptr;
-    errno = 0;
-    long value = strtol(text, &end, 10);
-    if (errno != 0 || end == text || *end != '\0' || value <= 0 || value > max) usage();
-    return static_cast<int>(value);
+    std::optional<unsigned long> value = parsePositive(text, static_cast<unsigned long>(max));
+    if (!value) usage();
+    return static_cast<int>(*value);
 }
 
 Options parseOptions(int argc, char** argv) {
@@ -157,7 +154,7 @@ Start startOnce(const Options& options, const Setting& setting, int number, cons
     fs::path runtime = setting.root / ("runtime-" + std::to_string(number));
     fs::create_directories(service);
     fs::create_directories(runtime);
-    std::string socketPath = (service / kServiceName).string();
+    std::string socketPath = (service / kBxdServiceName).string();
     std::string notifyPath = (setting.root / ("notify-" + std::to_string(number))).string();
 
     int notify = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);

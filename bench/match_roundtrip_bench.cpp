@@ -57,7 +57,6 @@ using namespace bexil;
 using namespace bexil::bench;
 using Clock = std::chrono::steady_clock;
 
-constexpr const char* kServiceName = "com.quorvel.bexil.bxd";
 constexpr int kPlugInsPerApplication = 10;
 constexpr int kPoints = 50;
 constexpr int kOnThePoint = 20;
@@ -86,10 +85,14 @@ struct Options {
 
 Options parseOptions(int argc, char** argv) {
     static const option kLong[] = {
-        {"counts", required_argument, nullptr, 'c'},       {"requests", required_argument, nullptr, 'n'},
-        {"all-requests", required_argument, nullptr, 'a'}, {"all-max", required_argument, nullptr, 'm'},
-        {"cache", required_argument, nullptr, 'C'},        {"bxd", required_argument, nullptr, 'b'},
-        {"wrapper", required_argument, nullptr, 'w'},      {"no-server-side", no_argument, nullptr, 's'},
+        {"counts", required_argument, nullptr, 'c'},
+        {"requests", required_argument, nullptr, 'n'},
+        {"all-requests", required_argument, nullptr, 'a'},
+        {"all-max", required_argument, nullptr, 'm'},
+        {"cache", required_argument, nullptr, 'C'},
+        {"bxd", required_argument, nullptr, 'b'},
+        {"wrapper", required_argument, nullptr, 'w'},
+        {"no-server-side", no_argument, nullptr, 's'},
         {nullptr, 0, nullptr, 0},
     };
     Options options;
@@ -169,9 +172,9 @@ fs::path prepareRegistry(const fs::path& cache, int count) {
         // An application without its information document is a placeholder, whose plug-ins discovery skips.
         if (i % kPlugInsPerApplication == 0) {
             fs::create_directories(app);
-            writeDocument(app / "Info.vrec",
-                          Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.bench.a" +
-                                                                                  std::to_string(i))}}));
+            writeDocument(
+                app / "Info.vrec",
+                Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.bench.a" + std::to_string(i))}}));
         }
         fs::path bundle = app / "PlugIns" / ("P" + std::to_string(i) + ".bxplugin");
         fs::create_directories(bundle / "Resources");
@@ -312,8 +315,8 @@ std::pair<std::vector<double>, size_t> serverSide(BXDatabase& database, const Va
         }
         matched = forms.size();
         out.clear();
-        if (ZemFrame::encode(ZemFrameKind::Reply, 0, 1, Value::dictionary({{"matches", Value::array(std::move(forms))}}),
-                             out))
+        if (ZemFrame::encode(ZemFrameKind::Reply, 0, 1,
+                             Value::dictionary({{"matches", Value::array(std::move(forms))}}), out))
             die("encoding the forms");
         // The first round builds the records; the figures are those of a warm daemon.
         if (round > 0) times.push_back(elapsedUs(start));
@@ -389,7 +392,7 @@ void runSize(const Options& options, int count) {
     }
 
     pid_t bxd = startBxd(options, run);
-    std::string socketPath = (run / "service" / kServiceName).string();
+    std::string socketPath = (run / "service" / kBxdServiceName).string();
     Connection connection;
     for (Clock::time_point deadline = Clock::now() + kStartTimeout; connection.fd < 0;) {
         if (Clock::now() > deadline || waitpid(bxd, nullptr, WNOHANG) != 0) die("bxd did not come up (see bxd.log)");
@@ -411,9 +414,10 @@ void runSize(const Options& options, int count) {
     }
     double pointCpu = (cpuUs(bxd) - cpuBefore) / options.requests;
     Percentiles p = percentiles(times);
-    printf("round trip point match: %zu forms, %zu bytes, p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request "
-           "(load %.2f)\n",
-           pointCount, pointBytes, p.p50Us, p.p99Us, pointCpu, loadAverage());
+    printf(
+        "round trip point match: %zu forms, %zu bytes, p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request "
+        "(load %.2f)\n",
+        pointCount, pointBytes, p.p50Us, p.p99Us, pointCpu, loadAverage());
 
     if (all) {
         Clock::time_point cold = Clock::now();
@@ -431,12 +435,12 @@ void runSize(const Options& options, int count) {
         double allCpu = (cpuUs(bxd) - allCpuBefore) / options.allRequests / static_cast<double>(allCount);
         Percentiles a = percentiles(allTimes);
         double perForm = static_cast<double>(bytes) / static_cast<double>(allCount);
-        printf("round trip match all: %zu forms, %zu bytes (%.0f per form; the %zu-byte frame limit is passed at "
-               "about %.0f forms), first (cold) %.0f us, p50 %.0f us = %.2f us per plug-in, p99 %.0f us, bxd CPU "
-               "%.2f us per plug-in (load %.2f)\n",
-               allCount, bytes, perForm, ZemFrame::kMaxFrameBytes,
-               static_cast<double>(ZemFrame::kMaxFrameBytes) / perForm, coldUs, a.p50Us,
-               a.p50Us / static_cast<double>(allCount), a.p99Us, allCpu, loadAverage());
+        printf(
+            "round trip match all: %zu forms, %zu bytes (%.0f per form; the %zu-byte frame limit is passed at "
+            "about %.0f forms), first (cold) %.0f us, p50 %.0f us = %.2f us per plug-in, p99 %.0f us, bxd CPU "
+            "%.2f us per plug-in (load %.2f)\n",
+            allCount, bytes, perForm, ZemFrame::kMaxFrameBytes, static_cast<double>(ZemFrame::kMaxFrameBytes) / perForm,
+            coldUs, a.p50Us, a.p50Us / static_cast<double>(allCount), a.p99Us, allCpu, loadAverage());
     }
     fflush(stdout);
 
