@@ -21,7 +21,8 @@ Value typicalRequest() {
         {"flags", Value::uint64(0)},
         {"rules", Value::dictionary({
                       {"RZExtensionPointIdentifier", Value::string("com.example.greeting")},
-                      {"RZExtensionAttributes.NSExtensionActivationRule", Value::string("TRUEPREDICATE")},
+                      {"RZExtensionActivationRule",
+                       Value::dictionary({{"attachments", Value::array({Value::string("image/png")})}})},
                       {"BDBundleIdentifier", Value::string("com.example.greeter.*")},
                   })},
         {"uuids", Value::array({Value::uuid(Uuid::random()), Value::uuid(Uuid::random())})},
@@ -46,7 +47,9 @@ Value discoveryReply() {
             {"containingApp", Value::string("/usr/share/apps/App" + std::to_string(i) + ".app")},
             {"annotation", Value::dictionary({{"election", Value::int64(1)}})},
             {"extensions", Value::dictionary({{".", Value::string(std::string(64, 'a' + i % 26))}})},
-            {"attributes", Value::dictionary({{"NSExtensionActivationRule", Value::string("TRUEPREDICATE")}})},
+            {"attributes",
+             Value::dictionary({{"RZExtensionActivationRule", Value::dictionary({{"image/png", Value::int64(4)},
+                                                                                 {"text/plain", Value::int64(1)}})}})},
             {"flags", Value::uint64(static_cast<uint64_t>(i) * 977)},
         }));
     }

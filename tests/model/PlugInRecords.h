@@ -21,8 +21,9 @@ inline Value shareInfo(Entries extraPlugIn = {}) {
         {"RZExtensionPointIdentifier", str("com.quorvel.share-services")},
         {"RZExtensionProtocol", str("ShareProtocol")},
         {"PrincipalClass", str("RZObject")},
-        {"RZExtensionAttributes",
-         dict({{"RZExtensionVersion", str("2.4")}, {"RZExtensionActivationRule", str("TRUEPREDICATE")}})},
+        {"RZExtensionAttributes", dict({{"RZExtensionVersion", str("2.4")},
+                                        {"RZExtensionActivationRule",
+                                         dict({{"image/png", Value::int64(4)}, {"text/plain", Value::int64(1)}})}})},
     };
     for (auto& e : extraPlugIn) plugIn.push_back(std::move(e));
     return dict({
