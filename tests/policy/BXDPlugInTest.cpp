@@ -10,6 +10,7 @@
 #include "platform/log/CaptureSink.h"
 #include "platform/sandbox/SandboxExtensions.h"
 #include "policy/BXDPlugIn.h"
+#include "policy/BXMatchRules.h"
 
 namespace bexil {
 namespace {
@@ -108,6 +109,31 @@ TEST(BXDPlugInConstruction, GenerationFromExplicitKeyOldStyleKeyOrDefault) {
     EXPECT_EQ(build(oldStyle)->hubProtocolVersion(), 1u);
 
     EXPECT_EQ(build(helloFields())->hubProtocolVersion(), 2u);
+}
+
+// A plug-in that states no version in its attributes has one all the same: the version shown to users, else "1".
+// The form carries it and a rule on the version compares against it; a stated version is never replaced.
+TEST(BXDPlugInConstruction, VersionFallsBackToTheShortVersionStringThenOne) {
+    auto versionOf = [](Value info) {
+        auto fields = helloFields();
+        fields.infoVrec = std::move(info);
+        std::shared_ptr<BXDPlugIn> plugIn = build(fields);
+        EXPECT_NE(plugIn, nullptr);
+        Result<MutableDictionary> form = plugIn->exportForm();
+        EXPECT_TRUE(form);
+        EXPECT_EQ(form->value().get("version"), plugIn->version().value_or(Value()));
+        EXPECT_TRUE(BXMatchRules::match(dict({{"RZExtensionVersion", plugIn->version().value_or(str("?"))}}), *plugIn,
+                                        BXMatchContext{}));
+        return plugIn->version();
+    };
+    Value unversioned = plugInDictionary({{"RZExtensionAttributes", dict({{"Language", str("en")}})}});
+    MutableDictionary withShortVersion(helloInfo(unversioned));
+    withShortVersion.set("BDBundleShortVersionString", str("2.10"));
+
+    EXPECT_EQ(versionOf(helloInfo()), str("1.2"));
+    EXPECT_EQ(versionOf(withShortVersion.take()), str("2.10"));
+    EXPECT_EQ(versionOf(helloInfo(unversioned)), str("1"));
+    EXPECT_EQ(versionOf(helloInfo(plugInDictionary({{"RZExtensionAttributes", str("not a dictionary")}}))), str("1"));
 }
 
 // A registry record without a bundle URL or an identifier yields no record (and no crash); a missing identifier is

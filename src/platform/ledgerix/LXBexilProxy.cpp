@@ -38,6 +38,8 @@ std::optional<Value> LXBexilProxy::bexilDictionary() const {
 
 namespace {
 constexpr std::string_view kExtensionPointAttribute = "RZExtensionPointIdentifier";
+constexpr std::string_view kVersionAttribute = "RZExtensionVersion";
+constexpr std::string_view kShortVersionInfoKey = "BDBundleShortVersionString";
 }  // namespace
 
 std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std::string_view key,
@@ -66,6 +68,15 @@ std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std:
     if (found == nullptr && scope == LXInfoScope::Attributes && key == kExtensionPointAttribute &&
         (plugIn = bexilDictionary()))
         found = plugIn->find(key);
+    // Every plug-in has a version: one that states none in its attributes takes the version shown to users, else
+    // "1", as a plug-in put into canonical shape would. Discovery prefers and rules compare by this value.
+    std::optional<Value> fallbackVersion;
+    if (found == nullptr && scope == LXInfoScope::Attributes && key == kVersionAttribute) {
+        const std::optional<Value>& info = infoVrec();
+        const Value* shortVersion = info ? info->find(kShortVersionInfoKey) : nullptr;
+        fallbackVersion = shortVersion ? *shortVersion : Value::string("1");
+        found = &*fallbackVersion;
+    }
     if (found == nullptr || (ofClass && found->kind() != *ofClass)) return std::nullopt;
     return *found;
 }
