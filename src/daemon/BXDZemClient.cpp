@@ -89,10 +89,16 @@ void BXDZemClient::handleEvent(const ZemConnection::Event& event) {
 void BXDZemClient::dying() { log::ops().debug("client %d termination imminent", static_cast<int>(pid())); }
 
 void BXDZemClient::dead() {
+    if (deathNoted_.exchange(true)) return;
     server_->unholdClient(this);
     log::ops().debug("client %d is dead", static_cast<int>(pid()));
     acceptWork_.store(false, std::memory_order_release);
     trace::clientDone(static_cast<int>(pid()));
+}
+
+bool BXDZemClient::peerHasHungUp() const {
+    std::shared_ptr<ZemConnection> connection = connection_.lock();
+    return !connection || connection->peerHasHungUp();
 }
 
 pid_t BXDZemClient::pid() const {

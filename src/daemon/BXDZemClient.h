@@ -33,8 +33,11 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
 
     // The peer is about to exit (the daemon is being stopped); only logged.
     void dying();
-    // The connection is gone: releases the client's holds and stops accepting work.
+    // The connection is gone: releases the client's holds and stops accepting work. Runs its course once, whether
+    // the connection reported the end or a request found the peer gone first.
     void dead();
+    // True once the peer has closed its connection, even before the connection's own queue has seen the end.
+    bool peerHasHungUp() const;
 
     // The entitlement's value in the peer's signature, or a null Value.
     Value entitlementValueForKey(std::string_view key) const override;
@@ -64,6 +67,7 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     std::string path_;
     std::shared_ptr<BXBundle> bundle_;
     std::atomic<bool> acceptWork_{true};
+    std::atomic<bool> deathNoted_{false};
     std::shared_ptr<const CodeSigningIdentity> _task;
     unsigned requestCount_ = 0;  // request queue only
 };

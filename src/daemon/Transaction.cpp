@@ -68,6 +68,9 @@ void Transaction::dispatch() {
                              static_cast<int>(kCurrentProtocolVersion)));
         return;
     }
+    // A client that hung up while its requests waited behind other clients' gets none of them run: its connection
+    // would see the end only when its own turn comes, after them, so the death is taken note of here first.
+    if (client_->acceptWork() && client_->peerHasHungUp()) client_->dead();
     if (!client_->acceptWork()) return;
 
     const int pid = client_->pid();

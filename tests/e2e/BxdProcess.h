@@ -69,6 +69,10 @@ class BxdProcess {
         return status;
     }
     bool running() const { return pid_ > 0 && waitpid(pid_, nullptr, WNOHANG) == 0; }
+    // Sends `signal` without waiting (SIGSTOP and SIGCONT hold and release the daemon).
+    void signal(int signal) const {
+        if (pid_ > 0) kill(pid_, signal);
+    }
 
     // Everything bxd wrote to standard error so far.
     std::string log() const {

@@ -188,6 +188,31 @@ TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
         expectFailure(request(name), 4, std::string("the \"") + name + "\" operation is not available yet");
 }
 
+// Guards a client that hangs up while its requests wait behind another client's: none of them runs. bxd is held
+// (SIGSTOP) while one client asks for a discovery and another sends two registrations and hangs up, so that all
+// three are waiting together when bxd goes on; the discovery is answered and nothing is registered.
+TEST_F(BxdEnvelope, RequestsOfAClientThatHungUpWhileTheyWaitedDoNotRun) {
+    copyExamples({"Greeter.app"});
+    const std::string hello = plugIn("Greeter.app/PlugIns/Hello.bxplugin");
+    TestClient other, vanishing;
+    ASSERT_EQ(errorText(other.replyTo(kBogus)), "unrecognized request");
+    ASSERT_EQ(errorText(vanishing.replyTo(kBogus)), "unrecognized request");
+
+    bxd_.signal(SIGSTOP);
+    auto discovery = std::async(std::launch::async, [&] { return other.roundTrip(matchRequest()); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    vanishing.sendAndHangUp({pathsRequest("add", {hello}), pathsRequest("add", {hello})});
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    bxd_.signal(SIGCONT);
+
+    TestClient::Reply answered = discovery.get();
+    ASSERT_TRUE(std::holds_alternative<Value>(answered));
+    EXPECT_EQ(errorCode(std::get<Value>(answered)), 0);
+    expectLog("client " + std::to_string(getpid()) + " is dead");
+    EXPECT_EQ(identifiers(succeed(matchRequest())), Ids{});
+    EXPECT_FALSE(registeredUuid(hello)) << bxd_.log();
+}
+
 // Guards the per-client request counter: the line comes at the 1000th request, not before.
 TEST_F(BxdEnvelope, EveryThousandthRequestOfAClientIsCounted) {
     TestClient client;

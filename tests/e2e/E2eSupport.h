@@ -58,6 +58,12 @@ class TestClient {
         return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
     }
 
+    // Sends `messages` as requests whose replies nobody waits for, then closes the connection.
+    void sendAndHangUp(const std::vector<Value>& messages) {
+        for (const Value& message : messages) connection_->sendWithReply(message, queue_, [](const Reply&) {});
+        connection_->cancel();
+    }
+
   private:
     EventLoop loop_;
     SerialQueue queue_;

@@ -61,6 +61,9 @@ class ZemConnection {
     virtual pid_t peerPid() const = 0;
     virtual uid_t peerUid() const = 0;
     virtual gid_t peerGid() const = 0;
+    // True once the peer has closed its end or the connection is closed, even while frames it sent before that are
+    // still waiting to be handled: the daemon runs no request of a peer that is gone. Safe from any thread.
+    virtual bool peerHasHungUp() const = 0;
     // The identity of the peer taken at accept (peer connections only; null on client connections).
     virtual std::shared_ptr<const CodeSigningIdentity> peerIdentity() const = 0;
 

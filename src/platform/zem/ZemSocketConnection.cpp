@@ -1,5 +1,6 @@
 #include "platform/zem/ZemSocketConnection.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <cerrno>
@@ -40,7 +41,8 @@ ZemSocketConnection::ZemSocketConnection(Socket socket, SerialQueue queue, std::
       pid_(pid),
       uid_(uid),
       gid_(gid),
-      state_(State::Open) {}
+      state_(State::Open),
+      probeFd_(socket_.native_handle()) {}
 
 ZemSocketConnection::ZemSocketConnection(SerialQueue queue, std::string serviceName)
     : side_(Side::Client), queue_(queue), socket_(ioContextOf(queue)), serviceName_(std::move(serviceName)) {}
@@ -133,6 +135,8 @@ bool ZemSocketConnection::connectClient() {
         gid_ = cred.gid;
     }
     state_ = State::Open;
+    std::lock_guard lock(probeMutex_);
+    probeFd_ = socket_.native_handle();
     return true;
 }
 
@@ -283,10 +287,25 @@ void ZemSocketConnection::answerWithError(PendingReply& pending, ZemError::Kind 
         [handler = std::move(pending.handler), kind] { handler(std::variant<Value, ZemError>(ZemError(kind))); });
 }
 
+bool ZemSocketConnection::peerHasHungUp() const {
+    std::lock_guard lock(probeMutex_);
+    if (probeClosed_) return true;
+    if (probeFd_ < 0) return false;  // a client connection not connected yet
+    // A peer that closed its socket shuts down both directions of ours (POLLHUP); one that only stopped writing
+    // (POLLRDHUP alone) may still be waiting for its replies.
+    pollfd probe{.fd = probeFd_, .events = 0, .revents = 0};
+    return ::poll(&probe, 1, 0) == 1 && (probe.revents & (POLLHUP | POLLERR)) != 0;
+}
+
 void ZemSocketConnection::close(ZemError::Kind kind) {
     if (state_ == State::Closed) return;
     bool interrupted = side_ == Side::Client && kind == ZemError::Kind::ConnectionInterrupted;
     state_ = interrupted ? State::Interrupted : State::Closed;
+    {
+        std::lock_guard lock(probeMutex_);
+        probeFd_ = -1;
+        probeClosed_ = true;
+    }
     asio::error_code ignored;
     socket_.close(ignored);
     reader_ = ZemFrameReader();

@@ -9,6 +9,7 @@
 #include <atomic>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -55,6 +56,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     pid_t peerPid() const override { return pid_.load(); }
     uid_t peerUid() const override { return uid_.load(); }
     gid_t peerGid() const override { return gid_.load(); }
+    bool peerHasHungUp() const override;
     std::shared_ptr<const CodeSigningIdentity> peerIdentity() const override { return identity_; }
     const std::string& serviceName() const override { return serviceName_; }
     std::string description() const override;
@@ -109,6 +111,13 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     uint64_t nextSerial_ = 1;
     std::map<uint64_t, PendingReply> pendingReplies_;
     std::vector<ZemFrame> heldFrames_;  // frames read while suspended
+
+    // The socket's descriptor for peerHasHungUp, which runs on other queues: -1 until the socket is open and again
+    // from the moment close() starts (then `probeClosed_`), so a probe never touches a descriptor number that has
+    // been closed and perhaps reused.
+    mutable std::mutex probeMutex_;
+    int probeFd_ = -1;
+    bool probeClosed_ = false;
 };
 
 }  // namespace bexil
