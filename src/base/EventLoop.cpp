@@ -1,9 +1,8 @@
 #include "base/EventLoop.h"
 
-#include <cstdlib>
-
 #include <atomic>
 #include <cstdio>
+#include <cstdlib>
 #include <mutex>
 #include <string>
 

@@ -18,7 +18,7 @@ struct QueueInternals;
 }  // namespace detail
 
 class EventLoop {
-public:
+  public:
     // One thread does socket I/O, decoding, the request queue and encoding, so a request never crosses threads
     // between its bytes arriving and its reply leaving: on small machines a cross-CPU wake-up costs more than a
     // whole request.
@@ -65,7 +65,7 @@ public:
     // runOnCurrentThread.
     unsigned runningThreadCount() const;
 
-private:
+  private:
     friend struct detail::QueueInternals;
 
     std::shared_ptr<detail::EventLoopCore> core_;

@@ -37,7 +37,7 @@ namespace bexil::detail {
 
 // The io_context of one EventLoop plus what the queues need to know about the threads running it.
 class EventLoopCore : public asio::io_context {
-public:
+  public:
     EventLoopCore() : keepAlive_(std::in_place, get_executor()) {}
 
     // Destroys every pending handler while leaving the services alive, so strands and timers still held by queues
@@ -57,7 +57,7 @@ public:
     // Number of threads running the loop or about to (own threads and callers of runOnCurrentThread).
     std::atomic<unsigned> runners{0};
 
-private:
+  private:
     std::mutex keepAliveMutex_;
     std::optional<asio::executor_work_guard<asio::io_context::executor_type>> keepAlive_;
     std::atomic<bool> closed_{false};
@@ -94,14 +94,14 @@ const QueueFrame* currentQueueFrame();
 
 // Marks the calling thread as running a block of `state` for the scope's lifetime; scopes nest.
 class CurrentQueueScope {
-public:
+  public:
     explicit CurrentQueueScope(const SerialQueueState* state) : CurrentQueueScope(state, currentQueueFrame()) {}
     CurrentQueueScope(const SerialQueueState* state, const QueueFrame* outer);
     ~CurrentQueueScope();
     CurrentQueueScope(const CurrentQueueScope&) = delete;
     CurrentQueueScope& operator=(const CurrentQueueScope&) = delete;
 
-private:
+  private:
     QueueFrame frame_;
     const QueueFrame* previous_;
 };

@@ -22,7 +22,7 @@ struct SerialQueueState;
 }  // namespace detail
 
 class SerialQueue {
-public:
+  public:
     // A new queue on `loop`; the label names it in log lines and in consistency failures.
     explicit SerialQueue(std::string label, EventLoop& loop = EventLoop::shared());
     // A new queue on the same loop as `sibling` (the IPC layer gives each accepted connection one).
@@ -71,7 +71,7 @@ public:
     // Two handles are equal when they refer to the same queue.
     bool operator==(const SerialQueue& other) const { return state_ == other.state_; }
 
-private:
+  private:
     friend struct detail::QueueInternals;
 
     void syncBlock(const std::function<void()>& block) const;

@@ -16,7 +16,7 @@
 namespace bexil {
 
 class SyncQueue {
-public:
+  public:
     explicit SyncQueue(std::string label) : label_(std::move(label)) {}
 
     SyncQueue(const SyncQueue&) = delete;
@@ -38,7 +38,7 @@ public:
         return std::invoke(block);
     }
 
-private:
+  private:
     struct Leave {
         SyncQueue& queue;
         ~Leave() { queue.leave(); }

@@ -1,4 +1,5 @@
 #include "database/BXDAnnotationStore.h"
+
 #include "base/StandardPaths.h"
 
 // The store trusts nothing it reads: a document that cannot be used is logged, left on disk for inspection and
@@ -65,8 +66,9 @@ std::optional<Error> BXDAnnotationStore::loadDb(const std::filesystem::path& url
     Result<Value> root = Document::readFile(url);
     if (!root.ok()) return fail(root.error());
     if (!root->isDictionary())
-        return fail(Error(std::string(BXDocumentErrorDomain), kDocumentMalformed,
-                          url.string() + ": the root is of type " + valueKindName(root->kind()) + ", not a dictionary"));
+        return fail(
+            Error(std::string(BXDocumentErrorDomain), kDocumentMalformed,
+                  url.string() + ": the root is of type " + valueKindName(root->kind()) + ", not a dictionary"));
 
     // A version that is not a number counts as absent, and absent counts as 0.
     int64_t version = root->get(kVersionKey).numberAsInt64().value_or(0);

@@ -147,8 +147,7 @@ void Transaction::matchPlugIns() {
 
             if (!all) {
                 if (std::optional<std::string> reason = plugIn->allowForClient(*client(), context)) {
-                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(),
-                                     *reason);
+                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(), *reason);
                     continue;
                 }
             }

@@ -19,7 +19,7 @@
 namespace bexil {
 
 class BXBundle {
-public:
+  public:
     // The constructors never fail on a path that does not name a bundle: the bundle they return answers nothing.
     // Only initWithZEMBundle given no platform bundle returns an empty pointer.
 
@@ -66,7 +66,7 @@ public:
     // Use the init... factories; the constructor is public only for make_shared.
     explicit BXBundle(std::shared_ptr<const PlatformBundle> bundle);
 
-private:
+  private:
     using CachedPath = std::optional<std::string>;
 
     const std::shared_ptr<const PlatformBundle> bundle_;

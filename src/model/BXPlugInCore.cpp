@@ -5,7 +5,6 @@
 
 #include "model/BXPlugInCore.h"
 
-
 #include "model/BXUtilities.h"
 #include "platform/log/Log.h"
 

@@ -446,7 +446,7 @@ TEST_F(LedgerixQueryTest, PlainEqualityRulesPreselectWhatTheFilterSees) {
                          [](std::string_view id) { return id != "com.example.q1"; });
     EXPECT_EQ(seen.size(), 10u);
     for (const std::string& id : seen) EXPECT_EQ(std::stoi(id.substr(13)) % 3, 1) << id;
-    EXPECT_EQ(result->size(), 9u);  // the filter's refusal counts
+    EXPECT_EQ(result->size(), 9u);    // the filter's refusal counts
     EXPECT_EQ(withEntitlements_, 2);  // q10 and q25 serve point b and carry entitlements
     EXPECT_EQ(filtered(Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.v1")}})).size(), 10u);
     // A list is alternatives; with a point rule beside it, both narrow together.

@@ -193,8 +193,8 @@ TEST(ZemCodec, NestingCountsAndLengthsBeyondTheInputFailBeforeAllocating) {
     deep.push_back(0x00);
     expectError(deep, ZemErrorCode::TooDeep);
 
-    expectError(hex("0a 80 80 80 80 10 00"), ZemErrorCode::CountExceedsInput);  // 2^32 items in 7 bytes
-    expectError(hex("0b 03 00 00 00 00 00"), ZemErrorCode::CountExceedsInput);  // 3 entries need 6 bytes
+    expectError(hex("0a 80 80 80 80 10 00"), ZemErrorCode::CountExceedsInput);      // 2^32 items in 7 bytes
+    expectError(hex("0b 03 00 00 00 00 00"), ZemErrorCode::CountExceedsInput);      // 3 entries need 6 bytes
     expectError(hex("06 80 80 80 80 80 80 80 80 80 01"), ZemErrorCode::Truncated);  // 2^63 bytes of string
     // A chain of arrays each claiming nearly as many items as bytes remain: every count passes its check, so
     // reserving by the claim would take 200 x 16 MB before the input runs out.

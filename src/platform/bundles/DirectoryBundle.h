@@ -30,7 +30,7 @@ enum class BundleLookup : int {
 };
 
 class DirectoryBundle final : public PlatformBundle {
-public:
+  public:
     static constexpr std::string_view kInfoFileName = "Info.vrec";
     static constexpr std::string_view kExecutableKey = "BDBundleExecutable";
     // Information documents are small; a larger file at the root of some directory is refused instead of read,
@@ -58,7 +58,7 @@ public:
     };
     explicit DirectoryBundle(Parts parts);
 
-private:
+  private:
     std::string requestedPath_;
     std::optional<std::string> root_;
     std::optional<Value> info_;

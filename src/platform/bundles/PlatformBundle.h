@@ -23,7 +23,7 @@ enum class BundleStringProperty : int {
 };
 
 class PlatformBundle {
-public:
+  public:
     virtual ~PlatformBundle() = default;
 
     // The property as an absolute path, or none when the bundle has no such property (or is no bundle at all).

@@ -1,5 +1,4 @@
 #include "platform/ksn/ConsentStore.h"
-#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -12,6 +11,7 @@
 #include <system_error>
 
 #include "base/Document.h"
+#include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
 namespace bexil {

@@ -11,7 +11,6 @@
 // application comes from the same row (a join), and its plug-in list is read only when someone asks for it.
 
 #include "platform/ledgerix/LedgerixWorkspace.h"
-#include "base/StandardPaths.h"
 
 #include <pwd.h>
 #include <sqlite3.h>
@@ -29,6 +28,7 @@
 #include <utility>
 
 #include "base/Document.h"
+#include "base/StandardPaths.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXApplicationWorkspaceObserverProtocol.h"

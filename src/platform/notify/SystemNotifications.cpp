@@ -1,5 +1,4 @@
 #include "platform/notify/SystemNotifications.h"
-#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -16,6 +15,7 @@
 #include <cstring>
 #include <vector>
 
+#include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -58,9 +58,7 @@ class FdCloser {
 
 }  // namespace
 
-fs::path SystemNotifications::defaultDirectory() {
-    return runtimeDirectory() / "notify";
-}
+fs::path SystemNotifications::defaultDirectory() { return runtimeDirectory() / "notify"; }
 
 SystemNotifications::SystemNotifications(fs::path directory) : directory_(std::move(directory)) {}
 

@@ -1,5 +1,4 @@
 #include "platform/sandbox/SandboxExtensions.h"
-#include "base/StandardPaths.h"
 
 #include <fcntl.h>
 #include <openssl/core_names.h>
@@ -13,6 +12,8 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+
+#include "base/StandardPaths.h"
 
 namespace bexil {
 
@@ -96,9 +97,7 @@ std::optional<std::string> canonicalPath(const std::string& path) {
 
 }  // namespace
 
-fs::path SandboxExtensions::defaultKeyPath() {
-    return runtimeDirectory() / "sandbox" / "extension-key";
-}
+fs::path SandboxExtensions::defaultKeyPath() { return runtimeDirectory() / "sandbox" / "extension-key"; }
 
 SandboxExtensions& SandboxExtensions::shared() {
     static SandboxExtensions instance(defaultKeyPath());
