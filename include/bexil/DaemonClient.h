@@ -18,6 +18,7 @@
 
 #include "base/Error.h"
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 
 namespace bexil {
 
@@ -37,15 +38,15 @@ class DaemonClient {
     };
     using Callback = std::function<void(const Reply&)>;
 
-    // Discovery flags of match().
-    static constexpr uint64_t kDiscoverAllVersions = 0x1;
-    static constexpr uint64_t kDiscoverAllInstances = 0x4;
-    static constexpr uint64_t kDiscoverSystemOnly = 0x8;
-    static constexpr uint64_t kDiscoverAll = 0x200;
+    // Discovery flags of match() (bexil/Protocol.h says what each does).
+    static constexpr uint64_t kDiscoverAllVersions = protocol::discover::kAllVersions;
+    static constexpr uint64_t kDiscoverAllInstances = protocol::discover::kAllInstances;
+    static constexpr uint64_t kDiscoverSystemOnly = protocol::discover::kSystemOnly;
+    static constexpr uint64_t kDiscoverAll = protocol::discover::kAll;
     // Hold flags of hold().
-    static constexpr uint64_t kHoldPlugInPaths = 0x1;
-    static constexpr uint64_t kHoldRefuseBusy = 0x2;
-    static constexpr uint64_t kHoldTerminate = 0x4;
+    static constexpr uint64_t kHoldPlugInPaths = protocol::hold::kPlugInPaths;
+    static constexpr uint64_t kHoldRefuseBusy = protocol::hold::kRefuseBusy;
+    static constexpr uint64_t kHoldTerminate = protocol::hold::kTerminate;
 
     // Connects to `serviceName`, or to the daemon's default service when it is empty.
     explicit DaemonClient(const std::string& serviceName = {});

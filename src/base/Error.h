@@ -13,6 +13,7 @@
 #include <variant>
 
 #include "base/Format.h"
+#include "bexil/Protocol.h"
 
 namespace bexil {
 
@@ -41,16 +42,22 @@ class Error {
     std::optional<std::string> message_;
 };
 
+using protocol::ErrorCode;
+
 // An error in the Bexil domain; with a message it carries it as its localized description, without one it has none.
+// The code is one of ErrorCode; the plain number is for codes that arrive from elsewhere (a reply's "errorcode").
 Error BXError(int code, std::optional<std::string_view> message);
+inline Error BXError(ErrorCode code, std::optional<std::string_view> message) {
+    return BXError(protocol::codeOf(code), message);
+}
 
 // The same, the message built from a printf-style format (see Format.h); a null format gives no message.
 template <typename... Args>
-Error BXErrorWithFormat(int code, FormatString<std::type_identity_t<Args>...> format, Args&&... args) {
+Error BXErrorWithFormat(ErrorCode code, FormatString<std::type_identity_t<Args>...> format, Args&&... args) {
     if (format.text() == nullptr) return BXError(code, std::nullopt);
     return BXError(code, formatPrintf(format, std::forward<Args>(args)...));
 }
-inline Error BXErrorWithFormat(int code, std::nullptr_t) { return BXError(code, std::nullopt); }
+inline Error BXErrorWithFormat(ErrorCode code, std::nullptr_t) { return BXError(code, std::nullopt); }
 
 // A value or the error that prevented it. Expected failures travel this way, never as exceptions.
 template <typename T>

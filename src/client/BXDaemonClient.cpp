@@ -2,11 +2,15 @@
 
 #include <utility>
 
+#include "model/MessageForm.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
 
 namespace {
+
+namespace key = protocol::key;
+using protocol::Request;
 
 constexpr std::string_view kUnknownErrorMessage = "unknown error returned by Bexil subsystem";
 
@@ -36,17 +40,17 @@ std::shared_ptr<BXDaemonClient> BXDaemonClient::initWithServiceName(const char* 
     return std::make_shared<BXDaemonClient>(serviceName);
 }
 
-MutableDictionary BXDaemonClient::request(const char* name) const {
+MutableDictionary BXDaemonClient::request(protocol::Request name) const {
     MutableDictionary request;
-    request.set("request", Value::string(name));
+    request.set(key::kRequest, Value::string(protocol::nameOf(name)));
     // The version travels unsigned; a negative setting goes out as its two's complement, which bxd refuses.
-    request.set("version", Value::uint64(static_cast<uint64_t>(protocolVersion())));
+    request.set(key::kVersion, Value::uint64(static_cast<uint64_t>(protocolVersion())));
     return request;
 }
 
-MutableDictionary BXDaemonClient::requestPaths(const char* name, const Value& paths) const {
+MutableDictionary BXDaemonClient::requestPaths(protocol::Request name, const Value& paths) const {
     MutableDictionary message = request(name);
-    message.set("paths", paths);
+    message.set(key::kPaths, paths);
     return message;
 }
 
@@ -54,7 +58,7 @@ void BXDaemonClient::setUuids(MutableDictionary& request, const std::vector<Uuid
     MutableArray array;
     array.reserve(uuids.size());
     for (const Uuid& uuid : uuids) array.append(Value::uuid(uuid));
-    request.set("uuids", array.take());
+    request.set(key::kUuids, array.take());
 }
 
 void BXDaemonClient::sendReply(const Value& request, ReplyHandler reply) {
@@ -70,72 +74,73 @@ void BXDaemonClient::sendReply(const Value& request, ReplyHandler reply) {
 }
 
 void BXDaemonClient::addPlugInsReply(const Value& paths, ReplyHandler reply) {
-    sendReply(requestPaths("add", paths).take(), std::move(reply));
+    sendReply(requestPaths(Request::Add, paths).take(), std::move(reply));
 }
 
 void BXDaemonClient::removePlugInsReply(const Value& paths, ReplyHandler reply) {
-    sendReply(requestPaths("remove", paths).take(), std::move(reply));
+    sendReply(requestPaths(Request::Remove, paths).take(), std::move(reply));
 }
 
 void BXDaemonClient::bulkPluginsReply(uint64_t flags, ReplyHandler reply) {
-    MutableDictionary message = request("bulk");
-    message.set("flags", Value::uint64(flags));
+    MutableDictionary message = request(Request::Bulk);
+    message.set(key::kFlags, Value::uint64(flags));
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::readyPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply) {
-    MutableDictionary message = request("ready");
-    message.set("flags", Value::uint64(flags));
+    MutableDictionary message = request(Request::Ready);
+    message.set(key::kFlags, Value::uint64(flags));
     setUuids(message, uuids);
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::accessPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply) {
-    MutableDictionary message = request("access");
-    message.set("flags", Value::uint64(flags));
+    MutableDictionary message = request(Request::Access);
+    message.set(key::kFlags, Value::uint64(flags));
     setUuids(message, uuids);
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::matchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply) {
-    MutableDictionary message = request("match");
-    message.set("rules", rules);
-    message.set("flags", Value::uint64(flags));
+    MutableDictionary message = request(Request::Match);
+    message.set(key::kRules, rules);
+    message.set(key::kFlags, Value::uint64(flags));
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,
                                                           ReplyHandler reply) {
-    MutableDictionary message = request("annotate");
+    MutableDictionary message = request(Request::Annotate);
     setUuids(message, uuids);
-    message.set("annotations", annotations);
+    message.set(key::kAnnotations, annotations);
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply) {
-    MutableDictionary message = request("bulk-annotate");
-    message.set("annotations", annotations);
+    MutableDictionary message = request(Request::BulkAnnotate);
+    message.set(key::kAnnotations, annotations);
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::holdPluginsFlagsReply(const Value& paths, uint64_t flags, ReplyHandler reply) {
-    MutableDictionary message = requestPaths("lock", paths);
-    message.set("flags", Value::uint64(flags));
+    MutableDictionary message = requestPaths(Request::Lock, paths);
+    message.set(key::kFlags, Value::uint64(flags));
     sendReply(message.take(), std::move(reply));
 }
 
 void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
-    MutableDictionary message = request("lock");
+    MutableDictionary message = request(Request::Lock);
     setUuids(message, {hold});
     sendReply(message.take(), std::move(reply));
 }
 
 std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {
-    if (const auto* error = std::get_if<ZemError>(&reply)) return BXError(4, error->description());
+    if (const auto* error = std::get_if<ZemError>(&reply))
+        return BXError(ErrorCode::OperationFailed, error->description());
     const Value& dictionary = std::get<Value>(reply);
     // Only the low 32 bits of the code are looked at: the daemon widens a signed 32-bit code with its sign.
     int32_t code = 0;
-    if (const Value* entry = dictionary.find("errorcode")) {
+    if (const Value* entry = dictionary.find(key::kErrorCode)) {
         if (auto u = entry->numberAsUInt64()) {
             code = static_cast<int32_t>(static_cast<uint32_t>(*u));
         } else if (auto i = entry->numberAsInt64()) {
@@ -143,25 +148,20 @@ std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {
         }
     }
     const std::string* message = nullptr;
-    if (const Value* entry = dictionary.find("error")) message = entry->getString();
+    if (const Value* entry = dictionary.find(key::kError)) message = entry->getString();
     if (code == 0 && message == nullptr) return std::nullopt;
     if (code == 0) throw InternalInconsistency(formatPrintf("bxd reported error without a code: %s", *message));
     if (message == nullptr) return BXError(code, kUnknownErrorMessage);
     return BXError(code, *message);
 }
 
-// The message form: our Zem carries every kind a property-list value can have (null, booleans, both integer
-// kinds, reals, strings, data, dates, UUIDs, arrays, dictionaries) and keeps them apart on the wire, so the
-// message form of a value is the value itself. Only the version gate is left, so that a daemon and a client that
-// speak another protocol version never mistake a result for one they could read.
+// The message form is shared with the daemon (model/MessageForm.h).
 std::optional<Value> BXDaemonClient::convertToZEMVersion(const Value& value, int64_t version) {
-    if (version != kProtocolVersion) return std::nullopt;
-    return value;
+    return toMessageForm(value, static_cast<uint64_t>(version));
 }
 
 std::optional<Value> BXDaemonClient::convertFromZEM(const Value& value) const {
-    if (protocolVersion() != kProtocolVersion) return std::nullopt;
-    return value;
+    return fromMessageForm(value, static_cast<uint64_t>(protocolVersion()));
 }
 
 }  // namespace bexil

@@ -21,6 +21,7 @@
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemError.h"
 
@@ -28,10 +29,10 @@ namespace bexil {
 
 class BXDaemonClient {
   public:
-    static constexpr const char* kDefaultServiceName = "com.quorvel.bexil.bxd";
+    static constexpr const char* kDefaultServiceName = protocol::kServiceName.data();
     static constexpr const char* kReplyQueueLabel = "bxd_client";
     // The version written into every request after creation; the only one whose discovery result is encoded.
-    static constexpr int64_t kProtocolVersion = 3;
+    static constexpr int64_t kProtocolVersion = protocol::kCurrentVersion;
 
     // The reply dictionary, or the connection-level error delivered in its place.
     using Reply = std::variant<Value, ZemError>;
@@ -65,8 +66,8 @@ class BXDaemonClient {
     void releaseHoldReply(const Uuid& hold, ReplyHandler reply);
 
     // Building blocks of the request methods.
-    MutableDictionary request(const char* name) const;
-    MutableDictionary requestPaths(const char* name, const Value& paths) const;
+    MutableDictionary request(protocol::Request name) const;
+    MutableDictionary requestPaths(protocol::Request name, const Value& paths) const;
     static void setUuids(MutableDictionary& request, const std::vector<Uuid>& uuids);
     void sendReply(const Value& request, ReplyHandler reply);
 

@@ -7,17 +7,17 @@ namespace bexil {
 Result<std::vector<std::shared_ptr<BXPlugInCore>>> plugInsFromMatchReply(const BXDaemonClient& client,
                                                                          const BXDaemonClient::Reply& reply) {
     if (auto error = BXDaemonClient::errorInReply(reply)) return *error;
-    const Value* encoded = std::get<Value>(reply).find("matches");
+    const Value* encoded = std::get<Value>(reply).find(protocol::key::kMatches);
     // A daemon answering another protocol version leaves "matches" out rather than send what we cannot read.
     if (encoded == nullptr && client.protocolVersion() != BXDaemonClient::kProtocolVersion)
-        return BXErrorWithFormat(7, "no discovery result for protocol version %lld",
+        return BXErrorWithFormat(ErrorCode::VersionMismatch, "no discovery result for protocol version %lld",
                                  static_cast<long long>(client.protocolVersion()));
-    if (encoded == nullptr) return BXError(4, "discovery reply without matches");
+    if (encoded == nullptr) return BXError(ErrorCode::OperationFailed, "discovery reply without matches");
     std::optional<Value> matches = client.convertFromZEM(*encoded);
     if (!matches)
-        return BXErrorWithFormat(7, "no discovery result for protocol version %lld",
+        return BXErrorWithFormat(ErrorCode::VersionMismatch, "no discovery result for protocol version %lld",
                                  static_cast<long long>(client.protocolVersion()));
-    if (!matches->isArray()) return BXError(4, "discovery reply with malformed matches");
+    if (!matches->isArray()) return BXError(ErrorCode::OperationFailed, "discovery reply with malformed matches");
 
     std::vector<std::shared_ptr<BXPlugInCore>> plugIns;
     plugIns.reserve(matches->count());

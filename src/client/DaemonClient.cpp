@@ -45,7 +45,7 @@ DaemonClient::Reply makeReply(const BXDaemonClient::Reply& raw) {
     } catch (const InternalInconsistency& inconsistency) {
         // A reply with a message but no code breaks the protocol; an application callback is no place to throw.
         log::ops().fault("%s", inconsistency.what());
-        reply.error = BXError(4, inconsistency.what());
+        reply.error = BXError(ErrorCode::OperationFailed, inconsistency.what());
     }
     return reply;
 }
@@ -103,13 +103,13 @@ DaemonClient::Reply DaemonClient::wait(const std::function<void(Callback)>& star
     log::ops().error("no reply from bxd within %lld ms", static_cast<long long>(timeout.count()));
     Reply reply;
     reply.connectionFailed = true;
-    reply.error = BXError(4, "no reply from bxd within the time limit");
+    reply.error = BXError(ErrorCode::OperationFailed, "no reply from bxd within the time limit");
     return reply;
 }
 
 std::optional<Value> DaemonClient::matches(const Reply& reply) const {
     if (!reply.ok()) return std::nullopt;
-    const Value* encoded = reply.message.find("matches");
+    const Value* encoded = reply.message.find(protocol::key::kMatches);
     if (encoded == nullptr) return std::nullopt;
     std::optional<Value> decoded = impl_->client.convertFromZEM(*encoded);
     if (!decoded || !decoded->isArray()) return std::nullopt;

@@ -12,6 +12,7 @@
 
 #include "base/SerialQueue.h"
 #include "base/SyncQueue.h"
+#include "bexil/Protocol.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
@@ -28,7 +29,7 @@ class ZemListener;
 
 class BXDServer : public BXDatabase, public BXDatabaseDelegate {
   public:
-    static constexpr const char* kDefaultServiceName = "com.quorvel.bexil.bxd";
+    static constexpr const char* kDefaultServiceName = protocol::kServiceName.data();
 
     // initForService:database: builds the server on `loop`; none when the database or the listener cannot be
     // built (the listener failure is logged with its reason).

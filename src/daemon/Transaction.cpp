@@ -28,23 +28,33 @@ std::optional<Value> zem_dictionary_get_dictionary(const Value& dictionary, std:
 
 namespace {
 
+using protocol::Request;
+
 struct HandlerEntry {
-    std::string_view name;
+    Request request;
     void (Transaction::*handler)();
 };
 
-// Looked up in this order, byte for byte; the first match wins.
-constexpr std::array<HandlerEntry, 9> kHandlers{{
-    {"add", &Transaction::addPlugIns},
-    {"remove", &Transaction::removePlugIns},
-    {"bulk", &Transaction::bulkPlugIns},
-    {"match", &Transaction::matchPlugIns},
-    {"ready", &Transaction::readyPlugIns},
-    {"access", &Transaction::accessPlugIns},
-    {"annotate", &Transaction::annotatePlugIns},
-    {"bulk-annotate", &Transaction::bulkAnnotatePlugIns},
-    {"lock", &Transaction::lockDownPlugIns},
+// One handler per request of the protocol, in the protocol's order; the build stops when they drift apart (an
+// entry left out shows as a request out of order, since the array has exactly one slot per request).
+constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
+    {Request::Add, &Transaction::addPlugIns},
+    {Request::Remove, &Transaction::removePlugIns},
+    {Request::Bulk, &Transaction::bulkPlugIns},
+    {Request::Match, &Transaction::matchPlugIns},
+    {Request::Ready, &Transaction::readyPlugIns},
+    {Request::Access, &Transaction::accessPlugIns},
+    {Request::Annotate, &Transaction::annotatePlugIns},
+    {Request::BulkAnnotate, &Transaction::bulkAnnotatePlugIns},
+    {Request::Lock, &Transaction::lockDownPlugIns},
 }};
+
+constexpr bool handlersFollowTheProtocol() {
+    for (size_t i = 0; i < kHandlers.size(); ++i)
+        if (kHandlers[i].request != protocol::kRequests[i].request) return false;
+    return true;
+}
+static_assert(handlersFollowTheProtocol(), "every request of bexil/Protocol.h needs its handler, in the same order");
 
 }  // namespace
 
@@ -57,15 +67,16 @@ std::shared_ptr<ZemConnection> Transaction::connection() const { return client_-
 
 void Transaction::dispatch() {
     const Value& body = request_.body();
-    const std::string* name = body.find("request") ? body.find("request")->getString() : nullptr;
-    const Value* versionValue = body.find("version");
+    const Value* nameValue = body.find(protocol::key::kRequest);
+    const std::string* name = nameValue ? nameValue->getString() : nullptr;
+    const Value* versionValue = body.find(protocol::key::kVersion);
     version_ = versionValue && versionValue->getUInt64() ? *versionValue->getUInt64() : 0;
 
     // The version is checked before anything else, so even a dying client learns that it speaks the wrong one.
-    if (version_ != 2 && version_ != kCurrentProtocolVersion) {
-        fail(7, formatPrintf("unsupported protocol version %d (current %d)",
-                             static_cast<int32_t>(static_cast<uint32_t>(version_)),
-                             static_cast<int>(kCurrentProtocolVersion)));
+    if (version_ != protocol::kAcceptedOldVersion && version_ != protocol::kCurrentVersion) {
+        fail(ErrorCode::VersionMismatch, formatPrintf("unsupported protocol version %d (current %d)",
+                                                      static_cast<int32_t>(static_cast<uint32_t>(version_)),
+                                                      static_cast<int>(protocol::kCurrentVersion)));
         return;
     }
     // A client that hung up while its requests waited behind other clients' gets none of them run: its connection
@@ -78,29 +89,33 @@ void Transaction::dispatch() {
     trace::request(pid, name ? name->c_str() : "");
 
     if (!name) {
-        fail(4, "invalid request format (missing type)");
+        fail(ErrorCode::InvalidRequest, "invalid request format (missing type)");
         return;
     }
-    runHandler(*name);
+    std::optional<Request> request = protocol::requestNamed(*name);
+    if (!request) {
+        fail(ErrorCode::InvalidRequest, "unrecognized request");
+        return;
+    }
+    runHandler(*request);
 }
 
-void Transaction::runHandler(std::string_view name) {
-    for (const HandlerEntry& entry : kHandlers) {
-        if (entry.name != name) continue;
-        try {
-            (this->*entry.handler)();
-        } catch (const InternalInconsistency& broken) {
-            // One bad record must not take the daemon down for every client: this request fails, the rest go on.
-            log::ops().fault("internal inconsistency while handling %{public}s: %s", entry.name.data(), broken.what());
-            if (!answered()) fail(4, broken.what());
-        }
-        return;
+void Transaction::runHandler(Request request) {
+    const HandlerEntry& entry = kHandlers[static_cast<size_t>(request)];
+    try {
+        (this->*entry.handler)();
+    } catch (const InternalInconsistency& broken) {
+        // One bad record must not take the daemon down for every client: this request fails, the rest go on.
+        log::ops().fault("internal inconsistency while handling %{public}s: %s", protocol::nameOf(request).data(),
+                         broken.what());
+        if (!answered()) fail(ErrorCode::OperationFailed, broken.what());
     }
-    fail(4, "unrecognized request");
 }
 
 // The code travels as an unsigned 64-bit number: the signed 32-bit code widened with its sign.
-static Value wireErrorCode(int code) { return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(code))); }
+static Value wireErrorCode(int64_t code) {
+    return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(static_cast<int32_t>(code))));
+}
 
 void Transaction::done() {
     if (answered_.exchange(true)) {
@@ -113,11 +128,12 @@ void Transaction::done() {
     if (Result<size_t> size = ZemCodec::encodedSize(reply); size && *size > ZemFrame::kMaxPayloadBytes) {
         log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", *size,
                          client_->pid(), ZemFrame::kMaxPayloadBytes);
-        reply =
-            Value::dictionary({{"errorcode", wireErrorCode(4)},
-                               {"error", Value::string(fmt::format("reply of {} bytes exceeds the frame limit of {} "
-                                                                   "bytes",
-                                                                   *size, ZemFrame::kMaxPayloadBytes))}});
+        reply = Value::dictionary(
+            {{std::string(protocol::key::kErrorCode), wireErrorCode(protocol::codeOf(ErrorCode::OperationFailed))},
+             {std::string(protocol::key::kError),
+              Value::string(fmt::format("reply of {} bytes exceeds the frame limit of {} "
+                                        "bytes",
+                                        *size, ZemFrame::kMaxPayloadBytes))}});
     }
     if (trace::requestOutputEnabled()) trace::requestOutput(client_->pid(), reply.description().c_str());
     std::shared_ptr<ZemConnection> connection = client_->connection();
@@ -125,21 +141,23 @@ void Transaction::done() {
     connection->sendReply(request_, reply);
 }
 
-void Transaction::fail(int code, std::string_view message) {
-    reply_.set("errorcode", wireErrorCode(code));
-    reply_.set("error", Value::string(message));
+void Transaction::fail(ErrorCode code, std::string_view message) { failWithCode(protocol::codeOf(code), message); }
+
+void Transaction::failWithCode(int64_t code, std::string_view message) {
+    reply_.set(protocol::key::kErrorCode, wireErrorCode(code));
+    reply_.set(protocol::key::kError, Value::string(message));
     done();
 }
 
-void Transaction::fail(int code, const Error& error) {
+void Transaction::fail(ErrorCode code, const Error& error) {
     if (error.isBexil()) {
         // A Bexil error made without a message answers with its code alone.
         if (!error.localizedDescription()) {
-            reply_.set("errorcode", wireErrorCode(static_cast<int>(error.code())));
+            reply_.set(protocol::key::kErrorCode, wireErrorCode(error.code()));
             done();
             return;
         }
-        fail(static_cast<int>(error.code()), *error.localizedDescription());
+        failWithCode(error.code(), *error.localizedDescription());
         return;
     }
     fail(code, error.localizedDescription().value_or(error.description()));

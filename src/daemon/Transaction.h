@@ -15,6 +15,7 @@
 
 #include "base/Error.h"
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 #include "platform/zem/ZemMessage.h"
 
 namespace bexil {
@@ -31,9 +32,6 @@ std::optional<Value> zem_dictionary_get_dictionary(const Value& dictionary, std:
 
 class Transaction : public std::enable_shared_from_this<Transaction> {
   public:
-    // The protocol version this daemon speaks; 2 is still accepted.
-    static constexpr uint64_t kCurrentProtocolVersion = 3;
-
     // initWithRequest:forClient: stores both and creates the reply from the request.
     Transaction(ZemMessage request, std::shared_ptr<BXDZemClient> client);
 
@@ -42,9 +40,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // Sends the reply. Called exactly once per transaction; later calls are ignored.
     void done();
     // Sets "errorcode" and "error" in the reply, then done().
-    void fail(int code, std::string_view message);
+    void fail(ErrorCode code, std::string_view message);
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.
-    void fail(int code, const Error& error);
+    void fail(ErrorCode code, const Error& error);
 
     const std::shared_ptr<BXDZemClient>& client() const { return client_; }
     const Value& request() const { return request_.body(); }
@@ -84,7 +82,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void lockDownPlugIns();
 
   private:
-    void runHandler(std::string_view name);
+    void runHandler(protocol::Request request);
+    void failWithCode(int64_t code, std::string_view message);
 
     ZemMessage request_;
     std::shared_ptr<BXDZemClient> client_;

@@ -73,7 +73,8 @@ std::optional<Error> BXDAnnotationStore::loadDb(const std::filesystem::path& url
     // A version that is not a number counts as absent, and absent counts as 0.
     int64_t version = root->get(kVersionKey).numberAsInt64().value_or(0);
     if (version != kDatabaseVersion)
-        return fail(BXErrorWithFormat(7, "found database version %d needed version %d", version, kDatabaseVersion));
+        return fail(BXErrorWithFormat(ErrorCode::VersionMismatch, "found database version %d needed version %d",
+                                      version, kDatabaseVersion));
 
     const Value* data = root->find(kDataKey);
     if (data == nullptr) {

@@ -7,13 +7,14 @@
 #include <vector>
 
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 #include "platform/prefs/PreferencesStore.h"
 
 namespace bexil {
 
 class BXDUserPrefs {
   public:
-    static constexpr const char* kDomain = "com.quorvel.bexil.userprefs";
+    static constexpr const char* kDomain = protocol::kUserPrefsDomain.data();
     static constexpr const char* kExclusionsKey = "exclusions";
 
     // `init`: reads the domain from `store` (the process's shared store by default), which must outlive this object.

@@ -279,7 +279,7 @@ std::optional<Error> BXDatabase::addPlugIn(std::string_view url) {
     Result<std::shared_ptr<const LXBexilProxy>> registered = workspace_->registerPlugin(url);
     if (!registered) {
         log::ops().debug("registry refused %@: %@", url, registered.error());
-        return BXError(2, "Ledgerix failed to register the plug-in");
+        return BXError(ErrorCode::RegistryRefused, "Ledgerix failed to register the plug-in");
     }
     return std::nullopt;
 }
@@ -287,7 +287,7 @@ std::optional<Error> BXDatabase::addPlugIn(std::string_view url) {
 std::optional<Error> BXDatabase::removePlugIn(std::string_view url) {
     if (std::optional<Error> error = workspace_->unregisterPlugin(url)) {
         log::ops().debug("registry refused to unregister %@: %@", url, *error);
-        return BXError(2, "Ledgerix failed to deregister the plug-in");
+        return BXError(ErrorCode::RegistryRefused, "Ledgerix failed to deregister the plug-in");
     }
     return std::nullopt;
 }

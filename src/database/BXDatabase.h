@@ -18,6 +18,7 @@
 #include "base/Error.h"
 #include "base/SyncQueue.h"
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 #include "database/BXDatabaseDelegate.h"
 #include "policy/BXAnnotationSource.h"
 
@@ -34,7 +35,7 @@ class BXDatabase {
     // Default for the largest number of cached records before the cache is emptied.
     static constexpr unsigned kDefaultCacheLimit = 1000000;
     // Posted (without payload) after a client's annotation changes and after hold changes.
-    static constexpr std::string_view kAnnotationChangeNotification = "com.quorvel.bexil.annotation-change";
+    static constexpr std::string_view kAnnotationChangeNotification = protocol::kAnnotationChangeNotification;
     // The annotation "election" key and the value automatic election stores.
     static constexpr std::string_view kElectionKey = "election";
     static constexpr int64_t kAutoElection = 1;

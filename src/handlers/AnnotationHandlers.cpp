@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 
+#include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
 #include "daemon/Transaction.h"
@@ -18,7 +19,7 @@ namespace bexil {
 
 namespace {
 
-constexpr std::string_view kAnnotationsKey = "annotations";
+constexpr std::string_view kAnnotationsKey = protocol::key::kAnnotations;
 constexpr std::string_view kElectionKey = "election";
 constexpr std::string_view kExtensionKey = "extension";
 
@@ -36,7 +37,7 @@ std::string uuidText(const BXDPlugIn& plugIn) {
 void Transaction::annotatePlugIns() {
     std::optional<Value> annotations = zem_dictionary_get_dictionary(request(), kAnnotationsKey);
     if (!annotations) {
-        fail(4, "invalid request format (bad annotations dictionary)");
+        fail(ErrorCode::InvalidRequest, "invalid request format (bad annotations dictionary)");
         return;
     }
 
@@ -44,14 +45,14 @@ void Transaction::annotatePlugIns() {
     MutableDictionary change;
     if (const Value* election = annotations->find(kElectionKey)) {
         if (!isElectionNumber(*election)) {
-            fail(4, "invalid request format (annotation election)");
+            fail(ErrorCode::InvalidRequest, "invalid request format (annotation election)");
             return;
         }
         change.set(kElectionKey, *election);
     }
     if (const Value* extension = annotations->find(kExtensionKey)) {
         if (!extension->isDictionary()) {
-            fail(4, "invalid request format (annotation extension)");
+            fail(ErrorCode::InvalidRequest, "invalid request format (annotation extension)");
             return;
         }
         change.set(kExtensionKey, *extension);
@@ -82,7 +83,7 @@ void Transaction::annotatePlugIns() {
 void Transaction::bulkAnnotatePlugIns() {
     std::optional<Value> annotations = zem_dictionary_get_dictionary(request(), kAnnotationsKey);
     if (!annotations) {
-        fail(4, "invalid request format (bad annotations dictionary)");
+        fail(ErrorCode::InvalidRequest, "invalid request format (bad annotations dictionary)");
         return;
     }
     log::ops().debug("bulk change requested for %u plug-ins", annotations->count());
@@ -90,17 +91,17 @@ void Transaction::bulkAnnotatePlugIns() {
     const pid_t pid = client()->pid();
     for (const DictionaryEntry& entry : annotations->entries()) {
         if (!entry.value.isDictionary()) {
-            fail(18, "annotations values must be dictionaries");
+            fail(ErrorCode::BadBulkAnnotation, "annotations values must be dictionaries");
             return;
         }
         std::optional<Uuid> uuid = Uuid::parse(entry.key);
         if (!uuid) {
-            fail(18, "invalid plug-in UUID value");
+            fail(ErrorCode::BadBulkAnnotation, "invalid plug-in UUID value");
             return;
         }
         std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(*uuid);
         if (!plugIn) {
-            fail(2, "no plug-in with the requested uuid");
+            fail(ErrorCode::RegistryRefused, "no plug-in with the requested uuid");
             return;
         }
         log::ops().debug("client %d bulk plug-in %@(%{public}@) annotation change: %@", pid, plugIn->identifier(),

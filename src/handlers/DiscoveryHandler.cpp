@@ -13,12 +13,13 @@
 #include <unordered_map>
 #include <vector>
 
-#include "client/BXDaemonClient.h"
+#include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
 #include "daemon/Transaction.h"
 #include "model/BXBundle.h"
 #include "model/BXUtilities.h"
+#include "model/MessageForm.h"
 #include "platform/log/Log.h"
 #include "platform/sandbox/ProcessSandbox.h"
 #include "platform/trace/Probes.h"
@@ -29,25 +30,8 @@ namespace bexil {
 
 namespace {
 
-// Keep every version of an identifier, not only the best.
-constexpr uint64_t kDiscoverAllVersions = 0x1;
-// With kDiscoverAllVersions: keep also plug-ins that share identifier and version.
-constexpr uint64_t kDiscoverAllInstances = 0x4;
-// Only plug-ins on the system volume.
-constexpr uint64_t kDiscoverSystemOnly = 0x8;
-// Privileged: no visibility checks, no host policy.
-constexpr uint64_t kDiscoverAll = 0x200;
-
-// The entitlement that privileged discovery needs (besides not being sandboxed).
-constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
-
-constexpr std::string_view kIdentifierKey = "identifier";
-constexpr std::string_view kVersionKey = "version";
-constexpr std::string_view kUuidKey = "uuid";
-constexpr std::string_view kSystemResidentKey = "systemResident";
-constexpr std::string_view kLastModifiedKey = "lastmodified";
-constexpr std::string_view kOverriderKey = "overrider";
-constexpr std::string_view kOverridingKey = "overriding";
+namespace discover = protocol::discover;
+namespace formKey = protocol::form;
 
 using Form = std::shared_ptr<MutableDictionary>;
 
@@ -64,10 +48,10 @@ std::string versionOf(const BXDPlugIn& plugIn) {
 // Whether the new plug-in wins against an accepted form of the same identifier and version: a system plug-in beats
 // one that is not, otherwise the later registration wins and equal times keep what was accepted first.
 bool winsTieBreak(const BXDPlugIn& plugIn, const MutableDictionary& form) {
-    const Value* resident = form.find(kSystemResidentKey);
+    const Value* resident = form.find(formKey::kSystemResident);
     bool formResident = resident != nullptr && resident->getBool().value_or(false);
     if (plugIn.onSystemVolume() && !formResident) return true;
-    const Value* modified = form.find(kLastModifiedKey);
+    const Value* modified = form.find(formKey::kLastModified);
     int32_t formModified = modified != nullptr ? static_cast<int32_t>(modified->numberAsInt64().value_or(0)) : 0;
     return plugIn.lastModified() > formModified;
 }
@@ -90,18 +74,18 @@ std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn) {
 }  // namespace
 
 void Transaction::matchPlugIns() {
-    const Value* rulesEntry = request().find("rules");
+    const Value* rulesEntry = request().find(protocol::key::kRules);
     if (rulesEntry != nullptr && !rulesEntry->isDictionary()) {
-        fail(4, "invalid request format (bad rules dictionary)");
+        fail(ErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
         return;
     }
     Value rules = rulesEntry != nullptr ? *rulesEntry : Value();
-    uint64_t flags = request().get("flags").numberAsUInt64().value_or(0);
-    bool all = (flags & kDiscoverAll) != 0;
+    uint64_t flags = request().get(protocol::key::kFlags).numberAsUInt64().value_or(0);
+    bool all = (flags & discover::kAll) != 0;
     pid_t pid = client()->pid();
 
-    if (all && (!client()->hasEntitlement(kManagerEntitlement) || processIsSandboxed(pid))) {
-        fail(11, "unauthorized discovery flag (BXDiscoverAll)");
+    if (all && (!client()->hasEntitlement(protocol::kManagerEntitlement) || processIsSandboxed(pid))) {
+        fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
         return;
     }
 
@@ -129,7 +113,8 @@ void Transaction::matchPlugIns() {
             if (!all) {
                 // Plug-ins outside the system volume are visible only inside an application, and not at all when
                 // the caller asked for system plug-ins only.
-                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & kDiscoverSystemOnly))) continue;
+                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & discover::kSystemOnly)))
+                    continue;
                 if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(*plugIn, clientBundle.get())) continue;
                 if (database->holdOnPlugIn(*plugIn)) continue;
             }
@@ -166,9 +151,9 @@ void Transaction::matchPlugIns() {
             bool dropped = false;
             for (auto at = sameIdentifier.begin(); at != sameIdentifier.end(); ++at) {
                 Form& other = results[*at];
-                ComparisonResult order = compareVersionString(version, textOf(*other, kVersionKey));
+                ComparisonResult order = compareVersionString(version, textOf(*other, formKey::kVersion));
                 bool same = order == ComparisonResult::Same;
-                if ((flags & kDiscoverAllVersions) && (!same || (flags & kDiscoverAllInstances))) continue;
+                if ((flags & discover::kAllVersions) && (!same || (flags & discover::kAllInstances))) continue;
                 bool wins = same ? winsTieBreak(*plugIn, *other) : order == ComparisonResult::Descending;
                 if (wins) {
                     other.reset();
@@ -194,13 +179,14 @@ void Transaction::matchPlugIns() {
         if (!replacements.empty()) {
             for (const Form& form : results) {
                 if (!form) continue;
-                std::string identifier = textOf(*form, kIdentifierKey);
+                std::string identifier = textOf(*form, formKey::kIdentifier);
                 auto replacing = replacements.find(identifier);
                 if (replacing == replacements.end()) continue;
-                std::string replacingUuid = textOf(*replacing->second, kUuidKey);
-                form->set(kOverriderKey, Value::string(replacingUuid));
-                replacing->second->set(kOverridingKey, Value::string(identifier));
-                log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid, textOf(*form, kUuidKey));
+                std::string replacingUuid = textOf(*replacing->second, formKey::kUuid);
+                form->set(formKey::kOverrider, Value::string(replacingUuid));
+                replacing->second->set(formKey::kOverriding, Value::string(identifier));
+                log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid,
+                                textOf(*form, formKey::kUuid));
             }
         }
     }
@@ -211,9 +197,8 @@ void Transaction::matchPlugIns() {
     // The builders are not used again: their entries move into the reply rather than being copied.
     for (const Form& form : results)
         if (form) forms.push_back(form->take());
-    if (std::optional<Value> encoded =
-            BXDaemonClient::convertToZEMVersion(Value::array(std::move(forms)), static_cast<int64_t>(version())))
-        reply().set("matches", std::move(*encoded));
+    if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version()))
+        reply().set(protocol::key::kMatches, std::move(*encoded));
     log::ops().debug("reply marshalled");
     done();
 }

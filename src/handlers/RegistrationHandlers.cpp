@@ -8,6 +8,7 @@
 #include <memory>
 #include <string>
 
+#include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
 #include "daemon/Transaction.h"
@@ -22,7 +23,6 @@ namespace {
 // Resolved paths longer than this are treated as not resolving, as with the fixed buffer clients were promised.
 constexpr size_t kResolvedPathBufferSize = 1024;
 // Entitlement that a caller needs to unregister plug-ins.
-constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
 
 // The canonical absolute path of `path`, or none when it does not resolve (or does not fit the buffer size).
 std::optional<std::string> resolvePath(const std::string& path) {
@@ -36,19 +36,19 @@ std::optional<std::string> resolvePath(const std::string& path) {
 }  // namespace
 
 bool Transaction::marshalPaths(const RegistrationHandler& handler) {
-    std::optional<Value> paths = zem_dictionary_get_array(request(), "paths");
+    std::optional<Value> paths = zem_dictionary_get_array(request(), protocol::key::kPaths);
     if (!paths) {
-        fail(4, "invalid request format");
+        fail(ErrorCode::InvalidRequest, "invalid request format");
         return false;
     }
     for (const Value& element : paths->items()) {
         const std::string* path = element.getString();
         if (path == nullptr) {
-            fail(4, "invalid request format");
+            fail(ErrorCode::InvalidRequest, "invalid request format");
             return false;
         }
         if (path->empty() || path->front() != '/') {
-            fail(9, formatPrintf("absolute path required: %s", *path));
+            fail(ErrorCode::BadPath, formatPrintf("absolute path required: %s", *path));
             return false;
         }
         std::optional<std::string> resolved = resolvePath(*path);
@@ -64,15 +64,15 @@ bool Transaction::processPaths(const RegistrationHandler& handler) {
 }
 
 bool Transaction::processUuidList(const PlugInHandler& handler) {
-    std::optional<Value> uuids = zem_dictionary_get_array(request(), "uuids");
+    std::optional<Value> uuids = zem_dictionary_get_array(request(), protocol::key::kUuids);
     if (!uuids) {
-        fail(4, "invalid request format (uuid)");
+        fail(ErrorCode::InvalidRequest, "invalid request format (uuid)");
         return false;
     }
     for (const Value& element : uuids->items()) {
         const Uuid* bytes = element.getUuid();
         if (bytes == nullptr) {
-            fail(4, "invalid request (bad uuid array)");
+            fail(ErrorCode::InvalidRequest, "invalid request (bad uuid array)");
             return false;
         }
         // A UUID value is always its 16 bytes, so making the UUID object cannot fail here; the answer for that case
@@ -80,7 +80,7 @@ bool Transaction::processUuidList(const PlugInHandler& handler) {
         Uuid uuid(bytes->bytes());
         std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(uuid);
         if (!plugIn) {
-            fail(4, "no such plugin (uuid not found)");
+            fail(ErrorCode::InvalidRequest, "no such plugin (uuid not found)");
             return false;
         }
         if (!handler(plugIn)) return false;
@@ -91,14 +91,14 @@ bool Transaction::processUuidList(const PlugInHandler& handler) {
 void Transaction::addPlugIns() {
     processPaths([this](const std::string& path, bool resolved) {
         if (!resolved) {
-            fail(9, formatPrintf("invalid plugin path: %@", path));
+            fail(ErrorCode::BadPath, formatPrintf("invalid plugin path: %@", path));
             return false;
         }
         trace::pluginAdd(path.c_str());
         if (std::optional<Error> error = server()->addPlugIn(path)) {
             log::ops().notice("failed to register plug-in at %@", path);
             // The database's own wording stays in the log; the client learns only which path failed.
-            fail(2, formatPrintf("unable to register plug-in at %@", path));
+            fail(ErrorCode::RegistryRefused, formatPrintf("unable to register plug-in at %@", path));
             return false;
         }
         return true;
@@ -108,16 +108,16 @@ void Transaction::addPlugIns() {
 void Transaction::removePlugIns() {
     processPaths([this](const std::string& path, bool resolved) {
         trace::pluginRemove(path.c_str(), resolved);
-        if (!client()->hasEntitlement(kManagerEntitlement)) {
+        if (!client()->hasEntitlement(protocol::kManagerEntitlement)) {
             log::defaultLog().notice(
                 "refused request from pid=%d to remove plug-in at %@ - client lacks required entitlement",
                 client()->pid(), path);
-            fail(11, "caller lacks entitlement for this operation");
+            fail(ErrorCode::NotAllowed, "caller lacks entitlement for this operation");
             return false;
         }
         // An unresolved path goes to the registry as the client sent it: the bundle may already be deleted.
         if (server()->removePlugIn(path)) {
-            fail(9, formatPrintf("no plugin at %@", path));
+            fail(ErrorCode::BadPath, formatPrintf("no plugin at %@", path));
             return false;
         }
         return true;
@@ -125,7 +125,7 @@ void Transaction::removePlugIns() {
 }
 
 void Transaction::bulkPlugIns() {
-    uint64_t flags = request().get("flags").numberAsUInt64().value_or(0);
+    uint64_t flags = request().get(protocol::key::kFlags).numberAsUInt64().value_or(0);
     log::ops().info("bulk options 0x%lx not supported", static_cast<unsigned long>(flags));
     done();
 }

@@ -5,6 +5,7 @@
 
 #include "model/BXPlugInCore.h"
 
+#include "bexil/Protocol.h"
 #include "model/BXUtilities.h"
 #include "platform/log/Log.h"
 
@@ -30,27 +31,7 @@ constexpr std::string_view kRZExtensionPointIdentifier = "RZExtensionPointIdenti
 constexpr std::string_view kRZExtensionVersion = "RZExtensionVersion";
 }  // namespace keys
 
-// Entries of the serialised form.
-namespace form {
-constexpr std::string_view kHubProtocolVersion = "hubProtocolVersion";
-constexpr std::string_view kPath = "path";
-constexpr std::string_view kSystemResident = "systemResident";
-constexpr std::string_view kIdentifier = "identifier";
-constexpr std::string_view kOriginalIdentifier = "original-identifier";
-constexpr std::string_view kVersion = "version";
-constexpr std::string_view kBundleInfo = "bundleInfo";
-constexpr std::string_view kInfo = "info";
-constexpr std::string_view kUuid = "uuid";
-constexpr std::string_view kLastModified = "lastmodified";
-constexpr std::string_view kAnnotations = "annotations";
-constexpr std::string_view kEntitlements = "entitlements";
-constexpr std::string_view kContainingPath = "containingPath";
-constexpr std::string_view kLocalizedContainingDisplayName = "localizedContainingDisplayName";
-constexpr std::string_view kLocalizedDisplayName = "localizedDisplayName";
-constexpr std::string_view kLocalizedShortName = "localizedShortName";
-constexpr std::string_view kHash = "hash";
-constexpr std::string_view kRequirement = "requirement";
-}  // namespace form
+namespace form = protocol::form;
 
 // The truth value of a configuration entry: booleans as they are, numbers when not zero. Anything else (a string,
 // a dictionary) is not a truth value and counts as NO.

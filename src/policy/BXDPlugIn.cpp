@@ -34,7 +34,7 @@ int32_t secondsAsInt32(double seconds) {
     return static_cast<int32_t>(truncated);
 }
 
-Error misconfigured(std::string_view message) { return BXError(12, message); }
+Error misconfigured(std::string_view message) { return BXError(ErrorCode::InvalidConfiguration, message); }
 
 }  // namespace
 

@@ -29,7 +29,7 @@ class Parser {
         size_t line = 1;
         for (size_t i = 0; i < pos_ && i < text_.size(); ++i)
             if (text_[i] == '\n') ++line;
-        return BXError(4, "JSON line " + std::to_string(line) + ": " + error_);
+        return BXError(ErrorCode::InvalidRequest, "JSON line " + std::to_string(line) + ": " + error_);
     }
 
     void skipSpace() {

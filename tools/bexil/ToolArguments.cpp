@@ -27,10 +27,10 @@ struct NamedFlag {
     uint64_t bit;
 };
 constexpr std::array<NamedFlag, 4> kDiscoveryFlags = {{
-    {"all-versions", 0x1},
-    {"all-instances", 0x4},
-    {"system-only", 0x8},
-    {"all", 0x200},
+    {"all-versions", protocol::discover::kAllVersions},
+    {"all-instances", protocol::discover::kAllInstances},
+    {"system-only", protocol::discover::kSystemOnly},
+    {"all", protocol::discover::kAll},
 }};
 
 }  // namespace
@@ -41,7 +41,9 @@ Result<std::vector<Uuid>> parseUuids(const std::vector<std::string>& texts) {
     std::vector<Uuid> uuids;
     for (const std::string& text : texts) {
         auto uuid = Uuid::parse(text);
-        if (!uuid) return BXError(4, "not a UUID: \"" + text + "\" (expected 8-4-4-4-12 hexadecimal digits)");
+        if (!uuid)
+            return BXError(ErrorCode::InvalidRequest,
+                           "not a UUID: \"" + text + "\" (expected 8-4-4-4-12 hexadecimal digits)");
         uuids.push_back(*uuid);
     }
     return uuids;
@@ -50,7 +52,7 @@ Result<std::vector<Uuid>> parseUuids(const std::vector<std::string>& texts) {
 Result<Value> absolutePaths(const std::vector<std::string>& texts) {
     MutableArray paths;
     for (const std::string& text : texts) {
-        if (text.empty() || text.front() != '/') return BXError(9, "absolute path required: " + text);
+        if (text.empty() || text.front() != '/') return BXError(ErrorCode::BadPath, "absolute path required: " + text);
         paths.append(Value::string(text));
     }
     return paths.take();
@@ -60,9 +62,11 @@ Result<Value> rulesFromArguments(const std::vector<std::string>& arguments) {
     MutableDictionary rules;
     for (const std::string& argument : arguments) {
         size_t eq = argument.find('=');
-        if (eq == std::string::npos || eq == 0) return BXError(4, "rule \"" + argument + "\" is not KEY=PATTERN");
+        if (eq == std::string::npos || eq == 0)
+            return BXError(ErrorCode::InvalidRequest, "rule \"" + argument + "\" is not KEY=PATTERN");
         std::string key = argument.substr(0, eq);
-        if (rules.find(key) != nullptr) return BXError(4, "rule key \"" + key + "\" given twice");
+        if (rules.find(key) != nullptr)
+            return BXError(ErrorCode::InvalidRequest, "rule key \"" + key + "\" given twice");
         rules.set(key, Value::string(argument.substr(eq + 1)));
     }
     return rules.take();
@@ -71,24 +75,26 @@ Result<Value> rulesFromArguments(const std::vector<std::string>& arguments) {
 Result<Value> readDictionaryFile(const fs::path& path) {
     std::error_code ec;
     uintmax_t size = fs::file_size(path, ec);
-    if (ec) return BXError(4, "cannot read " + path.string() + ": " + ec.message());
+    if (ec) return BXError(ErrorCode::InvalidRequest, "cannot read " + path.string() + ": " + ec.message());
     if (size > kMaxRuleFileBytes)
-        return BXError(
-            4, "cannot read " + path.string() + ": larger than " + std::to_string(kMaxRuleFileBytes) + " bytes");
-    Result<Value> value = BXError(4, "");
+        return BXError(ErrorCode::InvalidRequest, "cannot read " + path.string() + ": larger than " +
+                                                      std::to_string(kMaxRuleFileBytes) + " bytes");
+    Result<Value> value = BXError(ErrorCode::InvalidRequest, "");
     if (path.extension() == ".vrec") {
         value = Document::readFile(path);
     } else {
         std::ifstream in(path, std::ios::binary);
-        if (!in) return BXError(4, "cannot read " + path.string() + ": " + std::strerror(errno));
+        if (!in)
+            return BXError(ErrorCode::InvalidRequest, "cannot read " + path.string() + ": " + std::strerror(errno));
         std::stringstream text;
         text << in.rdbuf();
         value = parseJson(text.str());
     }
     if (!value) {
-        return BXError(4, path.string() + ": " + value.error().localizedDescription().value_or("unreadable"));
+        return BXError(ErrorCode::InvalidRequest,
+                       path.string() + ": " + value.error().localizedDescription().value_or("unreadable"));
     }
-    if (!value->isDictionary()) return BXError(4, path.string() + ": not a dictionary");
+    if (!value->isDictionary()) return BXError(ErrorCode::InvalidRequest, path.string() + ": not a dictionary");
     return value;
 }
 
@@ -103,8 +109,8 @@ Result<uint64_t> discoveryFlags(const std::vector<std::string>& names) {
             }
         }
         if (!known)
-            return BXError(
-                4, "unknown discovery flag \"" + name + "\" (known: all-versions, all-instances, system-only, all)");
+            return BXError(ErrorCode::InvalidRequest, "unknown discovery flag \"" + name +
+                                                          "\" (known: all-versions, all-instances, system-only, all)");
     }
     return flags;
 }
@@ -112,10 +118,12 @@ Result<uint64_t> discoveryFlags(const std::vector<std::string>& names) {
 fs::path preferencesFile() { return PreferencesStore().fileForDomain(kUserPrefsDomain); }
 
 std::optional<Error> validateExclusions(const Value& rules) {
-    if (!rules.isArray()) return BXError(4, "exclusions must be an array of rule dictionaries");
+    if (!rules.isArray()) return BXError(ErrorCode::InvalidRequest, "exclusions must be an array of rule dictionaries");
     size_t index = 0;
     for (const Value& rule : rules.items()) {
-        if (!rule.isDictionary()) return BXError(4, "exclusion " + std::to_string(index) + " is not a rule dictionary");
+        if (!rule.isDictionary())
+            return BXError(ErrorCode::InvalidRequest,
+                           "exclusion " + std::to_string(index) + " is not a rule dictionary");
         ++index;
     }
     return std::nullopt;

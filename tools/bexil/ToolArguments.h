@@ -11,6 +11,7 @@
 
 #include "base/Error.h"
 #include "base/Value.h"
+#include "bexil/Protocol.h"
 
 namespace bexil::tool {
 
@@ -35,7 +36,7 @@ Result<Value> readDictionaryFile(const std::filesystem::path& path);
 Result<uint64_t> discoveryFlags(const std::vector<std::string>& names);
 
 // The preferences domain that holds the global exclusions, under the key "exclusions".
-inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
+inline constexpr std::string_view kUserPrefsDomain = protocol::kUserPrefsDomain;
 
 // Where the global exclusions live: the preferences store's file of kUserPrefsDomain ($BX_PREFERENCES_DIR, else
 // $XDG_CONFIG_HOME/bexil/preferences with ~/.config for an unset XDG_CONFIG_HOME;

@@ -73,7 +73,7 @@ int roundTrip(const Options& options, const char* what,
         }
         std::fprintf(stderr, "bexil: %s failed (code %lld): %s\n", what, static_cast<long long>(error->code()),
                      error->localizedDescription().value_or("").c_str());
-        if (const Value* conflicts = message.find("conflicts"); conflicts && !options.json) {
+        if (const Value* conflicts = message.find(protocol::key::kConflicts); conflicts && !options.json) {
             std::fprintf(stderr, "bexil: busy: %s\n", conflicts->description().c_str());
         }
         return exitStatusForCode(error->code());
@@ -90,7 +90,7 @@ std::string cell(const std::optional<std::string>& text) { return text && !text-
 int printMatches(const Options& options, BXDaemonClient& client, const Value& message) {
     if (options.json) {
         std::optional<Value> matches;
-        if (const Value* encoded = message.find("matches")) matches = client.convertFromZEM(*encoded);
+        if (const Value* encoded = message.find(protocol::key::kMatches)) matches = client.convertFromZEM(*encoded);
         std::printf("%s\n", toJson(matches.value_or(Value::emptyArray())).c_str());
         return 0;
     }
@@ -141,7 +141,7 @@ int printHold(const Options& options, BXDaemonClient&, const Value& message) {
         std::printf("%s\n", toJson(message).c_str());
         return 0;
     }
-    const Value* uuid = message.find("uuids");
+    const Value* uuid = message.find(protocol::key::kUuids);
     if (uuid == nullptr || !uuid->isUuid()) {
         std::fprintf(stderr, "bexil: hold granted without a hold UUID in the reply\n");
         return kExitSoftware;
@@ -381,7 +381,9 @@ int run(int argc, char** argv) {
     if (*hold) {
         auto array = absolutePaths(paths);
         if (!array) return usageFailure(array.error());
-        uint64_t holdFlags = (pluginPaths ? 0x1 : 0) | (refuseBusy ? 0x2 : 0) | (terminate ? 0x4 : 0);
+        uint64_t holdFlags = (pluginPaths ? protocol::hold::kPlugInPaths : 0) |
+                             (refuseBusy ? protocol::hold::kRefuseBusy : 0) |
+                             (terminate ? protocol::hold::kTerminate : 0);
         return roundTrip(
             options, "hold", [&](BXDaemonClient& c, auto h) { c.holdPluginsFlagsReply(*array, holdFlags, h); },
             [&](BXDaemonClient& c, const Value& m) { return printHold(options, c, m); });

@@ -91,7 +91,7 @@ CodeSigningIdentity::~CodeSigningIdentity() {
 }
 
 Result<Value> CodeSigningIdentity::entitlementValueForKey(std::string_view key) const {
-    if (!established_) return BXError(4, "no code-signing identity: " + failureReason_);
+    if (!established_) return BXError(ErrorCode::OperationFailed, "no code-signing identity: " + failureReason_);
     if (entitlementsError_) return *entitlementsError_;
     return entitlements_.get(key);
 }

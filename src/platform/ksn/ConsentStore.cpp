@@ -41,7 +41,7 @@ Result<Value> ConsentStore::readDocument() const {
     if (ec == std::errc::no_such_file_or_directory) return Value::emptyDictionary();
     if (!ec && size > kMaxConsentFileBytes) {
         log::ops().error("consent file %{public}@ is larger than %zu bytes", file_.string(), kMaxConsentFileBytes);
-        return BXError(4, file_.string() + " is larger than the consent size limit");
+        return BXError(ErrorCode::OperationFailed, file_.string() + " is larger than the consent size limit");
     }
     Result<Value> document = Document::readFile(file_);
     if (!document) {
@@ -50,7 +50,8 @@ Result<Value> ConsentStore::readDocument() const {
             return Value::emptyDictionary();
         return document.error();
     }
-    if (!document->isDictionary()) return BXError(4, file_.string() + " does not hold a dictionary");
+    if (!document->isDictionary())
+        return BXError(ErrorCode::OperationFailed, file_.string() + " does not hold a dictionary");
     return document;
 }
 
@@ -94,7 +95,7 @@ std::optional<std::vector<ConsentRecord>> ConsentStore::copyInformationForBundle
 std::optional<Error> ConsentStore::setGranted(std::string_view bundleIdentifier, std::string_view service,
                                               bool granted) {
     if (bundleIdentifier.empty() || service.empty())
-        return BXError(4, "a consent answer needs a bundle identifier and a service name");
+        return BXError(ErrorCode::OperationFailed, "a consent answer needs a bundle identifier and a service name");
     fs::path directory = file_.parent_path().empty() ? fs::path(".") : file_.parent_path();
     std::error_code ec;
     fs::create_directories(directory, ec);
@@ -116,7 +117,8 @@ std::optional<Error> ConsentStore::setGranted(std::string_view bundleIdentifier,
         } else {
             const Value* current = document->find(bundleIdentifier);
             if (current != nullptr && !current->isDictionary()) {
-                result = BXError(4, "the consent entry of " + std::string(bundleIdentifier) + " is not a dictionary");
+                result = BXError(ErrorCode::OperationFailed,
+                                 "the consent entry of " + std::string(bundleIdentifier) + " is not a dictionary");
             } else {
                 MutableDictionary services(current ? *current : Value::emptyDictionary());
                 services.set(service, Value::boolean(granted));

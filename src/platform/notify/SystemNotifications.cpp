@@ -26,7 +26,9 @@ namespace {
 
 constexpr const char* kLockFileName = ".lock";
 
-Error posixError(const std::string& what, int error) { return BXError(4, what + ": " + std::strerror(error)); }
+Error posixError(const std::string& what, int error) {
+    return BXError(ErrorCode::OperationFailed, what + ": " + std::strerror(error));
+}
 
 // The counter file is a decimal number; anything else (a stray file) counts as 0 so that the next post repairs it.
 uint64_t readCounter(const fs::path& path) {
@@ -78,10 +80,11 @@ bool SystemNotifications::validName(std::string_view name) {
 }
 
 std::optional<Error> SystemNotifications::post(std::string_view name) {
-    if (!validName(name)) return BXError(4, "invalid notification name \"" + std::string(name) + "\"");
+    if (!validName(name))
+        return BXError(ErrorCode::OperationFailed, "invalid notification name \"" + std::string(name) + "\"");
     std::error_code ec;
     fs::create_directories(directory_, ec);
-    if (ec) return BXError(4, "cannot create " + directory_.string() + ": " + ec.message());
+    if (ec) return BXError(ErrorCode::OperationFailed, "cannot create " + directory_.string() + ": " + ec.message());
 
     int lockFd = ::open((directory_ / kLockFileName).c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
     if (lockFd < 0) return posixError("cannot open notification lock in " + directory_.string(), errno);
@@ -118,7 +121,7 @@ uint64_t SystemNotifications::state(std::string_view name) const {
 
 Result<SystemNotifications::Token> SystemNotifications::observe(std::string name, Callback callback,
                                                                 SerialQueue queue) {
-    if (!validName(name)) return BXError(4, "invalid notification name \"" + name + "\"");
+    if (!validName(name)) return BXError(ErrorCode::OperationFailed, "invalid notification name \"" + name + "\"");
     std::lock_guard lock(mutex_);
     if (inotifyFd_ < 0) {
         if (auto error = startWatching()) return *error;
@@ -137,7 +140,7 @@ void SystemNotifications::cancel(Token token) {
 std::optional<Error> SystemNotifications::startWatching() {
     std::error_code ec;
     fs::create_directories(directory_, ec);
-    if (ec) return BXError(4, "cannot create " + directory_.string() + ": " + ec.message());
+    if (ec) return BXError(ErrorCode::OperationFailed, "cannot create " + directory_.string() + ": " + ec.message());
     int inotifyFd = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
     if (inotifyFd < 0) return posixError("inotify_init1", errno);
     // A post renames its counter file into place; a plain write by some other tool closes it after writing.

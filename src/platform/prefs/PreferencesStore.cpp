@@ -89,7 +89,8 @@ std::optional<Error> PreferencesStore::checkDomain(std::string_view domain) {
         if (!allowed) valid = false;
     }
     if (valid) return std::nullopt;
-    return BXError(4, "invalid preferences domain name \"" + std::string(domain.substr(0, kMaxDomainLength)) + "\"");
+    return BXError(ErrorCode::OperationFailed,
+                   "invalid preferences domain name \"" + std::string(domain.substr(0, kMaxDomainLength)) + "\"");
 }
 
 Result<Value> PreferencesStore::readFile(const fs::path& file, FileIdentity* identity) const {
@@ -102,11 +103,11 @@ Result<Value> PreferencesStore::readFile(const fs::path& file, FileIdentity* ide
     struct stat st {};
     if (::fstat(fd.get(), &st) != 0) return posixError(errno, "cannot stat " + file.string());
     *identity = {st.st_dev, st.st_ino, st.st_size, nanoseconds(st.st_mtim), nanoseconds(st.st_ctim), true};
-    if (!S_ISREG(st.st_mode)) return BXError(4, file.string() + " is not a regular file");
+    if (!S_ISREG(st.st_mode)) return BXError(ErrorCode::OperationFailed, file.string() + " is not a regular file");
     if (static_cast<uint64_t>(st.st_size) > kMaxPreferencesFileBytes) {
         log::ops().error("preferences file %{public}@ is larger than %zu bytes", file.string(),
                          kMaxPreferencesFileBytes);
-        return BXError(4, file.string() + " is larger than the preferences size limit");
+        return BXError(ErrorCode::OperationFailed, file.string() + " is larger than the preferences size limit");
     }
 
     std::string text;
@@ -130,7 +131,8 @@ Result<Value> PreferencesStore::readFile(const fs::path& file, FileIdentity* ide
 
     Result<Value> document = Document::read(text);
     if (!document) return document.error();
-    if (!document->isDictionary()) return BXError(4, file.string() + " does not hold a dictionary");
+    if (!document->isDictionary())
+        return BXError(ErrorCode::OperationFailed, file.string() + " does not hold a dictionary");
     return document;
 }
 
@@ -205,7 +207,8 @@ std::optional<Error> PreferencesStore::setValue(std::string_view domain, std::st
     Result<std::string> text = Document::write(document);
     if (!text) return text.error();
     if (text->size() > kMaxPreferencesFileBytes)
-        return BXError(4, "preferences of " + std::string(domain) + " would exceed the preferences size limit");
+        return BXError(ErrorCode::OperationFailed,
+                       "preferences of " + std::string(domain) + " would exceed the preferences size limit");
     return Document::writeFileAtomically(fileForDomain(domain), document);
 }
 

@@ -236,7 +236,7 @@ std::filesystem::path ZemListener::socketPathForService(const std::string& servi
 Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serviceName, SerialQueue& queue,
                                                          EntitlementsDirectory* entitlements) {
     if (serviceName.empty() || serviceName.find('/') != std::string::npos || serviceName[0] == '.')
-        return BXError(4, "invalid service name \"" + serviceName + "\"");
+        return BXError(ErrorCode::OperationFailed, "invalid service name \"" + serviceName + "\"");
 
     if (int fd = activatedSocketFor(serviceName); fd >= 0) {
         auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, true, -1);
@@ -253,7 +253,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
     if (ec) return posixError("cannot create service directory " + dir.string(), ec.value());
     std::string path = (dir / serviceName).string();
     if (path.size() >= sizeof(sockaddr_un{}.sun_path))
-        return BXError(4, "socket path too long for service " + serviceName + ": " + path);
+        return BXError(ErrorCode::OperationFailed, "socket path too long for service " + serviceName + ": " + path);
 
     int lockFd = open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
     if (lockFd < 0) return posixError("cannot open lock for service " + serviceName, errno);
@@ -261,7 +261,8 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
         int error = errno;
         close(lockFd);
         if (error == EWOULDBLOCK)
-            return BXError(4, "service " + serviceName + " is already served by another process (" + path + ")");
+            return BXError(ErrorCode::OperationFailed,
+                           "service " + serviceName + " is already served by another process (" + path + ")");
         return posixError("cannot lock service " + serviceName, error);
     }
 
@@ -269,11 +270,12 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
     if (lstat(path.c_str(), &st) == 0) {
         if (!S_ISSOCK(st.st_mode)) {
             close(lockFd);
-            return BXError(4, path + " exists and is not a socket; not replacing it");
+            return BXError(ErrorCode::OperationFailed, path + " exists and is not a socket; not replacing it");
         }
         if (socketIsLive(path)) {
             close(lockFd);
-            return BXError(4, "service " + serviceName + " is already served by another process (" + path + ")");
+            return BXError(ErrorCode::OperationFailed,
+                           "service " + serviceName + " is already served by another process (" + path + ")");
         }
         log::ops().info("replacing stale socket %s", path.c_str());
         unlink(path.c_str());

@@ -1,0 +1,156 @@
+#pragma once
+
+// What bxd and its clients agree on, defined once: the protocol version, the request names, the keys of requests
+// and replies, the error codes, the flag bits, and the names of the service, the notification, the entitlement and
+// the preference domain. Plain constants with no state, usable from any thread. It depends on the standard library
+// only, so the daemon, the client library, the tool and applications (it is installed) all read the same table;
+// docs/protocol.md describes each entry and a test holds the two together.
+//
+// Adding a request means: its entry in kRequests, its handler in the daemon's handler table (which does not build
+// until it has one), its test, and at most a subcommand of the tool.
+
+#include <array>
+#include <cstdint>
+#include <optional>
+#include <string_view>
+
+namespace bexil::protocol {
+
+// The version every request carries under key::kVersion. Requests of the accepted older version are served alike;
+// only the discovery result is encoded for the current version alone.
+inline constexpr uint64_t kCurrentVersion = 3;
+inline constexpr uint64_t kAcceptedOldVersion = 2;
+
+// The name under which bxd offers its service (the socket's name, see docs/protocol.md).
+inline constexpr std::string_view kServiceName = "com.quorvel.bexil.bxd";
+// Posted each time the stored annotations or the set of holds change.
+inline constexpr std::string_view kAnnotationChangeNotification = "com.quorvel.bexil.annotation-change";
+// Lets a client remove plug-ins and discover every plug-in (discover::kAll).
+inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
+// The preference domain of the user's elections.
+inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
+
+// The requests, in the order the daemon compares their names (byte for byte; the first match wins).
+enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock };
+
+struct RequestInfo {
+    Request request;
+    // The value of key::kRequest.
+    std::string_view name;
+    // One line on what it does, for help texts and the documentation check.
+    std::string_view summary;
+};
+
+inline constexpr std::array<RequestInfo, 9> kRequests{{
+    {Request::Add, "add", "register the plug-in bundles at paths"},
+    {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
+    {Request::Bulk, "bulk", "bulk registration options (none supported)"},
+    {Request::Match, "match", "discover the plug-ins that match rules"},
+    {Request::Ready, "ready", "make plug-ins ready for the calling host"},
+    {Request::Access, "access", "read-only access tokens for plug-ins"},
+    {Request::Annotate, "annotate", "set the annotations of plug-ins"},
+    {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
+    {Request::Lock, "lock", "place or release a hold on plug-ins"},
+}};
+
+constexpr std::string_view nameOf(Request request) {
+    for (const RequestInfo& info : kRequests)
+        if (info.request == request) return info.name;
+    return {};
+}
+
+// The request whose name is exactly `name`, if any.
+constexpr std::optional<Request> requestNamed(std::string_view name) {
+    for (const RequestInfo& info : kRequests)
+        if (info.name == name) return info.request;
+    return std::nullopt;
+}
+
+// Keys of request and reply dictionaries.
+namespace key {
+inline constexpr std::string_view kRequest = "request";          // string, a name of kRequests
+inline constexpr std::string_view kVersion = "version";          // uint64
+inline constexpr std::string_view kPaths = "paths";              // array of absolute path strings
+inline constexpr std::string_view kUuids = "uuids";              // array of UUIDs
+inline constexpr std::string_view kFlags = "flags";              // uint64
+inline constexpr std::string_view kRules = "rules";              // dictionary of match rules
+inline constexpr std::string_view kAnnotations = "annotations";  // dictionary
+inline constexpr std::string_view kErrorCode = "errorcode";      // uint64, in a failed reply
+inline constexpr std::string_view kError = "error";              // string, in a failed reply
+inline constexpr std::string_view kMatches = "matches";          // array of plug-in forms, in a "match" reply
+inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
+}  // namespace key
+
+// Entries of a plug-in's form, the dictionary a "match" reply carries per plug-in under key::kMatches.
+namespace form {
+inline constexpr std::string_view kHubProtocolVersion = "hubProtocolVersion";
+inline constexpr std::string_view kPath = "path";
+inline constexpr std::string_view kSystemResident = "systemResident";
+inline constexpr std::string_view kIdentifier = "identifier";
+inline constexpr std::string_view kOriginalIdentifier = "original-identifier";
+inline constexpr std::string_view kVersion = "version";
+inline constexpr std::string_view kBundleInfo = "bundleInfo";
+inline constexpr std::string_view kInfo = "info";
+inline constexpr std::string_view kUuid = "uuid";
+inline constexpr std::string_view kLastModified = "lastmodified";
+inline constexpr std::string_view kAnnotations = "annotations";
+inline constexpr std::string_view kEntitlements = "entitlements";
+inline constexpr std::string_view kContainingPath = "containingPath";
+inline constexpr std::string_view kLocalizedContainingDisplayName = "localizedContainingDisplayName";
+inline constexpr std::string_view kLocalizedDisplayName = "localizedDisplayName";
+inline constexpr std::string_view kLocalizedShortName = "localizedShortName";
+inline constexpr std::string_view kHash = "hash";
+inline constexpr std::string_view kRequirement = "requirement";
+inline constexpr std::string_view kExtensions = "extensions";  // resource name -> read-only access token
+inline constexpr std::string_view kOverrider = "overrider";    // UUID text of the plug-in that replaces this one
+inline constexpr std::string_view kOverriding = "overriding";  // identifier of the plug-in this one replaces
+}  // namespace form
+
+// The codes of failed replies and of the errors the system makes (domain "Bexil"); 0 is success.
+enum class ErrorCode : int {
+    // The registry refused a registration change, or a plug-in named by UUID text is unknown.
+    RegistryRefused = 2,
+    // A malformed request...
+    InvalidRequest = 4,
+    // ... or, with the same code, an operation that failed inside the daemon.
+    OperationFailed = 4,
+    // An interface specification text is malformed.
+    BadInterfaceSpec = 6,
+    // The protocol version, or a stored document's version, is not the expected one.
+    VersionMismatch = 7,
+    // A bad path, or nothing at the path.
+    BadPath = 9,
+    // The caller is not allowed.
+    NotAllowed = 11,
+    // The plug-in's configuration is invalid or unsupported.
+    InvalidConfiguration = 12,
+    // Plug-ins are busy.
+    PlugInsBusy = 14,
+    // A bulk annotation entry is malformed.
+    BadBulkAnnotation = 18,
+};
+
+// Every code once (OperationFailed shares InvalidRequest's).
+inline constexpr std::array<ErrorCode, 9> kErrorCodes{
+    ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest, ErrorCode::BadInterfaceSpec,
+    ErrorCode::VersionMismatch,      ErrorCode::BadPath,        ErrorCode::NotAllowed,
+    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,    ErrorCode::BadBulkAnnotation};
+
+constexpr int codeOf(ErrorCode code) { return static_cast<int>(code); }
+
+// Flag bits of "match" (key::kFlags).
+namespace discover {
+inline constexpr uint64_t kAllVersions = 0x1;   // every version of an identifier, not only the best one
+inline constexpr uint64_t kAllInstances = 0x4;  // with kAllVersions: also copies of the same identifier and version
+inline constexpr uint64_t kSystemOnly = 0x8;    // only plug-ins on the system volume
+inline constexpr uint64_t kAll = 0x200;         // skip visibility, holds and host policy (manager, not sandboxed, only)
+}  // namespace discover
+
+// Flag bits of "lock" (key::kFlags).
+namespace hold {
+inline constexpr uint64_t kPlugInPaths = 0x1;  // the paths name plug-ins, not applications
+inline constexpr uint64_t kRefuseBusy = 0x2;   // refuse with ErrorCode::PlugInsBusy when a plug-in is in use
+inline constexpr uint64_t kTerminate = 0x4;    // end the held plug-ins' running instances before answering
+}  // namespace hold
+
+}  // namespace bexil::protocol
