@@ -79,7 +79,16 @@ inline constexpr std::string_view kErrorCode = "errorcode";      // uint64, in a
 inline constexpr std::string_view kError = "error";              // string, in a failed reply
 inline constexpr std::string_view kMatches = "matches";          // array of plug-in forms, in a "match" reply
 inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
+inline constexpr std::array kList{kRequest,     kVersion,   kPaths, kUuids,   kFlags,    kRules,
+                                  kAnnotations, kErrorCode, kError, kMatches, kConflicts};
 }  // namespace key
+
+// Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").
+namespace annotation {
+inline constexpr std::string_view kElection = "election";    // number: the user's election (docs/annotations.md)
+inline constexpr std::string_view kExtension = "extension";  // dictionary, stored for the plug-in as it is
+inline constexpr std::array kList{kElection, kExtension};
+}  // namespace annotation
 
 // Entries of a plug-in's form, the dictionary a "match" reply carries per plug-in under key::kMatches.
 namespace form {
@@ -104,6 +113,27 @@ inline constexpr std::string_view kRequirement = "requirement";
 inline constexpr std::string_view kExtensions = "extensions";  // resource name -> read-only access token
 inline constexpr std::string_view kOverrider = "overrider";    // UUID text of the plug-in that replaces this one
 inline constexpr std::string_view kOverriding = "overriding";  // identifier of the plug-in this one replaces
+inline constexpr std::array kList{kHubProtocolVersion,
+                                  kPath,
+                                  kSystemResident,
+                                  kIdentifier,
+                                  kOriginalIdentifier,
+                                  kVersion,
+                                  kBundleInfo,
+                                  kInfo,
+                                  kUuid,
+                                  kLastModified,
+                                  kAnnotations,
+                                  kEntitlements,
+                                  kContainingPath,
+                                  kLocalizedContainingDisplayName,
+                                  kLocalizedDisplayName,
+                                  kLocalizedShortName,
+                                  kHash,
+                                  kRequirement,
+                                  kExtensions,
+                                  kOverrider,
+                                  kOverriding};
 }  // namespace form
 
 // The codes of failed replies and of the errors the system makes (domain "Bexil"); 0 is success.
@@ -144,6 +174,7 @@ inline constexpr uint64_t kAllVersions = 0x1;   // every version of an identifie
 inline constexpr uint64_t kAllInstances = 0x4;  // with kAllVersions: also copies of the same identifier and version
 inline constexpr uint64_t kSystemOnly = 0x8;    // only plug-ins on the system volume
 inline constexpr uint64_t kAll = 0x200;         // skip visibility, holds and host policy (manager, not sandboxed, only)
+inline constexpr std::array kBits{kAllVersions, kAllInstances, kSystemOnly, kAll};
 }  // namespace discover
 
 // Flag bits of "lock" (key::kFlags).
@@ -151,6 +182,7 @@ namespace hold {
 inline constexpr uint64_t kPlugInPaths = 0x1;  // the paths name plug-ins, not applications
 inline constexpr uint64_t kRefuseBusy = 0x2;   // refuse with ErrorCode::PlugInsBusy when a plug-in is in use
 inline constexpr uint64_t kTerminate = 0x4;    // end the held plug-ins' running instances before answering
+inline constexpr std::array kBits{kPlugInPaths, kRefuseBusy, kTerminate};
 }  // namespace hold
 
 }  // namespace bexil::protocol

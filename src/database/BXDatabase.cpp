@@ -24,7 +24,7 @@ namespace bexil {
 
 namespace {
 
-constexpr std::string_view kAnnotationsFormKey = "annotations";
+constexpr std::string_view kAnnotationsFormKey = protocol::form::kAnnotations;
 
 std::string pathOf(const std::shared_ptr<const LXBexilProxy>& proxy) { return proxy->bundleURL().value_or("(null)"); }
 

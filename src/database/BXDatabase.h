@@ -37,7 +37,7 @@ class BXDatabase {
     // Posted (without payload) after a client's annotation changes and after hold changes.
     static constexpr std::string_view kAnnotationChangeNotification = protocol::kAnnotationChangeNotification;
     // The annotation "election" key and the value automatic election stores.
-    static constexpr std::string_view kElectionKey = "election";
+    static constexpr std::string_view kElectionKey = protocol::annotation::kElection;
     static constexpr int64_t kAutoElection = 1;
 
     // Posts a named system notification; the default posts through the platform's notification folder.

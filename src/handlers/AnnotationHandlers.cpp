@@ -20,8 +20,8 @@ namespace bexil {
 namespace {
 
 constexpr std::string_view kAnnotationsKey = protocol::key::kAnnotations;
-constexpr std::string_view kElectionKey = "election";
-constexpr std::string_view kExtensionKey = "extension";
+constexpr std::string_view kElectionKey = protocol::annotation::kElection;
+constexpr std::string_view kExtensionKey = protocol::annotation::kExtension;
 
 // An election must be numeric. A boolean is not accepted: the stored election is compared as a number by readers,
 // and "true" would silently read back as the automatic election.

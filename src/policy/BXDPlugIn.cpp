@@ -6,6 +6,7 @@
 #include <cstring>
 #include <limits>
 
+#include "bexil/Protocol.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
@@ -20,7 +21,7 @@ constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
 constexpr std::string_view kOldStyleInfoKey = "Bexil";
 constexpr std::string_view kDebugToolPrefix = "DT";
 constexpr std::string_view kSharedKey = "Shared";
-constexpr std::string_view kExtensionsFormKey = "extensions";
+constexpr std::string_view kExtensionsFormKey = protocol::form::kExtensions;
 constexpr std::string_view kWholeBundle = ".";
 
 // Seconds since 1970 with the fraction dropped, held to the range of the 32-bit field rather than wrapping.

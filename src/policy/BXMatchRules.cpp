@@ -5,6 +5,7 @@
 #include <limits>
 #include <optional>
 
+#include "bexil/Protocol.h"
 #include "model/BXUtilities.h"
 #include "platform/log/Log.h"
 
@@ -161,7 +162,7 @@ bool BXMatchRules::matchDictionaryPattern(const Value& value, const Value& patte
 }
 
 int32_t BXMatchRules::electionFromAnnotation(const Value& annotation) {
-    const Value* election = annotation.find("election");
+    const Value* election = annotation.find(protocol::annotation::kElection);
     if (election == nullptr) return 0;
     switch (election->kind()) {
         case ValueKind::Bool:

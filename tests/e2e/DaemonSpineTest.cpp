@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "E2eSupport.h"
+#include "ProtocolDocument.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 
@@ -38,6 +39,20 @@ class RawSocket {
     void write(const std::vector<uint8_t>& bytes) { (void)!::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL); }
     void closeNow() {
         if (fd_ >= 0) ::close(std::exchange(fd_, -1));
+    }
+    // Exactly `count` bytes, or fewer when the peer closes or 5 s pass without any.
+    std::vector<uint8_t> read(size_t count) {
+        timeval tv{5, 0};
+        setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+        std::vector<uint8_t> bytes(count);
+        size_t got = 0;
+        while (got < count) {
+            ssize_t n = ::recv(fd_, bytes.data() + got, count - got, 0);
+            if (n <= 0) break;
+            got += static_cast<size_t>(n);
+        }
+        bytes.resize(got);
+        return bytes;
     }
     // True when the daemon closed the connection (a read gives 0 or an error other than the time limit) in 5 s.
     bool closedByPeer() {
@@ -186,6 +201,28 @@ TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
     for (const char* name : {"Add", ""}) expectFailure(request(name), 4, "unrecognized request");
     for (const char* name : {"ready", "access", "lock"})
         expectFailure(request(name), 4, std::string("the \"") + name + "\" operation is not available yet");
+}
+
+// Guards the worked example of docs/protocol.md as a client written from it would meet it: its request frame, sent
+// with version 4 on a fresh connection, gets exactly the documented reply frame, whose serial is the daemon's first.
+TEST_F(BxdEnvelope, TheDocumentedExampleIsWhatBxdAnswers) {
+    std::vector<uint8_t> request = test::documentedBytes("request-frame");
+    std::vector<uint8_t> expected = test::documentedBytes("reply-frame");
+    ASSERT_GT(expected.size(), ZemFrame::kHeaderBytes);
+    ASSERT_EQ(request.back(), 3) << "the example's last byte is its version";
+    request.back() = 4;
+    RawSocket socket(bxd_.socketPath());
+    socket.write(request);
+    EXPECT_EQ(socket.read(expected.size()), expected);
+
+    // The daemon numbers its frames on each connection: the second reply carries serial 2.
+    constexpr size_t kSerial = 8, kInReplyTo = 16;  // header offsets; the numbers are little-endian
+    request[kSerial] = 2;
+    socket.write(request);
+    std::vector<uint8_t> second = socket.read(expected.size());
+    ASSERT_EQ(second.size(), expected.size());
+    EXPECT_EQ(second[kSerial], 2) << "serial";
+    EXPECT_EQ(second[kInReplyTo], 2) << "in-reply-to";
 }
 
 // Guards a client that hangs up while its requests wait behind another client's: none of them runs. bxd is held

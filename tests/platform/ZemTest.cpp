@@ -12,6 +12,7 @@
 #include <tuple>
 #include <vector>
 
+#include "ProtocolDocument.h"
 #include "ZemStrictEqual.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
@@ -29,13 +30,7 @@ Bytes encodeOrDie(const Value& v) {
     return bytes.ok() ? bytes.value() : Bytes{};
 }
 
-Bytes hex(std::string_view text) {
-    Bytes out;
-    std::istringstream in{std::string(text)};
-    std::string byte;
-    while (in >> byte) out.push_back(static_cast<uint8_t>(std::stoul(byte, nullptr, 16)));
-    return out;
-}
+Bytes hex(std::string_view text) { return test::hexBytes(text); }
 
 // Decodes and expects failure with the given code.
 void expectError(const Bytes& bytes, ZemErrorCode code) {
@@ -204,22 +199,6 @@ TEST(ZemCodec, NestingCountsAndLengthsBeyondTheInputFailBeforeAllocating) {
     expectError(chain, ZemErrorCode::Truncated);
 }
 
-// The bytes of a "```hex NAME" block of docs/protocol.md; annotations after '#' are ignored.
-Bytes documentedBytes(const std::string& name) {
-    std::ifstream in(std::string(BEXIL_SOURCE_DIR) + "/docs/protocol.md");
-    std::string line, text;
-    bool inside = false;
-    while (std::getline(in, line)) {
-        if (!inside) {
-            inside = line == "```hex " + name;
-            continue;
-        }
-        if (line.starts_with("```")) break;
-        text += line.substr(0, line.find('#')) + " ";
-    }
-    return hex(text);
-}
-
 // The frames in docs/protocol.md are what other implementations are written against.
 TEST(ZemCodec, DocumentedExampleMatchesEncoder) {
     Value request = Value::dictionary({
@@ -235,8 +214,8 @@ TEST(ZemCodec, DocumentedExampleMatchesEncoder) {
     Bytes requestFrame, replyFrame;
     ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 1, 0, request, requestFrame));
     ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Reply, 1, 1, reply, replyFrame));
-    EXPECT_EQ(documentedBytes("request-frame"), requestFrame);
-    EXPECT_EQ(documentedBytes("reply-frame"), replyFrame);
+    EXPECT_EQ(test::documentedBytes("request-frame"), requestFrame);
+    EXPECT_EQ(test::documentedBytes("reply-frame"), replyFrame);
 }
 
 // ---- Frames ----

@@ -91,9 +91,8 @@ void ZemSocketConnection::deliverTerminationImminent() {
 }
 
 void ZemSocketConnection::send(const Value& message) {
-    queue_.async([self = shared_from_this(), message] {
-        self->enqueueFrame(ZemFrameKind::Message, 0, 0, message, std::nullopt);
-    });
+    queue_.async(
+        [self = shared_from_this(), message] { self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt); });
 }
 
 void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& reply) {
@@ -105,13 +104,13 @@ void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& repl
     // Usually called from the request queue on the loop's own thread: the reply is then encoded and written at once
     // instead of taking another turn of the loop (which costs a reactor poll, more than the whole reply).
     queue_.dispatch([self = shared_from_this(), serial = request.serial(), reply] {
-        self->enqueueFrame(ZemFrameKind::Reply, 0, serial, reply, std::nullopt);
+        self->enqueueFrame(ZemFrameKind::Reply, serial, reply, std::nullopt);
     });
 }
 
 void ZemSocketConnection::sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) {
     queue_.async([self = shared_from_this(), message, pending = PendingReply{replyQueue, std::move(handler)}] {
-        self->enqueueFrame(ZemFrameKind::Request, 0, 0, message, pending);
+        self->enqueueFrame(ZemFrameKind::Request, 0, message, pending);
     });
 }
 
@@ -207,7 +206,7 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
     }
 }
 
-void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
+void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
                                        std::optional<PendingReply> pending) {
     if (side_ == Side::Client && state_ == State::Interrupted) {
         // The service went away earlier; a new message tries to reach it again.
@@ -222,7 +221,8 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t serial, uint6
         if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
         return;
     }
-    if (kind != ZemFrameKind::Reply) serial = nextSerial_++;
+    // Every frame this side sends takes the next serial, replies too, so a peer can tell our frames apart by it.
+    const uint64_t serial = nextSerial_++;
     if (std::optional<Error> error = ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_)) {
         log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(kind), static_cast<int>(pid_), *error);
         if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);

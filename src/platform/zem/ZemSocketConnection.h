@@ -74,8 +74,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void readMore();
     void onRead(const asio::error_code& error, size_t bytes);
     void handleFrame(ZemFrame frame);
-    void enqueueFrame(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                      std::optional<PendingReply> pending);
+    void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending);
     void writeMore();
     void onWritten(const asio::error_code& error, size_t bytes);
     // Ends the connection because of `why` (logged when it is a protocol violation or a limit).
