@@ -53,7 +53,7 @@ struct Fixture {
         for (const char* name : {"Hello", "Bonjour", "NightTheme"}) {
             std::string path = (root / "Greeter.app/PlugIns" / (std::string(name) + ".bxplugin")).string();
             (void)database->addPlugIn(path);
-            uuids.push_back(*workspace->pluginProxyForURL(path)->pluginUUID());
+            uuids.push_back(*workspace->plugInProxyForURL(path)->pluginUUID());
         }
     }
     ~Fixture() {
@@ -159,7 +159,7 @@ void BM_CacheMemory(benchmark::State& state) {
         std::vector<std::shared_ptr<const LXBexilProxy>> proxies;
         proxies.reserve(f.registry.uuids.size());
         size_t heapNoProxies = heapInUse();
-        for (const Uuid& uuid : f.registry.uuids) proxies.push_back(f.workspace->pluginProxyForUUID(uuid));
+        for (const Uuid& uuid : f.registry.uuids) proxies.push_back(f.workspace->plugInProxyForUUID(uuid));
         perRecordProxy = (static_cast<double>(heapInUse()) - static_cast<double>(heapNoProxies)) / n;
     }
     state.counters["records"] = static_cast<double>(f.registry.uuids.size());

@@ -156,7 +156,7 @@ void lookUpByUuid(benchmark::State& state, bool readDictionaries) {
     auto workspace = LedgerixWorkspace::open(options(f.largeState())).value();
     std::mt19937 random(7);
     for (auto _ : state) {
-        auto proxy = workspace->pluginProxyForUUID(f.uuids[random() % f.uuids.size()]);
+        auto proxy = workspace->plugInProxyForUUID(f.uuids[random() % f.uuids.size()]);
         if (!proxy) state.SkipWithError("missing record");
         if (readDictionaries) benchmark::DoNotOptimize(proxy->bexilDictionary());
         benchmark::DoNotOptimize(proxy);

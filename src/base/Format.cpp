@@ -267,7 +267,8 @@ std::string formatPrintfRuntime(std::string_view format, std::span<const FormatA
         int width = s.width, precision = s.precision;
         bool leftAlign = s.leftAlign;
         bool broken = false;
-        auto star = [&](int& into, bool isWidth) {
+        enum class Star { Width, Precision };
+        auto star = [&](int& into, Star which) {
             if (next >= args.size()) {
                 broken = true;
                 return;
@@ -281,14 +282,14 @@ std::string formatPrintfRuntime(std::string_view format, std::span<const FormatA
             int64_t v = a.kind() == FormatArg::Kind::Signed
                             ? std::clamp<int64_t>(a.signedValue(), -format_detail::kMaxWidth, format_detail::kMaxWidth)
                             : static_cast<int64_t>(std::min<uint64_t>(a.unsignedValue(), format_detail::kMaxWidth));
-            if (isWidth && v < 0) {
+            if (which == Star::Width && v < 0) {
                 leftAlign = true;
                 v = -v;
             }
             into = v < 0 ? -1 : static_cast<int>(v);
         };
-        if (s.widthStar) star(width, true);
-        if (s.precisionStar) star(precision, false);
+        if (s.widthStar) star(width, Star::Width);
+        if (s.precisionStar) star(precision, Star::Precision);
         if (next >= args.size()) {
             out += '<';
             out += written;

@@ -267,11 +267,12 @@ consteval void checkFormat(const char* format) {
     constexpr unsigned kinds[] = {categoriesOf<Args>()..., 0u};
     std::string_view text(format);
     size_t next = 0;
-    auto take = [&](unsigned accepted, bool star) {
+    enum class Slot { Star, Value };
+    auto take = [&](unsigned accepted, Slot slot) {
         if (next >= sizeof...(Args)) format_has_more_conversions_than_arguments();
         unsigned kind = kinds[next++];
         if (kind == 0 || (kind & ~accepted) != 0) {
-            if (star) format_width_or_precision_star_needs_an_integer();
+            if (slot == Slot::Star) format_width_or_precision_star_needs_an_integer();
             format_argument_has_the_wrong_kind_for_its_conversion();
         }
     };
@@ -281,9 +282,9 @@ consteval void checkFormat(const char* format) {
         if (!s.ok) format_has_a_malformed_conversion();
         i = s.end - 1;
         if (s.percent) continue;
-        if (s.widthStar) take(kInteger, true);
-        if (s.precisionStar) take(kInteger, true);
-        take(acceptedBy(s.conversion), false);
+        if (s.widthStar) take(kInteger, Slot::Star);
+        if (s.precisionStar) take(kInteger, Slot::Star);
+        take(acceptedBy(s.conversion), Slot::Value);
     }
     if (next != sizeof...(Args)) format_has_more_arguments_than_conversions();
 }

@@ -6,8 +6,8 @@
 
 namespace bexil::detail {
 
-void failQueueAssertion(std::string_view label, bool expectedOnQueue, const char* file, int line) {
-    std::string message = expectedOnQueue ? "not on queue \"" : "unexpectedly on queue \"";
+void failQueueAssertion(std::string_view label, QueueExpectation expected, const char* file, int line) {
+    std::string message = expected == QueueExpectation::OnQueue ? "not on queue \"" : "unexpectedly on queue \"";
     message.append(label);
     message.append("\" at ");
     message.append(file);

@@ -8,20 +8,23 @@
 
 namespace bexil::detail {
 
-[[noreturn]] void failQueueAssertion(std::string_view label, bool expectedOnQueue, const char* file, int line);
+enum class QueueExpectation { OnQueue, OffQueue };
+[[noreturn]] void failQueueAssertion(std::string_view label, QueueExpectation expected, const char* file, int line);
 
 }  // namespace bexil::detail
 
-#define BX_ASSERT_ON_QUEUE(queue)                                                                  \
-    do {                                                                                           \
-        const auto& bxAssertQueue_ = (queue);                                                      \
-        if (!bxAssertQueue_.isCurrent())                                                           \
-            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), true, __FILE__, __LINE__); \
+#define BX_ASSERT_ON_QUEUE(queue)                                                                                   \
+    do {                                                                                                            \
+        const auto& bxAssertQueue_ = (queue);                                                                       \
+        if (!bxAssertQueue_.isCurrent())                                                                            \
+            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), ::bexil::detail::QueueExpectation::OnQueue, \
+                                                __FILE__, __LINE__);                                                \
     } while (false)
 
-#define BX_ASSERT_NOT_ON_QUEUE(queue)                                                               \
-    do {                                                                                            \
-        const auto& bxAssertQueue_ = (queue);                                                       \
-        if (bxAssertQueue_.isCurrent())                                                             \
-            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), false, __FILE__, __LINE__); \
+#define BX_ASSERT_NOT_ON_QUEUE(queue)                                                                                \
+    do {                                                                                                             \
+        const auto& bxAssertQueue_ = (queue);                                                                        \
+        if (bxAssertQueue_.isCurrent())                                                                              \
+            ::bexil::detail::failQueueAssertion(bxAssertQueue_.label(), ::bexil::detail::QueueExpectation::OffQueue, \
+                                                __FILE__, __LINE__);                                                 \
     } while (false)

@@ -18,7 +18,8 @@
 
 namespace bexil {
 
-static std::atomic<BXDServer*> gServer{nullptr};
+// The server of this process, as BXDServer::server() answers it.
+static std::atomic<BXDServer*> runningServer{nullptr};
 
 // How long bxd lingers after SIGTERM so that termination-imminent events reach every connection queue.
 static constexpr auto kTerminationGrace = std::chrono::milliseconds(50);
@@ -33,7 +34,7 @@ BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
 BXDServer::~BXDServer() {
     if (service_) service_->cancel();
     BXDServer* self = this;
-    gServer.compare_exchange_strong(self, nullptr);
+    runningServer.compare_exchange_strong(self, nullptr);
 }
 
 std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* serviceName, const char* databasePath,
@@ -51,7 +52,7 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
     }
     server->service_ = *listener;
 
-    gServer.store(server.get());
+    runningServer.store(server.get());
     server->setDelegate(server.get());
 
     BXDServer* raw = server.get();
@@ -71,7 +72,7 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
     return server;
 }
 
-BXDServer* BXDServer::server() { return gServer.load(); }
+BXDServer* BXDServer::server() { return runningServer.load(); }
 
 void BXDServer::run() {
     service_->resume();

@@ -43,7 +43,7 @@ void BXDZemClient::start() {
         log::ops().debug("client %d is inside bundle %s (%s)", static_cast<int>(peer), bundle_->path()->c_str(),
                          bundle_->bundleIdentifier().value_or("no identifier").c_str());
 
-    _task = identity;
+    codeSigningIdentity_ = identity;
 
     // The connection owns the client from here on; its finalizer lets go once the connection has ended.
     connection->setContext(shared_from_this());
@@ -107,11 +107,11 @@ pid_t BXDZemClient::pid() const {
 }
 
 Value BXDZemClient::entitlementValueForKey(std::string_view key) const {
-    if (!_task) {
+    if (!codeSigningIdentity_) {
         log::ops().error("error retrieving entitlements for client %d", static_cast<int>(pid()));
         return Value();
     }
-    Result<Value> value = _task->entitlementValueForKey(key);
+    Result<Value> value = codeSigningIdentity_->entitlementValueForKey(key);
     if (!value) {
         log::ops().error("error retrieving entitlements for client %d", static_cast<int>(pid()));
         return Value();

@@ -68,7 +68,7 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     std::shared_ptr<BXBundle> bundle_;
     std::atomic<bool> acceptWork_{true};
     std::atomic<bool> deathNoted_{false};
-    std::shared_ptr<const CodeSigningIdentity> _task;
+    std::shared_ptr<const CodeSigningIdentity> codeSigningIdentity_;
     unsigned requestCount_ = 0;  // request queue only
 };
 

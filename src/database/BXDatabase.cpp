@@ -53,11 +53,11 @@ class BXDatabase::AnnotationReader final : public BXAnnotationSource {
 class BXDatabase::Observer final : public LXApplicationWorkspaceObserverProtocol {
   public:
     explicit Observer(BXDatabase& database) : database_(database) {}
-    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) override {
-        database_.pluginsDidInstall(plugins);
+    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override {
+        database_.pluginsDidInstall(plugIns);
     }
-    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) override {
-        database_.pluginsWillUninstall(plugins);
+    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override {
+        database_.pluginsWillUninstall(plugIns);
     }
 
   private:
@@ -153,7 +153,7 @@ std::shared_ptr<BXDPlugIn> BXDatabase::findPlugIn(const Uuid& uuid) {
     return _sync.sync([&]() -> std::shared_ptr<BXDPlugIn> {
         auto hit = cache_.find(uuid);
         if (hit != cache_.end()) return hit->second;
-        if (std::shared_ptr<const LXBexilProxy> proxy = workspace_->pluginProxyForUUID(uuid))
+        if (std::shared_ptr<const LXBexilProxy> proxy = workspace_->plugInProxyForUUID(uuid))
             return createPlugInForProxy(proxy);
         log::ops().info("Ledgerix cannot find plug-in with UUID:%{public}@", uuid.string());
         return nullptr;
@@ -161,7 +161,7 @@ std::shared_ptr<BXDPlugIn> BXDatabase::findPlugIn(const Uuid& uuid) {
 }
 
 std::shared_ptr<BXDPlugIn> BXDatabase::findPlugInAtPath(std::string_view url) {
-    std::shared_ptr<const LXBexilProxy> proxy = workspace_->pluginProxyForURL(url);
+    std::shared_ptr<const LXBexilProxy> proxy = workspace_->plugInProxyForURL(url);
     if (!proxy) {
         log::ops().info("Ledgerix cannot find plug-in at path:%@", url);
         return nullptr;
@@ -173,9 +173,9 @@ std::shared_ptr<BXDPlugIn> BXDatabase::findPlugInAtPath(std::string_view url) {
 
 std::optional<std::vector<std::shared_ptr<BXDPlugIn>>> BXDatabase::plugInsWithinApplication(std::string_view url) {
     std::shared_ptr<const LXApplicationProxy> application = workspace_->applicationProxyForBundleURL(url);
-    if (!application || application->plugins().empty()) return std::nullopt;
+    if (!application || application->plugIns().empty()) return std::nullopt;
     std::vector<std::shared_ptr<BXDPlugIn>> plugIns;
-    for (const std::shared_ptr<const LXBexilProxy>& proxy : application->plugins()) {
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : application->plugIns()) {
         if (std::shared_ptr<BXDPlugIn> plugIn = plugInForProxy(proxy)) plugIns.push_back(std::move(plugIn));
     }
     return plugIns;
@@ -326,22 +326,22 @@ void BXDatabase::autoElect(const BXDPlugIn& plugIn) {
 
 // ---- Registry events ----
 
-void BXDatabase::pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) {
-    for (const std::shared_ptr<const LXBexilProxy>& proxy : plugins) {
+void BXDatabase::pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : plugIns) {
         log::ops().notice("plug-in INSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
                           proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
     }
 }
 
-void BXDatabase::pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) {
+void BXDatabase::pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
     _sync.sync([&] {
-        for (const std::shared_ptr<const LXBexilProxy>& proxy : plugins) {
+        for (const std::shared_ptr<const LXBexilProxy>& proxy : plugIns) {
             log::ops().notice("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
                               proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
             if (proxy->pluginUUID()) cache_.erase(*proxy->pluginUUID());
         }
     });
-    if (BXDatabaseDelegate* target = delegate()) target->removedPlugIns(plugins);
+    if (BXDatabaseDelegate* target = delegate()) target->removedPlugIns(plugIns);
 }
 
 }  // namespace bexil

@@ -130,9 +130,9 @@ class BXDatabase {
 
     // ---- Registry events ----
 
-    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins);
+    void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns);
     // Drops the records from the cache inside `_sync`, then tells the delegate outside it.
-    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins);
+    void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns);
 
   protected:
     // initWithDatabase: remembers the path; initWithDatabase() then opens the registry and the store.

@@ -30,8 +30,8 @@ class ScriptedWorkspace : public LXApplicationWorkspace {
     }
     std::optional<Error> unregisterPlugin(std::string_view) override { return Error("test", 1, "not supported"); }
     void LXClearSchemaCaches() override {}
-    std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid&) override { return nullptr; }
-    std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view) override { return nullptr; }
+    std::shared_ptr<const LXBexilProxy> plugInProxyForUUID(const Uuid&) override { return nullptr; }
+    std::shared_ptr<const LXBexilProxy> plugInProxyForURL(std::string_view) override { return nullptr; }
     std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view) override {
         return nullptr;
     }

@@ -121,7 +121,7 @@ TEST_F(BXDatabaseTest, LookUpsFindAnInstalledPlugInAsOneCachedRecordAndUnknownOn
     std::shared_ptr<BXDPlugIn> byPath = database_->findPlugInAtPath(hello());
     ASSERT_NE(byPath, nullptr);
     EXPECT_EQ(database_->findPlugIn(*byPath->uuid()).get(), byPath.get());
-    EXPECT_EQ(database_->plugInForProxy(workspace_->pluginProxyForURL(hello())).get(), byPath.get());
+    EXPECT_EQ(database_->plugInForProxy(workspace_->plugInProxyForURL(hello())).get(), byPath.get());
     EXPECT_EQ(database_->cachedCount(), 1u);
 
     // A misconfigured plug-in registers but is never built, nor cached, so a later look-up tries again.
@@ -134,7 +134,7 @@ TEST_F(BXDatabaseTest, LookUpsFindAnInstalledPlugInAsOneCachedRecordAndUnknownOn
 // Guards the lock discipline: what must run under the database's lock refuses to run outside it.
 TEST_F(BXDatabaseTest, CreatingOutsideTheLockIsAnInternalInconsistency) {
     ASSERT_FALSE(database_->addPlugIn(hello()));
-    EXPECT_THROW(database_->createPlugInForProxy(workspace_->pluginProxyForURL(hello())), InternalInconsistency);
+    EXPECT_THROW(database_->createPlugInForProxy(workspace_->plugInProxyForURL(hello())), InternalInconsistency);
     EXPECT_THROW(database_->purgeCachesToLimit(0), InternalInconsistency);
 }
 

@@ -193,7 +193,7 @@ class DaemonTest : public ::testing::Test {
             ADD_FAILURE() << registry.error().description();
             return std::nullopt;
         }
-        auto proxy = (*registry)->pluginProxyForURL(path);
+        auto proxy = (*registry)->plugInProxyForURL(path);
         return proxy ? proxy->pluginUUID() : std::nullopt;
     }
 

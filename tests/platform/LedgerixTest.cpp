@@ -48,15 +48,15 @@ struct TestBundle {
 class RecordingObserver : public LXApplicationWorkspaceObserverProtocol {
   public:
     explicit RecordingObserver(LedgerixWorkspace* workspace) : workspace_(workspace) {}
-    void pluginsDidInstall(const LXProxyList& plugins) override {
+    void pluginsDidInstall(const LXProxyList& plugIns) override {
         std::lock_guard lock(mutex_);
-        for (const auto& p : plugins) events_.push_back("install " + p->pluginUUID()->string());
+        for (const auto& p : plugIns) events_.push_back("install " + p->pluginUUID()->string());
     }
-    void pluginsWillUninstall(const LXProxyList& plugins) override {
+    void pluginsWillUninstall(const LXProxyList& plugIns) override {
         // Looking records up from inside the callback must work: the registry holds no lock here.
-        bool stillThere = workspace_->pluginProxyForUUID(*plugins.front()->pluginUUID()) != nullptr;
+        bool stillThere = workspace_->plugInProxyForUUID(*plugIns.front()->pluginUUID()) != nullptr;
         std::lock_guard lock(mutex_);
-        for (const auto& p : plugins) events_.push_back("uninstall " + p->pluginUUID()->string());
+        for (const auto& p : plugIns) events_.push_back("uninstall " + p->pluginUUID()->string());
         uninstallsSeenRegistered += stillThere ? 1 : 0;
     }
     std::vector<std::string> snapshot() {
@@ -158,7 +158,7 @@ TEST_F(LedgerixRegistrationTest, DataOrNamelessPlugInGetsNoContainerAndApplicati
 
     auto app = workspace_->applicationProxyForBundleURL((kExamples / "Notes.app").string());
     ASSERT_TRUE(app);
-    EXPECT_EQ(app->plugins().size(), 2u);
+    EXPECT_EQ(app->plugIns().size(), 2u);
 
     EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Clipper.wexa").string()));
     EXPECT_FALSE(workspace_->unregisterPlugin((kExamples / "Notes.app/PlugIns/Stationery.bxplugin").string()));
@@ -170,18 +170,18 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
     fs::path bundle = writePlugIn(bundles_ / "A.app/PlugIns/One.bxplugin", {.identifier = "com.example.one"});
     auto proxy = registerOK(bundle);
     ASSERT_TRUE(proxy);
-    ASSERT_TRUE(workspace_->pluginProxyForUUID(*proxy->pluginUUID()));
-    EXPECT_FALSE(workspace_->pluginProxyForUUID(Uuid::random()));
+    ASSERT_TRUE(workspace_->plugInProxyForUUID(*proxy->pluginUUID()));
+    EXPECT_FALSE(workspace_->plugInProxyForUUID(Uuid::random()));
 
     fs::create_directory_symlink(bundle, dir_ / "link.bxplugin");
     for (std::string form :
          {bundle.string(), "file://" + bundle.string(), bundle.string() + "/",
           (bundles_ / "A.app/PlugIns/../PlugIns/One.bxplugin").string(), (dir_ / "link.bxplugin").string()}) {
-        auto found = workspace_->pluginProxyForURL(form);
+        auto found = workspace_->plugInProxyForURL(form);
         ASSERT_TRUE(found) << form;
         EXPECT_EQ(found->pluginUUID(), proxy->pluginUUID()) << form;
     }
-    EXPECT_FALSE(workspace_->pluginProxyForURL("relative/One.bxplugin"));
+    EXPECT_FALSE(workspace_->plugInProxyForURL("relative/One.bxplugin"));
 }
 
 // Guards unregistering a bundle already deleted (announced, looked-up-able during the announcement), and the
@@ -192,7 +192,7 @@ TEST_F(LedgerixRegistrationTest, UnregisterWorksAfterTheBundleIsGoneAndRefusesUn
     fs::remove_all(bundles_ / "A.app");
     EXPECT_FALSE(workspace_->unregisterPlugin(bundle.string()));
     EXPECT_EQ(count(), 0u);
-    EXPECT_FALSE(workspace_->pluginProxyForUUID(*proxy->pluginUUID()));
+    EXPECT_FALSE(workspace_->plugInProxyForUUID(*proxy->pluginUUID()));
     EXPECT_EQ(observer_->snapshot(), (std::vector<std::string>{"install " + proxy->pluginUUID()->string(),
                                                                "uninstall " + proxy->pluginUUID()->string()}));
     EXPECT_EQ(observer_->uninstallsSeenRegistered, 1);
@@ -216,7 +216,7 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     auto worker = [&](int offset) {
         for (int i = offset; i < 2 * kPerThread; i += 2) {
             if (!workspace_->registerPlugin(paths[i].string()).ok()) ++failures;
-            if (!workspace_->pluginProxyForURL(paths[i].string())) ++failures;
+            if (!workspace_->plugInProxyForURL(paths[i].string())) ++failures;
         }
     };
     std::thread a(worker, 0), b(worker, 1);
@@ -224,7 +224,7 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     b.join();
     EXPECT_EQ(failures, 0);
     EXPECT_EQ(count(), paths.size());
-    EXPECT_EQ(workspace_->applicationProxyForBundleURL((bundles_ / "App.app").string())->plugins().size(),
+    EXPECT_EQ(workspace_->applicationProxyForBundleURL((bundles_ / "App.app").string())->plugIns().size(),
               paths.size());
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
@@ -265,7 +265,7 @@ TEST_F(LedgerixReRegistrationTest, NewVersionIsUninstallThenInstallUnderANewUuid
     EXPECT_EQ(observer_->snapshot(), (std::vector<std::string>{"install " + one, "uninstall " + one, "install " + one,
                                                                "uninstall " + one, "install " + two}));
     EXPECT_EQ(observer_->uninstallsSeenRegistered, 2);
-    EXPECT_FALSE(workspace_->pluginProxyForUUID(*first->pluginUUID()));
+    EXPECT_FALSE(workspace_->plugInProxyForUUID(*first->pluginUUID()));
     EXPECT_EQ(count(), 1u);
 }
 
@@ -333,7 +333,7 @@ TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReporte
         EXPECT_FALSE(workspace->checkIntegrity()) << "round " << round;
         if (!last.empty()) {
             anyReported = true;
-            EXPECT_TRUE(workspace->pluginProxyForURL(last)) << "round " << round << ": lost " << last;
+            EXPECT_TRUE(workspace->plugInProxyForURL(last)) << "round " << round << ": lost " << last;
         }
     }
     EXPECT_TRUE(anyReported) << "the child never got a registration done before being killed";
@@ -535,7 +535,7 @@ TEST_F(LedgerixBadBundleTest, RefusalsLeaveTheRegistryUnchangedAContainerThatCan
     write(good / "Info.vrec", "broken");
     EXPECT_FALSE(workspace_->registerPlugin(good.string()).ok());
     EXPECT_EQ(count(), 1u);
-    auto still = workspace_->pluginProxyForURL(good.string());
+    auto still = workspace_->plugInProxyForURL(good.string());
     ASSERT_TRUE(still);
     EXPECT_EQ(still->pluginUUID(), original->pluginUUID());
     EXPECT_EQ(still->infoVrec(), original->infoVrec());

@@ -352,9 +352,9 @@ std::string base64(std::span<const uint8_t> bytes) {
     return out;
 }
 
-void write(std::string& out, const Value& value, bool pretty, int indent) {
+void write(std::string& out, const Value& value, JsonLayout layout, int indent) {
     auto newline = [&](int level) {
-        if (!pretty) return;
+        if (layout == JsonLayout::OneLine) return;
         out += '\n';
         out.append(static_cast<size_t>(level) * 2, ' ');
     };
@@ -405,7 +405,7 @@ void write(std::string& out, const Value& value, bool pretty, int indent) {
                 if (!first) out += ',';
                 first = false;
                 newline(indent + 1);
-                write(out, item, pretty, indent + 1);
+                write(out, item, layout, indent + 1);
             }
             newline(indent);
             out += ']';
@@ -423,8 +423,8 @@ void write(std::string& out, const Value& value, bool pretty, int indent) {
                 first = false;
                 newline(indent + 1);
                 writeString(out, entry.key);
-                out += pretty ? ": " : ":";
-                write(out, entry.value, pretty, indent + 1);
+                out += layout == JsonLayout::Pretty ? ": " : ":";
+                write(out, entry.value, layout, indent + 1);
             }
             newline(indent);
             out += '}';
@@ -437,9 +437,9 @@ void write(std::string& out, const Value& value, bool pretty, int indent) {
 
 Result<Value> parseJson(std::string_view text) { return Parser(text).document(); }
 
-std::string toJson(const Value& value, bool pretty) {
+std::string toJson(const Value& value, JsonLayout layout) {
     std::string out;
-    write(out, value, pretty, 0);
+    write(out, value, layout, 0);
     return out;
 }
 

@@ -17,6 +17,7 @@ namespace bexil::tool {
 inline constexpr int kMaxJsonDepth = 128;
 
 Result<Value> parseJson(std::string_view text);
-std::string toJson(const Value& value, bool pretty = true);
+enum class JsonLayout { Pretty, OneLine };
+std::string toJson(const Value& value, JsonLayout layout = JsonLayout::Pretty);
 
 }  // namespace bexil::tool

@@ -205,7 +205,7 @@ int exclusionsCommand(const Options& options, const std::string& setFile, const 
         std::printf("%s\n", toJson(exclusions).c_str());
     } else if (!change) {
         if (exclusions.count() == 0) std::printf("no exclusions (%s)\n", file.c_str());
-        for (const Value& rule : exclusions.items()) std::printf("%s\n", toJson(rule, false).c_str());
+        for (const Value& rule : exclusions.items()) std::printf("%s\n", toJson(rule, JsonLayout::OneLine).c_str());
     }
     return 0;
 }
@@ -230,7 +230,7 @@ int run(int argc, char** argv) {
     std::string file, setFile;
     uint64_t flags = 0;
     int64_t election = -1;
-    bool pluginPaths = false, refuseBusy = false, terminate = false, clear = false;
+    bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false;
     std::function<int()> action;
 
     auto* add = app.add_subcommand(
@@ -271,7 +271,7 @@ int run(int argc, char** argv) {
     auto* hold = app.add_subcommand(
         "hold", "hold plug-ins out of use; prints the hold UUID\n  example: bexil hold --refuse-busy /opt/Greeter.app");
     hold->add_option("paths", paths, "absolute paths of applications (or plug-ins with --plugin-paths)")->required();
-    hold->add_flag("--plugin-paths", pluginPaths, "the paths name plug-in bundles, not applications");
+    hold->add_flag("--plugin-paths", plugInPaths, "the paths name plug-in bundles, not applications");
     hold->add_flag("--refuse-busy", refuseBusy, "refuse the hold when a plug-in is busy");
     hold->add_flag("--terminate", terminate, "terminate running instances once the hold is placed");
     auto* release = app.add_subcommand("release", "release a hold\n  example: bexil release 7A0E...");
@@ -381,7 +381,7 @@ int run(int argc, char** argv) {
     if (*hold) {
         auto array = absolutePaths(paths);
         if (!array) return usageFailure(array.error());
-        uint64_t holdFlags = (pluginPaths ? protocol::hold::kPlugInPaths : 0) |
+        uint64_t holdFlags = (plugInPaths ? protocol::hold::kPlugInPaths : 0) |
                              (refuseBusy ? protocol::hold::kRefuseBusy : 0) |
                              (terminate ? protocol::hold::kTerminate : 0);
         return roundTrip(

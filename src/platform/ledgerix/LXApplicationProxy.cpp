@@ -9,18 +9,18 @@ namespace bexil {
 LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInLoader loader)
     : fields_(std::move(fields)), loader_(std::move(loader)) {}
 
-LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInList plugins)
-    : fields_(std::move(fields)), plugins_(std::move(plugins)) {}
+LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInList plugIns)
+    : fields_(std::move(fields)), plugIns_(std::move(plugIns)) {}
 
-const LXApplicationProxy::PlugInList& LXApplicationProxy::plugins() const {
+const LXApplicationProxy::PlugInList& LXApplicationProxy::plugIns() const {
     std::call_once(loaded_, [this] {
         if (loader_) {
-            plugins_ = loader_();
+            plugIns_ = loader_();
             // The loader may hold the registry alive; it is not needed any more.
             loader_ = nullptr;
         }
     });
-    return plugins_;
+    return plugIns_;
 }
 
 std::string LXApplicationProxy::description() const {

@@ -32,7 +32,7 @@ class LXApplicationProxy {
 
     // A record with a fixed plug-in list, or one read by `loader` on first use (none: the list is empty).
     LXApplicationProxy(Fields fields, PlugInLoader loader);
-    LXApplicationProxy(Fields fields, PlugInList plugins);
+    LXApplicationProxy(Fields fields, PlugInList plugIns);
     LXApplicationProxy(const LXApplicationProxy&) = delete;
     LXApplicationProxy& operator=(const LXApplicationProxy&) = delete;
 
@@ -42,7 +42,7 @@ class LXApplicationProxy {
     bool isPlaceholder() const { return fields_.isPlaceholder; }
 
     // The application's plug-ins in the order of their paths.
-    const PlugInList& plugins() const;
+    const PlugInList& plugIns() const;
 
     // "<application com.example.greeter /path/Greeter.app>" for log lines.
     std::string description() const;
@@ -51,7 +51,7 @@ class LXApplicationProxy {
     const Fields fields_;
     mutable std::once_flag loaded_;
     mutable PlugInLoader loader_;
-    mutable PlugInList plugins_;
+    mutable PlugInList plugIns_;
 };
 
 }  // namespace bexil

@@ -74,9 +74,9 @@ class LXApplicationWorkspace {
     virtual void LXClearSchemaCaches() = 0;
 
     // The record of a plug-in UUID, or none.
-    virtual std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid& uuid) = 0;
+    virtual std::shared_ptr<const LXBexilProxy> plugInProxyForUUID(const Uuid& uuid) = 0;
     // The record of the plug-in bundle at the path, or none.
-    virtual std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view url) = 0;
+    virtual std::shared_ptr<const LXBexilProxy> plugInProxyForURL(std::string_view url) = 0;
     // The record of the application bundle at the path, with its plug-ins, or none.
     virtual std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) = 0;
 

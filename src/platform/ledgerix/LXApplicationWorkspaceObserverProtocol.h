@@ -16,9 +16,9 @@ class LXApplicationWorkspaceObserverProtocol {
     virtual ~LXApplicationWorkspaceObserverProtocol() = default;
 
     // The records that were just installed, as they are now registered.
-    virtual void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) = 0;
+    virtual void pluginsDidInstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) = 0;
     // The records that are about to be removed, as they were registered; they are still registered now.
-    virtual void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugins) = 0;
+    virtual void pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) = 0;
 };
 
 }  // namespace bexil

@@ -60,7 +60,7 @@ constexpr const char* kMigrations[] = {
         identifier TEXT,
         name TEXT,
         placeholder INTEGER NOT NULL);
-    CREATE TABLE plugins(
+    CREATE TABLE plugIns(
         id INTEGER PRIMARY KEY,
         uuid BLOB NOT NULL UNIQUE,
         path TEXT NOT NULL UNIQUE,
@@ -78,10 +78,10 @@ constexpr const char* kMigrations[] = {
         short_name TEXT,
         info BLOB NOT NULL,
         entitlements BLOB);
-    CREATE INDEX plugins_identifier_key ON plugins(identifier_key);
-    CREATE INDEX plugins_point_key ON plugins(point_key);
-    CREATE INDEX plugins_point_wild ON plugins(point_wild) WHERE point_wild = 1;
-    CREATE INDEX plugins_application ON plugins(application_id);
+    CREATE INDEX plugins_identifier_key ON plugIns(identifier_key);
+    CREATE INDEX plugins_point_key ON plugIns(point_key);
+    CREATE INDEX plugins_point_wild ON plugIns(point_wild) WHERE point_wild = 1;
+    CREATE INDEX plugins_application ON plugIns(application_id);
     )sql",
 };
 static_assert(std::size(kMigrations) == LedgerixWorkspace::kSchemaVersion);
@@ -224,15 +224,15 @@ class LedgerixWorkspace::Statement {
 namespace {
 
 // One use of a prepared statement: binds, steps, reads, and leaves it reset for the next use.
-class Use {
+class StatementUse {
   public:
-    explicit Use(sqlite3_stmt* stmt) : stmt_(stmt) {}
-    ~Use() {
+    explicit StatementUse(sqlite3_stmt* stmt) : stmt_(stmt) {}
+    ~StatementUse() {
         sqlite3_reset(stmt_);
         sqlite3_clear_bindings(stmt_);
     }
-    Use(const Use&) = delete;
-    Use& operator=(const Use&) = delete;
+    StatementUse(const StatementUse&) = delete;
+    StatementUse& operator=(const StatementUse&) = delete;
 
     void bind(int index, const std::optional<std::string>& text) {
         if (text)
@@ -544,7 +544,7 @@ void LedgerixWorkspace::LXClearSchemaCaches() {
 
 namespace {
 
-void readRowColumns(const Use& use, LedgerixWorkspace::Row& row) {
+void readRowColumns(const StatementUse& use, LedgerixWorkspace::Row& row) {
     row.id = use.integer(0);
     std::optional<std::string> uuid = use.blob(1);
     if (uuid && uuid->size() == 16) {
@@ -584,7 +584,7 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
     sql += " ORDER BY p.id";
     std::shared_ptr<Statement> stmt = statement(sql);
     if (!stmt) return std::nullopt;
-    Use use(stmt->get());
+    StatementUse use(stmt->get());
     int index = 1;
     for (const std::string& argument : arguments) use.bind(index++, std::string_view(argument));
     if (integerArgument) use.bind(index++, *integerArgument);
@@ -678,13 +678,13 @@ std::vector<std::string> LedgerixWorkspace::candidatePaths(std::string_view url)
 
 // ---- Look-ups ----
 
-std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::pluginProxyForUUID(const Uuid& uuid) {
+std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::plugInProxyForUUID(const Uuid& uuid) {
     std::optional<Row> found;
     {
         std::lock_guard lock(mutex_);
         std::shared_ptr<Statement> stmt = statement(std::string(kSelectRow) + " WHERE p.uuid = ?");
         if (!stmt) return nullptr;
-        Use use(stmt->get());
+        StatementUse use(stmt->get());
         use.bind(1, uuid);
         int rc = use.step();
         if (rc == SQLITE_ROW) {
@@ -701,7 +701,7 @@ std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::pluginProxyForUUID(const 
     return proxyFromRow(*found);
 }
 
-std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::pluginProxyForURL(std::string_view url) {
+std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::plugInProxyForURL(std::string_view url) {
     for (const std::string& path : candidatePaths(url)) {
         std::optional<Row> row;
         {
@@ -723,7 +723,7 @@ std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationProxyFor
             std::shared_ptr<Statement> stmt =
                 statement("SELECT id, path, identifier, name, placeholder FROM applications WHERE path = ?");
             if (!stmt) return nullptr;
-            Use use(stmt->get());
+            StatementUse use(stmt->get());
             use.bind(1, std::string_view(path));
             int rc = use.step();
             if (rc == SQLITE_ROW) {
@@ -794,7 +794,7 @@ std::optional<size_t> LedgerixWorkspace::plugInCount() {
     std::lock_guard lock(mutex_);
     std::shared_ptr<Statement> stmt = statement("SELECT count(*) FROM plugins");
     if (!stmt) return std::nullopt;
-    Use use(stmt->get());
+    StatementUse use(stmt->get());
     if (use.step() != SQLITE_ROW) {
         failure("count plug-ins");
         return std::nullopt;
@@ -823,7 +823,7 @@ std::optional<Error> LedgerixWorkspace::checkIntegrity() {
         rows = selectRowsLocked("", {}, std::nullopt);
         std::shared_ptr<Statement> stmt = statement("SELECT count(*) FROM plugins");
         if (!rows || !stmt) return failure("read every plug-in record");
-        Use use(stmt->get());
+        StatementUse use(stmt->get());
         if (use.step() != SQLITE_ROW || static_cast<size_t>(use.integer(0)) != rows->size())
             return lxError(kLXStoreFailure, "registry holds plug-in rows that cannot be read");
     }
@@ -856,7 +856,7 @@ void LedgerixWorkspace::removeObserver(const LXApplicationWorkspaceObserverProto
     });
 }
 
-void LedgerixWorkspace::notifyObservers(bool didInstall, const LXProxyList& plugins) {
+void LedgerixWorkspace::notifyObservers(Change change, const LXProxyList& plugIns) {
     std::vector<std::shared_ptr<LXApplicationWorkspaceObserverProtocol>> targets;
     {
         std::lock_guard lock(observersMutex_);
@@ -866,10 +866,10 @@ void LedgerixWorkspace::notifyObservers(bool didInstall, const LXProxyList& plug
         }
     }
     for (const auto& observer : targets) {
-        if (didInstall)
-            observer->pluginsDidInstall(plugins);
+        if (change == Change::Installed)
+            observer->pluginsDidInstall(plugIns);
         else
-            observer->pluginsWillUninstall(plugins);
+            observer->pluginsWillUninstall(plugIns);
     }
 }
 
@@ -996,7 +996,7 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
             "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, name = excluded.name, "
             "placeholder = excluded.placeholder RETURNING id");
         if (!stmt) return rollback("prepare the application record");
-        Use use(stmt->get());
+        StatementUse use(stmt->get());
         use.bind(1, row.appPath);
         use.bind(2, row.appIdentifier);
         use.bind(3, row.appName);
@@ -1010,7 +1010,7 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
     {
         std::shared_ptr<Statement> stmt = statement("DELETE FROM plugins WHERE path = ?");
         if (!stmt) return rollback("prepare the removal of the old record");
-        Use use(stmt->get());
+        StatementUse use(stmt->get());
         use.bind(1, std::string_view(row.path));
         if (use.step() != SQLITE_DONE) return rollback("remove the old record");
     }
@@ -1020,7 +1020,7 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
             "point_key, point_wild, application_id, system, registered, container, name, short_name, info, "
             "entitlements) VALUES(?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
         if (!stmt) return rollback("prepare the plug-in record");
-        Use use(stmt->get());
+        StatementUse use(stmt->get());
         use.bind(1, uuid);
         use.bind(2, std::string_view(row.path));
         use.bind(3, row.identifier);
@@ -1053,7 +1053,7 @@ std::optional<Error> LedgerixWorkspace::dropApplicationIfEmptyLocked(int64_t app
     std::shared_ptr<Statement> stmt = statement(
         "DELETE FROM applications WHERE id = ?1 AND NOT EXISTS (SELECT 1 FROM plugins WHERE application_id = ?1)");
     if (!stmt) return failure("prepare the removal of an empty application");
-    Use use(stmt->get());
+    StatementUse use(stmt->get());
     use.bind(1, applicationId);
     if (use.step() != SQLITE_DONE) return failure("remove an empty application");
     return std::nullopt;
@@ -1089,7 +1089,7 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
         if (old && std::find(announced.begin(), announced.end(), old->uuid) == announced.end()) {
             lock.unlock();
             announced.push_back(old->uuid);
-            notifyObservers(false, {proxyFromRow(*old)});
+            notifyObservers(Change::Uninstalled, {proxyFromRow(*old)});
             continue;
         }
         // The UUID names the plug-in as long as the bundle keeps its identity and version; a new build is a new
@@ -1105,7 +1105,7 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
         lock.unlock();
         std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(*stored);
         log::lx().debug("registered %@", proxy);
-        notifyObservers(true, {proxy});
+        notifyObservers(Change::Installed, {proxy});
         return proxy;
     }
 }
@@ -1130,14 +1130,14 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
         if (std::find(announced.begin(), announced.end(), row->uuid) == announced.end()) {
             lock.unlock();
             announced.push_back(row->uuid);
-            notifyObservers(false, {proxyFromRow(*row)});
+            notifyObservers(Change::Uninstalled, {proxyFromRow(*row)});
             continue;
         }
         if (!exec(db_, "BEGIN IMMEDIATE")) return failure("begin an unregistration");
         std::shared_ptr<Statement> stmt = statement("DELETE FROM plugins WHERE uuid = ?");
         bool deleted = false;
         if (stmt) {
-            Use use(stmt->get());
+            StatementUse use(stmt->get());
             use.bind(1, row->uuid);
             deleted = use.step() == SQLITE_DONE;
         }

@@ -59,8 +59,8 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) override;
     std::optional<Error> unregisterPlugin(std::string_view url) override;
     void LXClearSchemaCaches() override;
-    std::shared_ptr<const LXBexilProxy> pluginProxyForUUID(const Uuid& uuid) override;
-    std::shared_ptr<const LXBexilProxy> pluginProxyForURL(std::string_view url) override;
+    std::shared_ptr<const LXBexilProxy> plugInProxyForUUID(const Uuid& uuid) override;
+    std::shared_ptr<const LXBexilProxy> plugInProxyForURL(std::string_view url) override;
     std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) override;
     std::optional<LXProxyList> installedPlugins() override;
     std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
@@ -105,7 +105,8 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     LXProxyList proxiesFromRows(const std::vector<Row>& rows);
     std::shared_ptr<const LXApplicationProxy> applicationFromRow(const Row& row);
     LXProxyList plugInsOfApplication(int64_t applicationId);
-    void notifyObservers(bool didInstall, const LXProxyList& plugins);
+    enum class Change { Installed, Uninstalled };
+    void notifyObservers(Change change, const LXProxyList& plugIns);
 
     const Options options_;
     const std::filesystem::path databasePath_;

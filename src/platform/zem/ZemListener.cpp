@@ -37,9 +37,12 @@ constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
 
 Error posixError(const std::string& what, int error) { return Error("POSIX", error, what + ": " + strerror(error)); }
 
+// Where the listening socket came from: handed over by the service manager, or bound by this process.
+enum class Origin { Activated, BoundHere };
+
 class ZemSocketListener final : public ZemListener, public std::enable_shared_from_this<ZemSocketListener> {
   public:
-    ZemSocketListener(std::string serviceName, SerialQueue queue, EntitlementsDirectory* entitlements, bool activated,
+    ZemSocketListener(std::string serviceName, SerialQueue queue, EntitlementsDirectory* entitlements, Origin origin,
                       int lockFd)
         : serviceName_(std::move(serviceName)),
           queue_(std::move(queue)),
@@ -47,7 +50,7 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
           acceptor_(*detail::QueueInternals::state(queue_)->core),
           signals_(*detail::QueueInternals::state(queue_)->core),
           retryTimer_(*detail::QueueInternals::state(queue_)->core),
-          activated_(activated),
+          activated_(origin == Origin::Activated),
           lockFd_(lockFd) {}
 
     ~ZemSocketListener() override {
@@ -239,7 +242,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
         return BXError(ErrorCode::OperationFailed, "invalid service name \"" + serviceName + "\"");
 
     if (int fd = activatedSocketFor(serviceName); fd >= 0) {
-        auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, true, -1);
+        auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, Origin::Activated, -1);
         asio::error_code error;
         listener->acceptor().assign(Protocol(), fd, error);
         if (error) return posixError("socket passed by systemd for " + serviceName, error.value());
@@ -281,7 +284,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
         unlink(path.c_str());
     }
 
-    auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, false, lockFd);
+    auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, Origin::BoundHere, lockFd);
     asio::error_code error;
     Protocol::acceptor& acceptor = listener->acceptor();
     acceptor.open(Protocol(), error);
