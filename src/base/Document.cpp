@@ -40,13 +40,9 @@ Error documentError(int code, std::string message) {
     return Error(std::string(BXDocumentErrorDomain), code, std::move(message));
 }
 
-Error posixError(int err, std::string_view operation, const std::filesystem::path& path) {
-    std::string message(operation);
-    message += " \"";
-    message += path.string();
-    message += "\": ";
-    message += strerror(err);
-    return Error(std::string(BXPosixErrorDomain), err, std::move(message));
+// "<operation> "<path>": <strerror>", in the POSIX domain.
+Error fileError(int err, std::string_view operation, const std::filesystem::path& path) {
+    return posixError(err, std::string(operation) + " \"" + path.string() + "\"");
 }
 
 // A short, printable excerpt of text for an error message.
@@ -832,7 +828,7 @@ Result<std::string> Document::write(const Value& value) { return Writer().run(va
 
 Result<Value> Document::readFile(const std::filesystem::path& path) {
     int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return posixError(errno, "open", path);
+    if (fd < 0) return fileError(errno, "open", path);
     std::string text;
     struct stat info {};
     if (::fstat(fd, &info) == 0 && S_ISREG(info.st_mode) && static_cast<uint64_t>(info.st_size) <= kMaxDocumentBytes)
@@ -844,7 +840,7 @@ Result<Value> Document::readFile(const std::filesystem::path& path) {
             if (errno == EINTR) continue;
             int err = errno;
             ::close(fd);
-            return posixError(err, "read", path);
+            return fileError(err, "read", path);
         }
         if (n == 0) break;
         text.append(buffer, static_cast<size_t>(n));
@@ -881,12 +877,12 @@ std::optional<Error> Document::writeFileAtomically(const std::filesystem::path& 
     temporary += suffix;
 
     int fd = fs.open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
-    if (fd < 0) return posixError(errno, "create", temporary);
+    if (fd < 0) return fileError(errno, "create", temporary);
 
     auto abandon = [&](int err, const char* operation, bool closeFirst) {
         if (closeFirst) fs.close(fd);
         fs.unlink(temporary.c_str());
-        return posixError(err, operation, temporary);
+        return fileError(err, operation, temporary);
     };
 
     std::string_view rest = *text;
@@ -902,17 +898,17 @@ std::optional<Error> Document::writeFileAtomically(const std::filesystem::path& 
     if (fs.rename(temporary.c_str(), path.c_str()) != 0) {
         int err = errno;
         fs.unlink(temporary.c_str());
-        return posixError(err, "rename over", path);
+        return fileError(err, "rename over", path);
     }
 
     std::filesystem::path directory = path.parent_path();
     if (directory.empty()) directory = ".";
     int dirFd = fs.open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC, 0);
-    if (dirFd < 0) return posixError(errno, "open directory", directory);
+    if (dirFd < 0) return fileError(errno, "open directory", directory);
     if (fs.fsync(dirFd) != 0) {
         int err = errno;
         fs.close(dirFd);
-        return posixError(err, "fsync directory", directory);
+        return fileError(err, "fsync directory", directory);
     }
     fs.close(dirFd);
     return std::nullopt;

@@ -13,6 +13,7 @@
 #include <string_view>
 
 #include "base/Error.h"
+#include "base/PosixError.h"
 #include "base/Value.h"
 
 namespace bexil {
@@ -20,7 +21,6 @@ namespace bexil {
 // The error domain of documents that cannot be read or values that cannot be written.
 inline constexpr std::string_view BXDocumentErrorDomain = "BexilDocument";
 // The error domain of failed system calls: the code is the errno.
-inline constexpr std::string_view BXPosixErrorDomain = "POSIX";
 
 enum DocumentErrorCode : int {
     // The text is not XML, not the document structure, or a value in it does not parse.

@@ -22,10 +22,6 @@ namespace {
 
 constexpr std::string_view kBundleIdentifierKey = "BDBundleIdentifier";
 
-Error posixError(int code, const std::string& what) {
-    return Error(std::string(BXPosixErrorDomain), code, what + ": " + std::strerror(code));
-}
-
 }  // namespace
 
 fs::path ConsentStore::defaultFile() {

@@ -15,6 +15,7 @@
 #include <cstring>
 #include <vector>
 
+#include "base/PosixError.h"
 #include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
@@ -26,8 +27,9 @@ namespace {
 
 constexpr const char* kLockFileName = ".lock";
 
-Error posixError(const std::string& what, int error) {
-    return BXError(ErrorCode::OperationFailed, what + ": " + std::strerror(error));
+// Notification failures are the daemon's own (code 4), with the system's text for the cause.
+Error failure(int error, std::string_view what) {
+    return BXError(ErrorCode::OperationFailed, posixMessage(error, what));
 }
 
 // The counter file is a decimal number; anything else (a stray file) counts as 0 so that the next post repairs it.
@@ -87,29 +89,29 @@ std::optional<Error> SystemNotifications::post(std::string_view name) {
     if (ec) return BXError(ErrorCode::OperationFailed, "cannot create " + directory_.string() + ": " + ec.message());
 
     int lockFd = ::open((directory_ / kLockFileName).c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-    if (lockFd < 0) return posixError("cannot open notification lock in " + directory_.string(), errno);
+    if (lockFd < 0) return failure(errno, "cannot open notification lock in " + directory_.string());
     FdCloser closeLock(lockFd);
     while (::flock(lockFd, LOCK_EX) != 0) {
-        if (errno != EINTR) return posixError("cannot lock notification folder " + directory_.string(), errno);
+        if (errno != EINTR) return failure(errno, "cannot lock notification folder " + directory_.string());
     }
 
     const fs::path target = directory_ / std::string(name);
     const std::string text = std::to_string(readCounter(target) + 1) + "\n";
     const fs::path temporary = directory_ / ("." + std::string(name) + "." + std::to_string(getpid()) + ".tmp");
     int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-    if (fd < 0) return posixError("cannot write " + temporary.string(), errno);
+    if (fd < 0) return failure(errno, "cannot write " + temporary.string());
     ssize_t written = ::write(fd, text.data(), text.size());
     int writeErrno = errno;
     ::close(fd);
     if (written != static_cast<ssize_t>(text.size())) {
         ::unlink(temporary.c_str());
-        return posixError("cannot write " + temporary.string(), written < 0 ? writeErrno : EIO);
+        return failure(written < 0 ? writeErrno : EIO, "cannot write " + temporary.string());
     }
     // The counter is a wake-up signal, not data worth an fsync: after a crash observers start over anyway.
     if (::rename(temporary.c_str(), target.c_str()) != 0) {
         int error = errno;
         ::unlink(temporary.c_str());
-        return posixError("cannot replace " + target.string(), error);
+        return failure(error, "cannot replace " + target.string());
     }
     return std::nullopt;
 }
@@ -142,18 +144,18 @@ std::optional<Error> SystemNotifications::startWatching() {
     fs::create_directories(directory_, ec);
     if (ec) return BXError(ErrorCode::OperationFailed, "cannot create " + directory_.string() + ": " + ec.message());
     int inotifyFd = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
-    if (inotifyFd < 0) return posixError("inotify_init1", errno);
+    if (inotifyFd < 0) return failure(errno, "inotify_init1");
     // A post renames its counter file into place; a plain write by some other tool closes it after writing.
     if (inotify_add_watch(inotifyFd, directory_.c_str(), IN_MOVED_TO | IN_CLOSE_WRITE) < 0) {
         int error = errno;
         ::close(inotifyFd);
-        return posixError("cannot watch " + directory_.string(), error);
+        return failure(error, "cannot watch " + directory_.string());
     }
     int stopFd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (stopFd < 0) {
         int error = errno;
         ::close(inotifyFd);
-        return posixError("eventfd", error);
+        return failure(error, "eventfd");
     }
     inotifyFd_ = inotifyFd;
     stopFd_ = stopFd;

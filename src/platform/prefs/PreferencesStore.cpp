@@ -27,10 +27,6 @@ namespace fs = std::filesystem;
 
 namespace {
 
-Error posixError(int code, const std::string& what) {
-    return Error(std::string(BXPosixErrorDomain), code, what + ": " + std::strerror(code));
-}
-
 int64_t nanoseconds(const struct timespec& time) {
     return static_cast<int64_t>(time.tv_sec) * 1'000'000'000 + time.tv_nsec;
 }

@@ -16,6 +16,7 @@
 #include <mutex>
 
 #include "base/EventLoopAsio.h"
+#include "base/PosixError.h"
 #include "platform/codesign/CodeSigningIdentity.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemSocketConnection.h"
@@ -34,8 +35,6 @@ using Protocol = asio::local::stream_protocol;
 
 // After a failed accept (out of file descriptors, say), wait this long before the next try instead of spinning.
 constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
-
-Error posixError(const std::string& what, int error) { return Error("POSIX", error, what + ": " + strerror(error)); }
 
 // Where the listening socket came from: handed over by the service manager, or bound by this process.
 enum class Origin { Activated, BoundHere };
@@ -107,7 +106,7 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
         if (cancelled_) return;
         if (error) {
             if (error == asio::error::operation_aborted) return;
-            Error failure = posixError("accept on service " + serviceName_, error.value());
+            Error failure = posixError(error.value(), "accept on service " + serviceName_);
             if (errorHandler_) errorHandler_(failure);
             retryTimer_.expires_after(kAcceptRetryDelay);
             retryTimer_.async_wait(detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& e) {
@@ -245,7 +244,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
         auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, Origin::Activated, -1);
         asio::error_code error;
         listener->acceptor().assign(Protocol(), fd, error);
-        if (error) return posixError("socket passed by systemd for " + serviceName, error.value());
+        if (error) return posixError(error.value(), "socket passed by systemd for " + serviceName);
         log::ops().info("listening on service %s (socket passed by systemd)", serviceName.c_str());
         return std::shared_ptr<ZemListener>(listener);
     }
@@ -253,20 +252,20 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
     std::filesystem::path dir = serviceDirectory();
     std::error_code ec;
     std::filesystem::create_directories(dir, ec);
-    if (ec) return posixError("cannot create service directory " + dir.string(), ec.value());
+    if (ec) return posixError(ec.value(), "cannot create service directory " + dir.string());
     std::string path = (dir / serviceName).string();
     if (path.size() >= sizeof(sockaddr_un{}.sun_path))
         return BXError(ErrorCode::OperationFailed, "socket path too long for service " + serviceName + ": " + path);
 
     int lockFd = open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-    if (lockFd < 0) return posixError("cannot open lock for service " + serviceName, errno);
+    if (lockFd < 0) return posixError(errno, "cannot open lock for service " + serviceName);
     if (flock(lockFd, LOCK_EX | LOCK_NB) != 0) {
         int error = errno;
         close(lockFd);
         if (error == EWOULDBLOCK)
             return BXError(ErrorCode::OperationFailed,
                            "service " + serviceName + " is already served by another process (" + path + ")");
-        return posixError("cannot lock service " + serviceName, error);
+        return posixError(error, "cannot lock service " + serviceName);
     }
 
     struct stat st {};
@@ -292,7 +291,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
     // Every user may connect: what a caller may do is decided per request, from its identity.
     if (!error && chmod(path.c_str(), 0666) != 0) error = asio::error_code(errno, asio::system_category());
     if (!error) acceptor.listen(asio::socket_base::max_listen_connections, error);
-    if (error) return posixError("cannot listen on " + path, error.value());
+    if (error) return posixError(error.value(), "cannot listen on " + path);
     log::ops().info("listening on service %s at %s", serviceName.c_str(), path.c_str());
     return std::shared_ptr<ZemListener>(listener);
 }
