@@ -28,6 +28,8 @@
 #include <variant>
 #include <vector>
 
+#include "base/Text.h"
+
 namespace bexil {
 
 namespace {
@@ -115,32 +117,10 @@ std::optional<TextFault> findTextFault(std::string_view s) {
     size_t n = s.size();
     size_t i = 0;
     while (i < n) {
-        unsigned char c = p[i];
-        if (c < 0x80) {
-            if (!isXmlChar(c)) return TextFault{i, false, c};
-            ++i;
-            continue;
-        }
-        size_t length;
-        uint32_t cp;
-        uint32_t minimum;
-        if ((c & 0xE0) == 0xC0) {
-            length = 2, cp = c & 0x1F, minimum = 0x80;
-        } else if ((c & 0xF0) == 0xE0) {
-            length = 3, cp = c & 0x0F, minimum = 0x800;
-        } else if ((c & 0xF8) == 0xF0) {
-            length = 4, cp = c & 0x07, minimum = 0x10000;
-        } else {
-            return TextFault{i, true, 0};
-        }
-        if (i + length > n) return TextFault{i, true, 0};
-        for (size_t k = 1; k < length; ++k) {
-            if ((p[i + k] & 0xC0) != 0x80) return TextFault{i, true, 0};
-            cp = (cp << 6) | (p[i + k] & 0x3F);
-        }
-        if (cp < minimum || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF)) return TextFault{i, true, 0};
-        if (!isXmlChar(cp)) return TextFault{i, false, cp};
-        i += length;
+        std::optional<Utf8Sequence> sequence = decodeUtf8(p + i, n - i);
+        if (!sequence) return TextFault{i, true, 0};
+        if (!isXmlChar(sequence->codePoint)) return TextFault{i, false, sequence->codePoint};
+        i += sequence->length;
     }
     return std::nullopt;
 }
@@ -156,14 +136,8 @@ std::optional<Error> checkCharacterReferences(std::string_view text) {
         size_t digits = 0;
         for (; i < text.size(); ++i) {
             char c = text[i];
-            int d;
-            if (c >= '0' && c <= '9') {
-                d = c - '0';
-            } else if (hex && (c | 0x20) >= 'a' && (c | 0x20) <= 'f') {
-                d = (c | 0x20) - 'a' + 10;
-            } else {
-                break;
-            }
+            int d = hex ? hexDigitValue(c) : (c >= '0' && c <= '9' ? c - '0' : -1);
+            if (d < 0) break;
             code = code * (hex ? 16 : 10) + static_cast<uint64_t>(d);
             if (code > 0x10FFFF) code = 0x110000;  // saturate: only "too large" matters
             ++digits;

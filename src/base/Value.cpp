@@ -13,6 +13,8 @@
 #include <functional>
 #include <stdexcept>
 
+#include "base/Text.h"
+
 namespace bexil {
 
 // Scalars live inline in the Value; everything else lives in a reference-counted node that is never edited after
@@ -96,13 +98,6 @@ Uuid Uuid::random() {
     return Uuid(b);
 }
 
-static int hexDigit(char c) {
-    if (c >= '0' && c <= '9') return c - '0';
-    if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-    return -1;
-}
-
 std::optional<Uuid> Uuid::parse(std::string_view text) {
     if (text.size() != kTextLength) return std::nullopt;
     std::array<uint8_t, 16> b{};
@@ -113,8 +108,8 @@ std::optional<Uuid> Uuid::parse(std::string_view text) {
             ++i;
             continue;
         }
-        int hi = hexDigit(text[i]);
-        int lo = hexDigit(text[i + 1]);
+        int hi = hexDigitValue(text[i]);
+        int lo = hexDigitValue(text[i + 1]);
         if (hi < 0 || lo < 0) return std::nullopt;
         b[byte++] = static_cast<uint8_t>(hi << 4 | lo);
         i += 2;

@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "base/Text.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/log/Log.h"
 
@@ -9,35 +10,9 @@ namespace bexil {
 
 namespace {
 
-int hexDigit(char c) {
-    if (c >= '0' && c <= '9') return c - '0';
-    if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-    return -1;
-}
-
-// The path of a local file URL ("file:///a%20b" -> "/a b", "file://localhost/x" -> "/x"). Anything else is taken
-// as a path already, which is what callers of this model pass nearly always.
-std::string pathOfURL(std::string_view url) {
-    constexpr std::string_view kScheme = "file://";
-    if (url.substr(0, kScheme.size()) != kScheme) return std::string(url);
-    std::string_view rest = url.substr(kScheme.size());
-    if (rest.substr(0, 9) == "localhost") rest.remove_prefix(9);
-    if (rest.empty() || rest.front() != '/') return std::string(url);
-    std::string path;
-    path.reserve(rest.size());
-    for (size_t i = 0; i < rest.size(); ++i) {
-        int high = -1, low = -1;
-        if (rest[i] == '%' && i + 2 < rest.size() && (high = hexDigit(rest[i + 1])) >= 0 &&
-            (low = hexDigit(rest[i + 2])) >= 0) {
-            path.push_back(static_cast<char>(high * 16 + low));
-            i += 2;
-        } else {
-            path.push_back(rest[i]);
-        }
-    }
-    return path;
-}
+// The path of a local file URL; anything else is taken as a path already, which is what callers of this model pass
+// nearly always.
+std::string pathOfURL(std::string_view url) { return pathOfFileURL(url).value_or(std::string(url)); }
 
 }  // namespace
 

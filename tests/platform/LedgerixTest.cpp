@@ -175,13 +175,15 @@ TEST_F(LedgerixRegistrationTest, LookUpByUuidAndByAnyFormOfThePath) {
 
     fs::create_directory_symlink(bundle, dir_ / "link.bxplugin");
     for (std::string form :
-         {bundle.string(), "file://" + bundle.string(), bundle.string() + "/",
+         {bundle.string(), "file://" + bundle.string(), "file://localhost" + bundle.string(),
+          "file://" + (bundles_ / "A.app/Plug%49ns/One.bxplugin").string(), bundle.string() + "/",
           (bundles_ / "A.app/PlugIns/../PlugIns/One.bxplugin").string(), (dir_ / "link.bxplugin").string()}) {
         auto found = workspace_->plugInProxyForURL(form);
         ASSERT_TRUE(found) << form;
         EXPECT_EQ(found->pluginUUID(), proxy->pluginUUID()) << form;
     }
     EXPECT_FALSE(workspace_->plugInProxyForURL("relative/One.bxplugin"));
+    EXPECT_FALSE(workspace_->plugInProxyForURL("file://elsewhere" + bundle.string()));
 }
 
 // Guards unregistering a bundle already deleted (announced, looked-up-able during the announcement), and the

@@ -5,6 +5,8 @@
 #include <cstdlib>
 #include <string>
 
+#include "base/Text.h"
+
 namespace bexil::tool {
 
 namespace {
@@ -144,24 +146,6 @@ class Parser {
         }
     }
 
-    static void appendUtf8(std::string& s, uint32_t cp) {
-        if (cp < 0x80) {
-            s += static_cast<char>(cp);
-        } else if (cp < 0x800) {
-            s += static_cast<char>(0xC0 | (cp >> 6));
-            s += static_cast<char>(0x80 | (cp & 0x3F));
-        } else if (cp < 0x10000) {
-            s += static_cast<char>(0xE0 | (cp >> 12));
-            s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-            s += static_cast<char>(0x80 | (cp & 0x3F));
-        } else {
-            s += static_cast<char>(0xF0 | (cp >> 18));
-            s += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
-            s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-            s += static_cast<char>(0x80 | (cp & 0x3F));
-        }
-    }
-
     bool hex4(uint32_t& out) {
         if (pos_ + 4 > text_.size()) {
             error_ = "truncated \\u escape";
@@ -169,18 +153,12 @@ class Parser {
         }
         out = 0;
         for (int i = 0; i < 4; ++i) {
-            char h = text_[pos_++];
-            out <<= 4;
-            if (h >= '0' && h <= '9')
-                out |= static_cast<uint32_t>(h - '0');
-            else if (h >= 'a' && h <= 'f')
-                out |= static_cast<uint32_t>(h - 'a' + 10);
-            else if (h >= 'A' && h <= 'F')
-                out |= static_cast<uint32_t>(h - 'A' + 10);
-            else {
+            int digit = hexDigitValue(text_[pos_++]);
+            if (digit < 0) {
                 error_ = "bad \\u escape";
                 return false;
             }
+            out = (out << 4) | static_cast<uint32_t>(digit);
         }
         return true;
     }

@@ -29,6 +29,7 @@
 
 #include "base/Document.h"
 #include "base/StandardPaths.h"
+#include "base/Text.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXApplicationWorkspaceObserverProtocol.h"
@@ -171,7 +172,12 @@ std::optional<std::string> stringEntry(const Value& dictionary, std::string_view
 // A URL or path as the registry keys it: absolute, "file://" removed, "." and ".." folded, no trailing slash. None
 // for anything that cannot be a bundle path.
 std::optional<std::string> lexicalPath(std::string_view url) {
-    if (url.starts_with("file://")) url.remove_prefix(7);
+    std::optional<std::string> fromURL;
+    if (url.starts_with("file://")) {
+        fromURL = pathOfFileURL(url);
+        if (!fromURL) return std::nullopt;
+        url = *fromURL;
+    }
     if (url.empty() || url[0] != '/' || url.find('\0') != std::string_view::npos) return std::nullopt;
     std::string path = fs::path(url).lexically_normal().string();
     while (path.size() > 1 && path.back() == '/') path.pop_back();

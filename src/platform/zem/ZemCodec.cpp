@@ -22,62 +22,18 @@
 #include <string_view>
 #include <utility>
 
+#include "base/Text.h"
+
 namespace bexil {
 
 namespace {
 
 static_assert(std::endian::native == std::endian::little || std::endian::native == std::endian::big);
 
-constexpr size_t kNoError = SIZE_MAX;
 // Slots a container reserves before it has seen its items; larger containers grow as items arrive.
 constexpr size_t kMaxInitialReserve = 1024;
 // Longest piece of a key quoted in an error message.
 constexpr size_t kMaxQuotedKey = 64;
-
-// Offset of the first byte that breaks UTF-8 (overlong forms, surrogates and code points above U+10FFFF
-// included), or kNoError when the whole text is well-formed.
-size_t firstInvalidUtf8(const uint8_t* p, size_t n) {
-    size_t i = 0;
-    while (i < n) {
-        if (n - i >= 8) {
-            uint64_t word;
-            std::memcpy(&word, p + i, 8);
-            if ((word & 0x8080808080808080ULL) == 0) {
-                i += 8;
-                continue;
-            }
-        }
-        uint8_t c = p[i];
-        if (c < 0x80) {
-            ++i;
-            continue;
-        }
-        size_t length;
-        uint32_t codePoint;
-        uint32_t smallest;
-        if ((c & 0xE0) == 0xC0) {
-            length = 2, codePoint = c & 0x1F, smallest = 0x80;
-        } else if ((c & 0xF0) == 0xE0) {
-            length = 3, codePoint = c & 0x0F, smallest = 0x800;
-        } else if ((c & 0xF8) == 0xF0) {
-            length = 4, codePoint = c & 0x07, smallest = 0x10000;
-        } else {
-            return i;
-        }
-        if (n - i < length) return i;
-        for (size_t k = 1; k < length; ++k) {
-            if ((p[i + k] & 0xC0) != 0x80) return i;
-            codePoint = (codePoint << 6) | (p[i + k] & 0x3F);
-        }
-        if (codePoint < smallest || codePoint > 0x10FFFF || (codePoint >= 0xD800 && codePoint <= 0xDFFF)) return i;
-        i += length;
-    }
-    return kNoError;
-}
-
-size_t firstInvalidUtf8(std::string_view s) {
-    return firstInvalidUtf8(reinterpret_cast<const uint8_t*>(s.data()), s.size());
-}
 
 // A key as it appears in an error message: printable ASCII as is, everything else as \xNN, cut at a sane length.
 std::string quoted(std::string_view key) {
@@ -209,7 +165,7 @@ class Sizer {
 
     void text(std::string_view s, const char* what) {
         size_t bad = firstInvalidUtf8(s);
-        if (bad == kNoError) return;
+        if (bad == kWellFormedUtf8) return;
         error = zemError(ZemErrorCode::InvalidUtf8,
                          fmt::format("{} at offset {} is not UTF-8 (bad byte 0x{:02x} at index {})", what, size,
                                      static_cast<uint8_t>(s[bad]), bad));
@@ -380,7 +336,7 @@ class Decoder {
         uint64_t n;
         if (!varint(n, what) || !need(n, what, start)) return false;
         size_t bad = firstInvalidUtf8(base_ + pos_, n);
-        if (bad != kNoError)
+        if (bad != kWellFormedUtf8)
             return fail(ZemErrorCode::InvalidUtf8,
                         fmt::format("{} at offset {} is not UTF-8 (bad byte 0x{:02x} at offset {})", what, start,
                                     base_[pos_ + bad], pos_ + bad));

@@ -1,0 +1,86 @@
+// The shared text helpers: every class of malformed UTF-8 is found at the right offset (the Zem codec and the
+// document reader both rely on it to refuse such text), sequences decode to the right code points at every
+// length boundary, and file URLs read the same way for the model and the registry.
+
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "base/Text.h"
+
+namespace bexil {
+namespace {
+
+size_t firstBad(std::vector<uint8_t> bytes) { return firstInvalidUtf8(bytes.data(), bytes.size()); }
+
+TEST(Utf8, EveryClassOfMalformedSequenceIsFoundWhereItStarts) {
+    struct Case {
+        const char* what;
+        std::vector<uint8_t> bytes;
+        size_t offset;
+    };
+    const Case cases[] = {
+        {"stray continuation", {'a', 0x80, 'b'}, 1},
+        {"byte that never starts a sequence", {0xFF}, 0},
+        {"five-byte lead", {0xF8, 0x88, 0x80, 0x80, 0x80}, 0},
+        {"two-byte sequence cut by the end", {'a', 'b', 0xC3}, 2},
+        {"four-byte sequence cut by the end", {0xF0, 0x9F, 0x98}, 0},
+        {"sequence cut by a non-continuation", {0xE2, 0x82, 'x'}, 0},
+        {"overlong two-byte slash", {0xC0, 0xAF}, 0},
+        {"overlong two-byte, largest", {0xC1, 0xBF}, 0},
+        {"overlong three-byte", {0xE0, 0x9F, 0xBF}, 0},
+        {"overlong four-byte", {0xF0, 0x8F, 0xBF, 0xBF}, 0},
+        {"first surrogate", {0xED, 0xA0, 0x80}, 0},
+        {"last surrogate", {0xED, 0xBF, 0xBF}, 0},
+        {"above U+10FFFF", {0xF4, 0x90, 0x80, 0x80}, 0},
+        {"largest lead byte", {0xF7, 0xBF, 0xBF, 0xBF}, 0},
+        // The ASCII fast path reads eight bytes at a time: a fault right after such a run must still be found.
+        {"after eight ASCII bytes", {'0', '1', '2', '3', '4', '5', '6', '7', 0x80}, 8},
+        {"inside a second word", {'0', '1', '2', '3', '4', '5', '6', '7', '8', 0xC3, 0x28, 'a', 'b', 'c', 'd', 'e'}, 9},
+    };
+    for (const Case& c : cases) {
+        EXPECT_EQ(firstBad(c.bytes), c.offset) << c.what;
+        EXPECT_FALSE(decodeUtf8(c.bytes.data() + c.offset, c.bytes.size() - c.offset)) << c.what;
+    }
+}
+
+TEST(Utf8, BoundaryCodePointsDecodeAndRoundTrip) {
+    for (uint32_t codePoint :
+         {0x0u, 0x7Fu, 0x80u, 0x7FFu, 0x800u, 0xD7FFu, 0xE000u, 0xFFFDu, 0xFFFFu, 0x10000u, 0x10FFFFu}) {
+        std::string text;
+        appendUtf8(text, codePoint);
+        const auto* bytes = reinterpret_cast<const uint8_t*>(text.data());
+        std::optional<Utf8Sequence> sequence = decodeUtf8(bytes, text.size());
+        ASSERT_TRUE(sequence) << std::hex << codePoint;
+        EXPECT_EQ(sequence->codePoint, codePoint);
+        EXPECT_EQ(sequence->length, text.size());
+        EXPECT_EQ(firstInvalidUtf8(text), kWellFormedUtf8);
+    }
+    EXPECT_EQ(firstInvalidUtf8(std::string_view("\0a\xC3\xA9\xE2\x82\xAC\xF0\x9F\x98\x80", 11)), kWellFormedUtf8);
+    EXPECT_EQ(firstInvalidUtf8(std::string_view()), kWellFormedUtf8);
+}
+
+TEST(FileURL, LocalURLsGiveTheirDecodedPathAndNothingElseIsOne) {
+    EXPECT_EQ(pathOfFileURL("file:///a%20b/c"), "/a b/c");
+    EXPECT_EQ(pathOfFileURL("file://localhost/x"), "/x");
+    EXPECT_EQ(pathOfFileURL("file:///x%2fy"), "/x/y");
+    EXPECT_EQ(pathOfFileURL("file:///100%"), "/100%") << "a % without two digits stays";
+    EXPECT_EQ(pathOfFileURL("file:///%4"), "/%4");
+    EXPECT_EQ(pathOfFileURL("file:///%zz"), "/%zz");
+    EXPECT_EQ(pathOfFileURL("file:///a%00b"), std::string("/a\0b", 4)) << "callers refuse the NUL";
+    EXPECT_FALSE(pathOfFileURL("/plain/path"));
+    EXPECT_FALSE(pathOfFileURL("file://otherhost/x"));
+    EXPECT_FALSE(pathOfFileURL("file://"));
+    EXPECT_FALSE(pathOfFileURL("file:relative"));
+    EXPECT_FALSE(pathOfFileURL("http:///x"));
+}
+
+TEST(Hex, DigitsOfEitherCaseAndNothingElse) {
+    std::string digits = "0123456789abcdefABCDEF";
+    for (size_t i = 0; i < digits.size(); ++i) EXPECT_EQ(hexDigitValue(digits[i]), i < 16 ? int(i) : int(i) - 6);
+    for (char c : std::string("gG/:@`\x80 ")) EXPECT_EQ(hexDigitValue(c), -1) << c;
+}
+
+}  // namespace
+}  // namespace bexil
