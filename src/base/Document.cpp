@@ -152,76 +152,22 @@ std::optional<Error> checkCharacterReferences(std::string_view text) {
     return std::nullopt;
 }
 
-// ---- base64 ----
-
-constexpr char kBase64Alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-
-void appendBase64(std::string& out, std::span<const uint8_t> bytes) {
-    size_t i = 0;
-    for (; i + 3 <= bytes.size(); i += 3) {
-        uint32_t v = uint32_t(bytes[i]) << 16 | uint32_t(bytes[i + 1]) << 8 | bytes[i + 2];
-        out += kBase64Alphabet[v >> 18];
-        out += kBase64Alphabet[(v >> 12) & 63];
-        out += kBase64Alphabet[(v >> 6) & 63];
-        out += kBase64Alphabet[v & 63];
+// The base64 text of a <data> element, or the reason it is not base64.
+std::variant<std::vector<uint8_t>, std::string> decodeDataText(std::string_view text) {
+    auto decoded = decodeBase64(text);
+    if (auto* bytes = std::get_if<std::vector<uint8_t>>(&decoded)) return std::move(*bytes);
+    const Base64Fault& fault = std::get<Base64Fault>(decoded);
+    switch (fault.kind) {
+        case Base64Fault::Kind::MisplacedPadding:
+            return std::string("misplaced '=' padding");
+        case Base64Fault::Kind::NotBase64:
+            return "character " + snippet(std::string_view(&fault.character, 1)) + " is not base64";
+        case Base64Fault::Kind::TextAfterPadding:
+            return std::string("text after '=' padding");
+        case Base64Fault::Kind::IncompleteGroup:
+            break;
     }
-    size_t rest = bytes.size() - i;
-    if (rest > 0) {
-        uint32_t v = uint32_t(bytes[i]) << 16 | (rest == 2 ? uint32_t(bytes[i + 1]) << 8 : 0);
-        out += kBase64Alphabet[v >> 18];
-        out += kBase64Alphabet[(v >> 12) & 63];
-        out += rest == 2 ? kBase64Alphabet[(v >> 6) & 63] : '=';
-        out += '=';
-    }
-}
-
-int base64Digit(char c) {
-    if (c >= 'A' && c <= 'Z') return c - 'A';
-    if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-    if (c >= '0' && c <= '9') return c - '0' + 52;
-    if (c == '+') return 62;
-    if (c == '/') return 63;
-    return -1;
-}
-
-// The bytes, or a description of the first fault.
-std::variant<std::vector<uint8_t>, std::string> decodeBase64(std::string_view text) {
-    std::vector<uint8_t> out;
-    out.reserve(text.size() / 4 * 3);
-    uint32_t quad = 0;
-    int count = 0;    // digits in the current group of four
-    int padding = 0;  // '=' seen so far; only more '=' and whitespace may follow
-    for (char c : text) {
-        if (isXmlWhitespace(c)) continue;
-        if (c == '=') {
-            if (count < 2) return std::string("misplaced '=' padding");
-            ++padding;
-            ++count;
-            if (count == 4) {
-                if (padding == 2) {
-                    out.push_back(static_cast<uint8_t>(quad >> 4));
-                } else {
-                    out.push_back(static_cast<uint8_t>(quad >> 10));
-                    out.push_back(static_cast<uint8_t>(quad >> 2));
-                }
-                count = 0;
-            }
-            continue;
-        }
-        int d = base64Digit(c);
-        if (d < 0) return "character " + snippet(std::string_view(&c, 1)) + " is not base64";
-        if (padding > 0) return std::string("text after '=' padding");
-        quad = (quad << 6) | static_cast<uint32_t>(d);
-        if (++count == 4) {
-            out.push_back(static_cast<uint8_t>(quad >> 16));
-            out.push_back(static_cast<uint8_t>(quad >> 8));
-            out.push_back(static_cast<uint8_t>(quad));
-            quad = 0;
-            count = 0;
-        }
-    }
-    if (count != 0) return std::string("length is not a multiple of four (missing '=' padding?)");
-    return out;
+    return std::string("length is not a multiple of four (missing '=' padding?)");
 }
 
 // ---- dates ----
@@ -505,7 +451,7 @@ class Reader {
         if (!text) return std::nullopt;
         if (name == "string") return Value::string(std::move(*text));
         if (name == "data") {
-            auto bytes = decodeBase64(*text);
+            auto bytes = decodeDataText(*text);
             if (auto* problem = std::get_if<std::string>(&bytes))
                 return failValue(node, "bad base64 data: " + *problem);
             return Value::data(std::move(std::get<std::vector<uint8_t>>(bytes)));

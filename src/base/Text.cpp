@@ -73,6 +73,89 @@ void appendUtf8(std::string& out, uint32_t codePoint) {
     }
 }
 
+namespace {
+
+constexpr char kBase64Alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+
+int base64Digit(char c) {
+    if (c >= 'A' && c <= 'Z') return c - 'A';
+    if (c >= 'a' && c <= 'z') return c - 'a' + 26;
+    if (c >= '0' && c <= '9') return c - '0' + 52;
+    if (c == '+') return 62;
+    if (c == '/') return 63;
+    return -1;
+}
+
+bool isSpace(char c) { return c == ' ' || c == '\t' || c == '\n' || c == '\r'; }
+
+}  // namespace
+
+void appendBase64(std::string& out, std::span<const uint8_t> bytes) {
+    size_t i = 0;
+    for (; i + 3 <= bytes.size(); i += 3) {
+        uint32_t v = uint32_t(bytes[i]) << 16 | uint32_t(bytes[i + 1]) << 8 | bytes[i + 2];
+        out += kBase64Alphabet[v >> 18];
+        out += kBase64Alphabet[(v >> 12) & 63];
+        out += kBase64Alphabet[(v >> 6) & 63];
+        out += kBase64Alphabet[v & 63];
+    }
+    size_t rest = bytes.size() - i;
+    if (rest > 0) {
+        uint32_t v = uint32_t(bytes[i]) << 16 | (rest == 2 ? uint32_t(bytes[i + 1]) << 8 : 0);
+        out += kBase64Alphabet[v >> 18];
+        out += kBase64Alphabet[(v >> 12) & 63];
+        out += rest == 2 ? kBase64Alphabet[(v >> 6) & 63] : '=';
+        out += '=';
+    }
+}
+
+std::string base64(std::span<const uint8_t> bytes) {
+    std::string out;
+    out.reserve((bytes.size() + 2) / 3 * 4);
+    appendBase64(out, bytes);
+    return out;
+}
+
+std::variant<std::vector<uint8_t>, Base64Fault> decodeBase64(std::string_view text) {
+    using Kind = Base64Fault::Kind;
+    std::vector<uint8_t> out;
+    out.reserve(text.size() / 4 * 3);
+    uint32_t quad = 0;
+    int count = 0;    // digits in the current group of four
+    int padding = 0;  // '=' seen so far; only more '=' and white space may follow
+    for (char c : text) {
+        if (isSpace(c)) continue;
+        if (c == '=') {
+            if (count < 2) return Base64Fault{Kind::MisplacedPadding};
+            ++padding;
+            ++count;
+            if (count == 4) {
+                if (padding == 2) {
+                    out.push_back(static_cast<uint8_t>(quad >> 4));
+                } else {
+                    out.push_back(static_cast<uint8_t>(quad >> 10));
+                    out.push_back(static_cast<uint8_t>(quad >> 2));
+                }
+                count = 0;
+            }
+            continue;
+        }
+        int d = base64Digit(c);
+        if (d < 0) return Base64Fault{Kind::NotBase64, c};
+        if (padding > 0) return Base64Fault{Kind::TextAfterPadding};
+        quad = (quad << 6) | static_cast<uint32_t>(d);
+        if (++count == 4) {
+            out.push_back(static_cast<uint8_t>(quad >> 16));
+            out.push_back(static_cast<uint8_t>(quad >> 8));
+            out.push_back(static_cast<uint8_t>(quad));
+            quad = 0;
+            count = 0;
+        }
+    }
+    if (count != 0) return Base64Fault{Kind::IncompleteGroup};
+    return out;
+}
+
 std::optional<std::string> pathOfFileURL(std::string_view text) {
     constexpr std::string_view kScheme = "file://", kLocalHost = "localhost";
     if (!text.starts_with(kScheme)) return std::nullopt;

@@ -6,8 +6,11 @@
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
+#include <variant>
+#include <vector>
 
 namespace bexil {
 
@@ -39,6 +42,19 @@ size_t firstInvalidUtf8(std::string_view text);
 
 // Appends the UTF-8 form of `codePoint` (which must be at most U+10FFFF and not a surrogate).
 void appendUtf8(std::string& out, uint32_t codePoint);
+
+// Appends the base64 form of `bytes` (standard alphabet, "=" padding, no line breaks).
+void appendBase64(std::string& out, std::span<const uint8_t> bytes);
+std::string base64(std::span<const uint8_t> bytes);
+
+// Why a text is not base64.
+struct Base64Fault {
+    enum class Kind { MisplacedPadding, NotBase64, TextAfterPadding, IncompleteGroup } kind;
+    char character = 0;  // the offending character, for NotBase64
+};
+// The bytes of base64 text (standard alphabet; spaces, tabs and line breaks anywhere are skipped; every group of
+// four complete, "=" padding only at the end of the last), or the first fault.
+std::variant<std::vector<uint8_t>, Base64Fault> decodeBase64(std::string_view text);
 
 // The path that a local file URL names: "file://", optionally "localhost", then an absolute path whose %XX escapes
 // are decoded ("file:///a%20b" -> "/a b", "file://localhost/x" -> "/x"); a "%" not followed by two hexadecimal

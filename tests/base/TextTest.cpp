@@ -76,6 +76,33 @@ TEST(FileURL, LocalURLsGiveTheirDecodedPathAndNothingElseIsOne) {
     EXPECT_FALSE(pathOfFileURL("http:///x"));
 }
 
+TEST(Base64, EveryLengthRoundTripsAndPaddingIsStrict) {
+    std::vector<uint8_t> bytes;
+    for (uint8_t next : {0x00, 0xFF, 0x10, 0x80, 0x7F, 0xFE, 0x01}) {
+        std::string text = base64(bytes);
+        EXPECT_EQ(text.size() % 4, 0u);
+        auto decoded = decodeBase64(text);
+        ASSERT_TRUE(std::holds_alternative<std::vector<uint8_t>>(decoded)) << text;
+        EXPECT_EQ(std::get<std::vector<uint8_t>>(decoded), bytes) << text;
+        bytes.push_back(next);
+    }
+    EXPECT_EQ(base64(std::vector<uint8_t>{'h', 'i'}), "aGk=");
+    EXPECT_EQ(std::get<std::vector<uint8_t>>(decodeBase64(" aG\nk=\r\n")), (std::vector<uint8_t>{'h', 'i'}));
+
+    using Kind = Base64Fault::Kind;
+    const std::pair<const char*, Kind> faults[] = {
+        {"=AAA", Kind::MisplacedPadding}, {"A===", Kind::MisplacedPadding}, {"aGk=aGk=", Kind::TextAfterPadding},
+        {"aG=k", Kind::TextAfterPadding}, {"aGk", Kind::IncompleteGroup},   {"aG=", Kind::IncompleteGroup},
+        {"aG-k", Kind::NotBase64},        {"aGk*", Kind::NotBase64},
+    };
+    for (const auto& [text, kind] : faults) {
+        auto decoded = decodeBase64(text);
+        ASSERT_TRUE(std::holds_alternative<Base64Fault>(decoded)) << text;
+        EXPECT_EQ(std::get<Base64Fault>(decoded).kind, kind) << text;
+    }
+    EXPECT_EQ(std::get<Base64Fault>(decodeBase64("aG-k")).character, '-');
+}
+
 TEST(Hex, DigitsOfEitherCaseAndNothingElse) {
     std::string digits = "0123456789abcdefABCDEF";
     for (size_t i = 0; i < digits.size(); ++i) EXPECT_EQ(hexDigitValue(digits[i]), i < 16 ? int(i) : int(i) - 6);

@@ -307,29 +307,6 @@ void writeString(std::string& out, std::string_view s) {
     out += '"';
 }
 
-std::string base64(std::span<const uint8_t> bytes) {
-    static constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    std::string out;
-    size_t i = 0;
-    for (; i + 2 < bytes.size(); i += 3) {
-        uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8) | bytes[i + 2];
-        for (int k = 18; k >= 0; k -= 6) out += kAlphabet[(n >> k) & 0x3F];
-    }
-    if (i + 1 == bytes.size()) {
-        uint32_t n = bytes[i] << 16;
-        out += kAlphabet[(n >> 18) & 0x3F];
-        out += kAlphabet[(n >> 12) & 0x3F];
-        out += "==";
-    } else if (i + 2 == bytes.size()) {
-        uint32_t n = (bytes[i] << 16) | (bytes[i + 1] << 8);
-        out += kAlphabet[(n >> 18) & 0x3F];
-        out += kAlphabet[(n >> 12) & 0x3F];
-        out += kAlphabet[(n >> 6) & 0x3F];
-        out += '=';
-    }
-    return out;
-}
-
 void write(std::string& out, const Value& value, JsonLayout layout, int indent) {
     auto newline = [&](int level) {
         if (layout == JsonLayout::OneLine) return;
