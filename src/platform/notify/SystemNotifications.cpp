@@ -17,6 +17,7 @@
 
 #include "base/PosixError.h"
 #include "base/StandardPaths.h"
+#include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -34,11 +35,10 @@ Error failure(int error, std::string_view what) {
 
 // The counter file is a decimal number; anything else (a stray file) counts as 0 so that the next post repairs it.
 uint64_t readCounter(const fs::path& path) {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return 0;
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) return 0;
     std::array<char, 32> buffer{};
-    ssize_t n = ::read(fd, buffer.data(), buffer.size() - 1);
-    ::close(fd);
+    ssize_t n = ::read(fd.get(), buffer.data(), buffer.size() - 1);
     if (n <= 0) return 0;
     uint64_t value = 0;
     auto [end, error] = std::from_chars(buffer.data(), buffer.data() + n, value);
@@ -46,19 +46,6 @@ uint64_t readCounter(const fs::path& path) {
     (void)end;
     return value;
 }
-
-class FdCloser {
-  public:
-    explicit FdCloser(int fd) : fd_(fd) {}
-    ~FdCloser() {
-        if (fd_ >= 0) ::close(fd_);
-    }
-    FdCloser(const FdCloser&) = delete;
-    FdCloser& operator=(const FdCloser&) = delete;
-
-  private:
-    int fd_;
-};
 
 }  // namespace
 
@@ -90,7 +77,7 @@ std::optional<Error> SystemNotifications::post(std::string_view name) {
 
     int lockFd = ::open((directory_ / kLockFileName).c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
     if (lockFd < 0) return failure(errno, "cannot open notification lock in " + directory_.string());
-    FdCloser closeLock(lockFd);
+    UniqueFd closeLock(lockFd);
     while (::flock(lockFd, LOCK_EX) != 0) {
         if (errno != EINTR) return failure(errno, "cannot lock notification folder " + directory_.string());
     }

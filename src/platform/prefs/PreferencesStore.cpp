@@ -19,6 +19,7 @@
 #include <system_error>
 
 #include "base/Document.h"
+#include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -32,20 +33,6 @@ int64_t nanoseconds(const struct timespec& time) {
 }
 
 // Closes a descriptor when the scope ends.
-class ScopedFd {
-  public:
-    explicit ScopedFd(int fd) : fd_(fd) {}
-    ~ScopedFd() {
-        if (fd_ >= 0) ::close(fd_);
-    }
-    ScopedFd(const ScopedFd&) = delete;
-    ScopedFd& operator=(const ScopedFd&) = delete;
-    int get() const { return fd_; }
-
-  private:
-    int fd_;
-};
-
 }  // namespace
 
 fs::path PreferencesStore::defaultDirectory() {
@@ -91,7 +78,7 @@ std::optional<Error> PreferencesStore::checkDomain(std::string_view domain) {
 
 Result<Value> PreferencesStore::readFile(const fs::path& file, FileIdentity* identity) const {
     *identity = {};
-    ScopedFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
+    UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
     if (fd.get() < 0) {
         if (errno == ENOENT) return Value::emptyDictionary();
         return posixError(errno, "cannot open " + file.string());
@@ -185,7 +172,7 @@ std::optional<Error> PreferencesStore::setValue(std::string_view domain, std::st
 
     // The read-modify-write of two writers must not interleave, or one of their changes would be lost. The lock is
     // on the directory itself, so no lock file is left lying around; it is released when the descriptor closes.
-    ScopedFd lockFd(::open(directory_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    UniqueFd lockFd(::open(directory_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (lockFd.get() < 0) return posixError(errno, "cannot open " + directory_.string());
     while (::flock(lockFd.get(), LOCK_EX) != 0) {
         if (errno != EINTR) return posixError(errno, "cannot lock " + directory_.string());
