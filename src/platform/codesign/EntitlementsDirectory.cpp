@@ -9,6 +9,7 @@
 #include <set>
 
 #include "base/Document.h"
+#include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -16,10 +17,7 @@ namespace bexil {
 EntitlementsDirectory::EntitlementsDirectory(std::filesystem::path directory, uid_t trustedUid)
     : directory_(std::move(directory)), trustedUid_(trustedUid) {}
 
-std::filesystem::path EntitlementsDirectory::defaultPath() {
-    if (const char* env = getenv("BX_ENTITLEMENTS_DIR"); env && *env) return env;
-    return "/etc/bexil/entitlements.d";
-}
+std::filesystem::path EntitlementsDirectory::defaultPath() { return entitlementsDirectory(); }
 
 static bool ownerAndModeTrusted(const struct stat& st, uid_t trustedUid) {
     bool ownerOk = st.st_uid == 0 || st.st_uid == trustedUid;

@@ -19,6 +19,7 @@
 #include <system_error>
 
 #include "base/Document.h"
+#include "base/StandardPaths.h"
 #include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
@@ -35,13 +36,7 @@ int64_t nanoseconds(const struct timespec& time) {
 // Closes a descriptor when the scope ends.
 }  // namespace
 
-fs::path PreferencesStore::defaultDirectory() {
-    if (const char* dir = getenv("BX_PREFERENCES_DIR"); dir && *dir) return fs::path(dir);
-    if (const char* config = getenv("XDG_CONFIG_HOME"); config && *config)
-        return fs::path(config) / "bexil" / "preferences";
-    const char* home = getenv("HOME");
-    return fs::path(home && *home ? home : "/") / ".config" / "bexil" / "preferences";
-}
+fs::path PreferencesStore::defaultDirectory() { return preferencesDirectory(); }
 
 std::string PreferencesStore::currentHostName() {
     std::array<char, 256> host{};

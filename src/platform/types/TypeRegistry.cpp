@@ -10,6 +10,7 @@
 #include <unordered_set>
 #include <utility>
 
+#include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -77,19 +78,7 @@ TypeRegistry::TypeRegistry(std::vector<std::filesystem::path> dataDirs, std::chr
 
 TypeRegistry::~TypeRegistry() = default;
 
-std::vector<std::filesystem::path> TypeRegistry::defaultDataDirs() {
-    std::vector<std::filesystem::path> dirs;
-    const char* env = std::getenv("XDG_DATA_DIRS");
-    std::string_view list = (env != nullptr && *env != '\0') ? std::string_view(env) : "/usr/local/share:/usr/share";
-    while (!list.empty()) {
-        size_t colon = list.find(':');
-        std::string_view item = list.substr(0, colon);
-        if (!item.empty()) dirs.emplace_back(std::string(item));
-        if (colon == std::string_view::npos) break;
-        list.remove_prefix(colon + 1);
-    }
-    return dirs;
-}
+std::vector<std::filesystem::path> TypeRegistry::defaultDataDirs() { return dataDirectories(); }
 
 TypeRegistry& TypeRegistry::shared() {
     static TypeRegistry* registry = new TypeRegistry(defaultDataDirs());  // never destroyed: used until exit

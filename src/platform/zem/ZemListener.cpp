@@ -17,6 +17,7 @@
 
 #include "base/EventLoopAsio.h"
 #include "base/PosixError.h"
+#include "base/StandardPaths.h"
 #include "platform/codesign/CodeSigningIdentity.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemSocketConnection.h"
@@ -223,13 +224,7 @@ bool socketIsLive(const std::string& path) {
 
 }  // namespace
 
-std::filesystem::path ZemListener::serviceDirectory() {
-    if (const char* dir = getenv("BX_SERVICE_DIR"); dir && *dir) return dir;
-    if (geteuid() == 0) return "/run/bexil";
-    if (const char* runtime = getenv("XDG_RUNTIME_DIR"); runtime && *runtime)
-        return std::filesystem::path(runtime) / "bexil";
-    return std::filesystem::path("/tmp") / ("bexil-" + std::to_string(geteuid()));
-}
+std::filesystem::path ZemListener::serviceDirectory() { return bexil::serviceDirectory(); }
 
 std::filesystem::path ZemListener::socketPathForService(const std::string& serviceName) {
     return serviceDirectory() / serviceName;
