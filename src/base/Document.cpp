@@ -170,114 +170,6 @@ std::variant<std::vector<uint8_t>, std::string> decodeDataText(std::string_view 
     return std::string("length is not a multiple of four (missing '=' padding?)");
 }
 
-// ---- dates ----
-
-constexpr int64_t kSecondsPerDay = 86400;
-// 0000-01-01T00:00:00Z and 9999-12-31T23:59:59Z: the years that four digits can spell.
-constexpr int64_t kFirstWritableSecond = -62167219200;
-constexpr int64_t kLastWritableSecond = 253402300799;
-
-int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
-    y -= m <= 2;
-    int64_t era = (y >= 0 ? y : y - 399) / 400;
-    auto yoe = static_cast<unsigned>(y - era * 400);
-    unsigned doy = (153 * (m + (m > 2 ? -3 : 9)) + 2) / 5 + d - 1;
-    unsigned doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
-    return era * 146097 + static_cast<int64_t>(doe) - 719468;
-}
-
-void civilFromDays(int64_t z, int64_t& y, unsigned& m, unsigned& d) {
-    z += 719468;
-    int64_t era = (z >= 0 ? z : z - 146096) / 146097;
-    auto doe = static_cast<unsigned>(z - era * 146097);
-    unsigned yoe = (doe - doe / 1460 + doe / 36524 - doe / 146096) / 365;
-    y = static_cast<int64_t>(yoe) + era * 400;
-    unsigned doy = doe - (365 * yoe + yoe / 4 - yoe / 100);
-    unsigned mp = (5 * doy + 2) / 153;
-    d = doy - (153 * mp + 2) / 5 + 1;
-    m = mp < 10 ? mp + 3 : mp - 9;
-    y += m <= 2;
-}
-
-bool readFixedDigits(std::string_view s, size_t pos, size_t count, unsigned& out) {
-    unsigned v = 0;
-    for (size_t i = pos; i < pos + count; ++i) {
-        if (s[i] < '0' || s[i] > '9') return false;
-        v = v * 10 + static_cast<unsigned>(s[i] - '0');
-    }
-    out = v;
-    return true;
-}
-
-// "YYYY-MM-DDTHH:MM:SS[.digits]Z": the whole seconds plus the fraction read as one decimal number, so the writer
-// can predict exactly which double a text gives.
-std::optional<double> parseDate(std::string_view s) {
-    unsigned year, month, day, hour, minute, second;
-    if (s.size() < 20 || !readFixedDigits(s, 0, 4, year) || s[4] != '-' || !readFixedDigits(s, 5, 2, month) ||
-        s[7] != '-' || !readFixedDigits(s, 8, 2, day) || s[10] != 'T' || !readFixedDigits(s, 11, 2, hour) ||
-        s[13] != ':' || !readFixedDigits(s, 14, 2, minute) || s[16] != ':' || !readFixedDigits(s, 17, 2, second))
-        return std::nullopt;
-    if (s.back() != 'Z') return std::nullopt;
-    if (month < 1 || month > 12 || day < 1 || hour > 23 || minute > 59 || second > 59) return std::nullopt;
-    static constexpr unsigned kDaysInMonth[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
-    bool leap = (year % 4 == 0 && year % 100 != 0) || year % 400 == 0;
-    if (day > kDaysInMonth[month - 1] + (month == 2 && leap ? 1 : 0)) return std::nullopt;
-    int64_t whole = daysFromCivil(year, month, day) * kSecondsPerDay + hour * 3600 + minute * 60 + second;
-    std::string_view rest = s.substr(19, s.size() - 20);
-    double fraction = 0;
-    if (!rest.empty()) {
-        if (rest.size() < 2 || rest[0] != '.') return std::nullopt;
-        for (char c : rest.substr(1))
-            if (c < '0' || c > '9') return std::nullopt;
-        std::string number = "0";
-        number += rest;
-        auto [end, ec] = std::from_chars(number.data(), number.data() + number.size(), fraction);
-        if (ec != std::errc() || end != number.data() + number.size()) return std::nullopt;
-    }
-    return static_cast<double>(whole) + fraction;
-}
-
-// The text of a date that parseDate reads back as exactly `seconds`, or none when there is no such text.
-std::optional<std::string> formatDate(double seconds) {
-    if (!std::isfinite(seconds)) return std::nullopt;
-    double whole = std::floor(seconds);
-    if (whole < static_cast<double>(kFirstWritableSecond) || whole > static_cast<double>(kLastWritableSecond))
-        return std::nullopt;
-    auto w = static_cast<int64_t>(whole);
-    int64_t days = w >= 0 ? w / kSecondsPerDay : -((-w + kSecondsPerDay - 1) / kSecondsPerDay);
-    int64_t secondOfDay = w - days * kSecondsPerDay;
-    int64_t year;
-    unsigned month, day;
-    civilFromDays(days, year, month, day);
-    char buf[32];
-    snprintf(buf, sizeof buf, "%04d-%02u-%02uT%02d:%02d:%02d", static_cast<int>(year), month, day,
-             static_cast<int>(secondOfDay / 3600), static_cast<int>(secondOfDay / 60 % 60),
-             static_cast<int>(secondOfDay % 60));
-    std::string base(buf);
-    double fraction = seconds - whole;
-    if (fraction == 0) return base + "Z";
-    // Prefer the short forms people write (milliseconds, microseconds); fall back to the exact decimal expansion.
-    auto attempt = [&](std::string_view digits) -> std::optional<std::string> {
-        // digits is "0.xxx" from to_chars
-        if (digits.size() < 3 || digits[0] != '0') return std::nullopt;
-        while (digits.size() > 3 && digits.back() == '0') digits.remove_suffix(1);
-        std::string text = base + std::string(digits.substr(1)) + "Z";
-        auto back = parseDate(text);
-        if (back && std::bit_cast<uint64_t>(*back) == std::bit_cast<uint64_t>(seconds)) return text;
-        return std::nullopt;
-    };
-    std::array<char, 1200> chars;
-    for (int precision = 1; precision <= 9; ++precision) {
-        auto r =
-            std::to_chars(chars.data(), chars.data() + chars.size(), fraction, std::chars_format::fixed, precision);
-        if (r.ec != std::errc()) break;
-        if (auto text = attempt(std::string_view(chars.data(), r.ptr))) return text;
-    }
-    auto r = std::to_chars(chars.data(), chars.data() + chars.size(), fraction, std::chars_format::fixed);
-    if (r.ec == std::errc()) return attempt(std::string_view(chars.data(), r.ptr));
-    return std::nullopt;
-}
-
 // ---- reals and integers ----
 
 std::optional<double> parseReal(std::string_view s) {
@@ -463,11 +355,11 @@ class Reader {
             if (!d) return failValue(node, "bad real " + snippet(s));
             return Value::real(*d);
         }
-        auto seconds = parseDate(s);
-        if (!seconds) return failValue(node, "bad date " + snippet(s) + ", expected YYYY-MM-DDTHH:MM:SS[.fraction]Z");
+        auto date = Date::fromIso8601(s);
+        if (!date) return failValue(node, "bad date " + snippet(s) + ", expected YYYY-MM-DDTHH:MM:SS[.fraction]Z");
         // A fraction can round a date past 9999-12-31T23:59:59Z; only dates that can be written again are read.
-        if (!formatDate(*seconds)) return failValue(node, "date " + snippet(s) + " out of range");
-        return Value::date(Date{*seconds});
+        if (!date->exactIso8601()) return failValue(node, "date " + snippet(s) + " out of range");
+        return Value::date(*date);
     }
 
     std::optional<Value> readInteger(pugi::xml_node node, std::string_view s) {
@@ -664,7 +556,7 @@ class Writer {
                 return true;
             }
             case ValueKind::Date: {
-                auto text = formatDate(value.getDate()->secondsSince1970);
+                auto text = value.getDate()->exactIso8601();
                 if (!text) {
                     return fail(kDocumentUnrepresentable, "a date outside the years 0000-9999 (" +
                                                               std::to_string(value.getDate()->secondsSince1970) +

@@ -16,50 +16,15 @@
 #include <utility>
 #include <vector>
 
+#include "base/Date.h"
+#include "base/Uuid.h"
+
 namespace bexil {
 
 enum class ValueKind : uint8_t { Null, Bool, Int64, UInt64, Real, String, Data, Date, Uuid, Array, Dictionary };
 
 // The name of a kind as it appears in error messages ("dictionary", "uint64", ...).
 const char* valueKindName(ValueKind kind);
-
-// A 128-bit universally unique identifier. The nil UUID (all zero) is the default.
-class Uuid {
-  public:
-    static constexpr size_t kTextLength = 36;
-
-    Uuid() = default;
-    explicit Uuid(const std::array<uint8_t, 16>& bytes) : bytes_(bytes) {}
-
-    // A fresh random (version 4) UUID from the kernel's random source.
-    static Uuid random();
-    // Accepts exactly the canonical 8-4-4-4-12 hexadecimal form, in either letter case; anything else is none.
-    static std::optional<Uuid> parse(std::string_view text);
-
-    // The canonical upper-case text of 36 characters.
-    std::string string() const;
-    const std::array<uint8_t, 16>& bytes() const { return bytes_; }
-    bool isNil() const;
-
-    auto operator<=>(const Uuid&) const = default;
-    bool operator==(const Uuid&) const = default;
-
-  private:
-    std::array<uint8_t, 16> bytes_{};
-};
-
-// A point in time as seconds since 1970-01-01T00:00:00Z (fractions allowed, negative before 1970).
-struct Date {
-    double secondsSince1970 = 0;
-
-    static Date now();
-    // ISO 8601 in UTC, "2026-11-23T10:03:25Z", with a fraction of a second only when there is one.
-    std::string iso8601() const;
-    // Accepts "YYYY-MM-DDTHH:MM:SS[.fraction]Z"; anything else is none.
-    static std::optional<Date> parseIso8601(std::string_view text);
-
-    auto operator<=>(const Date&) const = default;
-};
 
 namespace detail {
 struct Node;
