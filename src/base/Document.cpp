@@ -622,18 +622,6 @@ class Writer {
 
 // ---- Document ----
 
-int Document::FileSystem::open(const char* path, int flags, mode_t mode) { return ::open(path, flags, mode); }
-ssize_t Document::FileSystem::write(int fd, const void* bytes, size_t count) { return ::write(fd, bytes, count); }
-int Document::FileSystem::fsync(int fd) { return ::fsync(fd); }
-int Document::FileSystem::close(int fd) { return ::close(fd); }
-int Document::FileSystem::rename(const char* from, const char* to) { return ::rename(from, to); }
-int Document::FileSystem::unlink(const char* path) { return ::unlink(path); }
-
-Document::FileSystem& Document::posixFileSystem() {
-    static FileSystem fileSystem;
-    return fileSystem;
-}
-
 Result<Value> Document::read(std::string_view text) { return Reader(text).run(); }
 
 Result<std::string> Document::write(const Value& value) { return Writer().run(value); }
@@ -676,54 +664,7 @@ std::optional<Error> Document::writeFileAtomically(const std::filesystem::path& 
     Result<std::string> text = write(value);
     if (!text.ok()) return text.error();
 
-    // A name of our own beside the target, so the rename stays within one file system.
-    std::array<uint8_t, 8> random{};
-    if (getrandom(random.data(), random.size(), GRND_NONBLOCK) != static_cast<ssize_t>(random.size())) random.fill(0);
-    std::string suffix = ".tmp-" + std::to_string(getpid()) + "-";
-    for (uint8_t b : random) {
-        char hex[3];
-        snprintf(hex, sizeof hex, "%02x", b);
-        suffix += hex;
-    }
-    std::filesystem::path temporary = path;
-    temporary += suffix;
-
-    int fd = fs.open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
-    if (fd < 0) return fileError(errno, "create", temporary);
-
-    auto abandon = [&](int err, const char* operation, bool closeFirst) {
-        if (closeFirst) fs.close(fd);
-        fs.unlink(temporary.c_str());
-        return fileError(err, operation, temporary);
-    };
-
-    std::string_view rest = *text;
-    while (!rest.empty()) {
-        ssize_t n = fs.write(fd, rest.data(), rest.size());
-        if (n < 0 && errno == EINTR) continue;
-        if (n < 0) return abandon(errno, "write", true);
-        if (n == 0) return abandon(EIO, "write", true);
-        rest.remove_prefix(static_cast<size_t>(n));
-    }
-    if (fs.fsync(fd) != 0) return abandon(errno, "fsync", true);
-    if (fs.close(fd) != 0) return abandon(errno, "close", false);
-    if (fs.rename(temporary.c_str(), path.c_str()) != 0) {
-        int err = errno;
-        fs.unlink(temporary.c_str());
-        return fileError(err, "rename over", path);
-    }
-
-    std::filesystem::path directory = path.parent_path();
-    if (directory.empty()) directory = ".";
-    int dirFd = fs.open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC, 0);
-    if (dirFd < 0) return fileError(errno, "open directory", directory);
-    if (fs.fsync(dirFd) != 0) {
-        int err = errno;
-        fs.close(dirFd);
-        return fileError(err, "fsync directory", directory);
-    }
-    fs.close(dirFd);
-    return std::nullopt;
+    return replaceFileAtomically(path, *text, 0666, Durability::Synced, fs);
 }
 
 }  // namespace bexil

@@ -12,6 +12,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/AtomicFile.h"
 #include "base/Error.h"
 #include "base/PosixError.h"
 #include "base/Value.h"
@@ -39,20 +40,9 @@ inline constexpr size_t kMaxDocumentBytes = 64u << 20;
 
 class Document {
   public:
-    // The system calls of an atomic file write. The POSIX implementation is the default; tests derive from it to
-    // make one call fail. Each returns what the system call returns and leaves errno set on failure.
-    class FileSystem {
-      public:
-        virtual ~FileSystem() = default;
-        virtual int open(const char* path, int flags, mode_t mode);
-        virtual ssize_t write(int fd, const void* bytes, size_t count);
-        virtual int fsync(int fd);
-        virtual int close(int fd);
-        virtual int rename(const char* from, const char* to);
-        virtual int unlink(const char* path);
-    };
-    // The plain POSIX calls.
-    static FileSystem& posixFileSystem();
+    // The system calls of the atomic file write (base/AtomicFile.h).
+    using FileSystem = bexil::FileSystem;
+    static FileSystem& posixFileSystem() { return bexil::posixFileSystem(); }
 
     // The value a document holds. Malformed text is an error naming what is wrong, where it is in the value
     // (root["key"][index]) and its byte offset; no partial value is ever returned.

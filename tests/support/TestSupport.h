@@ -104,7 +104,7 @@ class DaemonDirs {
 
 // Makes one named call fail with a given errno (after `afterCalls` successful ones), otherwise makes the real
 // calls; writes are cut to 4 KiB so that writers must loop over short writes.
-class FailingFileSystem : public Document::FileSystem {
+class FailingFileSystem : public FileSystem {
   public:
     FailingFileSystem(std::string call, int error, int afterCalls = 0)
         : call_(std::move(call)), error_(error), afterCalls_(afterCalls) {}

@@ -15,6 +15,7 @@
 #include <cstring>
 #include <vector>
 
+#include "base/AtomicFile.h"
 #include "base/PosixError.h"
 #include "base/StandardPaths.h"
 #include "base/UniqueFd.h"
@@ -84,22 +85,10 @@ std::optional<Error> SystemNotifications::post(std::string_view name) {
 
     const fs::path target = directory_ / std::string(name);
     const std::string text = std::to_string(readCounter(target) + 1) + "\n";
-    const fs::path temporary = directory_ / ("." + std::string(name) + "." + std::to_string(getpid()) + ".tmp");
-    int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-    if (fd < 0) return failure(errno, "cannot write " + temporary.string());
-    ssize_t written = ::write(fd, text.data(), text.size());
-    int writeErrno = errno;
-    ::close(fd);
-    if (written != static_cast<ssize_t>(text.size())) {
-        ::unlink(temporary.c_str());
-        return failure(written < 0 ? writeErrno : EIO, "cannot write " + temporary.string());
-    }
     // The counter is a wake-up signal, not data worth an fsync: after a crash observers start over anyway.
-    if (::rename(temporary.c_str(), target.c_str()) != 0) {
-        int error = errno;
-        ::unlink(temporary.c_str());
-        return failure(error, "cannot replace " + target.string());
-    }
+    if (std::optional<Error> error = replaceFileAtomically(target, text, 0644, Durability::ReadersOnly))
+        return BXError(ErrorCode::OperationFailed,
+                       "cannot replace " + target.string() + ": " + error->localizedDescription().value_or(""));
     return std::nullopt;
 }
 

@@ -13,6 +13,8 @@
 #include <climits>
 #include <cstdlib>
 
+#include "base/AtomicFile.h"
+#include "base/PosixError.h"
 #include "base/StandardPaths.h"
 
 namespace bexil {
@@ -35,24 +37,14 @@ std::string hex(const unsigned char* bytes, size_t count) {
     return text;
 }
 
-// Writes the key to a fresh temporary file of mode 0600 and renames it into place, so a reader sees the old key or
-// the new one, never a part.
+// Replaces the key file (mode 0600) so that a reader sees the old key or the new one, never a part. False with
+// errno set on failure.
 bool writeKey(const fs::path& path, const std::vector<uint8_t>& key) {
     std::error_code ec;
     fs::create_directories(path.parent_path(), ec);
-    fs::path temporary = path;
-    temporary += ".tmp-" + std::to_string(getpid());
-    int fd = ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600);
-    if (fd < 0) return false;
-    // The mode of an existing temporary left by a crash is not trusted.
-    bool ok = ::fchmod(fd, 0600) == 0 && ::write(fd, key.data(), key.size()) == static_cast<ssize_t>(key.size()) &&
-              ::fsync(fd) == 0;
-    int saved = errno;
-    ::close(fd);
-    if (!ok || ::rename(temporary.c_str(), path.c_str()) != 0) {
-        if (ok) saved = errno;
-        ::unlink(temporary.c_str());
-        errno = saved;
+    std::string_view bytes(reinterpret_cast<const char*>(key.data()), key.size());
+    if (std::optional<Error> error = replaceFileAtomically(path, bytes, 0600)) {
+        errno = error->domain() == BXPosixErrorDomain ? static_cast<int>(error->code()) : EIO;
         return false;
     }
     return true;
