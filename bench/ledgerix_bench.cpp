@@ -171,15 +171,16 @@ void queryByExtensionPoint(benchmark::State& state) {
     std::mt19937 random(11);
     size_t found = 0, filtered = 0;
     for (auto _ : state) {
+        std::string point = "com.example.point" + std::to_string(random() % (f.plugInCount / kPlugInsPerPoint));
         Value query = Value::dictionary(
-            {{"RZExtensionPointIdentifier",
-              Value::string("com.example.point" + std::to_string(random() % (f.plugInCount / kPlugInsPerPoint)))},
-             {"RZUserElection", Value::string("1")}});
+            {{"RZExtensionPointIdentifier", Value::string(point)}, {"RZUserElection", Value::string("1")}});
         auto matches = workspace->pluginsMatchingQueryApplyFilter(
-            query, [&](std::string_view, const std::optional<Value>& entitlements) {
+            query,
+            [&](std::string_view, const std::optional<Value>& entitlements) {
                 ++filtered;
                 return !entitlements.has_value();
-            });
+            },
+            LXPreselection{.extensionPoints = std::vector<std::string>{point}});
         found += matches ? matches->size() : 0;
     }
     state.counters["matches"] = benchmark::Counter(static_cast<double>(found), benchmark::Counter::kAvgIterations);

@@ -246,7 +246,11 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
         LXPlugInFilter filter = [this, &wanted](std::string_view identifier, const std::optional<Value>& entitlements) {
             return !wanted || electionFilter(*wanted, identifier, entitlements);
         };
-        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filter);
+        LXPreselection preselection{
+            .extensionPoints = BXMatchRules::requiredValues(query, BXMatchRules::kExtensionPointKey),
+            .identifiers = BXMatchRules::requiredValues(query, BXMatchRules::kIdentifierKey),
+        };
+        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filter, preselection);
         log::lx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, query, proxies);
     }
 

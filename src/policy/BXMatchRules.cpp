@@ -27,6 +27,32 @@ const Value& falseValue() {
 bool isTrue(const Value& value) { return value == trueValue(); }
 bool isFalse(const Value& value) { return value == falseValue(); }
 
+// A comparison pattern: the operand and the outcome of compareVersionString that makes it hold (or, negated, fail).
+// Two-character operators first, so "<>" and "<=" are not read as "<", nor ">=" as ">". Only one operator is
+// stripped: "==a" compares against "=a". No operator means equality.
+struct Comparison {
+    std::string_view operand;
+    ComparisonResult wanted = ComparisonResult::Same;
+    bool negated = false;
+};
+
+Comparison comparisonOf(std::string_view pattern) {
+    struct Operator {
+        std::string_view prefix;
+        ComparisonResult wanted;
+        bool negated;
+    };
+    static constexpr Operator kOperators[] = {
+        {"<>", ComparisonResult::Same, true},      {"<=", ComparisonResult::Descending, true},
+        {">=", ComparisonResult::Ascending, true}, {"=", ComparisonResult::Same, false},
+        {"<", ComparisonResult::Ascending, false}, {">", ComparisonResult::Descending, false},
+    };
+    for (const Operator& op : kOperators) {
+        if (pattern.starts_with(op.prefix)) return {pattern.substr(op.prefix.size()), op.wanted, op.negated};
+    }
+    return {pattern};
+}
+
 const TypeRegistry& typesOf(const BXMatchContext& context) {
     return context.types != nullptr ? *context.types : TypeRegistry::shared();
 }
@@ -127,30 +153,38 @@ bool BXMatchRules::matchValuePattern(std::string_view value, const Value& patter
         return false;
     }
 
-    // Two-character operators first, so "<>" and "<=" are not read as "<", nor ">=" as ">". Only one operator is
-    // stripped: "==a" compares against "=a".
-    struct Operator {
-        std::string_view prefix;
-        ComparisonResult wanted;
-        bool negated;
+    Comparison comparison = comparisonOf(p);
+    return (compareVersionString(value, comparison.operand) == comparison.wanted) != comparison.negated;
+}
+
+std::optional<std::vector<std::string>> BXMatchRules::requiredValues(const Value& rules, std::string_view key) {
+    const Value* pattern = rules.isDictionary() ? rules.find(key) : nullptr;
+    if (pattern == nullptr) return std::nullopt;
+    // Only string patterns (alone or as a list of alternatives) are tested by comparison; every other kind is a
+    // presence or activation-rule test that many values pass.
+    auto equalTo = [](const Value& one) -> std::optional<std::string> {
+        const std::string* text = one.getString();
+        if (text == nullptr || text->starts_with('?')) return std::nullopt;
+        Comparison comparison = comparisonOf(*text);
+        // Same under compareVersionString holds for exactly one string: digit runs of equal value but different
+        // length ("01", "1") compare unequal, every other byte compares as itself.
+        if (comparison.wanted != ComparisonResult::Same || comparison.negated) return std::nullopt;
+        return std::string(comparison.operand);
     };
-    static constexpr Operator kOperators[] = {
-        {"<>", ComparisonResult::Same, true},      {"<=", ComparisonResult::Descending, true},
-        {">=", ComparisonResult::Ascending, true}, {"=", ComparisonResult::Same, false},
-        {"<", ComparisonResult::Ascending, false}, {">", ComparisonResult::Descending, false},
-    };
-    std::string_view operand = p;
-    ComparisonResult wanted = ComparisonResult::Same;
-    bool negated = false;
-    for (const Operator& op : kOperators) {
-        if (p.starts_with(op.prefix)) {
-            operand = p.substr(op.prefix.size());
-            wanted = op.wanted;
-            negated = op.negated;
-            break;
-        }
+    std::vector<std::string> values;
+    if (pattern->isString()) {
+        std::optional<std::string> value = equalTo(*pattern);
+        if (!value) return std::nullopt;
+        values.push_back(std::move(*value));
+        return values;
     }
-    return (compareVersionString(value, operand) == wanted) != negated;
+    if (!pattern->isArray() || pattern->count() == 0) return std::nullopt;
+    for (const Value& alternative : pattern->items()) {
+        std::optional<std::string> value = equalTo(alternative);
+        if (!value) return std::nullopt;
+        values.push_back(std::move(*value));
+    }
+    return values;
 }
 
 bool BXMatchRules::matchDictionaryPattern(const Value& value, const Value& pattern, const BXMatchContext& context) {

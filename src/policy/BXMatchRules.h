@@ -12,8 +12,10 @@
 // queue through the annotation source, so REQUIRES: never called on that queue.
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "base/Value.h"
 #include "model/BXPlugInCore.h"
@@ -38,6 +40,7 @@ class BXMatchRules {
   public:
     static constexpr std::string_view kEntitlementKeyPrefix = "ENTITLEMENT:";
     static constexpr std::string_view kIdentifierKey = "RZExtensionIdentifier";
+    static constexpr std::string_view kExtensionPointKey = "RZExtensionPointIdentifier";
     static constexpr std::string_view kUuidKey = "com.quorvel.uuid";
     static constexpr std::string_view kUserElectionKey = "RZUserElection";
     static constexpr std::string_view kContainingAppKey = "RZExtensionContainingApp";
@@ -67,6 +70,12 @@ class BXMatchRules {
     // The election as rules see it: the annotation's "election" read as a signed 32-bit integer (0 when absent),
     // bits 8 to 15 cleared, in decimal.
     static std::string userElectionValue(const BXPlugInCore& plugIn, const BXMatchContext& context = {});
+
+    // The strings that a plug-in's value for `key` must equal, one of them, for `rules` to hold as this engine
+    // compares; none when the rules let other values through (no rule on the key, an operator other than equality,
+    // a type test, a boolean or activation-rule pattern, a list with any such alternative, an empty list). The
+    // registry narrows its candidates with it, so it must never leave out a value the rule could accept.
+    static std::optional<std::vector<std::string>> requiredValues(const Value& rules, std::string_view key);
 
     // An annotation's "election" read as a signed 32-bit integer: numbers keep their low 32 bits (reals are cut
     // toward zero, then clamped), a string its leading decimal integer (clamped), anything else or absence is 0.

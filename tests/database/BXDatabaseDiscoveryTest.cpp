@@ -39,9 +39,10 @@ class ScriptedWorkspace : public LXApplicationWorkspace {
         ++installedCalls;
         return answer;
     }
-    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
-                                                               const LXPlugInFilter& filter) override {
+    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query, const LXPlugInFilter& filter,
+                                                               const LXPreselection& preselection) override {
         lastQuery = query;
+        lastPreselection = preselection;
         if (!answer) return std::nullopt;
         LXProxyList kept;
         for (const auto& proxy : *answer) {
@@ -53,6 +54,7 @@ class ScriptedWorkspace : public LXApplicationWorkspace {
 
     std::optional<LXProxyList> answer = LXProxyList{};
     Value lastQuery;
+    LXPreselection lastPreselection;
     int installedCalls = 0;
     int filterCalls = 0;
 };
@@ -190,6 +192,15 @@ TEST_F(BXDatabaseDiscoveryTest, ElectionOrListOfElectionsKeepsElectedAndAutoElec
         EXPECT_EQ(find(electionQuery(wanted)), expected) << wanted.description();
     // The whole query, election included, went to the registry as given.
     EXPECT_EQ(workspace_->lastQuery, electionQuery(dict({})));
+
+    // The registry narrows by what the rule engine says the query pins, and by nothing it was not told.
+    EXPECT_EQ(workspace_->lastPreselection.extensionPoints, std::vector<std::string>{"com.example.greeting"});
+    EXPECT_FALSE(workspace_->lastPreselection.identifiers);
+    find(dict({{"RZExtensionPointIdentifier", str("=com.example.point")},
+               {"RZExtensionIdentifier", Value::array({str("com.example.one"), str("com.example.two")})}}));
+    EXPECT_EQ(workspace_->lastPreselection.extensionPoints, std::vector<std::string>{"com.example.point"});
+    EXPECT_EQ(workspace_->lastPreselection.identifiers,
+              (std::vector<std::string>{"com.example.one", "com.example.two"}));
 }
 
 // Guards replacement: a replacing plug-in is filtered by the election of the plug-in it took over, not its own.

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <memory>
@@ -186,6 +187,48 @@ TEST_F(BXMatchRulesTest, PatternArraysAreAlternativesAndValueArraysMatchAnyStrin
     Value nested = str("en");
     for (int i = 0; i < 10000; ++i) nested = arr({nested});
     EXPECT_FALSE(rule("Language", nested));
+}
+
+// ---- What a rule set pins for the registry ----
+
+// The registry narrows its candidates with requiredValues, so it must never leave out a value that the rule
+// accepts: for each pattern, every sample value the rule accepts is one of the required values, and a pattern that
+// accepts values other than equal ones pins nothing.
+TEST_F(BXMatchRulesTest, RequiredValuesNeverLeaveOutAValueTheRuleAccepts) {
+    const char* samples[] = {
+        "com.example.a", "com.example.b", "com.example.v1", "com.example.v01", "=com.example.a", "", "com.example.A"};
+    auto accepted = [&](const Value& pattern) {
+        std::vector<std::string> values;
+        for (const char* sample : samples)
+            if (value(sample, pattern)) values.emplace_back(sample);
+        return values;
+    };
+    const Value pinning[] = {str("com.example.a"), str("=com.example.v1"), str("==com.example.a"),
+                             arr({str("com.example.b"), str("=com.example.v01")}), str("")};
+    for (const Value& pattern : pinning) {
+        auto required = BXMatchRules::requiredValues(dict({{"K", pattern}}), "K");
+        ASSERT_TRUE(required) << pattern.description();
+        for (const std::string& sample : accepted(pattern))
+            EXPECT_NE(std::find(required->begin(), required->end(), sample), required->end())
+                << sample << " is accepted by " << pattern.description() << " but not pinned";
+    }
+    EXPECT_EQ(BXMatchRules::requiredValues(dict({{"K", str("==com.example.a")}}), "K"),
+              std::vector<std::string>{"=com.example.a"});
+
+    const Value open[] = {str("<>com.example.a"),
+                          str("<=com.example.b"),
+                          str(">com.example.a"),
+                          str("?ZQ-CONFORMS:public.data"),
+                          Value::boolean(true),
+                          Value::boolean(false),
+                          Value::emptyArray(),
+                          arr({str("com.example.a"), str("<com.example.b")}),
+                          arr({str("com.example.a"), Value::int64(1)}),
+                          dict({{"image/png", Value::int64(1)}})};
+    for (const Value& pattern : open)
+        EXPECT_FALSE(BXMatchRules::requiredValues(dict({{"K", pattern}}), "K")) << pattern.description();
+    EXPECT_FALSE(BXMatchRules::requiredValues(dict({{"Other", str("x")}}), "K")) << "no rule on the key";
+    EXPECT_FALSE(BXMatchRules::requiredValues(str("K"), "K")) << "not a rule set";
 }
 
 // "?ZQ-CONFORMS:" matches a more specific type, "?ZQ-IS:" a more general one. The prefixes are exact: any other

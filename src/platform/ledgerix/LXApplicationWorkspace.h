@@ -49,6 +49,15 @@ using LXProxyList = std::vector<std::shared_ptr<const LXBexilProxy>>;
 // (none when it has none); true keeps the candidate.
 using LXPlugInFilter = std::function<bool(std::string_view identifier, const std::optional<Value>& entitlements)>;
 
+// What a discovery query pins, as the rule engine that owns the query language reads it: for the extension point
+// and for the identifier, the strings that a matching plug-in's value must equal (any one of them), or none when
+// the query lets other values through. The registry narrows its candidates by its indexes with it and never reads
+// the query's patterns itself, so a pattern it did not know could not narrow them wrongly.
+struct LXPreselection {
+    std::optional<std::vector<std::string>> extensionPoints = std::nullopt;
+    std::optional<std::vector<std::string>> identifiers = std::nullopt;
+};
+
 class LXApplicationWorkspace {
   public:
     virtual ~LXApplicationWorkspace() = default;
@@ -83,11 +92,10 @@ class LXApplicationWorkspace {
     // Every registered plug-in in registration order; none when the store cannot be read.
     virtual std::optional<LXProxyList> installedPlugins() = 0;
     // The plug-ins that may match the query and that pass the filter, in registration order; none when the store
-    // cannot be read. The registry pre-selects by the query's extension point and identifier rules when they are
-    // plain equalities and otherwise lets everything through: the caller re-checks every rule itself. The filter
-    // runs once per candidate on the calling thread.
-    virtual std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
-                                                                       const LXPlugInFilter& filter) = 0;
+    // cannot be read. Only the pre-selection narrows the candidates (the query is for the log): the caller re-checks
+    // every rule itself. The filter runs once per candidate on the calling thread.
+    virtual std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query, const LXPlugInFilter& filter,
+                                                                       const LXPreselection& preselection = {}) = 0;
 };
 
 }  // namespace bexil

@@ -107,7 +107,8 @@ Error lxError(LXErrorCode code, std::string message) {
 bool isDigit(char c) { return c >= '0' && c <= '9'; }
 
 // The form in which indexed keys are stored and looked up: every run of digits without its leading zeros (a run of
-// zeros keeps one), so that strings that discovery compares as equal ("v01", "v1") have one form.
+// zeros keeps one). Discovery tells "v01" from "v1", so one key may stand for a few values that a rule tells apart;
+// that only widens the candidates, which the caller checks rule by rule anyway.
 std::string matchForm(std::string_view text) {
     std::string form;
     form.reserve(text.size());
@@ -123,32 +124,6 @@ std::string matchForm(std::string_view text) {
         i = end;
     }
     return form;
-}
-
-// The operands of a rule pattern that only holds when the value equals one of them, in match form; none when the
-// pattern can hold otherwise (an operator, a conformance test, a boolean or a dictionary pattern).
-std::optional<std::vector<std::string>> plainEqualityOperands(const Value& pattern) {
-    auto one = [](std::string_view p) -> std::optional<std::string> {
-        if (!p.empty() && (p[0] == '?' || p[0] == '<' || p[0] == '>')) return std::nullopt;
-        if (!p.empty() && p[0] == '=') p.remove_prefix(1);
-        return matchForm(p);
-    };
-    std::vector<std::string> operands;
-    if (const std::string* s = pattern.getString()) {
-        std::optional<std::string> operand = one(*s);
-        if (!operand) return std::nullopt;
-        operands.push_back(std::move(*operand));
-        return operands;
-    }
-    if (!pattern.isArray() || pattern.count() == 0) return std::nullopt;
-    for (const Value& item : pattern.items()) {
-        const std::string* s = item.getString();
-        if (s == nullptr) return std::nullopt;
-        std::optional<std::string> operand = one(*s);
-        if (!operand) return std::nullopt;
-        operands.push_back(std::move(*operand));
-    }
-    return operands;
 }
 
 // The URL as a caller sent it, safe to put in a message: control bytes (a NUL among them) are escaped.
@@ -757,28 +732,28 @@ std::optional<LXProxyList> LedgerixWorkspace::installedPlugins() {
 }
 
 std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(const Value& query,
-                                                                              const LXPlugInFilter& filter) {
-    // Pre-select with the indexes where the query pins the extension point or the identifier; every other rule is
-    // the caller's to check.
+                                                                              const LXPlugInFilter& filter,
+                                                                              const LXPreselection& preselection) {
+    // The indexes narrow by what the rule engine says the query pins. A plug-in whose point is not one plain string
+    // (point_wild), or that has no identifier, may still answer such a rule from its dictionaries, so it always
+    // stays a candidate.
     std::string where;
     std::vector<std::string> arguments;
-    auto constrain = [&](std::string_view key, std::string_view column, std::string_view orElse) {
-        const Value* pattern = query.isDictionary() ? query.find(key) : nullptr;
-        if (pattern == nullptr) return;
-        std::optional<std::vector<std::string>> operands = plainEqualityOperands(*pattern);
-        if (!operands) return;
+    auto constrain = [&](const std::optional<std::vector<std::string>>& values, std::string_view column,
+                         std::string_view orElse) {
+        if (!values || values->empty()) return;
         if (!where.empty()) where += " AND ";
         where += "(";
         where += column;
         where += " IN (";
-        for (size_t i = 0; i < operands->size(); ++i) where += i ? ",?" : "?";
+        for (size_t i = 0; i < values->size(); ++i) where += i ? ",?" : "?";
         where += ") OR ";
         where += orElse;
         where += ")";
-        arguments.insert(arguments.end(), operands->begin(), operands->end());
+        for (const std::string& value : *values) arguments.push_back(matchForm(value));
     };
-    constrain(kExtensionPointKey, "p.point_key", "p.point_wild = 1");
-    constrain(kIdentifierKey, "p.identifier_key", "p.identifier_key IS NULL");
+    constrain(preselection.extensionPoints, "p.point_key", "p.point_wild = 1");
+    constrain(preselection.identifiers, "p.identifier_key", "p.identifier_key IS NULL");
 
     std::optional<std::vector<Row>> rows = selectRows(where, arguments, std::nullopt);
     if (!rows) return std::nullopt;

@@ -63,8 +63,8 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     std::shared_ptr<const LXBexilProxy> plugInProxyForURL(std::string_view url) override;
     std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) override;
     std::optional<LXProxyList> installedPlugins() override;
-    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query,
-                                                               const LXPlugInFilter& filter) override;
+    std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query, const LXPlugInFilter& filter,
+                                                               const LXPreselection& preselection = {}) override;
 
     const std::filesystem::path& databasePath() const { return databasePath_; }
     // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
