@@ -65,7 +65,7 @@ class TerminationTest : public ::testing::Test {
     }
     void TearDown() override { server_.reset(); }
 
-    RunningInstances instances() const { return RunningInstances("instances", root_ / "runtime"); }
+    InstanceRecords instances() const { return InstanceRecords(InstanceRecords::Kind::Running, root_ / "runtime"); }
 
     // Runs terminatePlugInsReply and waits for its reply.
     void terminate(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
@@ -132,7 +132,7 @@ TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
 // records' directory.
 TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {
     test::TempDir runtime("bx-assertions");
-    RunningInstances assertions("assertions", runtime.path());
+    InstanceRecords assertions(InstanceRecords::Kind::Assertion, runtime.path());
     ProcessAssertions wardend(assertions);
     pid_t busy = startSleeper();
     pid_t finished = startSleeper();
@@ -211,7 +211,7 @@ TEST(ServiceManagerTermination, APidReusedWhileAnotherInstanceEndsIsLeftAlone) {
 
     // Named after the process outside, since every run is pid 1 in here.
     fs::path runtime = fs::temp_directory_path() / ("bx-pid-reuse-" + std::string(getenv(kInPidNamespace)));
-    RunningInstances instances("instances", runtime);
+    InstanceRecords instances(InstanceRecords::Kind::Running, runtime);
     int report[2];
     ASSERT_EQ(pipe2(report, O_CLOEXEC), 0);
     pid_t first = startLingeringInstance(report[1]), second = startLingeringInstance(report[1]);

@@ -6,7 +6,7 @@
 
 #include "ChildProcess.h"
 #include "E2eSupport.h"
-#include "platform/jobard/RunningInstances.h"
+#include "platform/runtime/InstanceRecords.h"
 
 namespace bexil {
 namespace {
@@ -56,7 +56,7 @@ class RegistrationTest : public DaemonTest {
         return -1;
     }
 
-    RunningInstances running_{"instances", bxd_.root() / "runtime"};
+    InstanceRecords running_{InstanceRecords::Kind::Running, bxd_.root() / "runtime"};
     std::vector<pid_t> instances_;
 };
 

@@ -29,12 +29,12 @@ bool waitForExit(int pidfd, std::chrono::milliseconds timeout) {
 }
 
 // Ends one instance: SIGTERM, then SIGKILL after the grace period. Returns 0 or an errno value.
-int terminate(const RunningInstances::Instance& instance) {
+int terminate(const InstanceRecords::Instance& instance) {
     int pidfd = pidfdOpen(instance.pid);
     if (pidfd < 0) return errno == ESRCH ? 0 : errno;
     // The pidfd pins one process; make sure it is still the one the record names before signalling it. Earlier
     // instances may have taken seconds to end, time enough for this one to end too and its pid to be reused.
-    if (RunningInstances::startTime(instance.pid) != instance.startTime) {
+    if (InstanceRecords::startTime(instance.pid) != instance.startTime) {
         close(pidfd);
         return 0;
     }
@@ -51,11 +51,11 @@ int terminate(const RunningInstances::Instance& instance) {
 
 }  // namespace
 
-ServiceManager::ServiceManager(RunningInstances instances) : instances_(std::move(instances)) {}
+ServiceManager::ServiceManager(InstanceRecords instances) : instances_(std::move(instances)) {}
 
 void ServiceManager::removeExternalService(const std::string& bundleIdentifier, const std::string& /*version*/,
                                            SerialQueue queue, std::function<void(int error)> completion) const {
-    std::vector<RunningInstances::Instance> running = instances_.live(bundleIdentifier);
+    std::vector<InstanceRecords::Instance> running = instances_.live(bundleIdentifier);
     if (running.empty()) {
         queue.async([completion = std::move(completion)] { completion(kNothingOnRecord); });
         return;
@@ -63,7 +63,7 @@ void ServiceManager::removeExternalService(const std::string& bundleIdentifier, 
     // Waiting for processes to exit can take seconds: it must not hold up any queue.
     std::thread([running = std::move(running), queue, completion = std::move(completion)]() mutable {
         int error = 0;
-        for (const RunningInstances::Instance& instance : running) {
+        for (const InstanceRecords::Instance& instance : running) {
             int result = terminate(instance);
             std::error_code ignored;
             std::filesystem::remove(instance.record, ignored);

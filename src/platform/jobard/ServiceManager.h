@@ -1,14 +1,14 @@
 #pragma once
 
 // The service manager's side of plug-in termination: ends every running instance of a plug-in that its runtime
-// recorded (see RunningInstances). The waiting happens on a thread of its own, never on the caller's queue; the
+// recorded (see InstanceRecords). The waiting happens on a thread of its own, never on the caller's queue; the
 // completion is delivered on the queue the caller names. Thread-safe.
 
 #include <functional>
 #include <string>
 
 #include "base/SerialQueue.h"
-#include "platform/jobard/RunningInstances.h"
+#include "platform/runtime/InstanceRecords.h"
 
 namespace bexil {
 
@@ -19,7 +19,7 @@ class ServiceManager {
     // How long an instance has after SIGTERM before it is killed.
     static constexpr auto kTerminationGrace = std::chrono::seconds(5);
 
-    explicit ServiceManager(RunningInstances instances = RunningInstances("instances"));
+    explicit ServiceManager(InstanceRecords instances = InstanceRecords(InstanceRecords::Kind::Running));
 
     // remove-external-service: terminates the running instances of `bundleIdentifier` and calls `completion` on
     // `queue` with 0 when one or more were terminated, kNothingOnRecord when none was running, or an errno value.
@@ -28,7 +28,7 @@ class ServiceManager {
                                std::function<void(int error)> completion) const;
 
   private:
-    RunningInstances instances_;
+    InstanceRecords instances_;
 };
 
 }  // namespace bexil

@@ -1,20 +1,22 @@
 #pragma once
 
-// The records that plug-in runtimes keep of their running instances: one file per process under
-// `<runtime dir>/<kind>/<bundle identifier>/<pid>`, holding the process's start time (field 22 of /proc/<pid>/stat),
-// so that a record whose pid has since been reused by another process is recognised as stale. Used by the service
-// manager (kind "instances") and the process-assertion service (kind "assertions"). Stateless; any thread.
+// The one format of the records that plug-in runtimes keep of their processes, shared by the service manager
+// (jobard: which instances run) and the process-assertion service (wardend: which instances hold an assertion):
+// one file per process under `<runtime dir>/<kind folder>/<bundle identifier>/<pid>`, holding the process's start
+// time (field 22 of /proc/<pid>/stat) in decimal, so that a record whose pid has since been reused by another
+// process is recognised as stale. Stateless; any thread.
 
 #include <sys/types.h>
 
 #include <filesystem>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace bexil {
 
-class RunningInstances {
+class InstanceRecords {
   public:
     struct Instance {
         pid_t pid;
@@ -27,8 +29,11 @@ class RunningInstances {
     // $BX_RUNTIME_DIR, else /run/bexil for root, else $XDG_RUNTIME_DIR/bexil.
     static std::filesystem::path runtimeDirectory();
 
-    // `kind` is the sub-folder ("instances" or "assertions").
-    explicit RunningInstances(std::string kind, std::filesystem::path runtimeDir = runtimeDirectory());
+    // Which records: of running instances (folder "instances") or of process assertions (folder "assertions").
+    enum class Kind { Running, Assertion };
+    static std::string_view folderOf(Kind kind);
+
+    explicit InstanceRecords(Kind kind, std::filesystem::path runtimeDir = runtimeDirectory());
 
     // Records `pid` as a live instance of `bundleIdentifier` (what a plug-in runtime does when it starts).
     bool record(const std::string& bundleIdentifier, pid_t pid) const;

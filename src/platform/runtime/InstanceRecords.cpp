@@ -1,4 +1,4 @@
-#include "platform/jobard/RunningInstances.h"
+#include "platform/runtime/InstanceRecords.h"
 
 #include <unistd.h>
 
@@ -12,11 +12,13 @@ namespace bexil {
 
 namespace fs = std::filesystem;
 
-fs::path RunningInstances::runtimeDirectory() { return bexil::runtimeDirectory(); }
+fs::path InstanceRecords::runtimeDirectory() { return bexil::runtimeDirectory(); }
 
-RunningInstances::RunningInstances(std::string kind, fs::path runtimeDir) : directory_(runtimeDir / kind) {}
+std::string_view InstanceRecords::folderOf(Kind kind) { return kind == Kind::Running ? "instances" : "assertions"; }
 
-std::optional<unsigned long long> RunningInstances::startTime(pid_t pid) {
+InstanceRecords::InstanceRecords(Kind kind, fs::path runtimeDir) : directory_(runtimeDir / folderOf(kind)) {}
+
+std::optional<unsigned long long> InstanceRecords::startTime(pid_t pid) {
     std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
     std::string stat;
     if (!std::getline(in, stat)) return std::nullopt;
@@ -37,7 +39,7 @@ static bool safeComponent(const std::string& name) {
            name.find('\0') == std::string::npos;
 }
 
-bool RunningInstances::record(const std::string& bundleIdentifier, pid_t pid) const {
+bool InstanceRecords::record(const std::string& bundleIdentifier, pid_t pid) const {
     if (!safeComponent(bundleIdentifier)) return false;
     std::optional<unsigned long long> started = startTime(pid);
     if (!started) return false;
@@ -48,7 +50,7 @@ bool RunningInstances::record(const std::string& bundleIdentifier, pid_t pid) co
     return static_cast<bool>(out);
 }
 
-std::vector<RunningInstances::Instance> RunningInstances::live(const std::string& bundleIdentifier) const {
+std::vector<InstanceRecords::Instance> InstanceRecords::live(const std::string& bundleIdentifier) const {
     std::vector<Instance> found;
     if (!safeComponent(bundleIdentifier)) return found;
     std::error_code ec;
