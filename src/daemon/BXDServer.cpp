@@ -43,8 +43,8 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
     if (!server->initWithDatabase()) return nullptr;
 
     server->entitlements_ = std::make_unique<EntitlementsDirectory>(EntitlementsDirectory::defaultPath(), geteuid());
-    Result<std::shared_ptr<ZemListener>> listener = ZemListener::create(serviceName ? serviceName : kDefaultServiceName,
-                                                                        server->zemQueue_, server->entitlements_.get());
+    Result<std::shared_ptr<ZemListener>> listener =
+        ZemListener::create(serviceName ? serviceName : kDefaultServiceName, server->zemQueue_);
     if (!listener) {
         log::ops().error("cannot listen on service %s: %@", serviceName ? serviceName : kDefaultServiceName,
                          listener.error());

@@ -46,6 +46,10 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // Runs `work` on mainQueue: at once when called on the loop's thread while the queue is free, else queued.
     void submitWork(std::function<void()> work);
 
+    // The trusted directory of programs' entitlements, from which clients' identities are built (null before
+    // initForServiceDatabase). Lives as long as the server; safe from any thread.
+    EntitlementsDirectory* entitlementsDirectory() const { return entitlements_.get(); }
+
     // Database delegate: plug-ins about to be uninstalled.
     void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
     // Asks the service manager to end every running instance of `plugIns`; `reply` runs once, on a waiter thread

@@ -27,9 +27,11 @@ std::shared_ptr<BXDZemClient> BXDZemClient::initWithConnectionServer(const std::
 
 void BXDZemClient::start() {
     std::shared_ptr<ZemConnection> connection = connection_.lock();
-    std::shared_ptr<const CodeSigningIdentity> identity = connection->peerIdentity();
+    // Who the peer is: its executable, pinned to the live process by the pidfd the transport took at accept, and
+    // the entitlements the trusted directory grants that executable.
+    std::shared_ptr<const CodeSigningIdentity> identity =
+        CodeSigningIdentity::ofPeer(connection->peerCredentials(), server_->entitlementsDirectory());
 
-    // The executable was read and pinned to the live process when the connection was accepted.
     if (identity && identity->established() && identity->executablePath().size() < kExecutablePathBufferSize) {
         path_ = identity->executablePath();
         std::shared_ptr<BXBundle> bundle = BXBundle::initWithExecutablePath(path_);

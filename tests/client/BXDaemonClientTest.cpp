@@ -26,7 +26,7 @@ using Reply = BXDaemonClient::Reply;
 class CapturingService {
   public:
     explicit CapturingService(std::string service = BXDaemonClient::kDefaultServiceName) : queue_("capture", *loop_) {
-        auto listener = ZemListener::create(service, queue_, nullptr);
+        auto listener = ZemListener::create(service, queue_);
         EXPECT_TRUE(listener.ok());
         listener_ = *listener;
         listener_->setConnectionHandler([this](std::shared_ptr<ZemConnection> peer) {

@@ -84,7 +84,8 @@ TEST_F(CodeSigningIdentityTest, PeerThatExitsRightAfterConnectingHasNoIdentity) 
         }
         int fd = accept(listener_, nullptr, nullptr);
         ASSERT_GE(fd, 0);
-        auto id = CodeSigningIdentity::fromConnectedSocket(fd, &dir);
+        ZemPeerCredentials peer = ZemPeerCredentials::ofConnectedSocket(fd);
+        auto id = CodeSigningIdentity::ofPeer(peer, &dir);
         EXPECT_FALSE(id->established()) << (reaped ? "reaped" : "zombie");
         EXPECT_TRUE(id->entitlements().count() == 0);
         auto value = id->entitlementValueForKey(kManager);
@@ -92,6 +93,19 @@ TEST_F(CodeSigningIdentityTest, PeerThatExitsRightAfterConnectingHasNoIdentity) 
         close(fd);
         if (!reaped) waitpid(child, nullptr, 0);
     }
+}
+
+// Guards the daemon's side of the split: credentials the transport could not complete never give an identity or
+// entitlements, even when their pid names a program that has them (here this very process).
+TEST_F(CodeSigningIdentityTest, IncompleteCredentialsGrantNothing) {
+    writeEntitlements("self.vrec", selfExecutable(), Value::dictionary({{kManager, Value::boolean(true)}}));
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+    ZemPeerCredentials peer{.pid = getpid(), .uid = geteuid(), .gid = getegid(), .failure = "no pidfd for the peer"};
+    auto id = CodeSigningIdentity::ofPeer(peer, &dir);
+    EXPECT_FALSE(id->established());
+    EXPECT_EQ(id->failureReason(), "no pidfd for the peer");
+    EXPECT_EQ(id->entitlements().count(), 0u);
+    EXPECT_FALSE(id->entitlementValueForKey(kManager).ok());
 }
 
 // Guards the trust rules for entitlements files: writable by others, foreign owner, a link, an open directory or a

@@ -1,9 +1,9 @@
 #pragma once
 
-// The identity of the process at the other end of a connection, taken once when the connection is accepted and
-// bound to it for its whole life: credentials from the kernel, a pidfd that pins the very process, its executable,
-// and the entitlements the trusted directory grants that executable. Immutable after creation; any thread may read.
-// Whenever some step of establishing the identity fails the identity grants no entitlements, never more.
+// The identity of the process at the other end of a connection, built by the daemon from what the transport read at
+// accept (credentials and a pidfd that pins the very process) and bound to the connection for its whole life: its
+// executable and the entitlements the trusted directory grants that executable. Immutable after creation; any thread
+// may read. Whenever some step of establishing the identity fails the identity grants no entitlements, never more.
 
 #include <sys/types.h>
 
@@ -13,6 +13,7 @@
 
 #include "base/Error.h"
 #include "base/Value.h"
+#include "platform/zem/ZemPeerCredentials.h"
 
 namespace bexil {
 
@@ -20,10 +21,10 @@ class EntitlementsDirectory;
 
 class CodeSigningIdentity {
   public:
-    // Reads the peer of the connected Unix-domain socket `fd` now; `entitlements` may be null (no entitlements).
-    static std::shared_ptr<CodeSigningIdentity> fromConnectedSocket(int fd, EntitlementsDirectory* entitlements);
+    // The identity of the peer whose credentials the transport read; `entitlements` may be null (no entitlements).
+    static std::shared_ptr<CodeSigningIdentity> ofPeer(const ZemPeerCredentials& peer,
+                                                       EntitlementsDirectory* entitlements);
 
-    ~CodeSigningIdentity();
     CodeSigningIdentity(const CodeSigningIdentity&) = delete;
     CodeSigningIdentity& operator=(const CodeSigningIdentity&) = delete;
 
@@ -31,8 +32,8 @@ class CodeSigningIdentity {
     pid_t pid() const { return pid_; }
     uid_t uid() const { return uid_; }
     gid_t gid() const { return gid_; }
-    // A pidfd for the peer taken at accept time, owned by this object; -1 when none could be had.
-    int pidfd() const { return pidfd_; }
+    // A pidfd for the peer taken at accept time; -1 when none could be had.
+    int pidfd() const { return pidfd_ ? pidfd_->get() : -1; }
     // The peer's executable, resolved; empty when it could not be established.
     const std::string& executablePath() const { return executablePath_; }
     // True when the executable was read and the process was confirmed alive afterwards through the pidfd.
@@ -54,7 +55,7 @@ class CodeSigningIdentity {
     pid_t pid_ = -1;
     uid_t uid_ = static_cast<uid_t>(-1);
     gid_t gid_ = static_cast<gid_t>(-1);
-    int pidfd_ = -1;
+    std::shared_ptr<const UniqueFd> pidfd_;
     bool established_ = false;
     std::string executablePath_;
     std::string failureReason_;

@@ -16,11 +16,11 @@
 #include "base/Value.h"
 #include "platform/zem/ZemError.h"
 #include "platform/zem/ZemMessage.h"
+#include "platform/zem/ZemPeerCredentials.h"
 
 namespace bexil {
 
 class SerialQueue;
-class CodeSigningIdentity;
 
 class ZemConnection {
   public:
@@ -64,8 +64,8 @@ class ZemConnection {
     // True once the peer has closed its end or the connection is closed, even while frames it sent before that are
     // still waiting to be handled: the daemon runs no request of a peer that is gone. Safe from any thread.
     virtual bool peerHasHungUp() const = 0;
-    // The identity of the peer taken at accept (peer connections only; null on client connections).
-    virtual std::shared_ptr<const CodeSigningIdentity> peerIdentity() const = 0;
+    // What the kernel said about the peer at accept (peer connections only; empty with a failure on client ones).
+    virtual const ZemPeerCredentials& peerCredentials() const = 0;
 
     virtual const std::string& serviceName() const = 0;
     virtual std::string description() const = 0;

@@ -18,7 +18,6 @@
 #include "base/EventLoopAsio.h"
 #include "base/PosixError.h"
 #include "base/StandardPaths.h"
-#include "platform/codesign/CodeSigningIdentity.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemSocketConnection.h"
 
@@ -42,11 +41,9 @@ enum class Origin { Activated, BoundHere };
 
 class ZemSocketListener final : public ZemListener, public std::enable_shared_from_this<ZemSocketListener> {
   public:
-    ZemSocketListener(std::string serviceName, SerialQueue queue, EntitlementsDirectory* entitlements, Origin origin,
-                      int lockFd)
+    ZemSocketListener(std::string serviceName, SerialQueue queue, Origin origin, int lockFd)
         : serviceName_(std::move(serviceName)),
           queue_(std::move(queue)),
-          entitlements_(entitlements),
           acceptor_(*detail::QueueInternals::state(queue_)->core),
           signals_(*detail::QueueInternals::state(queue_)->core),
           retryTimer_(*detail::QueueInternals::state(queue_)->core),
@@ -129,12 +126,11 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
         limitLogged_ = false;
 
         int fd = socket.native_handle();
-        std::shared_ptr<const CodeSigningIdentity> identity =
-            CodeSigningIdentity::fromConnectedSocket(fd, entitlements_);
-        pid_t pid = identity->pid() > 0 ? identity->pid() : 0;
+        ZemPeerCredentials peer = ZemPeerCredentials::ofConnectedSocket(fd);
+        pid_t pid = peer.pid > 0 ? peer.pid : 0;
         SerialQueue peerQueue("peer-" + std::to_string(pid), queue_);
-        auto connection = std::make_shared<ZemSocketConnection>(std::move(socket), peerQueue, serviceName_, identity,
-                                                                pid, identity->uid(), identity->gid());
+        auto connection =
+            std::make_shared<ZemSocketConnection>(std::move(socket), peerQueue, serviceName_, std::move(peer));
         connectionCount_.fetch_add(1);
         {
             // Connections that have ended are forgotten here, so the list stays as long as the live ones.
@@ -177,7 +173,6 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
 
     const std::string serviceName_;
     SerialQueue queue_;
-    EntitlementsDirectory* entitlements_;
     Protocol::acceptor acceptor_;
     asio::signal_set signals_;
     asio::steady_timer retryTimer_;
@@ -230,13 +225,12 @@ std::filesystem::path ZemListener::socketPathForService(const std::string& servi
     return serviceDirectory() / serviceName;
 }
 
-Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serviceName, SerialQueue& queue,
-                                                         EntitlementsDirectory* entitlements) {
+Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serviceName, SerialQueue& queue) {
     if (serviceName.empty() || serviceName.find('/') != std::string::npos || serviceName[0] == '.')
         return BXError(ErrorCode::OperationFailed, "invalid service name \"" + serviceName + "\"");
 
     if (int fd = activatedSocketFor(serviceName); fd >= 0) {
-        auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, Origin::Activated, -1);
+        auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, Origin::Activated, -1);
         asio::error_code error;
         listener->acceptor().assign(Protocol(), fd, error);
         if (error) return posixError(error.value(), "socket passed by systemd for " + serviceName);
@@ -278,7 +272,7 @@ Result<std::shared_ptr<ZemListener>> ZemListener::create(const std::string& serv
         unlink(path.c_str());
     }
 
-    auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, entitlements, Origin::BoundHere, lockFd);
+    auto listener = std::make_shared<ZemSocketListener>(serviceName, queue, Origin::BoundHere, lockFd);
     asio::error_code error;
     Protocol::acceptor& acceptor = listener->acceptor();
     acceptor.open(Protocol(), error);

@@ -16,7 +16,6 @@
 namespace bexil {
 
 class SerialQueue;
-class EntitlementsDirectory;
 class ZemConnection;
 
 class ZemListener {
@@ -30,10 +29,10 @@ class ZemListener {
     virtual ~ZemListener() = default;
 
     // Binds the service. A socket file left by a dead daemon is replaced; one that a live process still accepts on
-    // is never taken over: that is an error naming the service. `entitlements` may be null (no peer has any).
+    // is never taken over: that is an error naming the service. Each accepted connection carries the peer's
+    // credentials (ZemPeerCredentials); who the peer is, is for the user of the listener to decide.
     // The listener starts suspended: nothing is accepted before resume().
-    static Result<std::shared_ptr<ZemListener>> create(const std::string& serviceName, SerialQueue& queue,
-                                                       EntitlementsDirectory* entitlements);
+    static Result<std::shared_ptr<ZemListener>> create(const std::string& serviceName, SerialQueue& queue);
 
     // $BX_SERVICE_DIR, else /run/bexil for root, else $XDG_RUNTIME_DIR/bexil.
     static std::filesystem::path serviceDirectory();

@@ -31,16 +31,15 @@ asio::io_context& ioContextOf(const SerialQueue& queue) { return *detail::QueueI
 }  // namespace
 
 ZemSocketConnection::ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName,
-                                         std::shared_ptr<const CodeSigningIdentity> identity, pid_t pid, uid_t uid,
-                                         gid_t gid)
+                                         ZemPeerCredentials peer)
     : side_(Side::Peer),
       queue_(std::move(queue)),
       socket_(std::move(socket)),
       serviceName_(std::move(serviceName)),
-      identity_(std::move(identity)),
-      pid_(pid),
-      uid_(uid),
-      gid_(gid),
+      peer_(std::move(peer)),
+      pid_(peer_.pid > 0 ? peer_.pid : 0),
+      uid_(peer_.uid),
+      gid_(peer_.gid),
       state_(State::Open),
       probeFd_(socket_.native_handle()) {}
 

@@ -31,9 +31,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
 
     enum class Side { Peer, Client };
 
-    // A peer connection around an accepted socket, with the identity taken at accept.
-    ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName,
-                        std::shared_ptr<const CodeSigningIdentity> identity, pid_t pid, uid_t uid, gid_t gid);
+    // A peer connection around an accepted socket, with the peer's credentials read at accept.
+    ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName, ZemPeerCredentials peer);
     // A client connection, not yet connected.
     ZemSocketConnection(SerialQueue queue, std::string serviceName);
     ~ZemSocketConnection() override;
@@ -57,7 +56,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     uid_t peerUid() const override { return uid_.load(); }
     gid_t peerGid() const override { return gid_.load(); }
     bool peerHasHungUp() const override;
-    std::shared_ptr<const CodeSigningIdentity> peerIdentity() const override { return identity_; }
+    const ZemPeerCredentials& peerCredentials() const override { return peer_; }
     const std::string& serviceName() const override { return serviceName_; }
     std::string description() const override;
 
@@ -88,7 +87,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     SerialQueue queue_;
     Socket socket_;
     const std::string serviceName_;
-    std::shared_ptr<const CodeSigningIdentity> identity_;
+    const ZemPeerCredentials peer_;
     std::atomic<pid_t> pid_{0};
     std::atomic<uid_t> uid_{static_cast<uid_t>(-1)};
     std::atomic<gid_t> gid_{static_cast<gid_t>(-1)};
