@@ -71,6 +71,117 @@ std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn) {
     return identifiers;
 }
 
+// The filter that every candidate passes, in this order, before it competes with the others: where it lives,
+// dedication and holds (all three skipped for the discover-all flag), the client's rules, the global exclusions and
+// the host policy (skipped for discover-all). A plug-in the client may not see is never matched against its rules,
+// so rules cannot probe for it.
+struct CandidateFilter {
+    const Value& rules;
+    const std::vector<Value>& exclusions;
+    uint64_t flags;
+    BXDZemClient& client;
+    BXDServer& database;
+    const BXMatchContext& context;
+
+    bool all() const { return (flags & discover::kAll) != 0; }
+
+    bool admits(BXDPlugIn& plugIn) const {
+        // Only the logs name the candidate, and they are rare: the text is made when one is written.
+        auto uuidText = [&plugIn] { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); };
+        const pid_t pid = client.pid();
+        if (!all()) {
+            // Plug-ins outside the system volume are visible only inside an application, and not at all when the
+            // caller asked for system plug-ins only.
+            if (!plugIn.onSystemVolume() && (!plugIn.containingUrl() || (flags & discover::kSystemOnly))) return false;
+            if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(plugIn, client.bundle().get())) return false;
+            if (database.holdOnPlugIn(plugIn)) return false;
+        }
+        if (!plugIn.match(rules, context)) return false;
+        for (const Value& exclusion : exclusions) {
+            if (plugIn.match(exclusion, context)) {
+                log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText());
+                return false;
+            }
+        }
+        if (!all()) {
+            if (std::optional<std::string> reason = plugIn.allowForClient(client, context)) {
+                log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(), *reason);
+                return false;
+            }
+        }
+        return true;
+    }
+};
+
+// The forms accepted so far, in the order of acceptance, with the duplicate resolution among forms of the same
+// identifier: a form that a later duplicate beat is left as an empty slot, so that the positions recorded per
+// identifier stay valid.
+class AcceptedForms {
+  public:
+    explicit AcceptedForms(uint64_t flags) : flags_(flags) {}
+
+    // Offers the exported form of a candidate that passed the filter; it is kept unless an accepted form of its
+    // identifier beats it, and it replaces one that it beats.
+    void offer(const BXDPlugIn& plugIn, MutableDictionary exported, BXDServer& database) {
+        std::string version = versionOf(plugIn);
+        std::vector<size_t>& sameIdentifier = positions_[plugIn.identifier().value_or("")];
+        for (auto at = sameIdentifier.begin(); at != sameIdentifier.end(); ++at) {
+            Form& other = forms_[*at];
+            ComparisonResult order = compareVersionString(version, textOf(*other, formKey::kVersion));
+            bool same = order == ComparisonResult::Same;
+            if ((flags_ & discover::kAllVersions) && (!same || (flags_ & discover::kAllInstances))) continue;
+            bool wins = same ? winsTieBreak(plugIn, *other) : order == ComparisonResult::Descending;
+            if (!wins) return;
+            other.reset();
+            sameIdentifier.erase(at);
+            --kept_;
+            break;
+        }
+        Form form = std::make_shared<MutableDictionary>(std::move(exported));
+        database.addAnnotationForPlugInIn(plugIn, *form);
+        plugIn.augmentForm(*form);
+        sameIdentifier.push_back(forms_.size());
+        forms_.push_back(form);
+        ++kept_;
+        // A later plug-in naming the same identifier takes the entry over.
+        for (const std::string& replaced : replacedIdentifiers(plugIn)) replacements_[replaced] = form;
+    }
+
+    // Writes the replacement links into the forms, once every candidate has been seen.
+    void linkReplacements() {
+        if (replacements_.empty()) return;
+        for (const Form& form : forms_) {
+            if (!form) continue;
+            std::string identifier = textOf(*form, formKey::kIdentifier);
+            auto replacing = replacements_.find(identifier);
+            if (replacing == replacements_.end()) continue;
+            std::string replacingUuid = textOf(*replacing->second, formKey::kUuid);
+            form->set(formKey::kOverrider, Value::string(replacingUuid));
+            replacing->second->set(formKey::kOverriding, Value::string(identifier));
+            log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid, textOf(*form, formKey::kUuid));
+        }
+    }
+
+    size_t count() const { return kept_; }
+
+    // The kept forms as values. The builders are not used again: their entries move rather than being copied.
+    std::vector<Value> take() {
+        std::vector<Value> values;
+        values.reserve(kept_);
+        for (const Form& form : forms_)
+            if (form) values.push_back(form->take());
+        return values;
+    }
+
+  private:
+    uint64_t flags_;
+    std::vector<Form> forms_;
+    // The positions in forms_ of the live forms of each identifier, in the order of forms_.
+    std::unordered_map<std::string, std::vector<size_t>> positions_;
+    std::unordered_map<std::string, Form> replacements_;
+    size_t kept_ = 0;
+};
+
 }  // namespace
 
 void Transaction::matchPlugIns() {
@@ -81,123 +192,38 @@ void Transaction::matchPlugIns() {
     }
     Value rules = rulesEntry != nullptr ? *rulesEntry : Value();
     uint64_t flags = request().get(protocol::key::kFlags).numberAsUInt64().value_or(0);
-    bool all = (flags & discover::kAll) != 0;
     pid_t pid = client()->pid();
 
-    if (all && (!client()->hasEntitlement(protocol::kManagerEntitlement) || processIsSandboxed(pid))) {
+    if ((flags & discover::kAll) &&
+        (!client()->hasEntitlement(protocol::kManagerEntitlement) || processIsSandboxed(pid))) {
         fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
         return;
     }
 
     BXDServer* database = server();
     BXMatchContext context{.annotations = &database->annotationSource()};
-    // The accepted forms in the order of acceptance; a form that a later duplicate beat is left as an empty slot,
-    // so the positions that `accepted` records stay valid.
-    std::vector<Form> results;
-    size_t kept = 0;
+    AcceptedForms accepted(flags);
     {
-        // The positions in `results` of the live forms of each identifier, in the order of `results`: duplicate
-        // resolution looks only at the forms of the candidate's own identifier.
-        std::unordered_map<std::string, std::vector<size_t>> accepted;
-        // Everything per candidate lives in this scope, so the records and rejected forms are gone before the
-        // reply is encoded.
-        std::unordered_map<std::string, Form> replacements;
+        // The candidates and the rejected forms live in this scope, so they are gone before the reply is encoded.
         std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database->userPrefs().exclusions());
+        CandidateFilter filter{rules, exclusions, flags, *client(), *database, context};
         std::optional<BXDatabase::PlugInSet> candidates = database->findPlugIns(rules);
         trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
-
-        const std::shared_ptr<BXBundle>& clientBundle = client()->bundle();
         for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
-            // Only the logs name the candidate, and they are rare: the text is made when one is written.
-            auto uuidText = [&plugIn] { return plugIn->uuid() ? plugIn->uuid()->string() : std::string(); };
-            if (!all) {
-                // Plug-ins outside the system volume are visible only inside an application, and not at all when
-                // the caller asked for system plug-ins only.
-                if (!plugIn->onSystemVolume() && (!plugIn->containingUrl() || (flags & discover::kSystemOnly)))
-                    continue;
-                if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(*plugIn, clientBundle.get())) continue;
-                if (database->holdOnPlugIn(*plugIn)) continue;
-            }
-            if (!plugIn->match(rules, context)) continue;
-
-            bool excluded = false;
-            for (const Value& exclusion : exclusions) {
-                if (plugIn->match(exclusion, context)) {
-                    log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText());
-                    excluded = true;
-                    break;
-                }
-            }
-            if (excluded) continue;
-
-            if (!all) {
-                if (std::optional<std::string> reason = plugIn->allowForClient(*client(), context)) {
-                    log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(), *reason);
-                    continue;
-                }
-            }
-
+            if (!filter.admits(*plugIn)) continue;
             Result<MutableDictionary> exported = plugIn->exportForm();
             if (!exported) {
-                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", uuidText(),
-                                 exported.error());
+                log::ops().error("failed to export matching plug-in %{public}@: %{public}@",
+                                 plugIn->uuid() ? plugIn->uuid()->string() : std::string(), exported.error());
                 continue;
             }
-
-            // Duplicate resolution against the forms of the same identifier accepted so far.
-            std::string identifier = plugIn->identifier().value_or("");
-            std::string version = versionOf(*plugIn);
-            std::vector<size_t>& sameIdentifier = accepted[identifier];
-            bool dropped = false;
-            for (auto at = sameIdentifier.begin(); at != sameIdentifier.end(); ++at) {
-                Form& other = results[*at];
-                ComparisonResult order = compareVersionString(version, textOf(*other, formKey::kVersion));
-                bool same = order == ComparisonResult::Same;
-                if ((flags & discover::kAllVersions) && (!same || (flags & discover::kAllInstances))) continue;
-                bool wins = same ? winsTieBreak(*plugIn, *other) : order == ComparisonResult::Descending;
-                if (wins) {
-                    other.reset();
-                    sameIdentifier.erase(at);
-                    --kept;
-                } else {
-                    dropped = true;
-                }
-                break;
-            }
-            if (dropped) continue;
-
-            Form form = std::make_shared<MutableDictionary>(std::move(*exported));
-            database->addAnnotationForPlugInIn(*plugIn, *form);
-            plugIn->augmentForm(*form);
-            sameIdentifier.push_back(results.size());
-            results.push_back(form);
-            ++kept;
-            // A later plug-in naming the same identifier takes the entry over.
-            for (const std::string& replaced : replacedIdentifiers(*plugIn)) replacements[replaced] = form;
+            accepted.offer(*plugIn, std::move(*exported), *database);
         }
-
-        if (!replacements.empty()) {
-            for (const Form& form : results) {
-                if (!form) continue;
-                std::string identifier = textOf(*form, formKey::kIdentifier);
-                auto replacing = replacements.find(identifier);
-                if (replacing == replacements.end()) continue;
-                std::string replacingUuid = textOf(*replacing->second, formKey::kUuid);
-                form->set(formKey::kOverrider, Value::string(replacingUuid));
-                replacing->second->set(formKey::kOverriding, Value::string(identifier));
-                log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid,
-                                textOf(*form, formKey::kUuid));
-            }
-        }
+        accepted.linkReplacements();
     }
 
-    log::ops().info("match returned %u plug-ins", kept);
-    std::vector<Value> forms;
-    forms.reserve(kept);
-    // The builders are not used again: their entries move into the reply rather than being copied.
-    for (const Form& form : results)
-        if (form) forms.push_back(form->take());
-    if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version()))
+    log::ops().info("match returned %u plug-ins", static_cast<unsigned>(accepted.count()));
+    if (std::optional<Value> encoded = toMessageForm(Value::array(accepted.take()), version()))
         reply().set(protocol::key::kMatches, std::move(*encoded));
     log::ops().debug("reply marshalled");
     done();
