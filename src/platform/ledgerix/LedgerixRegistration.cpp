@@ -21,6 +21,47 @@ namespace bexil {
 namespace fs = std::filesystem;
 using namespace ledgerix_detail;
 
+namespace {
+
+// The bundle's entitlements in document form, none when it has no entitlements file, or why they cannot be used.
+Result<std::optional<std::string>> readEntitlements(const std::string& bundlePath) {
+    fs::path entitlementsPath = fs::path(bundlePath) / kEntitlementsFileName;
+    struct stat entitlementsStatus;
+    if (::lstat(entitlementsPath.c_str(), &entitlementsStatus) != 0) {
+        if (errno == ENOENT) return std::optional<std::string>();
+        return lxError(kLXBadEntitlements,
+                       formatPrintf("cannot read the entitlements of %s: %s", bundlePath, std::strerror(errno)));
+    }
+    if (entitlementsStatus.st_size > static_cast<off_t>(kMaxEntitlementsBytes))
+        return lxError(kLXBadEntitlements, formatPrintf("the entitlements of %s are larger than %zu bytes", bundlePath,
+                                                        kMaxEntitlementsBytes));
+    Result<Value> entitlements = Document::readFile(entitlementsPath);
+    if (!entitlements.ok())
+        return lxError(kLXBadEntitlements,
+                       formatPrintf("cannot read the entitlements of %s: %@", bundlePath, entitlements.error()));
+    if (!entitlements->isDictionary())
+        return lxError(kLXBadEntitlements, formatPrintf("the entitlements of %s are not a dictionary", bundlePath));
+    Result<std::string> text = Document::write(*entitlements);
+    if (!text.ok()) return text.error();
+    return std::optional<std::string>(std::move(text).value());
+}
+
+// A plug-in directly inside X.app/PlugIns/ belongs to the application X.app: the row gets its columns.
+void describeApplication(LedgerixWorkspace::Row& row) {
+    fs::path parent = fs::path(row.path).parent_path();
+    fs::path application = parent.parent_path();
+    if (parent.filename() != "PlugIns" || application.extension() != ".app" || application.stem() == "") return;
+    row.appPath = application.string();
+    std::shared_ptr<const DirectoryBundle> appBundle = DirectoryBundle::create(application, BundleLookup::Directory);
+    std::optional<Value> appInfo = appBundle->infoDictionary();
+    if (appInfo && !appInfo->isDictionary()) appInfo.reset();
+    row.appPlaceholder = !appInfo.has_value();
+    if (appInfo) row.appIdentifier = stringEntry(*appInfo, "BDBundleIdentifier");
+    row.appName = displayName(appInfo, *row.appPath);
+}
+
+}  // namespace
+
 Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view url) {
     std::optional<std::string> lexical = lexicalPath(url);
     if (!lexical) return lxError(kLXBadPath, formatPrintf("not a usable absolute bundle path: \"%s\"", printable(url)));
@@ -44,25 +85,9 @@ Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view ur
         return lxError(kLXNotAPlugIn,
                        formatPrintf("%s is not a plug-in: its Info.vrec has no RZExtension dictionary", *real));
 
-    fs::path entitlementsPath = fs::path(*real) / kEntitlementsFileName;
-    struct stat entitlementsStatus;
-    if (::lstat(entitlementsPath.c_str(), &entitlementsStatus) == 0) {
-        if (entitlementsStatus.st_size > static_cast<off_t>(kMaxEntitlementsBytes))
-            return lxError(kLXBadEntitlements, formatPrintf("the entitlements of %s are larger than %zu bytes", *real,
-                                                            kMaxEntitlementsBytes));
-        Result<Value> entitlements = Document::readFile(entitlementsPath);
-        if (!entitlements.ok())
-            return lxError(kLXBadEntitlements,
-                           formatPrintf("cannot read the entitlements of %s: %@", *real, entitlements.error()));
-        if (!entitlements->isDictionary())
-            return lxError(kLXBadEntitlements, formatPrintf("the entitlements of %s are not a dictionary", *real));
-        Result<std::string> text = Document::write(*entitlements);
-        if (!text.ok()) return text.error();
-        row.entitlements = std::move(text).value();
-    } else if (errno != ENOENT) {
-        return lxError(kLXBadEntitlements,
-                       formatPrintf("cannot read the entitlements of %s: %s", *real, std::strerror(errno)));
-    }
+    Result<std::optional<std::string>> entitlements = readEntitlements(*real);
+    if (!entitlements.ok()) return entitlements.error();
+    row.entitlements = std::move(entitlements).value();
 
     row.identifier = stringEntry(*plugIn, kIdentifierKey);
     if (!row.identifier) row.identifier = stringEntry(*info, "BDBundleIdentifier");
@@ -87,19 +112,7 @@ Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view ur
     row.shortName = stringEntry(*info, "BDBundleName");
     if (!row.shortName || row.shortName->empty()) row.shortName = row.name;
 
-    // A plug-in directly inside X.app/PlugIns/ belongs to the application X.app.
-    fs::path parent = fs::path(row.path).parent_path();
-    fs::path application = parent.parent_path();
-    if (parent.filename() == "PlugIns" && application.extension() == ".app" && application.stem() != "") {
-        row.appPath = application.string();
-        std::shared_ptr<const DirectoryBundle> appBundle =
-            DirectoryBundle::create(application, BundleLookup::Directory);
-        std::optional<Value> appInfo = appBundle->infoDictionary();
-        if (appInfo && !appInfo->isDictionary()) appInfo.reset();
-        row.appPlaceholder = !appInfo.has_value();
-        if (appInfo) row.appIdentifier = stringEntry(*appInfo, "BDBundleIdentifier");
-        row.appName = displayName(appInfo, *row.appPath);
-    }
+    describeApplication(row);
 
     const Value* protocol = plugIn->find("RZExtensionProtocol");
     bool carriesCode = !(protocol && protocol->isString() && *protocol->getString() == "#Data");
