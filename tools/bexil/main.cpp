@@ -210,6 +210,224 @@ int exclusionsCommand(const Options& options, const std::string& setFile, const 
     return 0;
 }
 
+// ---- subcommands ----
+
+// What the arguments of the subcommands fill in; each subcommand declares the fields it reads.
+struct Arguments {
+    std::vector<std::string> paths, uuids, rules, flagNames, addRules;
+    std::string file, setFile;
+    uint64_t flags = 0;
+    int64_t election = -1;
+    bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false;
+};
+
+using Printer = std::function<int(BXDaemonClient&, const Value&)>;
+
+int withPaths(const Options& options, const Arguments& arguments, const char* what,
+              void (BXDaemonClient::*send)(const Value&, BXDaemonClient::ReplyHandler)) {
+    auto array = absolutePaths(arguments.paths);
+    if (!array) return usageFailure(array.error());
+    return roundTrip(options, what, [&](BXDaemonClient& c, auto h) { (c.*send)(*array, std::move(h)); }, {});
+}
+
+int withUuids(const Options& options, const Arguments& arguments, const char* what,
+              const std::function<void(BXDaemonClient&, const std::vector<Uuid>&, BXDaemonClient::ReplyHandler)>& send,
+              const Printer& done) {
+    auto list = parseUuids(arguments.uuids);
+    if (!list) return usageFailure(list.error());
+    return roundTrip(
+        options, what, [&](BXDaemonClient& c, auto h) { send(c, *list, std::move(h)); }, done);
+}
+
+int annotateWith(const Options& options, const Arguments& arguments, const Value& annotations) {
+    return withUuids(options, arguments, "annotate",
+                     [&](BXDaemonClient& c, const std::vector<Uuid>& list, auto h) {
+                         c.setPluginAnnotationsAnnotationsReply(list, annotations, std::move(h));
+                     },
+                     {});
+}
+
+int addCommand(const Options& options, Arguments& arguments) {
+    return withPaths(options, arguments, "add", &BXDaemonClient::addPlugInsReply);
+}
+
+int removeCommand(const Options& options, Arguments& arguments) {
+    return withPaths(options, arguments, "remove", &BXDaemonClient::removePlugInsReply);
+}
+
+int bulkCommand(const Options& options, Arguments& arguments) {
+    return roundTrip(options, "bulk", [&](BXDaemonClient& c, auto h) { c.bulkPluginsReply(arguments.flags, h); }, {});
+}
+
+int matchCommand(const Options& options, Arguments& arguments) {
+    auto ruleSet = rulesFromArguments(arguments.rules);
+    if (!ruleSet) return usageFailure(ruleSet.error());
+    Value combined = *ruleSet;
+    if (!arguments.file.empty()) {
+        auto fromFile = readDictionaryFile(arguments.file);
+        if (!fromFile) return usageFailure(fromFile.error());
+        MutableDictionary merged(*fromFile);
+        for (const DictionaryEntry& entry : ruleSet->entries()) merged.set(entry.key, entry.value);
+        combined = merged.take();
+    }
+    auto matchFlags = discoveryFlags(arguments.flagNames);
+    if (!matchFlags) return usageFailure(matchFlags.error());
+    return roundTrip(
+        options, "match", [&](BXDaemonClient& c, auto h) { c.matchPlugInsFlagsReply(combined, *matchFlags, h); },
+        [&](BXDaemonClient& c, const Value& m) { return printMatches(options, c, m); });
+}
+
+int readyCommand(const Options& options, Arguments& arguments) {
+    return withUuids(options, arguments, "ready",
+                     [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.readyPlugInsFlagsReply(l, 0, h); },
+                     {});
+}
+
+int accessCommand(const Options& options, Arguments& arguments) {
+    return withUuids(
+        options, arguments, "access",
+        [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.accessPlugInsFlagsReply(l, 0, h); },
+        [&](BXDaemonClient& c, const Value& m) { return printExtensions(options, c, m); });
+}
+
+int annotateCommand(const Options& options, Arguments& arguments) {
+    MutableDictionary annotations;
+    if (arguments.election >= 0) annotations.set(protocol::annotation::kElection, Value::int64(arguments.election));
+    if (!arguments.file.empty()) {
+        auto extension = readDictionaryFile(arguments.file);
+        if (!extension) return usageFailure(extension.error());
+        annotations.set(protocol::annotation::kExtension, *extension);
+    }
+    if (annotations.count() == 0) {
+        usageError("annotate needs --election or --extension");
+        return kExitUsage;
+    }
+    return annotateWith(options, arguments, annotations.take());
+}
+
+int electCommand(const Options& options, Arguments& arguments) {
+    return annotateWith(options, arguments,
+                        Value::dictionary({{std::string(protocol::annotation::kElection), Value::int64(1)}}));
+}
+
+int unelectCommand(const Options& options, Arguments& arguments) {
+    return annotateWith(options, arguments,
+                        Value::dictionary({{std::string(protocol::annotation::kElection), Value::int64(0)}}));
+}
+
+int bulkAnnotateCommand(const Options& options, Arguments& arguments) {
+    auto annotations = readDictionaryFile(arguments.file);
+    if (!annotations) return usageFailure(annotations.error());
+    for (const DictionaryEntry& entry : annotations->entries()) {
+        if (!Uuid::parse(entry.key)) {
+            usageError("bulk annotation key \"" + entry.key + "\" is not a plug-in UUID");
+            return kExitUsage;
+        }
+        if (!entry.value.isDictionary()) {
+            usageError("bulk annotation of " + entry.key + " is not a dictionary");
+            return kExitUsage;
+        }
+    }
+    return roundTrip(options, "bulk-annotate",
+                     [&](BXDaemonClient& c, auto h) { c.bulkSetPluginAnnotationsReply(*annotations, h); }, {});
+}
+
+int holdCommand(const Options& options, Arguments& arguments) {
+    auto array = absolutePaths(arguments.paths);
+    if (!array) return usageFailure(array.error());
+    uint64_t holdFlags = (arguments.plugInPaths ? protocol::hold::kPlugInPaths : 0) |
+                         (arguments.refuseBusy ? protocol::hold::kRefuseBusy : 0) |
+                         (arguments.terminate ? protocol::hold::kTerminate : 0);
+    return roundTrip(
+        options, "hold", [&](BXDaemonClient& c, auto h) { c.holdPluginsFlagsReply(*array, holdFlags, h); },
+        [&](BXDaemonClient& c, const Value& m) { return printHold(options, c, m); });
+}
+
+int releaseCommand(const Options& options, Arguments& arguments) {
+    return withUuids(options, arguments, "release",
+                     [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.releaseHoldReply(l.front(), h); },
+                     {});
+}
+
+int exclusionsSubcommand(const Options& options, Arguments& arguments) {
+    return exclusionsCommand(options, arguments.setFile, arguments.addRules, arguments.clear);
+}
+
+void pathsArgument(CLI::App& command, Arguments& arguments) {
+    command.add_option("paths", arguments.paths, "absolute paths of plug-in bundles")->required();
+}
+void uuidsArgument(CLI::App& command, Arguments& arguments) {
+    command.add_option("uuids", arguments.uuids, "plug-in UUIDs")->required();
+}
+
+// One subcommand: its name, its help (one line, then an example), the arguments it declares and what it does.
+struct Subcommand {
+    const char* name;
+    const char* help;
+    void (*declare)(CLI::App& command, Arguments& arguments);
+    int (*action)(const Options& options, Arguments& arguments);
+};
+
+// In the order the help lists them.
+const Subcommand kSubcommands[] = {
+    {"add", "register plug-in bundles\n  example: bexil add /opt/Greeter.app/PlugIns/Hello.bxplugin", pathsArgument,
+     addCommand},
+    {"remove",
+     "unregister plug-in bundles (needs the manager entitlement)\n  example: bexil remove "
+     "/opt/Greeter.app/PlugIns/Hello.bxplugin",
+     pathsArgument, removeCommand},
+    {"bulk", "bulk registration request (no option is supported today)\n  example: bexil bulk",
+     [](CLI::App& c, Arguments& a) { c.add_option("--flags", a.flags, "option bits"); }, bulkCommand},
+    {"match",
+     "discover plug-ins\n  example: bexil match RZExtensionPointIdentifier=com.example.greeting --flag all-versions",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
+         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
+         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+     },
+     matchCommand},
+    {"ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...", uuidsArgument, readyCommand},
+    {"access", "get read access tokens for plug-in bundles\n  example: bexil access 2F1C...", uuidsArgument,
+     accessCommand},
+    {"annotate", "set annotations of plug-ins\n  example: bexil annotate --election 1 --extension ext.json 2F1C...",
+     [](CLI::App& c, Arguments& a) {
+         uuidsArgument(c, a);
+         c.add_option("--election", a.election, "election value (0: none, 1: elected)")->check(CLI::NonNegativeNumber);
+         c.add_option("--extension", a.file, "the client-defined annotation from a .vrec or JSON file");
+     },
+     annotateCommand},
+    {"elect", "elect plug-ins (election 1)\n  example: bexil elect 2F1C...", uuidsArgument, electCommand},
+    {"unelect", "withdraw the election of plug-ins (election 0)\n  example: bexil unelect 2F1C...", uuidsArgument,
+     unelectCommand},
+    {"bulk-annotate",
+     "replace the client-defined annotations of many plug-ins\n  example: bexil bulk-annotate annotations.json   # "
+     "{\"<uuid>\": {...}, ...}",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("file", a.file, ".vrec or JSON dictionary from plug-in UUID to annotation")->required();
+     },
+     bulkAnnotateCommand},
+    {"hold", "hold plug-ins out of use; prints the hold UUID\n  example: bexil hold --refuse-busy /opt/Greeter.app",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("paths", a.paths, "absolute paths of applications (or plug-ins with --plugin-paths)")->required();
+         c.add_flag("--plugin-paths", a.plugInPaths, "the paths name plug-in bundles, not applications");
+         c.add_flag("--refuse-busy", a.refuseBusy, "refuse the hold when a plug-in is busy");
+         c.add_flag("--terminate", a.terminate, "terminate running instances once the hold is placed");
+     },
+     holdCommand},
+    {"release", "release a hold\n  example: bexil release 7A0E...",
+     [](CLI::App& c, Arguments& a) { c.add_option("uuid", a.uuids, "the hold's UUID")->required()->expected(1); },
+     releaseCommand},
+    {"exclusions",
+     "show or set the global exclusions preference\n  example: bexil exclusions --add "
+     "RZExtensionPointIdentifier=com.example.ads",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("--set", a.setFile, "replace the exclusions by a .vrec or JSON file");
+         c.add_option("--add", a.addRules, "append one rule made of KEY=PATTERN arguments");
+         c.add_flag("--clear", a.clear, "remove every exclusion");
+     },
+     exclusionsSubcommand},
+};
+
 int run(int argc, char** argv) {
     Options options;
     CLI::App app{
@@ -226,62 +444,13 @@ int run(int argc, char** argv) {
         ->check(CLI::PositiveNumber)
         ->capture_default_str();
 
-    std::vector<std::string> paths, uuids, rules, flagNames, addRules;
-    std::string file, setFile;
-    uint64_t flags = 0;
-    int64_t election = -1;
-    bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false;
-    std::function<int()> action;
-
-    auto* add = app.add_subcommand(
-        "add", "register plug-in bundles\n  example: bexil add /opt/Greeter.app/PlugIns/Hello.bxplugin");
-    add->add_option("paths", paths, "absolute paths of plug-in bundles")->required();
-    auto* remove = app.add_subcommand("remove",
-                                      "unregister plug-in bundles (needs the manager entitlement)\n  example: bexil "
-                                      "remove /opt/Greeter.app/PlugIns/Hello.bxplugin");
-    remove->add_option("paths", paths, "absolute paths of plug-in bundles")->required();
-    auto* bulk =
-        app.add_subcommand("bulk", "bulk registration request (no option is supported today)\n  example: bexil bulk");
-    bulk->add_option("--flags", flags, "option bits");
-    auto* match = app.add_subcommand("match",
-                                     "discover plug-ins\n  example: bexil match "
-                                     "RZExtensionPointIdentifier=com.example.greeting --flag all-versions");
-    match->add_option("rules", rules, "rules as KEY=PATTERN");
-    match->add_option("--rules-file", file, "rule dictionary from a .vrec or JSON file");
-    match->add_option("--flag", flagNames, "all-versions, all-instances, system-only or all (repeatable)");
-    auto* ready = app.add_subcommand("ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...");
-    ready->add_option("uuids", uuids, "plug-in UUIDs")->required();
-    auto* access =
-        app.add_subcommand("access", "get read access tokens for plug-in bundles\n  example: bexil access 2F1C...");
-    access->add_option("uuids", uuids, "plug-in UUIDs")->required();
-    auto* annotate = app.add_subcommand(
-        "annotate", "set annotations of plug-ins\n  example: bexil annotate --election 1 --extension ext.json 2F1C...");
-    annotate->add_option("uuids", uuids, "plug-in UUIDs")->required();
-    annotate->add_option("--election", election, "election value (0: none, 1: elected)")->check(CLI::NonNegativeNumber);
-    annotate->add_option("--extension", file, "the client-defined annotation from a .vrec or JSON file");
-    auto* elect = app.add_subcommand("elect", "elect plug-ins (election 1)\n  example: bexil elect 2F1C...");
-    elect->add_option("uuids", uuids, "plug-in UUIDs")->required();
-    auto* unelect = app.add_subcommand(
-        "unelect", "withdraw the election of plug-ins (election 0)\n  example: bexil unelect 2F1C...");
-    unelect->add_option("uuids", uuids, "plug-in UUIDs")->required();
-    auto* bulkAnnotate = app.add_subcommand("bulk-annotate",
-                                            "replace the client-defined annotations of many plug-ins\n  example: bexil "
-                                            "bulk-annotate annotations.json   # {\"<uuid>\": {...}, ...}");
-    bulkAnnotate->add_option("file", file, ".vrec or JSON dictionary from plug-in UUID to annotation")->required();
-    auto* hold = app.add_subcommand(
-        "hold", "hold plug-ins out of use; prints the hold UUID\n  example: bexil hold --refuse-busy /opt/Greeter.app");
-    hold->add_option("paths", paths, "absolute paths of applications (or plug-ins with --plugin-paths)")->required();
-    hold->add_flag("--plugin-paths", plugInPaths, "the paths name plug-in bundles, not applications");
-    hold->add_flag("--refuse-busy", refuseBusy, "refuse the hold when a plug-in is busy");
-    hold->add_flag("--terminate", terminate, "terminate running instances once the hold is placed");
-    auto* release = app.add_subcommand("release", "release a hold\n  example: bexil release 7A0E...");
-    release->add_option("uuid", uuids, "the hold's UUID")->required()->expected(1);
-    auto* exclusions = app.add_subcommand("exclusions",
-                                          "show or set the global exclusions preference\n  example: bexil exclusions "
-                                          "--add RZExtensionPointIdentifier=com.example.ads");
-    exclusions->add_option("--set", setFile, "replace the exclusions by a .vrec or JSON file");
-    exclusions->add_option("--add", addRules, "append one rule made of KEY=PATTERN arguments");
-    exclusions->add_flag("--clear", clear, "remove every exclusion");
+    Arguments arguments;
+    std::vector<std::pair<CLI::App*, const Subcommand*>> commands;
+    for (const Subcommand& subcommand : kSubcommands) {
+        CLI::App* command = app.add_subcommand(subcommand.name, subcommand.help);
+        subcommand.declare(*command, arguments);
+        commands.emplace_back(command, &subcommand);
+    }
 
     try {
         app.parse(argc, argv);
@@ -297,102 +466,8 @@ int run(int argc, char** argv) {
     // The library logs to the system log; on a terminal without one, its lines would mix with the tool's own.
     log::LogRegistry::shared().setThreshold(options.verbose ? log::Level::Debug : log::Level::Fault);
 
-    auto withPaths = [&](const char* what, auto sendPaths) -> int {
-        auto array = absolutePaths(paths);
-        if (!array) return usageFailure(array.error());
-        return roundTrip(options, what, [&](BXDaemonClient& c, auto h) { sendPaths(c, *array, std::move(h)); }, {});
-    };
-    auto withUuids = [&](const char* what, auto sendUuids,
-                         std::function<int(BXDaemonClient&, const Value&)> done) -> int {
-        auto list = parseUuids(uuids);
-        if (!list) return usageFailure(list.error());
-        return roundTrip(
-            options, what, [&](BXDaemonClient& c, auto h) { sendUuids(c, *list, std::move(h)); }, std::move(done));
-    };
-    auto annotateWith = [&](Value annotations) {
-        return withUuids("annotate",
-                         [&](BXDaemonClient& c, const std::vector<Uuid>& list, auto h) {
-                             c.setPluginAnnotationsAnnotationsReply(list, annotations, std::move(h));
-                         },
-                         {});
-    };
-
-    if (*add) return withPaths("add", [](BXDaemonClient& c, const Value& p, auto h) { c.addPlugInsReply(p, h); });
-    if (*remove)
-        return withPaths("remove", [](BXDaemonClient& c, const Value& p, auto h) { c.removePlugInsReply(p, h); });
-    if (*bulk) return roundTrip(options, "bulk", [&](BXDaemonClient& c, auto h) { c.bulkPluginsReply(flags, h); }, {});
-    if (*match) {
-        auto ruleSet = rulesFromArguments(rules);
-        if (!ruleSet) return usageFailure(ruleSet.error());
-        Value combined = *ruleSet;
-        if (!file.empty()) {
-            auto fromFile = readDictionaryFile(file);
-            if (!fromFile) return usageFailure(fromFile.error());
-            MutableDictionary merged(*fromFile);
-            for (const DictionaryEntry& entry : ruleSet->entries()) merged.set(entry.key, entry.value);
-            combined = merged.take();
-        }
-        auto matchFlags = discoveryFlags(flagNames);
-        if (!matchFlags) return usageFailure(matchFlags.error());
-        return roundTrip(
-            options, "match", [&](BXDaemonClient& c, auto h) { c.matchPlugInsFlagsReply(combined, *matchFlags, h); },
-            [&](BXDaemonClient& c, const Value& m) { return printMatches(options, c, m); });
-    }
-    if (*ready)
-        return withUuids(
-            "ready", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.readyPlugInsFlagsReply(l, 0, h); },
-            {});
-    if (*access)
-        return withUuids(
-            "access", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.accessPlugInsFlagsReply(l, 0, h); },
-            [&](BXDaemonClient& c, const Value& m) { return printExtensions(options, c, m); });
-    if (*annotate) {
-        MutableDictionary annotations;
-        if (election >= 0) annotations.set("election", Value::int64(election));
-        if (!file.empty()) {
-            auto extension = readDictionaryFile(file);
-            if (!extension) return usageFailure(extension.error());
-            annotations.set("extension", *extension);
-        }
-        if (annotations.count() == 0) {
-            usageError("annotate needs --election or --extension");
-            return kExitUsage;
-        }
-        return annotateWith(annotations.take());
-    }
-    if (*elect) return annotateWith(Value::dictionary({{"election", Value::int64(1)}}));
-    if (*unelect) return annotateWith(Value::dictionary({{"election", Value::int64(0)}}));
-    if (*bulkAnnotate) {
-        auto annotations = readDictionaryFile(file);
-        if (!annotations) return usageFailure(annotations.error());
-        for (const DictionaryEntry& entry : annotations->entries()) {
-            if (!Uuid::parse(entry.key)) {
-                usageError("bulk annotation key \"" + entry.key + "\" is not a plug-in UUID");
-                return kExitUsage;
-            }
-            if (!entry.value.isDictionary()) {
-                usageError("bulk annotation of " + entry.key + " is not a dictionary");
-                return kExitUsage;
-            }
-        }
-        return roundTrip(options, "bulk-annotate",
-                         [&](BXDaemonClient& c, auto h) { c.bulkSetPluginAnnotationsReply(*annotations, h); }, {});
-    }
-    if (*hold) {
-        auto array = absolutePaths(paths);
-        if (!array) return usageFailure(array.error());
-        uint64_t holdFlags = (plugInPaths ? protocol::hold::kPlugInPaths : 0) |
-                             (refuseBusy ? protocol::hold::kRefuseBusy : 0) |
-                             (terminate ? protocol::hold::kTerminate : 0);
-        return roundTrip(
-            options, "hold", [&](BXDaemonClient& c, auto h) { c.holdPluginsFlagsReply(*array, holdFlags, h); },
-            [&](BXDaemonClient& c, const Value& m) { return printHold(options, c, m); });
-    }
-    if (*release)
-        return withUuids(
-            "release", [](BXDaemonClient& c, const std::vector<Uuid>& l, auto h) { c.releaseHoldReply(l.front(), h); },
-            {});
-    if (*exclusions) return exclusionsCommand(options, setFile, addRules, clear);
+    for (const auto& [command, subcommand] : commands)
+        if (*command) return subcommand->action(options, arguments);
     return kExitUsage;
 }
 
