@@ -4,7 +4,6 @@
 #include <openssl/core_names.h>
 #include <openssl/crypto.h>
 #include <openssl/evp.h>
-#include <openssl/hmac.h>
 #include <openssl/rand.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -146,30 +145,30 @@ EVP_MAC_CTX* keyedMac(const std::vector<uint8_t>& key) {
     return state;
 }
 
-}  // namespace
-
-std::string SandboxExtensions::issuingSignatureLocked(std::string_view extensionClass, std::string_view path) {
-    if (!issuingMac_) issuingMac_.reset(keyedMac(issuingKey_));
-    EVP_MAC_CTX* state = issuingMac_ ? EVP_MAC_CTX_dup(issuingMac_.get()) : nullptr;
-    if (state == nullptr) return signature(issuingKey_, extensionClass, path);
+// The one way a signature is made: the MAC of `state` (which this takes over and frees) over the class and path,
+// in hexadecimal; empty when there is no state or the library fails, which no caller may take as a signature.
+std::string finishSignature(EVP_MAC_CTX* state, std::string_view extensionClass, std::string_view path) {
+    if (state == nullptr) return {};
     std::string message = signedMessage(extensionClass, path);
     unsigned char digest[EVP_MAX_MD_SIZE];
     size_t length = 0;
     bool ok = EVP_MAC_update(state, reinterpret_cast<const unsigned char*>(message.data()), message.size()) == 1 &&
               EVP_MAC_final(state, digest, &length, sizeof digest) == 1;
     EVP_MAC_CTX_free(state);
-    if (!ok) return signature(issuingKey_, extensionClass, path);
-    return hex(digest, length);
+    return ok ? hex(digest, length) : std::string();
+}
+
+}  // namespace
+
+std::string SandboxExtensions::issuingSignatureLocked(std::string_view extensionClass, std::string_view path) {
+    if (!issuingMac_) issuingMac_.reset(keyedMac(issuingKey_));
+    EVP_MAC_CTX* state = issuingMac_ ? EVP_MAC_CTX_dup(issuingMac_.get()) : keyedMac(issuingKey_);
+    return finishSignature(state, extensionClass, path);
 }
 
 std::string SandboxExtensions::signature(const std::vector<uint8_t>& key, std::string_view extensionClass,
                                          std::string_view path) const {
-    std::string message = signedMessage(extensionClass, path);
-    unsigned char digest[EVP_MAX_MD_SIZE];
-    unsigned int length = 0;
-    HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(message.data()),
-         message.size(), digest, &length);
-    return hex(digest, length);
+    return finishSignature(keyedMac(key), extensionClass, path);
 }
 
 std::optional<std::string> SandboxExtensions::issueFileExtension(std::string_view extensionClass,
@@ -188,8 +187,12 @@ std::optional<std::string> SandboxExtensions::issueFileExtension(std::string_vie
     }
     std::lock_guard lock(mutex_);
     if (!ensureIssuingKeyLocked()) return std::nullopt;
-    return std::string(extensionClass) + kSeparator + issuingSignatureLocked(extensionClass, resolved) + kSeparator +
-           resolved;
+    std::string mac = issuingSignatureLocked(extensionClass, resolved);
+    if (mac.empty()) {
+        errno = EIO;
+        return std::nullopt;
+    }
+    return std::string(extensionClass) + kSeparator + mac + kSeparator + resolved;
 }
 
 int64_t SandboxExtensions::consume(const std::string& token) {
@@ -206,7 +209,8 @@ int64_t SandboxExtensions::consume(const std::string& token) {
     std::optional<std::vector<uint8_t>> key = readKey(keyPath_);
     if (!key) return -1;
     std::string expected = signature(*key, extensionClass, path);
-    if (mac.size() != expected.size() || CRYPTO_memcmp(mac.data(), expected.data(), expected.size()) != 0) {
+    if (expected.empty() || mac.size() != expected.size() ||
+        CRYPTO_memcmp(mac.data(), expected.data(), expected.size()) != 0) {
         errno = EPERM;
         return -1;
     }
