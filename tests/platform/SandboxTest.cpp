@@ -110,9 +110,9 @@ TEST_F(SandboxExtensionsTest, AlteredOrForeignTokensAreRefused) {
     std::string otherClass = *token;
     otherClass.replace(0, 1, "x");
     // A token without a signature, for a real path: an empty signature must never compare equal to anything.
-    std::string unsigned_ = "com.quorvel.sandbox.read-only;;" + (root_ / "bundle").string();
+    std::string withoutSignature = "com.quorvel.sandbox.read-only;;" + (root_ / "bundle").string();
     for (const std::string& bad :
-         {otherPath, otherClass, std::string(";;"), token->substr(0, token->size() / 2), unsigned_}) {
+         {otherPath, otherClass, std::string(";;"), token->substr(0, token->size() / 2), withoutSignature}) {
         errno = 0;
         EXPECT_EQ(issuer.consume(bad), -1) << bad;
         EXPECT_EQ(errno, EPERM) << bad;
