@@ -24,25 +24,7 @@ Error documentError(int code, std::string message) {
     return Error(std::string(BXDocumentErrorDomain), code, std::move(message));
 }
 
-// A short, printable excerpt of text for an error message.
-std::string snippet(std::string_view text) {
-    std::string out;
-    size_t length = std::min(text.size(), kSnippetLength);
-    // Never cut a UTF-8 sequence in half: messages end up in logs that expect valid text.
-    while (length > 0 && length < text.size() && (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80) --length;
-    for (size_t i = 0; i < length; ++i) {
-        unsigned char c = static_cast<unsigned char>(text[i]);
-        if (c < 0x20 || c == 0x7F || c == '"' || c == '\\') {
-            char buf[8];
-            snprintf(buf, sizeof buf, "\\x%02X", c);
-            out += buf;
-        } else {
-            out += static_cast<char>(c);
-        }
-    }
-    if (length < text.size()) out += "...";
-    return "\"" + out + "\"";
-}
+std::string snippet(std::string_view text) { return quotedForMessage(text, kSnippetLength); }
 
 std::string pathText(const std::vector<PathStep>& steps) {
     std::string out = "root";

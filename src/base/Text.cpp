@@ -55,6 +55,32 @@ size_t firstInvalidUtf8(std::string_view text) {
     return firstInvalidUtf8(reinterpret_cast<const uint8_t*>(text.data()), text.size());
 }
 
+std::string quotedForMessage(std::string_view text, size_t limit) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    const auto* bytes = reinterpret_cast<const uint8_t*>(text.data());
+    std::string out = "\"";
+    size_t i = 0;
+    while (i < text.size()) {
+        uint8_t c = bytes[i];
+        std::optional<Utf8Sequence> sequence = c >= 0x80 ? decodeUtf8(bytes + i, text.size() - i) : std::nullopt;
+        size_t length = sequence ? sequence->length : 1;
+        if (i + length > limit) break;
+        if (sequence) {
+            out.append(text.substr(i, length));
+        } else if (c < 0x20 || c >= 0x7F || c == '"' || c == '\\') {
+            out += "\\x";
+            out += kHex[c >> 4];
+            out += kHex[c & 0xF];
+        } else {
+            out += static_cast<char>(c);
+        }
+        i += length;
+    }
+    if (i < text.size()) out += "...";
+    out += '"';
+    return out;
+}
+
 void appendUtf8(std::string& out, uint32_t codePoint) {
     if (codePoint < 0x80) {
         out += static_cast<char>(codePoint);

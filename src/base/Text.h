@@ -43,6 +43,12 @@ size_t firstInvalidUtf8(std::string_view text);
 // Appends the UTF-8 form of `codePoint` (which must be at most U+10FFFF and not a surrogate).
 void appendUtf8(std::string& out, uint32_t codePoint);
 
+// Text from outside (a key, a path, a document excerpt) made safe for a message or a log line, in double quotes:
+// control bytes, DEL, '"', '\\' and bytes that are not well-formed UTF-8 as \xNN (lower-case hexadecimal),
+// well-formed UTF-8 as it is. At most `limit` bytes of the text are shown, never cutting a sequence in half, and
+// "..." before the closing quote says that it was cut.
+std::string quotedForMessage(std::string_view text, size_t limit = SIZE_MAX);
+
 // Appends the base64 form of `bytes` (standard alphabet, "=" padding, no line breaks).
 void appendBase64(std::string& out, std::span<const uint8_t> bytes);
 std::string base64(std::span<const uint8_t> bytes);

@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <string>
 #include <vector>
 
@@ -59,6 +60,25 @@ TEST(Utf8, BoundaryCodePointsDecodeAndRoundTrip) {
     }
     EXPECT_EQ(firstInvalidUtf8(std::string_view("\0a\xC3\xA9\xE2\x82\xAC\xF0\x9F\x98\x80", 11)), kWellFormedUtf8);
     EXPECT_EQ(firstInvalidUtf8(std::string_view()), kWellFormedUtf8);
+}
+
+// Messages and logs expect valid text on one line: whatever the bytes, the quoted form is well-formed UTF-8 with no
+// control characters, and it is cut without splitting a character.
+TEST(QuotedForMessage, AnyBytesBecomeOneLineOfValidText) {
+    EXPECT_EQ(quotedForMessage("plain"), "\"plain\"");
+    EXPECT_EQ(quotedForMessage(std::string_view("a\0b\n\"\\\x7f", 7)), "\"a\\x00b\\x0a\\x22\\x5c\\x7f\"");
+    EXPECT_EQ(quotedForMessage("caf\xC3\xA9 \xC3"), "\"caf\xC3\xA9 \\xc3\"")
+        << "valid UTF-8 kept, a broken byte escaped";
+    EXPECT_EQ(quotedForMessage("\xED\xA0\x80"), "\"\\xed\\xa0\\x80\"") << "a surrogate is not text";
+    EXPECT_EQ(quotedForMessage("abcdef", 3), "\"abc...\"");
+    EXPECT_EQ(quotedForMessage("ab\xE2\x82\xAC", 4), "\"ab...\"") << "never half a character";
+    EXPECT_EQ(quotedForMessage("abc", 3), "\"abc\"");
+    std::string all;
+    for (int c = 0; c < 256; ++c) all += static_cast<char>(c);
+    std::string quoted = quotedForMessage(all);
+    EXPECT_EQ(firstInvalidUtf8(quoted), kWellFormedUtf8);
+    EXPECT_EQ(std::count_if(quoted.begin(), quoted.end(), [](char c) { return static_cast<unsigned char>(c) < 0x20; }),
+              0);
 }
 
 TEST(FileURL, LocalURLsGiveTheirDecodedPathAndNothingElseIsOne) {

@@ -42,7 +42,7 @@ Error lxError(LXErrorCode code, std::string message);
 // zeros keeps one). Discovery tells "v01" from "v1", so one key may stand for a few values that a rule tells apart;
 // that only widens the candidates, which the caller checks rule by rule anyway.
 std::string matchForm(std::string_view text);
-// The URL as a caller sent it, safe to put in a message: control bytes (a NUL among them) are escaped.
+// The URL as a caller sent it, quoted and safe to put in a message (a NUL among its bytes is escaped).
 std::string printable(std::string_view url);
 std::optional<std::string> stringEntry(const Value& dictionary, std::string_view key);
 // A URL or path as the registry keys it: absolute, a file URL read as its path, "." and ".." folded, no trailing

@@ -64,7 +64,7 @@ void describeApplication(LedgerixWorkspace::Row& row) {
 
 Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view url) {
     std::optional<std::string> lexical = lexicalPath(url);
-    if (!lexical) return lxError(kLXBadPath, formatPrintf("not a usable absolute bundle path: \"%s\"", printable(url)));
+    if (!lexical) return lxError(kLXBadPath, formatPrintf("not a usable absolute bundle path: %s", printable(url)));
     int error = 0;
     std::optional<std::string> real = realPath(*lexical, &error);
     if (!real) return lxError(kLXBadPath, formatPrintf("cannot resolve %s: %s", *lexical, std::strerror(error)));

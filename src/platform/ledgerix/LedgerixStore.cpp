@@ -93,16 +93,7 @@ std::string matchForm(std::string_view text) {
 }
 
 // The URL as a caller sent it, safe to put in a message: control bytes (a NUL among them) are escaped.
-std::string printable(std::string_view url) {
-    std::string text;
-    for (char c : url) {
-        if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f)
-            text += formatPrintf("\\x%02x", static_cast<unsigned>(static_cast<unsigned char>(c)));
-        else
-            text += c;
-    }
-    return text;
-}
+std::string printable(std::string_view url) { return quotedForMessage(url); }
 
 std::optional<std::string> stringEntry(const Value& dictionary, std::string_view key) {
     const Value* value = dictionary.find(key);

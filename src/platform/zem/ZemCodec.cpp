@@ -35,19 +35,8 @@ constexpr size_t kMaxInitialReserve = 1024;
 // Longest piece of a key quoted in an error message.
 constexpr size_t kMaxQuotedKey = 64;
 
-// A key as it appears in an error message: printable ASCII as is, everything else as \xNN, cut at a sane length.
-std::string quoted(std::string_view key) {
-    std::string out = "\"";
-    for (size_t i = 0; i < key.size() && i < kMaxQuotedKey; ++i) {
-        auto c = static_cast<unsigned char>(key[i]);
-        if (c >= 0x20 && c < 0x7F && c != '"' && c != '\\')
-            out += static_cast<char>(c);
-        else
-            out += fmt::format("\\x{:02x}", c);
-    }
-    out += key.size() > kMaxQuotedKey ? "\"..." : "\"";
-    return out;
-}
+// A key as it appears in an error message, cut at a sane length.
+std::string quoted(std::string_view key) { return quotedForMessage(key, kMaxQuotedKey); }
 
 constexpr size_t varintSize(uint64_t v) {
     size_t n = 1;
