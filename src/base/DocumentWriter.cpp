@@ -153,6 +153,11 @@ class Writer {
             case ValueKind::Dictionary:
                 break;
         }
+        return writeContainer(value, depth);
+    }
+
+    // An array or a dictionary, its opening tag already indented.
+    bool writeContainer(const Value& value, size_t depth) {
         const char* name = value.isArray() ? "array" : "dict";
         if (depth + 1 > kMaxDocumentDepth)
             return fail(kDocumentLimitExceeded, "containers nested deeper than " + std::to_string(kMaxDocumentDepth));

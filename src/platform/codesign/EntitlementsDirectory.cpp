@@ -9,6 +9,7 @@
 #include <set>
 
 #include "base/Document.h"
+#include "base/PosixError.h"
 #include "base/StandardPaths.h"
 #include "platform/log/Log.h"
 
@@ -37,7 +38,7 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
     if (stat(directory_.c_str(), &dirStat) != 0) {
         // A missing directory simply grants nothing to anybody.
         if (errno == ENOENT) return Value::emptyDictionary();
-        return Error("POSIX", errno, std::string(strerror(errno)) + ": " + directory_.string());
+        return posixError(errno, "cannot read the entitlements directory " + directory_.string());
     }
     if (!S_ISDIR(dirStat.st_mode) || !ownerAndModeTrusted(dirStat, trustedUid_)) {
         log::ops().error("entitlements directory %s is not trusted (owner or mode); no program has entitlements",
@@ -45,7 +46,7 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
         return Value::emptyDictionary();
     }
     DIR* dir = opendir(directory_.c_str());
-    if (!dir) return Error("POSIX", errno, std::string(strerror(errno)) + ": " + directory_.string());
+    if (!dir) return posixError(errno, "cannot open the entitlements directory " + directory_.string());
 
     // Files are taken in name order, so when two name the same executable the later name wins, on every machine.
     std::set<std::string> names;
