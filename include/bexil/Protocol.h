@@ -27,7 +27,7 @@ inline constexpr std::string_view kServiceName = "com.quorvel.bexil.bxd";
 inline constexpr std::string_view kAnnotationChangeNotification = "com.quorvel.bexil.annotation-change";
 // Lets a client remove plug-ins and discover every plug-in (discover::kAll).
 inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bexil.manager";
-// The preference domain of the user's elections.
+// The preference domain that bxd reads (the global exclusions, docs/preferences.md).
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
@@ -37,7 +37,7 @@ struct RequestInfo {
     Request request;
     // The value of key::kRequest.
     std::string_view name;
-    // One line on what it does, for help texts and the documentation check.
+    // One line on what it does.
     std::string_view summary;
 };
 
