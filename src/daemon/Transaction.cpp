@@ -35,8 +35,9 @@ struct HandlerEntry {
     void (Transaction::*handler)();
 };
 
-// One handler per request of the protocol, in the protocol's order; the build stops when they drift apart (an
-// entry left out shows as a request out of order, since the array has exactly one slot per request).
+// One handler per request of the protocol, in the protocol's order and at the index of its enum value (dispatch
+// indexes the table by it); the build stops when they drift apart (an entry left out shows as a request out of
+// order, since the array has exactly one slot per request).
 constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Add, &Transaction::addPlugIns},
     {Request::Remove, &Transaction::removePlugIns},
@@ -51,7 +52,8 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
 
 constexpr bool handlersFollowTheProtocol() {
     for (size_t i = 0; i < kHandlers.size(); ++i)
-        if (kHandlers[i].request != protocol::kRequests[i].request) return false;
+        if (kHandlers[i].request != protocol::kRequests[i].request || static_cast<size_t>(kHandlers[i].request) != i)
+            return false;
     return true;
 }
 static_assert(handlersFollowTheProtocol(), "every request of bexil/Protocol.h needs its handler, in the same order");
