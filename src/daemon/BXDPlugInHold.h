@@ -1,8 +1,11 @@
 #pragma once
 
-// A hold that keeps plug-ins out of use while their applications change. Placed by a client, owned by the
-// server's hold list (read and written only inside the server's syncQueue), and released when its client dies.
+// A hold keeps plug-ins out of use while the client that placed it wants: discovery leaves them out and they are
+// not made ready. Made by the "lock" request, owned by the server's hold list (read and written only inside the
+// server's syncQueue), and released by its UUID or when its client dies. Immutable after creation.
 
+#include <atomic>
+#include <cstddef>
 #include <memory>
 #include <vector>
 
@@ -15,26 +18,36 @@ class BXDZemClient;
 
 class BXDPlugInHold {
   public:
-    BXDPlugInHold(Uuid token, std::weak_ptr<BXDZemClient> client, std::vector<std::shared_ptr<BXDPlugIn>> blocked = {})
-        : token_(token), client_(std::move(client)), blocked_(std::move(blocked)) {}
+    // A new hold with a fresh random UUID over `plugIns` (a plug-in named twice is held once), placed now by
+    // `client`, which it refers to weakly. Opens one keep-alive unit until the hold is destroyed.
+    BXDPlugInHold(std::vector<std::shared_ptr<BXDPlugIn>> plugIns, std::weak_ptr<BXDZemClient> client);
+    ~BXDPlugInHold();
+    BXDPlugInHold(const BXDPlugInHold&) = delete;
+    BXDPlugInHold& operator=(const BXDPlugInHold&) = delete;
 
-    const Uuid& token() const { return token_; }
-    // The client that placed the hold, referred to weakly: a hold never keeps a dead client alive.
-    std::shared_ptr<BXDZemClient> client() const { return client_.lock(); }
-    bool belongsTo(const BXDZemClient* client) const { return client_.lock().get() == client || client_.expired(); }
+    // The hold's identity, handed to the client; two holds are the same hold when their UUIDs are equal.
+    const Uuid& uuid() const { return uuid_; }
+    const Date& created() const { return created_; }
+    // Whether `client` placed this hold. A hold whose client object is gone belongs to nobody: it stays until it
+    // is released by its UUID.
+    bool placedBy(const BXDZemClient* client) const;
 
     // The held plug-ins; no two with the same UUID.
     const std::vector<std::shared_ptr<BXDPlugIn>>& blocked() const { return blocked_; }
     // Whether the hold names the plug-in; records are the same plug-in exactly when their UUIDs are equal.
-    bool blocks(const BXDPlugIn& plugIn) const {
-        for (const std::shared_ptr<BXDPlugIn>& held : blocked_) {
-            if (held->uuid() == plugIn.uuid()) return true;
-        }
-        return false;
-    }
+    bool blocks(const BXDPlugIn& plugIn) const;
+
+    bool operator==(const BXDPlugInHold& other) const { return uuid_ == other.uuid_; }
+
+    // The keep-alive units open now: one per hold alive. While any is open the daemon must not end for being idle
+    // (bxd has no idle exit today; the count is logged with every change of the holds, so it can be checked).
+    static size_t openKeepAliveUnits() { return openUnits_.load(); }
 
   private:
-    Uuid token_;
+    static std::atomic<size_t> openUnits_;
+
+    Uuid uuid_;
+    Date created_;
     std::weak_ptr<BXDZemClient> client_;
     std::vector<std::shared_ptr<BXDPlugIn>> blocked_;
 };

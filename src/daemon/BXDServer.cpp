@@ -136,10 +136,48 @@ bool BXDServer::holdOnPlugIn(const BXDPlugIn& plugIn) {
     });
 }
 
-void BXDServer::unholdClient(const BXDZemClient* client) {
+void BXDServer::addHold(std::shared_ptr<BXDPlugInHold> hold) {
+    syncQueue_.sync([&] { holds_.push_back(std::move(hold)); });
+    log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
+    notifyAnnotationChange();
+}
+
+void BXDServer::unholdToken(const Uuid& uuid) {
+    // The released hold is destroyed (closing its keep-alive unit) after syncQueue is left.
+    std::shared_ptr<BXDPlugInHold> released;
     syncQueue_.sync([&] {
-        std::erase_if(holds_, [client](const std::shared_ptr<BXDPlugInHold>& hold) { return hold->belongsTo(client); });
+        auto found = std::find_if(holds_.begin(), holds_.end(),
+                                  [&](const std::shared_ptr<BXDPlugInHold>& hold) { return hold->uuid() == uuid; });
+        if (found == holds_.end()) return;
+        log::ops().debug("releasing plug-in hold %{public}@ at client's request", uuid.string());
+        released = std::move(*found);
+        holds_.erase(found);
     });
+    if (!released) return;
+    released.reset();
+    log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
+    notifyAnnotationChange();
+}
+
+void BXDServer::unholdClient(const BXDZemClient* client) {
+    std::vector<std::shared_ptr<BXDPlugInHold>> released;
+    const int pid = client != nullptr ? static_cast<int>(client->pid()) : 0;
+    syncQueue_.sync([&] {
+        for (auto hold = holds_.begin(); hold != holds_.end();) {
+            if (!(*hold)->placedBy(client)) {
+                ++hold;
+                continue;
+            }
+            log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", (*hold)->uuid().string(), pid);
+            released.push_back(std::move(*hold));
+            hold = holds_.erase(hold);
+        }
+    });
+    if (released.empty()) return;
+    size_t count = released.size();
+    released.clear();
+    log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
+    for (size_t i = 0; i < count; ++i) notifyAnnotationChange();
 }
 
 }  // namespace bexil

@@ -16,6 +16,7 @@
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
+#include "platform/wardend/ProcessAssertions.h"
 
 namespace bexil {
 
@@ -58,9 +59,20 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
                                std::function<void()> reply);
     // The service manager used for termination (tests point it at their own runtime directory).
     void setServiceManager(ServiceManager manager) { serviceManager_ = std::move(manager); }
-    // holdOnPlugIn: whether some hold names the plug-in. REQUIRES: not inside syncQueue.
+    // The process-assertion service that says which plug-ins are busy (tests point it at their own runtime
+    // directory).
+    const ProcessAssertions& processAssertions() const { return processAssertions_; }
+    void setProcessAssertions(ProcessAssertions assertions) { processAssertions_ = std::move(assertions); }
+
+    // Holds. Each runs its work synchronously on syncQueue, so REQUIRES: not inside syncQueue. Every change of the
+    // set of holds posts the annotation-change notification once, after leaving syncQueue.
+    // holdOnPlugIn: whether some hold names the plug-in.
     bool holdOnPlugIn(const BXDPlugIn& plugIn);
-    // Releases every hold that `client` placed. REQUIRES: not inside syncQueue.
+    // Appends `hold` to the holds.
+    void addHold(std::shared_ptr<BXDPlugInHold> hold);
+    // Releases the hold with that UUID, if there is one.
+    void unholdToken(const Uuid& uuid);
+    // Releases every hold that `client` placed (one notification per hold); holds whose client is gone stay.
     void unholdClient(const BXDZemClient* client);
 
     SerialQueue& zemQueue() { return zemQueue_; }
@@ -88,6 +100,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::unique_ptr<BXDUserPrefs> userPrefs_;
     unsigned verbose_ = 0;
     ServiceManager serviceManager_;
+    ProcessAssertions processAssertions_;
 };
 
 }  // namespace bexil

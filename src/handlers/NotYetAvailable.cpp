@@ -7,6 +7,5 @@ namespace bexil {
 
 void Transaction::readyPlugIns() { fail(ErrorCode::OperationFailed, "the \"ready\" operation is not available yet"); }
 void Transaction::accessPlugIns() { fail(ErrorCode::OperationFailed, "the \"access\" operation is not available yet"); }
-void Transaction::lockDownPlugIns() { fail(ErrorCode::OperationFailed, "the \"lock\" operation is not available yet"); }
 
 }  // namespace bexil

@@ -7,6 +7,7 @@
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDServer.h"
+#include "platform/notify/SystemNotifications.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {
@@ -28,11 +29,15 @@ class BXDServerHoldTest : public ::testing::Test {
     }
     void TearDown() override { server_.reset(); }
 
-    void place(std::vector<std::shared_ptr<BXDPlugIn>> plugIns) {
-        server_->syncQueue().sync([&] {
-            server_->holds().push_back(
-                std::make_shared<BXDPlugInHold>(Uuid::random(), std::weak_ptr<BXDZemClient>(), std::move(plugIns)));
-        });
+    // Places a hold whose client object is already gone, as the server sees one after its client was freed.
+    Uuid place(std::vector<std::shared_ptr<BXDPlugIn>> plugIns) {
+        auto hold = std::make_shared<BXDPlugInHold>(std::move(plugIns), std::weak_ptr<BXDZemClient>());
+        Uuid uuid = hold->uuid();
+        server_->addHold(std::move(hold));
+        return uuid;
+    }
+    uint64_t posted() const {
+        return SystemNotifications(root_ / "runtime" / "notify").state(protocol::kAnnotationChangeNotification);
     }
 
     test::DaemonDirs root_{"bxdserver-hold"};
@@ -40,27 +45,42 @@ class BXDServerHoldTest : public ::testing::Test {
     std::unique_ptr<BXDServer> server_;
 };
 
-// Guards holds (which keep plug-ins from being ended while an application updates): a hold names plug-ins by
-// UUID, so a record rebuilt for the same registry plug-in is held too; an empty hold (an application without
-// plug-ins) holds nothing, and a hold without a living client goes with the next release of dead clients' holds.
-TEST_F(BXDServerHoldTest, HoldsNamePlugInsByUuidAndGoWithTheirClient) {
+// Guards holds (which keep plug-ins out of use while an application changes): a hold names plug-ins by UUID, so a
+// record rebuilt for the same registry plug-in is held too; an empty hold (an application without plug-ins) holds
+// nothing; a hold whose client object is gone stays until it is released by its UUID; every change of the set of
+// holds posts the notification once, and an unknown UUID changes and posts nothing. Each hold keeps one keep-alive
+// unit open while it exists.
+TEST_F(BXDServerHoldTest, HoldsNamePlugInsByUuidAndEndOnlyWhenReleased) {
     Uuid helloUuid = Uuid::random();
     std::shared_ptr<BXDPlugIn> hello = record("hello", helloUuid);
     std::shared_ptr<BXDPlugIn> bonjour = record("bonjour", Uuid::random());
     std::shared_ptr<BXDPlugIn> night = record("night", Uuid::random());
     ASSERT_TRUE(hello && bonjour && night);
+    const size_t unitsBefore = BXDPlugInHold::openKeepAliveUnits();
+    const uint64_t before = posted();
     EXPECT_FALSE(server_->holdOnPlugIn(*hello));
-    place({});
+    Uuid empty = place({});
     EXPECT_FALSE(server_->holdOnPlugIn(*hello));
 
     place({bonjour});
-    place({night, hello});
+    Uuid both = place({night, hello, record("hello", helloUuid)});
+    EXPECT_EQ(posted(), before + 3);
+    EXPECT_EQ(BXDPlugInHold::openKeepAliveUnits(), unitsBefore + 3);
     EXPECT_TRUE(server_->holdOnPlugIn(*hello)) << "found in a later hold";
     EXPECT_TRUE(server_->holdOnPlugIn(*record("hello", helloUuid)));
     EXPECT_FALSE(server_->holdOnPlugIn(*record("other", Uuid::random())));
 
     server_->unholdClient(nullptr);
+    EXPECT_TRUE(server_->holdOnPlugIn(*hello)) << "a hold whose client is gone belongs to nobody";
+    server_->unholdToken(Uuid::random());
+    EXPECT_EQ(posted(), before + 3) << "nothing released, nothing posted";
+
+    server_->unholdToken(both);
     EXPECT_FALSE(server_->holdOnPlugIn(*hello));
+    EXPECT_TRUE(server_->holdOnPlugIn(*bonjour));
+    server_->unholdToken(empty);
+    EXPECT_EQ(posted(), before + 5);
+    EXPECT_EQ(BXDPlugInHold::openKeepAliveUnits(), unitsBefore + 1);
 }
 
 }  // namespace

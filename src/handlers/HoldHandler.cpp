@@ -1,0 +1,105 @@
+// The "lock" request: places a hold over plug-ins (named by their bundles, or as all plug-ins of applications),
+// optionally refusing busy ones and terminating running instances afterwards, or releases holds by UUID. A hold is
+// in force from the moment it is added, so with termination the reply comes later, from the termination waiter,
+// while the request queue goes on with other requests.
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "bexil/Protocol.h"
+#include "daemon/BXDPlugInHold.h"
+#include "daemon/BXDServer.h"
+#include "daemon/BXDZemClient.h"
+#include "daemon/Transaction.h"
+#include "platform/log/Log.h"
+
+namespace bexil {
+
+namespace {
+
+namespace hold = protocol::hold;
+
+// The plug-ins as a list of their UUIDs, for the log.
+std::string uuidList(const std::vector<std::shared_ptr<BXDPlugIn>>& plugIns) {
+    std::string text = "(";
+    for (const std::shared_ptr<BXDPlugIn>& plugIn : plugIns) {
+        if (text.size() > 1) text += ", ";
+        text += plugIn->uuid() ? plugIn->uuid()->string() : std::string("(no uuid)");
+    }
+    return text + ")";
+}
+
+}  // namespace
+
+void Transaction::lockDownPlugIns() {
+    // The release form: every UUID is released in turn; unknown ones, and elements that are not UUIDs, are passed
+    // over, so that a client can always release what it holds without first asking what still exists.
+    if (std::optional<Value> uuids = zem_dictionary_get_array(request(), protocol::key::kUuids)) {
+        for (const Value& element : uuids->items()) {
+            if (const Uuid* uuid = element.getUuid()) server()->unholdToken(*uuid);
+        }
+        done();
+        return;
+    }
+
+    const uint64_t flags = request().get(protocol::key::kFlags).numberAsUInt64().value_or(0);
+    std::vector<std::shared_ptr<BXDPlugIn>> plugIns;
+    bool walked = marshalPaths([&](const std::string& path, bool resolved) {
+        if (!resolved) {
+            fail(ErrorCode::BadPath, formatPrintf("invalid path: %@", path));
+            return false;
+        }
+        if (flags & hold::kPlugInPaths) {
+            std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugInAtPath(path);
+            if (!plugIn) {
+                fail(ErrorCode::BadPath, formatPrintf("no plug-in at path:%@", path));
+                return false;
+            }
+            plugIns.push_back(std::move(plugIn));
+        } else if (auto within = server()->plugInsWithinApplication(path)) {
+            plugIns.insert(plugIns.end(), within->begin(), within->end());
+        }
+        return true;
+    });
+    if (!walked) return;
+    log::ops().info("processing hold request for plug-ins:%@", uuidList(plugIns));
+
+    if (flags & hold::kRefuseBusy) {
+        std::vector<std::shared_ptr<BXDPlugIn>> busy;
+        MutableArray conflicts;
+        for (const std::shared_ptr<BXDPlugIn>& plugIn : plugIns) {
+            if (std::optional<Value> conflict = plugIn->checkBusy(server()->processAssertions())) {
+                busy.push_back(plugIn);
+                conflicts.append(std::move(*conflict));
+            }
+        }
+        if (!busy.empty()) {
+            log::ops().debug("hold refused. Busy plug-ins:%@", uuidList(busy));
+            reply().set(protocol::key::kConflicts, conflicts.take());
+            fail(ErrorCode::PlugInsBusy, "plug-ins are busy");
+            return;
+        }
+    }
+
+    auto placed = std::make_shared<BXDPlugInHold>(plugIns, client());
+    const std::string uuid = placed->uuid().string();
+    server()->addHold(placed);
+    reply().set(protocol::key::kUuids, Value::uuid(placed->uuid()));
+
+    if (!(flags & hold::kTerminate)) {
+        log::ops().info("hold request granted uuid:%{public}@", uuid);
+        done();
+        return;
+    }
+    std::vector<std::shared_ptr<const LXBexilProxy>> records;
+    for (const std::shared_ptr<BXDPlugIn>& plugIn : plugIns)
+        if (plugIn->lxproxy()) records.push_back(plugIn->lxproxy());
+    // The transaction stays alive in the callback until the answer has gone out.
+    server()->terminatePlugInsReply(records, [self = shared_from_this(), uuid] {
+        log::ops().info("forced termination complete; hold request granted uuid:%{public}@", uuid);
+        self->done();
+    });
+}
+
+}  // namespace bexil

@@ -1,0 +1,170 @@
+// The "lock" request through the real daemon: holds keep plug-ins out of discovery until they are released by UUID
+// or their client's connection ends; path problems and busy plug-ins refuse the hold; the terminate flag answers
+// once the held plug-ins' instances have ended. Every change of the set of holds is announced once. The server's
+// own bookkeeping (plug-in identity by UUID, holds of clients already gone) is BXDServerHoldTest's.
+
+#include <gtest/gtest.h>
+
+#include "ChildProcess.h"
+#include "E2eSupport.h"
+#include "platform/notify/SystemNotifications.h"
+#include "platform/runtime/InstanceRecords.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace test;
+
+const std::string kHello = "com.example.greeter.hello";
+const std::string kBonjour = "com.example.greeter.bonjour";
+
+Value lockRequest(const std::vector<std::string>& paths, uint64_t flags) {
+    MutableDictionary message(pathsRequest("lock", paths));
+    message.set("flags", Value::uint64(flags));
+    return message.take();
+}
+Value releaseRequest(const std::vector<Value>& uuids) {
+    return request("lock", {{"uuids", Value::array(std::vector<Value>(uuids))}});
+}
+
+class HoldTest : public DaemonTest {
+  protected:
+    void SetUp() override {
+        copyExamples({"Greeter.app", "Notes.app"});
+        ASSERT_TRUE(start()) << bxd_.log();
+        add({hello(), bonjour()});
+    }
+    void TearDown() override {
+        for (pid_t pid : sleepers_) {
+            kill(pid, SIGKILL);
+            waitpid(pid, nullptr, 0);
+        }
+    }
+    std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
+    std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
+    bool discovered(const std::string& identifier) const {
+        return !identifiers(succeed(matchRequest(identifierRule(identifier)))).empty();
+    }
+    uint64_t posted() const {
+        return SystemNotifications(bxd_.root() / "runtime" / "notify").state("com.quorvel.bexil.annotation-change");
+    }
+    // A live process recorded as an instance of `bundleIdentifier` of the given kind.
+    pid_t recordInstance(InstanceRecords::Kind kind, const std::string& bundleIdentifier) {
+        pid_t pid = startSleeper();
+        sleepers_.push_back(pid);
+        EXPECT_TRUE(InstanceRecords(kind, bxd_.root() / "runtime").record(bundleIdentifier, pid));
+        return pid;
+    }
+
+    // Holds last as long as the connection of the client that placed them: the requests that place them go through
+    // this one client, which lives for the whole test.
+    Value hold(const Value& message) {
+        if (!holder_) holder_ = std::make_unique<TestClient>();
+        Value reply = holder_->replyTo(message);
+        EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+        return reply;
+    }
+
+    std::vector<pid_t> sleepers_;
+    std::unique_ptr<TestClient> holder_;
+};
+
+// Guards the two forms: a hold on an application holds its plug-ins (left out of discovery) and answers one UUID
+// value; a release by that UUID brings them back; an unknown UUID, or an element that is no UUID, is passed over;
+// "uuids" beside "paths" is a release and places nothing. One notification per change, none for no change.
+TEST_F(HoldTest, AHoldKeepsPlugInsOutOfDiscoveryUntilItsUuidIsReleased) {
+    ASSERT_TRUE(discovered(kHello) && discovered(kBonjour));
+    const uint64_t before = posted();
+    Value granted = hold(lockRequest({plugIn("Greeter.app")}, 0));
+    const Value* uuid = granted.find("uuids");
+    ASSERT_TRUE(uuid && uuid->isUuid()) << granted.description();
+    EXPECT_FALSE(discovered(kHello) || discovered(kBonjour));
+    EXPECT_EQ(posted(), before + 1);
+    expectLog("processing hold request for plug-ins:");
+    expectLog("hold request granted uuid:" + uuid->getUuid()->string());
+
+    succeed(releaseRequest({Value::uuid(Uuid::random()), Value::string("not a uuid")}));
+    EXPECT_EQ(posted(), before + 1) << "nothing released, nothing announced";
+    EXPECT_FALSE(discovered(kHello));
+
+    MutableDictionary both(lockRequest({hello()}, 0x1));
+    both.set("uuids", Value::array({*uuid}));
+    succeed(both.take());
+    EXPECT_TRUE(discovered(kHello) && discovered(kBonjour)) << "released, and no new hold from the paths";
+    EXPECT_EQ(posted(), before + 2);
+    expectLog("releasing plug-in hold " + uuid->getUuid()->string() + " at client's request");
+
+    // An application without plug-ins is held, and holds nothing.
+    fs::create_directories(bxd_.root() / "Empty.app");
+    EXPECT_TRUE(hold(lockRequest({(bxd_.root() / "Empty.app").string()}, 0)).find("uuids"));
+    EXPECT_TRUE(discovered(kHello));
+}
+
+// Guards the path walk of the hold form: each problem answers its code and text and places no hold.
+TEST_F(HoldTest, PathProblemsRefuseTheHold) {
+    const uint64_t before = posted();
+    expectFailure(lockRequest({"Greeter.app"}, 0), 9, "absolute path required: Greeter.app");
+    std::string missing = plugIn("Missing.app");
+    expectFailure(lockRequest({missing}, 0), 9, "invalid path: " + missing);
+    expectFailure(lockRequest({hello(), plugIn("Greeter.app")}, 0x1), 9, "no plug-in at path:" + plugIn("Greeter.app"));
+    expectFailure(request("lock", {{"flags", Value::uint64(0)}}), 4, "invalid request format");
+    EXPECT_TRUE(discovered(kHello)) << "the walk stopped: no hold over the paths before the bad one";
+    EXPECT_EQ(posted(), before);
+}
+
+// Guards refusing busy plug-ins: with 0x2, each busy plug-in adds its description to "conflicts", in the order of
+// the plug-ins, and no hold is placed; without 0x2 busy plug-ins are held like any other.
+TEST_F(HoldTest, BusyPlugInsRefuseTheHoldWithTheirConflicts) {
+    recordInstance(InstanceRecords::Kind::Assertion, kBonjour);
+    recordInstance(InstanceRecords::Kind::Assertion, kHello);
+    const uint64_t before = posted();
+    Value refused = TestClient().replyTo(lockRequest({hello(), bonjour()}, 0x1 | 0x2));
+    EXPECT_EQ(errorCode(refused), 14);
+    EXPECT_EQ(errorText(refused), "plug-ins are busy");
+    const Value conflicts = refused.get("conflicts");
+    ASSERT_EQ(conflicts.count(), 2u) << refused.description();
+    EXPECT_EQ(conflicts.items()[0].get("ExtensionBundleIdentifier").stringView(), kHello);
+    EXPECT_EQ(conflicts.items()[1].get("ExtensionBundleIdentifier").stringView(), kBonjour);
+    expectLog("hold refused. Busy plug-ins:");
+    EXPECT_TRUE(discovered(kHello) && discovered(kBonjour));
+    EXPECT_EQ(posted(), before);
+
+    hold(lockRequest({hello()}, 0x1));
+    EXPECT_FALSE(discovered(kHello));
+}
+
+// Guards the end of a client: every hold it placed is released when its connection ends, each announced.
+TEST_F(HoldTest, TheHoldsOfAClientGoWithItsConnection) {
+    const uint64_t before = posted();
+    {
+        TestClient placer;
+        ASSERT_EQ(errorCode(placer.replyTo(lockRequest({hello()}, 0x1))), 0);
+        ASSERT_EQ(errorCode(placer.replyTo(lockRequest({bonjour()}, 0x1))), 0);
+        EXPECT_FALSE(discovered(kHello) || discovered(kBonjour));
+    }
+    expectLog("for dead client pid " + std::to_string(getpid()));
+    for (int i = 0; i < 500 && posted() < before + 4; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_EQ(posted(), before + 4) << "two holds placed, two released";
+    EXPECT_EQ(bxd_.countInLog("for dead client pid"), 2u);
+    EXPECT_TRUE(discovered(kHello) && discovered(kBonjour));
+}
+
+// Guards the terminate flag: the hold is in force at once and the answer comes when the held plug-in's running
+// instance has ended; another plug-in's instance runs on.
+TEST_F(HoldTest, TerminateAnswersOnceTheHeldInstancesHaveEnded) {
+    pid_t helloPid = recordInstance(InstanceRecords::Kind::Running, kHello);
+    pid_t bonjourPid = recordInstance(InstanceRecords::Kind::Running, kBonjour);
+    Value granted = hold(lockRequest({hello()}, 0x1 | 0x4));
+    ASSERT_TRUE(granted.find("uuids"));
+    int status = 0;
+    ASSERT_EQ(waitpid(helloPid, &status, WNOHANG), helloPid) << "answered before the instance ended";
+    std::erase(sleepers_, helloPid);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGTERM);
+    EXPECT_EQ(waitpid(bonjourPid, &status, WNOHANG), 0);
+    expectLog("forced termination complete; hold request granted uuid:" + granted.get("uuids").getUuid()->string());
+    EXPECT_FALSE(discovered(kHello));
+}
+
+}  // namespace
+}  // namespace bexil
