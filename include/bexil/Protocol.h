@@ -79,8 +79,9 @@ inline constexpr std::string_view kErrorCode = "errorcode";      // uint64, in a
 inline constexpr std::string_view kError = "error";              // string, in a failed reply
 inline constexpr std::string_view kMatches = "matches";          // array of plug-in forms, in a "match" reply
 inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
-inline constexpr std::array kList{kRequest,     kVersion,   kPaths, kUuids,   kFlags,    kRules,
-                                  kAnnotations, kErrorCode, kError, kMatches, kConflicts};
+inline constexpr std::string_view kExtensions = "extensions";    // array of tokens, in an "access" reply
+inline constexpr std::array kList{kRequest,     kVersion,   kPaths, kUuids,   kFlags,     kRules,
+                                  kAnnotations, kErrorCode, kError, kMatches, kConflicts, kExtensions};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

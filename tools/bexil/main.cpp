@@ -155,7 +155,9 @@ int printExtensions(const Options& options, BXDaemonClient&, const Value& messag
         std::printf("%s\n", toJson(message).c_str());
         return 0;
     }
-    for (const Value& token : message.get("extensions").items()) std::printf("%s\n", token.description().c_str());
+    // One token per line, as it is, so that a script can hand it on.
+    for (const Value& token : message.get(protocol::key::kExtensions).items())
+        std::printf("%s\n", token.isString() ? std::string(token.stringView()).c_str() : token.description().c_str());
     return 0;
 }
 
