@@ -11,6 +11,7 @@
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDZemClient.h"
 #include "platform/codesign/EntitlementsDirectory.h"
+#include "platform/ksn/ConsentStore.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
 #include "platform/zem/ZemConnection.h"
@@ -29,7 +30,8 @@ BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
       loop_(loop),
       zemQueue_("zem", loop),
       mainQueue_("service", loop),
-      syncQueue_("serverSync") {}
+      syncQueue_("serverSync"),
+      consent_(std::make_shared<ConsentStore>()) {}
 
 BXDServer::~BXDServer() {
     if (service_) service_->cancel();

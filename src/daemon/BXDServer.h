@@ -16,6 +16,7 @@
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
+#include "platform/ksn/PrivacyConsent.h"
 #include "platform/wardend/ProcessAssertions.h"
 
 namespace bexil {
@@ -57,8 +58,13 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // of this call, after every request has been answered. Returns at once.
     void terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
                                std::function<void()> reply);
-    // The service manager used for termination (tests point it at their own runtime directory).
+    // The service manager that keeps hosts' grants and terminates instances (tests point it at their own runtime
+    // directory).
+    ServiceManager& serviceManager() { return serviceManager_; }
     void setServiceManager(ServiceManager manager) { serviceManager_ = std::move(manager); }
+    // The user's privacy-consent answers, read when a plug-in is enabled.
+    const PrivacyConsent& privacyConsent() const { return *consent_; }
+    void setPrivacyConsent(std::shared_ptr<const PrivacyConsent> consent) { consent_ = std::move(consent); }
     // The process-assertion service that says which plug-ins are busy (tests point it at their own runtime
     // directory).
     const ProcessAssertions& processAssertions() const { return processAssertions_; }
@@ -101,6 +107,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     unsigned verbose_ = 0;
     ServiceManager serviceManager_;
     ProcessAssertions processAssertions_;
+    std::shared_ptr<const PrivacyConsent> consent_;
 };
 
 }  // namespace bexil

@@ -49,9 +49,9 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     std::shared_ptr<ZemConnection> connection() const { return connection_.lock(); }
     BXDServer* server() const { return server_; }
     // The peer's pid, read from the connection every time; 0 once the connection no longer exists.
-    pid_t pid() const;
+    pid_t pid() const override;
     // The peer's executable path; empty when it could not be found.
-    const std::string& path() const { return path_; }
+    const std::string& path() const override { return path_; }
     // The bundle that contains the peer's executable; null when there is none.
     const std::shared_ptr<BXBundle>& bundle() const { return bundle_; }
     bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }

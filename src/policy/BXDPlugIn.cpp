@@ -3,10 +3,13 @@
 #include <cerrno>
 #include <cmath>
 #include <cstdint>
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <limits>
 
 #include "bexil/Protocol.h"
+#include "model/BXBundle.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
@@ -36,6 +39,31 @@ int32_t secondsAsInt32(double seconds) {
 }
 
 Error misconfigured(std::string_view message) { return BXError(ErrorCode::InvalidConfiguration, message); }
+
+constexpr std::string_view kExtensionPointKey = "RZExtensionPointIdentifier";
+constexpr std::string_view kServiceKey = "ZEMService";
+constexpr std::string_view kEnvironmentKey = "EnvironmentVariables";
+constexpr std::string_view kSandboxProfileKey = "_SandboxProfile";
+constexpr std::string_view kOmitSandboxParametersKey = "_OmitSandboxParameters";
+constexpr std::string_view kPackageTypeKey = "BDBundlePackageType";
+constexpr std::string_view kRequestsOpenAccessKey = "RequestsOpenAccess";
+constexpr std::string_view kTestSdkVariable = "BXTEST_SDK";
+
+// The sandbox profile of each extension point with a profile of its own, tested in order; every other point (or
+// none) runs under kDefaultProfile. The typepad point's profile also depends on open access and consent.
+constexpr std::string_view kTypepadPoint = "com.quorvel.typepad-service";
+constexpr std::string_view kTypepadProfile = "typepad";
+constexpr std::string_view kDefaultProfile = "plugin";
+struct PointProfile {
+    std::string_view point;
+    std::string_view profile;
+};
+constexpr PointProfile kPointProfiles[] = {
+    {"com.quorvel.netguard.filter-data", "netguard-filter"},
+    {"com.quorvel.peekview.extension.preview", "peekviewd"},
+    {"com.quorvel.app.non-ui-extension", "sketchpad-devtools"},
+    {"com.quorvel.app.non-ui-extension.multiple-instances", "sketchpad-devtools"},
+};
 
 }  // namespace
 
@@ -167,6 +195,98 @@ Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
         }
     }
     return result.take();
+}
+
+// ---- Enabling for a host ----
+
+std::string BXDPlugIn::sandboxProfile(const PrivacyConsent& consent) const {
+    std::optional<Value> typepadPoint = pluginKey(kExtensionPointKey);
+    if (typepadPoint && *typepadPoint == Value::string(std::string(kTypepadPoint))) {
+        std::optional<Value> openAccess = attribute(kRequestsOpenAccessKey);
+        if (openAccess && openAccess->isBool() && openAccess->getBool() == true &&
+            BXHostAccessPolicy::allowedKSNServices(*this, consent).count(std::string(kKSNServiceTypepadNetwork)) != 0)
+            return std::string(kDefaultProfile);
+        return std::string(kTypepadProfile);
+    }
+    if (std::optional<Value> dictionary = plugInDictionary()) {
+        const Value* point = dictionary->find(kExtensionPointKey);
+        const std::string* name = point != nullptr ? point->getString() : nullptr;
+        if (name != nullptr)
+            for (const PointProfile& entry : kPointProfiles)
+                if (*name == entry.point) return std::string(entry.profile);
+    }
+    return std::string(kDefaultProfile);
+}
+
+std::optional<Error> BXDPlugIn::enableForClient(const HostAccessClient& client,
+                                                const BXEnableServices& services) const {
+    std::string uuidText = uuid() ? uuid()->string() : std::string();
+    std::optional<std::string> identifier = this->identifier();
+    std::optional<Value> version = this->version();
+
+    MutableDictionary environment;
+    std::optional<std::string> container = lxproxy_ ? lxproxy_->dataContainerURL() : std::nullopt;
+    if (container) {
+        environment.set("HOME", Value::string(*container));
+        environment.set("BDFIXED_USER_HOME", Value::string(*container));
+        environment.set("TMPDIR", Value::string((std::filesystem::path(*container) / "tmp").string()));
+    } else {
+        log::ops().debug("no data container for plug-in %@(%@) %{public}@ at %@", identifier, version, uuidText,
+                         path());
+    }
+
+    std::string profile = sandboxProfile(services.consent);
+
+    if (const char* sdk = std::getenv(kTestSdkVariable.data())) environment.set(kTestSdkVariable, Value::string(sdk));
+
+    MutableDictionary serviceDescription;
+    std::optional<Value> service = infoKey(kServiceKey);
+    if (service && service->isDictionary()) {
+        log::lx().debug("raw ZEMService=%@", *service);
+        for (const auto& [key, value] : service->entries()) serviceDescription.set(key, value);
+    } else {
+        log::ops().info("no ZEMService for plug-in; database returned %@", service);
+    }
+
+    // The plug-in's own variables win over the daemon's; an entry that is not a dictionary cannot be merged and is
+    // left out, so the daemon's variables stand alone.
+    if (const Value* own = serviceDescription.find(kEnvironmentKey); own != nullptr && own->isDictionary())
+        for (const auto& [name, value] : own->entries()) environment.set(name, value);
+    serviceDescription.set(kEnvironmentKey, environment.take());
+    serviceDescription.set(kSandboxProfileKey, Value::string(profile));
+    serviceDescription.set(kOmitSandboxParametersKey, Value::boolean(true));
+
+    log::ops().info("assigning plug-in %@(%@) %{public}@ to %s sandbox", identifier, version, uuidText,
+                    profile.c_str());
+
+    MutableDictionary overlay;
+    overlay.set(kServiceKey, serviceDescription.take());
+    overlay.set(kPackageTypeKey, Value::string(std::string(kServicePackageType)));
+    Value activation = overlay.take();
+
+    log::ops().notice("allowing host %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", static_cast<int>(client.pid()),
+                      client.path(), identifier, version, uuidText, url());
+
+    std::shared_ptr<BXBundle> bundle = url() ? BXBundle::initWithURL(*url()) : nullptr;
+    std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
+    // A bundle whose executable is missing answers with its own directory, which no service manager can start.
+    std::error_code ec;
+    if (executable && !std::filesystem::is_regular_file(*executable, ec)) executable.reset();
+    if (!executable) {
+        log::ops().error("failed to obtain execPath for plug-in %@(%{public}@) bundle=%@", description(), uuidText,
+                         bundle ? bundle->description() : std::string("(null)"));
+        return BXError(ErrorCode::OperationFailed,
+                       formatPrintf("cannot obtain executable path for plug-in %@(%@)", identifier, uuidText));
+    }
+
+    log::ops().debug("activation overlay=%@", activation);
+    if (int error = services.serviceManager.addExternalService(client.pid(), *executable, activation); error != 0) {
+        log::ops().error("jobard error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", error,
+                         static_cast<int>(client.pid()), client.path(), identifier, version, uuidText, path());
+        return BXError(ErrorCode::OperationFailed,
+                       formatPrintf("unable to enable plug-in %@(%@)", identifier, uuidText));
+    }
+    return std::nullopt;
 }
 
 // ---- Entitlements and annotations ----

@@ -14,6 +14,8 @@
 #include "base/Error.h"
 #include "base/Value.h"
 #include "model/BXPlugInCore.h"
+#include "platform/jobard/ServiceManager.h"
+#include "platform/ksn/PrivacyConsent.h"
 #include "platform/wardend/ProcessAssertions.h"
 #include "policy/BXMatchRules.h"
 #include "policy/HostAccessClient.h"
@@ -21,6 +23,13 @@
 namespace bexil {
 
 class LXBexilProxy;
+
+// What enabling a plug-in uses besides the host: the service manager that keeps the grant, and the user's privacy
+// consent (which chooses the sandbox of typepad plug-ins). Both outlive the call.
+struct BXEnableServices {
+    ServiceManager& serviceManager;
+    const PrivacyConsent& consent;
+};
 
 class BXDPlugIn : public BXPlugInCore {
   public:
@@ -58,6 +67,20 @@ class BXDPlugIn : public BXPlugInCore {
     // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
     // is one string or an array; other elements are passed over; paths that get no token are left out (logged).
     Value issueResourceExtensions(const Value& paths) const;
+
+    // The privacy-consent service that lets a typepad plug-in that asks for open access run in the ordinary
+    // plug-in sandbox, which may reach the network.
+    static constexpr std::string_view kKSNServiceTypepadNetwork = "typepad-network";
+    // The package type the service manager expects in an activation overlay.
+    static constexpr std::string_view kServicePackageType = "ZEM!";
+
+    // The sandbox profile the plug-in runs under: by its extension point, and for a typepad plug-in by whether it
+    // asks for open access and the user granted its application the typepad network.
+    std::string sandboxProfile(const PrivacyConsent& consent) const;
+    // enableForClient: builds the plug-in's service description (its "ZEMService", the environment of its data
+    // container, the sandbox profile) and grants `client` the right to start its executable with it. Errors have
+    // code 4. Keeps nothing in the record; calling it again repeats the grant.
+    std::optional<Error> enableForClient(const HostAccessClient& client, const BXEnableServices& services) const;
 
     // The value of `key` in the plug-in's entitlements, or none.
     std::optional<Value> valueForEntitlement(std::string_view key) const;

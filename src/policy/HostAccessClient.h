@@ -1,9 +1,12 @@
 #pragma once
 
-// HostAccessClient is what the host access policy needs to know of a connected host: its entitlements. The daemon's
-// client object implements it; tests substitute their own. Implementations must be usable from the queue that
-// runs the request.
+// HostAccessClient is what the host access policy and enabling need to know of a connected host: its process, its
+// executable and its entitlements. The daemon's client object implements it; tests substitute their own.
+// Implementations must be usable from the queue that runs the request.
 
+#include <sys/types.h>
+
+#include <string>
 #include <string_view>
 
 #include "base/Value.h"
@@ -17,6 +20,10 @@ class HostAccessClient {
     virtual Value entitlementValueForKey(std::string_view key) const = 0;
     // Whether the host holds the entitlement: it has a value and that value is not equal to false (nor to 0).
     virtual bool hasEntitlement(std::string_view key) const = 0;
+    // The host's process id; 0 once it is unknown.
+    virtual pid_t pid() const = 0;
+    // The host's executable path; empty when it could not be found.
+    virtual const std::string& path() const = 0;
 };
 
 }  // namespace bexil

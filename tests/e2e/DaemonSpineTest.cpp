@@ -199,7 +199,7 @@ TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
 
     expectFailure(Value::dictionary({{"version", Value::uint64(3)}}), 4, "invalid request format (missing type)");
     for (const char* name : {"Add", ""}) expectFailure(request(name), 4, "unrecognized request");
-    expectFailure(request("ready"), 4, "the \"ready\" operation is not available yet");
+    expectFailure(request("ready"), 4, "invalid request format (uuid)");
 }
 
 // Guards the worked example of docs/protocol.md as a client written from it would meet it: its request frame, sent

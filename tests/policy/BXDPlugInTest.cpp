@@ -1,10 +1,13 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/wait.h>
 
 #include <filesystem>
 #include <fstream>
 
 #include "TestSupport.h"
+#include "base/Document.h"
+#include "platform/ksn/ConsentStore.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/CaptureSink.h"
@@ -285,6 +288,185 @@ TEST_F(BXDPlugInExtensionsTest, ApplicationExtensionGetsOneTokenForItsWholeBundl
     Value extensions = form.value().get("extensions");
     ASSERT_EQ(extensions.count(), 1u);
     EXPECT_EQ(grantedPath(extensions.get(".")), *plugIn->url());
+}
+
+// ---- Enabling for a host ----
+
+// The calling process plays the host; its grant is read back from the service manager, which keeps what enabling
+// handed it.
+class BXDPlugInEnableTest : public ::testing::Test {
+  protected:
+    class Host : public HostAccessClient {
+      public:
+        Value entitlementValueForKey(std::string_view) const override { return Value::null(); }
+        bool hasEntitlement(std::string_view) const override { return false; }
+        pid_t pid() const override { return pid_; }
+        const std::string& path() const override { return path_; }
+        pid_t pid_ = getpid();
+        std::string path_ = "/usr/bin/host";
+    };
+
+    void SetUp() override {
+        unsetenv("BXTEST_SDK");
+        std::filesystem::create_directories(app() / "PlugIns/Keys.bxplugin");
+        ASSERT_FALSE(Document::writeFileAtomically(app() / "Info.vrec",
+                                                   dict({{"BDBundleIdentifier", str("com.example.greeter")}})));
+        ASSERT_FALSE(Document::writeFileAtomically(
+            bundle() / "Info.vrec",
+            dict({{"BDBundleIdentifier", str("com.example.greeter.keys")}, {"BDBundleExecutable", str("keys")}})));
+        std::ofstream(bundle() / "keys") << "#!/bin/sh\n";
+    }
+    void TearDown() override { unsetenv("BXTEST_SDK"); }
+
+    std::filesystem::path app() const { return dir_.path() / "Greeter.app"; }
+    std::filesystem::path bundle() const { return app() / "PlugIns/Keys.bxplugin"; }
+    std::string executable() const { return (bundle() / "keys").string(); }
+
+    // A code-carrying plug-in of `point` whose information dictionary adds `info`.
+    std::shared_ptr<BXDPlugIn> plugIn(const std::string& point, Entries info = {}, Entries attributes = {}) {
+        auto fields = helloFields();
+        fields.bundleURL = bundle().string();
+        LXApplicationProxy::Fields appFields;
+        appFields.bundleURL = app().string();
+        fields.containingBundle = std::make_shared<LXApplicationProxy>(appFields, LXApplicationProxy::PlugInList{});
+        MutableDictionary attributeEntries(dict({{"RZExtensionVersion", str("1.2")}}));
+        for (const auto& [key, value] : attributes) attributeEntries.set(key, value);
+        MutableDictionary entries(helloInfo(plugInDictionary(
+            {{"RZExtensionPointIdentifier", str(point)}, {"RZExtensionAttributes", attributeEntries.take()}})));
+        for (const auto& [key, value] : info) entries.set(key, value);
+        fields.infoVrec = entries.take();
+        std::shared_ptr<BXDPlugIn> record = build(fields);
+        // A plug-in that carries code is refused without a container when it is built, so a record that lost its
+        // container is made by swapping in a registry record without one.
+        if (record && !withContainer_) {
+            fields.dataContainerURL.reset();
+            record->setLxproxy(std::make_shared<LXBexilProxy>(std::move(fields)));
+        }
+        return record;
+    }
+
+    // Enables `p` for the host; the overlay the service manager was given, or the error.
+    Result<Value> enable(const BXDPlugIn& p) {
+        if (std::optional<Error> error = p.enableForClient(host_, {manager_, consent_})) return *error;
+        std::optional<Value> overlay = manager_.grantedOverlay(host_.pid(), executable());
+        if (!overlay) return BXError(ErrorCode::OperationFailed, "no grant recorded");
+        return *overlay;
+    }
+    Value description(const BXDPlugIn& p) {
+        Result<Value> overlay = enable(p);
+        EXPECT_TRUE(overlay) << overlay.error().description();
+        return overlay ? overlay->get("ZEMService") : Value::null();
+    }
+
+    test::TempDir dir_{"bxdplugin-enable"};
+    test::TempDir runtime_{"bxdplugin-enable-runtime"};
+    Host host_;
+    bool withContainer_ = true;
+    ServiceManager manager_{InstanceRecords(InstanceRecords::Kind::Running, runtime_.path())};
+    ConsentStore consent_{dir_.path() / "consent.vrec"};
+};
+
+// The overlay holds the bundle's service dictionary with the daemon's three keys and the package type; the
+// environment starts from the data container, the plug-in's own variables win, BXTEST_SDK is passed on.
+TEST_F(BXDPlugInEnableTest, DescriptionMergesTheBundlesServiceOverTheDaemonsEnvironment) {
+    setenv("BXTEST_SDK", "/opt/sdk-under-test", 1);
+    auto p = plugIn(
+        "com.example.greeting",
+        {{"ZEMService", dict({{"RunLoopType", str("main")},
+                              {"EnvironmentVariables", dict({{"HOME", str("/own/home")}, {"LANG", str("C")}})}})}});
+    ASSERT_NE(p, nullptr);
+    log::CaptureSink capture;
+    Result<Value> overlay = enable(*p);
+    ASSERT_TRUE(overlay) << overlay.error().description();
+    const std::string container = "/var/lib/bexil/containers/com.example.greeter.hello";
+    EXPECT_EQ(*overlay,
+              dict({{"ZEMService", dict({{"RunLoopType", str("main")},
+                                         {"EnvironmentVariables", dict({{"HOME", str("/own/home")},
+                                                                        {"BDFIXED_USER_HOME", str(container)},
+                                                                        {"TMPDIR", str(container + "/tmp")},
+                                                                        {"BXTEST_SDK", str("/opt/sdk-under-test")},
+                                                                        {"LANG", str("C")}})},
+                                         {"_SandboxProfile", str("plugin")},
+                                         {"_OmitSandboxParameters", Value::boolean(true)}})},
+                    {"BDBundlePackageType", str("ZEM!")}}));
+    EXPECT_TRUE(capture.contains("assigning plug-in com.example.greeter.hello(1.2) " + kHelloUuid.string() +
+                                 " to plugin sandbox"));
+    EXPECT_TRUE(capture.contains("allowing host " + std::to_string(getpid()) +
+                                 " /usr/bin/host to use plug-in "
+                                 "com.example.greeter.hello(1.2) uuid=" +
+                                 kHelloUuid.string() + " at " + bundle().string()));
+    // Enabling again replaces the grant rather than adding one.
+    ASSERT_TRUE(enable(*p));
+    EXPECT_EQ(manager_.grantCount(), 1u);
+}
+
+// Without a data container or a service dictionary the description still carries an (empty) environment; an
+// "EnvironmentVariables" that is not a dictionary is left out of the merge instead of replacing the daemon's.
+TEST_F(BXDPlugInEnableTest, MissingOrMalformedPartsLeaveTheDaemonsKeysStanding) {
+    withContainer_ = false;
+    auto noContainer = plugIn("com.example.greeting");
+    ASSERT_NE(noContainer, nullptr);
+    withContainer_ = true;
+    log::CaptureSink capture;
+    EXPECT_EQ(description(*noContainer), dict({{"EnvironmentVariables", Value::emptyDictionary()},
+                                               {"_SandboxProfile", str("plugin")},
+                                               {"_OmitSandboxParameters", Value::boolean(true)}}));
+    EXPECT_TRUE(capture.contains("no ZEMService for plug-in; database returned (null)"));
+
+    auto malformed = plugIn("com.example.greeting", {{"ZEMService", dict({{"EnvironmentVariables", str("X=1")}})}});
+    ASSERT_NE(malformed, nullptr);
+    Value environment = description(*malformed).get("EnvironmentVariables");
+    EXPECT_EQ(environment.get("HOME"), str("/var/lib/bexil/containers/com.example.greeter.hello"));
+    EXPECT_EQ(environment.count(), 3u) << environment.description();
+}
+
+// The profile table, in its order: typepad plug-ins reach the ordinary sandbox only with open access requested
+// and the typepad network granted to their application; every other point maps by name, unknown ones to "plugin".
+TEST_F(BXDPlugInEnableTest, SandboxProfileFollowsTheExtensionPoint) {
+    auto profile = [&](const std::string& point, Entries attributes = {}) {
+        auto p = plugIn(point, {}, std::move(attributes));
+        return p ? p->sandboxProfile(consent_) : std::string("(no record)");
+    };
+    const std::string typepad = "com.quorvel.typepad-service";
+    EXPECT_EQ(profile(typepad), "typepad");
+    EXPECT_EQ(profile(typepad, {{"RequestsOpenAccess", Value::boolean(true)}}), "typepad") << "no consent yet";
+    ASSERT_FALSE(consent_.setGranted("com.example.greeter", "typepad-network", true));
+    EXPECT_EQ(profile(typepad, {{"RequestsOpenAccess", Value::boolean(true)}}), "plugin");
+    EXPECT_EQ(profile(typepad, {{"RequestsOpenAccess", Value::int64(1)}}), "typepad") << "only boolean true counts";
+    EXPECT_EQ(profile(typepad), "typepad");
+    EXPECT_EQ(profile("com.quorvel.netguard.filter-data"), "netguard-filter");
+    EXPECT_EQ(profile("com.quorvel.peekview.extension.preview"), "peekviewd");
+    EXPECT_EQ(profile("com.quorvel.app.non-ui-extension"), "sketchpad-devtools");
+    EXPECT_EQ(profile("com.quorvel.app.non-ui-extension.multiple-instances"), "sketchpad-devtools");
+    EXPECT_EQ(profile("com.quorvel.app.non-ui-extension.other"), "plugin");
+}
+
+// Enabling fails before the service manager is asked when the bundle has no executable to start, and with the
+// service manager's refusal when the host is gone; neither leaves a grant.
+TEST_F(BXDPlugInEnableTest, NoExecutableOrAGoneHostFailsWithCodeFour) {
+    auto p = plugIn("com.example.greeting");
+    ASSERT_NE(p, nullptr);
+    std::filesystem::remove(executable());
+    log::CaptureSink capture;
+    Result<Value> missing = enable(*p);
+    ASSERT_FALSE(missing);
+    EXPECT_EQ(missing.error().code(), 4);
+    EXPECT_EQ(missing.error().localizedDescription(),
+              "cannot obtain executable path for plug-in com.example.greeter.hello(" + kHelloUuid.string() + ")");
+    EXPECT_TRUE(capture.contains("failed to obtain execPath for plug-in "));
+
+    std::ofstream(executable()) << "#!/bin/sh\n";
+    pid_t child = fork();
+    if (child == 0) _exit(0);
+    ASSERT_EQ(waitpid(child, nullptr, 0), child);
+    host_.pid_ = child;  // ended and reaped: no process to grant anything to
+    Result<Value> gone = enable(*p);
+    ASSERT_FALSE(gone);
+    EXPECT_EQ(gone.error().localizedDescription(),
+              "unable to enable plug-in com.example.greeter.hello(" + kHelloUuid.string() + ")");
+    EXPECT_TRUE(capture.contains("jobard error " + std::to_string(ESRCH) + " trying to allow " + std::to_string(child) +
+                                 " /usr/bin/host"));
+    EXPECT_EQ(manager_.grantCount(), 0u);
 }
 
 }  // namespace

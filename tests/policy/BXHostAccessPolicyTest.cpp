@@ -29,9 +29,12 @@ class FakeHost : public HostAccessClient {
         if (value.isNull() || value.getBool() == false) return false;
         return !(value.isNumber() && value.numberAsDouble() == 0.0);
     }
+    pid_t pid() const override { return 4242; }
+    const std::string& path() const override { return path_; }
 
   private:
     std::map<std::string, Value> entitlements_;
+    std::string path_ = "/usr/bin/fake-host";
 };
 
 std::shared_ptr<BXPlugInCore> plugIn(const std::string& path, Entries plugInEntries = {}) {

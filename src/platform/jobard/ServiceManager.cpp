@@ -4,10 +4,16 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
+#include <list>
+#include <mutex>
 #include <thread>
+
+#include "base/UniqueFd.h"
+#include "platform/log/Log.h"
 
 namespace bexil {
 
@@ -49,9 +55,69 @@ int terminate(const InstanceRecords::Instance& instance) {
     return result;
 }
 
+bool hasExited(int pidfd) { return waitForExit(pidfd, std::chrono::milliseconds(0)); }
+
 }  // namespace
 
-ServiceManager::ServiceManager(InstanceRecords instances) : instances_(std::move(instances)) {}
+struct ServiceManager::Grants {
+    struct Grant {
+        UniqueFd host;  // pidfd of the process the grant was made to
+        pid_t hostPid;
+        std::string executablePath;
+        Value overlay;
+    };
+
+    // Drops the grants of hosts that have ended. REQUIRES: `mutex` held.
+    void prune() {
+        grants.remove_if([](const Grant& grant) { return hasExited(grant.host.get()); });
+    }
+
+    mutable std::mutex mutex;
+    std::list<Grant> grants;  // oldest first
+};
+
+ServiceManager::ServiceManager(InstanceRecords instances)
+    : instances_(std::move(instances)), grants_(std::make_shared<Grants>()) {}
+
+int ServiceManager::addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay) {
+    if (executablePath.empty() || hostPid <= 0) return EINVAL;
+    UniqueFd host(pidfdOpen(hostPid));
+    if (!host) return errno;
+    std::lock_guard lock(grants_->mutex);
+    grants_->prune();
+    size_t ofHost = 0;
+    for (auto it = grants_->grants.begin(); it != grants_->grants.end();) {
+        if (it->hostPid == hostPid && it->executablePath == executablePath) {
+            it = grants_->grants.erase(it);
+            continue;
+        }
+        if (it->hostPid == hostPid) ++ofHost;
+        ++it;
+    }
+    if (ofHost >= kMaxGrantsPerHost) {
+        auto oldest = std::find_if(grants_->grants.begin(), grants_->grants.end(),
+                                   [hostPid](const Grants::Grant& grant) { return grant.hostPid == hostPid; });
+        log::ops().error("host %d holds %zu grants, the limit (kMaxGrantsPerHost): dropping its oldest, for %s",
+                         static_cast<int>(hostPid), ofHost, oldest->executablePath.c_str());
+        grants_->grants.erase(oldest);
+    }
+    grants_->grants.push_back(Grants::Grant{std::move(host), hostPid, executablePath, overlay});
+    return 0;
+}
+
+std::optional<Value> ServiceManager::grantedOverlay(pid_t hostPid, const std::string& executablePath) const {
+    std::lock_guard lock(grants_->mutex);
+    grants_->prune();
+    for (const Grants::Grant& grant : grants_->grants)
+        if (grant.hostPid == hostPid && grant.executablePath == executablePath) return grant.overlay;
+    return std::nullopt;
+}
+
+size_t ServiceManager::grantCount() const {
+    std::lock_guard lock(grants_->mutex);
+    grants_->prune();
+    return grants_->grants.size();
+}
 
 void ServiceManager::removeExternalService(const std::string& bundleIdentifier, const std::string& /*version*/,
                                            SerialQueue queue, std::function<void(int error)> completion) const {

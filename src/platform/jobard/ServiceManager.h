@@ -1,13 +1,21 @@
 #pragma once
 
-// The service manager's side of plug-in termination: ends every running instance of a plug-in that its runtime
-// recorded (see InstanceRecords). The waiting happens on a thread of its own, never on the caller's queue; the
-// completion is delivered on the queue the caller names. Thread-safe.
+// The service manager: remembers which plug-in executables each host process may start and with which activation
+// overlay (the grants that enabling a plug-in makes), and ends every running instance of a plug-in that its runtime
+// recorded (see InstanceRecords). A grant is tied to the host process through a pidfd, so it ends with that process
+// and a later process that is given the same pid never inherits it. Copies share one grant table. The waiting of
+// termination happens on a thread of its own, never on the caller's queue; the completion is delivered on the queue
+// the caller names. Thread-safe.
+
+#include <sys/types.h>
 
 #include <functional>
+#include <memory>
+#include <optional>
 #include <string>
 
 #include "base/SerialQueue.h"
+#include "base/Value.h"
 #include "platform/runtime/InstanceRecords.h"
 
 namespace bexil {
@@ -19,7 +27,21 @@ class ServiceManager {
     // How long an instance has after SIGTERM before it is killed.
     static constexpr auto kTerminationGrace = std::chrono::seconds(5);
 
+    // Grants kept at most for one host process; past this the oldest grant of that host is dropped (logged), so a
+    // host that enables plug-ins in a loop cannot grow the table without bound.
+    static constexpr size_t kMaxGrantsPerHost = 1024;
+
     explicit ServiceManager(InstanceRecords instances = InstanceRecords(InstanceRecords::Kind::Running));
+
+    // add-external-service: allows the live process `hostPid` to start `executablePath` with `overlay`, replacing
+    // an earlier grant of the same host and executable. Returns 0, or an errno value (ESRCH when the host has
+    // already ended; EINVAL for an empty path).
+    int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay);
+    // The overlay granted to `hostPid` for `executablePath`, as long as the process that received the grant still
+    // runs; none otherwise.
+    std::optional<Value> grantedOverlay(pid_t hostPid, const std::string& executablePath) const;
+    // Grants of processes that still run (grants of ended hosts are dropped on the way).
+    size_t grantCount() const;
 
     // remove-external-service: terminates the running instances of `bundleIdentifier` and calls `completion` on
     // `queue` with 0 when one or more were terminated, kNothingOnRecord when none was running, or an errno value.
@@ -27,8 +49,13 @@ class ServiceManager {
     void removeExternalService(const std::string& bundleIdentifier, const std::string& version, SerialQueue queue,
                                std::function<void(int error)> completion) const;
 
+    const InstanceRecords& instances() const { return instances_; }
+
   private:
+    struct Grants;
+
     InstanceRecords instances_;
+    std::shared_ptr<Grants> grants_;
 };
 
 }  // namespace bexil
