@@ -260,7 +260,7 @@ TEST(ZemFrame, BadHeadersAreRefusedWithTheirOwnCode) {
         {header('Z', 1, 2, 0, 2, 1, 0), ZemErrorCode::BadMagic},
         {header(m, 2, 2, 0, 2, 1, 0), ZemErrorCode::UnsupportedVersion},
         {header(m, 1, 4, 0, 2, 1, 0), ZemErrorCode::UnknownKind},
-        {header(m, 1, 2, 1, 2, 1, 0), ZemErrorCode::BadHeader},  // reserved bits set
+        {header(m, 1, 2, 5, 2, 1, 0), ZemErrorCode::BadHeader},  // more descriptors than a frame may carry
         {header(m, 1, 2, 0, 2, 0, 0), ZemErrorCode::BadHeader},  // request without serial
         {header(m, 1, 3, 0, 2, 5, 0), ZemErrorCode::BadHeader},  // reply to nothing
         {header(m, 1, 2, 0, ZemFrame::kMaxPayloadBytes + 1, 1, 0), ZemErrorCode::FrameTooLarge},

@@ -12,7 +12,9 @@
 #include <memory>
 #include <string>
 #include <variant>
+#include <vector>
 
+#include "base/UniqueFd.h"
 #include "base/Value.h"
 #include "platform/zem/ZemError.h"
 #include "platform/zem/ZemMessage.h"
@@ -28,6 +30,8 @@ class ZemConnection {
     using EventHandler = std::function<void(const Event&)>;
     // The reply's dictionary, or the connection error that took its place; called exactly once.
     using ReplyHandler = std::function<void(const std::variant<Value, ZemError>&)>;
+    // The same with the whole reply message, for requests whose reply passes file descriptors.
+    using MessageReplyHandler = std::function<void(const std::variant<ZemMessage, ZemError>&)>;
     using Finalizer = std::function<void(std::shared_ptr<void> context)>;
 
     virtual ~ZemConnection() = default;
@@ -53,8 +57,14 @@ class ZemConnection {
     virtual void send(const Value& message) = 0;
     // The answer to `request`, which the peer receives as the reply it waits for.
     virtual void sendReply(const ZemMessage& request, const Value& reply) = 0;
+    // The same, passing `descriptors` (at most ZemFrame::kMaxDescriptorsPerFrame) with it; they are closed here
+    // once sent, or when the connection ends first.
+    virtual void sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
+                                          std::vector<UniqueFd> descriptors) = 0;
     // A message that expects one reply; `handler` runs on `replyQueue` with the reply or the error in its place.
     virtual void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) = 0;
+    // The same, handing over the whole reply message with any descriptors it carries.
+    virtual void sendWithMessageReply(const Value& message, SerialQueue& replyQueue, MessageReplyHandler handler) = 0;
 
     // The peer's credentials taken when the connection was accepted (peer connections) or made (client side:
     // the service's). A pid of 0 when they are unknown.

@@ -10,11 +10,12 @@ namespace bexil {
 
 namespace {
 
-// Header layout: magic, version, kind, reserved (0), payload length u32, serial u64, inReplyTo u64; little-endian.
+// Header layout: magic, version, kind, descriptor count, payload length u32, serial u64, inReplyTo u64;
+// little-endian.
 constexpr size_t kMagicOffset = 0;
 constexpr size_t kVersionOffset = 1;
 constexpr size_t kKindOffset = 2;
-constexpr size_t kReservedOffset = 3;
+constexpr size_t kDescriptorsOffset = 3;
 constexpr size_t kLengthOffset = 4;
 constexpr size_t kSerialOffset = 8;
 constexpr size_t kInReplyToOffset = 16;
@@ -63,7 +64,7 @@ void ZemFrame::encodeHeader(const ZemFrameHeader& header, std::span<uint8_t, kHe
     p[kMagicOffset] = kMagic;
     p[kVersionOffset] = kVersion;
     p[kKindOffset] = static_cast<uint8_t>(header.kind);
-    p[kReservedOffset] = 0;
+    p[kDescriptorsOffset] = header.descriptorCount;
     putLittleEndian(p + kLengthOffset, header.payloadLength, 4);
     putLittleEndian(p + kSerialOffset, header.serial, 8);
     putLittleEndian(p + kInReplyToOffset, header.inReplyTo, 8);
@@ -95,11 +96,12 @@ Result<ZemFrameHeader> ZemFrame::decodeHeader(std::span<const uint8_t, kHeaderBy
     uint8_t kind = p[kKindOffset];
     if (kind < static_cast<uint8_t>(ZemFrameKind::Message) || kind > static_cast<uint8_t>(ZemFrameKind::Reply))
         return zemError(ZemErrorCode::UnknownKind, fmt::format("unknown frame kind {}", kind));
-    if (p[kReservedOffset] != 0)
-        return zemError(ZemErrorCode::BadHeader,
-                        fmt::format("reserved header byte is 0x{:02x}, not 0", p[kReservedOffset]));
+    if (p[kDescriptorsOffset] > kMaxDescriptorsPerFrame)
+        return zemError(ZemErrorCode::BadHeader, fmt::format("frame announces {} descriptors, more than {}",
+                                                             p[kDescriptorsOffset], kMaxDescriptorsPerFrame));
     ZemFrameHeader header;
     header.kind = static_cast<ZemFrameKind>(kind);
+    header.descriptorCount = p[kDescriptorsOffset];
     header.payloadLength = static_cast<uint32_t>(getLittleEndian(p + kLengthOffset, 4));
     header.serial = getLittleEndian(p + kSerialOffset, 8);
     header.inReplyTo = getLittleEndian(p + kInReplyToOffset, 8);
@@ -108,12 +110,15 @@ Result<ZemFrameHeader> ZemFrame::decodeHeader(std::span<const uint8_t, kHeaderBy
 }
 
 std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                      std::vector<uint8_t>& out) {
+                                      std::vector<uint8_t>& out, uint8_t descriptorCount) {
     if (!payload.isDictionary())
         return zemError(ZemErrorCode::NotDictionary,
                         fmt::format("a {} cannot carry a {}; payloads are dictionaries", zemFrameKindName(kind),
                                     valueKindName(payload.kind())));
-    ZemFrameHeader header{kind, serial, inReplyTo, 0};
+    ZemFrameHeader header{kind, serial, inReplyTo, 0, descriptorCount};
+    if (descriptorCount > kMaxDescriptorsPerFrame)
+        return zemError(ZemErrorCode::BadHeader, fmt::format("a frame carries at most {} descriptors, not {}",
+                                                             kMaxDescriptorsPerFrame, descriptorCount));
     if (auto error = checkHeader(header)) return error;
     size_t start = out.size();
     out.resize(start + kHeaderBytes);

@@ -31,6 +31,8 @@ struct ZemFrameHeader {
     uint64_t serial = 0;
     uint64_t inReplyTo = 0;
     uint32_t payloadLength = 0;
+    // File descriptors passed with the frame (sent as SCM_RIGHTS with its first byte).
+    uint8_t descriptorCount = 0;
 
     bool operator==(const ZemFrameHeader&) const = default;
 };
@@ -43,6 +45,8 @@ class ZemFrame {
     // The largest frame, header included, that either side sends or accepts.
     static constexpr size_t kMaxFrameBytes = 16 * 1024 * 1024;
     static constexpr size_t kMaxPayloadBytes = kMaxFrameBytes - kHeaderBytes;
+    // The most file descriptors one frame may carry; a header announcing more is refused.
+    static constexpr uint8_t kMaxDescriptorsPerFrame = 4;
 
     ZemFrame() = default;
     ZemFrame(ZemFrameHeader header, std::vector<uint8_t> payload) : header_(header), payload_(std::move(payload)) {}
@@ -62,17 +66,19 @@ class ZemFrame {
 
     // Writes the 24 header bytes. The header must satisfy the rules checkHeader() enforces.
     static void encodeHeader(const ZemFrameHeader& header, std::span<uint8_t, kHeaderBytes> out);
-    // Reads and checks a header: magic, version, kind, reserved bits, the serial rules of the kind, and the
-    // announced length against kMaxFrameBytes (so an oversized frame is refused before its payload is read).
+    // Reads and checks a header: magic, version, kind, the descriptor count against kMaxDescriptorsPerFrame, the
+    // serial rules of the kind, and the announced length against kMaxFrameBytes (so an oversized frame is refused
+    // before its payload is read).
     static Result<ZemFrameHeader> decodeHeader(std::span<const uint8_t, kHeaderBytes> bytes);
     // Whether a header may go on the wire: a Request needs a non-zero serial, a Reply a non-zero inReplyTo,
     // and only a Reply may carry an inReplyTo.
     static std::optional<Error> checkHeader(const ZemFrameHeader& header);
 
     // Appends a complete frame (header and encoded `payload`, which must be a dictionary) to `out`, which grows
-    // once. On any error, `out` is left as it was.
+    // once; the header announces `descriptorCount` descriptors, which the caller sends with the frame's first byte.
+    // On any error, `out` is left as it was.
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                       std::vector<uint8_t>& out);
+                                       std::vector<uint8_t>& out, uint8_t descriptorCount = 0);
 
   private:
     ZemFrameHeader header_;

@@ -3,8 +3,10 @@
 #include <poll.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cinttypes>
+#include <cstring>
 
 #include "base/EventLoopAsio.h"
 #include "platform/log/Log.h"
@@ -107,7 +109,31 @@ void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& repl
     });
 }
 
+void ZemSocketConnection::sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
+                                                   std::vector<UniqueFd> descriptors) {
+    if (!request.expectsReply()) {
+        log::ops().error("reply to message #%llu, which expects none, dropped",
+                         static_cast<unsigned long long>(request.serial()));
+        return;
+    }
+    auto owned = std::make_shared<std::vector<UniqueFd>>(std::move(descriptors));
+    queue_.dispatch([self = shared_from_this(), serial = request.serial(), reply, owned] {
+        self->enqueueFrame(ZemFrameKind::Reply, serial, reply, std::nullopt, std::move(*owned));
+    });
+}
+
 void ZemSocketConnection::sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) {
+    sendWithMessageReply(message, replyQueue,
+                         [handler = std::move(handler)](const std::variant<ZemMessage, ZemError>& answer) {
+                             if (const auto* reply = std::get_if<ZemMessage>(&answer))
+                                 handler(std::variant<Value, ZemError>(reply->body()));
+                             else
+                                 handler(std::variant<Value, ZemError>(std::get<ZemError>(answer)));
+                         });
+}
+
+void ZemSocketConnection::sendWithMessageReply(const Value& message, SerialQueue& replyQueue,
+                                               MessageReplyHandler handler) {
     queue_.async([self = shared_from_this(), message, pending = PendingReply{replyQueue, std::move(handler)}] {
         self->enqueueFrame(ZemFrameKind::Request, 0, message, pending);
     });
@@ -139,29 +165,74 @@ bool ZemSocketConnection::connectClient() {
 }
 
 void ZemSocketConnection::readMore() {
+    for (int turn = 0; turn < kReadsPerTurn; ++turn) {
+        if (suspended_ || reading_ || state_ != State::Open) return;
+        ssize_t bytes = receive();
+        if (bytes > 0) {
+            if (!consume(static_cast<size_t>(bytes))) return;
+            continue;
+        }
+        if (bytes == 0) return endOfStream();
+        if (errno == EINTR) continue;
+        if (errno == EAGAIN || errno == EWOULDBLOCK) break;
+        return endOfStream();
+    }
     if (suspended_ || reading_ || state_ != State::Open) return;
     reading_ = true;
-    if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
-    socket_.async_read_some(
-        asio::buffer(readBuffer_),
-        detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error, size_t bytes) {
-            self->onRead(error, bytes);
-        }));
+    socket_.async_wait(Socket::wait_read,
+                       detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error) {
+                           self->reading_ = false;
+                           if (self->state_ != State::Open) return;
+                           if (error) return self->endOfStream();
+                           self->readMore();
+                       }));
 }
 
-void ZemSocketConnection::onRead(const asio::error_code& error, size_t bytes) {
-    reading_ = false;
-    if (state_ != State::Open) return;
-    if (error) {
-        if (reader_.hasPartialFrame())
-            log::ops().error("peer %d closed its connection in the middle of a frame", static_cast<int>(pid_));
-        close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
-        return;
+ssize_t ZemSocketConnection::receive() {
+    if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
+    iovec chunk{readBuffer_.data(), readBuffer_.size()};
+    // Room for one frame's descriptors: the kernel never joins the descriptors of two sends in one read.
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * ZemFrame::kMaxDescriptorsPerFrame)];
+    msghdr message{};
+    message.msg_iov = &chunk;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    ssize_t bytes = ::recvmsg(socket_.native_handle(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    if (bytes < 0) return bytes;
+    for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr; header = CMSG_NXTHDR(&message, header)) {
+        if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
+        size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+        for (size_t i = 0; i < count; ++i) {
+            int fd;
+            std::memcpy(&fd, CMSG_DATA(header) + i * sizeof(int), sizeof fd);
+            receivedFds_.emplace_back(fd);
+        }
     }
+    if ((message.msg_flags & MSG_CTRUNC) != 0 || receivedFds_.size() > kMaxPendingDescriptors) {
+        log::ops().error(
+            "protocol violation by peer %d: more descriptors than its frames may carry "
+            "(kMaxPendingDescriptors %zu); disconnecting",
+            static_cast<int>(pid_), kMaxPendingDescriptors);
+        close(ZemError::Kind::ConnectionInvalid);
+        errno = ECONNABORTED;
+        return -1;
+    }
+    return bytes;
+}
+
+void ZemSocketConnection::endOfStream() {
+    if (state_ != State::Open) return;
+    if (reader_.hasPartialFrame())
+        log::ops().error("peer %d closed its connection in the middle of a frame", static_cast<int>(pid_));
+    close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
+}
+
+bool ZemSocketConnection::consume(size_t bytes) {
     std::optional<Error> broken = reader_.feed(std::span<const uint8_t>(readBuffer_.data(), bytes));
     // Frames completed before a bad header are still whole and are handled; then the stream is dropped.
     while (std::optional<ZemFrame> frame = reader_.next()) {
-        if (state_ != State::Open) return;
+        if (state_ != State::Open) return false;
         if (suspended_)
             heldFrames_.push_back(std::move(*frame));
         else
@@ -170,9 +241,9 @@ void ZemSocketConnection::onRead(const asio::error_code& error, size_t bytes) {
     if (broken) {
         log::ops().error("protocol violation by peer %d: %@; disconnecting", static_cast<int>(pid_), *broken);
         close(ZemError::Kind::ConnectionInvalid);
-        return;
+        return false;
     }
-    readMore();
+    return state_ == State::Open;
 }
 
 void ZemSocketConnection::handleFrame(ZemFrame frame) {
@@ -183,10 +254,24 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
         close(ZemError::Kind::ConnectionInvalid);
         return;
     }
+    // The frame's descriptors came with its first byte, so they have arrived by now, after those of earlier frames.
+    const size_t announced = frame.header().descriptorCount;
+    if (receivedFds_.size() < announced) {
+        log::ops().error("protocol violation by peer %d: %s announces %zu descriptors but %zu arrived; disconnecting",
+                         static_cast<int>(pid_), frame.description().c_str(), announced, receivedFds_.size());
+        close(ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    std::vector<UniqueFd> descriptors;
+    for (size_t i = 0; i < announced; ++i) {
+        descriptors.push_back(std::move(receivedFds_.front()));
+        receivedFds_.pop_front();
+    }
     switch (frame.kind()) {
         case ZemFrameKind::Message:
         case ZemFrameKind::Request:
-            deliver(ZemMessage(std::move(*body), frame.serial(), frame.kind() == ZemFrameKind::Request));
+            deliver(ZemMessage(std::move(*body), frame.serial(), frame.kind() == ZemFrameKind::Request,
+                               std::move(descriptors)));
             return;
         case ZemFrameKind::Reply: {
             auto it = pendingReplies_.find(frame.inReplyTo());
@@ -197,8 +282,9 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
             }
             PendingReply pending = std::move(it->second);
             pendingReplies_.erase(it);
-            pending.queue.async([handler = std::move(pending.handler), reply = std::move(*body)] {
-                handler(std::variant<Value, ZemError>(reply));
+            pending.queue.async([handler = std::move(pending.handler),
+                                 reply = ZemMessage(std::move(*body), frame.serial(), false, std::move(descriptors))] {
+                handler(std::variant<ZemMessage, ZemError>(reply));
             });
             return;
         }
@@ -206,7 +292,7 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
 }
 
 void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
-                                       std::optional<PendingReply> pending) {
+                                       std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors) {
     if (side_ == Side::Client && state_ == State::Interrupted) {
         // The service went away earlier; a new message tries to reach it again.
         state_ = State::Idle;
@@ -222,12 +308,21 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
     }
     // Every frame this side sends takes the next serial, replies too, so a peer can tell our frames apart by it.
     const uint64_t serial = nextSerial_++;
-    if (std::optional<Error> error = ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_)) {
+    const size_t start = outgoing_.size();
+    if (descriptors.size() > ZemFrame::kMaxDescriptorsPerFrame) {
+        log::ops().error("cannot send %s to peer %d with %zu descriptors (at most %u)", zemFrameKindName(kind),
+                         static_cast<int>(pid_), descriptors.size(), unsigned{ZemFrame::kMaxDescriptorsPerFrame});
+        if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+        return;
+    }
+    if (std::optional<Error> error =
+            ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_, static_cast<uint8_t>(descriptors.size()))) {
         log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(kind), static_cast<int>(pid_), *error);
         if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
         return;
     }
     if (pending) pendingReplies_.emplace(serial, std::move(*pending));
+    if (!descriptors.empty()) attachments_.push_back(Attachment{start, std::move(descriptors)});
     size_t queued = outgoing_.size() + writing_.size();
     if (queued > kMaxQueuedBytes) {
         log::ops().error("peer %d has %zu bytes queued, over the limit of %zu (kMaxQueuedBytes): disconnecting",
@@ -240,6 +335,7 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
 
 void ZemSocketConnection::writeMore() {
     if (writeInFlight_ || outgoing_.empty() || state_ != State::Open) return;
+    if (!attachments_.empty()) return writeWithAttachments();
     // The socket buffer almost always has room: try a non-blocking send first, so that a reply costs one system
     // call and no completion handler; only what does not fit waits for the socket to drain.
     ssize_t sent = ::send(socket_.native_handle(), outgoing_.data(), outgoing_.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
@@ -264,6 +360,68 @@ void ZemSocketConnection::writeMore() {
         }));
 }
 
+void ZemSocketConnection::writeWithAttachments() {
+    while (!outgoing_.empty()) {
+        Attachment* here = attachments_.empty() || attachments_.front().offset != 0 ? nullptr : &attachments_.front();
+        // A piece ends where the next frame with descriptors starts, so those always leave with that frame's first
+        // byte.
+        size_t end = outgoing_.size();
+        for (const Attachment& attachment : attachments_)
+            if (attachment.offset > 0) {
+                end = attachment.offset;
+                break;
+            }
+        iovec piece{outgoing_.data(), end};
+        msghdr message{};
+        message.msg_iov = &piece;
+        message.msg_iovlen = 1;
+        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * ZemFrame::kMaxDescriptorsPerFrame)];
+        if (here != nullptr) {
+            size_t count = here->descriptors.size();
+            message.msg_control = control;
+            message.msg_controllen = CMSG_SPACE(sizeof(int) * count);
+            cmsghdr* header = CMSG_FIRSTHDR(&message);
+            header->cmsg_level = SOL_SOCKET;
+            header->cmsg_type = SCM_RIGHTS;
+            header->cmsg_len = CMSG_LEN(sizeof(int) * count);
+            for (size_t i = 0; i < count; ++i) {
+                int fd = here->descriptors[i].get();
+                std::memcpy(CMSG_DATA(header) + i * sizeof(int), &fd, sizeof fd);
+            }
+        }
+        ssize_t sent = ::sendmsg(socket_.native_handle(), &message, MSG_DONTWAIT | MSG_NOSIGNAL);
+        if (sent < 0) {
+            if (errno == EINTR) continue;
+            if (errno != EAGAIN && errno != EWOULDBLOCK) {
+                close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted
+                                            : ZemError::Kind::ConnectionInvalid);
+                return;
+            }
+            writeInFlight_ = true;
+            socket_.async_wait(Socket::wait_write,
+                               detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error) {
+                                   self->writeInFlight_ = false;
+                                   if (self->state_ != State::Open) return;
+                                   if (error) {
+                                       self->close(self->side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted
+                                                                               : ZemError::Kind::ConnectionInvalid);
+                                       return;
+                                   }
+                                   self->writeMore();
+                               }));
+            return;
+        }
+        // The kernel holds its own references to the descriptors once any byte has gone with them.
+        if (here != nullptr && sent > 0) attachments_.pop_front();
+        dropSent(static_cast<size_t>(sent));
+    }
+}
+
+void ZemSocketConnection::dropSent(size_t bytes) {
+    outgoing_.erase(outgoing_.begin(), outgoing_.begin() + static_cast<std::ptrdiff_t>(bytes));
+    for (Attachment& attachment : attachments_) attachment.offset -= bytes;
+}
+
 void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
     writeInFlight_ = false;
     writing_.clear();
@@ -283,7 +441,7 @@ void ZemSocketConnection::failPendingReplies(ZemError::Kind kind) {
 
 void ZemSocketConnection::answerWithError(PendingReply& pending, ZemError::Kind kind) {
     pending.queue.async(
-        [handler = std::move(pending.handler), kind] { handler(std::variant<Value, ZemError>(ZemError(kind))); });
+        [handler = std::move(pending.handler), kind] { handler(std::variant<ZemMessage, ZemError>(ZemError(kind))); });
 }
 
 bool ZemSocketConnection::peerHasHungUp() const {
@@ -309,6 +467,8 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     socket_.close(ignored);
     reader_ = ZemFrameReader();
     outgoing_.clear();
+    attachments_.clear();
+    receivedFds_.clear();
     heldFrames_.clear();
     failPendingReplies(kind);
     deliver(ZemError(kind));

@@ -7,6 +7,7 @@
 
 #include <asio.hpp>
 #include <atomic>
+#include <deque>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -28,6 +29,11 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
     // Size of one read from the socket.
     static constexpr size_t kReadChunkBytes = 64 * 1024;
+    // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
+    // requests, few enough that one peer cannot keep the loop to itself.
+    static constexpr int kReadsPerTurn = 4;
+    // Descriptors received ahead of the frames that announce them; a peer that sends more is violating the protocol.
+    static constexpr size_t kMaxPendingDescriptors = 16;
 
     enum class Side { Peer, Client };
 
@@ -51,7 +57,10 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void cancel() override;
     void send(const Value& message) override;
     void sendReply(const ZemMessage& request, const Value& reply) override;
+    void sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
+                                  std::vector<UniqueFd> descriptors) override;
     void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) override;
+    void sendWithMessageReply(const Value& message, SerialQueue& replyQueue, MessageReplyHandler handler) override;
     pid_t peerPid() const override { return pid_.load(); }
     uid_t peerUid() const override { return uid_.load(); }
     gid_t peerGid() const override { return gid_.load(); }
@@ -63,7 +72,12 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
   private:
     struct PendingReply {
         SerialQueue queue;
-        ReplyHandler handler;
+        MessageReplyHandler handler;
+    };
+    // Descriptors to send with the frame that starts at `offset` in outgoing_.
+    struct Attachment {
+        size_t offset;
+        std::vector<UniqueFd> descriptors;
     };
     enum class State { Idle, Open, Interrupted, Closed };
 
@@ -71,10 +85,21 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void start();
     bool connectClient();
     void readMore();
-    void onRead(const asio::error_code& error, size_t bytes);
+    // One recvmsg: the bytes read (0 at the end of the stream) or -1 with errno; descriptors go to receivedFds_.
+    ssize_t receive();
+    // Cuts and handles the frames in the `bytes` just read. False when the connection ended on the way.
+    bool consume(size_t bytes);
+    // The peer closed its end, or the socket failed.
+    void endOfStream();
     void handleFrame(ZemFrame frame);
-    void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending);
+    void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending,
+                      std::vector<UniqueFd> descriptors = {});
     void writeMore();
+    // writeMore's path while descriptors wait in outgoing_: every piece is sent with the descriptors of the frame
+    // it starts, and never runs into the next frame that carries some.
+    void writeWithAttachments();
+    // Drops the first `bytes` of outgoing_, keeping the attachments' offsets right.
+    void dropSent(size_t bytes);
     void onWritten(const asio::error_code& error, size_t bytes);
     // Ends the connection because of `why` (logged when it is a protocol violation or a limit).
     void close(ZemError::Kind kind);
@@ -102,8 +127,10 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     bool reading_ = false;
     ZemFrameReader reader_;
     std::vector<uint8_t> readBuffer_;
-    std::vector<uint8_t> outgoing_;  // frames waiting for the write in flight to finish
-    std::vector<uint8_t> writing_;   // the frames of the write in flight
+    std::vector<uint8_t> outgoing_;       // frames waiting for the write in flight to finish
+    std::vector<uint8_t> writing_;        // the frames of the write in flight
+    std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
+    std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
     unsigned delivering_ = 0;  // depth of event handler calls in progress on the stack
     uint64_t nextSerial_ = 1;
