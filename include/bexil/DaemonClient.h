@@ -33,6 +33,12 @@ class DaemonClient {
         std::optional<Error> error;
         // True when no reply dictionary came: the daemon is not running, went away or did not answer in time.
         bool connectionFailed = false;
+        // launch(): the host's end of the connected socket to the started plug-in; -1 otherwise. Owned by the
+        // Reply (and its copies): dup it, or take it with takeChannel, to keep it beyond the Reply.
+        int channel() const { return channel_ ? *channel_ : -1; }
+        // Gives the socket up to the caller, who closes it; -1 when there is none or it was taken already.
+        int takeChannel();
+        std::shared_ptr<int> channel_;
 
         bool ok() const { return !error.has_value(); }
     };
@@ -67,6 +73,9 @@ class DaemonClient {
     void bulkAnnotate(const Value& annotations, Callback done);
     void hold(const std::vector<std::string>& paths, uint64_t flags, Callback done);
     void releaseHold(const Uuid& hold, Callback done);
+    // Starts a plug-in that ready() made runnable for this process, in its sandbox; the reply carries "pid" and
+    // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
+    void launch(const Uuid& plugIn, Callback done);
 
     // Runs `start` with a callback and waits for its reply at most `timeout`:
     //     auto reply = client.wait([&](auto done) { client.bulk(0, done); });

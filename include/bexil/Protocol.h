@@ -31,7 +31,8 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock };
+// "launch" is an extension of ours: on Linux nobody but bxd starts plug-ins (docs/protocol.md).
+enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch };
 
 struct RequestInfo {
     Request request;
@@ -41,7 +42,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 9> kRequests{{
+inline constexpr std::array<RequestInfo, 10> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -51,6 +52,7 @@ inline constexpr std::array<RequestInfo, 9> kRequests{{
     {Request::Annotate, "annotate", "set the annotations of plug-ins"},
     {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
     {Request::Lock, "lock", "place or release a hold on plug-ins"},
+    {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -80,8 +82,9 @@ inline constexpr std::string_view kError = "error";              // string, in a
 inline constexpr std::string_view kMatches = "matches";          // array of plug-in forms, in a "match" reply
 inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
 inline constexpr std::string_view kExtensions = "extensions";    // array of tokens, in an "access" reply
-inline constexpr std::array kList{kRequest,     kVersion,   kPaths, kUuids,   kFlags,     kRules,
-                                  kAnnotations, kErrorCode, kError, kMatches, kConflicts, kExtensions};
+inline constexpr std::string_view kPid = "pid";                  // uint64, the instance a "launch" started
+inline constexpr std::array kList{kRequest,   kVersion, kPaths,   kUuids,     kFlags,      kRules, kAnnotations,
+                                  kErrorCode, kError,   kMatches, kConflicts, kExtensions, kPid};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

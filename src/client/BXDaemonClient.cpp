@@ -134,6 +134,14 @@ void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
     sendReply(message.take(), std::move(reply));
 }
 
+void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply) {
+    MutableDictionary message = request(Request::Launch);
+    setUuids(message, {plugIn});
+    Value request = message.take();
+    log::traffic().debug("request: %@", request);
+    bxd_->sendWithMessageReply(request, replyQueue_, std::move(reply));
+}
+
 std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {
     if (const auto* error = std::get_if<ZemError>(&reply))
         return BXError(ErrorCode::OperationFailed, error->description());

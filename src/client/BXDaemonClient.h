@@ -37,6 +37,8 @@ class BXDaemonClient {
     // The reply dictionary, or the connection-level error delivered in its place.
     using Reply = std::variant<Value, ZemError>;
     using ReplyHandler = std::function<void(const Reply&)>;
+    // A reply together with the descriptors it passed (only "launch" passes one).
+    using MessageReplyHandler = ZemConnection::MessageReplyHandler;
 
     // Connects to `serviceName`, or to kDefaultServiceName when it is null. The reply queue runs on `loop`.
     explicit BXDaemonClient(const char* serviceName = nullptr, EventLoop& loop = EventLoop::shared());
@@ -64,6 +66,8 @@ class BXDaemonClient {
     void bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply);
     void holdPluginsFlagsReply(const Value& paths, uint64_t flags, ReplyHandler reply);
     void releaseHoldReply(const Uuid& hold, ReplyHandler reply);
+    // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
+    void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
 
     // Building blocks of the request methods.
     MutableDictionary request(protocol::Request name) const;

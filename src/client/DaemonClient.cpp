@@ -4,8 +4,12 @@
 
 #include "bexil/DaemonClient.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <future>
 #include <mutex>
+#include <utility>
 
 #include "bexil/bexil.h"
 #include "client/BXDaemonClient.h"
@@ -92,6 +96,28 @@ void DaemonClient::hold(const std::vector<std::string>& paths, uint64_t flags, C
 }
 void DaemonClient::releaseHold(const Uuid& hold, Callback done) {
     impl_->client.releaseHoldReply(hold, adapt(std::move(done)));
+}
+void DaemonClient::launch(const Uuid& plugIn, Callback done) {
+    impl_->client.launchPlugInReply(plugIn, [done = std::move(done)](const std::variant<ZemMessage, ZemError>& raw) {
+        if (!done) return;
+        if (const auto* error = std::get_if<ZemError>(&raw)) return done(makeReply(BXDaemonClient::Reply(*error)));
+        const ZemMessage& message = std::get<ZemMessage>(raw);
+        Reply reply = makeReply(BXDaemonClient::Reply(message.body()));
+        if (reply.ok() && message.descriptorCount() == 1) {
+            int fd = fcntl(message.descriptor(0), F_DUPFD_CLOEXEC, 0);
+            if (fd >= 0)
+                reply.channel_ = std::shared_ptr<int>(new int(fd), [](int* owned) {
+                    if (*owned >= 0) ::close(*owned);
+                    delete owned;
+                });
+        }
+        done(reply);
+    });
+}
+
+int DaemonClient::Reply::takeChannel() {
+    if (!channel_) return -1;
+    return std::exchange(*channel_, -1);
 }
 
 DaemonClient::Reply DaemonClient::wait(const std::function<void(Callback)>& start, std::chrono::milliseconds timeout) {

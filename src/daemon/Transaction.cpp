@@ -48,6 +48,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Annotate, &Transaction::annotatePlugIns},
     {Request::BulkAnnotate, &Transaction::bulkAnnotatePlugIns},
     {Request::Lock, &Transaction::lockDownPlugIns},
+    {Request::Launch, &Transaction::launchPlugIn},
 }};
 
 constexpr bool handlersFollowTheProtocol() {
@@ -119,7 +120,9 @@ static Value wireErrorCode(int64_t code) {
     return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(static_cast<int32_t>(code))));
 }
 
-void Transaction::done() {
+void Transaction::done() { doneWithDescriptors({}); }
+
+void Transaction::doneWithDescriptors(std::vector<UniqueFd> descriptors) {
     if (answered_.exchange(true)) {
         log::ops().fault("transaction answered twice for client %d", client_->pid());
         return;
@@ -140,7 +143,10 @@ void Transaction::done() {
     if (trace::requestOutputEnabled()) trace::requestOutput(client_->pid(), reply.description().c_str());
     std::shared_ptr<ZemConnection> connection = client_->connection();
     if (!connection) return;  // the peer is gone: there is nobody to answer
-    connection->sendReply(request_, reply);
+    if (descriptors.empty())
+        connection->sendReply(request_, reply);
+    else
+        connection->sendReplyWithDescriptors(request_, reply, std::move(descriptors));
 }
 
 void Transaction::fail(ErrorCode code, std::string_view message) { failWithCode(protocol::codeOf(code), message); }

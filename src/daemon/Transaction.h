@@ -12,8 +12,10 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "base/Error.h"
+#include "base/UniqueFd.h"
 #include "base/Value.h"
 #include "bexil/Protocol.h"
 #include "platform/zem/ZemMessage.h"
@@ -39,6 +41,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void dispatch();
     // Sends the reply. Called exactly once per transaction; later calls are ignored.
     void done();
+    // The same, passing `descriptors` with the reply (closed here once sent, or if the client is gone).
+    void doneWithDescriptors(std::vector<UniqueFd> descriptors);
     // Sets "errorcode" and "error" in the reply, then done().
     void fail(ErrorCode code, std::string_view message);
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.
@@ -80,6 +84,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void annotatePlugIns();
     void bulkAnnotatePlugIns();
     void lockDownPlugIns();
+    void launchPlugIn();
 
   private:
     void runHandler(protocol::Request request);

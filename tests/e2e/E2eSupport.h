@@ -3,6 +3,7 @@
 // What the end-to-end tests share: a client connection, request builders, the error fields of a reply, and a
 // fixture with a private daemon, copies of the example bundles and the usual requests.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -24,6 +25,7 @@
 #include "base/Document.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
+#include "base/UniqueFd.h"
 #include "base/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
@@ -56,6 +58,21 @@ class TestClient {
         Reply reply = roundTrip(message);
         EXPECT_TRUE(std::holds_alternative<Value>(reply)) << "connection error instead of a reply";
         return std::holds_alternative<Value>(reply) ? std::get<Value>(reply) : Value();
+    }
+
+    // The reply and the first descriptor it passed (invalid when none); a null reply on a connection error.
+    std::pair<Value, UniqueFd> replyWithDescriptor(const Value& message) {
+        using MessageReply = std::variant<ZemMessage, ZemError>;
+        auto promise = std::make_shared<std::promise<MessageReply>>();
+        auto future = promise->get_future();
+        connection_->sendWithMessageReply(message, queue_,
+                                          [promise](const MessageReply& reply) { promise->set_value(reply); });
+        if (future.wait_for(std::chrono::seconds(20)) != std::future_status::ready) return {};
+        MessageReply reply = future.get();
+        const auto* received = std::get_if<ZemMessage>(&reply);
+        if (received == nullptr) return {};
+        UniqueFd descriptor(received->descriptorCount() > 0 ? fcntl(received->descriptor(0), F_DUPFD_CLOEXEC, 0) : -1);
+        return {received->body(), std::move(descriptor)};
     }
 
     // Sends `messages` as requests whose replies nobody waits for, then closes the connection.

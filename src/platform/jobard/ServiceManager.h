@@ -14,7 +14,9 @@
 #include <optional>
 #include <string>
 
+#include "base/Error.h"
 #include "base/SerialQueue.h"
+#include "base/UniqueFd.h"
 #include "base/Value.h"
 #include "platform/runtime/InstanceRecords.h"
 
@@ -48,6 +50,34 @@ class ServiceManager {
     // Instances are recorded per bundle identifier, so `version` only names the registration in logs.
     void removeExternalService(const std::string& bundleIdentifier, const std::string& version, SerialQueue queue,
                                std::function<void(int error)> completion) const;
+
+    // The longest bubblewrap may take to set up a sandbox before the launch counts as failed.
+    static constexpr auto kSandboxSetupTimeout = std::chrono::seconds(10);
+    // The descriptor number of the plug-in's end of its socket to the host, and the variable that names it.
+    static constexpr int kPlugInSocketFd = 3;
+    static constexpr std::string_view kPlugInSocketVariable = "BEXIL_PLUGIN_FD";
+
+    // $BX_BWRAP, else /usr/bin/bwrap.
+    static std::string bubblewrapPath();
+
+    struct ServiceLaunch {
+        std::string bundleIdentifier;  // names the instance record
+        std::string bundlePath;
+        std::string executablePath;
+        std::optional<std::string> container;
+        Value serviceDescription;  // the "ZEMService" of a granted overlay: environment and sandbox profile
+        uid_t uid;                 // the host's user and group, which the plug-in runs as
+        gid_t gid;
+    };
+    struct LaunchedService {
+        pid_t pid;         // the recorded instance (the sandbox's outer process)
+        UniqueFd hostEnd;  // the host's end of the socket whose other end the plug-in has as kPlugInSocketFd
+    };
+    // Starts the plug-in's executable under bubblewrap with the sandbox profile and environment of its service
+    // description, records the instance, and reaps it on `reaper` when it ends (removing the record). Fails with
+    // code 4 and a message saying why, never starting the plug-in without its sandbox. Blocks the caller until
+    // the sandbox is set up (at most kSandboxSetupTimeout).
+    Result<LaunchedService> startService(const ServiceLaunch& launch, SerialQueue& reaper) const;
 
     const InstanceRecords& instances() const { return instances_; }
 

@@ -1,0 +1,205 @@
+// Starting a plug-in: the one place where bxd makes processes. The child between fork and exec only moves
+// descriptors, drops to the host's user and execs bubblewrap, all with async-signal-safe calls and with every
+// argument prepared before the fork, since other threads may hold locks the child would never see released.
+
+#include <fcntl.h>
+#include <grp.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <asio.hpp>
+#include <cerrno>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <memory>
+
+#include "base/EventLoopAsio.h"
+#include "base/Format.h"
+#include "platform/jobard/ServiceManager.h"
+#include "platform/log/Log.h"
+#include "platform/sandbox/SandboxProfiles.h"
+
+namespace bexil {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr std::string_view kEnvironmentKey = "EnvironmentVariables";
+constexpr std::string_view kSandboxProfileKey = "_SandboxProfile";
+constexpr int kStatusFd = 4;
+constexpr std::string_view kChildPidKey = "\"child-pid\"";
+
+Error launchError(const std::string& message) { return BXError(ErrorCode::OperationFailed, message); }
+
+// Reads what bubblewrap reports on its status pipe until it names the started process; false when the pipe ends or
+// the time runs out first.
+bool sandboxStarted(int statusFd) {
+    std::string status;
+    auto deadline = std::chrono::steady_clock::now() + ServiceManager::kSandboxSetupTimeout;
+    while (status.find(kChildPidKey) == std::string::npos || status.find('}') == std::string::npos) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        if (left.count() <= 0) return false;
+        pollfd p{statusFd, POLLIN, 0};
+        int ready = poll(&p, 1, static_cast<int>(left.count()));
+        if (ready < 0 && errno == EINTR) continue;
+        if (ready <= 0) return false;
+        char buffer[512];
+        ssize_t n = read(statusFd, buffer, sizeof buffer);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return false;
+        status.append(buffer, static_cast<size_t>(n));
+    }
+    return true;
+}
+
+std::string exitText(int status) {
+    if (WIFEXITED(status)) return "exit status " + std::to_string(WEXITSTATUS(status));
+    if (WIFSIGNALED(status)) return std::string("signal ") + strsignal(WTERMSIG(status));
+    return "status " + std::to_string(status);
+}
+
+// Waits on `queue` for the process to end without blocking anyone, then reaps it and removes its record. The
+// status pipe stays open until then: bubblewrap reports the plug-in's exit on it last, and a closed pipe would kill
+// it with SIGPIPE instead.
+void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd status, SerialQueue& queue) {
+    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    if (pidfd < 0) {
+        log::ops().error("cannot watch plug-in %s instance %d: %s; reaping it now", identifier.c_str(),
+                         static_cast<int>(pid), strerror(errno));
+        kill(pid, SIGKILL);
+        waitpid(pid, nullptr, 0);
+        std::error_code ignored;
+        fs::remove(record, ignored);
+        return;
+    }
+    auto watch = std::make_shared<asio::posix::stream_descriptor>(*detail::QueueInternals::state(queue)->core, pidfd);
+    watch->async_wait(
+        asio::posix::stream_descriptor::wait_read,
+        detail::bindToQueue(queue, [watch, pid, record, identifier,
+                                    status = std::make_shared<UniqueFd>(std::move(status))](const asio::error_code&) {
+            int status = 0;
+            pid_t reaped;
+            do {
+                reaped = waitpid(pid, &status, 0);
+            } while (reaped < 0 && errno == EINTR);
+            std::error_code ignored;
+            fs::remove(record, ignored);
+            log::ops().info("plug-in %s instance %d ended (%s)", identifier.c_str(), static_cast<int>(pid),
+                            exitText(status).c_str());
+            watch->close();
+        }));
+}
+
+}  // namespace
+
+std::string ServiceManager::bubblewrapPath() {
+    const char* configured = std::getenv("BX_BWRAP");
+    return configured != nullptr && *configured != '\0' ? configured : "/usr/bin/bwrap";
+}
+
+Result<ServiceManager::LaunchedService> ServiceManager::startService(const ServiceLaunch& launch,
+                                                                     SerialQueue& reaper) const {
+    const std::string name = launch.bundleIdentifier;
+    const std::string* profileName = launch.serviceDescription.get(kSandboxProfileKey).getString();
+    const SandboxProfile* profile = profileName ? SandboxProfiles::named(*profileName) : nullptr;
+    if (profile == nullptr)
+        return launchError(
+            formatPrintf("cannot launch %s: no known sandbox profile in its service description", name.c_str()));
+    const std::string bwrap = bubblewrapPath();
+    if (access(bwrap.c_str(), X_OK) != 0)
+        return launchError(formatPrintf("cannot launch %s: bubblewrap is not available (%s: %s)", name.c_str(),
+                                        bwrap.c_str(), strerror(errno)));
+
+    // The plug-in runs as the host's user, so its container (and the TMPDIR inside it) must be that user's.
+    if (launch.container) {
+        std::error_code ec;
+        fs::create_directories(fs::path(*launch.container) / "tmp", ec);
+        if (ec)
+            return launchError(formatPrintf("cannot launch %s: cannot make its data container %s: %s", name.c_str(),
+                                            launch.container->c_str(), ec.message().c_str()));
+        if (geteuid() == 0 && launch.uid != 0) {
+            if (chown(launch.container->c_str(), launch.uid, launch.gid) != 0 ||
+                chown((fs::path(*launch.container) / "tmp").c_str(), launch.uid, launch.gid) != 0)
+                return launchError(formatPrintf("cannot launch %s: cannot give its data container to user %u: %s",
+                                                name.c_str(), static_cast<unsigned>(launch.uid), strerror(errno)));
+        }
+    }
+
+    SandboxProfiles::Launch sandbox{launch.bundlePath, launch.container, launch.executablePath, {}, kStatusFd};
+    for (const auto& [variable, value] : launch.serviceDescription.get(kEnvironmentKey).entries())
+        if (const std::string* text = value.getString()) sandbox.environment.emplace_back(variable, *text);
+    sandbox.environment.emplace_back(std::string(kPlugInSocketVariable), std::to_string(kPlugInSocketFd));
+    std::vector<std::string> arguments = SandboxProfiles::bubblewrapArguments(*profile, sandbox);
+    arguments.insert(arguments.begin(), bwrap);
+    std::vector<char*> argv;
+    for (std::string& argument : arguments) argv.push_back(argument.data());
+    argv.push_back(nullptr);
+    char path[] = "PATH=/usr/bin:/bin";
+    char* envp[] = {path, nullptr};
+
+    int sockets[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sockets) != 0)
+        return launchError(formatPrintf("cannot launch %s: socketpair: %s", name.c_str(), strerror(errno)));
+    UniqueFd hostEnd(sockets[0]), plugInEnd(sockets[1]);
+    int statusPipe[2];
+    if (pipe2(statusPipe, O_CLOEXEC) != 0)
+        return launchError(formatPrintf("cannot launch %s: pipe: %s", name.c_str(), strerror(errno)));
+    UniqueFd statusRead(statusPipe[0]), statusWrite(statusPipe[1]);
+    const uid_t uid = launch.uid;
+    const gid_t gid = launch.gid;
+    const bool dropToHost = geteuid() == 0 && (uid != 0 || gid != 0);
+
+    pid_t pid = fork();
+    if (pid < 0) return launchError(formatPrintf("cannot launch %s: fork: %s", name.c_str(), strerror(errno)));
+    if (pid == 0) {
+        // Above the numbers they are moved to, so that neither dup2 overwrites the other's source.
+        int socketCopy = fcntl(plugInEnd.get(), F_DUPFD_CLOEXEC, 10);
+        int statusCopy = fcntl(statusWrite.get(), F_DUPFD_CLOEXEC, 10);
+        int devNull = open("/dev/null", O_RDONLY | O_CLOEXEC);
+        if (socketCopy < 0 || statusCopy < 0 || devNull < 0 || dup2(devNull, 0) < 0 ||
+            dup2(socketCopy, kPlugInSocketFd) < 0 || dup2(statusCopy, kStatusFd) < 0)
+            _exit(126);
+        syscall(SYS_close_range, kStatusFd + 1, ~0U, 0);
+        sigset_t none;
+        sigemptyset(&none);
+        sigprocmask(SIG_SETMASK, &none, nullptr);
+        if (dropToHost &&
+            (setgroups(0, nullptr) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(uid, uid, uid) != 0))
+            _exit(126);
+        execve(argv[0], argv.data(), envp);
+        _exit(127);
+    }
+    plugInEnd.reset();
+    statusWrite.reset();
+
+    if (!sandboxStarted(statusRead.get())) {
+        kill(pid, SIGKILL);
+        int status = 0;
+        while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+        }
+        return launchError(formatPrintf("cannot launch %s: bubblewrap did not set up its sandbox (%s)", name.c_str(),
+                                        exitText(status).c_str()));
+    }
+    // An instance that termination and the busy check could not see must not run.
+    if (!instances_.record(launch.bundleIdentifier, pid)) {
+        kill(pid, SIGKILL);
+        while (waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
+        }
+        return launchError(formatPrintf("cannot launch %s: cannot record its instance under %s", name.c_str(),
+                                        instances_.directory().c_str()));
+    }
+    fs::path record = instances_.directory() / launch.bundleIdentifier / std::to_string(pid);
+    reapWhenDone(pid, record, name, std::move(statusRead), reaper);
+    log::ops().notice("launched plug-in %s as instance %d (user %u) in the %s sandbox", name.c_str(),
+                      static_cast<int>(pid), static_cast<unsigned>(uid), std::string(profile->name).c_str());
+    return LaunchedService{pid, std::move(hostEnd)};
+}
+
+}  // namespace bexil

@@ -1,0 +1,196 @@
+// The "launch" request through the real daemon and a real sandbox: a host starts a plug-in it made ready and talks
+// to it over the socket bxd hands over; the instance is recorded while it runs and reaped when it ends; nothing
+// starts without a grant of this very process, without a known profile, or without bubblewrap; and the started
+// plug-in sees only its bundle, its container and a private /tmp, and the network only under profiles that allow it.
+
+#include <gtest/gtest.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include "E2eSupport.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace test;
+
+const fs::path kHelloPlugIn = fs::path(BEXIL_BINARY_DIR) / "examples/plugins/hello-plugin";
+const fs::path kProbePlugIn = fs::path(BEXIL_BINARY_DIR) / "tests/bx_probe_plugin";
+
+// Writes `line` and a newline to `fd` and reads one line back; "(closed)" or "(timeout)" when none comes.
+std::string exchange(int fd, const std::string& line) {
+    std::string out = line + "\n";
+    if (write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) return "(closed)";
+    std::string answer;
+    char c;
+    for (;;) {
+        pollfd p{fd, POLLIN, 0};
+        if (poll(&p, 1, 10000) != 1) return "(timeout)";
+        if (read(fd, &c, 1) != 1) return "(closed)";
+        if (c == '\n') return answer;
+        answer += c;
+    }
+}
+
+class LaunchTest : public DaemonTest {
+  protected:
+    void SetUp() override {
+        if (access("/usr/bin/bwrap", X_OK) != 0) GTEST_SKIP() << "bubblewrap is not installed";
+        copyExamples({"Greeter.app"});
+        fs::copy_file(kHelloPlugIn, hello() + "/hello", fs::copy_options::overwrite_existing);
+    }
+    void startAndAdd(std::vector<std::string> more = {}) {
+        ASSERT_TRUE(start()) << bxd_.log();
+        more.insert(more.begin(), {hello(), bonjour()});
+        add(more);
+    }
+    std::string hello() const { return plugIn("Greeter.app/PlugIns/Hello.bxplugin"); }
+    std::string bonjour() const { return plugIn("Greeter.app/PlugIns/Bonjour.bxplugin"); }
+    Value uuidsOf(const std::vector<std::string>& paths) const {
+        std::vector<Value> uuids;
+        for (const std::string& path : paths) uuids.push_back(Value::uuid(registeredUuid(path).value_or(Uuid())));
+        return Value::array(std::move(uuids));
+    }
+    Value ready(TestClient& client, const std::vector<std::string>& paths) const {
+        return client.replyTo(request("ready", {{"uuids", uuidsOf(paths)}}));
+    }
+    std::pair<Value, UniqueFd> launch(TestClient& client, const std::string& path) const {
+        return client.replyWithDescriptor(request("launch", {{"uuids", uuidsOf({path})}}));
+    }
+    fs::path instanceRecord(const std::string& identifier, uint64_t pid) const {
+        return bxd_.root() / "runtime/instances" / identifier / std::to_string(pid);
+    }
+    fs::path container(const std::string& identifier) const { return bxd_.root() / "state/containers" / identifier; }
+
+    // A bundle for the probe plug-in inside Probe.app, of extension point `point`.
+    std::string makeProbe(const std::string& name, const std::string& point) {
+        fs::path app = bundles_ / "Probe.app";
+        fs::create_directories(app / "PlugIns");
+        fs::path bundle = app / "PlugIns" / (name + ".bxplugin");
+        fs::create_directories(bundle);
+        fs::copy_file(kProbePlugIn, bundle / "probe", fs::copy_options::overwrite_existing);
+        Value info = Value::dictionary(
+            {{"BDBundleIdentifier", Value::string("com.example.probe." + name)},
+             {"BDBundleExecutable", Value::string("probe")},
+             {"BDBundleVersion", Value::string("1")},
+             {"RZExtension", Value::dictionary({{"PrincipalClass", Value::string("Probe")},
+                                                {"RZExtensionPointIdentifier", Value::string(point)},
+                                                {"RZExtensionProtocol", Value::string("Probing")},
+                                                {"RZExtensionAttributes",
+                                                 Value::dictionary({{"RZExtensionVersion", Value::string("1")}})}})}});
+        EXPECT_FALSE(Document::writeFileAtomically(bundle / "Info.vrec", info));
+        EXPECT_FALSE(Document::writeFileAtomically(
+            app / "Info.vrec", Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.probe")}})));
+        return bundle.string();
+    }
+};
+
+// Guards the whole path: ready, launch, a line each way through the sandboxed example plug-in, whose HOME is its
+// data container; the instance is on record while it runs, and when the host closes its end the plug-in ends, is
+// reaped and its record removed.
+TEST_F(LaunchTest, AHostTalksToTheLaunchedPlugInWhichIsRecordedUntilItEnds) {
+    startAndAdd();
+    TestClient host;
+    ASSERT_EQ(errorCode(ready(host, {hello()})), 0) << bxd_.log();
+    auto [reply, channel] = launch(host, hello());
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    ASSERT_TRUE(channel) << "no socket came with the reply";
+    uint64_t pid = reply.get("pid").numberAsUInt64().value_or(0);
+    ASSERT_GT(pid, 0u);
+    EXPECT_TRUE(fs::exists(instanceRecord("com.example.greeter.hello", pid)));
+
+    std::string answer = exchange(channel.get(), "world");
+    EXPECT_EQ(answer.rfind("Hello, world! (plug-in pid ", 0), 0u) << answer;
+    EXPECT_NE(answer.find("home " + container("com.example.greeter.hello").string() + ")"), std::string::npos)
+        << answer;
+    EXPECT_EQ(exchange(channel.get(), "again").rfind("Hello, again!", 0), 0u);
+
+    channel.reset();
+    expectLog("plug-in com.example.greeter.hello instance " + std::to_string(pid) + " ended (exit status 0)");
+    EXPECT_FALSE(fs::exists(instanceRecord("com.example.greeter.hello", pid)));
+}
+
+// Guards the refusals, none of which starts a process: a plug-in this host never made ready, a held plug-in, an
+// unknown UUID, more than one UUID, and a plug-in whose profile is fine but whose sandbox tool is missing.
+TEST_F(LaunchTest, NothingStartsWithoutAGrantAHoldFreePlugInAndBubblewrap) {
+    setenv("BX_BWRAP", (bxd_.root() / "no-bwrap").c_str(), 1);
+    startAndAdd();
+    unsetenv("BX_BWRAP");
+    TestClient host;
+    EXPECT_EQ(errorText(launch(host, hello()).first),
+              "plug-in com.example.greeter.hello was not made ready for this host");
+    EXPECT_EQ(errorText(host.replyTo(request("launch", {{"uuids", Value::array({Value::uuid(Uuid::random())})}}))),
+              "no such plugin (uuid not found)");
+    EXPECT_EQ(errorText(host.replyTo(request("launch", {{"uuids", uuidsOf({hello(), bonjour()})}}))),
+              "invalid request format (launch takes one uuid)");
+
+    ASSERT_EQ(errorCode(ready(host, {hello()})), 0);
+    auto [missing, none] = launch(host, hello());
+    EXPECT_EQ(errorCode(missing), 4);
+    EXPECT_EQ(errorText(missing), "cannot launch com.example.greeter.hello: bubblewrap is not available (" +
+                                      (bxd_.root() / "no-bwrap").string() + ": No such file or directory)");
+    EXPECT_FALSE(none);
+
+    TestClient holder;
+    ASSERT_EQ(errorCode(holder.replyTo(
+                  request("lock", {{"paths", Value::array({Value::string(hello())})}, {"flags", Value::uint64(1)}}))),
+              0);
+    auto [held, nothing] = launch(host, hello());
+    EXPECT_EQ(errorCode(held), 11);
+    EXPECT_EQ(errorText(held), "access to plugin com.example.greeter.hello denied: the plug-in is on hold");
+    EXPECT_TRUE(fs::is_empty(bxd_.root() / "runtime") ||
+                !fs::exists(bxd_.root() / "runtime/instances/com.example.greeter.hello") ||
+                fs::is_empty(bxd_.root() / "runtime/instances/com.example.greeter.hello"));
+}
+
+// Guards confinement: the plug-in writes its container and /tmp and nothing else (not its bundle, not the
+// daemon's state, not the file system root), cannot see another plug-in's container, and reaches a port on this
+// machine's loopback only under a profile with network access ("plugin"), not under "typepad".
+TEST_F(LaunchTest, APlugInSeesOnlyItsBundleContainerAndTmpAndTheNetworkItsProfileAllows) {
+    std::string open = makeProbe("open", "com.example.probe");
+    std::string closed = makeProbe("closed", "com.quorvel.typepad-service");
+    startAndAdd({open, closed});
+    fs::create_directories(container("com.example.greeter.hello"));
+    { std::ofstream(container("com.example.greeter.hello") / "secret.txt") << "hello's secret\n"; }
+
+    int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(listen(listener, 4), 0);
+    socklen_t length = sizeof address;
+    getsockname(listener, reinterpret_cast<sockaddr*>(&address), &length);
+    const std::string port = std::to_string(ntohs(address.sin_port));
+    UniqueFd listenerOwner(listener);
+
+    TestClient host;
+    ASSERT_EQ(errorCode(ready(host, {open, closed})), 0) << bxd_.log();
+    auto [openReply, openChannel] = launch(host, open);
+    auto [closedReply, closedChannel] = launch(host, closed);
+    ASSERT_TRUE(openChannel && closedChannel) << errorText(openReply) << errorText(closedReply) << bxd_.log();
+
+    const std::string own = container("com.example.probe.open").string();
+    EXPECT_EQ(exchange(openChannel.get(), "write " + own + "/note.txt"), "ok");
+    EXPECT_EQ(slurp(own + "/note.txt"), "probe\n") << "the container is the real one, kept after the plug-in";
+    EXPECT_EQ(exchange(openChannel.get(), "write /tmp/scratch"), "ok");
+    EXPECT_FALSE(fs::exists("/tmp/scratch") && slurp("/tmp/scratch") == "probe\n") << "/tmp is private";
+    EXPECT_EQ(exchange(openChannel.get(), "env TMPDIR"), "ok " + own + "/tmp");
+    EXPECT_EQ(exchange(openChannel.get(), "write " + open + "/Info.vrec"), "error Read-only file system");
+    EXPECT_EQ(exchange(openChannel.get(), "write /escaped"), "error Read-only file system");
+    // The daemon's state directory is not there: a write to its path lands in the private /tmp, if anywhere.
+    exchange(openChannel.get(), "write " + (bxd_.root() / "state/evil").string());
+    EXPECT_FALSE(fs::exists(bxd_.root() / "state/evil"));
+    EXPECT_EQ(exchange(openChannel.get(), "read " + container("com.example.greeter.hello").string() + "/secret.txt"),
+              "error No such file or directory");
+    EXPECT_EQ(exchange(openChannel.get(), "read " + open + "/Info.vrec").rfind("ok <?xml", 0), 0u);
+    EXPECT_EQ(exchange(openChannel.get(), "connect " + port), "ok") << "the plugin profile reaches the network";
+    EXPECT_EQ(exchange(closedChannel.get(), "connect " + port).rfind("error ", 0), 0u)
+        << "the typepad profile has no network";
+    EXPECT_EQ(exchange(openChannel.get(), "uid"), "ok " + std::to_string(getuid()));
+}
+
+}  // namespace
+}  // namespace bexil
