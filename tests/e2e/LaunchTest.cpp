@@ -6,7 +6,10 @@
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
+#include <spawn.h>
 #include <sys/socket.h>
+
+#include <sstream>
 
 #include "E2eSupport.h"
 
@@ -18,6 +21,8 @@ using namespace test;
 
 const fs::path kHelloPlugIn = fs::path(BEXIL_BINARY_DIR) / "examples/plugins/hello-plugin";
 const fs::path kProbePlugIn = fs::path(BEXIL_BINARY_DIR) / "tests/bx_probe_plugin";
+const fs::path kHostClient = fs::path(BEXIL_BINARY_DIR) / "tests/bx_host_client";
+constexpr const char* kInPidNamespace = "BX_TEST_IN_PID_NAMESPACE";
 
 // Writes `line` and a newline to `fd` and reads one line back; "(closed)" or "(timeout)" when none comes.
 std::string exchange(int fd, const std::string& line) {
@@ -190,6 +195,80 @@ TEST_F(LaunchTest, APlugInSeesOnlyItsBundleContainerAndTmpAndTheNetworkItsProfil
     EXPECT_EQ(exchange(closedChannel.get(), "connect " + port).rfind("error ", 0), 0u)
         << "the typepad profile has no network";
     EXPECT_EQ(exchange(openChannel.get(), "uid"), "ok " + std::to_string(getuid()));
+}
+
+// Runs the host client with `arguments` as the next process (no shell in between, which would take a pid
+// first); its lines of output (its pid first).
+std::vector<std::string> runHost(const std::vector<std::string>& arguments, const fs::path& output) {
+    std::vector<std::string> all{kHostClient.string()};
+    all.insert(all.end(), arguments.begin(), arguments.end());
+    std::vector<char*> argv;
+    for (std::string& argument : all) argv.push_back(argument.data());
+    argv.push_back(nullptr);
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_addopen(&actions, 1, output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    posix_spawn_file_actions_adddup2(&actions, 1, 2);
+    pid_t pid = -1;
+    EXPECT_EQ(posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), environ), 0);
+    posix_spawn_file_actions_destroy(&actions);
+    int status = -1;
+    waitpid(pid, &status, 0);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << slurp(output);
+    std::vector<std::string> lines;
+    std::istringstream in(slurp(output));
+    for (std::string line; std::getline(in, line);) lines.push_back(line);
+    return lines;
+}
+
+// A host that made a plug-in ready and ended leaves nothing a later process with its pid could use. Choosing the
+// next pid needs a pid namespace of one's own, so the test runs itself again as the first process of new user and
+// pid namespaces, with the daemon inside. bubblewrap is pointed at nothing, so a launch that the grant lets
+// through answers "bubblewrap is not available" instead of starting anything.
+class LaunchGrantTest : public DaemonTest {};
+
+TEST_F(LaunchGrantTest, AGrantDiesWithItsHostAndIsNotInheritedByThePid) {
+    const std::string name = std::string(::testing::UnitTest::GetInstance()->current_test_suite()->name()) + "." +
+                             ::testing::UnitTest::GetInstance()->current_test_info()->name();
+    if (!getenv(kInPidNamespace)) {
+        const std::string namespaces = "unshare --user --map-root-user --pid --fork --mount-proc ";
+        if (std::system((namespaces + "true >/dev/null 2>&1").c_str()) != 0)
+            GTEST_SKIP() << "cannot make user and pid namespaces here";
+        fs::path output = bxd_.root() / "namespace-run.txt";
+        int status = std::system((std::string(kInPidNamespace) + "=1 " + namespaces + "'" +
+                                  fs::canonical("/proc/self/exe").string() + "' --gtest_filter=" + name + " >'" +
+                                  output.string() + "' 2>&1")
+                                     .c_str());
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << slurp(output);
+        EXPECT_NE(slurp(output).find("[  PASSED  ] 1 test"), std::string::npos) << slurp(output);
+        return;
+    }
+
+    copyExamples({"Greeter.app"});
+    setenv("BX_BWRAP", (bxd_.root() / "no-bwrap").c_str(), 1);
+    ASSERT_TRUE(start()) << bxd_.log();
+    std::string hello = plugIn("Greeter.app/PlugIns/Hello.bxplugin");
+    add({hello});
+    const std::string uuid = registeredUuid(hello)->string();
+    const std::string granted = "4 cannot launch com.example.greeter.hello: bubblewrap is not available";
+    const std::string refused = "11 plug-in com.example.greeter.hello was not made ready for this host";
+    fs::path output = bxd_.root() / "host.txt";
+
+    std::vector<std::string> first = runHost({"launch:" + uuid, "ready:" + uuid, "launch:" + uuid}, output);
+    ASSERT_EQ(first.size(), 4u);
+    EXPECT_EQ(first[1], refused) << "no grant before ready";
+    EXPECT_EQ(first[2], "0 ");
+    EXPECT_EQ(first[3].rfind(granted, 0), 0u) << "the grant lets its own host through: " << first[3];
+
+    const pid_t endedHost = std::stoi(first[0]);
+    {
+        std::ofstream next("/proc/sys/kernel/ns_last_pid");
+        next << endedHost - 1;
+    }
+    std::vector<std::string> successor = runHost({"launch:" + uuid}, output);
+    ASSERT_EQ(successor.size(), 2u);
+    ASSERT_EQ(std::stoi(successor[0]), endedHost) << "the pid was not reused";
+    EXPECT_EQ(successor[1], refused);
 }
 
 }  // namespace
