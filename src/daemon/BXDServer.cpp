@@ -138,10 +138,18 @@ bool BXDServer::holdOnPlugIn(const BXDPlugIn& plugIn) {
     });
 }
 
-void BXDServer::addHold(std::shared_ptr<BXDPlugInHold> hold) {
-    syncQueue_.sync([&] { holds_.push_back(std::move(hold)); });
+bool BXDServer::addHold(std::shared_ptr<BXDPlugInHold> hold, const BXDZemClient* placer) {
+    // A client's death is noted before its holds are released on this queue, so the check and the addition here
+    // either come before that release (which then takes the hold) or see the death.
+    bool added = syncQueue_.sync([&] {
+        if (placer != nullptr && placer->isDead()) return false;
+        holds_.push_back(std::move(hold));
+        return true;
+    });
+    if (!added) return false;
     log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
     notifyAnnotationChange();
+    return true;
 }
 
 void BXDServer::unholdToken(const Uuid& uuid) {

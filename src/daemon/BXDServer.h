@@ -74,8 +74,9 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // set of holds posts the annotation-change notification once, after leaving syncQueue.
     // holdOnPlugIn: whether some hold names the plug-in.
     bool holdOnPlugIn(const BXDPlugIn& plugIn);
-    // Appends `hold` to the holds.
-    void addHold(std::shared_ptr<BXDPlugInHold> hold);
+    // Appends `hold` to the holds, unless `placer` has already been seen to die: its holds were released then, and
+    // one added now would outlive it. Returns whether the hold was added.
+    bool addHold(std::shared_ptr<BXDPlugInHold> hold, const BXDZemClient* placer = nullptr);
     // Releases the hold with that UUID, if there is one.
     void unholdToken(const Uuid& uuid);
     // Releases every hold that `client` placed (one notification per hold); holds whose client is gone stay.

@@ -36,6 +36,8 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     // The connection is gone: releases the client's holds and stops accepting work. Runs its course once, whether
     // the connection reported the end or a request found the peer gone first.
     void dead();
+    // True once dead() has begun: from then on the client's holds are being, or have been, released.
+    bool isDead() const { return deathNoted_.load(std::memory_order_acquire); }
     // True once the peer has closed its connection, even before the connection's own queue has seen the end.
     bool peerHasHungUp() const;
 

@@ -83,9 +83,16 @@ void Transaction::lockDownPlugIns() {
     }
 
     auto placed = std::make_shared<BXDPlugInHold>(plugIns, client());
-    const std::string uuid = placed->uuid().string();
-    server()->addHold(placed);
-    reply().set(protocol::key::kUuids, Value::uuid(placed->uuid()));
+    const Uuid holdUuid = placed->uuid();
+    const std::string uuid = holdUuid.string();
+    // The server's list is the hold's only owner from here: the reply below can end the connection and release the
+    // hold at once, and its keep-alive unit must close with that release, not when this handler returns.
+    if (!server()->addHold(std::move(placed), client().get())) {
+        // The client died while its request waited: nobody is left to hold for, or to answer.
+        log::ops().debug("hold for departed client %d not placed", static_cast<int>(client()->pid()));
+        return;
+    }
+    reply().set(protocol::key::kUuids, Value::uuid(holdUuid));
 
     if (!(flags & hold::kTerminate)) {
         log::ops().info("hold request granted uuid:%{public}@", uuid);

@@ -69,6 +69,7 @@ class BxdProcess {
         return status;
     }
     bool running() const { return pid_ > 0 && waitpid(pid_, nullptr, WNOHANG) == 0; }
+    pid_t pid() const { return pid_; }
     // Sends `signal` without waiting (SIGSTOP and SIGCONT hold and release the daemon).
     void signal(int signal) const {
         if (pid_ > 0) kill(pid_, signal);
