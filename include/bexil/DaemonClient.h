@@ -73,6 +73,9 @@ class DaemonClient {
     void bulkAnnotate(const Value& annotations, Callback done);
     void hold(const std::vector<std::string>& paths, uint64_t flags, Callback done);
     void releaseHold(const Uuid& hold, Callback done);
+    // The holds in force, under "holds": per hold its "uuid", the "pid" and "executable" of its placer, "created"
+    // and "plugins" ("identifier", "uuid", "path"). Needs the manager entitlement.
+    void holds(Callback done);
     // Starts a plug-in that ready() made runnable for this process, in its sandbox; the reply carries "pid" and
     // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
     void launch(const Uuid& plugIn, Callback done);

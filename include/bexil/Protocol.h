@@ -31,8 +31,9 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch" is an extension of ours: on Linux nobody but bxd starts plug-ins (docs/protocol.md).
-enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch };
+// "launch" and "holds" are extensions of ours: on Linux nobody but bxd starts plug-ins, and administrators want to
+// see what holds plug-ins out of use (docs/protocol.md).
+enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch, Holds };
 
 struct RequestInfo {
     Request request;
@@ -42,7 +43,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 10> kRequests{{
+inline constexpr std::array<RequestInfo, 11> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -53,6 +54,7 @@ inline constexpr std::array<RequestInfo, 10> kRequests{{
     {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
     {Request::Lock, "lock", "place or release a hold on plug-ins"},
     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
+    {Request::Holds, "holds", "list the holds in force (manager only)"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -83,8 +85,9 @@ inline constexpr std::string_view kMatches = "matches";          // array of plu
 inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
 inline constexpr std::string_view kExtensions = "extensions";    // array of tokens, in an "access" reply
 inline constexpr std::string_view kPid = "pid";                  // uint64, the instance a "launch" started
+inline constexpr std::string_view kHolds = "holds";              // array of hold descriptions, in a "holds" reply
 inline constexpr std::array kList{kRequest,   kVersion, kPaths,   kUuids,     kFlags,      kRules, kAnnotations,
-                                  kErrorCode, kError,   kMatches, kConflicts, kExtensions, kPid};
+                                  kErrorCode, kError,   kMatches, kConflicts, kExtensions, kPid,   kHolds};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

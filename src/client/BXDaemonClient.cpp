@@ -134,6 +134,8 @@ void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
     sendReply(message.take(), std::move(reply));
 }
 
+void BXDaemonClient::listHoldsReply(ReplyHandler reply) { sendReply(request(Request::Holds).take(), std::move(reply)); }
+
 void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply) {
     MutableDictionary message = request(Request::Launch);
     setUuids(message, {plugIn});

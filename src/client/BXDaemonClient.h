@@ -66,6 +66,8 @@ class BXDaemonClient {
     void bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply);
     void holdPluginsFlagsReply(const Value& paths, uint64_t flags, ReplyHandler reply);
     void releaseHoldReply(const Uuid& hold, ReplyHandler reply);
+    // The holds in force (needs the manager entitlement).
+    void listHoldsReply(ReplyHandler reply);
     // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
     void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
 

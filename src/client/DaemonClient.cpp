@@ -97,6 +97,7 @@ void DaemonClient::hold(const std::vector<std::string>& paths, uint64_t flags, C
 void DaemonClient::releaseHold(const Uuid& hold, Callback done) {
     impl_->client.releaseHoldReply(hold, adapt(std::move(done)));
 }
+void DaemonClient::holds(Callback done) { impl_->client.listHoldsReply(adapt(std::move(done))); }
 void DaemonClient::launch(const Uuid& plugIn, Callback done) {
     impl_->client.launchPlugInReply(plugIn, [done = std::move(done)](const std::variant<ZemMessage, ZemError>& raw) {
         if (!done) return;

@@ -1,11 +1,17 @@
 #include "daemon/BXDPlugInHold.h"
 
+#include "daemon/BXDZemClient.h"
+
 namespace bexil {
 
 std::atomic<size_t> BXDPlugInHold::openUnits_{0};
 
 BXDPlugInHold::BXDPlugInHold(std::vector<std::shared_ptr<BXDPlugIn>> plugIns, std::weak_ptr<BXDZemClient> client)
     : uuid_(Uuid::random()), created_(Date::now()), client_(std::move(client)) {
+    if (std::shared_ptr<BXDZemClient> owner = client_.lock()) {
+        ownerPid_ = owner->pid();
+        ownerExecutable_ = owner->path();
+    }
     for (std::shared_ptr<BXDPlugIn>& plugIn : plugIns) {
         if (plugIn && !blocks(*plugIn)) blocked_.push_back(std::move(plugIn));
     }

@@ -4,9 +4,12 @@
 // not made ready. Made by the "lock" request, owned by the server's hold list (read and written only inside the
 // server's syncQueue), and released by its UUID or when its client dies. Immutable after creation.
 
+#include <sys/types.h>
+
 #include <atomic>
 #include <cstddef>
 #include <memory>
+#include <string>
 #include <vector>
 
 #include "base/Value.h"
@@ -28,6 +31,9 @@ class BXDPlugInHold {
     // The hold's identity, handed to the client; two holds are the same hold when their UUIDs are equal.
     const Uuid& uuid() const { return uuid_; }
     const Date& created() const { return created_; }
+    // Who placed the hold, as it was when the hold was placed (for listings; the client may be gone since).
+    pid_t ownerPid() const { return ownerPid_; }
+    const std::string& ownerExecutable() const { return ownerExecutable_; }
     // Whether `client` placed this hold. A hold whose client object is gone belongs to nobody: it stays until it
     // is released by its UUID.
     bool placedBy(const BXDZemClient* client) const;
@@ -49,6 +55,8 @@ class BXDPlugInHold {
     Uuid uuid_;
     Date created_;
     std::weak_ptr<BXDZemClient> client_;
+    pid_t ownerPid_ = 0;
+    std::string ownerExecutable_;
     std::vector<std::shared_ptr<BXDPlugIn>> blocked_;
 };
 

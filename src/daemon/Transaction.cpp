@@ -49,6 +49,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::BulkAnnotate, &Transaction::bulkAnnotatePlugIns},
     {Request::Lock, &Transaction::lockDownPlugIns},
     {Request::Launch, &Transaction::launchPlugIn},
+    {Request::Holds, &Transaction::listHolds},
 }};
 
 constexpr bool handlersFollowTheProtocol() {

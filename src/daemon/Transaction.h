@@ -85,6 +85,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void bulkAnnotatePlugIns();
     void lockDownPlugIns();
     void launchPlugIn();
+    void listHolds();
 
   private:
     void runHandler(protocol::Request request);

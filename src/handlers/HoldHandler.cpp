@@ -109,4 +109,33 @@ void Transaction::lockDownPlugIns() {
     });
 }
 
+// "holds", an extension of ours: what holds plug-ins out of use, for administrators. Each hold is described by its
+// UUID, the pid and executable of the client that placed it (as they were then), when, and its plug-ins.
+void Transaction::listHolds() {
+    if (!client()->hasEntitlement(protocol::kManagerEntitlement)) {
+        log::ops().notice("client %d may not list holds: it lacks the manager entitlement",
+                          static_cast<int>(client()->pid()));
+        fail(ErrorCode::NotAllowed, "caller lacks entitlement for this operation");
+        return;
+    }
+    MutableArray holds;
+    server()->syncQueue().sync([&] {
+        for (const std::shared_ptr<BXDPlugInHold>& hold : server()->holds()) {
+            MutableArray plugIns;
+            for (const std::shared_ptr<BXDPlugIn>& plugIn : hold->blocked())
+                plugIns.append(
+                    Value::dictionary({{"identifier", Value::string(plugIn->identifier().value_or(""))},
+                                       {"uuid", plugIn->uuid() ? Value::uuid(*plugIn->uuid()) : Value::null()},
+                                       {"path", Value::string(plugIn->path().value_or(""))}}));
+            holds.append(Value::dictionary({{"uuid", Value::uuid(hold->uuid())},
+                                            {"pid", Value::uint64(static_cast<uint64_t>(hold->ownerPid()))},
+                                            {"executable", Value::string(hold->ownerExecutable())},
+                                            {"created", Value::date(hold->created())},
+                                            {"plugins", plugIns.take()}}));
+        }
+    });
+    reply().set(protocol::key::kHolds, holds.take());
+    done();
+}
+
 }  // namespace bexil

@@ -225,5 +225,34 @@ TEST_F(HoldTest, AHoldDiesWithAClientKilledAtAnyMoment) {
 #endif
 }
 
+// Guards the listing of holds: only a manager may see them; each hold shows its UUID, who placed it (pid and
+// executable, kept after that client is gone), when, and its plug-ins; the tool prints them as a table.
+TEST_F(HoldTest, HoldsAreListedForManagersWithTheirPlacerAndPlugIns) {
+    expectFailure(request("holds"), 11, "caller lacks entitlement for this operation");
+    Value placed = hold(lockRequest({plugIn("Greeter.app")}, 0));
+    grantSelfManager();
+    Value listed = succeed(request("holds"));
+    ASSERT_EQ(listed.get("holds").count(), 1u) << listed.description();
+    const Value entry = listed.get("holds").items()[0];
+    EXPECT_EQ(entry.get("uuid"), placed.get("uuids"));
+    EXPECT_EQ(entry.get("pid").numberAsUInt64(), static_cast<uint64_t>(getpid()));
+    EXPECT_EQ(entry.get("executable").stringView(), fs::canonical("/proc/self/exe").string());
+    ASSERT_TRUE(entry.get("created").getDate());
+    EXPECT_LT(Date::now().secondsSince1970 - entry.get("created").getDate()->secondsSince1970, 60.0);
+    std::vector<std::string> held;
+    for (const Value& plugIn : entry.get("plugins").items()) held.emplace_back(plugIn.get("identifier").stringView());
+    std::sort(held.begin(), held.end());
+    EXPECT_EQ(held, (std::vector<std::string>{kBonjour, kHello})) << "the registered plug-ins of the application";
+
+    grant(fs::path(BEXIL_BINARY_DIR) / "tools/bexil/bexil",
+          Value::dictionary({{kManagerEntitlement, Value::boolean(true)}}), "tool");
+    Outcome table = bexil("holds");
+    EXPECT_EQ(table.status, 0) << table.err;
+    EXPECT_NE(table.out.find(placed.get("uuids").getUuid()->string() + "  " +
+                             std::to_string(getpid()).insert(0, 7 - std::to_string(getpid()).size(), ' ')),
+              std::string::npos)
+        << table.out;
+}
+
 }  // namespace
 }  // namespace bexil

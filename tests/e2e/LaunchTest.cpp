@@ -197,6 +197,17 @@ TEST_F(LaunchTest, APlugInSeesOnlyItsBundleContainerAndTmpAndTheNetworkItsProfil
     EXPECT_EQ(exchange(openChannel.get(), "uid"), "ok " + std::to_string(getuid()));
 }
 
+// Guards the tool: "bexil launch" makes the plug-in ready for itself and launches it in one process (a grant
+// would not outlive a separate "bexil ready"), says each --say line and prints the plug-in's answers.
+TEST_F(LaunchTest, TheToolLaunchesAndTalksToThePlugIn) {
+    startAndAdd();
+    Outcome run = bexil("launch " + registeredUuid(hello())->string() + " --say world --say again");
+    EXPECT_EQ(run.status, 0) << run.err << bxd_.log();
+    EXPECT_EQ(run.out.rfind("Hello, world! (plug-in pid ", 0), 0u) << run.out;
+    EXPECT_NE(run.out.find("\nHello, again! "), std::string::npos) << run.out;
+    EXPECT_EQ(run.err.rfind("bexil: plug-in instance ", 0), 0u) << run.err;
+}
+
 // Runs the host client with `arguments` as the next process (no shell in between, which would take a pid
 // first); its lines of output (its pid first).
 std::vector<std::string> runHost(const std::vector<std::string>& arguments, const fs::path& output) {

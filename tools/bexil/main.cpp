@@ -3,11 +3,15 @@
 // Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 69 when bxd is not running,
 // 70 for a reply the tool cannot read, 75 when bxd did not answer in time.
 
+#include <poll.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <csignal>
 #include <cstdio>
 #include <filesystem>
+#include <future>
 #include <iostream>
 #include <string>
 #include <vector>
@@ -150,6 +154,52 @@ int printHold(const Options& options, BXDaemonClient&, const Value& message) {
     return 0;
 }
 
+// Blocks until the tool is asked to stop (SIGINT, SIGTERM or SIGHUP); returns the signal.
+int waitForStopSignal() {
+    sigset_t stops;
+    sigemptyset(&stops);
+    for (int stop : {SIGINT, SIGTERM, SIGHUP}) sigaddset(&stops, stop);
+    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+    int received = 0;
+    sigwait(&stops, &received);
+    return received;
+}
+
+std::string ageText(double seconds) {
+    long whole = seconds < 0 ? 0 : static_cast<long>(seconds);
+    if (whole < 120) return std::to_string(whole) + "s";
+    if (whole < 7200) return std::to_string(whole / 60) + "m";
+    if (whole < 172800) return std::to_string(whole / 3600) + "h";
+    return std::to_string(whole / 86400) + "d";
+}
+
+int printHolds(const Options& options, BXDaemonClient&, const Value& message) {
+    const Value holds = message.get(protocol::key::kHolds);
+    if (options.json) {
+        std::printf("%s\n", toJson(holds).c_str());
+        return 0;
+    }
+    if (holds.count() == 0) {
+        std::printf("no holds\n");
+        return 0;
+    }
+    const double now = Date::now().secondsSince1970;
+    std::printf("%-36s  %7s  %5s  %-30s  %s\n", "HOLD", "PID", "AGE", "EXECUTABLE", "PLUG-INS");
+    for (const Value& hold : holds.items()) {
+        std::string plugIns;
+        for (const Value& plugIn : hold.get("plugins").items())
+            plugIns += (plugIns.empty() ? "" : ", ") + std::string(plugIn.get("identifier").stringView());
+        std::optional<Date> created = hold.get("created").getDate();
+        const Uuid* uuid = hold.get("uuid").getUuid();
+        std::string executable(hold.get("executable").stringView());
+        std::printf("%-36s  %7llu  %5s  %-30s  %s\n", uuid ? uuid->string().c_str() : "-",
+                    static_cast<unsigned long long>(hold.get("pid").numberAsUInt64().value_or(0)),
+                    created ? ageText(now - created->secondsSince1970).c_str() : "-",
+                    executable.empty() ? "-" : executable.c_str(), plugIns.empty() ? "(none)" : plugIns.c_str());
+    }
+    return 0;
+}
+
 int printExtensions(const Options& options, BXDaemonClient&, const Value& message) {
     if (options.json) {
         std::printf("%s\n", toJson(message).c_str());
@@ -220,7 +270,8 @@ struct Arguments {
     std::string file, setFile;
     uint64_t flags = 0;
     int64_t election = -1;
-    bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false;
+    bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false, wait = false;
+    std::vector<std::string> say;
 };
 
 using Printer = std::function<int(BXDaemonClient&, const Value&)>;
@@ -342,7 +393,132 @@ int holdCommand(const Options& options, Arguments& arguments) {
                          (arguments.terminate ? protocol::hold::kTerminate : 0);
     return roundTrip(
         options, "hold", [&](BXDaemonClient& c, auto h) { c.holdPluginsFlagsReply(*array, holdFlags, h); },
-        [&](BXDaemonClient& c, const Value& m) { return printHold(options, c, m); });
+        [&](BXDaemonClient& c, const Value& m) {
+            int status = printHold(options, c, m);
+            if (status != 0 || !arguments.wait) return status;
+            // The hold lives with this connection: keep it open until asked to stop.
+            std::fflush(stdout);
+            std::fprintf(stderr, "bexil: holding until interrupted\n");
+            waitForStopSignal();
+            std::fprintf(stderr, "bexil: releasing the hold\n");
+            return 0;
+        });
+}
+
+int holdsCommand(const Options& options, Arguments&) {
+    return roundTrip(
+        options, "holds", [](BXDaemonClient& c, auto h) { c.listHoldsReply(h); },
+        [&](BXDaemonClient& c, const Value& m) { return printHolds(options, c, m); });
+}
+
+// Writes everything to `fd`; false when the other end is gone.
+bool writeAll(int fd, std::string_view text) {
+    while (!text.empty()) {
+        ssize_t n = write(fd, text.data(), text.size());
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return false;
+        text.remove_prefix(static_cast<size_t>(n));
+    }
+    return true;
+}
+
+// Reads one line (without its newline) from `fd`; none at the end of the stream.
+std::optional<std::string> readLine(int fd) {
+    std::string line;
+    char c;
+    for (;;) {
+        ssize_t n = read(fd, &c, 1);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return line.empty() ? std::nullopt : std::optional<std::string>(line);
+        if (c == '\n') return line;
+        line += c;
+    }
+}
+
+// Copies standard input to the plug-in and the plug-in's output to standard output until the plug-in ends.
+void relay(int plugIn) {
+    bool inputOpen = true;
+    char buffer[4096];
+    for (;;) {
+        pollfd watched[2] = {{plugIn, POLLIN, 0}, {inputOpen ? 0 : -1, POLLIN, 0}};
+        if (poll(watched, 2, -1) < 0) {
+            if (errno == EINTR) continue;
+            return;
+        }
+        if (watched[0].revents != 0) {
+            ssize_t n = read(plugIn, buffer, sizeof buffer);
+            if (n <= 0) return;
+            if (!writeAll(1, std::string_view(buffer, static_cast<size_t>(n)))) return;
+        }
+        if (inputOpen && watched[1].revents != 0) {
+            ssize_t n = read(0, buffer, sizeof buffer);
+            if (n <= 0) {
+                inputOpen = false;
+                shutdown(plugIn, SHUT_WR);  // tells the plug-in that nothing more is coming
+            } else if (!writeAll(plugIn, std::string_view(buffer, static_cast<size_t>(n)))) {
+                return;
+            }
+        }
+    }
+}
+
+// Makes the plug-in ready for this process, launches it and talks to it: each --say line is sent and its answer
+// printed, or without --say standard input is relayed to it and its output to standard output.
+int launchCommand(const Options& options, Arguments& arguments) {
+    auto list = parseUuids(arguments.uuids);
+    if (!list) return usageFailure(list.error());
+    // The grant belongs to this process, so ready and launch must both come from it.
+    if (int status =
+            roundTrip(options, "ready", [&](BXDaemonClient& c, auto h) { c.readyPlugInsFlagsReply(*list, 0, h); }, {});
+        status != 0)
+        return status;
+    BXDaemonClient client(options.service.c_str());
+    auto answer = std::make_shared<std::promise<std::variant<ZemMessage, ZemError>>>();
+    client.launchPlugInReply(list->front(),
+                             [answer](const std::variant<ZemMessage, ZemError>& reply) { answer->set_value(reply); });
+    auto future = answer->get_future();
+    if (future.wait_for(std::chrono::milliseconds(static_cast<int64_t>(options.timeoutSeconds * 1000))) !=
+        std::future_status::ready) {
+        std::fprintf(stderr, "bexil: bxd did not answer launch within %g seconds\n", options.timeoutSeconds);
+        return kExitTimeout;
+    }
+    std::variant<ZemMessage, ZemError> reply = future.get();
+    if (std::holds_alternative<ZemError>(reply)) {
+        std::fprintf(stderr, "bexil: bxd is not running on service %s\n", options.service.c_str());
+        return kExitUnavailable;
+    }
+    const ZemMessage& message = std::get<ZemMessage>(reply);
+    if (std::optional<Error> error = BXDaemonClient::errorInReply(BXDaemonClient::Reply(message.body()))) {
+        std::fprintf(stderr, "bexil: launch failed (code %lld): %s\n", static_cast<long long>(error->code()),
+                     error->localizedDescription().value_or("").c_str());
+        return exitStatusForCode(error->code());
+    }
+    if (message.descriptorCount() != 1) {
+        std::fprintf(stderr, "bexil: launch answered without a socket to the plug-in\n");
+        return kExitSoftware;
+    }
+    const int plugIn = message.descriptor(0);
+    const uint64_t pid = message.body().get(protocol::key::kPid).numberAsUInt64().value_or(0);
+    if (options.json)
+        std::printf("%s\n", toJson(message.body()).c_str());
+    else
+        std::fprintf(stderr, "bexil: plug-in instance %llu started\n", static_cast<unsigned long long>(pid));
+    std::fflush(stdout);
+    if (arguments.say.empty()) {
+        relay(plugIn);
+        std::fprintf(stderr, "bexil: plug-in instance %llu ended\n", static_cast<unsigned long long>(pid));
+        return 0;
+    }
+    for (const std::string& line : arguments.say) {
+        if (!writeAll(plugIn, line + "\n")) break;
+        std::optional<std::string> heard = readLine(plugIn);
+        if (!heard) {
+            std::fprintf(stderr, "bexil: the plug-in ended without answering\n");
+            return kExitSoftware;
+        }
+        std::printf("%s\n", heard->c_str());
+    }
+    return 0;
 }
 
 int releaseCommand(const Options& options, Arguments& arguments) {
@@ -389,6 +565,14 @@ const Subcommand kSubcommands[] = {
      },
      matchCommand},
     {"ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...", uuidsArgument, readyCommand},
+    {"launch",
+     "make a plug-in ready for this command and start it in its sandbox, then talk to it\n  example: bexil launch "
+     "2F1C... --say world",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("uuid", a.uuids, "the plug-in's UUID")->required()->expected(1);
+         c.add_option("--say", a.say, "send this line and print the answer (repeatable); else relay standard input");
+     },
+     launchCommand},
     {"access", "get read access tokens for plug-in bundles\n  example: bexil access 2F1C...", uuidsArgument,
      accessCommand},
     {"annotate", "set annotations of plug-ins\n  example: bexil annotate --election 1 --extension ext.json 2F1C...",
@@ -414,8 +598,11 @@ const Subcommand kSubcommands[] = {
          c.add_flag("--plugin-paths", a.plugInPaths, "the paths name plug-in bundles, not applications");
          c.add_flag("--refuse-busy", a.refuseBusy, "refuse the hold when a plug-in is busy");
          c.add_flag("--terminate", a.terminate, "terminate running instances once the hold is placed");
+         c.add_flag("--wait", a.wait, "keep the hold until interrupted (it ends with this command)");
      },
      holdCommand},
+    {"holds", "list the holds in force (needs the manager entitlement)\n  example: bexil holds",
+     [](CLI::App&, Arguments&) {}, holdsCommand},
     {"release", "release a hold\n  example: bexil release 7A0E...",
      [](CLI::App& c, Arguments& a) { c.add_option("uuid", a.uuids, "the hold's UUID")->required()->expected(1); },
      releaseCommand},
