@@ -115,6 +115,12 @@ TEST_F(HoldTest, PathProblemsRefuseTheHold) {
     expectFailure(request("lock", {{"flags", Value::uint64(0)}}), 4, "invalid request format");
     EXPECT_TRUE(discovered(kHello)) << "the walk stopped: no hold over the paths before the bad one";
     EXPECT_EQ(posted(), before);
+
+    // Both lists empty: an empty release releases nothing, an empty hold holds nothing; both succeed.
+    EXPECT_EQ(succeed(request("lock", {{"uuids", Value::emptyArray()}})).count(), 0u);
+    EXPECT_TRUE(
+        hold(request("lock", {{"paths", Value::emptyArray()}, {"flags", Value::uint64(0)}})).get("uuids").isUuid());
+    EXPECT_TRUE(discovered(kHello) && discovered(kBonjour));
 }
 
 // Guards refusing busy plug-ins: with 0x2, each busy plug-in adds its description to "conflicts", in the order of

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
@@ -7,6 +8,7 @@
 #include "TestSupport.h"
 #include "platform/sandbox/ProcessSandbox.h"
 #include "platform/sandbox/SandboxExtensions.h"
+#include "platform/sandbox/SandboxProfiles.h"
 
 namespace bexil {
 namespace {
@@ -139,6 +141,45 @@ TEST_F(SandboxExtensionsTest, MissingPathsAndBadClassesGetNoToken) {
     EXPECT_EQ(errno, EINVAL);
     EXPECT_FALSE(issuer.issueFileExtension(SandboxExtensions::kReadOnlyClass, std::string("/tmp\0x", 6)));
     EXPECT_FALSE(fs::exists(keyPath())) << "no key is made before a token is issued";
+}
+
+// The arguments of one option followed by its operands, found anywhere in `args`.
+bool hasSequence(const std::vector<std::string>& args, const std::vector<std::string>& sequence) {
+    return std::search(args.begin(), args.end(), sequence.begin(), sequence.end()) != args.end();
+}
+
+// Guards what a profile may do: only the network profiles share the host's network and see its name-service
+// files; every profile drops capabilities, shows the bundle read-only and the container read-write, makes the root
+// read-only after the mounts, clears the environment and runs exactly the executable; unknown names are refused.
+TEST(SandboxProfiles, ProfilesDifferInNetworkOnlyAndConfineAlike) {
+    EXPECT_EQ(SandboxProfiles::named("no-such-profile"), nullptr);
+    SandboxProfiles::Launch launch{"/apps/A.app/PlugIns/P.bxplugin",
+                                   "/state/containers/p",
+                                   "/apps/A.app/PlugIns/P.bxplugin/p",
+                                   {{"HOME", "/state/containers/p"}},
+                                   4};
+    for (const char* name : {"plugin", "typepad", "netguard-filter", "peekviewd", "sketchpad-devtools"}) {
+        const SandboxProfile* profile = SandboxProfiles::named(name);
+        ASSERT_NE(profile, nullptr) << name;
+        std::vector<std::string> args = SandboxProfiles::bubblewrapArguments(*profile, launch);
+        const bool network = std::string_view(name) != "typepad" && std::string_view(name) != "peekviewd";
+        EXPECT_EQ(profile->network, network) << name;
+        EXPECT_EQ(std::count(args.begin(), args.end(), "--share-net"), network ? 1 : 0) << name;
+        EXPECT_EQ(hasSequence(args, {"--ro-bind-try", "/etc/resolv.conf", "/etc/resolv.conf"}), network) << name;
+        EXPECT_TRUE(hasSequence(args, {"--unshare-all", "--cap-drop", "ALL"})) << name;
+        EXPECT_TRUE(hasSequence(args, {"--ro-bind", launch.bundle, launch.bundle})) << name;
+        EXPECT_TRUE(hasSequence(args, {"--bind", *launch.container, *launch.container})) << name;
+        EXPECT_TRUE(hasSequence(args, {"--tmpfs", "/tmp"})) << name;
+        EXPECT_TRUE(hasSequence(args, {"--clearenv", "--setenv", "HOME", "/state/containers/p"})) << name;
+        // The root is made read-only after every mount, or a later mount would go back to a writable root.
+        auto readOnlyRoot = std::find(args.begin(), args.end(), "--remount-ro");
+        auto lastBind = std::find(args.rbegin(), args.rend(), "--bind");
+        ASSERT_NE(readOnlyRoot, args.end());
+        EXPECT_GT(readOnlyRoot - args.begin(), args.rend() - lastBind - 1) << name;
+        EXPECT_TRUE(hasSequence(args, {"--json-status-fd", "4", "--", launch.executable})) << name;
+        EXPECT_EQ(args.back(), launch.executable) << name;
+        EXPECT_EQ(std::count(args.begin(), args.end(), "/"), 1) << "nothing binds the whole root: " << name;
+    }
 }
 
 }  // namespace
