@@ -3,6 +3,7 @@
 // starts without a grant of this very process, without a known profile, or without bubblewrap; and the started
 // plug-in sees only its bundle, its container and a private /tmp, and the network only under profiles that allow it.
 
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -169,6 +170,36 @@ TEST_F(LaunchTest, AHostThatLeavesDuringALaunchLeavesNoInstance) {
     EXPECT_EQ(bxd_.countInLog("launched plug-in com.example.greeter.hello"),
               bxd_.countInLog("plug-in com.example.greeter.hello instance "))
         << "every instance started was reaped";
+}
+
+// Guards the user a plug-in runs as: a host that is not root gets a plug-in running as its own user, never as
+// root, even though bxd runs as root; the plug-in's container becomes that user's.
+TEST_F(LaunchTest, APlugInRunsAsItsHostsUserNeverAsRoot) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to run a host as another user";
+    std::string probe = makeProbe("user", "com.example.probe");
+    // The host is another user: it must reach the socket and the plug-in its bundle.
+    fs::permissions(bxd_.root(), fs::perms(0755));
+    startAndAdd({probe});
+    const std::string uuid = registeredUuid(probe)->string();
+    fs::path output = bxd_.root() / "host-nobody.txt";
+    pid_t host = fork();
+    if (host == 0) {
+        int out = open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        if (out < 0 || dup2(out, 1) < 0 || dup2(out, 2) < 0 || setgroups(0, nullptr) != 0 ||
+            setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0)
+            _exit(125);
+        execl(kHostClient.c_str(), kHostClient.c_str(), ("ready:" + uuid).c_str(), ("launch:" + uuid).c_str(),
+              "say:uid", nullptr);
+        _exit(127);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(host, &status, 0), host);
+    std::string text = slurp(output);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << text;
+    EXPECT_NE(text.find("\n0 \n0 \nok 65534\n"), std::string::npos) << text << bxd_.log();
+    struct stat owner {};
+    ASSERT_EQ(stat(container("com.example.probe.user").c_str(), &owner), 0);
+    EXPECT_EQ(owner.st_uid, 65534u);
 }
 
 // Guards confinement: the plug-in writes its container and /tmp and nothing else (not its bundle, not the

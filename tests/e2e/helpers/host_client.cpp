@@ -1,34 +1,85 @@
-// A host for end-to-end tests that need hosts in processes of their own: for each argument "ready:UUID" or
-// "launch:UUID", in order, sends that request and prints "CODE TEXT" of the reply (0 and nothing on success), one
-// line each, after a first line with its own pid. Each request goes on its own connection, as separate programs'
-// would; the grant of "ready" belongs to this process, whichever connection asked.
+// A host for end-to-end tests that need hosts in processes of their own: for each argument, in order,
+// "ready:UUID" or "launch:UUID" sends that request and prints "CODE TEXT" of the reply (0 and nothing on success),
+// and "say:TEXT" sends TEXT as a line to the plug-in launched last and prints its one-line answer. The first line
+// printed is the host's own pid. Each request goes on its own connection, as separate programs' would; the grant
+// of "ready" belongs to this process, whichever connection asked.
 
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <cstdio>
+#include <future>
 #include <string>
 
-#include "OneRequest.h"
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
+#include "base/UniqueFd.h"
+#include "platform/zem/ZemConnection.h"
+
+namespace {
+
+using namespace bexil;
+
+// The reply and a copy of the descriptor it passed, if any; none without a reply within ten seconds.
+std::optional<std::pair<Value, UniqueFd>> requestOnce(const Value& request) {
+    EventLoop loop(1);
+    SerialQueue queue("host_client", loop);
+    auto connection = ZemConnection::createClient("com.quorvel.bexil.bxd", queue);
+    connection->setEventHandler([](const ZemConnection::Event&) {});
+    connection->resume();
+    auto promise = std::make_shared<std::promise<std::variant<ZemMessage, ZemError>>>();
+    connection->sendWithMessageReply(
+        request, queue, [promise](const std::variant<ZemMessage, ZemError>& reply) { promise->set_value(reply); });
+    auto future = promise->get_future();
+    bool answered = future.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
+    connection->cancel();
+    if (!answered) return std::nullopt;
+    auto reply = future.get();
+    const auto* message = std::get_if<ZemMessage>(&reply);
+    if (message == nullptr) return std::nullopt;
+    UniqueFd descriptor(message->descriptorCount() > 0 ? fcntl(message->descriptor(0), F_DUPFD_CLOEXEC, 0) : -1);
+    return std::pair<Value, UniqueFd>(message->body(), std::move(descriptor));
+}
+
+std::string exchange(int fd, const std::string& line) {
+    std::string out = line + "\n";
+    if (write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) return "(closed)";
+    std::string answer;
+    char c;
+    while (read(fd, &c, 1) == 1 && c != '\n') answer += c;
+    return answer;
+}
+
+}  // namespace
 
 int main(int argc, char** argv) {
-    using namespace bexil;
     printf("%d\n", static_cast<int>(getpid()));
+    UniqueFd plugIn;
     for (int i = 1; i < argc; ++i) {
         std::string argument = argv[i];
         size_t colon = argument.find(':');
-        std::optional<Uuid> uuid = colon == std::string::npos ? std::nullopt : Uuid::parse(argument.substr(colon + 1));
-        if (!uuid) {
-            fprintf(stderr, "host_client: expected ready:UUID or launch:UUID, not %s\n", argument.c_str());
+        std::string verb = argument.substr(0, colon),
+                    rest = colon == std::string::npos ? "" : argument.substr(colon + 1);
+        if (verb == "say") {
+            printf("%s\n", plugIn ? exchange(plugIn.get(), rest).c_str() : "(nothing launched)");
+            continue;
+        }
+        std::optional<Uuid> uuid = Uuid::parse(rest);
+        if ((verb != "ready" && verb != "launch") || !uuid) {
+            fprintf(stderr, "host_client: expected ready:UUID, launch:UUID or say:TEXT, not %s\n", argv[i]);
             return 64;
         }
-        std::optional<Value> reply =
-            test::sendOneRequest("host_client", "com.quorvel.bexil.bxd",
-                                 Value::dictionary({{"request", Value::string(argument.substr(0, colon))},
+        auto reply = requestOnce(Value::dictionary({{"request", Value::string(verb)},
                                                     {"version", Value::uint64(3)},
                                                     {"uuids", Value::array({Value::uuid(*uuid)})}}));
-        if (!reply) return 2;
-        printf("%lld %s\n", static_cast<long long>(reply->get("errorcode").numberAsInt64().value_or(0)),
-               std::string(reply->get("error").stringView()).c_str());
+        if (!reply) {
+            fprintf(stderr, "host_client: no reply\n");
+            return 2;
+        }
+        printf("%lld %s\n", static_cast<long long>(reply->first.get("errorcode").numberAsInt64().value_or(0)),
+               std::string(reply->first.get("error").stringView()).c_str());
+        if (reply->second) plugIn = std::move(reply->second);
+        fflush(stdout);
     }
     return 0;
 }
