@@ -103,6 +103,12 @@ bool BXDZemClient::peerHasHungUp() const {
     return !connection || connection->peerHasHungUp();
 }
 
+int BXDZemClient::pidfd() const {
+    std::shared_ptr<ZemConnection> connection = connection_.lock();
+    if (!connection || !connection->peerCredentials().pidfd) return -1;
+    return connection->peerCredentials().pidfd->get();
+}
+
 pid_t BXDZemClient::pid() const {
     std::shared_ptr<ZemConnection> connection = connection_.lock();
     return connection ? connection->peerPid() : 0;

@@ -54,6 +54,8 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     pid_t pid() const override;
     // The peer's executable path; empty when it could not be found.
     const std::string& path() const override { return path_; }
+    // The pidfd the transport took when the peer connected; -1 when there is none or the connection is gone.
+    int pidfd() const override;
     // The bundle that contains the peer's executable; null when there is none.
     const std::shared_ptr<BXBundle>& bundle() const { return bundle_; }
     bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }

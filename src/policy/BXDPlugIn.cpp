@@ -280,7 +280,8 @@ std::optional<Error> BXDPlugIn::enableForClient(const HostAccessClient& client,
     }
 
     log::ops().debug("activation overlay=%@", activation);
-    if (int error = services.serviceManager.addExternalService(client.pid(), *executable, activation); error != 0) {
+    if (int error = services.serviceManager.addExternalService(client.pid(), *executable, activation, client.pidfd());
+        error != 0) {
         log::ops().error("jobard error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", error,
                          static_cast<int>(client.pid()), client.path(), identifier, version, uuidText, path());
         return BXError(ErrorCode::OperationFailed,

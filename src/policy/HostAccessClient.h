@@ -24,6 +24,9 @@ class HostAccessClient {
     virtual pid_t pid() const = 0;
     // The host's executable path; empty when it could not be found.
     virtual const std::string& path() const = 0;
+    // A pidfd that pins the host process since it connected (borrowed), or -1 when there is none; grants made to
+    // the host are tied to it rather than to a pid that another process could get later.
+    virtual int pidfd() const { return -1; }
 };
 
 }  // namespace bexil

@@ -1,5 +1,6 @@
 #include "platform/jobard/ServiceManager.h"
 
+#include <fcntl.h>
 #include <poll.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -79,10 +80,12 @@ struct ServiceManager::Grants {
 ServiceManager::ServiceManager(InstanceRecords instances)
     : instances_(std::move(instances)), grants_(std::make_shared<Grants>()) {}
 
-int ServiceManager::addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay) {
+int ServiceManager::addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay,
+                                       int hostPidfd) {
     if (executablePath.empty() || hostPid <= 0) return EINVAL;
-    UniqueFd host(pidfdOpen(hostPid));
+    UniqueFd host(hostPidfd >= 0 ? fcntl(hostPidfd, F_DUPFD_CLOEXEC, 0) : pidfdOpen(hostPid));
     if (!host) return errno;
+    if (hasExited(host.get())) return ESRCH;
     std::lock_guard lock(grants_->mutex);
     grants_->prune();
     size_t ofHost = 0;
