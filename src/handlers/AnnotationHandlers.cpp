@@ -23,9 +23,9 @@ constexpr std::string_view kAnnotationsKey = protocol::key::kAnnotations;
 constexpr std::string_view kElectionKey = protocol::annotation::kElection;
 constexpr std::string_view kExtensionKey = protocol::annotation::kExtension;
 
-// An election must be numeric. A boolean is not accepted: the stored election is compared as a number by readers,
-// and "true" would silently read back as the automatic election.
-bool isElectionNumber(const Value& value) { return value.isNumber() && !value.isBool(); }
+// An election must be a number. Booleans are numbers here, as everywhere a value is read as one: a stored true is
+// read back as the election 1, false as 0; only values of other kinds are refused.
+bool isElectionNumber(const Value& value) { return value.isNumber(); }
 
 std::string uuidText(const BXDPlugIn& plugIn) {
     std::optional<Uuid> uuid = plugIn.uuid();

@@ -144,6 +144,22 @@ TEST_F(AnnotationTest, MalformedRequestsAreRefusedAndPartialFailuresPostNothing)
     EXPECT_EQ(notifications(), 0u);
 }
 
+// Guards the kinds an election may have: every number kind, booleans included, is stored and read back by
+// discovery's election rule as the number it stands for; a string is refused (above).
+TEST_F(AnnotationTest, ElectionsOfEveryNumberKindAreReadAsTheirNumber) {
+    auto electedAs = [&](const std::string& value) {
+        Value rules = Value::dictionary(
+            {{"RZExtensionIdentifier", Value::string(kHelloKey)}, {"RZUserElection", Value::string(value)}});
+        return identifiers(succeed(matchRequest(rules))) == Ids{kHelloKey};
+    };
+    const std::pair<Value, const char*> kinds[] = {
+        {Value::boolean(true), "1"}, {Value::uint64(2), "2"}, {Value::real(3.0), "3"}, {Value::boolean(false), "0"}};
+    for (const auto& [value, number] : kinds) {
+        succeed(annotateRequest(Value::dictionary({{"election", value}}), {hello_}));
+        EXPECT_TRUE(electedAs(number)) << value.description() << " is not read as " << number;
+    }
+}
+
 // Guards the frame limit on the reply side: annotations that fit one request each but together make a discovery
 // reply larger than a frame give an error reply, and the connection stays usable.
 TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
