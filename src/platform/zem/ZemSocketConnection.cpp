@@ -10,6 +10,7 @@
 
 #include "base/EventLoopAsio.h"
 #include "platform/log/Log.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 #include "platform/zem/ZemListener.h"
 
@@ -248,6 +249,10 @@ bool ZemSocketConnection::consume(size_t bytes) {
 
 void ZemSocketConnection::handleFrame(ZemFrame frame) {
     Result<Value> body = frame.decodePayload();
+    // A well-formed value that is not a dictionary breaks no framing: a message or request carrying one is handed
+    // on for the receiver to log and drop, and the stream goes on. A reply must be a dictionary.
+    if (!body && isZemError(body.error(), ZemErrorCode::NotDictionary) && frame.kind() != ZemFrameKind::Reply)
+        body = ZemCodec::decode(frame.payload());
     if (!body) {
         log::ops().error("protocol violation by peer %d in %s: %@; disconnecting", static_cast<int>(pid_),
                          frame.description().c_str(), body.error());
