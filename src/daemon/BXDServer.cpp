@@ -4,8 +4,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <semaphore>
-#include <thread>
 
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
@@ -91,14 +89,27 @@ void BXDServer::removedPlugIns(const std::vector<std::shared_ptr<const LXBexilPr
     terminatePlugInsReply(plugIns, [plugIns] { log::ops().debug("removal complete for %@", plugIns); });
 }
 
-// Every record gets one request to the service manager; their completions run on this call's "killer" queue and
-// each signals the semaphore once, whatever its outcome. The waiter consumes exactly that many signals on a thread
-// of its own ("killer-waiter"), so neither the request queue nor the event loop ever waits for a process to exit.
+// Every record gets one request to the service manager; their completions run on this call's "killer" queue, one
+// at a time, and the last of them sends the reply. Nothing waits for a process to exit: the service manager's
+// watches on the event loop say when each one has.
 void BXDServer::terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
                                       std::function<void()> reply) {
     SerialQueue killer("killer", loop_);
-    auto answered = std::make_shared<std::counting_semaphore<>>(0);
     const size_t count = plugIns.size();
+    log::ops().debug("waiting for %d termination replies", static_cast<int>(count));
+    if (count == 0) {
+        killer.async([reply = std::move(reply)] {
+            log::ops().debug("sending termination reply");
+            reply();
+        });
+        return;
+    }
+    struct Waiting {
+        size_t remaining;
+        std::function<void()> reply;
+    };
+    auto waiting = std::make_shared<Waiting>(Waiting{count, std::move(reply)});
+    log::ops().debug("awaiting termination reply #%d", 0);
     for (const std::shared_ptr<const LXBexilProxy>& plugIn : plugIns) {
         std::string version = "1";
         if (plugIn->infoVrec())
@@ -107,7 +118,7 @@ void BXDServer::terminatePlugInsReply(const std::vector<std::shared_ptr<const LX
         log::ops().debug("requesting termination for %@(%@) jobard:%@ %@", plugIn->bundleIdentifier(),
                          plugIn->bundleVersion(), version, uuid);
         serviceManager_.removeExternalService(
-            plugIn->bundleIdentifier().value_or(""), version, killer, [answered, uuid](int error) {
+            plugIn->bundleIdentifier().value_or(""), version, killer, [waiting, uuid, count](int error) {
                 if (error == 0)
                     log::ops().info("one or more plug-ins have been terminated for uuid=%@", uuid);
                 else if (error == ServiceManager::kNothingOnRecord)
@@ -115,18 +126,14 @@ void BXDServer::terminatePlugInsReply(const std::vector<std::shared_ptr<const LX
                 else
                     log::ops().error("jobard error attempting to terminate plug-ins: error=%d for uuid=%@", error,
                                      uuid);
-                answered->release();
+                if (--waiting->remaining > 0) {
+                    log::ops().debug("awaiting termination reply #%d", static_cast<int>(count - waiting->remaining));
+                    return;
+                }
+                log::ops().debug("sending termination reply");
+                waiting->reply();
             });
     }
-    std::thread([answered, count, reply = std::move(reply)] {
-        log::ops().debug("waiting for %d termination replies", static_cast<int>(count));
-        for (size_t i = 0; i < count; ++i) {
-            log::ops().debug("awaiting termination reply #%d", static_cast<int>(i));
-            answered->acquire();
-        }
-        log::ops().debug("sending termination reply");
-        reply();
-    }).detach();
 }
 
 std::vector<std::shared_ptr<BXDPlugInHold>>& BXDServer::holds() { return holds_; }

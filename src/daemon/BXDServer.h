@@ -54,8 +54,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
 
     // Database delegate: plug-ins about to be uninstalled.
     void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
-    // Asks the service manager to end every running instance of `plugIns`; `reply` runs once, on a waiter thread
-    // of this call, after every request has been answered. Returns at once.
+    // Asks the service manager to end every running instance of `plugIns`; `reply` runs once, on a queue of this
+    // call, after every request has been answered. Returns at once; nothing blocks while processes end.
     void terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
                                std::function<void()> reply);
     // The service manager that keeps hosts' grants and terminates instances (tests point it at their own runtime

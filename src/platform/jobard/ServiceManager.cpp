@@ -6,13 +6,14 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <asio.hpp>
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
 #include <list>
 #include <mutex>
-#include <thread>
 
+#include "base/EventLoopAsio.h"
 #include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
@@ -35,25 +36,47 @@ bool waitForExit(int pidfd, std::chrono::milliseconds timeout) {
     return rc > 0;
 }
 
-// Ends one instance: SIGTERM, then SIGKILL after the grace period. Returns 0 or an errno value.
-int terminate(const InstanceRecords::Instance& instance) {
+// Ends one instance without blocking anyone: SIGTERM, then SIGKILL when it is still there after the grace period,
+// all driven by `queue`'s event loop (a watch on the instance's pidfd and a timer). `done` runs once on `queue`
+// with 0 or an errno value.
+void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, std::function<void(int)> done) {
     int pidfd = pidfdOpen(instance.pid);
-    if (pidfd < 0) return errno == ESRCH ? 0 : errno;
-    // The pidfd pins one process; make sure it is still the one the record names before signalling it. Earlier
-    // instances may have taken seconds to end, time enough for this one to end too and its pid to be reused.
+    if (pidfd < 0) return done(errno == ESRCH ? 0 : errno);
+    // The pidfd pins one process; make sure it is still the one the record names before signalling it. The
+    // instance may have ended meanwhile and its pid gone to another process.
     if (InstanceRecords::startTime(instance.pid) != instance.startTime) {
         close(pidfd);
-        return 0;
+        return done(0);
     }
-    int result = 0;
     if (pidfdSignal(pidfd, SIGTERM) != 0) {
-        result = errno == ESRCH ? 0 : errno;
-    } else if (!waitForExit(pidfd, ServiceManager::kTerminationGrace)) {
-        if (pidfdSignal(pidfd, SIGKILL) != 0 && errno != ESRCH) result = errno;
-        waitForExit(pidfd, std::chrono::seconds(1));
+        int error = errno;
+        close(pidfd);
+        return done(error == ESRCH ? 0 : error);
     }
-    close(pidfd);
-    return result;
+    asio::io_context& io = *detail::QueueInternals::state(queue)->core;
+    auto exited = std::make_shared<asio::posix::stream_descriptor>(io, pidfd);
+    auto timer = std::make_shared<asio::steady_timer>(io, ServiceManager::kTerminationGrace);
+    auto finished = std::make_shared<bool>(false);
+    auto finish = [exited, timer, finished, done = std::move(done)](int result) {
+        if (std::exchange(*finished, true)) return;
+        timer->cancel();
+        exited->close();
+        done(result);
+    };
+    exited->async_wait(asio::posix::stream_descriptor::wait_read,
+                       detail::bindToQueue(queue, [finish](const asio::error_code& error) {
+                           if (error != asio::error::operation_aborted) finish(0);
+                       }));
+    timer->async_wait(
+        detail::bindToQueue(queue, [queue, exited, timer, finished, finish](const asio::error_code& error) {
+            if (error || *finished) return;
+            if (pidfdSignal(exited->native_handle(), SIGKILL) != 0 && errno != ESRCH) return finish(errno);
+            // A killed process is gone at once, unless it is stuck in the kernel: wait a little, then give up on it.
+            timer->expires_after(std::chrono::seconds(1));
+            timer->async_wait(detail::bindToQueue(queue, [finish](const asio::error_code& again) {
+                if (!again) finish(0);
+            }));
+        }));
 }
 
 bool hasExited(int pidfd) { return waitForExit(pidfd, std::chrono::milliseconds(0)); }
@@ -129,17 +152,23 @@ void ServiceManager::removeExternalService(const std::string& bundleIdentifier, 
         queue.async([completion = std::move(completion)] { completion(kNothingOnRecord); });
         return;
     }
-    // Waiting for processes to exit can take seconds: it must not hold up any queue.
-    std::thread([running = std::move(running), queue, completion = std::move(completion)]() mutable {
+    // Every instance is ended at once; the completion runs when the last one is done, with the first error.
+    struct Progress {
+        size_t remaining;
         int error = 0;
+        std::function<void(int)> completion;
+    };
+    auto progress = std::make_shared<Progress>(Progress{running.size(), 0, std::move(completion)});
+    queue.async([running = std::move(running), queue, progress]() mutable {
         for (const InstanceRecords::Instance& instance : running) {
-            int result = terminate(instance);
-            std::error_code ignored;
-            std::filesystem::remove(instance.record, ignored);
-            if (result != 0 && error == 0) error = result;
+            terminate(instance, queue, [progress, record = instance.record](int result) {
+                std::error_code ignored;
+                std::filesystem::remove(record, ignored);
+                if (result != 0 && progress->error == 0) progress->error = result;
+                if (--progress->remaining == 0) progress->completion(progress->error);
+            });
         }
-        queue.async([completion = std::move(completion), error] { completion(error); });
-    }).detach();
+    });
 }
 
 }  // namespace bexil

@@ -3,9 +3,9 @@
 // The service manager: remembers which plug-in executables each host process may start and with which activation
 // overlay (the grants that enabling a plug-in makes), and ends every running instance of a plug-in that its runtime
 // recorded (see InstanceRecords). A grant is tied to the host process through a pidfd, so it ends with that process
-// and a later process that is given the same pid never inherits it. Copies share one grant table. The waiting of
-// termination happens on a thread of its own, never on the caller's queue; the completion is delivered on the queue
-// the caller names. Thread-safe.
+// and a later process that is given the same pid never inherits it. Copies share one grant table. Termination
+// waits for nothing: pidfd watches and timers on the event loop of the queue the caller names carry it, and the
+// completion is delivered on that queue. Thread-safe.
 
 #include <sys/types.h>
 
