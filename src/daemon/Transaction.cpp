@@ -113,6 +113,12 @@ void Transaction::runHandler(Request request) {
         log::ops().fault("internal inconsistency while handling %{public}s: %s", protocol::nameOf(request).data(),
                          broken.what());
         if (!answered()) fail(ErrorCode::OperationFailed, broken.what());
+    } catch (...) {
+        // Anything else that escapes a handler (an allocation failure, a library's exception) is answered the same
+        // way, so that the client never waits for a reply that cannot come.
+        std::string what = exceptionMessage(std::current_exception());
+        log::ops().fault("exception while handling %{public}s: %s", protocol::nameOf(request).data(), what.c_str());
+        if (!answered()) fail(ErrorCode::OperationFailed, "internal error: " + what);
     }
 }
 

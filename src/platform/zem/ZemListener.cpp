@@ -139,11 +139,13 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
             peers_.push_back(connection);
         }
         connection->setClosedCallback([self = shared_from_this()] { self->connectionCount_.fetch_sub(1); });
+        // The next accept is asked for before this connection's handler runs, so that nothing the handler throws
+        // can stop the service from taking connections.
+        acceptNext();
         if (connectionHandler_)
             connectionHandler_(connection);
         else
             connection->cancel();
-        acceptNext();
     }
 
     void watchTermination() {
