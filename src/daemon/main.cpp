@@ -1,14 +1,18 @@
 // bxd: the plug-in registry daemon. Parses its options, builds the one server and hands the main thread to the
 // event loop for ever; the process is ended from outside (systemd).
 
+#include <sys/resource.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <optional>
 
 #include "base/EventLoop.h"
 #include "daemon/BXDServer.h"
 #include "platform/log/Log.h"
+#include "platform/zem/ZemListener.h"
 
 namespace {
 
@@ -16,6 +20,56 @@ namespace {
 void logUncaughtException(std::string_view queueLabel, std::exception_ptr exception) {
     std::string what = bexil::exceptionMessage(exception);
     bexil::log::ops().fault("block on queue %s threw: %s", std::string(queueLabel), what);
+}
+
+// Descriptors bxd keeps for itself besides its connections: the registry, the annotation document, the log, the
+// pidfds and pipes of launched plug-ins and of termination.
+constexpr size_t kDescriptorsKeptBack = 128;
+// Each connection holds its socket and a pidfd of its peer.
+constexpr size_t kDescriptorsPerConnection = 2;
+
+// A positive count from the environment variable `name`; none when it is unset, and none (logged) when it is not a
+// positive number.
+std::optional<size_t> countFromEnvironment(const char* name) {
+    const char* text = getenv(name);
+    if (text == nullptr || *text == '\0') return std::nullopt;
+    char* end = nullptr;
+    unsigned long long value = strtoull(text, &end, 10);
+    if (*end != '\0' || value == 0 || text[0] == '-') {
+        bexil::log::ops().error("%s=%s is not a positive number; using the default", name, text);
+        return std::nullopt;
+    }
+    return static_cast<size_t>(value);
+}
+
+// The connection limits: the defaults, or $BX_MAX_CONNECTIONS and $BX_MAX_CONNECTIONS_PER_USER, with the total held
+// below what the open-file limit allows once bxd has raised its soft limit to the hard one.
+bexil::ZemListener::Limits connectionLimits() {
+    using bexil::log::ops;
+    rlimit files{};
+    if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+        rlim_t before = files.rlim_cur;
+        files.rlim_cur = files.rlim_max;
+        if (setrlimit(RLIMIT_NOFILE, &files) == 0)
+            ops().info("open-file limit raised from %llu to %llu", static_cast<unsigned long long>(before),
+                       static_cast<unsigned long long>(files.rlim_cur));
+        else
+            files.rlim_cur = before;
+    }
+    bexil::ZemListener::Limits limits;
+    if (auto total = countFromEnvironment("BX_MAX_CONNECTIONS")) limits.maxConnections = *total;
+    if (auto perUser = countFromEnvironment("BX_MAX_CONNECTIONS_PER_USER")) limits.maxConnectionsPerUser = *perUser;
+    const size_t openFiles = static_cast<size_t>(files.rlim_cur);
+    const size_t affordable = openFiles > kDescriptorsKeptBack + kDescriptorsPerConnection
+                                  ? (openFiles - kDescriptorsKeptBack) / kDescriptorsPerConnection
+                                  : 1;
+    if (limits.maxConnections > affordable) {
+        ops().notice("connection limit lowered from %zu to %zu: the open-file limit is %zu", limits.maxConnections,
+                     affordable, openFiles);
+        limits.maxConnections = affordable;
+    }
+    limits.reservedForRoot = std::min(limits.reservedForRoot, limits.maxConnections / 4);
+    return limits;
 }
 
 [[noreturn]] void usage() {
@@ -61,16 +115,21 @@ int main(int argc, char** argv) {
     // The main thread is the loop's only thread: socket I/O, decoding, every request and encoding share it, so a
     // request never changes threads between its bytes arriving and its reply leaving.
     EventLoop::setUncaughtExceptionHandler(logUncaughtException);
+    const ZemListener::Limits limits = connectionLimits();
     EventLoop loop(0);
     std::unique_ptr<BXDServer> server = BXDServer::initForServiceDatabase(serviceName, databasePath, loop);
     if (!server) {
         log::ops().error("unable to construct server");
         return 1;
     }
+    server->service().setLimits(limits);
     server->setVerbose(verbose);
     server->setCacheLimit(cacheLimit);
-    log::ops().debug("bxd configured: service %s, cache limit %u, annotations %s, verbose %u", serviceName, cacheLimit,
-                     databasePath ? databasePath : "(default)", verbose);
+    log::ops().debug(
+        "bxd configured: service %s, cache limit %u, annotations %s, verbose %u, connections %zu "
+        "(%zu per user, %zu kept for root)",
+        serviceName, cacheLimit, databasePath ? databasePath : "(default)", verbose, limits.maxConnections,
+        limits.maxConnectionsPerUser, limits.reservedForRoot);
     server->run();
     return 0;
 }

@@ -8,12 +8,15 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <list>
+#include <map>
 #include <mutex>
+#include <set>
 
 #include "base/EventLoopAsio.h"
 #include "base/PosixError.h"
@@ -57,6 +60,10 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
     Protocol::acceptor& acceptor() { return acceptor_; }
 
     void setConnectionHandler(ConnectionHandler handler) override { connectionHandler_ = std::move(handler); }
+    void setLimits(Limits limits) override {
+        limits.reservedForRoot = std::min(limits.reservedForRoot, limits.maxConnections / 4);
+        limits_ = limits;
+    }
     void setErrorHandler(ErrorHandler handler) override { errorHandler_ = std::move(handler); }
     void setTerminationHandler(std::function<void()> handler) override { terminationHandler_ = std::move(handler); }
 
@@ -92,6 +99,46 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
     bool activatedBySystemd() const override { return activated_; }
 
   private:
+    // Counts a new connection of `uid`, or refuses it when a limit is reached: the total (with the last
+    // reservedForRoot places kept for root) or the user's own. Each limit is logged once when it is hit.
+    bool admit(uid_t uid) {
+        std::lock_guard lock(countsMutex_);
+        const size_t total = connectionCount_.load();
+        const size_t forOthers = limits_.maxConnections - limits_.reservedForRoot;
+        if (total >= limits_.maxConnections || (uid != 0 && total >= forOthers)) {
+            if (!limitLogged_)
+                log::ops().error(
+                    "service %s has %zu connections, the limit (kMaxConnections %zu, of which %zu kept "
+                    "for root): refusing new ones",
+                    serviceName_.c_str(), total, limits_.maxConnections, limits_.reservedForRoot);
+            limitLogged_ = true;
+            return false;
+        }
+        size_t& ofUser = perUser_[uid];
+        if (uid != 0 && ofUser >= limits_.maxConnectionsPerUser) {
+            if (usersAtLimit_.insert(uid).second)
+                log::ops().error(
+                    "user %u has %zu connections to service %s, the limit (kMaxConnectionsPerUser): "
+                    "refusing new ones",
+                    static_cast<unsigned>(uid), ofUser, serviceName_.c_str());
+            return false;
+        }
+        ++ofUser;
+        connectionCount_.fetch_add(1);
+        return true;
+    }
+
+    // A connection of `uid` has ended. Runs on the connection's queue.
+    void release(uid_t uid) {
+        std::lock_guard lock(countsMutex_);
+        connectionCount_.fetch_sub(1);
+        if (connectionCount_.load() + limits_.reservedForRoot < limits_.maxConnections) limitLogged_ = false;
+        auto found = perUser_.find(uid);
+        if (found == perUser_.end()) return;
+        if (--found->second < limits_.maxConnectionsPerUser) usersAtLimit_.erase(uid);
+        if (found->second == 0) perUser_.erase(found);
+    }
+
     void acceptNext() {
         if (cancelled_) return;
         acceptor_.async_accept(detail::bindToQueue(
@@ -112,33 +159,25 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
             }));
             return;
         }
-        if (connectionCount_.load() >= kMaxConnections) {
-            if (!limitLogged_) {
-                log::ops().error("service %s has %zu connections, the limit (kMaxConnections): refusing new ones",
-                                 serviceName_.c_str(), kMaxConnections);
-                limitLogged_ = true;
-            }
+        int fd = socket.native_handle();
+        ZemPeerCredentials peer = ZemPeerCredentials::ofConnectedSocket(fd);
+        if (!admit(peer.uid)) {
             asio::error_code ignored;
             socket.close(ignored);
             acceptNext();
             return;
         }
-        limitLogged_ = false;
-
-        int fd = socket.native_handle();
-        ZemPeerCredentials peer = ZemPeerCredentials::ofConnectedSocket(fd);
         pid_t pid = peer.pid > 0 ? peer.pid : 0;
         SerialQueue peerQueue("peer-" + std::to_string(pid), queue_);
         auto connection =
             std::make_shared<ZemSocketConnection>(std::move(socket), peerQueue, serviceName_, std::move(peer));
-        connectionCount_.fetch_add(1);
         {
             // Connections that have ended are forgotten here, so the list stays as long as the live ones.
             std::lock_guard lock(peersMutex_);
             peers_.remove_if([](const std::weak_ptr<ZemSocketConnection>& weak) { return weak.expired(); });
             peers_.push_back(connection);
         }
-        connection->setClosedCallback([self = shared_from_this()] { self->connectionCount_.fetch_sub(1); });
+        connection->setClosedCallback([self = shared_from_this(), uid = peer.uid] { self->release(uid); });
         // The next accept is asked for before this connection's handler runs, so that nothing the handler throws
         // can stop the service from taking connections.
         acceptNext();
@@ -185,7 +224,11 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
     std::function<void()> terminationHandler_;
     bool resumed_ = false;
     bool cancelled_ = false;
-    bool limitLogged_ = false;
+    bool limitLogged_ = false;  // under countsMutex_
+    Limits limits_;
+    std::mutex countsMutex_;
+    std::map<uid_t, size_t> perUser_;
+    std::set<uid_t> usersAtLimit_;
     std::atomic<uint64_t> keepAlive_{0};
     std::atomic<size_t> connectionCount_{0};
     std::mutex peersMutex_;

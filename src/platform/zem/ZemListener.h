@@ -25,6 +25,17 @@ class ZemListener {
 
     // Largest number of peer connections open at once; further ones are refused (and logged) until some close.
     static constexpr size_t kMaxConnections = 4096;
+    // Largest number of connections of one user (uid), so that one user cannot lock every other client out.
+    static constexpr size_t kMaxConnectionsPerUser = 256;
+    // Connections below kMaxConnections that only root may take, so that administrators can always get in.
+    static constexpr size_t kConnectionsReservedForRoot = 64;
+
+    // The connection limits in force; the defaults are the constants above.
+    struct Limits {
+        size_t maxConnections = kMaxConnections;
+        size_t maxConnectionsPerUser = kMaxConnectionsPerUser;
+        size_t reservedForRoot = kConnectionsReservedForRoot;
+    };
 
     virtual ~ZemListener() = default;
 
@@ -40,6 +51,9 @@ class ZemListener {
 
     // REQUIRES: before resume().
     virtual void setConnectionHandler(ConnectionHandler handler) = 0;
+    // A connection over a limit is closed at accept, logged once until its count is below the limit again.
+    // REQUIRES: before resume().
+    virtual void setLimits(Limits limits) = 0;
     // Errors of the listening socket itself; they are never taken for a connection.
     virtual void setErrorHandler(ErrorHandler handler) = 0;
     // What happens after SIGTERM has been turned into termination-imminent events (default: the process exits).
