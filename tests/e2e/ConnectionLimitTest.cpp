@@ -99,5 +99,14 @@ TEST_F(ConnectionLimitTest, TheLastPlacesAreKeptForRoot) {
     succeed(request("bulk"));
 }
 
+// Guards the descriptors: under an open-file limit of 256 bxd cannot afford 4096 connections, so it lowers its limit
+// (two descriptors per connection, 128 kept back) and says so, rather than failing accepts later.
+TEST_F(ConnectionLimitTest, TheConnectionLimitStaysBelowWhatTheDescriptorsAllow) {
+    bxd_.setLauncher({"/usr/bin/prlimit", "--nofile=256:256", "--"});
+    ASSERT_TRUE(start()) << bxd_.log();
+    expectLog("connection limit lowered from 4096 to 64: the open-file limit is 256");
+    succeed(request("bulk"));
+}
+
 }  // namespace
 }  // namespace bexil

@@ -151,14 +151,17 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
         if (cancelled_) return;
         if (error) {
             if (error == asio::error::operation_aborted) return;
+            // Reported once until an accept succeeds again: out of descriptors, every retry would fail alike.
             Error failure = posixError(error.value(), "accept on service " + serviceName_);
-            if (errorHandler_) errorHandler_(failure);
+            if (errorHandler_ && !acceptFailing_) errorHandler_(failure);
+            acceptFailing_ = true;
             retryTimer_.expires_after(kAcceptRetryDelay);
             retryTimer_.async_wait(detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& e) {
                 if (!e) self->acceptNext();
             }));
             return;
         }
+        acceptFailing_ = false;
         int fd = socket.native_handle();
         ZemPeerCredentials peer = ZemPeerCredentials::ofConnectedSocket(fd);
         if (!admit(peer.uid)) {
@@ -225,6 +228,7 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
     bool resumed_ = false;
     bool cancelled_ = false;
     bool limitLogged_ = false;  // under countsMutex_
+    bool acceptFailing_ = false;
     Limits limits_;
     std::mutex countsMutex_;
     std::map<uid_t, size_t> perUser_;
