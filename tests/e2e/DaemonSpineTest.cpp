@@ -317,5 +317,34 @@ TEST_F(BxdEnvelope, MisbehavingAndVanishingPeersAreDroppedAndOthersServed) {
     EXPECT_TRUE(bxd_.running());
 }
 
+// Guards stalled connections: with a stall time of 1 s, a connection that never sends a frame and one that sends
+// half a frame are dropped and logged; one that sent a whole request and then stays silent longer is kept and
+// answered when it speaks again.
+TEST_F(BxdEnvelope, StalledConnectionsAreDroppedButQuietOnesKept) {
+    setenv("BX_STALLED_CONNECTION_SECONDS", "1", 1);
+    bxd_.stop(SIGKILL);
+    ASSERT_TRUE(start()) << bxd_.log();
+    unsetenv("BX_STALLED_CONNECTION_SECONDS");
+    const std::string path = bxd_.socketPath();
+    RawSocket silent(path);
+    RawSocket half(path);
+    std::vector<uint8_t> partial = burst(1);
+    partial.resize(partial.size() / 2);
+    half.write(partial);
+    RawSocket quiet(path);
+    quiet.write(burst(1));
+    ASSERT_EQ(quiet.read(ZemFrame::kHeaderBytes).size(), ZemFrame::kHeaderBytes);
+
+    EXPECT_TRUE(silent.closedByPeer());
+    EXPECT_TRUE(half.closedByPeer());
+    expectLog("sent no complete frame for 1 s (kStalledConnectionTimeout): disconnecting");
+    expectLog("sent part of a frame and no more for 1 s");
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+    std::vector<uint8_t> second;
+    ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 2, 0, kBogus, second).has_value());
+    quiet.write(second);
+    EXPECT_EQ(quiet.read(ZemFrame::kHeaderBytes).size(), ZemFrame::kHeaderBytes) << "a quiet client was dropped";
+}
+
 }  // namespace
 }  // namespace bexil

@@ -5,6 +5,7 @@
 // SIGTERM into a termination-imminent event on every open peer connection, and counts keep-alive units for idle
 // accounting. Created and controlled on one queue; counters may be read anywhere.
 
+#include <chrono>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
@@ -30,11 +31,16 @@ class ZemListener {
     // Connections below kMaxConnections that only root may take, so that administrators can always get in.
     static constexpr size_t kConnectionsReservedForRoot = 64;
 
+    // How long a peer may keep a connection without a first complete frame, or with part of one, before it is
+    // dropped (logged). A peer that has sent a frame may stay silent between frames for as long as it likes.
+    static constexpr std::chrono::seconds kStalledConnectionTimeout{30};
+
     // The connection limits in force; the defaults are the constants above.
     struct Limits {
         size_t maxConnections = kMaxConnections;
         size_t maxConnectionsPerUser = kMaxConnectionsPerUser;
         size_t reservedForRoot = kConnectionsReservedForRoot;
+        std::chrono::seconds stalledConnectionTimeout = kStalledConnectionTimeout;
     };
 
     virtual ~ZemListener() = default;

@@ -31,6 +31,8 @@ namespace {
 
 asio::io_context& ioContextOf(const SerialQueue& queue) { return *detail::QueueInternals::state(queue)->core; }
 
+std::atomic<long> stalledTimeoutSeconds{ZemListener::kStalledConnectionTimeout.count()};
+
 }  // namespace
 
 ZemSocketConnection::ZemSocketConnection(Socket socket, SerialQueue queue, std::string serviceName,
@@ -44,10 +46,46 @@ ZemSocketConnection::ZemSocketConnection(Socket socket, SerialQueue queue, std::
       uid_(peer_.uid),
       gid_(peer_.gid),
       state_(State::Open),
+      stallTimer_(ioContextOf(queue_)),
       probeFd_(socket_.native_handle()) {}
 
 ZemSocketConnection::ZemSocketConnection(SerialQueue queue, std::string serviceName)
-    : side_(Side::Client), queue_(queue), socket_(ioContextOf(queue)), serviceName_(std::move(serviceName)) {}
+    : side_(Side::Client),
+      queue_(queue),
+      socket_(ioContextOf(queue)),
+      serviceName_(std::move(serviceName)),
+      stallTimer_(ioContextOf(queue)) {}
+
+void ZemSocketConnection::setStalledConnectionTimeout(std::chrono::seconds timeout) {
+    stalledTimeoutSeconds.store(timeout.count());
+}
+
+void ZemSocketConnection::watchStall() {
+    if (side_ != Side::Peer || state_ != State::Open) return;
+    const bool waiting = !framed_ || reader_.hasPartialFrame();
+    if (!waiting) {
+        if (stallArmed_) {
+            stallArmed_ = false;
+            stallTimer_.cancel();
+        }
+        return;
+    }
+    if (stallArmed_) return;  // the first moment of waiting counts, not the latest byte
+    stallArmed_ = true;
+    const std::chrono::seconds timeout(stalledTimeoutSeconds.load());
+    stallTimer_.expires_after(timeout);
+    stallTimer_.async_wait(
+        detail::bindToQueue(queue_, [self = shared_from_this(), timeout](const asio::error_code& error) {
+            if (error || !self->stallArmed_ || self->state_ != State::Open) return;
+            self->stallArmed_ = false;
+            if (self->framed_ && !self->reader_.hasPartialFrame()) return;
+            log::ops().error("peer %d sent %s for %lld s (kStalledConnectionTimeout): disconnecting",
+                             static_cast<int>(self->pid_),
+                             self->reader_.hasPartialFrame() ? "part of a frame and no more" : "no complete frame",
+                             static_cast<long long>(timeout.count()));
+            self->close(ZemError::Kind::ConnectionInvalid);
+        }));
+}
 
 ZemSocketConnection::~ZemSocketConnection() {
     if (finalizer_) finalizer_(std::move(context_));
@@ -179,6 +217,7 @@ void ZemSocketConnection::readMore() {
         return endOfStream();
     }
     if (suspended_ || reading_ || state_ != State::Open) return;
+    watchStall();
     reading_ = true;
     socket_.async_wait(Socket::wait_read,
                        detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error) {
@@ -248,6 +287,7 @@ bool ZemSocketConnection::consume(size_t bytes) {
 }
 
 void ZemSocketConnection::handleFrame(ZemFrame frame) {
+    framed_ = true;
     Result<Value> body = frame.decodePayload();
     // A well-formed value that is not a dictionary breaks no framing: a message or request carrying one is handed
     // on for the receiver to log and drop, and the stream goes on. A reply must be a dictionary.
@@ -470,6 +510,8 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     }
     asio::error_code ignored;
     socket_.close(ignored);
+    stallArmed_ = false;
+    stallTimer_.cancel();
     reader_ = ZemFrameReader();
     outgoing_.clear();
     attachments_.clear();

@@ -7,6 +7,7 @@
 
 #include <asio.hpp>
 #include <atomic>
+#include <chrono>
 #include <deque>
 #include <map>
 #include <memory>
@@ -34,6 +35,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     static constexpr int kReadsPerTurn = 4;
     // Descriptors received ahead of the frames that announce them; a peer that sends more is violating the protocol.
     static constexpr size_t kMaxPendingDescriptors = 16;
+    // Overrides ZemListener::kStalledConnectionTimeout for connections accepted from now on.
+    static void setStalledConnectionTimeout(std::chrono::seconds timeout);
 
     enum class Side { Peer, Client };
 
@@ -91,6 +94,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     bool consume(size_t bytes);
     // The peer closed its end, or the socket failed.
     void endOfStream();
+    // Peer side: arms the stall timer while no frame has come yet or part of one waits, cancels it otherwise.
+    void watchStall();
     void handleFrame(ZemFrame frame);
     void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending,
                       std::vector<UniqueFd> descriptors = {});
@@ -132,6 +137,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
     std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
+    asio::steady_timer stallTimer_;
+    bool stallArmed_ = false;
+    bool framed_ = false;      // a complete frame has arrived
     unsigned delivering_ = 0;  // depth of event handler calls in progress on the stack
     uint64_t nextSerial_ = 1;
     std::map<uint64_t, PendingReply> pendingReplies_;
