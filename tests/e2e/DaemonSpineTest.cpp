@@ -346,5 +346,23 @@ TEST_F(BxdEnvelope, StalledConnectionsAreDroppedButQuietOnesKept) {
     EXPECT_EQ(quiet.read(ZemFrame::kHeaderBytes).size(), ZemFrame::kHeaderBytes) << "a quiet client was dropped";
 }
 
+// Guards a client that pipelines without reading: once its unread replies pass the pause mark its further requests
+// wait, other clients are served meanwhile, and after the stall time (1 s here) it is dropped with a log line.
+TEST_F(BxdEnvelope, AClientThatNeverReadsIsPausedThenDropped) {
+    setenv("BX_STALLED_CONNECTION_SECONDS", "1", 1);
+    bxd_.stop(SIGKILL);
+    ASSERT_TRUE(start()) << bxd_.log();
+    unsetenv("BX_STALLED_CONNECTION_SECONDS");
+    RawSocket lazy(bxd_.socketPath());
+    std::vector<uint8_t> many = burst(40000);
+    std::thread writer([&] { lazy.write(many); });
+    TestClient client;
+    for (int i = 0; i < 20; ++i) EXPECT_EQ(errorText(client.replyTo(kBogus)), "unrecognized request");
+    expectLog("has not read its replies for 1 s (");
+    EXPECT_LT(bxd_.countInLog("requested bogus"), 40000u) << "the lazy client's requests were all run";
+    writer.join();
+    EXPECT_EQ(errorText(client.replyTo(kBogus)), "unrecognized request");
+}
+
 }  // namespace
 }  // namespace bexil

@@ -62,7 +62,7 @@ void ZemSocketConnection::setStalledConnectionTimeout(std::chrono::seconds timeo
 
 void ZemSocketConnection::watchStall() {
     if (side_ != Side::Peer || state_ != State::Open) return;
-    const bool waiting = !framed_ || reader_.hasPartialFrame();
+    const bool waiting = !framed_ || reader_.hasPartialFrame() || readPaused_;
     if (!waiting) {
         if (stallArmed_) {
             stallArmed_ = false;
@@ -78,6 +78,15 @@ void ZemSocketConnection::watchStall() {
         detail::bindToQueue(queue_, [self = shared_from_this(), timeout](const asio::error_code& error) {
             if (error || !self->stallArmed_ || self->state_ != State::Open) return;
             self->stallArmed_ = false;
+            if (self->readPaused_) {
+                log::ops().error(
+                    "peer %d has not read its replies for %lld s (%zu bytes queued, "
+                    "kStalledConnectionTimeout): disconnecting",
+                    static_cast<int>(self->pid_), static_cast<long long>(timeout.count()),
+                    self->outgoing_.size() + self->writing_.size());
+                self->close(ZemError::Kind::ConnectionInvalid);
+                return;
+            }
             if (self->framed_ && !self->reader_.hasPartialFrame()) return;
             log::ops().error("peer %d sent %s for %lld s (kStalledConnectionTimeout): disconnecting",
                              static_cast<int>(self->pid_),
@@ -206,6 +215,12 @@ bool ZemSocketConnection::connectClient() {
 void ZemSocketConnection::readMore() {
     for (int turn = 0; turn < kReadsPerTurn; ++turn) {
         if (suspended_ || reading_ || state_ != State::Open) return;
+        if (side_ == Side::Peer && outgoing_.size() + writing_.size() >= kReadPauseBytes) {
+            // The peer does not read what it asked for: its next requests wait until it does.
+            readPaused_ = true;
+            watchStall();
+            return;
+        }
         ssize_t bytes = receive();
         if (bytes > 0) {
             if (!consume(static_cast<size_t>(bytes))) return;
@@ -453,6 +468,7 @@ void ZemSocketConnection::writeWithAttachments() {
                                        return;
                                    }
                                    self->writeMore();
+                                   self->resumeReadingIfDrained();
                                }));
             return;
         }
@@ -476,6 +492,14 @@ void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
         return;
     }
     writeMore();
+    resumeReadingIfDrained();
+}
+
+void ZemSocketConnection::resumeReadingIfDrained() {
+    if (!readPaused_ || state_ != State::Open || outgoing_.size() + writing_.size() >= kReadPauseBytes) return;
+    readPaused_ = false;
+    watchStall();
+    readMore();
 }
 
 void ZemSocketConnection::failPendingReplies(ZemError::Kind kind) {

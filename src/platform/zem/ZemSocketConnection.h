@@ -28,6 +28,10 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // Bytes of replies and messages queued towards one peer that has not read them yet; past this the peer is
     // taken to have stopped reading and is disconnected.
     static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
+    // Replies queued towards a peer past which its further requests are not read until it reads some: a client
+    // that pipelines without reading is served as fast as it reads, and one that never reads is dropped once it
+    // has been paused for the stall time.
+    static constexpr size_t kReadPauseBytes = 1024 * 1024;
     // Size of one read from the socket.
     static constexpr size_t kReadChunkBytes = 64 * 1024;
     // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
@@ -94,7 +98,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     bool consume(size_t bytes);
     // The peer closed its end, or the socket failed.
     void endOfStream();
-    // Peer side: arms the stall timer while no frame has come yet or part of one waits, cancels it otherwise.
+    // Peer side: arms the stall timer while no frame has come yet, part of one waits, or reading is paused for
+    // replies the peer does not read; cancels it otherwise.
     void watchStall();
     void handleFrame(ZemFrame frame);
     void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending,
@@ -106,6 +111,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // Drops the first `bytes` of outgoing_, keeping the attachments' offsets right.
     void dropSent(size_t bytes);
     void onWritten(const asio::error_code& error, size_t bytes);
+    // Reads again once the replies a paused peer had not read are mostly gone.
+    void resumeReadingIfDrained();
     // Ends the connection because of `why` (logged when it is a protocol violation or a limit).
     void close(ZemError::Kind kind);
     void failPendingReplies(ZemError::Kind kind);
@@ -140,6 +147,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     asio::steady_timer stallTimer_;
     bool stallArmed_ = false;
     bool framed_ = false;      // a complete frame has arrived
+    bool readPaused_ = false;  // reading stopped until the peer reads its replies
     unsigned delivering_ = 0;  // depth of event handler calls in progress on the stack
     uint64_t nextSerial_ = 1;
     std::map<uint64_t, PendingReply> pendingReplies_;
