@@ -1,6 +1,7 @@
 // bxd: the plug-in registry daemon. Parses its options, builds the one server and hands the main thread to the
 // event loop for ever; the process is ended from outside (systemd).
 
+#include <malloc.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
@@ -21,6 +22,12 @@ void logUncaughtException(std::string_view queueLabel, std::exception_ptr except
     std::string what = bexil::exceptionMessage(exception);
     bexil::log::ops().fault("block on queue %s threw: %s", std::string(queueLabel), what);
 }
+
+// Large frames (up to 16 MiB) come from the heap rather than from mappings of their own, and freed heap memory up
+// to this much is kept rather than given back at once: otherwise every large request maps fresh pages, faults each
+// of them in while it is read, and unmaps them when it is done, which costs far more than the reading itself.
+constexpr int kLargeAllocationFromHeapBytes = 17 * 1024 * 1024;
+constexpr int kFreeMemoryKeptBytes = 64 * 1024 * 1024;
 
 // Descriptors bxd keeps for itself besides its connections: the registry, the annotation document, the log, the
 // pidfds and pipes of launched plug-ins and of termination.
@@ -118,6 +125,8 @@ int main(int argc, char** argv) {
     // The main thread is the loop's only thread: socket I/O, decoding, every request and encoding share it, so a
     // request never changes threads between its bytes arriving and its reply leaving.
     EventLoop::setUncaughtExceptionHandler(logUncaughtException);
+    mallopt(M_MMAP_THRESHOLD, kLargeAllocationFromHeapBytes);
+    mallopt(M_TRIM_THRESHOLD, kFreeMemoryKeptBytes);
     const ZemListener::Limits limits = connectionLimits();
     EventLoop loop(0);
     std::unique_ptr<BXDServer> server = BXDServer::initForServiceDatabase(serviceName, databasePath, loop);

@@ -28,8 +28,11 @@ std::optional<Error> ZemFrameReader::feed(std::span<const uint8_t> bytes) {
             size_t missing = current_.payloadLength - payload_.size();
             size_t take = std::min(missing, bytes.size());
             if (payload_.capacity() < payload_.size() + take) {
-                // Grow geometrically, but never past the announced length.
-                size_t want = std::max(payload_.capacity() * 2, payload_.size() + take);
+                // A peer that has sent kInitialPayloadReserve bytes of a frame gets room for the rest at once, so a
+                // large frame is copied once more at most; before that, growth follows the bytes that arrive.
+                size_t want = payload_.size() >= kInitialPayloadReserve
+                                  ? current_.payloadLength
+                                  : std::max(payload_.capacity() * 2, payload_.size() + take);
                 payload_.reserve(std::min<size_t>(want, current_.payloadLength));
             }
             payload_.insert(payload_.end(), bytes.begin(), bytes.begin() + static_cast<ptrdiff_t>(take));
