@@ -184,7 +184,7 @@ class BxdEnvelope : public DaemonTest {
 
 // Guards the envelope checks before dispatch: versions 2 and 3 reach the handler table, anything else (below,
 // above, absent, high bits set, another kind) is code 7 naming the low 32 bits; then the request name, which must
-// match exactly, and the known requests without a handler yet.
+// match exactly, and a known request that reaches its handler (a "ready" without its list).
 TEST_F(BxdEnvelope, VersionThenRequestNameAreChecked) {
     for (uint64_t accepted : {2u, 3u})
         expectFailure(versioned("bogus", Value::uint64(accepted)), 4, "unrecognized request");
