@@ -1,19 +1,19 @@
 #include "platform/codesign/CodeSigningIdentity.h"
 
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
 
+#include "base/Pidfd.h"
 #include "platform/codesign/EntitlementsDirectory.h"
 
 namespace bexil {
 
 namespace {
 
-bool pidfdAlive(int pidfd) { return syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0; }
+bool pidfdAlive(int pidfd) { return pidfdSendSignal(pidfd, 0) == 0; }
 
 }  // namespace
 

@@ -21,6 +21,7 @@
 
 #include "base/EventLoopAsio.h"
 #include "base/Format.h"
+#include "base/Pidfd.h"
 #include "platform/jobard/ServiceManager.h"
 #include "platform/log/Log.h"
 #include "platform/sandbox/SandboxProfiles.h"
@@ -69,7 +70,7 @@ std::string exitText(int status) {
 // status pipe stays open until then: bubblewrap reports the plug-in's exit on it last, and a closed pipe would kill
 // it with SIGPIPE instead.
 void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd status, SerialQueue& queue) {
-    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    int pidfd = pidfdOpen(pid);
     if (pidfd < 0) {
         log::ops().error("cannot watch plug-in %s instance %d: %s; reaping it now", identifier.c_str(),
                          static_cast<int>(pid), strerror(errno));

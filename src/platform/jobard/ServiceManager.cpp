@@ -1,8 +1,6 @@
 #include "platform/jobard/ServiceManager.h"
 
 #include <fcntl.h>
-#include <poll.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -14,27 +12,13 @@
 #include <mutex>
 
 #include "base/EventLoopAsio.h"
+#include "base/Pidfd.h"
 #include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
 
 namespace {
-
-int pidfdOpen(pid_t pid) { return static_cast<int>(syscall(SYS_pidfd_open, pid, 0)); }
-int pidfdSignal(int pidfd, int signal) {
-    return static_cast<int>(syscall(SYS_pidfd_send_signal, pidfd, signal, nullptr, 0));
-}
-
-// A pidfd becomes readable when its process has exited.
-bool waitForExit(int pidfd, std::chrono::milliseconds timeout) {
-    pollfd p{pidfd, POLLIN, 0};
-    int rc;
-    do {
-        rc = poll(&p, 1, static_cast<int>(timeout.count()));
-    } while (rc < 0 && errno == EINTR);
-    return rc > 0;
-}
 
 // Ends one instance without blocking anyone: SIGTERM, then SIGKILL when it is still there after the grace period,
 // all driven by `queue`'s event loop (a watch on the instance's pidfd and a timer). `done` runs once on `queue`
@@ -48,7 +32,7 @@ void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, st
         close(pidfd);
         return done(0);
     }
-    if (pidfdSignal(pidfd, SIGTERM) != 0) {
+    if (pidfdSendSignal(pidfd, SIGTERM) != 0) {
         int error = errno;
         close(pidfd);
         return done(error == ESRCH ? 0 : error);
@@ -70,7 +54,7 @@ void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, st
     timer->async_wait(
         detail::bindToQueue(queue, [queue, exited, timer, finished, finish](const asio::error_code& error) {
             if (error || *finished) return;
-            if (pidfdSignal(exited->native_handle(), SIGKILL) != 0 && errno != ESRCH) return finish(errno);
+            if (pidfdSendSignal(exited->native_handle(), SIGKILL) != 0 && errno != ESRCH) return finish(errno);
             // A killed process is gone at once, unless it is stuck in the kernel: wait a little, then give up on it.
             timer->expires_after(std::chrono::seconds(1));
             timer->async_wait(detail::bindToQueue(queue, [finish](const asio::error_code& again) {
@@ -78,8 +62,6 @@ void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, st
             }));
         }));
 }
-
-bool hasExited(int pidfd) { return waitForExit(pidfd, std::chrono::milliseconds(0)); }
 
 }  // namespace
 
@@ -93,7 +75,7 @@ struct ServiceManager::Grants {
 
     // Drops the grants of hosts that have ended. REQUIRES: `mutex` held.
     void prune() {
-        grants.remove_if([](const Grant& grant) { return hasExited(grant.host.get()); });
+        grants.remove_if([](const Grant& grant) { return pidfdExited(grant.host.get()); });
     }
 
     mutable std::mutex mutex;
@@ -108,7 +90,7 @@ int ServiceManager::addExternalService(pid_t hostPid, const std::string& executa
     if (executablePath.empty() || hostPid <= 0) return EINVAL;
     UniqueFd host(hostPidfd >= 0 ? fcntl(hostPidfd, F_DUPFD_CLOEXEC, 0) : pidfdOpen(hostPid));
     if (!host) return errno;
-    if (hasExited(host.get())) return ESRCH;
+    if (pidfdExited(host.get())) return ESRCH;
     std::lock_guard lock(grants_->mutex);
     grants_->prune();
     size_t ofHost = 0;

@@ -1,12 +1,13 @@
 #include "platform/zem/ZemPeerCredentials.h"
 
 #include <sys/socket.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <fstream>
+
+#include "base/Pidfd.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77
@@ -15,8 +16,6 @@
 namespace bexil {
 
 namespace {
-
-int pidfdOpen(pid_t pid) { return static_cast<int>(syscall(SYS_pidfd_open, pid, 0)); }
 
 // The pid a pidfd refers to, from /proc/self/fdinfo ("Pid:" is -1 once the process has been reaped).
 pid_t pidOfPidfd(int pidfd) {
