@@ -11,6 +11,7 @@
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemFrame.h"
+#include "policy/BXDPlugIn.h"
 
 namespace bexil {
 
@@ -154,6 +155,10 @@ void Transaction::doneWithDescriptors(std::vector<UniqueFd> descriptors) {
         connection->sendReply(request_, reply);
     else
         connection->sendReplyWithDescriptors(request_, reply, std::move(descriptors));
+}
+
+void Transaction::denyAccess(const BXDPlugIn& plugIn, std::string_view reason) {
+    fail(ErrorCode::NotAllowed, formatPrintf("access to plugin %@ denied: %@", plugIn.identifier(), reason));
 }
 
 void Transaction::fail(ErrorCode code, std::string_view message) { failWithCode(protocol::codeOf(code), message); }

@@ -48,6 +48,11 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.
     void fail(ErrorCode code, const Error& error);
 
+    // The refusal of a plug-in to this host, code 11 "access to plugin ID denied: REASON".
+    void denyAccess(const BXDPlugIn& plugIn, std::string_view reason);
+    // The reason a held plug-in is refused.
+    static constexpr std::string_view kOnHoldReason = "the plug-in is on hold";
+
     const std::shared_ptr<BXDZemClient>& client() const { return client_; }
     const Value& request() const { return request_.body(); }
     const ZemMessage& requestMessage() const { return request_; }

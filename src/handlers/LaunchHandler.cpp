@@ -5,14 +5,12 @@
 
 #include <signal.h>
 
-#include <filesystem>
 #include <memory>
 #include <string>
 
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
 #include "daemon/Transaction.h"
-#include "model/BXBundle.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
 #include "policy/BXDPlugIn.h"
@@ -41,14 +39,11 @@ void Transaction::launchPlugIn() {
     const BXDZemClient& host = *client();
     std::string uuidText = plugIn->uuid() ? plugIn->uuid()->string() : std::string();
     if (server()->holdOnPlugIn(*plugIn)) {
-        fail(ErrorCode::NotAllowed,
-             formatPrintf("access to plugin %@ denied: %@", plugIn->identifier(), "the plug-in is on hold"));
+        denyAccess(*plugIn, kOnHoldReason);
         return;
     }
-    std::shared_ptr<BXBundle> bundle = plugIn->url() ? BXBundle::initWithURL(*plugIn->url()) : nullptr;
-    std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
-    std::error_code ec;
-    if (plugIn->isData() || !executable || !std::filesystem::is_regular_file(*executable, ec)) {
+    std::optional<std::string> executable = plugIn->isData() ? std::nullopt : plugIn->startableExecutable();
+    if (!executable) {
         fail(ErrorCode::OperationFailed,
              formatPrintf("cannot obtain executable path for plug-in %@(%@)", plugIn->identifier(), uuidText));
         return;

@@ -16,13 +16,6 @@
 
 namespace bexil {
 
-namespace {
-
-// The reason a held plug-in is refused, in the same answer as the host policy's refusals.
-constexpr std::string_view kOnHold = "the plug-in is on hold";
-
-}  // namespace
-
 void Transaction::readyPlugIns() {
     std::vector<std::shared_ptr<BXDPlugIn>> toEnable;
     const BXDZemClient& host = *client();
@@ -31,8 +24,8 @@ void Transaction::readyPlugIns() {
         trace::pluginReady(uuidText.c_str());
         if (server()->holdOnPlugIn(*plugIn)) {
             log::ops().notice("denied access to %d for plugin %@(%{public}@): %s", static_cast<int>(host.pid()),
-                              plugIn->identifier(), uuidText, kOnHold.data());
-            fail(ErrorCode::NotAllowed, formatPrintf("access to plugin %@ denied: %@", plugIn->identifier(), kOnHold));
+                              plugIn->identifier(), uuidText, kOnHoldReason.data());
+            denyAccess(*plugIn, kOnHoldReason);
             return false;
         }
         if (plugIn->isData()) return true;
@@ -40,7 +33,7 @@ void Transaction::readyPlugIns() {
         if (std::optional<std::string> reason = plugIn->allowForClient(host, context)) {
             log::ops().notice("denied access to %d for plugin %@(%{public}@): %{public}@", static_cast<int>(host.pid()),
                               plugIn->identifier(), uuidText, *reason);
-            fail(ErrorCode::NotAllowed, formatPrintf("access to plugin %@ denied: %@", plugIn->identifier(), *reason));
+            denyAccess(*plugIn, *reason);
             return false;
         }
         for (const std::shared_ptr<BXDPlugIn>& already : toEnable)

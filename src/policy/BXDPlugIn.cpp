@@ -199,6 +199,19 @@ Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
 
 // ---- Enabling for a host ----
 
+std::optional<std::string> BXDPlugIn::startableExecutableOf(const BXBundle* bundle) {
+    std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
+    // A bundle whose executable is missing answers with its own directory, which nothing can start.
+    std::error_code ec;
+    if (executable && !std::filesystem::is_regular_file(*executable, ec)) return std::nullopt;
+    return executable;
+}
+
+std::optional<std::string> BXDPlugIn::startableExecutable() const {
+    std::shared_ptr<BXBundle> bundle = url() ? BXBundle::initWithURL(*url()) : nullptr;
+    return startableExecutableOf(bundle.get());
+}
+
 std::string BXDPlugIn::sandboxProfile(const PrivacyConsent& consent) const {
     std::optional<Value> typepadPoint = pluginKey(kExtensionPointKey);
     if (typepadPoint && *typepadPoint == Value::string(std::string(kTypepadPoint))) {
@@ -268,10 +281,7 @@ std::optional<Error> BXDPlugIn::enableForClient(const HostAccessClient& client,
                       client.path(), identifier, version, uuidText, url());
 
     std::shared_ptr<BXBundle> bundle = url() ? BXBundle::initWithURL(*url()) : nullptr;
-    std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
-    // A bundle whose executable is missing answers with its own directory, which no service manager can start.
-    std::error_code ec;
-    if (executable && !std::filesystem::is_regular_file(*executable, ec)) executable.reset();
+    std::optional<std::string> executable = startableExecutableOf(bundle.get());
     if (!executable) {
         log::ops().error("failed to obtain execPath for plug-in %@(%{public}@) bundle=%@", description(), uuidText,
                          bundle ? bundle->description() : std::string("(null)"));

@@ -22,6 +22,7 @@
 
 namespace bexil {
 
+class BXBundle;
 class LXBexilProxy;
 
 // What enabling a plug-in uses besides the host: the service manager that keeps the grant, and the user's privacy
@@ -73,6 +74,11 @@ class BXDPlugIn : public BXPlugInCore {
     static constexpr std::string_view kKSNServiceTypepadNetwork = "typepad-network";
     // The package type the service manager expects in an activation overlay.
     static constexpr std::string_view kServicePackageType = "ZEM!";
+
+    // The plug-in's executable when it is a file that can be started; none when the bundle cannot be opened or
+    // names no executable that exists. Reads the bundle from disk.
+    std::optional<std::string> startableExecutable() const;
+    static std::optional<std::string> startableExecutableOf(const BXBundle* bundle);
 
     // The sandbox profile the plug-in runs under: by its extension point, and for a typepad plug-in by whether it
     // asks for open access and the user granted its application the typepad network.
