@@ -45,6 +45,25 @@ int usageFailure(const Error& error) {
     return kExitUsage;
 }
 
+// The exit status of a reply that reports a failure (said on standard error, and the reply printed with --json),
+// or none when it reports success.
+std::optional<int> failureStatus(const Options& options, const char* what, const Value& message) {
+    std::optional<Error> error;
+    try {
+        error = BXDaemonClient::errorInReply(BXDaemonClient::Reply(message));
+    } catch (const InternalInconsistency& inconsistency) {
+        std::fprintf(stderr, "bexil: %s failed: %s\n", what, inconsistency.what());
+        return kExitSoftware;
+    }
+    if (!error) return std::nullopt;
+    if (options.json) std::printf("%s\n", toJson(message).c_str());
+    std::fprintf(stderr, "bexil: %s failed (code %lld): %s\n", what, static_cast<long long>(error->code()),
+                 error->localizedDescription().value_or("").c_str());
+    if (const Value* conflicts = message.find(protocol::key::kConflicts); conflicts && !options.json)
+        std::fprintf(stderr, "bexil: busy: %s\n", conflicts->description().c_str());
+    return exitStatusForCode(error->code());
+}
+
 // Sends one request and turns the outcome into an exit status; on success `onSuccess` prints the reply.
 int roundTrip(const Options& options, const char* what,
               const std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>& send,
@@ -63,25 +82,8 @@ int roundTrip(const Options& options, const char* what,
                      ZemListener::socketPathForService(options.service).c_str());
         return kExitUnavailable;
     }
-    std::optional<Error> error;
-    try {
-        error = BXDaemonClient::errorInReply(*reply);
-    } catch (const InternalInconsistency& inconsistency) {
-        std::fprintf(stderr, "bexil: %s failed: %s\n", what, inconsistency.what());
-        return kExitSoftware;
-    }
     const Value& message = std::get<Value>(*reply);
-    if (error) {
-        if (options.json) {
-            std::printf("%s\n", toJson(message).c_str());
-        }
-        std::fprintf(stderr, "bexil: %s failed (code %lld): %s\n", what, static_cast<long long>(error->code()),
-                     error->localizedDescription().value_or("").c_str());
-        if (const Value* conflicts = message.find(protocol::key::kConflicts); conflicts && !options.json) {
-            std::fprintf(stderr, "bexil: busy: %s\n", conflicts->description().c_str());
-        }
-        return exitStatusForCode(error->code());
-    }
+    if (std::optional<int> failed = failureStatus(options, what, message)) return *failed;
     if (options.json && !onSuccess) {
         std::printf("%s\n", toJson(message).c_str());
         return 0;
@@ -488,11 +490,7 @@ int launchCommand(const Options& options, Arguments& arguments) {
         return kExitUnavailable;
     }
     const ZemMessage& message = std::get<ZemMessage>(reply);
-    if (std::optional<Error> error = BXDaemonClient::errorInReply(BXDaemonClient::Reply(message.body()))) {
-        std::fprintf(stderr, "bexil: launch failed (code %lld): %s\n", static_cast<long long>(error->code()),
-                     error->localizedDescription().value_or("").c_str());
-        return exitStatusForCode(error->code());
-    }
+    if (std::optional<int> failed = failureStatus(options, "launch", message.body())) return *failed;
     if (message.descriptorCount() != 1) {
         std::fprintf(stderr, "bexil: launch answered without a socket to the plug-in\n");
         return kExitSoftware;
