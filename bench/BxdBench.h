@@ -8,6 +8,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
@@ -115,6 +116,41 @@ inline void enterPrivateBxdEnvironment(const std::filesystem::path& root) {
         dup2(log, STDERR_FILENO);
         dup2(log, STDOUT_FILENO);
     }
+}
+
+// The median and 99th percentile of `micros` (reordered).
+struct Percentiles {
+    double p50, p99;
+};
+inline Percentiles percentilesOf(std::vector<double>& micros) {
+    std::sort(micros.begin(), micros.end());
+    return {micros[micros.size() / 2], micros[std::min(micros.size() - 1, micros.size() * 99 / 100)]};
+}
+
+// A new temporary directory named after `prefix`, with the service/, state/, runtime/ and entitlements.d/ a
+// private bxd needs (the last one only its owner may write, as bxd demands).
+inline std::filesystem::path makePrivateBxdRoot(const std::string& prefix) {
+    std::string pattern = (std::filesystem::temp_directory_path() / (prefix + "-XXXXXX")).string();
+    if (mkdtemp(pattern.data()) == nullptr) die("mkdtemp");
+    const std::filesystem::path root = pattern;
+    for (const char* sub : {"service", "state", "runtime", "entitlements.d"})
+        std::filesystem::create_directories(root / sub);
+    std::filesystem::permissions(root / "entitlements.d", std::filesystem::perms(0755));
+    return root;
+}
+
+// Starts the bxd built beside this program in the private environment of `root`, its annotations in
+// root/annotations.vrec; returns its pid.
+inline pid_t startPrivateBxd(const std::filesystem::path& root) {
+    pid_t bxd = fork();
+    if (bxd < 0) die("fork");
+    if (bxd == 0) {
+        enterPrivateBxdEnvironment(root);
+        std::string binary = defaultBxdPath(), document = (root / "annotations.vrec").string();
+        execl(binary.c_str(), binary.c_str(), "-d", document.c_str(), nullptr);
+        _exit(127);
+    }
+    return bxd;
 }
 
 }  // namespace bexil::bench

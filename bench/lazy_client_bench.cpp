@@ -44,11 +44,7 @@ void roundTrip(int fd, const std::vector<uint8_t>& frame) {
     bench::readExactly(fd, payload.data(), payload.size());
 }
 
-struct Figures {
-    double p50, p99;
-};
-
-Figures measure(int fd, int requests) {
+bench::Percentiles measure(int fd, int requests) {
     std::vector<uint8_t> frame = requestFrame(1);
     std::vector<double> micros;
     micros.reserve(static_cast<size_t>(requests));
@@ -57,8 +53,7 @@ Figures measure(int fd, int requests) {
         roundTrip(fd, frame);
         micros.push_back(std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count());
     }
-    std::sort(micros.begin(), micros.end());
-    return {micros[micros.size() / 2], micros[std::min(micros.size() - 1, micros.size() * 99 / 100)]};
+    return bench::percentilesOf(micros);
 }
 
 }  // namespace
@@ -78,17 +73,8 @@ int main(int argc, char** argv) {
         (c == 'r' ? requests : lazyRequests) = static_cast<int>(*value);
     }
 
-    char pattern[] = "/tmp/lazy-client-bench-XXXXXX";
-    const fs::path root = mkdtemp(pattern);
-    for (const char* sub : {"service", "state", "runtime", "entitlements.d"}) fs::create_directories(root / sub);
-    fs::permissions(root / "entitlements.d", fs::perms(0755));
-    pid_t bxd = fork();
-    if (bxd == 0) {
-        bench::enterPrivateBxdEnvironment(root);
-        std::string binary = bench::defaultBxdPath(), document = (root / "annotations.vrec").string();
-        execl(binary.c_str(), binary.c_str(), "-d", document.c_str(), nullptr);
-        _exit(127);
-    }
+    const fs::path root = bench::makePrivateBxdRoot("lazy-client-bench");
+    pid_t bxd = bench::startPrivateBxd(root);
     const std::string socket = (root / "service" / bench::kBxdServiceName).string();
     int fd = -1;
     for (int i = 0; i < 500 && (fd = bench::connectTo(socket)) < 0; ++i)
@@ -96,7 +82,7 @@ int main(int argc, char** argv) {
     if (fd < 0) die("bxd did not come up");
 
     measure(fd, 1000);  // warm up
-    Figures idle = measure(fd, requests);
+    bench::Percentiles idle = measure(fd, requests);
 
     // The lazy client: writes its requests as fast as bxd takes them and never reads.
     pid_t lazy = fork();
@@ -113,7 +99,7 @@ int main(int argc, char** argv) {
         _exit(0);
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(200));  // let it fill bxd's queue for it
-    Figures loaded = measure(fd, requests);
+    bench::Percentiles loaded = measure(fd, requests);
     kill(lazy, SIGKILL);
     waitpid(lazy, nullptr, 0);
 

@@ -93,11 +93,7 @@ void writeInfo(const fs::path& bundle, const std::string& identifier, const char
         die("writing Info.vrec");
 }
 
-struct Figures {
-    double p50, p99;
-};
-
-Figures measure(int rounds, const std::function<void()>& once) {
+bench::Percentiles measure(int rounds, const std::function<void()>& once) {
     std::vector<double> micros;
     micros.reserve(static_cast<size_t>(rounds));
     for (int i = 0; i < rounds; ++i) {
@@ -105,8 +101,7 @@ Figures measure(int rounds, const std::function<void()>& once) {
         once();
         micros.push_back(std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count());
     }
-    std::sort(micros.begin(), micros.end());
-    return {micros[micros.size() / 2], micros[std::min(micros.size() - 1, micros.size() * 99 / 100)]};
+    return bench::percentilesOf(micros);
 }
 
 }  // namespace
@@ -126,10 +121,7 @@ int main(int argc, char** argv) {
         (c == 'r' ? rounds : launches) = static_cast<int>(*value);
     }
 
-    char pattern[] = "/tmp/plugin-use-bench-XXXXXX";
-    const fs::path root = mkdtemp(pattern);
-    for (const char* sub : {"service", "state", "runtime", "entitlements.d"}) fs::create_directories(root / sub);
-    fs::permissions(root / "entitlements.d", fs::perms(0755));
+    const fs::path root = bench::makePrivateBxdRoot("plugin-use-bench");
     const fs::path self = fs::read_symlink("/proc/self/exe").parent_path();
     const fs::path helloPlugIn = (self / ".." / "examples/plugins/hello-plugin").lexically_normal();
     fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples/bundles/Greeter.app", root / "Greeter.app",
@@ -147,13 +139,7 @@ int main(int argc, char** argv) {
         paths.push_back(bundle.string());
     }
 
-    pid_t bxd = fork();
-    if (bxd == 0) {
-        bench::enterPrivateBxdEnvironment(root);
-        std::string binary = bench::defaultBxdPath(), document = (root / "annotations.vrec").string();
-        execl(binary.c_str(), binary.c_str(), "-d", document.c_str(), nullptr);
-        _exit(127);
-    }
+    pid_t bxd = bench::startPrivateBxd(root);
     for (int i = 0; i < 500 && !fs::exists(root / "service" / bench::kBxdServiceName); ++i)
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     setenv("BX_SERVICE_DIR", (root / "service").c_str(), 1);
@@ -187,14 +173,14 @@ int main(int argc, char** argv) {
         const Value launch = request("launch", {{"uuids", helloUuid}});
 
         for (int i = 0; i < 200; ++i) host.roundTrip(reference);  // warm caches and the connection
-        Figures ref = measure(rounds, [&] { host.roundTrip(reference); });
-        Figures lock = measure(rounds, [&] {
+        bench::Percentiles ref = measure(rounds, [&] { host.roundTrip(reference); });
+        bench::Percentiles lock = measure(rounds, [&] {
             Value uuid = host.roundTrip(hold).body().get("uuids");
             host.roundTrip(request("lock", {{"uuids", Value::array({uuid})}}));
         });
-        Figures one = measure(rounds, [&] { host.roundTrip(readyOne); });
-        Figures many = measure(rounds, [&] { host.roundTrip(readyTwenty); });
-        Figures started = measure(launches, [&] {
+        bench::Percentiles one = measure(rounds, [&] { host.roundTrip(readyOne); });
+        bench::Percentiles many = measure(rounds, [&] { host.roundTrip(readyTwenty); });
+        bench::Percentiles started = measure(launches, [&] {
             ZemMessage reply = host.roundTrip(launch);
             if (reply.descriptorCount() != 1) die("launch passed no socket");
             int plugIn = reply.descriptor(0);
@@ -204,7 +190,7 @@ int main(int argc, char** argv) {
         });
 
         printf("%-12s %10s %10s %10s\n", "request", "p50 us", "p99 us", "p50/ref");
-        auto row = [&](const char* name, Figures f) {
+        auto row = [&](const char* name, bench::Percentiles f) {
             printf("%-12s %10.1f %10.1f %10.2f\n", name, f.p50, f.p99, f.p50 / ref.p50);
         };
         row("reference", ref);
