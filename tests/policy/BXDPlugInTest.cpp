@@ -13,6 +13,7 @@
 #include "platform/log/CaptureSink.h"
 #include "platform/sandbox/SandboxExtensions.h"
 #include "policy/BXDPlugIn.h"
+#include "policy/BXDPlugInSignature.h"
 #include "policy/BXMatchRules.h"
 
 namespace bexil {
@@ -216,6 +217,27 @@ TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
     ASSERT_TRUE(form);
     EXPECT_EQ(form->value().get("localizedContainingDisplayName"), str("Greeter"));
     EXPECT_EQ(form->value().get("bundleInfo"), helloInfo());
+}
+
+// Only the build tools' "DT" keys go, by a case-sensitive prefix: a key that merely starts with "dt", or holds
+// "DT" later, is the bundle's own.
+TEST(BXDPlugInInfo, PruningDropsTheBuildToolKeysOnly) {
+    Value pruned = BXDPlugIn::prunedInfoDictionaryFor(dict({{"DTCompiler", str("cc")},
+                                                            {"DT", str("bare prefix")},
+                                                            {"BDBundleVersion", str("7")},
+                                                            {"dtLocal", str("kept")},
+                                                            {"XDTool", str("kept")}}));
+    EXPECT_EQ(pruned, dict({{"BDBundleVersion", str("7")}, {"dtLocal", str("kept")}, {"XDTool", str("kept")}}));
+    EXPECT_EQ(BXDPlugIn::prunedInfoDictionaryFor(dict({})), dict({}));
+}
+
+// The signature summary is a placeholder that must never repeat, so that nothing can take two bundles' summaries
+// for the same code.
+TEST(BXDPlugInInfo, SignatureSummaryIsAFreshDigestWithThePlaceholderRequirement) {
+    BXDPlugInSignature first(kHelloPath), second(kHelloPath);
+    EXPECT_EQ(first.requirement(), "dummy requirement");
+    EXPECT_NE(first.cdhash(), second.cdhash()) << "the same URL still gives another digest";
+    EXPECT_NE(first.cdhash(), (std::array<uint8_t, BXDPlugInSignature::kDigestBytes>{}));
 }
 
 // Plug-in bundles on disk, so that the sandbox can resolve the paths it issues tokens for.
