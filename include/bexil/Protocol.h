@@ -85,9 +85,11 @@ inline constexpr std::string_view kMatches = "matches";          // array of plu
 inline constexpr std::string_view kConflicts = "conflicts";      // array, in a "lock" reply refused as busy
 inline constexpr std::string_view kExtensions = "extensions";    // array of tokens, in an "access" reply
 inline constexpr std::string_view kPid = "pid";                  // uint64, the instance a "launch" started
+inline constexpr std::string_view kBundleInfo = "bundleInfo";    // dictionary, what a "launch" started
 inline constexpr std::string_view kHolds = "holds";              // array of hold descriptions, in a "holds" reply
-inline constexpr std::array kList{kRequest,   kVersion, kPaths,   kUuids,     kFlags,      kRules, kAnnotations,
-                                  kErrorCode, kError,   kMatches, kConflicts, kExtensions, kPid,   kHolds};
+inline constexpr std::array kList{kRequest,   kVersion,     kPaths,     kUuids,      kFlags,
+                                  kRules,     kAnnotations, kErrorCode, kError,      kMatches,
+                                  kConflicts, kExtensions,  kPid,       kBundleInfo, kHolds};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

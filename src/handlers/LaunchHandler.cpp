@@ -84,6 +84,9 @@ void Transaction::launchPlugIn() {
         return;
     }
     reply().set(protocol::key::kPid, Value::uint64(static_cast<uint64_t>(launched->pid)));
+    // What was started, as the registry knows the bundle, without the entries that only say how it was built.
+    if (std::optional<Value> info = plugIn->bundleInfoDictionary(); info && info->isDictionary())
+        reply().set(protocol::key::kBundleInfo, BXDPlugIn::prunedInfoDictionaryFor(*info));
     std::vector<UniqueFd> descriptors;
     descriptors.push_back(std::move(launched->hostEnd));
     doneWithDescriptors(std::move(descriptors));

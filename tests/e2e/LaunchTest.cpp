@@ -83,6 +83,7 @@ class LaunchTest : public DaemonTest {
             {{"BDBundleIdentifier", Value::string("com.example.probe." + name)},
              {"BDBundleExecutable", Value::string("probe")},
              {"BDBundleVersion", Value::string("1")},
+             {"DTBuildTool", Value::string("made by hand")},
              {"RZExtension", Value::dictionary({{"PrincipalClass", Value::string("Probe")},
                                                 {"RZExtensionPointIdentifier", Value::string(point)},
                                                 {"RZExtensionProtocol", Value::string("Probing")},
@@ -228,6 +229,9 @@ TEST_F(LaunchTest, APlugInSeesOnlyItsBundleContainerAndTmpAndTheNetworkItsProfil
     auto [openReply, openChannel] = launch(host, open);
     auto [closedReply, closedChannel] = launch(host, closed);
     ASSERT_TRUE(openChannel && closedChannel) << errorText(openReply) << errorText(closedReply) << bxd_.log();
+    const Value& started = openReply.get("bundleInfo");
+    EXPECT_EQ(started.get("BDBundleIdentifier"), Value::string("com.example.probe.open")) << "the reply says what ran";
+    EXPECT_EQ(started.find("DTBuildTool"), nullptr) << "without what only says how it was built";
 
     const std::string own = container("com.example.probe.open").string();
     EXPECT_EQ(exchange(openChannel.get(), "write " + own + "/note.txt"), "ok");
@@ -258,6 +262,7 @@ TEST_F(LaunchTest, TheToolLaunchesAndTalksToThePlugIn) {
     EXPECT_EQ(run.out.rfind("Hello, world! (plug-in pid ", 0), 0u) << run.out;
     EXPECT_NE(run.out.find("\nHello, again! "), std::string::npos) << run.out;
     EXPECT_EQ(run.err.rfind("bexil: plug-in instance ", 0), 0u) << run.err;
+    EXPECT_NE(run.err.find(" started (com.example.greeter.hello 1.2)\n"), std::string::npos) << run.err;
 }
 
 // Runs the host client with `arguments` as the next process (no shell in between, which would take a pid

@@ -464,6 +464,18 @@ void relay(int plugIn) {
     }
 }
 
+// "identifier version" of the bundle a launch started, from its information dictionary.
+std::string startedBundle(const Value& info) {
+    std::string text(info.get("BDBundleIdentifier").stringView());
+    for (const char* key : {"BDBundleShortVersionString", "BDBundleVersion"}) {
+        if (const Value& version = info.get(key); version.isString()) {
+            text += " " + std::string(version.stringView());
+            break;
+        }
+    }
+    return text.empty() ? "unnamed bundle" : text;
+}
+
 // Makes the plug-in ready for this process, launches it and talks to it: each --say line is sent and its answer
 // printed, or without --say standard input is relayed to it and its output to standard output.
 int launchCommand(const Options& options, Arguments& arguments) {
@@ -500,7 +512,8 @@ int launchCommand(const Options& options, Arguments& arguments) {
     if (options.json)
         std::printf("%s\n", toJson(message.body()).c_str());
     else
-        std::fprintf(stderr, "bexil: plug-in instance %llu started\n", static_cast<unsigned long long>(pid));
+        std::fprintf(stderr, "bexil: plug-in instance %llu started (%s)\n", static_cast<unsigned long long>(pid),
+                     startedBundle(message.body().get(protocol::key::kBundleInfo)).c_str());
     std::fflush(stdout);
     if (arguments.say.empty()) {
         relay(plugIn);
