@@ -113,8 +113,13 @@ TEST_F(HoldTest, PathProblemsRefuseTheHold) {
     expectFailure(lockRequest({missing}, 0), 9, "invalid path: " + missing);
     expectFailure(lockRequest({hello(), plugIn("Greeter.app")}, 0x1), 9, "no plug-in at path:" + plugIn("Greeter.app"));
     expectFailure(request("lock", {{"flags", Value::uint64(0)}}), 4, "invalid request format");
+    // A path that is a file, not a bundle directory: no plug-in is there, and no application has plug-ins there.
+    const std::string file = hello() + "/Info.vrec";
+    expectFailure(lockRequest({file}, 0x1), 9, "no plug-in at path:" + file);
     EXPECT_TRUE(discovered(kHello)) << "the walk stopped: no hold over the paths before the bad one";
     EXPECT_EQ(posted(), before);
+    EXPECT_TRUE(hold(lockRequest({file}, 0)).get("uuids").isUuid()) << "an application without plug-ins";
+    EXPECT_TRUE(discovered(kHello));
 
     // Both lists empty: an empty release releases nothing, an empty hold holds nothing; both succeed.
     EXPECT_EQ(succeed(request("lock", {{"uuids", Value::emptyArray()}})).count(), 0u);
