@@ -152,6 +152,25 @@ struct Outcome {
     std::string out, err;
 };
 
+// A bubblewrap command line that runs a program in a private root made of the system's programs and libraries,
+// `root` (read-write) and the build tree, all at their own paths, followed by the `more` arguments (further mounts);
+// the process ids stay shared with the test, so clients outside talk to a daemon started this way as to any.
+inline std::vector<std::string> privateRootLauncher(const std::filesystem::path& root,
+                                                    const std::vector<std::string>& more) {
+    std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc", "--dev", "/dev"};
+    const std::string mounts[][3] = {{"--ro-bind", "/usr", "/usr"},
+                                     {"--ro-bind", "/etc", "/etc"},
+                                     {"--bind", root.string(), root.string()},
+                                     {"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR},
+                                     {"--symlink", "usr/lib", "/lib"},
+                                     {"--symlink", "usr/lib64", "/lib64"},
+                                     {"--symlink", "usr/bin", "/bin"},
+                                     {"--symlink", "usr/sbin", "/sbin"}};
+    for (const auto& mount : mounts) launcher.insert(launcher.end(), std::begin(mount), std::end(mount));
+    launcher.insert(launcher.end(), more.begin(), more.end());
+    return launcher;
+}
+
 // A private daemon (not started yet) with its own preferences directory exported to this process, so the tool
 // and the daemon agree on it, plus the bundles, entitlements and requests most end-to-end tests need.
 class DaemonTest : public ::testing::Test {

@@ -30,21 +30,10 @@ class SystemPlugInTest : public DaemonTest {
         fs::copy(kExamples / "System/Library/PlugIns/Clock.bxplugin", system_ / "Library/PlugIns/Clock.bxplugin",
                  fs::copy_options::recursive);
 
-        // Only the system's programs and libraries, this test's temporary root and the build tree, at their own
-        // paths, plus the directories that stand for /System and /SystemX.
-        std::string root = bxd_.root().string();
-        std::vector<std::string> launcher = {"/usr/bin/bwrap", "--die-with-parent", "--proc", "/proc", "--dev", "/dev"};
-        const std::string mounts[][3] = {{"--ro-bind", "/usr", "/usr"},
-                                         {"--ro-bind", "/etc", "/etc"},
-                                         {"--bind", root, root},
-                                         {"--ro-bind", BEXIL_BINARY_DIR, BEXIL_BINARY_DIR},
-                                         {"--ro-bind", system_.string(), "/System"},
-                                         {"--ro-bind", bundles_.string(), "/SystemX/Library/PlugIns"},
-                                         {"--symlink", "usr/lib", "/lib"},
-                                         {"--symlink", "usr/lib64", "/lib64"},
-                                         {"--symlink", "usr/bin", "/bin"},
-                                         {"--symlink", "usr/sbin", "/sbin"}};
-        for (const auto& mount : mounts) launcher.insert(launcher.end(), std::begin(mount), std::end(mount));
+        // This test's temporary root and the build tree, plus the directories that stand for /System and /SystemX.
+        std::vector<std::string> launcher = privateRootLauncher(
+            bxd_.root(),
+            {"--ro-bind", system_.string(), "/System", "--ro-bind", bundles_.string(), "/SystemX/Library/PlugIns"});
         // Machines without user namespaces or mount rights cannot make the private root; say so instead of failing.
         std::string probe;
         for (const std::string& word : launcher) probe += "'" + word + "' ";
