@@ -12,6 +12,7 @@
 #include <thread>
 #include <vector>
 
+#include "FaultyVfs.h"
 #include "TestSupport.h"
 #include "base/Document.h"
 #include "platform/ledgerix/LXApplicationProxy.h"
@@ -339,6 +340,51 @@ TEST_F(LedgerixPersistenceTest, KilledWhileRegisteringLosesNothingThatWasReporte
         }
     }
     EXPECT_TRUE(anyReported) << "the child never got a registration done before being killed";
+}
+
+// Guards a failing disk: while the store's writes or its syncs fail, a registration fails with the store's error and
+// changes nothing that can be seen, now or after reopening; once the disk works again the same registration lands,
+// and a reopened registry holds each bundle once under the UUID it was given.
+TEST_F(LedgerixPersistenceTest, FailingWritesOrSyncsRefuseTheRegistrationAndLeaveTheStoreWhole) {
+    workspace_.reset();
+    LedgerixWorkspace::Options options{state_, root_};
+    options.storeVfs = test::FaultyVfs::kName;
+    test::FaultyVfs::set(test::FaultyVfs::Fault::None);
+    for (test::FaultyVfs::Fault fault : {test::FaultyVfs::Fault::Writes, test::FaultyVfs::Fault::Syncs}) {
+        SCOPED_TRACE(fault == test::FaultyVfs::Fault::Writes ? "failing writes" : "failing syncs");
+        const std::string tag = fault == test::FaultyVfs::Fault::Writes ? "w" : "s";
+        fs::path kept = writePlugIn(bundles_ / ("Kept" + tag + ".bxplugin"), {.identifier = "com.example.kept" + tag});
+        fs::path refused =
+            writePlugIn(bundles_ / ("Refused" + tag + ".bxplugin"), {.identifier = "com.example.refused" + tag});
+        std::optional<Uuid> keptUuid, refusedUuid;
+        {
+            auto opened = LedgerixWorkspace::open(options);
+            ASSERT_TRUE(opened.ok()) << opened.error().description();
+            workspace_ = opened.value();
+            keptUuid = registerOK(kept)->pluginUUID();
+            const size_t before = count();
+
+            test::FaultyVfs::set(fault);
+            auto failed = workspace_->registerPlugin(refused.string());
+            test::FaultyVfs::set(test::FaultyVfs::Fault::None);
+            ASSERT_FALSE(failed.ok());
+            EXPECT_EQ(failed.error().code(), kLXStoreFailure) << failed.error().description();
+            EXPECT_NE(failed.error().description().find("disk I/O error"), std::string::npos)
+                << failed.error().description();
+            EXPECT_EQ(count(), before);
+            EXPECT_FALSE(workspace_->plugInProxyForURL(refused.string()));
+
+            std::shared_ptr<const LXBexilProxy> landed = registerOK(refused);
+            ASSERT_TRUE(landed);
+            refusedUuid = landed->pluginUUID();
+            workspace_.reset();
+        }
+        auto reopened = LedgerixWorkspace::open({state_, root_});
+        ASSERT_TRUE(reopened.ok()) << reopened.error().description();
+        EXPECT_FALSE(reopened.value()->checkIntegrity());
+        EXPECT_EQ(reopened.value()->plugInProxyForURL(kept.string())->pluginUUID(), keptUuid);
+        EXPECT_EQ(reopened.value()->plugInProxyForURL(refused.string())->pluginUUID(), refusedUuid);
+    }
 }
 
 // A database cut short (which a light open would not notice) is moved aside untouched at open and an empty, working

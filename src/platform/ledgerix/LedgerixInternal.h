@@ -67,8 +67,8 @@ struct Opened {
 };
 enum class OpenCheck { Light, Full };
 // Opens (creating when needed) and configures the store at `path`, checks it as `check` says and migrates its
-// schema to kSchemaVersion.
-Opened openStore(const std::string& path, LedgerixWorkspace::Durability durability, OpenCheck check);
+// schema to kSchemaVersion, through the VFS that `options` names.
+Opened openStore(const std::string& path, const LedgerixWorkspace::Options& options, OpenCheck check);
 // Moves a damaged database and its companions aside; the error when that is impossible.
 std::optional<Error> quarantine(const std::string& path, std::string* movedTo);
 

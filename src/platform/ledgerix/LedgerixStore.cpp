@@ -247,17 +247,17 @@ std::optional<Opened> migrate(sqlite3* db, const std::string& path) {
 
 }  // namespace
 
-Opened openStore(const std::string& path, LedgerixWorkspace::Durability durability, OpenCheck check) {
+Opened openStore(const std::string& path, const LedgerixWorkspace::Options& options, OpenCheck check) {
     sqlite3* db = nullptr;
-    int rc =
-        sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr);
+    int rc = sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX,
+                             options.storeVfs.empty() ? nullptr : options.storeVfs.c_str());
     std::optional<Opened> failure;
     if (rc != SQLITE_OK) {
         failure = failedTo(db, "open the database", rc);
     } else {
         sqlite3_extended_result_codes(db, 1);
         sqlite3_busy_timeout(db, 5000);
-        failure = configure(db, durability);
+        failure = configure(db, options.durability);
         if (!failure) failure = check == OpenCheck::Full ? checkEveryPage(db) : checkHeaderAndLength(db, path);
         if (!failure) failure = migrate(db, path);
     }

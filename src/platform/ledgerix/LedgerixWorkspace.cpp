@@ -52,13 +52,13 @@ Result<std::shared_ptr<LedgerixWorkspace>> LedgerixWorkspace::open(Options optio
     std::string path = (options.stateDirectory / kDatabaseFileName).string();
     fs::path marker = path + std::string(kNeedsCheckSuffix);
     bool suspect = fs::exists(marker, ec);
-    Opened opened = openStore(path, options.durability, suspect ? OpenCheck::Full : OpenCheck::Light);
+    Opened opened = openStore(path, options, suspect ? OpenCheck::Full : OpenCheck::Light);
     if (!opened.db && opened.damaged) {
         std::string movedTo;
         if (std::optional<Error> error = quarantine(path, &movedTo)) return *error;
         log::ops().error("registry database %s is damaged (%@); moved it aside to %s and started an empty registry",
                          path, opened.error, movedTo);
-        opened = openStore(path, options.durability, OpenCheck::Light);
+        opened = openStore(path, options, OpenCheck::Light);
     }
     if (!opened.db) return *opened.error;
     if (suspect) fs::remove(marker, ec);

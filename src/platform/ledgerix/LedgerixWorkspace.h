@@ -42,6 +42,9 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
         // "<root>/System/"). Only tests change it, so that they never need a real /System.
         std::filesystem::path rootDirectory = "/";
         Durability durability = Durability::Full;
+        // The SQLite VFS the store's files are opened through; empty for the default. Tests name one that fails
+        // reads, writes or syncs on demand, to show what the registry does when its storage fails.
+        std::string storeVfs;
     };
 
     // Opens (creating or migrating) the registry. A damaged database is moved aside and an empty one started (logged);
