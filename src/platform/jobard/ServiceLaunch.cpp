@@ -22,6 +22,7 @@
 #include "base/EventLoopAsio.h"
 #include "base/Format.h"
 #include "base/Pidfd.h"
+#include "platform/containers/DataContainer.h"
 #include "platform/jobard/ServiceManager.h"
 #include "platform/log/Log.h"
 #include "platform/sandbox/SandboxProfiles.h"
@@ -118,19 +119,14 @@ Result<ServiceManager::LaunchedService> ServiceManager::startService(const Servi
         return launchError(formatPrintf("cannot launch %s: bubblewrap is not available (%s: %s)", name.c_str(),
                                         bwrap.c_str(), strerror(errno)));
 
-    // The plug-in runs as the host's user, so its container (and the TMPDIR inside it) must be that user's.
+    // The plug-in runs as the host's user, so its container (and the TMPDIR inside it) must be that user's. A user
+    // who ran the plug-in before owns the container and could have put links in it: prepare follows none.
     if (launch.container) {
-        std::error_code ec;
-        fs::create_directories(fs::path(*launch.container) / "tmp", ec);
-        if (ec)
-            return launchError(formatPrintf("cannot launch %s: cannot make its data container %s: %s", name.c_str(),
-                                            launch.container->c_str(), ec.message().c_str()));
-        if (geteuid() == 0 && launch.uid != 0) {
-            if (chown(launch.container->c_str(), launch.uid, launch.gid) != 0 ||
-                chown((fs::path(*launch.container) / "tmp").c_str(), launch.uid, launch.gid) != 0)
-                return launchError(formatPrintf("cannot launch %s: cannot give its data container to user %u: %s",
-                                                name.c_str(), static_cast<unsigned>(launch.uid), strerror(errno)));
-        }
+        std::optional<DataContainer::Owner> owner;
+        if (geteuid() == 0 && launch.uid != 0) owner = DataContainer::Owner{launch.uid, launch.gid};
+        if (std::optional<Error> error = DataContainer::prepare(*launch.container, owner))
+            return launchError(formatPrintf("cannot launch %s: %s", name.c_str(),
+                                            error->localizedDescription().value_or("its data container")));
     }
 
     SandboxProfiles::Launch sandbox{launch.bundlePath, launch.container, launch.executablePath, {}, kStatusFd};

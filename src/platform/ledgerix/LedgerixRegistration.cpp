@@ -12,6 +12,7 @@
 
 #include "base/Document.h"
 #include "platform/bundles/DirectoryBundle.h"
+#include "platform/containers/DataContainer.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixInternal.h"
 #include "platform/log/Log.h"
@@ -126,16 +127,8 @@ Result<LedgerixWorkspace::Row> LedgerixWorkspace::readBundle(std::string_view ur
 }
 
 std::optional<Error> LedgerixWorkspace::makeContainer(const std::string& path) {
-    std::error_code ec;
-    fs::create_directories(fs::path(path) / "tmp", ec);
-    if (ec)
-        return lxError(kLXContainerFailure, formatPrintf("cannot make the data container %s: %s", path, ec.message()));
-    for (const fs::path& directory : {fs::path(path), fs::path(path) / "tmp"}) {
-        struct stat status;
-        if (::lstat(directory.c_str(), &status) != 0 || !S_ISDIR(status.st_mode))
-            return lxError(kLXContainerFailure, formatPrintf("the data container %s is not a directory", path));
-        ::chmod(directory.c_str(), 0700);
-    }
+    if (std::optional<Error> error = DataContainer::prepare(path))
+        return lxError(kLXContainerFailure, error->localizedDescription().value_or(path));
     return std::nullopt;
 }
 
