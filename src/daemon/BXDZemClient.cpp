@@ -109,6 +109,12 @@ int BXDZemClient::pidfd() const {
     return connection->peerCredentials().pidfd->get();
 }
 
+std::optional<UserIdentity> BXDZemClient::user() const {
+    std::shared_ptr<ZemConnection> connection = connection_.lock();
+    if (!connection) return std::nullopt;
+    return UserIdentity{connection->peerUid(), connection->peerGid()};
+}
+
 pid_t BXDZemClient::pid() const {
     std::shared_ptr<ZemConnection> connection = connection_.lock();
     return connection ? connection->peerPid() : 0;

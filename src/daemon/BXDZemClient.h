@@ -12,6 +12,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/ActingAs.h"
 #include "base/Value.h"
 #include "platform/zem/ZemConnection.h"
 #include "policy/HostAccessClient.h"
@@ -54,6 +55,8 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     pid_t pid() const override;
     // The peer's executable path; empty when it could not be found.
     const std::string& path() const override { return path_; }
+    // The peer's user and group as the transport read them at connect time; none once the connection is gone.
+    std::optional<UserIdentity> user() const;
     // The pidfd the transport took when the peer connected; -1 when there is none or the connection is gone.
     int pidfd() const override;
     // The bundle that contains the peer's executable; null when there is none.

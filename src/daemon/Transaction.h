@@ -14,6 +14,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/ActingAs.h"
 #include "base/Error.h"
 #include "base/UniqueFd.h"
 #include "base/Value.h"
@@ -71,9 +72,10 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
 
     // Walks the request's "paths": every element must be an absolute path string. True when every path was handled
     // and every handler call returned true; on false the transaction has been answered.
-    bool marshalPaths(const RegistrationHandler& handler);
+    // Paths are resolved with the rights of `resolveAs` when given (see ActingAs), else with bxd's own.
+    bool marshalPaths(const RegistrationHandler& handler, std::optional<UserIdentity> resolveAs = std::nullopt);
     // marshalPaths, then done() when it returned true.
-    bool processPaths(const RegistrationHandler& handler);
+    bool processPaths(const RegistrationHandler& handler, std::optional<UserIdentity> resolveAs = std::nullopt);
     // Walks the request's "uuids", resolving each through the database. Sends no reply on success.
     bool processUuidList(const PlugInHandler& handler);
     // Sets the reply entry's "annotations" to the plug-in's stored annotation, or to an empty dictionary.

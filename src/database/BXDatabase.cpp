@@ -279,8 +279,8 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
     return result;
 }
 
-std::optional<Error> BXDatabase::addPlugIn(std::string_view url) {
-    Result<std::shared_ptr<const LXBexilProxy>> registered = workspace_->registerPlugin(url);
+std::optional<Error> BXDatabase::addPlugIn(std::string_view url, std::optional<UserIdentity> readAs) {
+    Result<std::shared_ptr<const LXBexilProxy>> registered = workspace_->registerPlugin(url, readAs);
     if (!registered) {
         log::ops().debug("registry refused %@: %@", url, registered.error());
         return BXError(ErrorCode::RegistryRefused, "Ledgerix failed to register the plug-in");

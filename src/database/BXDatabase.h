@@ -15,6 +15,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "base/ActingAs.h"
 #include "base/Error.h"
 #include "base/SyncQueue.h"
 #include "base/Value.h"
@@ -105,8 +106,9 @@ class BXDatabase {
     // another type, or any element fails normalisation: election filtering is then off.
     static std::optional<std::vector<std::string>> wantedElections(const Value& query);
 
-    // Registers / unregisters the plug-in bundle at `url`; an error of code 2 when the registry refuses.
-    std::optional<Error> addPlugIn(std::string_view url);
+    // Registers / unregisters the plug-in bundle at `url`; an error of code 2 when the registry refuses. The bundle
+    // is read with the rights of `readAs` when given.
+    std::optional<Error> addPlugIn(std::string_view url, std::optional<UserIdentity> readAs = std::nullopt);
     std::optional<Error> removePlugIn(std::string_view url);
 
     // The number of cached records (for tests and diagnostics).

@@ -8,6 +8,7 @@
 #include <memory>
 #include <string>
 
+#include "base/ActingAs.h"
 #include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
@@ -24,10 +25,13 @@ namespace {
 constexpr size_t kResolvedPathBufferSize = 1024;
 // Entitlement that a caller needs to unregister plug-ins.
 
-// The canonical absolute path of `path`, or none when it does not resolve (or does not fit the buffer size).
-std::optional<std::string> resolvePath(const std::string& path) {
+// The canonical absolute path of `path`, or none when it does not resolve (or does not fit the buffer size), as
+// `resolveAs` sees it when given.
+std::optional<std::string> resolvePath(const std::string& path, std::optional<UserIdentity> resolveAs) {
     // A path with an embedded NUL cannot name a file; realpath would silently look at a prefix of it.
     if (path.find('\0') != std::string::npos) return std::nullopt;
+    ActingAs resolver(resolveAs);
+    if (!resolver.ok()) return std::nullopt;
     std::unique_ptr<char, decltype(&free)> resolved(realpath(path.c_str(), nullptr), &free);
     if (!resolved || strlen(resolved.get()) >= kResolvedPathBufferSize) return std::nullopt;
     return std::string(resolved.get());
@@ -35,7 +39,7 @@ std::optional<std::string> resolvePath(const std::string& path) {
 
 }  // namespace
 
-bool Transaction::marshalPaths(const RegistrationHandler& handler) {
+bool Transaction::marshalPaths(const RegistrationHandler& handler, std::optional<UserIdentity> resolveAs) {
     std::optional<Value> paths = zem_dictionary_get_array(request(), protocol::key::kPaths);
     if (!paths) {
         fail(ErrorCode::InvalidRequest, "invalid request format");
@@ -51,14 +55,14 @@ bool Transaction::marshalPaths(const RegistrationHandler& handler) {
             fail(ErrorCode::BadPath, formatPrintf("absolute path required: %s", *path));
             return false;
         }
-        std::optional<std::string> resolved = resolvePath(*path);
+        std::optional<std::string> resolved = resolvePath(*path, resolveAs);
         if (!handler(resolved ? *resolved : *path, resolved.has_value())) return false;
     }
     return true;
 }
 
-bool Transaction::processPaths(const RegistrationHandler& handler) {
-    if (!marshalPaths(handler)) return false;
+bool Transaction::processPaths(const RegistrationHandler& handler, std::optional<UserIdentity> resolveAs) {
+    if (!marshalPaths(handler, resolveAs)) return false;
     done();
     return true;
 }
@@ -89,20 +93,24 @@ bool Transaction::processUuidList(const PlugInHandler& handler) {
 }
 
 void Transaction::addPlugIns() {
-    processPaths([this](const std::string& path, bool resolved) {
-        if (!resolved) {
-            fail(ErrorCode::BadPath, formatPrintf("invalid plugin path: %@", path));
-            return false;
-        }
-        trace::pluginAdd(path.c_str());
-        if (std::optional<Error> error = server()->addPlugIn(path)) {
-            log::ops().notice("failed to register plug-in at %@", path);
-            // The database's own wording stays in the log; the client learns only which path failed.
-            fail(ErrorCode::RegistryRefused, formatPrintf("unable to register plug-in at %@", path));
-            return false;
-        }
-        return true;
-    });
+    // A client registers what it can read: every file of the bundle is reached with its rights, not bxd's.
+    const std::optional<UserIdentity> caller = client()->user();
+    processPaths(
+        [this, &caller](const std::string& path, bool resolved) {
+            if (!resolved) {
+                fail(ErrorCode::BadPath, formatPrintf("invalid plugin path: %@", path));
+                return false;
+            }
+            trace::pluginAdd(path.c_str());
+            if (std::optional<Error> error = server()->addPlugIn(path, caller)) {
+                log::ops().notice("failed to register plug-in at %@", path);
+                // The database's own wording stays in the log; the client learns only which path failed.
+                fail(ErrorCode::RegistryRefused, formatPrintf("unable to register plug-in at %@", path));
+                return false;
+            }
+            return true;
+        },
+        caller);
 }
 
 void Transaction::removePlugIns() {

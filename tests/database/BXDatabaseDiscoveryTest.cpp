@@ -25,7 +25,7 @@ class ScriptedWorkspace : public LXApplicationWorkspace {
   public:
     void addObserver(std::weak_ptr<LXApplicationWorkspaceObserverProtocol>) override {}
     void removeObserver(const LXApplicationWorkspaceObserverProtocol*) override {}
-    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view) override {
+    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view, std::optional<UserIdentity>) override {
         return Error("test", 1, "not supported");
     }
     std::optional<Error> unregisterPlugin(std::string_view) override { return Error("test", 1, "not supported"); }

@@ -2,6 +2,7 @@
 // running instances (real child processes) of a removed plug-in ended. Path forms, re-registration (a changed build
 // is an uninstall, as for "remove"), bad bundles and bundles gone from disk are LedgerixTest's.
 
+#include <grp.h>
 #include <gtest/gtest.h>
 
 #include "ChildProcess.h"
@@ -14,6 +15,7 @@ namespace {
 namespace fs = std::filesystem;
 using namespace test;
 
+const fs::path kHostClient = fs::path(BEXIL_BINARY_DIR) / "tests/bx_host_client";
 const std::string kHello = "com.example.greeter.hello";
 const std::string kBonjour = "com.example.greeter.bonjour";
 
@@ -134,6 +136,47 @@ TEST_F(RegistrationTest, RemoveNeedsTheEntitlementAndEndsThePlugInsInstancesAfte
     EXPECT_EQ(bxd_.countInLog("requesting termination for " + kBonjour), 0u) << bxd_.log();
 
     expectFailure(pathsRequest("remove", {hello()}), 9, "no plugin at " + hello());
+}
+
+// Guards registering as a client that is not root: bxd reads the bundle with the client's rights, so a bundle in a
+// directory the client cannot enter, or one whose information document is a link to a file the client cannot read,
+// is refused and left unregistered (while root registers it), and a bundle the client can read registers as usual.
+TEST_F(RegistrationTest, AClientRegistersOnlyWhatItCouldReadItself) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to run a client as another user";
+    fs::permissions(bxd_.root(), fs::perms(0755));
+    const fs::path privateApp = bundles_ / "Private.app", linkedApp = bundles_ / "Linked.app";
+    fs::create_directories(privateApp / "PlugIns");
+    fs::copy(hello(), privateApp / "PlugIns/Hello.bxplugin", fs::copy_options::recursive);
+    fs::permissions(privateApp, fs::perms(0700));
+    fs::create_directories(linkedApp / "PlugIns/Hello.bxplugin");
+    fs::create_symlink(privateApp / "PlugIns/Hello.bxplugin/Info.vrec", linkedApp / "PlugIns/Hello.bxplugin/Info.vrec");
+    const std::string hidden = (privateApp / "PlugIns/Hello.bxplugin").string();
+    const std::string linked = (linkedApp / "PlugIns/Hello.bxplugin").string();
+
+    fs::path output = bxd_.root() / "client-nobody.txt";
+    pid_t client = fork();
+    if (client == 0) {
+        int out = open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        if (out < 0 || dup2(out, 1) < 0 || dup2(out, 2) < 0 || setgroups(0, nullptr) != 0 ||
+            setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0)
+            _exit(125);
+        execl(kHostClient.c_str(), kHostClient.c_str(), ("add:" + hidden).c_str(), ("add:" + linked).c_str(),
+              ("add:" + hello()).c_str(), nullptr);
+        _exit(127);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(client, &status, 0), client);
+    std::string text = slurp(output);
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << text;
+    std::string answers = text.substr(text.find('\n') + 1);  // after the client's pid
+    EXPECT_EQ(answers, "9 invalid plugin path: " + hidden + "\n2 unable to register plug-in at " + linked + "\n0 \n")
+        << bxd_.log();
+    EXPECT_FALSE(registeredUuid(hidden));
+    EXPECT_FALSE(registeredUuid(linked));
+    EXPECT_TRUE(registeredUuid(hello()));
+
+    add({hidden});  // bxd's own client, root, reads it
+    EXPECT_TRUE(registeredUuid(hidden));
 }
 
 }  // namespace

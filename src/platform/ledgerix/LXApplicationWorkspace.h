@@ -13,6 +13,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/ActingAs.h"
 #include "base/Error.h"
 #include "base/Value.h"
 
@@ -75,7 +76,11 @@ class LXApplicationWorkspace {
     // a new UUID when its identifier or "BDBundleVersion" changed, under the old one otherwise. On failure the
     // registry is unchanged; if the store fails after the old record's uninstall was announced, observers have
     // heard of an uninstall that did not happen and find the record again on their next look-up.
-    virtual Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) = 0;
+    virtual Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url,
+                                                                       std::optional<UserIdentity> readAs) = 0;
+    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) {
+        return registerPlugin(url, std::nullopt);
+    }
     // Removes the record of the plug-in registered at the path; the bundle itself need not exist any more.
     virtual std::optional<Error> unregisterPlugin(std::string_view url) = 0;
 

@@ -10,6 +10,7 @@
 #include <fstream>
 #include <system_error>
 
+#include "base/ActingAs.h"
 #include "base/Document.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/containers/DataContainer.h"
@@ -211,8 +212,17 @@ std::optional<Error> LedgerixWorkspace::dropApplicationIfEmptyLocked(int64_t app
     return std::nullopt;
 }
 
-Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(std::string_view url) {
-    Result<Row> read = readBundle(url);
+Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(std::string_view url,
+                                                                              std::optional<UserIdentity> readAs) {
+    // Everything read of the bundle is read with the rights of the user it is registered for, so that nobody
+    // learns through the registry what they could not read themselves; what the registry then writes is its own.
+    Result<Row> read = [&]() -> Result<Row> {
+        ActingAs reader(readAs);
+        if (!reader.ok())
+            return lxError(kLXBadPath, formatPrintf("cannot read %s as user %u", printable(url),
+                                                    static_cast<unsigned>(readAs ? readAs->uid : 0)));
+        return readBundle(url);
+    }();
     if (!read.ok()) {
         log::lx().info("registration of %s refused: %@", printable(url), read.error());
         return read.error();

@@ -59,7 +59,10 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
 
     void addObserver(std::weak_ptr<LXApplicationWorkspaceObserverProtocol> observer) override;
     void removeObserver(const LXApplicationWorkspaceObserverProtocol* observer) override;
-    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) override;
+    using LXApplicationWorkspace::registerPlugin;
+    // Registers the bundle at `url`, reading it from disk as `readAs` when given (see ActingAs).
+    Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url,
+                                                               std::optional<UserIdentity> readAs) override;
     std::optional<Error> unregisterPlugin(std::string_view url) override;
     void LXClearSchemaCaches() override;
     std::shared_ptr<const LXBexilProxy> plugInProxyForUUID(const Uuid& uuid) override;

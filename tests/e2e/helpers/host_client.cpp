@@ -1,7 +1,7 @@
 // A host for end-to-end tests that need hosts in processes of their own: for each argument, in order,
-// "ready:UUID" or "launch:UUID" sends that request and prints "CODE TEXT" of the reply (0 and nothing on success),
-// and "say:TEXT" sends TEXT as a line to the plug-in launched last and prints its one-line answer. The first line
-// printed is the host's own pid. Each request goes on its own connection, as separate programs' would; the grant
+// "add:PATH", "ready:UUID" or "launch:UUID" sends that request and prints "CODE TEXT" of the reply (0 and nothing on
+// success), and "say:TEXT" sends TEXT as a line to the plug-in launched last and prints its one-line answer. The first
+// line printed is the host's own pid. Each request goes on its own connection, as separate programs' would; the grant
 // of "ready" belongs to this process, whichever connection asked.
 
 #include <fcntl.h>
@@ -65,13 +65,14 @@ int main(int argc, char** argv) {
             continue;
         }
         std::optional<Uuid> uuid = Uuid::parse(rest);
-        if ((verb != "ready" && verb != "launch") || !uuid) {
-            fprintf(stderr, "host_client: expected ready:UUID, launch:UUID or say:TEXT, not %s\n", argv[i]);
+        if (verb != "add" && ((verb != "ready" && verb != "launch") || !uuid)) {
+            fprintf(stderr, "host_client: expected add:PATH, ready:UUID, launch:UUID or say:TEXT, not %s\n", argv[i]);
             return 64;
         }
+        Value list = verb == "add" ? Value::array({Value::string(rest)}) : Value::array({Value::uuid(*uuid)});
         auto reply = requestOnce(Value::dictionary({{"request", Value::string(verb)},
                                                     {"version", Value::uint64(3)},
-                                                    {"uuids", Value::array({Value::uuid(*uuid)})}}));
+                                                    {verb == "add" ? "paths" : "uuids", list}}));
         if (!reply) {
             fprintf(stderr, "host_client: no reply\n");
             return 2;
