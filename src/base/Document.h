@@ -51,7 +51,9 @@ class Document {
     // where it is; nothing is silently dropped or changed.
     static Result<std::string> write(const Value& value);
 
-    // Reads and parses a file; I/O errors are POSIX errors, parse errors name the path in their message.
+    // Reads and parses a file; I/O errors are POSIX errors, parse errors name the path in their message. Only a
+    // regular file is read (anything else is EINVAL): a pipe or a device named in place of a document could
+    // otherwise keep the reader waiting, or reading, for ever.
     static Result<Value> readFile(const std::filesystem::path& path);
     // Replaces the file at `path` with the document of `value`: a temporary file in the same directory is written,
     // synced, renamed over the target and the directory synced. On failure before the rename the old file is

@@ -287,12 +287,16 @@ class Reader {
 Result<Value> Document::read(std::string_view text) { return Reader(text).run(); }
 
 Result<Value> Document::readFile(const std::filesystem::path& path) {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    // Not blocking, so that opening a pipe returns at once; for a regular file the flag changes nothing.
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
     if (fd < 0) return fileError(errno, "open", path);
     std::string text;
     struct stat info {};
-    if (::fstat(fd, &info) == 0 && S_ISREG(info.st_mode) && static_cast<uint64_t>(info.st_size) <= kMaxDocumentBytes)
-        text.reserve(static_cast<size_t>(info.st_size));
+    if (::fstat(fd, &info) != 0 || !S_ISREG(info.st_mode)) {
+        ::close(fd);
+        return Error(std::string(BXPosixErrorDomain), EINVAL, "read \"" + path.string() + "\": not a regular file");
+    }
+    if (static_cast<uint64_t>(info.st_size) <= kMaxDocumentBytes) text.reserve(static_cast<size_t>(info.st_size));
     char buffer[65536];
     for (;;) {
         ssize_t n = ::read(fd, buffer, sizeof buffer);

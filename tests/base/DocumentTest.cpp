@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -224,6 +225,16 @@ TEST_F(DocumentFileTest, ReadErrorsNameTheFile) {
     ASSERT_FALSE(malformed.ok());
     EXPECT_EQ(malformed.error().domain(), "BexilDocument");
     EXPECT_EQ(message(malformed.error()), path_.string() + ": bad integer \"x\" (byte 6)");
+
+    // A pipe or a device in place of the document is refused at once rather than waited on or read for ever.
+    std::filesystem::remove(path_);
+    ASSERT_EQ(mkfifo(path_.c_str(), 0600), 0);
+    for (const std::filesystem::path& notAFile : {path_, std::filesystem::path("/dev/zero")}) {
+        Result<Value> refused = Document::readFile(notAFile);
+        ASSERT_FALSE(refused.ok());
+        EXPECT_EQ(refused.error().code(), EINVAL);
+        EXPECT_EQ(message(refused.error()), "read \"" + notAFile.string() + "\": not a regular file");
+    }
 }
 
 using test::FailingFileSystem;
