@@ -1,4 +1,7 @@
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -7,6 +10,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "TestSupport.h"
 #include "base/Document.h"
@@ -159,6 +163,54 @@ TEST_F(CodeSigningIdentityTest, UntrustedFilesGrantNothing) {
     auto granted = dir.entitlementsForExecutable(self);
     ASSERT_TRUE(granted.ok());
     EXPECT_EQ(granted->get(kManager), Value::string("yes"));
+}
+
+// Guards against borrowing a trusted program's name: a process that runs another file mounted over an entitled
+// program (in a mount namespace of its own) shows that program's path, but gets none of its entitlements; the same
+// program run plainly does.
+TEST_F(CodeSigningIdentityTest, AFileMountedOverAnEntitledProgramGetsNothing) {
+    if (geteuid() != 0) GTEST_SKIP() << "mounting needs root";
+    const fs::path entitled = root_ / "entitled", impostor = root_ / "impostor";
+    fs::copy_file("/usr/bin/sleep", entitled);
+    fs::copy_file("/usr/bin/sleep", impostor);
+    writeEntitlements("entitled.vrec", entitled.string(), Value::dictionary({{kManager, Value::boolean(true)}}));
+    EntitlementsDirectory dir(entitlementsDir(), geteuid());
+    log::CaptureSink capture;
+    for (bool mountedOver : {false, true}) {
+        SCOPED_TRACE(mountedOver ? "impostor mounted over the program" : "the program itself");
+        pid_t child = fork();
+        if (child == 0) {
+            int fd = socket(AF_UNIX, SOCK_STREAM, 0);  // kept across exec: the peer is the program that follows
+            sockaddr_un addr = address();
+            if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
+            if (mountedOver &&
+                (unshare(CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) ||
+                 mount(impostor.c_str(), entitled.c_str(), nullptr, MS_BIND, nullptr) != 0))
+                _exit(3);
+            execl(entitled.c_str(), "entitled", "30", nullptr);
+            _exit(127);
+        }
+        int fd = accept(listener_, nullptr, nullptr);
+        ASSERT_GE(fd, 0);
+        // Identify the peer only once it runs the program (or what stands in its place).
+        struct stat expected {
+        }, seen{};
+        ASSERT_EQ(stat((mountedOver ? impostor : entitled).c_str(), &expected), 0);
+        const std::string exe = "/proc/" + std::to_string(child) + "/exe";
+        for (int i = 0; i < 500 && !(stat(exe.c_str(), &seen) == 0 && seen.st_ino == expected.st_ino); ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        ASSERT_EQ(seen.st_ino, expected.st_ino) << "the child never ran the program";
+
+        auto id = CodeSigningIdentity::ofPeer(ZemPeerCredentials::ofConnectedSocket(fd), &dir);
+        EXPECT_TRUE(id->established()) << id->failureReason();
+        EXPECT_EQ(id->executablePath(), entitled.string()) << "the name is the same either way";
+        EXPECT_EQ(id->entitlements().count(), mountedOver ? 0u : 1u);
+        close(fd);
+        kill(child, SIGKILL);
+        waitpid(child, nullptr, 0);
+    }
+    EXPECT_TRUE(capture.contains("ignoring entitlements of " + entitled.string() +
+                                 ": the process runs another file under that name"));
 }
 
 // Guards reloading: a changed file is seen, the later of two files for one program wins, a removed one is forgotten

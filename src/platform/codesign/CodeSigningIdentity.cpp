@@ -1,5 +1,7 @@
 #include "platform/codesign/CodeSigningIdentity.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -7,6 +9,7 @@
 #include <cstring>
 
 #include "base/Pidfd.h"
+#include "base/UniqueFd.h"
 #include "platform/codesign/EntitlementsDirectory.h"
 
 namespace bexil {
@@ -34,6 +37,12 @@ std::shared_ptr<CodeSigningIdentity> CodeSigningIdentity::ofPeer(const ZemPeerCr
 
     char exe[4096];
     std::string procExe = "/proc/" + std::to_string(peer.pid) + "/exe";
+    // The link's text is the path as the peer's own mount namespace shows it, where another file may be mounted
+    // over a trusted program; opening the link gives the file the peer really runs, whose identity is what counts.
+    UniqueFd running(::open(procExe.c_str(), O_RDONLY | O_CLOEXEC));
+    struct stat runningStatus {};
+    if (!running || ::fstat(running.get(), &runningStatus) != 0)
+        return fail(std::string("cannot open the peer's executable: ") + strerror(errno));
     ssize_t n = readlink(procExe.c_str(), exe, sizeof exe - 1);
     if (n <= 0) return fail(std::string("cannot read the peer's executable: ") + strerror(errno));
     std::string path(exe, static_cast<size_t>(n));
@@ -48,7 +57,7 @@ std::shared_ptr<CodeSigningIdentity> CodeSigningIdentity::ofPeer(const ZemPeerCr
     id->executablePath_ = std::move(path);
     id->established_ = true;
     if (entitlements) {
-        Result<Value> granted = entitlements->entitlementsForExecutable(id->executablePath_);
+        Result<Value> granted = entitlements->entitlementsForExecutable(id->executablePath_, &runningStatus);
         if (granted)
             id->entitlements_ = *granted;
         else

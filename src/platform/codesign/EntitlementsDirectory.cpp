@@ -33,7 +33,8 @@ bool EntitlementsDirectory::isTrustedFile(const std::filesystem::path& path, uid
     return ownerAndModeTrusted(st, trustedUid);
 }
 
-Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string& realPath) {
+Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string& realPath,
+                                                               const struct stat* running) {
     struct stat dirStat {};
     if (stat(directory_.c_str(), &dirStat) != 0) {
         // A missing directory simply grants nothing to anybody.
@@ -90,6 +91,14 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
             "ignoring entitlements of %s: the executable is not owned by a trusted user or is writable "
             "by others",
             realPath.c_str());
+        return Value::emptyDictionary();
+    }
+    struct stat named {};
+    if (found.count() > 0 && running != nullptr &&
+        (::lstat(realPath.c_str(), &named) != 0 || named.st_dev != running->st_dev ||
+         named.st_ino != running->st_ino)) {
+        log::ops().error("ignoring entitlements of %s: the process runs another file under that name",
+                         realPath.c_str());
         return Value::emptyDictionary();
     }
     return found;

@@ -6,6 +6,7 @@
 // mistake in the directory can only ever take entitlements away. Thread-safe; parsed files are cached and re-read
 // only when their inode, size or modification time changes.
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <filesystem>
@@ -32,8 +33,9 @@ class EntitlementsDirectory {
     static std::filesystem::path defaultPath();
 
     // The entitlements dictionary of the executable at `realPath` (already resolved), or an empty dictionary when
-    // no trusted file names it. An error means the directory could not be read at all.
-    Result<Value> entitlementsForExecutable(const std::string& realPath);
+    // no trusted file names it. With `running` (the status of the file a process really runs) the file at
+    // `realPath` must also be that very file. An error means the directory could not be read at all.
+    Result<Value> entitlementsForExecutable(const std::string& realPath, const struct stat* running = nullptr);
 
     // True when `path` is owned by root or `trustedUid` and neither group- nor world-writable.
     static bool isTrustedFile(const std::filesystem::path& path, uid_t trustedUid);
