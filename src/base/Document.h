@@ -55,6 +55,9 @@ class Document {
     // regular file is read (anything else is EINVAL): a pipe or a device named in place of a document could
     // otherwise keep the reader waiting, or reading, for ever.
     static Result<Value> readFile(const std::filesystem::path& path);
+    // The same for a file the caller has opened (so that it could check what it opened); `path` names it in
+    // messages. Reads from the descriptor's current offset; the caller keeps and closes it.
+    static Result<Value> readOpenFile(int fd, const std::filesystem::path& path);
     // Replaces the file at `path` with the document of `value`: a temporary file in the same directory is written,
     // synced, renamed over the target and the directory synced. On failure before the rename the old file is
     // untouched and the temporary file removed; when only the directory sync fails, the new document is in place

@@ -26,6 +26,7 @@
 #include "base/DocumentSyntax.h"
 #include "base/PosixError.h"
 #include "base/Text.h"
+#include "base/UniqueFd.h"
 
 namespace bexil {
 
@@ -288,33 +289,30 @@ Result<Value> Document::read(std::string_view text) { return Reader(text).run();
 
 Result<Value> Document::readFile(const std::filesystem::path& path) {
     // Not blocking, so that opening a pipe returns at once; for a regular file the flag changes nothing.
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-    if (fd < 0) return fileError(errno, "open", path);
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+    if (!fd) return fileError(errno, "open", path);
+    return readOpenFile(fd.get(), path);
+}
+
+Result<Value> Document::readOpenFile(int fd, const std::filesystem::path& path) {
     std::string text;
     struct stat info {};
-    if (::fstat(fd, &info) != 0 || !S_ISREG(info.st_mode)) {
-        ::close(fd);
+    if (::fstat(fd, &info) != 0 || !S_ISREG(info.st_mode))
         return Error(std::string(BXPosixErrorDomain), EINVAL, "read \"" + path.string() + "\": not a regular file");
-    }
     if (static_cast<uint64_t>(info.st_size) <= kMaxDocumentBytes) text.reserve(static_cast<size_t>(info.st_size));
     char buffer[65536];
     for (;;) {
         ssize_t n = ::read(fd, buffer, sizeof buffer);
         if (n < 0) {
             if (errno == EINTR) continue;
-            int err = errno;
-            ::close(fd);
-            return fileError(err, "read", path);
+            return fileError(errno, "read", path);
         }
         if (n == 0) break;
         text.append(buffer, static_cast<size_t>(n));
-        if (text.size() > kMaxDocumentBytes) {
-            ::close(fd);
+        if (text.size() > kMaxDocumentBytes)
             return documentError(kDocumentLimitExceeded, path.string() + ": document larger than the limit of " +
                                                              std::to_string(kMaxDocumentBytes) + " bytes");
-        }
     }
-    ::close(fd);
     Result<Value> value = read(text);
     if (!value.ok()) {
         const Error& e = value.error();

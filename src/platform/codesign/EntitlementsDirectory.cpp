@@ -1,6 +1,7 @@
 #include "platform/codesign/EntitlementsDirectory.h"
 
 #include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -11,6 +12,7 @@
 #include "base/Document.h"
 #include "base/PosixError.h"
 #include "base/StandardPaths.h"
+#include "base/UniqueFd.h"
 #include "platform/log/Log.h"
 
 namespace bexil {
@@ -61,8 +63,11 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
     Value found = Value::emptyDictionary();
     for (const std::string& name : names) {
         std::filesystem::path file = directory_ / name;
+        // What is judged is what was opened: no link is followed, and the trust checks read the open file. A link is
+        // judged as itself (lstat), and never read.
+        UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
         struct stat st {};
-        if (lstat(file.c_str(), &st) != 0) continue;
+        if (fd ? fstat(fd.get(), &st) != 0 : (errno != ELOOP || lstat(file.c_str(), &st) != 0)) continue;
         CachedFile& cached = cache_[name];
         bool unchanged = cached.inode == st.st_ino && cached.size == st.st_size &&
                          cached.mtime.tv_sec == st.st_mtim.tv_sec && cached.mtime.tv_nsec == st.st_mtim.tv_nsec;
@@ -70,7 +75,7 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
             cached = CachedFile{st.st_ino, st.st_size, st.st_mtim, std::nullopt, Value()};
             if (!S_ISREG(st.st_mode) || !ownerAndModeTrusted(st, trustedUid_)) {
                 log::ops().error("ignoring untrusted entitlements file %s (owner or mode)", file.c_str());
-            } else if (Result<Value> doc = Document::readFile(file); !doc) {
+            } else if (Result<Value> doc = Document::readOpenFile(fd.get(), file); !doc) {
                 log::ops().error("ignoring unreadable entitlements file %s: %@", file.c_str(), doc.error());
             } else if (const std::string* exe =
                            doc->find(kExecutableKey) ? doc->find(kExecutableKey)->getString() : nullptr;
