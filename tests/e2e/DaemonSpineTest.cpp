@@ -346,6 +346,28 @@ TEST_F(BxdEnvelope, StalledConnectionsAreDroppedButQuietOnesKept) {
     EXPECT_EQ(quiet.read(ZemFrame::kHeaderBytes).size(), ZemFrame::kHeaderBytes) << "a quiet client was dropped";
 }
 
+// Guards pipelining: a client that writes 10,000 requests before reading any reply gets every one answered, in
+// the order it sent them (replies queue up for it until it reads, within the pause mark).
+TEST_F(BxdEnvelope, TenThousandPipelinedRequestsAreAllAnsweredInOrder) {
+    constexpr uint64_t kRequests = 10000;
+    RawSocket client(bxd_.socketPath());
+    std::vector<uint8_t> many = burst(kRequests);
+    std::thread writer([&] { client.write(many); });
+    uint64_t answered = 0;
+    for (uint64_t expected = 1; expected <= kRequests; ++expected) {
+        std::vector<uint8_t> bytes = client.read(ZemFrame::kHeaderBytes);
+        if (bytes.size() != ZemFrame::kHeaderBytes) break;
+        Result<ZemFrameHeader> header =
+            ZemFrame::decodeHeader(std::span<const uint8_t, ZemFrame::kHeaderBytes>(bytes.data(), bytes.size()));
+        ASSERT_TRUE(header.ok()) << header.error().description();
+        ASSERT_EQ(header->inReplyTo, expected);
+        ASSERT_EQ(client.read(header->payloadLength).size(), header->payloadLength);
+        answered = expected;
+    }
+    writer.join();
+    EXPECT_EQ(answered, kRequests) << bxd_.log().substr(0, 2000);
+}
+
 // Guards a client that pipelines without reading: once its unread replies pass the pause mark its further requests
 // wait, other clients are served meanwhile, and after the stall time (1 s here) it is dropped with a log line.
 TEST_F(BxdEnvelope, AClientThatNeverReadsIsPausedThenDropped) {
