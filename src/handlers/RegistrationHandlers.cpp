@@ -93,8 +93,10 @@ bool Transaction::processUuidList(const PlugInHandler& handler) {
 }
 
 void Transaction::addPlugIns() {
-    // A client registers what it can read: every file of the bundle is reached with its rights, not bxd's.
-    const std::optional<UserIdentity> caller = client()->user();
+    // A client registers what it can read: every file of the bundle is reached with its rights, not bxd's. A client
+    // whose connection is already gone has no known rights, and an identity the kernel cannot take reads nothing.
+    const std::optional<UserIdentity> caller =
+        client()->user().value_or(UserIdentity{static_cast<uid_t>(-1), static_cast<gid_t>(-1)});
     processPaths(
         [this, &caller](const std::string& path, bool resolved) {
             if (!resolved) {

@@ -76,6 +76,7 @@ class LXApplicationWorkspace {
     // a new UUID when its identifier or "BDBundleVersion" changed, under the old one otherwise. On failure the
     // registry is unchanged; if the store fails after the old record's uninstall was announced, observers have
     // heard of an uninstall that did not happen and find the record again on their next look-up.
+    // With `readAs`, every read of the bundle (resolving its path included) uses that user's file-system rights.
     virtual Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url,
                                                                        std::optional<UserIdentity> readAs) = 0;
     Result<std::shared_ptr<const LXBexilProxy>> registerPlugin(std::string_view url) {
