@@ -86,15 +86,15 @@ void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd s
         asio::posix::stream_descriptor::wait_read,
         detail::bindToQueue(queue, [watch, pid, record, identifier,
                                     status = std::make_shared<UniqueFd>(std::move(status))](const asio::error_code&) {
-            int status = 0;
+            int exitStatus = 0;
             pid_t reaped;
             do {
-                reaped = waitpid(pid, &status, 0);
+                reaped = waitpid(pid, &exitStatus, 0);
             } while (reaped < 0 && errno == EINTR);
             std::error_code ignored;
             fs::remove(record, ignored);
             log::ops().info("plug-in %s instance %d ended (%s)", identifier.c_str(), static_cast<int>(pid),
-                            exitText(status).c_str());
+                            exitText(exitStatus).c_str());
             watch->close();
         }));
 }
