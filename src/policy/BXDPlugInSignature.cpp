@@ -6,8 +6,7 @@
 
 namespace bexil {
 
-BXDPlugInSignature::BXDPlugInSignature(std::string_view /*bundleUrl*/)
-    : requirement_(kPlaceholderRequirement) {
+BXDPlugInSignature::BXDPlugInSignature(std::string_view /*bundleUrl*/) : requirement_(kPlaceholderRequirement) {
     const std::string text = Uuid::random().string();
     SHA1(reinterpret_cast<const unsigned char*>(text.data()), text.size(), cdhash_.data());
 }
