@@ -28,13 +28,13 @@
 #include <vector>
 
 #include "../tests/platform/ZemStrictEqual.h"
+#include "FuzzLog.h"
 #include "base/Document.h"
 #include "model/BXBundle.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/codesign/EntitlementsDirectory.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
-#include "platform/log/Log.h"
 #include "policy/BXDPlugIn.h"
 
 namespace {
@@ -68,6 +68,7 @@ std::string replaceAll(std::string text, std::string_view from, std::string_view
 }
 
 struct World {
+    fuzz::LogCheck logCheck;
     fs::path root;
     fs::path application;
     fs::path plugIn;
@@ -92,7 +93,6 @@ struct World {
         }
         tool = plugIn / "tool";
 
-        log::LogRegistry::shared().setThreshold(log::Level::Fault);
         Result<std::shared_ptr<LedgerixWorkspace>> opened =
             LedgerixWorkspace::open({.stateDirectory = root / "state",
                                      .rootDirectory = root,
@@ -224,5 +224,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     // Registration makes a data container per plug-in identifier; the next input starts without them.
     std::error_code ignored;
     fs::remove_all(w.root / "state" / "containers", ignored);
+    if (std::optional<std::string> fault = w.logCheck.takeFault()) fail("a fault was logged: " + *fault);
     return 0;
 }

@@ -21,9 +21,9 @@
 #include <vector>
 
 #include "../tests/platform/ZemStrictEqual.h"
+#include "FuzzLog.h"
 #include "database/BXDUserPrefs.h"
 #include "platform/ledgerix/LXBexilProxy.h"
-#include "platform/log/Log.h"
 #include "platform/prefs/PreferencesStore.h"
 #include "policy/BXDPlugIn.h"
 
@@ -65,6 +65,7 @@ std::shared_ptr<BXDPlugIn> record(const std::string& identifier, const std::stri
 }
 
 struct World {
+    fuzz::LogCheck logCheck;
     fs::path root;
     std::vector<std::shared_ptr<BXDPlugIn>> plugIns;
 
@@ -72,7 +73,6 @@ struct World {
         std::string dir = (fs::temp_directory_path() / "bexil-preferences-fuzz-XXXXXX").string();
         if (::mkdtemp(dir.data()) == nullptr) fail("cannot make a temporary directory");
         root = dir;
-        log::LogRegistry::shared().setThreshold(log::Level::Fault);
         plugIns.push_back(record(
             "com.example.greeter.hello", "/System/Library/PlugIns/Hello.bxplugin", true,
             Value::dictionary({{"Language", Value::string("en")}, {"RZExtensionVersion", Value::string("1.2")}})));
@@ -90,10 +90,7 @@ World& world() {
     return instance;
 }
 
-}  // namespace
-
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    World& w = world();
+void exercise(const World& w, const uint8_t* data, size_t size) {
     // A fresh store for every input: its cache must not stand in for a file rewritten within one clock tick.
     PreferencesStore store(w.root, "fuzz");
     const std::string domain = BXDUserPrefs::kDomain;
@@ -133,13 +130,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (!whole) {
         if (!written) fail("a file the store cannot read was overwritten");
         if (readText(file) != bytes) fail("a file the writer refused was changed");
-        return 0;
+        return;
     }
     if (written) {
         // Setting one key may only fail when the document grows past the size limit.
         if (bytes.size() < PreferencesStore::kMaxPreferencesFileBytes / 2)
             fail("a readable domain cannot be written: " + written->description());
-        return 0;
+        return;
     }
     Result<Value> after = store.readDomain(domain);
     if (!after) fail("what the writer wrote cannot be read: " + after.error().description());
@@ -151,5 +148,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (!testing::strictlyEqual(store.copyValueAfterSync(domain, kWrittenKey),
                                 Value::int64(static_cast<int64_t>(size))))
         fail("the synchronised domain does not show the written key");
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    World& w = world();
+    exercise(w, data, size);
+    if (std::optional<std::string> fault = w.logCheck.takeFault()) fail("a fault was logged: " + *fault);
     return 0;
 }

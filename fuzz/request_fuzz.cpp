@@ -37,6 +37,7 @@
 #include <string>
 #include <vector>
 
+#include "FuzzLog.h"
 #include "base/Document.h"
 #include "base/EventLoop.h"
 #include "base/Pidfd.h"
@@ -47,8 +48,6 @@
 #include "daemon/BXDZemClient.h"
 #include "platform/ledgerix/LXApplicationWorkspace.h"
 #include "platform/ledgerix/LXBexilProxy.h"
-#include "platform/log/CaptureSink.h"
-#include "platform/log/Log.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemFrame.h"
@@ -175,7 +174,7 @@ struct World {
     std::string executable;
     std::unique_ptr<EventLoop> loop;
     std::unique_ptr<BXDServer> server;
-    std::unique_ptr<log::CaptureSink> faults;
+    std::unique_ptr<fuzz::LogCheck> logCheck;
     // The bundles registered at the start of every input, by real path.
     std::set<std::string> baseline;
     // The registered plug-ins' UUIDs, in the order of their paths: what the placeholders count through.
@@ -195,9 +194,7 @@ struct World {
         // "launch" gets as far as starting the sandbox and no further: nothing is ever started.
         setenv("BX_BWRAP", (root / "no-bubblewrap").c_str(), 1);
 
-        // Only faults are written and captured: they are what an input must never cause.
-        log::LogRegistry::shared().setThreshold(log::Level::Fault);
-        faults = std::make_unique<log::CaptureSink>(log::Level::Fault);
+        logCheck = std::make_unique<fuzz::LogCheck>();
         EventLoop::setUncaughtExceptionHandler(uncaughtException);
 
         // This process is the entitled client: the trusted directory makes its executable a manager.
@@ -234,7 +231,7 @@ struct World {
     ~World() {
         server.reset();
         loop.reset();
-        faults.reset();
+        logCheck.reset();
         std::error_code ignored;
         fs::remove_all(root, ignored);
     }
@@ -365,7 +362,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (holdsLeft != 0) fail("holds outlive the client that placed them");
     if (BXDPlugInHold::openKeepAliveUnits() != 0) fail("keep-alive units outlive their holds");
 
-    std::vector<log::CaptureSink::Entry> logged = w.faults->entries();
-    if (!logged.empty()) fail("the daemon logged a fault: " + logged.front().message);
+    if (std::optional<std::string> fault = w.logCheck->takeFault()) fail("the daemon logged a fault: " + *fault);
     return 0;
 }
