@@ -236,30 +236,40 @@ struct World {
         fs::remove_all(root, ignored);
     }
 
-    // Undoes what earlier inputs registered or removed, and lists the plug-ins for the placeholders.
+    LXProxyList installed() const {
+        std::optional<LXProxyList> list = server->workspace()->installedPlugins();
+        if (!list) fail("the registry cannot list its plug-ins");
+        return *list;
+    }
+
+    // Undoes what earlier inputs registered or removed, and lists the plug-ins for the placeholders (anew each
+    // time: a bundle removed and added again has a new UUID).
     void restoreBaseline() {
-        std::optional<LXProxyList> installed = server->workspace()->installedPlugins();
-        if (!installed) fail("the registry cannot list its plug-ins");
+        LXProxyList list = installed();
+        bool changed = false;
         std::set<std::string> present;
-        for (const auto& proxy : *installed) {
+        for (const auto& proxy : list) {
             if (!proxy->bundleURL()) continue;
             present.insert(*proxy->bundleURL());
-            if (!baseline.count(*proxy->bundleURL())) server->removePlugIn(*proxy->bundleURL());
+            if (!baseline.count(*proxy->bundleURL())) {
+                server->removePlugIn(*proxy->bundleURL());
+                changed = true;
+            }
         }
-        bool changed = present != baseline;
-        for (const std::string& path : baseline)
-            if (!present.count(path) && server->addPlugIn(path)) fail("a baseline bundle cannot be registered again");
-        if (changed || plugIns.empty()) {
-            installed = server->workspace()->installedPlugins();
-            if (!installed) fail("the registry cannot list its plug-ins");
-            std::vector<std::pair<std::string, Uuid>> byPath;
-            for (const auto& proxy : *installed)
-                if (proxy->bundleURL() && proxy->pluginUUID())
-                    byPath.emplace_back(*proxy->bundleURL(), *proxy->pluginUUID());
-            std::sort(byPath.begin(), byPath.end());
-            plugIns.clear();
-            for (const auto& [path, uuid] : byPath) plugIns.push_back(uuid);
+        for (const std::string& path : baseline) {
+            if (present.count(path)) continue;
+            if (server->addPlugIn(path)) fail("a baseline bundle cannot be registered again");
+            changed = true;
         }
+        if (changed) list = installed();
+        std::vector<std::pair<std::string, Uuid>> byPath;
+        for (const auto& proxy : list)
+            if (proxy->bundleURL() && proxy->pluginUUID())
+                byPath.emplace_back(*proxy->bundleURL(), *proxy->pluginUUID());
+        std::sort(byPath.begin(), byPath.end());
+        plugIns.clear();
+        for (const auto& [path, uuid] : byPath) plugIns.push_back(uuid);
+        if (plugIns.empty()) fail("no plug-in is registered");
     }
 
     std::string resolveText(const std::string& text) const {
@@ -344,11 +354,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         if (messages[i].isDictionary()) ++expected;
         connection->deliver(ZemMessage(messages[i], i + 1, !oneWay));
     }
-    std::map<uint64_t, int> replies = connection->awaitReplies(expected);
-    // Whatever the requests set going has run by now: the last reply has gone out, and both queues are idle.
+    connection->awaitReplies(expected);
+    // Anything more the daemon sends would come from work still queued: once both queues are idle, the counts are
+    // final.
     connection->drain();
     w.server->mainQueue().sync([] {});
-    replies = connection->awaitReplies(expected);
+    std::map<uint64_t, int> replies = connection->awaitReplies(expected);
     for (size_t i = 0; i < messages.size(); ++i) {
         int count = replies.count(i + 1) ? replies[i + 1] : 0;
         int wanted = messages[i].isDictionary() ? 1 : 0;
