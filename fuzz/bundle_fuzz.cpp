@@ -93,10 +93,11 @@ struct World {
         }
         tool = plugIn / "tool";
 
-        Result<std::shared_ptr<LedgerixWorkspace>> opened =
-            LedgerixWorkspace::open({.stateDirectory = root / "state",
-                                     .rootDirectory = root,
-                                     .durability = LedgerixWorkspace::Durability::Process});
+        LedgerixWorkspace::Options options;
+        options.stateDirectory = root / "state";
+        options.rootDirectory = root;
+        options.durability = LedgerixWorkspace::Durability::Process;
+        Result<std::shared_ptr<LedgerixWorkspace>> opened = LedgerixWorkspace::open(options);
         if (!opened) fail("cannot open the registry: " + opened.error().description());
         registry = *opened;
     }
