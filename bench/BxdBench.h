@@ -139,14 +139,14 @@ inline std::filesystem::path makePrivateBxdRoot(const std::string& prefix) {
     return root;
 }
 
-// Starts the bxd built beside this program in the private environment of `root`, its annotations in
-// root/annotations.vrec; returns its pid.
-inline pid_t startPrivateBxd(const std::filesystem::path& root) {
+// Starts `binary` (by default the bxd built beside this program) in the private environment of `root`, its
+// annotations in root/annotations.vrec; returns its pid.
+inline pid_t startPrivateBxd(const std::filesystem::path& root, const std::string& binary = defaultBxdPath()) {
     pid_t bxd = fork();
     if (bxd < 0) die("fork");
     if (bxd == 0) {
         enterPrivateBxdEnvironment(root);
-        std::string binary = defaultBxdPath(), document = (root / "annotations.vrec").string();
+        std::string document = (root / "annotations.vrec").string();
         execl(binary.c_str(), binary.c_str(), "-d", document.c_str(), nullptr);
         _exit(127);
     }
