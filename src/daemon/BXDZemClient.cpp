@@ -103,10 +103,9 @@ bool BXDZemClient::peerHasHungUp() const {
     return !connection || connection->peerHasHungUp();
 }
 
-int BXDZemClient::pidfd() const {
+std::shared_ptr<const UniqueFd> BXDZemClient::pidfd() const {
     std::shared_ptr<ZemConnection> connection = connection_.lock();
-    if (!connection || !connection->peerCredentials().pidfd) return -1;
-    return connection->peerCredentials().pidfd->get();
+    return connection ? connection->peerCredentials().pidfd : nullptr;
 }
 
 std::optional<UserIdentity> BXDZemClient::user() const {

@@ -32,7 +32,7 @@ constexpr int kFreeMemoryKeptBytes = 64 * 1024 * 1024;
 // Descriptors bxd keeps for itself besides its connections: the registry, the annotation document, the log, the
 // pidfds and pipes of launched plug-ins and of termination.
 constexpr size_t kDescriptorsKeptBack = 128;
-// Each connection holds its socket and a pidfd of its peer.
+// Each connection holds its socket and a pidfd of its peer (which the peer's grants share rather than copy).
 constexpr size_t kDescriptorsPerConnection = 2;
 
 // A positive count from the environment variable `name`; none when it is unset, and none (logged) when it is not a

@@ -6,9 +6,11 @@
 
 #include <sys/types.h>
 
+#include <memory>
 #include <string>
 #include <string_view>
 
+#include "base/UniqueFd.h"
 #include "base/Value.h"
 
 namespace bexil {
@@ -24,9 +26,10 @@ class HostAccessClient {
     virtual pid_t pid() const = 0;
     // The host's executable path; empty when it could not be found.
     virtual const std::string& path() const = 0;
-    // A pidfd that pins the host process since it connected (borrowed), or -1 when there is none; grants made to
-    // the host are tied to it rather than to a pid that another process could get later.
-    virtual int pidfd() const { return -1; }
+    // A pidfd that pins the host process since it connected, or null when there is none; grants made to the host
+    // are tied to it rather than to a pid that another process could get later. Shared, not copied: a grant keeps
+    // the connection's own descriptor open, so however many plug-ins a host enables, they cost bxd no descriptor.
+    virtual std::shared_ptr<const UniqueFd> pidfd() const { return nullptr; }
 };
 
 }  // namespace bexil

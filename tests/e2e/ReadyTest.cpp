@@ -89,5 +89,54 @@ TEST_F(ReadyTest, AVanishedExecutableFailsThatPlugInOnly) {
     EXPECT_EQ(grantsOf("com.example.greeter.bonjour"), 1u) << bxd_.log();
 }
 
+// Guards bxd's descriptors: a grant is tied to the host process by the pidfd the host's connection already holds,
+// so readying many plug-ins with code costs bxd no descriptor per plug-in. A descriptor per grant would let one host
+// make bxd hold up to kMaxGrantsPerHost of them, beyond the two per connection its connection limit counts on.
+TEST_F(ReadyTest, GrantsCostTheDaemonNoDescriptorPerPlugIn) {
+    constexpr int kPlugIns = 40;
+    const fs::path app = bundles_ / "Many.app";
+    fs::create_directories(app / "PlugIns");
+    ASSERT_FALSE(Document::writeFileAtomically(
+        app / "Info.vrec", Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.many")}})));
+    std::vector<std::string> paths;
+    for (int i = 0; i < kPlugIns; ++i) {
+        const fs::path bundle = app / "PlugIns" / ("P" + std::to_string(i) + ".bxplugin");
+        fs::create_directories(bundle);
+        std::ofstream(bundle / "run") << "#!/bin/sh\n";
+        fs::permissions(bundle / "run", fs::perms(0755));
+        ASSERT_FALSE(Document::writeFileAtomically(
+            bundle / "Info.vrec",
+            Value::dictionary(
+                {{"BDBundleIdentifier", Value::string("com.example.many.p" + std::to_string(i))},
+                 {"BDBundleExecutable", Value::string("run")},
+                 {"BDBundleVersion", Value::string("1")},
+                 {"RZExtension",
+                  Value::dictionary({{"PrincipalClass", Value::string("Many")},
+                                     {"RZExtensionPointIdentifier", Value::string("com.example.many")},
+                                     {"RZExtensionProtocol", Value::string("Many")},
+                                     {"RZExtensionAttributes",
+                                      Value::dictionary({{"RZExtensionVersion", Value::string("1")}})}})}})));
+        paths.push_back(bundle.string());
+    }
+    startAndAdd();
+    add(paths);
+    std::vector<Value> uuids;
+    for (const std::string& path : paths) uuids.push_back(uuidOf(path));
+    auto descriptors = [this] {
+        size_t count = 0;
+        for ([[maybe_unused]] const auto& entry : fs::directory_iterator("/proc/" + std::to_string(bxd_.pid()) + "/fd"))
+            ++count;
+        return count;
+    };
+
+    TestClient host;
+    ASSERT_EQ(errorCode(host.replyTo(request("bulk"))), 0);  // the connection, and its pidfd, are in place
+    const size_t before = descriptors();
+    Value reply = host.replyTo(readyRequest(uuids));
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply);
+    EXPECT_EQ(grantsOf("com.example.many.p39"), 1u) << bxd_.log();
+    EXPECT_LE(descriptors(), before + 2) << "descriptors of bxd before the grants: " << before;
+}
+
 }  // namespace
 }  // namespace bexil

@@ -1,6 +1,5 @@
 #include "platform/jobard/ServiceManager.h"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -67,7 +66,7 @@ void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, st
 
 struct ServiceManager::Grants {
     struct Grant {
-        UniqueFd host;  // pidfd of the process the grant was made to
+        std::shared_ptr<const UniqueFd> host;  // pidfd of the process the grant was made to, shared
         pid_t hostPid;
         std::string executablePath;
         Value overlay;
@@ -75,7 +74,7 @@ struct ServiceManager::Grants {
 
     // Drops the grants of hosts that have ended. REQUIRES: `mutex` held.
     void prune() {
-        grants.remove_if([](const Grant& grant) { return pidfdExited(grant.host.get()); });
+        grants.remove_if([](const Grant& grant) { return pidfdExited(grant.host->get()); });
     }
 
     mutable std::mutex mutex;
@@ -86,11 +85,15 @@ ServiceManager::ServiceManager(InstanceRecords instances)
     : instances_(std::move(instances)), grants_(std::make_shared<Grants>()) {}
 
 int ServiceManager::addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay,
-                                       int hostPidfd) {
+                                       std::shared_ptr<const UniqueFd> hostPidfd) {
     if (executablePath.empty() || hostPid <= 0) return EINVAL;
-    UniqueFd host(hostPidfd >= 0 ? fcntl(hostPidfd, F_DUPFD_CLOEXEC, 0) : pidfdOpen(hostPid));
-    if (!host) return errno;
-    if (pidfdExited(host.get())) return ESRCH;
+    std::shared_ptr<const UniqueFd> host = std::move(hostPidfd);
+    if (!host || !*host) {
+        UniqueFd opened(pidfdOpen(hostPid));
+        if (!opened) return errno;
+        host = std::make_shared<const UniqueFd>(std::move(opened));
+    }
+    if (pidfdExited(host->get())) return ESRCH;
     std::lock_guard lock(grants_->mutex);
     grants_->prune();
     size_t ofHost = 0;

@@ -36,10 +36,12 @@ class ServiceManager {
     explicit ServiceManager(InstanceRecords instances = InstanceRecords(InstanceRecords::Kind::Running));
 
     // add-external-service: allows the live process `hostPid` to start `executablePath` with `overlay`, replacing
-    // an earlier grant of the same host and executable. The grant is tied to the process `hostPidfd` pins (a copy
-    // is kept), or, without one (-1), to the process that has the pid now. Returns 0, or an errno value (ESRCH
-    // when the host has already ended; EINVAL for an empty path).
-    int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay, int hostPidfd = -1);
+    // an earlier grant of the same host and executable. The grant is tied to the process `hostPidfd` pins (the
+    // descriptor is shared, never duplicated: a host's grants must not cost a descriptor each), or, without one,
+    // to the process that has the pid now. Returns 0, or an errno value (ESRCH when the host has already ended;
+    // EINVAL for an empty path).
+    int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay,
+                           std::shared_ptr<const UniqueFd> hostPidfd = nullptr);
     // The overlay granted to `hostPid` for `executablePath`, as long as the process that received the grant still
     // runs; none otherwise.
     std::optional<Value> grantedOverlay(pid_t hostPid, const std::string& executablePath) const;
