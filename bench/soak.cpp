@@ -11,9 +11,9 @@
 // anyway when the run fails.
 //
 // Set-up: a private root with the example bundles, Hello's real executable (examples/plugins) in Greeter.app,
-// Many.app with 50 generated plug-ins, Churn.app with 5 that managers unregister and register again, and an
-// entitlements document that makes a copy of this program a manager. bxd logs only errors there
-// (BXD_LOG_LEVEL=error unless set) to its own stderr, root/bxd.log.
+// Many.app with 50 generated plug-ins (three of them busy: a process assertion is recorded for each), Churn.app with
+// 5 that managers unregister and register again, and an entitlements document that makes a copy of this program a
+// manager. bxd logs only errors there (BXD_LOG_LEVEL=error unless set) to its own stderr, root/bxd.log.
 //
 // The clients are separate processes, this program executed again: even slots speak through libbexil, odd ones in
 // hand-written Zem frames (and only those send malformed requests, and sometimes write a frame in two pieces so a
@@ -21,16 +21,19 @@
 // every request: "add" (also of bad paths), "remove" (refused with code 11 unless manager), "bulk", "match" (with
 // and without rules, discover-all), "ready", "access", "annotate", "bulk-annotate", "lock" (holds of applications
 // and of plug-ins with flags 0x1, 0x2 and 0x4; some released by UUID, some never), "holds", "launch" (when
-// bubblewrap works here: a line is exchanged with Hello, then the socket closed), an unknown request name, a wrong
-// or missing version, a frame whose payload is not a dictionary and a one-way message. Requests whose answer is
-// fixed by the protocol (refusals for lack of the entitlement, malformed requests, releases) are checked.
-// Once a second the supervisor kills one client with SIGKILL and starts another in its slot.
+// bubblewrap works here: a line is exchanged with Hello, whose socket is closed at the client's next launch, so that
+// instances run while others hold with 0x2 and 0x4), an unknown request name, a wrong or missing version, a frame
+// whose payload is not a dictionary and a one-way message. Requests whose answer is fixed by the protocol (refusals
+// for lack of the entitlement, malformed requests, releases) are checked. Once a second the supervisor kills one
+// client with SIGKILL and starts another in its slot.
 //
 // It prints the requests sent and answered by kind, the errors by code, timeouts (no reply within 10 s), lost
 // replies (the connection ended under a live client), wrong answers, and bxd's resident memory and open descriptors
 // at the start, the middle, the end and once the clients are gone, with the ratio end/middle; then it stops bxd with
 // SIGTERM and reports its exit status and any sanitizer report on its stderr. It exits non-zero when bxd died, a
-// reply was missing or late, an answer was wrong, or a sanitizer reported.
+// reply was missing or late, an answer was wrong, or a sanitizer reported. Once the clients are gone bxd may still
+// hold a few more descriptors than at the start: the pidfds of ended hosts whose grants it drops at the next
+// "ready" or "launch", not when the host ends; their number stays below the number of clients.
 
 #include <fcntl.h>
 #include <getopt.h>
@@ -65,6 +68,7 @@
 #include "base/Uuid.h"
 #include "base/Value.h"
 #include "bexil/DaemonClient.h"
+#include "platform/runtime/InstanceRecords.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 
@@ -775,6 +779,7 @@ class Soaker {
     }
 
     void launch() {
+        running_.reset();  // the previous instance ends once its host closes its end
         if (frames_ && chance(6)) {
             expect(kLaunch, request("launch", {{"uuids", uuidArray({plan_.helloUuid, plan_.helloUuid})}}), 4);
             return;
@@ -811,6 +816,7 @@ class Soaker {
         }
         if (heard.rfind("Hello, soak " + std::to_string(slot_) + "!", 0) == 0) {
             tally_.greeted++;
+            running_ = std::move(answer.channel);
         } else {
             wrong("Hello answered \"" + heard + "\"");
         }
@@ -872,6 +878,7 @@ class Soaker {
     FrameTransport* frames_ = nullptr;  // set when this client speaks frames
     bool manager_ = false;
     std::vector<Uuid> releasable_, kept_;
+    UniqueFd running_;  // the socket to the Hello instance this client launched last
 };
 
 [[noreturn]] void runClient(const fs::path& root, unsigned slot) {
@@ -1118,6 +1125,12 @@ int main(int argc, char** argv) {
         }
     }
     if (Document::writeFileAtomically(root / "plan.vrec", planValue(plan))) die("writing the plan");
+    // Busy plug-ins, for the holds that refuse busy ones (0x2): process assertions on three of Many.app's plug-ins,
+    // recorded as a plug-in runtime records them, for this process, which lives as long as the run.
+    for (int i = 0; i < 3; ++i)
+        if (!InstanceRecords(InstanceRecords::Kind::Assertion, root / "runtime")
+                 .record("com.example.many.p" + std::to_string(i), getpid()))
+            die("recording a process assertion");
     Tally& tally = *mapTally(root / "tally", true);
 
     // ---- the clients
