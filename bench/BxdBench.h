@@ -4,12 +4,14 @@
 // Unix socket plumbing, blocking whole writes and reads, and the private environment a child bxd starts in.
 
 #include <fcntl.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <csignal>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -145,6 +147,8 @@ inline pid_t startPrivateBxd(const std::filesystem::path& root, const std::strin
     pid_t bxd = fork();
     if (bxd < 0) die("fork");
     if (bxd == 0) {
+        // A benchmark that dies on an error must not leave its daemon behind.
+        prctl(PR_SET_PDEATHSIG, SIGTERM);
         enterPrivateBxdEnvironment(root);
         std::string document = (root / "annotations.vrec").string();
         execl(binary.c_str(), binary.c_str(), "-d", document.c_str(), nullptr);

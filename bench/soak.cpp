@@ -1091,13 +1091,18 @@ int main(int argc, char** argv) {
         if (!bxdEnded && waitpid(bxd, &bxdStatus, WNOHANG) == bxd) bxdEnded = true;
         return !bxdEnded;
     };
-    for (int i = 0; i < 3000 && bxdAlive(); ++i) {
+    bool listening = false;
+    for (int i = 0; i < 3000 && !listening && bxdAlive(); ++i) {
         int fd = bench::connectTo(plan.socketPath);
-        if (fd >= 0) {
-            close(fd);
-            break;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        listening = fd >= 0;
+        if (listening) close(fd);
+        if (!listening) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    if (!listening) {
+        fprintf(stderr, "soak: bxd did not come up within 30 s; its log is in %s\n", (root / "bxd.log").c_str());
+        kill(bxd, SIGKILL);
+        waitpid(bxd, nullptr, 0);
+        return 1;
     }
     std::mt19937_64 random(std::random_device{}());
     {
