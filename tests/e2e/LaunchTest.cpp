@@ -173,6 +173,41 @@ TEST_F(LaunchTest, AHostThatLeavesDuringALaunchLeavesNoInstance) {
         << "every instance started was reaped";
 }
 
+// Guards the end of an instance: ending it (here by a hold with termination) ends its whole sandbox, even when its
+// outer process dies before it has let the sandbox's first process go on. bubblewrap names that process before it
+// releases it, and a sandbox that nobody releases waits forever, on no record, holding the plug-in's socket. A
+// stand-in for bubblewrap reports its first process and never releases it.
+TEST_F(LaunchTest, EndingAnInstanceEndsItsWholeSandbox) {
+    const fs::path stalling = bxd_.root() / "stalling-bwrap";
+    std::ofstream(stalling) << "#!/bin/sh\n"
+                               "sleep 600 &\n"
+                               "echo $! > \"$0.first\"\n"
+                               "echo \"{ \\\"child-pid\\\": $! }\" >&4\n"
+                               "wait\n";
+    fs::permissions(stalling, fs::perms(0755));
+    setenv("BX_BWRAP", stalling.c_str(), 1);
+    startAndAdd();
+    unsetenv("BX_BWRAP");
+    TestClient host;
+    ASSERT_EQ(errorCode(ready(host, {hello()})), 0);
+    auto [reply, channel] = launch(host, hello());
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    const pid_t first = std::stoi(slurp(stalling.string() + ".first"));
+    auto running = [first] {
+        std::string stat = slurp("/proc/" + std::to_string(first) + "/stat");
+        size_t name = stat.rfind(')');
+        return name != std::string::npos && name + 2 < stat.size() && stat[name + 2] != 'Z';
+    };
+    ASSERT_TRUE(running());
+
+    Value held = TestClient().replyTo(
+        request("lock", {{"paths", Value::array({Value::string(hello())})}, {"flags", Value::uint64(0x1 | 0x4)}}));
+    EXPECT_EQ(errorCode(held), 0) << errorText(held);
+    for (int i = 0; i < 500 && running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_FALSE(running()) << "the sandbox's first process outlived its instance\n" << bxd_.log();
+    if (running()) kill(first, SIGKILL);
+}
+
 // Guards the user a plug-in runs as: a host that is not root gets a plug-in running as its own user, never as
 // root, even though bxd runs as root; the plug-in's container becomes that user's.
 TEST_F(LaunchTest, APlugInRunsAsItsHostsUserNeverAsRoot) {

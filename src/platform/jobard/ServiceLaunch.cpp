@@ -14,10 +14,13 @@
 #include <asio.hpp>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <memory>
+#include <optional>
 
 #include "base/EventLoopAsio.h"
 #include "base/Format.h"
@@ -40,25 +43,73 @@ constexpr std::string_view kChildPidKey = "\"child-pid\"";
 
 Error launchError(const std::string& message) { return BXError(ErrorCode::OperationFailed, message); }
 
-// Reads what bubblewrap reports on its status pipe until it names the started process; false when the pipe ends or
-// the time runs out first.
-bool sandboxStarted(int statusFd) {
+// The number that follows `key` and its colon in bubblewrap's status text; none when it is missing.
+std::optional<unsigned long long> statusNumber(const std::string& status, std::string_view key) {
+    size_t at = status.find(key);
+    if (at == std::string::npos) return std::nullopt;
+    at = status.find(':', at + key.size());
+    if (at == std::string::npos) return std::nullopt;
+    char* end = nullptr;
+    unsigned long long value = strtoull(status.c_str() + at + 1, &end, 10);
+    if (end == status.c_str() + at + 1) return std::nullopt;
+    return value;
+}
+
+// Reads what bubblewrap reports on its status pipe until it names the sandbox's first process, and returns that
+// pid; none when the pipe ends or the time runs out first.
+std::optional<pid_t> sandboxStarted(int statusFd) {
     std::string status;
     auto deadline = std::chrono::steady_clock::now() + ServiceManager::kSandboxSetupTimeout;
     while (status.find(kChildPidKey) == std::string::npos || status.find('}') == std::string::npos) {
         auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-        if (left.count() <= 0) return false;
+        if (left.count() <= 0) return std::nullopt;
         pollfd p{statusFd, POLLIN, 0};
         int ready = poll(&p, 1, static_cast<int>(left.count()));
         if (ready < 0 && errno == EINTR) continue;
-        if (ready <= 0) return false;
+        if (ready <= 0) return std::nullopt;
         char buffer[512];
         ssize_t n = read(statusFd, buffer, sizeof buffer);
         if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
+        if (n <= 0) return std::nullopt;
         status.append(buffer, static_cast<size_t>(n));
     }
-    return true;
+    std::optional<unsigned long long> first = statusNumber(status, kChildPidKey);
+    if (!first || *first == 0 || *first > static_cast<unsigned long long>(INT32_MAX)) return std::nullopt;
+    return static_cast<pid_t>(*first);
+}
+
+// The parent pid of `pid`, from /proc/<pid>/stat; -1 when it cannot be read.
+pid_t parentOf(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string stat((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    size_t name = stat.rfind(')');
+    if (name == std::string::npos) return -1;
+    char state;
+    int parent = -1;
+    if (sscanf(stat.c_str() + name + 1, " %c %d", &state, &parent) != 2) return -1;
+    return parent;
+}
+
+// A pidfd of the sandbox's first process, the child `first` of bubblewrap's process `outer`. bubblewrap names it
+// before it lets it go on, and if bubblewrap's process ends before that moment (killed because the host left or a
+// hold ends the instance, or failing), the first process waits for it forever, on no record, holding the
+// plug-in's socket. Ending it ends the sandbox: it is the first process of the sandbox's pid namespace. It is
+// pinned only while it is still the child of `outer`, which bxd has not reaped, so the pid names no other process.
+UniqueFd pinSandbox(pid_t outer, pid_t first) {
+    UniqueFd pinned(pidfdOpen(first));
+    if (!pinned || parentOf(first) != outer || pidfdExited(pinned.get())) return UniqueFd();
+    return pinned;
+}
+
+// Ends what is left of a sandbox whose outer process has ended. A sandbox that bubblewrap released ends with its
+// outer process by itself (this only makes sure); one it never released is ended here.
+void endSandbox(const UniqueFd& first, const std::string& identifier, pid_t pid) {
+    if (!first || pidfdExited(first.get())) return;
+    log::ops().notice("ending what is left of the sandbox of instance %d (plug-in %s)", static_cast<int>(pid),
+                      identifier.c_str());
+    if (pidfdSendSignal(first.get(), SIGKILL) != 0 && errno != ESRCH)
+        log::ops().error("cannot end the sandbox of instance %d (plug-in %s): %s", static_cast<int>(pid),
+                         identifier.c_str(), strerror(errno));
 }
 
 std::string exitText(int status) {
@@ -67,16 +118,18 @@ std::string exitText(int status) {
     return "status " + std::to_string(status);
 }
 
-// Waits on `queue` for the process to end without blocking anyone, then reaps it and removes its record. The
-// status pipe stays open until then: bubblewrap reports the plug-in's exit on it last, and a closed pipe would kill
-// it with SIGPIPE instead.
-void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd status, SerialQueue& queue) {
+// Waits on `queue` for the process to end without blocking anyone, then reaps it, ends what is left of its sandbox
+// and removes its record. The status pipe stays open until then: bubblewrap reports the plug-in's exit on it last,
+// and a closed pipe would kill it with SIGPIPE instead.
+void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd status, UniqueFd sandbox,
+                  SerialQueue& queue) {
     int pidfd = pidfdOpen(pid);
     if (pidfd < 0) {
         log::ops().error("cannot watch plug-in %s instance %d: %s; reaping it now", identifier.c_str(),
                          static_cast<int>(pid), strerror(errno));
         kill(pid, SIGKILL);
         waitpid(pid, nullptr, 0);
+        endSandbox(sandbox, identifier, pid);
         std::error_code ignored;
         fs::remove(record, ignored);
         return;
@@ -84,19 +137,21 @@ void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd s
     auto watch = std::make_shared<asio::posix::stream_descriptor>(*detail::QueueInternals::state(queue)->core, pidfd);
     watch->async_wait(
         asio::posix::stream_descriptor::wait_read,
-        detail::bindToQueue(queue, [watch, pid, record, identifier,
-                                    status = std::make_shared<UniqueFd>(std::move(status))](const asio::error_code&) {
-            int exitStatus = 0;
-            pid_t reaped;
-            do {
-                reaped = waitpid(pid, &exitStatus, 0);
-            } while (reaped < 0 && errno == EINTR);
-            std::error_code ignored;
-            fs::remove(record, ignored);
-            log::ops().info("plug-in %s instance %d ended (%s)", identifier.c_str(), static_cast<int>(pid),
-                            exitText(exitStatus).c_str());
-            watch->close();
-        }));
+        detail::bindToQueue(queue,
+                            [watch, pid, record, identifier, status = std::make_shared<UniqueFd>(std::move(status)),
+                             sandbox = std::make_shared<UniqueFd>(std::move(sandbox))](const asio::error_code&) {
+                                int exitStatus = 0;
+                                pid_t reaped;
+                                do {
+                                    reaped = waitpid(pid, &exitStatus, 0);
+                                } while (reaped < 0 && errno == EINTR);
+                                endSandbox(*sandbox, identifier, pid);
+                                std::error_code ignored;
+                                fs::remove(record, ignored);
+                                log::ops().info("plug-in %s instance %d ended (%s)", identifier.c_str(),
+                                                static_cast<int>(pid), exitText(exitStatus).c_str());
+                                watch->close();
+                            }));
 }
 
 }  // namespace
@@ -176,7 +231,8 @@ Result<ServiceManager::LaunchedService> ServiceManager::startService(const Servi
     plugInEnd.reset();
     statusWrite.reset();
 
-    if (!sandboxStarted(statusRead.get())) {
+    std::optional<pid_t> first = sandboxStarted(statusRead.get());
+    if (!first) {
         kill(pid, SIGKILL);
         int status = 0;
         while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
@@ -184,16 +240,18 @@ Result<ServiceManager::LaunchedService> ServiceManager::startService(const Servi
         return launchError(formatPrintf("cannot launch %s: bubblewrap did not set up its sandbox (%s)", name.c_str(),
                                         exitText(status).c_str()));
     }
+    UniqueFd firstProcess = pinSandbox(pid, *first);
     // An instance that termination and the busy check could not see must not run.
     if (!instances_.record(launch.bundleIdentifier, pid)) {
         kill(pid, SIGKILL);
         while (waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
         }
+        endSandbox(firstProcess, name, pid);
         return launchError(formatPrintf("cannot launch %s: cannot record its instance under %s", name.c_str(),
                                         instances_.directory().c_str()));
     }
     fs::path record = instances_.directory() / launch.bundleIdentifier / std::to_string(pid);
-    reapWhenDone(pid, record, name, std::move(statusRead), reaper);
+    reapWhenDone(pid, record, name, std::move(statusRead), std::move(firstProcess), reaper);
     log::ops().notice("launched plug-in %s as instance %d (user %u) in the %s sandbox", name.c_str(),
                       static_cast<int>(pid), static_cast<unsigned>(uid), std::string(profile->name).c_str());
     return LaunchedService{pid, std::move(hostEnd)};
