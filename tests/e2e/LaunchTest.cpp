@@ -8,11 +8,13 @@
 #include <netinet/in.h>
 #include <poll.h>
 #include <spawn.h>
+#include <sys/ptrace.h>
 #include <sys/socket.h>
 
 #include <sstream>
 
 #include "E2eSupport.h"
+#include "base/Pidfd.h"
 
 namespace bexil {
 namespace {
@@ -206,6 +208,42 @@ TEST_F(LaunchTest, EndingAnInstanceEndsItsWholeSandbox) {
     for (int i = 0; i < 500 && running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
     EXPECT_FALSE(running()) << "the sandbox's first process outlived its instance\n" << bxd_.log();
     if (running()) kill(first, SIGKILL);
+}
+
+// Guards the daemon's one thread against the end of an instance: bxd learns of it from the instance's pidfd, which
+// can report an end that waitpid cannot collect yet (here: a process that another process traces is reaped by its
+// parent only after its tracer has seen it end; the event loop can also report a pidfd early). bxd must answer other
+// requests meanwhile and reap the instance once it can. A stand-in for bubblewrap ends when its host hangs up.
+TEST_F(LaunchTest, AnInstanceThatCannotBeReapedYetDoesNotStopTheDaemon) {
+    const fs::path fake = bxd_.root() / "plain-bwrap";
+    std::ofstream(fake) << "#!/bin/sh\n"
+                           "echo \"{ \\\"child-pid\\\": $$ }\" >&4\n"
+                           "exec cat <&3 >/dev/null\n";
+    fs::permissions(fake, fs::perms(0755));
+    setenv("BX_BWRAP", fake.c_str(), 1);
+    startAndAdd();
+    unsetenv("BX_BWRAP");
+    TestClient host;
+    ASSERT_EQ(errorCode(ready(host, {hello()})), 0);
+    auto [reply, channel] = launch(host, hello());
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    const pid_t instance = static_cast<pid_t>(reply.get("pid").numberAsUInt64().value_or(0));
+    if (ptrace(PTRACE_SEIZE, instance, nullptr, nullptr) != 0)
+        GTEST_SKIP() << "this process may not trace another: " << strerror(errno);
+
+    UniqueFd ended(pidfdOpen(instance));
+    channel.reset();  // the instance ends; until its tracer has seen that, its parent cannot reap it
+    ASSERT_TRUE(pidfdExited(ended.get(), 5000));
+    const auto asked = std::chrono::steady_clock::now();
+    TestClient::Reply answer = TestClient().roundTrip(request("bulk"), std::chrono::seconds(3));
+    EXPECT_TRUE(std::holds_alternative<Value>(answer)) << "bxd stopped answering while an instance ended";
+    EXPECT_LT(std::chrono::steady_clock::now() - asked, std::chrono::seconds(2));
+
+    int status = 0;
+    ASSERT_EQ(waitpid(instance, &status, __WALL), instance);  // the tracer has seen the end: bxd may reap it now
+    EXPECT_TRUE(WIFEXITED(status)) << status;
+    expectLog("plug-in com.example.greeter.hello instance " + std::to_string(instance) + " ended (exit status 0)");
+    EXPECT_FALSE(fs::exists(instanceRecord("com.example.greeter.hello", static_cast<uint64_t>(instance))));
 }
 
 // Guards the user a plug-in runs as: a host that is not root gets a plug-in running as its own user, never as

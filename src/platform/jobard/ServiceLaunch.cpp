@@ -118,9 +118,70 @@ std::string exitText(int status) {
     return "status " + std::to_string(status);
 }
 
-// Waits on `queue` for the process to end without blocking anyone, then reaps it, ends what is left of its sandbox
-// and removes its record. The status pipe stays open until then: bubblewrap reports the plug-in's exit on it last,
-// and a closed pipe would kill it with SIGPIPE instead.
+// How long the reaper waits before it looks again at an instance that has ended but that bxd may not reap yet.
+constexpr auto kReapRetry = std::chrono::milliseconds(100);
+
+// One launched instance until bxd has reaped it: its pidfd watched on the event loop, and what goes with the
+// instance (its record, the status pipe, the sandbox's first process). The status pipe stays open until the end:
+// bubblewrap reports the plug-in's exit on it last, and a closed pipe would kill it with SIGPIPE instead.
+//
+// A readable pidfd is only a reason to look. The event loop can report it readable while the instance still runs
+// (seen under heavy client churn), and a process that another process traces has ended before its parent may reap
+// it. So waitpid never waits here: bxd has one thread, and every client would wait with it until the plug-in ended.
+class InstanceReaper : public std::enable_shared_from_this<InstanceReaper> {
+  public:
+    InstanceReaper(int pidfd, pid_t pid, fs::path record, std::string identifier, UniqueFd status, UniqueFd sandbox,
+                   SerialQueue& queue)
+        : queue_(queue),
+          watch_(*detail::QueueInternals::state(queue)->core, pidfd),
+          again_(*detail::QueueInternals::state(queue)->core),
+          pid_(pid),
+          record_(std::move(record)),
+          identifier_(std::move(identifier)),
+          status_(std::move(status)),
+          sandbox_(std::move(sandbox)) {}
+
+    void wait() {
+        watch_.async_wait(asio::posix::stream_descriptor::wait_read,
+                          detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error) {
+                              if (error != asio::error::operation_aborted) self->look();
+                          }));
+    }
+
+  private:
+    void look() {
+        int status = 0;
+        pid_t reaped;
+        do {
+            reaped = waitpid(pid_, &status, WNOHANG);
+        } while (reaped < 0 && errno == EINTR);
+        if (reaped == 0) {
+            if (!pidfdExited(watch_.native_handle())) return wait();
+            again_.expires_after(kReapRetry);
+            again_.async_wait(detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error) {
+                if (!error) self->look();
+            }));
+            return;
+        }
+        endSandbox(sandbox_, identifier_, pid_);
+        std::error_code ignored;
+        fs::remove(record_, ignored);
+        log::ops().info("plug-in %s instance %d ended (%s)", identifier_.c_str(), static_cast<int>(pid_),
+                        exitText(status).c_str());
+        watch_.close(ignored);
+    }
+
+    SerialQueue queue_;
+    asio::posix::stream_descriptor watch_;
+    asio::steady_timer again_;
+    const pid_t pid_;
+    const fs::path record_;
+    const std::string identifier_;
+    UniqueFd status_;
+    UniqueFd sandbox_;
+};
+
+// Reaps the instance `pid` on `queue` once it has ended (see InstanceReaper), without blocking anyone.
 void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd status, UniqueFd sandbox,
                   SerialQueue& queue) {
     int pidfd = pidfdOpen(pid);
@@ -134,24 +195,9 @@ void reapWhenDone(pid_t pid, fs::path record, std::string identifier, UniqueFd s
         fs::remove(record, ignored);
         return;
     }
-    auto watch = std::make_shared<asio::posix::stream_descriptor>(*detail::QueueInternals::state(queue)->core, pidfd);
-    watch->async_wait(
-        asio::posix::stream_descriptor::wait_read,
-        detail::bindToQueue(queue,
-                            [watch, pid, record, identifier, status = std::make_shared<UniqueFd>(std::move(status)),
-                             sandbox = std::make_shared<UniqueFd>(std::move(sandbox))](const asio::error_code&) {
-                                int exitStatus = 0;
-                                pid_t reaped;
-                                do {
-                                    reaped = waitpid(pid, &exitStatus, 0);
-                                } while (reaped < 0 && errno == EINTR);
-                                endSandbox(*sandbox, identifier, pid);
-                                std::error_code ignored;
-                                fs::remove(record, ignored);
-                                log::ops().info("plug-in %s instance %d ended (%s)", identifier.c_str(),
-                                                static_cast<int>(pid), exitText(exitStatus).c_str());
-                                watch->close();
-                            }));
+    std::make_shared<InstanceReaper>(pidfd, pid, std::move(record), std::move(identifier), std::move(status),
+                                     std::move(sandbox), queue)
+        ->wait();
 }
 
 }  // namespace

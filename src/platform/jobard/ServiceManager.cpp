@@ -19,6 +19,19 @@ namespace bexil {
 
 namespace {
 
+// Calls `ended` on `queue` once the process of `pidfd` has ended; nothing when the watch is closed first. A readable
+// pidfd is only a reason to look: the event loop can report one while the process still runs, and whoever waits
+// here (a hold with termination) promises its caller that the instance has ended.
+void whenExited(std::shared_ptr<asio::posix::stream_descriptor> pidfd, SerialQueue queue, std::function<void()> ended) {
+    pidfd->async_wait(
+        asio::posix::stream_descriptor::wait_read,
+        detail::bindToQueue(queue, [pidfd, queue, ended = std::move(ended)](const asio::error_code& error) mutable {
+            if (error == asio::error::operation_aborted) return;
+            if (!pidfdExited(pidfd->native_handle())) return whenExited(pidfd, queue, std::move(ended));
+            ended();
+        }));
+}
+
 // Ends one instance without blocking anyone: SIGTERM, then SIGKILL when it is still there after the grace period,
 // all driven by `queue`'s event loop (a watch on the instance's pidfd and a timer). `done` runs once on `queue`
 // with 0 or an errno value.
@@ -46,10 +59,7 @@ void terminate(const InstanceRecords::Instance& instance, SerialQueue& queue, st
         exited->close();
         done(result);
     };
-    exited->async_wait(asio::posix::stream_descriptor::wait_read,
-                       detail::bindToQueue(queue, [finish](const asio::error_code& error) {
-                           if (error != asio::error::operation_aborted) finish(0);
-                       }));
+    whenExited(exited, queue, [finish] { finish(0); });
     timer->async_wait(
         detail::bindToQueue(queue, [queue, exited, timer, finished, finish](const asio::error_code& error) {
             if (error || *finished) return;
