@@ -30,10 +30,11 @@
 // It prints the requests sent and answered by kind, the errors by code, timeouts (no reply within 10 s), lost
 // replies (the connection ended under a live client), wrong answers, and bxd's resident memory and open descriptors
 // at the start, the middle, the end and once the clients are gone, with the ratio end/middle; then it stops bxd with
-// SIGTERM and reports its exit status and any sanitizer report on its stderr. It exits non-zero when bxd died, a
-// reply was missing or late, an answer was wrong, or a sanitizer reported. Once the clients are gone bxd may still
-// hold a few more descriptors than at the start: the pidfds of ended hosts whose grants it drops at the next
-// "ready" or "launch", not when the host ends; their number stays below the number of clients.
+// SIGTERM and reports its exit status, any process of a plug-in sandbox that outlived it (ended then) and any
+// sanitizer report on its stderr. It exits non-zero when bxd died, a reply was missing or late, an answer was wrong,
+// a sandbox process outlived bxd, or a sanitizer reported. Once the clients are gone bxd may still hold a few more
+// descriptors than at the start: the pidfds of ended hosts whose grants it drops at the next "ready" or "launch", not
+// when the host ends; their number stays below the number of clients.
 
 #include <fcntl.h>
 #include <getopt.h>
@@ -52,6 +53,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <deque>
 #include <filesystem>
 #include <fstream>
@@ -175,10 +177,16 @@ Tally* mapTally(const fs::path& path, bool create) {
     return static_cast<Tally*>(shared);
 }
 
-// Keeps the first few problems in words for the report.
+// Keeps the first few problems in words for the report, with the time of day (UTC, as bxd's log has it).
 void note(Tally& tally, const std::string& text) {
     uint32_t slot = tally.notesTaken.fetch_add(1);
-    if (slot < kNotes) snprintf(tally.notes[slot], sizeof tally.notes[slot], "%s", text.c_str());
+    if (slot >= kNotes) return;
+    timespec now{};
+    clock_gettime(CLOCK_REALTIME, &now);
+    tm utc{};
+    gmtime_r(&now.tv_sec, &utc);
+    snprintf(tally.notes[slot], sizeof tally.notes[slot], "%02d:%02d:%02d.%03ld %s", utc.tm_hour, utc.tm_min,
+             utc.tm_sec, now.tv_nsec / 1000000, text.c_str());
 }
 
 void raiseTo(std::atomic<uint64_t>& slowest, uint64_t value) {
@@ -990,6 +998,23 @@ std::string slurp(const fs::path& path) {
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
+// The live processes (zombies have no command line) whose command line names `root`, other than this one: what is
+// left of the plug-in sandboxes bxd started there, once bxd has ended.
+std::vector<std::pair<pid_t, std::string>> processesIn(const fs::path& root) {
+    std::vector<std::pair<pid_t, std::string>> found;
+    std::error_code error;
+    for (fs::directory_iterator it("/proc", error), end; !error && it != end; it.increment(error)) {
+        const std::string name = it->path().filename().string();
+        if (name.find_first_not_of("0123456789") != std::string::npos) continue;
+        const pid_t pid = static_cast<pid_t>(std::stol(name));
+        if (pid == getpid()) continue;
+        std::string command = slurp(it->path() / "cmdline");
+        std::replace(command.begin(), command.end(), '\0', ' ');
+        if (command.find(root.string()) != std::string::npos) found.emplace_back(pid, command);
+    }
+    return found;
+}
+
 // The sanitizer reports in a log: how many, and the first line of the first one.
 std::pair<size_t, std::string> sanitizerReports(const fs::path& log) {
     const std::string text = slurp(log);
@@ -1235,6 +1260,10 @@ int main(int argc, char** argv) {
             ending = "died after the run: " + describeStatus(bxdStatus);
         }
     }
+    // Instances end with bxd: give the kernel a moment to end their sandboxes, then end and count what is left.
+    std::this_thread::sleep_for(std::chrono::seconds(1));
+    const std::vector<std::pair<pid_t, std::string>> leftBehind = processesIn(root);
+    for (const auto& [pid, command] : leftBehind) kill(pid, SIGKILL);
     auto [reports, firstReport] = sanitizerReports(root / "bxd.log");
     auto [clientReports, firstClientReport] = sanitizerReports(root / "clients.log");
 
@@ -1293,6 +1322,9 @@ int main(int argc, char** argv) {
     const bool died = diedDuringRun || ending.rfind("died", 0) == 0;
     printf("bxd alive at the end: %s\n", died ? "no" : "yes");
     printf("bxd after SIGTERM: %s\n", ending.c_str());
+    printf("processes of bxd's sandboxes left behind: %zu%s%.120s\n", leftBehind.size(),
+           leftBehind.empty() ? "" : " (killed now), the first: ",
+           leftBehind.empty() ? "" : leftBehind.front().second.c_str());
     printf("sanitizer reports on bxd's stderr: %zu%s%s\n", reports, reports ? ", the first: " : "",
            firstReport.c_str());
     if (clientReports)
@@ -1300,7 +1332,7 @@ int main(int argc, char** argv) {
                firstClientReport.c_str());
 
     const bool failed = died || tally.timeouts > 0 || tally.lost > 0 || tally.misdirected > 0 || tally.wrong > 0 ||
-                        reports > 0 || clientReports > 0;
+                        !leftBehind.empty() || reports > 0 || clientReports > 0;
     printf("verdict: %s\n", failed ? "FAIL" : "pass");
     if (failed || options.keep) {
         printf("private root kept: %s\n", root.c_str());
