@@ -57,7 +57,7 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     const std::string& path() const override { return path_; }
     // The peer's user and group as the transport read them at connect time; none once the connection is gone.
     std::optional<UserIdentity> user() const;
-    // The pidfd the transport took when the peer connected; -1 when there is none or the connection is gone.
+    // The pidfd the transport took when the peer connected; null when there is none or the connection is gone.
     std::shared_ptr<const UniqueFd> pidfd() const override;
     // The bundle that contains the peer's executable; null when there is none.
     const std::shared_ptr<BXBundle>& bundle() const { return bundle_; }
