@@ -29,7 +29,8 @@ class DaemonClient {
         // The reply dictionary; null when the connection failed in its place.
         Value message;
         // None on success; the daemon's code and message otherwise (code 4 for a failed connection or a reply
-        // that never came within wait()'s time limit).
+        // that never came within wait()'s time limit, and also for a request that could not be sent as it stands,
+        // such as one holding text that is not UTF-8: connectionFailed then stays false).
         std::optional<Error> error;
         // True when no reply dictionary came: the daemon is not running, went away or did not answer in time.
         bool connectionFailed = false;

@@ -145,8 +145,13 @@ void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler r
 }
 
 std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {
-    if (const auto* error = std::get_if<ZemError>(&reply))
+    if (const auto* error = std::get_if<ZemError>(&reply)) {
+        if (error->kind() == ZemError::Kind::MessageInvalid)
+            return BXError(
+                ErrorCode::InvalidRequest,
+                "the request cannot be sent: it holds text that is not UTF-8, nests too deep or is too large");
         return BXError(ErrorCode::OperationFailed, error->description());
+    }
     const Value& dictionary = std::get<Value>(reply);
     // Only the low 32 bits of the code are looked at: the daemon widens a signed 32-bit code with its sign.
     int32_t code = 0;

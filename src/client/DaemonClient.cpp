@@ -42,7 +42,7 @@ DaemonClient::Reply makeReply(const BXDaemonClient::Reply& raw) {
     if (const Value* message = std::get_if<Value>(&raw)) {
         reply.message = *message;
     } else {
-        reply.connectionFailed = true;
+        reply.connectionFailed = std::get<ZemError>(raw).kind() != ZemError::Kind::MessageInvalid;
     }
     try {
         reply.error = BXDaemonClient::errorInReply(raw);

@@ -183,6 +183,28 @@ TEST(BXDaemonClientConnectionTest, MissingServiceAnswersWithAConnectionErrorThat
     EXPECT_TRUE(capture.contains("Communications error: " + std::get<ZemError>(*reply).description()));
 }
 
+// Guards the difference between a request that cannot travel and a connection that failed: text that is not UTF-8
+// is refused before anything is sent, as a malformed request (the public client says the connection did not fail),
+// and the same connection carries the next request. Reporting it as a connection failure made the tool say bxd was
+// not running.
+TEST_F(BXDaemonClientRequestTest, ARequestThatCannotBeEncodedFailsAloneAndTheConnectionGoesOn) {
+    BXDaemonClient client;
+    Value rules = Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.\xff")}});
+    auto refused = sendAndWait([&](auto h) { client.matchPlugInsFlagsReply(rules, 0, h); }, std::chrono::seconds(10));
+    ASSERT_TRUE(refused.has_value());
+    ASSERT_TRUE(std::holds_alternative<ZemError>(*refused));
+    EXPECT_EQ(std::get<ZemError>(*refused).kind(), ZemError::Kind::MessageInvalid);
+    std::optional<Error> error = BXDaemonClient::errorInReply(*refused);
+    ASSERT_TRUE(error.has_value());
+    EXPECT_EQ(error->code(), static_cast<int64_t>(ErrorCode::InvalidRequest));
+    EXPECT_NE(error->localizedDescription().value_or("").find("not UTF-8"), std::string::npos);
+
+    auto next = sendAndWait([&](auto h) { client.bulkPluginsReply(0, h); }, std::chrono::seconds(10));
+    ASSERT_TRUE(next.has_value());
+    EXPECT_TRUE(std::holds_alternative<Value>(*next)) << "the connection must survive a request it could not send";
+    EXPECT_EQ(service_.lastRequest().get("request"), Value::string("bulk"));
+}
+
 // ---- errorInReply ----
 
 Reply replyWith(std::vector<std::pair<std::string, Value>> entries) { return Value::dictionary(std::move(entries)); }

@@ -32,10 +32,16 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
 
     ASSERT_TRUE(start());
     const std::string uuid = "11111111-2222-4333-8444-555555555555";
+    // Text that is not UTF-8 cannot travel: the tool says where it is, and that it sent nothing.
+    const std::string badRules = (bxd_.root() / "bad-rules.json").string();
+    std::ofstream(badRules) << "{\n  \"RZExtensionPointIdentifier\": \"com.example.\xff\"\n}\n";
     // Each row: arguments, exit status, text the one line on standard error must hold.
     const std::tuple<std::string, int, std::string> cases[] = {
         {"ready not-a-uuid", 64, "not a UUID"},
         {"match --rules-file /nonexistent/rules.json", 64, "/nonexistent/rules.json"},
+        {"match --rules-file " + badRules, 64, "JSON line 2: string is not UTF-8 (bad byte 0xff)"},
+        {"match $(printf 'RZExtensionPointIdentifier=\\377')", 64,
+         "bexil: match not sent: it holds text that is not UTF-8"},
         {"annotate " + uuid, 64, "needs --election or --extension"},
         {"frobnicate", 64, ""},
         {"add", 64, ""},

@@ -164,10 +164,10 @@ class Parser {
     }
 
     bool parseString(std::string& out) {
-        ++pos_;
+        const size_t start = ++pos_;
         while (pos_ < text_.size()) {
             char c = text_[pos_++];
-            if (c == '"') return true;
+            if (c == '"') return wellFormed(start, pos_ - 1);
             if (static_cast<unsigned char>(c) < 0x20) {
                 error_ = "control character in a string";
                 return false;
@@ -226,6 +226,19 @@ class Parser {
             }
         }
         error_ = "unterminated string";
+        return false;
+    }
+
+    // Refuses a string whose bytes between `start` and `end` are not UTF-8 here, where the line can be named: the
+    // escapes are ASCII and what \u makes is well formed, so the raw bytes decide. Without this the text would
+    // reach the encoder and fail there, far from the file that holds it.
+    bool wellFormed(size_t start, size_t end) {
+        size_t bad = firstInvalidUtf8(text_.substr(start, end - start));
+        if (bad == kWellFormedUtf8) return true;
+        pos_ = start + bad;
+        char byte[8];
+        std::snprintf(byte, sizeof byte, "0x%02x", static_cast<unsigned char>(text_[pos_]));
+        error_ = std::string("string is not UTF-8 (bad byte ") + byte + ")";
         return false;
     }
 

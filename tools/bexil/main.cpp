@@ -64,6 +64,20 @@ std::optional<int> failureStatus(const Options& options, const char* what, const
     return exitStatusForCode(error->code());
 }
 
+// The exit status, and the line on standard error, for a request that got a connection error in place of its reply:
+// either the request could not be sent as it stands (the connection is fine: the user gave something that cannot
+// travel, so it is a usage error), or bxd is not there.
+int unsent(const Options& options, const char* what, const ZemError& error) {
+    if (error.kind() == ZemError::Kind::MessageInvalid) {
+        std::fprintf(stderr, "bexil: %s not sent: it holds text that is not UTF-8, nests too deep or is too large\n",
+                     what);
+        return kExitUsage;
+    }
+    std::fprintf(stderr, "bexil: bxd is not running on service %s (%s)\n", options.service.c_str(),
+                 ZemListener::socketPathForService(options.service).c_str());
+    return kExitUnavailable;
+}
+
 // Sends one request and turns the outcome into an exit status; on success `onSuccess` prints the reply.
 int roundTrip(const Options& options, const char* what,
               const std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>& send,
@@ -77,11 +91,7 @@ int roundTrip(const Options& options, const char* what,
                      options.timeoutSeconds, options.service.c_str());
         return kExitTimeout;
     }
-    if (std::holds_alternative<ZemError>(*reply)) {
-        std::fprintf(stderr, "bexil: bxd is not running on service %s (%s)\n", options.service.c_str(),
-                     ZemListener::socketPathForService(options.service).c_str());
-        return kExitUnavailable;
-    }
+    if (const ZemError* error = std::get_if<ZemError>(&*reply)) return unsent(options, what, *error);
     const Value& message = std::get<Value>(*reply);
     if (std::optional<int> failed = failureStatus(options, what, message)) return *failed;
     if (options.json && !onSuccess) {
@@ -497,10 +507,7 @@ int launchCommand(const Options& options, Arguments& arguments) {
         return kExitTimeout;
     }
     std::variant<ZemMessage, ZemError> reply = future.get();
-    if (std::holds_alternative<ZemError>(reply)) {
-        std::fprintf(stderr, "bexil: bxd is not running on service %s\n", options.service.c_str());
-        return kExitUnavailable;
-    }
+    if (const ZemError* error = std::get_if<ZemError>(&reply)) return unsent(options, "launch", *error);
     const ZemMessage& message = std::get<ZemMessage>(reply);
     if (std::optional<int> failed = failureStatus(options, "launch", message.body())) return *failed;
     if (message.descriptorCount() != 1) {

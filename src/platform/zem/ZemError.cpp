@@ -10,6 +10,8 @@ std::string ZemError::description() const {
             return "Connection interrupted";
         case Kind::TerminationImminent:
             return "Termination imminent";
+        case Kind::MessageInvalid:
+            return "Message invalid";
     }
     return "Unknown connection error";
 }

@@ -16,12 +16,15 @@ class ZemError {
         ConnectionInterrupted,
         // The daemon is being stopped (SIGTERM); the connection still works until it is closed.
         TerminationImminent,
+        // This message was not sent: it cannot be encoded (a text that is not UTF-8, too deep, too large) or carries
+        // too many descriptors. Only a reply handler gets it; the connection stays usable.
+        MessageInvalid,
     };
 
     explicit ZemError(Kind kind) : kind_(kind) {}
 
     Kind kind() const { return kind_; }
-    // "Connection invalid", "Connection interrupted", "Termination imminent".
+    // "Connection invalid", "Connection interrupted", "Termination imminent", "Message invalid".
     std::string description() const;
 
     bool operator==(const ZemError&) const = default;

@@ -372,13 +372,13 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
     if (descriptors.size() > ZemFrame::kMaxDescriptorsPerFrame) {
         log::ops().error("cannot send %s to peer %d with %zu descriptors (at most %u)", zemFrameKindName(kind),
                          static_cast<int>(pid_), descriptors.size(), unsigned{ZemFrame::kMaxDescriptorsPerFrame});
-        if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+        if (pending) answerWithError(*pending, ZemError::Kind::MessageInvalid);
         return;
     }
     if (std::optional<Error> error =
             ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_, static_cast<uint8_t>(descriptors.size()))) {
         log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(kind), static_cast<int>(pid_), *error);
-        if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
+        if (pending) answerWithError(*pending, ZemError::Kind::MessageInvalid);
         return;
     }
     if (pending) pendingReplies_.emplace(serial, std::move(*pending));
