@@ -74,6 +74,18 @@ class LaunchTest : public DaemonTest {
     }
     fs::path container(const std::string& identifier) const { return bxd_.root() / "state/containers" / identifier; }
 
+    // Starts bxd with the shell script `script` (written as root/`name`) in bubblewrap's place and registers the
+    // greeters. The script reports its first process on descriptor 4 as bubblewrap does; the plug-in's socket is its
+    // descriptor 3.
+    void startAndAddWithStandIn(const std::string& name, const std::string& script) {
+        const fs::path standIn = bxd_.root() / name;
+        std::ofstream(standIn) << "#!/bin/sh\n" << script;
+        fs::permissions(standIn, fs::perms(0755));
+        setenv("BX_BWRAP", standIn.c_str(), 1);
+        startAndAdd();
+        unsetenv("BX_BWRAP");
+    }
+
     // A bundle for the probe plug-in inside Probe.app, of extension point `point`.
     std::string makeProbe(const std::string& name, const std::string& point) {
         fs::path app = bundles_ / "Probe.app";
@@ -180,21 +192,16 @@ TEST_F(LaunchTest, AHostThatLeavesDuringALaunchLeavesNoInstance) {
 // releases it, and a sandbox that nobody releases waits forever, on no record, holding the plug-in's socket. A
 // stand-in for bubblewrap reports its first process and never releases it.
 TEST_F(LaunchTest, EndingAnInstanceEndsItsWholeSandbox) {
-    const fs::path stalling = bxd_.root() / "stalling-bwrap";
-    std::ofstream(stalling) << "#!/bin/sh\n"
-                               "sleep 600 &\n"
-                               "echo $! > \"$0.first\"\n"
-                               "echo \"{ \\\"child-pid\\\": $! }\" >&4\n"
-                               "wait\n";
-    fs::permissions(stalling, fs::perms(0755));
-    setenv("BX_BWRAP", stalling.c_str(), 1);
-    startAndAdd();
-    unsetenv("BX_BWRAP");
+    startAndAddWithStandIn("stalling-bwrap",
+                           "sleep 600 &\n"
+                           "echo $! > \"$0.first\"\n"
+                           "echo \"{ \\\"child-pid\\\": $! }\" >&4\n"
+                           "wait\n");
     TestClient host;
     ASSERT_EQ(errorCode(ready(host, {hello()})), 0);
     auto [reply, channel] = launch(host, hello());
     ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
-    const pid_t first = std::stoi(slurp(stalling.string() + ".first"));
+    const pid_t first = std::stoi(slurp((bxd_.root() / "stalling-bwrap.first").string()));
     auto running = [first] {
         std::string stat = slurp("/proc/" + std::to_string(first) + "/stat");
         size_t name = stat.rfind(')');
@@ -215,14 +222,9 @@ TEST_F(LaunchTest, EndingAnInstanceEndsItsWholeSandbox) {
 // parent only after its tracer has seen it end; the event loop can also report a pidfd early). bxd must answer other
 // requests meanwhile and reap the instance once it can. A stand-in for bubblewrap ends when its host hangs up.
 TEST_F(LaunchTest, AnInstanceThatCannotBeReapedYetDoesNotStopTheDaemon) {
-    const fs::path fake = bxd_.root() / "plain-bwrap";
-    std::ofstream(fake) << "#!/bin/sh\n"
+    startAndAddWithStandIn("plain-bwrap",
                            "echo \"{ \\\"child-pid\\\": $$ }\" >&4\n"
-                           "exec cat <&3 >/dev/null\n";
-    fs::permissions(fake, fs::perms(0755));
-    setenv("BX_BWRAP", fake.c_str(), 1);
-    startAndAdd();
-    unsetenv("BX_BWRAP");
+                           "exec cat <&3 >/dev/null\n");
     TestClient host;
     ASSERT_EQ(errorCode(ready(host, {hello()})), 0);
     auto [reply, channel] = launch(host, hello());
