@@ -77,6 +77,10 @@ class DaemonClient {
     // The holds in force, under "holds": per hold its "uuid", the "pid" and "executable" of its placer, "created"
     // and "plugins" ("identifier", "uuid", "path"). Needs the manager entitlement.
     void holds(Callback done);
+    // What bxd is doing now: "uptime" (seconds), "connections", "served" (request name -> count since start),
+    // "cachedRecords", "cacheLimit", "holdCount" and "registered" (absent when the registry cannot be read). Any
+    // client may ask. An extension of the protocol (docs/protocol.md).
+    void status(Callback done);
     // Starts a plug-in that ready() made runnable for this process, in its sandbox; the reply carries "pid" and
     // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
     void launch(const Uuid& plugIn, Callback done);

@@ -31,9 +31,9 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch" and "holds" are extensions of ours: on Linux nobody but bxd starts plug-ins, and administrators want to
-// see what holds plug-ins out of use (docs/protocol.md).
-enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch, Holds };
+// "launch", "holds" and "status" are extensions of ours: on Linux nobody but bxd starts plug-ins, and administrators
+// want to see what holds plug-ins out of use and what the daemon is doing (docs/protocol.md).
+enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch, Holds, Status };
 
 struct RequestInfo {
     Request request;
@@ -43,7 +43,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 11> kRequests{{
+inline constexpr std::array<RequestInfo, 12> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -55,6 +55,7 @@ inline constexpr std::array<RequestInfo, 11> kRequests{{
     {Request::Lock, "lock", "place or release a hold on plug-ins"},
     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
     {Request::Holds, "holds", "list the holds in force (manager only)"},
+    {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -87,9 +88,18 @@ inline constexpr std::string_view kExtensions = "extensions";    // array of tok
 inline constexpr std::string_view kPid = "pid";                  // uint64, the instance a "launch" started
 inline constexpr std::string_view kBundleInfo = "bundleInfo";    // dictionary, what a "launch" started
 inline constexpr std::string_view kHolds = "holds";              // array of hold descriptions, in a "holds" reply
-inline constexpr std::array kList{kRequest,   kVersion,     kPaths,     kUuids,      kFlags,
-                                  kRules,     kAnnotations, kErrorCode, kError,      kMatches,
-                                  kConflicts, kExtensions,  kPid,       kBundleInfo, kHolds};
+// In a "status" reply:
+inline constexpr std::string_view kUptime = "uptime";                // uint64, seconds since bxd started
+inline constexpr std::string_view kConnections = "connections";      // uint64, client connections open now
+inline constexpr std::string_view kServed = "served";                // dictionary, request name -> uint64 count
+inline constexpr std::string_view kCachedRecords = "cachedRecords";  // uint64, plug-in records in the cache
+inline constexpr std::string_view kCacheLimit = "cacheLimit";        // uint64, records past which it is purged
+inline constexpr std::string_view kHoldCount = "holdCount";          // uint64, holds in force
+inline constexpr std::string_view kRegistered = "registered";        // uint64, plug-ins in the registry
+inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,     kFlags,       kRules,
+                                  kAnnotations,   kErrorCode,  kError,     kMatches,   kConflicts,   kExtensions,
+                                  kPid,           kBundleInfo, kHolds,     kUptime,    kConnections, kServed,
+                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

@@ -136,6 +136,8 @@ void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
 
 void BXDaemonClient::listHoldsReply(ReplyHandler reply) { sendReply(request(Request::Holds).take(), std::move(reply)); }
 
+void BXDaemonClient::statusReply(ReplyHandler reply) { sendReply(request(Request::Status).take(), std::move(reply)); }
+
 void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply) {
     MutableDictionary message = request(Request::Launch);
     setUuids(message, {plugIn});

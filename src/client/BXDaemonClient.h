@@ -68,6 +68,8 @@ class BXDaemonClient {
     void releaseHoldReply(const Uuid& hold, ReplyHandler reply);
     // The holds in force (needs the manager entitlement).
     void listHoldsReply(ReplyHandler reply);
+    // What bxd is doing now (any client may ask).
+    void statusReply(ReplyHandler reply);
     // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
     void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
 

@@ -5,6 +5,10 @@
 // server(); lives for the life of the process. Requests run one at a time on mainQueue; holds are touched only
 // inside syncQueue.
 
+#include <array>
+#include <atomic>
+#include <chrono>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -94,6 +98,16 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     unsigned verbose() const { return verbose_; }
     void setVerbose(unsigned count) { verbose_ = count; }
 
+    // What "status" reports: requests dispatched since start, counted by name (safe from any thread), and when the
+    // server was built.
+    void countRequest(protocol::Request request) {
+        served_[static_cast<size_t>(request)].fetch_add(1, std::memory_order_relaxed);
+    }
+    uint64_t served(protocol::Request request) const {
+        return served_[static_cast<size_t>(request)].load(std::memory_order_relaxed);
+    }
+    std::chrono::steady_clock::time_point started() const { return started_; }
+
   private:
     BXDServer(const char* databasePath, EventLoop& loop);
 
@@ -109,6 +123,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     ServiceManager serviceManager_;
     ProcessAssertions processAssertions_;
     std::shared_ptr<const PrivacyConsent> consent_;
+    std::array<std::atomic<uint64_t>, protocol::kRequests.size()> served_{};
+    const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
 };
 
 }  // namespace bexil

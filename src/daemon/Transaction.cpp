@@ -51,6 +51,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Lock, &Transaction::lockDownPlugIns},
     {Request::Launch, &Transaction::launchPlugIn},
     {Request::Holds, &Transaction::listHolds},
+    {Request::Status, &Transaction::reportStatus},
 }};
 
 constexpr bool handlersFollowTheProtocol() {
@@ -102,6 +103,7 @@ void Transaction::dispatch() {
         fail(ErrorCode::InvalidRequest, "unrecognized request");
         return;
     }
+    server()->countRequest(*request);
     runHandler(*request);
 }
 

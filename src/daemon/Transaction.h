@@ -93,6 +93,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void lockDownPlugIns();
     void launchPlugIn();
     void listHolds();
+    void reportStatus();
 
   private:
     void runHandler(protocol::Request request);

@@ -212,6 +212,31 @@ int printHolds(const Options& options, BXDaemonClient&, const Value& message) {
     return 0;
 }
 
+// One line per figure of a "status" reply, then the requests served by name (those served at least once).
+int printStatus(const Options& options, BXDaemonClient&, const Value& message) {
+    if (options.json) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    auto number = [&](std::string_view key) -> std::string {
+        std::optional<uint64_t> value = message.get(key).numberAsUInt64();
+        return value ? std::to_string(*value) : "unknown";
+    };
+    std::optional<uint64_t> uptime = message.get(protocol::key::kUptime).numberAsUInt64();
+    std::printf("uptime:       %s\n", uptime ? ageText(static_cast<double>(*uptime)).c_str() : "unknown");
+    std::printf("connections:  %s\n", number(protocol::key::kConnections).c_str());
+    std::printf("registered:   %s plug-ins\n", number(protocol::key::kRegistered).c_str());
+    std::printf("cache:        %s of %s records\n", number(protocol::key::kCachedRecords).c_str(),
+                number(protocol::key::kCacheLimit).c_str());
+    std::printf("holds:        %s\n", number(protocol::key::kHoldCount).c_str());
+    std::printf("served:\n");
+    for (const auto& [name, count] : message.get(protocol::key::kServed).entries())
+        if (count.numberAsUInt64().value_or(0) > 0)
+            std::printf("  %-14s %llu\n", name.c_str(),
+                        static_cast<unsigned long long>(count.numberAsUInt64().value_or(0)));
+    return 0;
+}
+
 int printExtensions(const Options& options, BXDaemonClient&, const Value& message) {
     if (options.json) {
         std::printf("%s\n", toJson(message).c_str());
@@ -421,6 +446,12 @@ int holdsCommand(const Options& options, Arguments&) {
     return roundTrip(
         options, "holds", [](BXDaemonClient& c, auto h) { c.listHoldsReply(h); },
         [&](BXDaemonClient& c, const Value& m) { return printHolds(options, c, m); });
+}
+
+int statusCommand(const Options& options, Arguments&) {
+    return roundTrip(
+        options, "status", [](BXDaemonClient& c, auto h) { c.statusReply(h); },
+        [&](BXDaemonClient& c, const Value& m) { return printStatus(options, c, m); });
 }
 
 // Writes everything to `fd`; false when the other end is gone.
@@ -633,6 +664,9 @@ const Subcommand kSubcommands[] = {
          c.add_flag("--clear", a.clear, "remove every exclusion");
      },
      exclusionsSubcommand},
+    {"status",
+     "what bxd is doing now: uptime, connections, plug-ins, cache, holds, requests served\n  example: bexil status",
+     [](CLI::App&, Arguments&) {}, statusCommand},
 };
 
 int run(int argc, char** argv) {

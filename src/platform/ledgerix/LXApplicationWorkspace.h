@@ -95,6 +95,8 @@ class LXApplicationWorkspace {
     // The record of the application bundle at the path, with its plug-ins, or none.
     virtual std::shared_ptr<const LXApplicationProxy> applicationProxyForBundleURL(std::string_view url) = 0;
 
+    // How many plug-ins are registered, without reading their records; none when unknown.
+    virtual std::optional<size_t> plugInCount() { return std::nullopt; }
     // Every registered plug-in in registration order; none when the store cannot be read.
     virtual std::optional<LXProxyList> installedPlugins() = 0;
     // The plug-ins that may match the query and that pass the filter, in registration order; none when the store

@@ -76,7 +76,7 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
     std::optional<Error> checkIntegrity();
     // The number of registered plug-ins; none when the store cannot be read.
-    std::optional<size_t> plugInCount();
+    std::optional<size_t> plugInCount() override;
 
     // Use open(); public only for make_shared.
     struct Private;
