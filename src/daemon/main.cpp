@@ -49,8 +49,8 @@ std::optional<size_t> countFromEnvironment(const char* name) {
     return static_cast<size_t>(value);
 }
 
-// The connection limits: the defaults, or $BX_MAX_CONNECTIONS, $BX_MAX_CONNECTIONS_PER_USER and
-// $BX_STALLED_CONNECTION_SECONDS, with the total held
+// The connection limits: the defaults, or $BX_MAX_CONNECTIONS, $BX_MAX_CONNECTIONS_PER_USER,
+// $BX_STALLED_CONNECTION_SECONDS and $BX_QUEUED_REPLY_BYTES, with the total held
 // below what the open-file limit allows once bxd has raised its soft limit to the hard one.
 bexil::ZemListener::Limits connectionLimits() {
     using bexil::log::ops;
@@ -69,6 +69,7 @@ bexil::ZemListener::Limits connectionLimits() {
     if (auto perUser = countFromEnvironment("BX_MAX_CONNECTIONS_PER_USER")) limits.maxConnectionsPerUser = *perUser;
     if (auto seconds = countFromEnvironment("BX_STALLED_CONNECTION_SECONDS"))
         limits.stalledConnectionTimeout = std::chrono::seconds(*seconds);
+    if (auto bytes = countFromEnvironment("BX_QUEUED_REPLY_BYTES")) limits.queuedReplyBytes = *bytes;
     const size_t openFiles = static_cast<size_t>(files.rlim_cur);
     const size_t affordable = openFiles > kDescriptorsKeptBack + kDescriptorsPerConnection
                                   ? (openFiles - kDescriptorsKeptBack) / kDescriptorsPerConnection

@@ -64,6 +64,7 @@ class ZemSocketListener final : public ZemListener, public std::enable_shared_fr
         limits.reservedForRoot = std::min(limits.reservedForRoot, limits.maxConnections / 4);
         limits_ = limits;
         ZemSocketConnection::setStalledConnectionTimeout(limits.stalledConnectionTimeout);
+        ZemSocketConnection::setReadPauseBytes(limits.queuedReplyBytes);
     }
     void setErrorHandler(ErrorHandler handler) override { errorHandler_ = std::move(handler); }
     void setTerminationHandler(std::function<void()> handler) override { terminationHandler_ = std::move(handler); }

@@ -34,6 +34,10 @@ class ZemListener {
     // How long a peer may keep a connection without a first complete frame, or with part of one, before it is
     // dropped (logged). A peer that has sent a frame may stay silent between frames for as long as it likes.
     static constexpr std::chrono::seconds kStalledConnectionTimeout{30};
+    // Replies queued towards a peer past which its further requests are not read until it reads some: a client
+    // that pipelines without reading is served as fast as it reads, and one that never reads is dropped once it
+    // has not read for the stall time.
+    static constexpr size_t kQueuedReplyBytes = 1024 * 1024;
 
     // The connection limits in force; the defaults are the constants above.
     struct Limits {
@@ -41,6 +45,7 @@ class ZemListener {
         size_t maxConnectionsPerUser = kMaxConnectionsPerUser;
         size_t reservedForRoot = kConnectionsReservedForRoot;
         std::chrono::seconds stalledConnectionTimeout = kStalledConnectionTimeout;
+        size_t queuedReplyBytes = kQueuedReplyBytes;
     };
 
     virtual ~ZemListener() = default;

@@ -32,6 +32,7 @@ namespace {
 asio::io_context& ioContextOf(const SerialQueue& queue) { return *detail::QueueInternals::state(queue)->core; }
 
 std::atomic<long> stalledTimeoutSeconds{ZemListener::kStalledConnectionTimeout.count()};
+std::atomic<size_t> readPauseBytes{ZemListener::kQueuedReplyBytes};
 
 }  // namespace
 
@@ -59,6 +60,8 @@ ZemSocketConnection::ZemSocketConnection(SerialQueue queue, std::string serviceN
 void ZemSocketConnection::setStalledConnectionTimeout(std::chrono::seconds timeout) {
     stalledTimeoutSeconds.store(timeout.count());
 }
+
+void ZemSocketConnection::setReadPauseBytes(size_t bytes) { readPauseBytes.store(bytes); }
 
 void ZemSocketConnection::watchStall() {
     if (side_ != Side::Peer || state_ != State::Open) return;
@@ -215,8 +218,14 @@ bool ZemSocketConnection::connectClient() {
 void ZemSocketConnection::readMore() {
     for (int turn = 0; turn < kReadsPerTurn; ++turn) {
         if (suspended_ || reading_ || state_ != State::Open) return;
-        if (side_ == Side::Peer && outgoing_.size() + writing_.size() >= kReadPauseBytes) {
+        if (side_ == Side::Peer &&
+            outgoing_.size() + writing_.size() >= readPauseBytes.load(std::memory_order_relaxed)) {
             // The peer does not read what it asked for: its next requests wait until it does.
+            if (!readPaused_)
+                log::ops().notice(
+                    "peer %d has %zu bytes of replies unread, over the limit (kQueuedReplyBytes): its "
+                    "requests wait until it reads",
+                    static_cast<int>(pid_), outgoing_.size() + writing_.size());
             readPaused_ = true;
             watchStall();
             return;
@@ -496,7 +505,9 @@ void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
 }
 
 void ZemSocketConnection::resumeReadingIfDrained() {
-    if (!readPaused_ || state_ != State::Open || outgoing_.size() + writing_.size() >= kReadPauseBytes) return;
+    if (!readPaused_ || state_ != State::Open ||
+        outgoing_.size() + writing_.size() >= readPauseBytes.load(std::memory_order_relaxed))
+        return;
     readPaused_ = false;
     watchStall();
     readMore();

@@ -28,10 +28,6 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // Bytes of replies and messages queued towards one peer that has not read them yet; past this the peer is
     // taken to have stopped reading and is disconnected.
     static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
-    // Replies queued towards a peer past which its further requests are not read until it reads some: a client
-    // that pipelines without reading is served as fast as it reads, and one that never reads is dropped once it
-    // has been paused for the stall time.
-    static constexpr size_t kReadPauseBytes = 1024 * 1024;
     // Size of one read from the socket.
     static constexpr size_t kReadChunkBytes = 64 * 1024;
     // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
@@ -41,6 +37,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     static constexpr size_t kMaxPendingDescriptors = 16;
     // Overrides ZemListener::kStalledConnectionTimeout for connections accepted from now on.
     static void setStalledConnectionTimeout(std::chrono::seconds timeout);
+    // Overrides ZemListener::kQueuedReplyBytes, the replies queued towards a peer past which its requests are left
+    // unread, for every connection from now on.
+    static void setReadPauseBytes(size_t bytes);
 
     enum class Side { Peer, Client };
 
