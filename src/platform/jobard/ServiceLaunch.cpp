@@ -14,11 +14,9 @@
 #include <asio.hpp>
 #include <cerrno>
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <memory>
 #include <optional>
 
@@ -78,16 +76,10 @@ std::optional<pid_t> sandboxStarted(int statusFd) {
     return static_cast<pid_t>(*first);
 }
 
-// The parent pid of `pid`, from /proc/<pid>/stat; -1 when it cannot be read.
+// The parent pid of `pid`; -1 when it cannot be read.
 pid_t parentOf(pid_t pid) {
-    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-    std::string stat((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    size_t name = stat.rfind(')');
-    if (name == std::string::npos) return -1;
-    char state;
-    int parent = -1;
-    if (sscanf(stat.c_str() + name + 1, " %c %d", &state, &parent) != 2) return -1;
-    return parent;
+    std::optional<unsigned long long> parent = InstanceRecords::statField(pid, 4);
+    return parent ? static_cast<pid_t>(*parent) : -1;
 }
 
 // A pidfd of the sandbox's first process, the child `first` of bubblewrap's process `outer`. bubblewrap names it

@@ -18,7 +18,9 @@ std::string_view InstanceRecords::folderOf(Kind kind) { return kind == Kind::Run
 
 InstanceRecords::InstanceRecords(Kind kind, fs::path runtimeDir) : directory_(runtimeDir / folderOf(kind)) {}
 
-std::optional<unsigned long long> InstanceRecords::startTime(pid_t pid) {
+std::optional<unsigned long long> InstanceRecords::startTime(pid_t pid) { return statField(pid, 22); }
+
+std::optional<unsigned long long> InstanceRecords::statField(pid_t pid, int index) {
     std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
     std::string stat;
     if (!std::getline(in, stat)) return std::nullopt;
@@ -27,8 +29,8 @@ std::optional<unsigned long long> InstanceRecords::startTime(pid_t pid) {
     if (close == std::string::npos) return std::nullopt;
     std::istringstream fields(stat.substr(close + 2));
     std::string field;
-    for (int index = 3; fields >> field; ++index) {
-        if (index == 22) return std::strtoull(field.c_str(), nullptr, 10);
+    for (int at = 3; fields >> field; ++at) {
+        if (at == index) return std::strtoull(field.c_str(), nullptr, 10);
     }
     return std::nullopt;
 }

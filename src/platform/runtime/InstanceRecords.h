@@ -43,6 +43,9 @@ class InstanceRecords {
 
     // The start time of a process, or none when it does not exist.
     static std::optional<unsigned long long> startTime(pid_t pid);
+    // Field `index` (3 or more, numbered as proc(5) numbers them: 4 is the parent pid, 22 the start time) of
+    // /proc/<pid>/stat as a number; none when the process or the field is not there.
+    static std::optional<unsigned long long> statField(pid_t pid, int index);
 
     const std::filesystem::path& directory() const { return directory_; }
 
