@@ -143,6 +143,10 @@ int main(int argc, char** argv) {
         "(%zu per user, %zu kept for root)",
         serviceName, cacheLimit, databasePath ? databasePath : "(default)", verbose, limits.maxConnections,
         limits.maxConnectionsPerUser, limits.reservedForRoot);
+    // Plug-ins run no longer than the daemon that started them: their hosts reach them through sockets bxd handed
+    // out, and the instance records that termination and holds rely on are bxd's own.
+    server->serviceManager().endSandboxedInstances("left running by an earlier bxd");
     server->run();
+    server->serviceManager().endSandboxedInstances("as bxd stops");
     return 0;
 }

@@ -128,6 +128,29 @@ TEST_F(TerminationTest, StaleRecordsNeverSignalAnotherProcess) {
     EXPECT_FALSE(fs::exists(stale));
 }
 
+// Guards the sweep of sandboxes that a daemon leaves: a recorded sandbox and its outer process are ended, a record
+// whose pids now name other processes (here this test's own) signals nothing, and a record that another runtime
+// keeps without a sandbox line is not bxd's to end.
+TEST_F(TerminationTest, LeftSandboxesAreEndedAndNothingElseIs) {
+    log::CaptureSink capture;
+    pid_t outer = startSleeper(), first = startSleeper(), foreign = startSleeper();
+    SleeperGuard guard{outer, first, foreign};
+    ASSERT_TRUE(instances().record("com.example.greeter.hello", outer, first));
+    ASSERT_TRUE(instances().record("com.example.greeter.bonjour", foreign));
+    fs::path stale = root_ / "runtime" / "instances" / "com.example.greeter.stale" / std::to_string(getpid());
+    fs::create_directories(stale.parent_path());
+    std::ofstream(stale) << "1\nsandbox " << getpid() << " 1\n";
+
+    EXPECT_EQ(ServiceManager(instances()).endSandboxedInstances("in a test"), 1u);
+    EXPECT_TRUE(reapWithin(outer, std::chrono::seconds(2)));
+    EXPECT_TRUE(reapWithin(first, std::chrono::seconds(2)));
+    EXPECT_TRUE(
+        capture.contains("ending plug-in com.example.greeter.hello instance " + std::to_string(outer) + " in a test"));
+    EXPECT_FALSE(fs::exists(stale));
+    EXPECT_EQ(instances().live("com.example.greeter.bonjour").size(), 1u);
+    EXPECT_EQ(waitpid(foreign, nullptr, WNOHANG), 0) << "a record without a sandbox line was ended";
+}
+
 // The busy check's platform service: only live asserted instances count, and a name cannot reach outside the
 // records' directory.
 TEST(ProcessAssertions, OnlyLiveAssertedInstancesAreBusy) {

@@ -34,7 +34,13 @@ class BxdProcess {
         chmod(entitlementsDir().c_str(), 0755);
     }
     ~BxdProcess() {
-        if (running()) stop(SIGKILL);
+        // Stopped as a service manager stops it, so that it ends what it started (a daemon killed in the middle of
+        // a launch can leave a sandbox behind that only its next start would end); killed if it does not stop.
+        if (running()) {
+            kill(pid_, SIGTERM);
+            for (int i = 0; i < 500 && running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+            if (running()) stop(SIGKILL);
+        }
         std::error_code ignored;
         std::filesystem::remove_all(root_, ignored);
     }

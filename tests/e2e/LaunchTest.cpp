@@ -217,6 +217,50 @@ TEST_F(LaunchTest, EndingAnInstanceEndsItsWholeSandbox) {
     if (running()) kill(first, SIGKILL);
 }
 
+// Guards what outlives a daemon: bxd ends the sandboxes it started when it stops, and when it is killed instead, the
+// next bxd of the same runtime directory ends what it left (a sandbox that was named but never released waits
+// forever otherwise). The stand-in for bubblewrap, like one whose daemon has gone, never releases its first process
+// and does not die with bxd.
+TEST_F(LaunchTest, SandboxesDoNotOutliveTheDaemonThatStartedThem) {
+    startAndAddWithStandIn("stalling-bwrap",
+                           "sleep 600 &\n"
+                           "echo $! > \"$0.first\"\n"
+                           "echo \"{ \\\"child-pid\\\": $! }\" >&4\n"
+                           "wait\n");
+    // Pinned before the daemon goes, so that their pids cannot be reused while they are looked at.
+    auto launchPinned = [&] {
+        TestClient host;
+        EXPECT_EQ(errorCode(ready(host, {hello()})), 0);
+        auto [reply, channel] = launch(host, hello());
+        EXPECT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+        const pid_t outer = static_cast<pid_t>(reply.get("pid").numberAsUInt64().value_or(0));
+        const pid_t first = std::stoi(slurp((bxd_.root() / "stalling-bwrap.first").string()));
+        return std::pair(UniqueFd(pidfdOpen(outer)), UniqueFd(pidfdOpen(first)));
+    };
+    auto endsSoon = [](const UniqueFd& process) { return process && pidfdExited(process.get(), 5000); };
+
+    auto [killedOuter, killedFirst] = launchPinned();
+    ASSERT_TRUE(killedOuter && killedFirst);
+    bxd_.stop(SIGKILL);
+    EXPECT_FALSE(pidfdExited(killedFirst.get(), 200)) << "the stand-in's sandbox must outlive a killed daemon";
+    setenv("BX_BWRAP", (bxd_.root() / "stalling-bwrap").c_str(), 1);
+    const bool restarted = start();
+    unsetenv("BX_BWRAP");
+    ASSERT_TRUE(restarted) << bxd_.log();
+    EXPECT_TRUE(endsSoon(killedFirst)) << "the next daemon left the sandbox running\n" << bxd_.log();
+    EXPECT_TRUE(endsSoon(killedOuter));
+    EXPECT_EQ(bxd_.countInLog("left running by an earlier bxd"), 1u) << bxd_.log();
+
+    auto [stoppedOuter, stoppedFirst] = launchPinned();
+    ASSERT_TRUE(stoppedOuter && stoppedFirst);
+    EXPECT_EQ(WEXITSTATUS(bxd_.stop(SIGTERM)), 0);
+    EXPECT_TRUE(endsSoon(stoppedFirst)) << "a stopped daemon left its sandbox running\n" << bxd_.log();
+    EXPECT_TRUE(endsSoon(stoppedOuter));
+    EXPECT_TRUE(fs::is_empty(bxd_.root() / "runtime/instances/com.example.greeter.hello")) << "records stay behind";
+    for (const UniqueFd* process : {&killedOuter, &killedFirst, &stoppedOuter, &stoppedFirst})
+        if (*process) pidfdSendSignal(process->get(), SIGKILL);
+}
+
 // Guards the daemon's one thread against the end of an instance: bxd learns of it from the instance's pidfd, which
 // can report an end that waitpid cannot collect yet (here: a process that another process traces is reaped by its
 // parent only after its tracer has seen it end; the event loop can also report a pidfd early). bxd must answer other

@@ -19,6 +19,7 @@
 #include <filesystem>
 #include <memory>
 #include <optional>
+#include <utility>
 
 #include "base/EventLoopAsio.h"
 #include "base/Format.h"
@@ -280,7 +281,8 @@ Result<ServiceManager::LaunchedService> ServiceManager::startService(const Servi
     }
     UniqueFd firstProcess = pinSandbox(pid, *first);
     // An instance that termination and the busy check could not see must not run.
-    if (!instances_.record(launch.bundleIdentifier, pid)) {
+    const std::optional<pid_t> sandboxFirst = firstProcess ? std::optional<pid_t>(*first) : std::nullopt;
+    if (!instances_.record(launch.bundleIdentifier, pid, sandboxFirst)) {
         kill(pid, SIGKILL);
         while (waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
         }
@@ -293,6 +295,28 @@ Result<ServiceManager::LaunchedService> ServiceManager::startService(const Servi
     log::ops().notice("launched plug-in %s as instance %d (user %u) in the %s sandbox", name.c_str(),
                       static_cast<int>(pid), static_cast<unsigned>(uid), std::string(profile->name).c_str());
     return LaunchedService{pid, std::move(hostEnd)};
+}
+
+size_t ServiceManager::endSandboxedInstances(const char* why) const {
+    size_t ended = 0;
+    for (const InstanceRecords::Sandboxed& left : instances_.sandboxed()) {
+        bool signalled = false;
+        for (auto [pid, started] :
+             {std::pair(left.instance.pid, left.instance.startTime), std::pair(left.sandbox, left.sandboxStartTime)}) {
+            // Pinned before it is checked, so that the pid cannot come to name another process in between.
+            UniqueFd pinned(pidfdOpen(pid));
+            if (pinned && InstanceRecords::startTime(pid) == started && pidfdSendSignal(pinned.get(), SIGKILL) == 0)
+                signalled = true;
+        }
+        if (signalled) {
+            log::ops().notice("ending plug-in %s instance %d %s", left.bundleIdentifier.c_str(),
+                              static_cast<int>(left.instance.pid), why);
+            ++ended;
+        }
+        std::error_code ignored;
+        fs::remove(left.instance.record, ignored);
+    }
+    return ended;
 }
 
 }  // namespace bexil

@@ -82,6 +82,12 @@ class ServiceManager {
     // the sandbox is set up (at most kSandboxSetupTimeout).
     Result<LaunchedService> startService(const ServiceLaunch& launch, SerialQueue& reaper) const;
 
+    // Ends every instance that bxd started in a sandbox and that is still on record, with its sandbox, and removes
+    // the records; `why` ends the log line of each ("as bxd stops", "left running by an earlier bxd"). bxd calls it
+    // when it stops, and when it starts for what a killed bxd could not end: a sandbox that bubblewrap had named
+    // but not yet released when its outer process died waits forever otherwise. Returns how many it ended.
+    size_t endSandboxedInstances(const char* why) const;
+
     const InstanceRecords& instances() const { return instances_; }
 
   private:

@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
@@ -41,7 +42,9 @@ static bool safeComponent(const std::string& name) {
            name.find('\0') == std::string::npos;
 }
 
-bool InstanceRecords::record(const std::string& bundleIdentifier, pid_t pid) const {
+static constexpr std::string_view kSandboxLine = "sandbox";
+
+bool InstanceRecords::record(const std::string& bundleIdentifier, pid_t pid, std::optional<pid_t> sandbox) const {
     if (!safeComponent(bundleIdentifier)) return false;
     std::optional<unsigned long long> started = startTime(pid);
     if (!started) return false;
@@ -49,7 +52,38 @@ bool InstanceRecords::record(const std::string& bundleIdentifier, pid_t pid) con
     fs::create_directories(directory_ / bundleIdentifier, ec);
     std::ofstream out(directory_ / bundleIdentifier / std::to_string(pid));
     out << *started << "\n";
+    if (sandbox) {
+        // A sandbox that has already gone needs no line; the instance record is still worth keeping.
+        if (std::optional<unsigned long long> sandboxStarted = startTime(*sandbox))
+            out << kSandboxLine << " " << *sandbox << " " << *sandboxStarted << "\n";
+    }
     return static_cast<bool>(out);
+}
+
+std::vector<InstanceRecords::Sandboxed> InstanceRecords::sandboxed() const {
+    std::vector<Sandboxed> found;
+    std::error_code ec;
+    for (const auto& bundle : fs::directory_iterator(directory_, ec)) {
+        const std::string bundleIdentifier = bundle.path().filename().string();
+        if (!safeComponent(bundleIdentifier) || !bundle.is_directory(ec)) continue;
+        std::error_code inner;
+        for (const auto& entry : fs::directory_iterator(bundle.path(), inner)) {
+            const std::string name = entry.path().filename().string();
+            char* end = nullptr;
+            long pid = std::strtol(name.c_str(), &end, 10);
+            if (name.empty() || *end != '\0' || pid <= 0 || pid > INT32_MAX) continue;
+            std::ifstream in(entry.path());
+            unsigned long long started = 0, sandboxStarted = 0;
+            long sandbox = 0;
+            std::string word;
+            if (!(in >> started >> word >> sandbox >> sandboxStarted) || word != kSandboxLine || sandbox <= 0 ||
+                sandbox > INT32_MAX)
+                continue;
+            found.push_back(Sandboxed{bundleIdentifier, Instance{static_cast<pid_t>(pid), entry.path(), started},
+                                      static_cast<pid_t>(sandbox), sandboxStarted});
+        }
+    }
+    return found;
 }
 
 std::vector<InstanceRecords::Instance> InstanceRecords::live(const std::string& bundleIdentifier) const {
