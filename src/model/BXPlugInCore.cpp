@@ -5,9 +5,12 @@
 
 #include "model/BXPlugInCore.h"
 
+#include <unordered_set>
+
 #include "bexil/Protocol.h"
 #include "model/BXUtilities.h"
 #include "platform/log/Log.h"
+#include "platform/sdks/ExtensionSDKRegistry.h"
 
 namespace bexil {
 
@@ -29,6 +32,8 @@ constexpr std::string_view kDedicated = "Dedicated";
 constexpr std::string_view kPassProxy = "PassProxy";
 constexpr std::string_view kRZExtensionPointIdentifier = "RZExtensionPointIdentifier";
 constexpr std::string_view kRZExtensionVersion = "RZExtensionVersion";
+constexpr std::string_view kShared = "Shared";
+constexpr std::string_view kCleanTimeout = "CleanTimeout";
 }  // namespace keys
 
 namespace form = protocol::form;
@@ -172,6 +177,78 @@ void BXPlugInCore::canonicalize() {
     MutableDictionary plugIn(current ? *current : Value::emptyDictionary());
     plugIn.set(keys::kRZExtensionAttributes, attrs.take());
     setPlugInDictionary(plugIn.take());
+}
+
+// ---- SDK resolution ----
+
+std::optional<Value> BXPlugInCore::readSDKDictionary(std::string_view name) {
+    std::optional<Value> entry = ExtensionSDKRegistry::shared()->copySDKEntry(name);
+    if (!entry) {
+        log::ops().notice("plug-in sdk \"%{public}@\" not registered", name);
+        return std::nullopt;
+    }
+    // The registry's entry is already a plain dictionary on this platform; anything else is not an SDK.
+    if (!entry->isDictionary()) return std::nullopt;
+    return entry;
+}
+
+void BXPlugInCore::resolveSDK() {
+    std::optional<Value> info = bundleInfoDictionary();
+    if (!info)
+        log::ops().fault("cannot resolve SDK without materialized Info.vrec (%{public}@ of %@)", "resolveSDK",
+                         description());
+    if (std::optional<Value> spec = sdkSpec()) {
+        if (!spec->isString()) {
+            log::ops().error("invalid SDK key:%{public}@", spec->description());
+            return;
+        }
+        std::optional<Value> sdk = readSDKDictionary(spec->stringView());
+        // The merged dictionary's "RZExtension" comes from the plug-in's own, so it is a dictionary whenever the
+        // plug-in's was; a false answer could only keep the plug-in dictionary as it was, which is what we want.
+        if (sdk && info) setDictionaries(mergeDictionaryInto(*sdk, *info));
+    }
+    canonicalize();
+}
+
+Value BXPlugInCore::mergeDictionaryInto(const Value& sdk, const Value& plugIn) const {
+    if (!sdk.isDictionary() || !plugIn.isDictionary()) return plugIn;
+    MutableDictionary result(plugIn);
+    for (const DictionaryEntry& entry : sdk.entries()) {
+        const Value* mine = result.find(entry.key);
+        if (mine == nullptr) {
+            result.set(entry.key, entry.value);
+        } else if (sdkOverridesKey(entry.key)) {
+            result.set(entry.key, entry.value);
+        } else if (entry.key == keys::kShared) {
+            Value merged = mergeSharedResourcesInto(entry.value, *mine);
+            result.set(entry.key, std::move(merged));
+        } else if (entry.value.isDictionary()) {
+            Value merged = mergeDictionaryInto(entry.value, *mine);
+            result.set(entry.key, std::move(merged));
+        }
+        // Otherwise the plug-in's value stays, arrays included.
+    }
+    return result.take();
+}
+
+bool BXPlugInCore::sdkOverridesKey(std::string_view key) const { return key == keys::kCleanTimeout; }
+
+Value BXPlugInCore::mergeSharedResourcesInto(const Value& sdk, const Value& plugIn) const {
+    auto listOf = [](const Value& v) -> std::optional<std::vector<Value>> {
+        if (v.isString()) return std::vector<Value>{v};
+        if (v.isArray()) return std::vector<Value>(v.items().begin(), v.items().end());
+        return std::nullopt;
+    };
+    std::optional<std::vector<Value>> theirs = listOf(sdk);
+    std::optional<std::vector<Value>> mine = listOf(plugIn);
+    if (!theirs || !mine) return plugIn;
+    std::unordered_set<Value, ValueHash> seen;
+    MutableArray result;
+    result.reserve(mine->size() + theirs->size());
+    for (const std::vector<Value>* list : {&*mine, &*theirs})
+        for (const Value& path : *list)
+            if (seen.insert(path).second) result.append(path);
+    return result.take();
 }
 
 // ---- Checks and annotations ----

@@ -64,6 +64,32 @@ class BXPlugInCore {
     // Rewrites the plug-in dictionary so that it holds an attributes dictionary with an "RZExtensionVersion".
     virtual void canonicalize();
 
+    // ---- SDK resolution ----
+    //
+    // Every plug-in names its extension point; the point's SDK dictionary supplies the defaults the plug-in does not
+    // state. Resolution is for records that hold their own information dictionary (built by a client from a bundle
+    // or a form) and runs while the record is being built, before it is shared; the daemon's records never run it.
+
+    // The SDK dictionary registered under `name` in the process's extension-SDK registry, or nothing (logged).
+    // Static, as the registry is the process's: a record that must look elsewhere replaces the registry instead.
+    static std::optional<Value> readSDKDictionary(std::string_view name);
+    // Merges the SDK named by sdkSpec under the information dictionary (which becomes the merged one, its
+    // "RZExtension" entry the plug-in dictionary), then canonicalizes. A record without an information dictionary
+    // is an internal fault: it is reported, nothing is merged, and it is still canonicalized. A name that is not
+    // a string is logged and leaves the record entirely unchanged.
+    virtual void resolveSDK();
+    // A new dictionary: `plugIn` with what `sdk` adds. Keys only on one side are kept; where both have a key the
+    // plug-in's value wins, except that sdkOverridesKey keys take the SDK's value, "Shared" takes the union, and two
+    // dictionaries merge by these rules at any depth. Where the SDK holds a dictionary and the plug-in something
+    // else, the plug-in's value is kept: the SDK cannot reshape what the plug-in wrote. Neither input changes.
+    virtual Value mergeDictionaryInto(const Value& sdk, const Value& plugIn) const;
+    // True for the keys whose SDK value replaces the plug-in's own: "CleanTimeout" alone.
+    virtual bool sdkOverridesKey(std::string_view key) const;
+    // The union of two shared-resource lists, each distinct path once: the plug-in's in its order, then the SDK's
+    // that it lacks. A single path string counts as a list of that path, since "Shared" may be written either way;
+    // when either side is neither, the plug-in's value is kept as it is.
+    virtual Value mergeSharedResourcesInto(const Value& sdk, const Value& plugIn) const;
+
     // ---- Form ----
 
     // The serialised form. Never fails today; callers check the result all the same. An entry whose record value is
