@@ -17,6 +17,8 @@ namespace bexil::tool {
 
 // Exit statuses of the tool besides 0 and the daemon's error codes (sysexits.h values).
 inline constexpr int kExitUsage = 64;        // bad arguments; nothing was sent
+inline constexpr int kExitDataError = 65;    // a document on disk (an SDK, a bundle's Info.vrec) cannot be used
+inline constexpr int kExitNoInput = 66;      // what was asked for is not there (an SDK that is not registered)
 inline constexpr int kExitUnavailable = 69;  // bxd is not running or the connection failed
 inline constexpr int kExitSoftware = 70;     // the daemon answered something the tool cannot read
 inline constexpr int kExitTimeout = 75;      // bxd did not answer in time

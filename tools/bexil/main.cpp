@@ -1,7 +1,8 @@
 // bexil: the command line of the plug-in registry. One subcommand per request of bxd, plus the global exclusions
 // preference. Every argument is checked before anything is sent; every wait for the daemon has a time limit.
-// Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 69 when bxd is not running,
-// 70 for a reply the tool cannot read, 75 when bxd did not answer in time.
+// Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 65 for a document on disk that
+// cannot be used, 66 for an SDK that is not registered, 69 when bxd is not running, 70 for a reply the tool cannot
+// read, 75 when bxd did not answer in time. `info` and `sdk` read the disk and never talk to bxd.
 
 #include <poll.h>
 #include <sys/socket.h>
@@ -17,11 +18,13 @@
 #include <vector>
 
 #include "JsonText.h"
+#include "PlugInInfo.h"
 #include "ToolArguments.h"
 #include "base/Document.h"
 #include "client/BXDaemonClient.h"
 #include "client/BXDaemonClientSync.h"
 #include "client/BXPlugInMatches.h"
+#include "model/BXBundle.h"
 #include "platform/log/Log.h"
 #include "platform/prefs/PreferencesStore.h"
 #include "platform/zem/ZemListener.h"
@@ -309,6 +312,7 @@ struct Arguments {
     int64_t election = -1;
     bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false, wait = false;
     std::vector<std::string> say;
+    std::string point;
 };
 
 using Printer = std::function<int(BXDaemonClient&, const Value&)>;
@@ -580,6 +584,76 @@ int exclusionsSubcommand(const Options& options, Arguments& arguments) {
     return exclusionsCommand(options, arguments.setFile, arguments.addRules, arguments.clear);
 }
 
+// ---- plug-in bundles and SDKs on disk ----
+
+// Prints the SDK dictionary registered for an extension point, with the document it came from.
+int sdkShowCommand(const Options& options, Arguments& arguments) {
+    auto sdk = findSDK(arguments.point);
+    if (!sdk) {
+        std::fprintf(stderr, "bexil: the SDK of %s cannot be used: %s\n", arguments.point.c_str(),
+                     sdk.error().localizedDescription().value_or("").c_str());
+        return kExitDataError;
+    }
+    if (!*sdk) {
+        std::fprintf(stderr, "bexil: no SDK is registered for extension point %s (searched %s)\n",
+                     arguments.point.c_str(), sdkDirectoriesText().c_str());
+        return kExitNoInput;
+    }
+    if (options.json) {
+        std::printf("%s\n", toJson((*sdk)->dictionary).c_str());
+        return 0;
+    }
+    std::printf("SDK of %s from %s:\n%s\n", arguments.point.c_str(), (*sdk)->path.c_str(),
+                toJson((*sdk)->dictionary).c_str());
+    return 0;
+}
+
+// Shows a plug-in bundle as a client sees it: its information dictionary with the SDK of its extension point merged
+// under it and its plug-in dictionary canonicalized, so that its author sees what the extension point gave it.
+int infoCommand(const Options& options, Arguments& arguments) {
+    auto record = resolvedPlugInAtPath(arguments.file);
+    if (!record) {
+        usageError(record.error().localizedDescription().value_or("cannot read the plug-in"));
+        return kExitDataError;
+    }
+    const Value plugIn = (*record)->plugInDictionary().value_or(Value::emptyDictionary());
+    MutableDictionary resolved((*record)->bundleInfoDictionary().value_or(Value::emptyDictionary()));
+    resolved.set("RZExtension", plugIn);
+    if (options.json) {
+        std::printf("%s\n", toJson(resolved.take()).c_str());
+        return 0;
+    }
+    std::optional<Value> point = (*record)->sdkSpec();
+    std::string sdkLine = "none named";
+    std::vector<std::string> added;
+    if (point && point->isString()) {
+        auto sdk = findSDK(point->stringView());
+        if (!sdk) {
+            sdkLine = "cannot be used: " + sdk.error().localizedDescription().value_or("");
+        } else if (!*sdk) {
+            sdkLine = "not registered";
+        } else {
+            sdkLine = (*sdk)->path.string();
+            std::optional<Value> own = BXBundle::initWithPath(*(*record)->path())->infoDictionary();
+            added =
+                keysAddedBySDK(own ? own->get("RZExtension") : Value::emptyDictionary(), plugIn, (*sdk)->dictionary);
+        }
+    }
+    std::string addedText;
+    for (const std::string& key : added) addedText += (addedText.empty() ? "" : ", ") + key;
+    std::optional<Value> version = (*record)->version();
+    std::printf("identifier:      %s\n", cell((*record)->identifier()).c_str());
+    std::printf("path:            %s\n", cell((*record)->path()).c_str());
+    std::printf("version:         %s\n", version && version->isString() ? version->getString()->c_str() : "-");
+    std::printf(
+        "extension point: %s\n",
+        point ? (point->isString() ? std::string(point->stringView()).c_str() : point->description().c_str()) : "-");
+    std::printf("SDK:             %s\n", sdkLine.c_str());
+    std::printf("from the SDK:    %s\n", addedText.empty() ? "-" : addedText.c_str());
+    std::printf("RZExtension after SDK resolution:\n%s\n", toJson(plugIn).c_str());
+    return 0;
+}
+
 void pathsArgument(CLI::App& command, Arguments& arguments) {
     command.add_option("paths", arguments.paths, "absolute paths of plug-in bundles")->required();
 }
@@ -667,6 +741,19 @@ const Subcommand kSubcommands[] = {
     {"status",
      "what bxd is doing now: uptime, connections, plug-ins, cache, holds, requests served\n  example: bexil status",
      [](CLI::App&, Arguments&) {}, statusCommand},
+    {"info",
+     "show a plug-in bundle on disk after SDK resolution: what its extension point gives it\n  example: bexil info "
+     "/opt/Greeter.app/PlugIns/Hello.bxplugin",
+     [](CLI::App& c, Arguments& a) { c.add_option("path", a.file, "the plug-in bundle's directory")->required(); },
+     infoCommand},
+    {"sdk", "show the SDK dictionary registered for an extension point\n  example: bexil sdk show com.example.greeting",
+     [](CLI::App& c, Arguments& a) {
+         c.require_subcommand(1);
+         c.add_subcommand("show", "print the SDK dictionary of an extension point")
+             ->add_option("point", a.point, "the extension point's name")
+             ->required();
+     },
+     sdkShowCommand},
 };
 
 int run(int argc, char** argv) {
@@ -675,7 +762,8 @@ int run(int argc, char** argv) {
         "bexil: talk to bxd, the plug-in registry daemon.\n"
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
-        "annotation); 64 bad arguments (nothing sent); 69 bxd not running; 70 unreadable reply; 75 no answer in time.",
+        "annotation); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
+        "69 bxd not running; 70 unreadable reply; 75 no answer in time.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();
