@@ -1,5 +1,6 @@
 // Feeds forms and information dictionaries built from random bytes to the plug-in record: reading a form, setting a
-// record up from names and dictionaries, then every derived property, the checks, canonical shape and the export.
+// record up from names and dictionaries, then every derived property, the checks, canonical shape and the export,
+// and resolving a record against an SDK made from the same bytes.
 // The bytes are decoded by a small generator that picks value kinds and draws dictionary keys mostly from the
 // record's own vocabulary, so that the inputs reach the code that reads those keys instead of missing every look-up.
 
@@ -12,6 +13,7 @@
 
 #include "FuzzByteReader.h"
 #include "model/BXPlugInCore.h"
+#include "platform/sdks/ExtensionSDKRegistry.h"
 
 namespace {
 
@@ -130,6 +132,40 @@ void exercise(BXPlugInCore& record) {
     (void)record.exportForm();
 }
 
+// Serves one SDK, drawn from the same bytes, for whatever name a record asks for.
+class OneSDK : public bexil::ExtensionSDKRegistry {
+  public:
+    explicit OneSDK(Value sdk) : sdk_(std::move(sdk)) {}
+    std::optional<Value> copySDKEntry(std::string_view) const override {
+        if (!sdk_.isDictionary()) return std::nullopt;
+        return sdk_;
+    }
+
+  private:
+    Value sdk_;
+};
+
+// Resolution against any SDK: a record whose SDK name is a string ends canonical, and a merge loses no key of
+// either side.
+void resolveAgainst(const Value& sdk, const Value& info) {
+    auto previous = bexil::ExtensionSDKRegistry::setShared(std::make_shared<OneSDK>(sdk));
+    if (auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid("com.example.fuzz", "/Apps/A.app/PlugIns/P.wexa",
+                                                                      info, std::nullopt, std::nullopt)) {
+        std::optional<Value> spec = record->sdkSpec();
+        record->resolveSDK();
+        if ((!spec || spec->isString()) && !record->version()) __builtin_trap();
+        exercise(*record);
+    }
+    if (sdk.isDictionary() && info.isDictionary()) {
+        BXPlugInCore merger;
+        Value merged = merger.mergeDictionaryInto(sdk, info);
+        for (const Value* side : {&sdk, &info})
+            for (const auto& entry : side->entries())
+                if (!merged.contains(entry.key)) __builtin_trap();
+    }
+    bexil::ExtensionSDKRegistry::setShared(previous);
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -155,5 +191,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (!(mode & 32)) bundleInfo = input;
     if (auto record = BXPlugInCore::initWithNameUrlBundleInfoInfoUuid(identifier, url, bundleInfo, info, uuid))
         exercise(*record);
+
+    if (mode & 64) resolveAgainst(value(in, 0), input);
     return 0;
 }
