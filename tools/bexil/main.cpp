@@ -624,7 +624,7 @@ int infoCommand(const Options& options, Arguments& arguments) {
         return 0;
     }
     std::optional<Value> point = (*record)->sdkSpec();
-    std::string sdkLine = "none named";
+    std::string sdkLine = !point ? "none named" : "none: the extension point's name is not a string";
     std::vector<std::string> added;
     if (point && point->isString()) {
         auto sdk = findSDK(point->stringView());

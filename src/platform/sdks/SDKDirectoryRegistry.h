@@ -3,8 +3,10 @@
 // SDKDirectoryRegistry finds SDK documents in directories: the SDK of extension point NAME is the structured
 // document NAME.vrec (docs/sdks.md). Directories are searched in precedence order and the first one holding the
 // file wins, so a file in /etc/bexil/sdks replaces the one of the same name in /usr/share/bexil/sdks. Nothing is
-// cached: every look-up reads the file as it is now (SDK resolution runs when a client builds a record from a
-// bundle, which is rare next to the cost of one small read). Immutable once made; any thread.
+// cached: every look-up reads the file as it is now, so a change is seen at once. SDKs are resolved when a client
+// builds a record from a bundle on disk, which reads that bundle's Info.vrec anyway; one more small document costs
+// about as much again (bench/sdk_resolution_bench), not enough to keep copies in step with the files.
+// Immutable once made; any thread.
 
 #include <cstddef>
 #include <filesystem>
