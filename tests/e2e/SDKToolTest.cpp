@@ -1,6 +1,6 @@
-// bexil info and bexil sdk show: what a plug-in author runs to see what an extension point gives a plug-in. They
-// read the disk only, so they answer with no bxd running. (The merge itself: BXPlugInSDK; the look-up rules:
-// SDKDirectoryRegistryTest.)
+// bexil info and bexil sdk show: what a plug-in author runs to see what an extension point gives a plug-in, here
+// the example plug-ins with the example SDKs. They read the disk only, so they answer with no bxd running. (The
+// merge itself: BXPlugInSDK; the look-up rules: SDKDirectoryRegistryTest.)
 
 #include <gtest/gtest.h>
 
@@ -32,7 +32,6 @@ TEST_F(SDKToolTest, SdkShowPrintsTheDocumentOrSaysWhyNot) {
     EXPECT_NE(shown.out.find("SDK of com.example.greeting from " + (sdks_ / "com.example.greeting.vrec").string()),
               std::string::npos)
         << shown.out;
-    EXPECT_NE(bexil("--json sdk show com.example.greeting").out.find("\"Formality\": \"casual\""), std::string::npos);
 
     const std::tuple<std::string, int, std::string> cases[] = {
         {"com.example.none", 66,
@@ -54,11 +53,9 @@ TEST_F(SDKToolTest, InfoShowsThePlugInAfterResolution) {
     const std::string bonjour = (kExamples / "Greeter.app/PlugIns/Bonjour.bxplugin").string();
     Outcome shown = bexil("info " + bonjour);
     EXPECT_EQ(shown.status, 0) << shown.err;
-    EXPECT_NE(shown.out.find("from the SDK:    CleanTimeout, RZExtensionAttributes.Formality\n"), std::string::npos)
-        << shown.out;
-    Outcome json = bexil("--json info " + bonjour);
-    EXPECT_NE(json.out.find("\"Language\": \"fr\""), std::string::npos) << json.out;
-    EXPECT_NE(json.out.find("\"Formality\": \"casual\""), std::string::npos) << json.out;
+    for (const char* text : {"from the SDK:    CleanTimeout, RZExtensionAttributes.Formality\n", "\"Language\": \"fr\"",
+                             "\"Formality\": \"casual\"", "\"CleanTimeout\": 10"})
+        EXPECT_NE(shown.out.find(text), std::string::npos) << text << "\n" << shown.out;
 
     Outcome app = bexil("info " + (kExamples / "Greeter.app").string());
     EXPECT_EQ(app.status, 65);

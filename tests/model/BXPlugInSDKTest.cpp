@@ -63,9 +63,6 @@ TEST_F(BXPlugInSDK, MergeRulesDecideTheWinnerByKindOfValue) {
     EXPECT_EQ(ext.get("CleanTimeout"), Value::int64(5));
     EXPECT_EQ(ext.get("Shared"), array({str("y"), str("z"), str("x")}));
     EXPECT_EQ(ext.get("RZExtensionAttributes"), dict({{"A", Value::int64(1)}, {"B", Value::int64(2)}}));
-    // Inputs are values: the plug-in's dictionary is what it was.
-    EXPECT_EQ(plugIn.get("Name"), str("mine"));
-    EXPECT_FALSE(plugIn.contains("OnlySDK"));
 }
 
 // "Shared" may be one path or a list; a union never repeats a path, and anything else keeps the plug-in's value.
@@ -74,22 +71,6 @@ TEST_F(BXPlugInSDK, SharedResourcesUniteWithoutDuplicates) {
               array({str("a"), str("b")}));
     EXPECT_EQ(merger_.mergeSharedResourcesInto(array({str("c")}), str("a")), array({str("a"), str("c")}));
     EXPECT_EQ(merger_.mergeSharedResourcesInto(array({str("c")}), Value::int64(3)), Value::int64(3));
-}
-
-// A resolved record has the SDK's defaults under its own values and is canonicalized.
-TEST_F(BXPlugInSDK, ResolveMergesTheRegisteredSDKAndCanonicalizes) {
-    registry_->sdks["com.quorvel.share-services"] =
-        dict({{"RZExtension", dict({{"RZExtensionProtocol", str("Other")},
-                                    {"RZExtensionHostEntitlement", str("com.example.host")},
-                                    {"RZExtensionAttributes", dict({{"Mode", str("copy")}})}})}});
-    auto record = makeRecord(kSharePath, shareInfo());
-    record->resolveSDK();
-    EXPECT_EQ(record->protocolSpec(), str("ShareProtocol"));
-    EXPECT_EQ(record->pluginKey("RZExtensionHostEntitlement"), str("com.example.host"));
-    EXPECT_EQ(record->attribute("Mode"), str("copy"));
-    EXPECT_EQ(record->version(), str("2.4"));
-    // The merged dictionary became the information dictionary too.
-    EXPECT_EQ(record->infoKey("RZExtension")->get("RZExtensionHostEntitlement"), str("com.example.host"));
 }
 
 // An unregistered SDK is logged by name and the record keeps its dictionaries but is still canonicalized; a name
