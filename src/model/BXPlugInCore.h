@@ -75,8 +75,9 @@ class BXPlugInCore {
     static std::optional<Value> readSDKDictionary(std::string_view name);
     // Merges the SDK named by sdkSpec under the information dictionary (which becomes the merged one, its
     // "RZExtension" entry the plug-in dictionary), then canonicalizes. A record without an information dictionary
-    // is an internal fault: it is reported, nothing is merged, and it is still canonicalized. A name that is not
-    // a string is logged and leaves the record entirely unchanged.
+    // is an internal fault, reported like the record's others (fault level on the ops channel, naming the operation
+    // and the record): nothing is merged, and it is still canonicalized. A name that is not a string is logged and
+    // leaves the record entirely unchanged.
     virtual void resolveSDK();
     // A new dictionary: `plugIn` with what `sdk` adds. Keys only on one side are kept; where both have a key the
     // plug-in's value wins, except that sdkOverridesKey keys take the SDK's value, "Shared" takes the union, and two
