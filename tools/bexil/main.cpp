@@ -645,9 +645,8 @@ int infoCommand(const Options& options, Arguments& arguments) {
     std::printf("identifier:      %s\n", cell((*record)->identifier()).c_str());
     std::printf("path:            %s\n", cell((*record)->path()).c_str());
     std::printf("version:         %s\n", version && version->isString() ? version->getString()->c_str() : "-");
-    std::printf(
-        "extension point: %s\n",
-        point ? (point->isString() ? std::string(point->stringView()).c_str() : point->description().c_str()) : "-");
+    std::string pointText = !point ? "-" : point->isString() ? std::string(point->stringView()) : point->description();
+    std::printf("extension point: %s\n", pointText.c_str());
     std::printf("SDK:             %s\n", sdkLine.c_str());
     std::printf("from the SDK:    %s\n", addedText.empty() ? "-" : addedText.c_str());
     std::printf("RZExtension after SDK resolution:\n%s\n", toJson(plugIn).c_str());
