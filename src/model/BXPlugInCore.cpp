@@ -324,6 +324,8 @@ std::optional<std::string> BXPlugInCore::containingPath() const { return contain
 
 std::optional<Value> BXPlugInCore::attributes() const { return pluginKey(keys::kRZExtensionAttributes); }
 
+std::optional<Error> BXPlugInCore::augmentInterface(BXInterface&) const { return std::nullopt; }
+
 std::optional<Value> BXPlugInCore::version() const { return attribute(keys::kRZExtensionVersion); }
 
 std::optional<Value> BXPlugInCore::protocolSpec() const {

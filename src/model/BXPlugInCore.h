@@ -23,6 +23,8 @@
 
 namespace bexil {
 
+class BXInterface;
+
 class BXPlugInCore {
   public:
     // `init`: an empty record with no property set. Set it up with one of the setup operations before sharing it.
@@ -121,6 +123,9 @@ class BXPlugInCore {
     virtual std::optional<Value> infoKey(std::string_view key) const;
     virtual std::optional<Value> pluginKey(std::string_view key) const;
     virtual std::optional<Value> attribute(std::string_view key) const;
+    // A hook for a kind of plug-in whose connections need more than its protocol and spec strings describe; it may
+    // refine `interface`. The record itself changes nothing and never fails.
+    virtual std::optional<Error> augmentInterface(BXInterface& interface) const;
 
     // ---- Derived properties ----
 
