@@ -4,6 +4,8 @@
 // `pkg-config --cflags --libs bexil`.
 
 #include "bexil/DaemonClient.h"
+#include "bexil/Interface.h"
+#include "bexil/TypedConnection.h"
 
 #define BEXIL_VERSION_MAJOR 0
 #define BEXIL_VERSION_MINOR 1
