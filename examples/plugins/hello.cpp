@@ -1,7 +1,10 @@
-// The Hello example plug-in: greets every line its host sends. bxd starts it in its sandbox with one end of a
-// socket to the host as descriptor BEXIL_PLUGIN_FD; the plug-in reads lines from it and answers each with one line,
-// until the host closes its end. It uses nothing but the C library, as a plug-in in any language could.
+// The Hello example plug-in. bxd starts it in its sandbox with one end of a socket to the host as descriptor
+// BEXIL_PLUGIN_FD. A host that binds the socket to Hello's protocol (GreetingProvider) calls "greet" with typed
+// messages, which Hello serves through the client library; a host that just writes text lines (`bexil launch
+// --say`) gets one line back for each. The first byte tells the two apart: a typed host's first frame starts with
+// the frame magic, a byte that never begins UTF-8 text.
 
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -9,7 +12,36 @@
 #include <cstdlib>
 #include <string>
 
+#include "GreetingProtocol.h"
+#include "bexil/TypedConnection.h"
+
 namespace {
+
+constexpr unsigned char kFrameMagic = 0xB7;
+
+std::string greetingFor(const std::string& name) {
+    const char* home = std::getenv("HOME");
+    return "Hello, " + name + "! (plug-in pid " + std::to_string(getpid()) + ", home " + (home ? home : "none") + ")";
+}
+
+int serveTyped(int host) {
+    if (!greeting::declareProtocol()) return 70;
+    auto connection = bexil::TypedConnection::bind(host, bexil::Value::string(greeting::kProtocol));
+    if (!connection) {
+        std::fprintf(stderr, "hello: %s\n", connection.error().description().c_str());
+        return 70;
+    }
+    // The connection has checked the call against the protocol: "greet" with one string.
+    auto greet = [](std::string_view, const bexil::Value& arguments) -> bexil::Result<bexil::Value> {
+        return bexil::Value::array({bexil::Value::string(greetingFor(std::string(arguments.items()[0].stringView()))),
+                                    bexil::Value::int64(getpid())});
+    };
+    if (auto broken = (*connection)->serve(greet)) {
+        std::fprintf(stderr, "hello: the host broke the connection: %s\n", broken->description().c_str());
+        return 1;
+    }
+    return 0;
+}
 
 bool writeAll(int fd, const std::string& text) {
     size_t done = 0;
@@ -31,7 +63,13 @@ int main() {
         return 64;
     }
     const int host = std::atoi(named);
-    const char* home = std::getenv("HOME");
+    unsigned char first = 0;
+    ssize_t peeked;
+    do {
+        peeked = recv(host, &first, 1, MSG_PEEK);
+    } while (peeked < 0 && errno == EINTR);
+    if (peeked <= 0) return 0;  // the host closed its end before saying anything
+    if (first == kFrameMagic) return serveTyped(host);
     std::string line;
     char buffer[4096];
     for (;;) {
@@ -43,9 +81,7 @@ int main() {
                 line += buffer[i];
                 continue;
             }
-            std::string answer = "Hello, " + line + "! (plug-in pid " + std::to_string(getpid()) + ", home " +
-                                 (home ? home : "none") + ")\n";
-            if (!writeAll(host, answer)) return 0;
+            if (!writeAll(host, greetingFor(line) + "\n")) return 0;
             line.clear();
         }
     }

@@ -13,8 +13,12 @@
 
 #include <sstream>
 
+#include "../../examples/plugins/GreetingProtocol.h"
 #include "E2eSupport.h"
 #include "base/Pidfd.h"
+#include "bexil/TypedConnection.h"
+#include "platform/zem/ZemFrame.h"
+#include "platform/zem/ZemFrameReader.h"
 
 namespace bexil {
 namespace {
@@ -133,6 +137,54 @@ TEST_F(LaunchTest, AHostTalksToTheLaunchedPlugInWhichIsRecordedUntilItEnds) {
     channel.reset();
     expectLog("plug-in com.example.greeter.hello instance " + std::to_string(pid) + " ended (exit status 0)");
     EXPECT_FALSE(fs::exists(instanceRecord("com.example.greeter.hello", pid)));
+}
+
+// The typed path: the host binds the socket to the protocol that Hello's bundle names and greets with typed calls.
+// An ill-typed call stays on the host's side; one written by hand reaches Hello, which refuses it and keeps serving.
+TEST_F(LaunchTest, AHostAndTheLaunchedPlugInExchangeTypedMessages) {
+    startAndAdd();
+    TestClient host;
+    ASSERT_EQ(errorCode(ready(host, {hello()})), 0) << bxd_.log();
+    auto [reply, channel] = launch(host, hello());
+    ASSERT_EQ(errorCode(reply), 0) << errorText(reply) << "\n" << bxd_.log();
+    ASSERT_TRUE(channel);
+    const uint64_t pid = reply.get("pid").numberAsUInt64().value_or(0);
+    Value spec = reply.get("bundleInfo").get("RZExtension").get("RZExtensionProtocol");
+    ASSERT_EQ(spec, Value::string("GreetingProvider"));
+    ASSERT_TRUE(greeting::declareProtocol());
+    UniqueFd byHand(dup(channel.get()));
+    auto connection = TypedConnection::bind(channel.release(), spec);
+    ASSERT_TRUE(connection.ok()) << connection.error().description();
+
+    auto greeted = (*connection)->call("greet", Value::array({Value::string("typed world")}));
+    ASSERT_TRUE(greeted.ok()) << greeted.error().description() << "\n" << bxd_.log();
+    EXPECT_EQ(greeted->items()[0].stringView().rfind("Hello, typed world! (plug-in pid ", 0), 0u);
+    EXPECT_GT(greeted->items()[1].numberAsInt64().value_or(0), 0);
+    EXPECT_FALSE((*connection)->call("greet", Value::array({Value::int64(1)})).ok());
+
+    std::vector<uint8_t> frame;
+    ASSERT_FALSE(ZemFrame::encode(
+        ZemFrameKind::Request, 99, 0,
+        Value::dictionary({{"selector", Value::string("greet")}, {"arguments", Value::array({Value::int64(1)})}}),
+        frame));
+    ASSERT_EQ(write(byHand.get(), frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+    ZemFrameReader reader;
+    std::optional<ZemFrame> refusal;
+    uint8_t buffer[4096];
+    for (pollfd ready{byHand.get(), POLLIN, 0}; !refusal && poll(&ready, 1, 10000) == 1;) {
+        ssize_t n = read(byHand.get(), buffer, sizeof buffer);
+        if (n <= 0) break;
+        reader.feed(std::span<const uint8_t>(buffer, static_cast<size_t>(n)));
+        refusal = reader.next();
+    }
+    ASSERT_TRUE(refusal) << bxd_.log();
+    EXPECT_EQ(refusal->inReplyTo(), 99u);
+    EXPECT_EQ(refusal->decodePayload()->get("errorcode"), Value::uint64(4));
+    EXPECT_TRUE((*connection)->call("greet", Value::array({Value::string("again")})).ok());
+
+    byHand.reset();
+    connection->reset();
+    expectLog("plug-in com.example.greeter.hello instance " + std::to_string(pid) + " ended (exit status 0)");
 }
 
 // Guards the refusals, none of which starts a process: a plug-in this host never made ready, a held plug-in, an
