@@ -67,11 +67,14 @@ struct TypedConnection::Impl {
                 if (left.count() <= 0) return connectionError("no answer in time");
                 wait = static_cast<int>(std::min<int64_t>(left.count(), INT32_MAX));
             }
-            pollfd ready{socket, POLLIN, 0};
-            int polled = ::poll(&ready, 1, wait);
-            if (polled < 0 && errno == EINTR) continue;
-            if (polled < 0) return connectionError(formatPrintf("poll: %s", std::strerror(errno)));
-            if (polled == 0) continue;
+            // Waiting for ever needs no poll: the blocking read is the wait, one system call instead of two.
+            if (wait >= 0) {
+                pollfd ready{socket, POLLIN, 0};
+                int polled = ::poll(&ready, 1, wait);
+                if (polled < 0 && errno == EINTR) continue;
+                if (polled < 0) return connectionError(formatPrintf("poll: %s", std::strerror(errno)));
+                if (polled == 0) continue;
+            }
             uint8_t buffer[64 * 1024];
             ssize_t n = ::read(socket, buffer, sizeof buffer);
             if (n < 0 && errno == EINTR) continue;
