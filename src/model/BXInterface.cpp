@@ -318,7 +318,9 @@ std::optional<Error> BXInterface::checkArgumentsAtDepth(std::string_view selecto
     for (size_t index = 0; index < *count; ++index) {
         const Value& argument = arguments.items()[index];
         const Slot* described = slot(selector, index, direction);
-        if (!described) continue;  // declared without a type: only a refinement could have taken one away
+        // Every declared argument is described (a protocol cannot declare one without a type); were one not, nothing
+        // would restrict it.
+        if (!described) continue;
         if (described->nested) {
             const Value& nestedSelector = argument.get(kSelectorKey);
             if (!argument.isDictionary() || !nestedSelector.isString() || depth >= kMaxNestedDepth)
