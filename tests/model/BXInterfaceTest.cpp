@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <thread>
 
 #include "bexil/Interface.h"
 #include "platform/log/CaptureSink.h"
@@ -118,6 +119,17 @@ TEST(CompoundProtocol, NamesMembersInOrderAndRegistersOnce) {
     Error untouched = BXError(1, "untouched");
     EXPECT_EQ(compoundProtocol(Value::int64(3), &untouched), nullptr);
     EXPECT_EQ(untouched.code(), 1);
+}
+
+// Threads that make the same compound at once all get the one protocol the registry kept.
+TEST(CompoundProtocol, ConcurrentMakersShareOneProtocol) {
+    ASSERT_TRUE(makeProtocol("RaceA") && makeProtocol("RaceB"));
+    Value members = Value::array({Value::string("RaceA"), Value::string("RaceB")});
+    std::vector<std::shared_ptr<const BXProtocol>> made(8);
+    std::vector<std::thread> threads;
+    for (auto& slot : made) threads.emplace_back([&slot, &members] { slot = compoundProtocol(members); });
+    for (auto& thread : threads) thread.join();
+    for (const auto& protocol : made) EXPECT_EQ(protocol, BXProtocolRegistry::shared().lookup(made[0]->name()));
 }
 
 TEST(CompoundProtocol, UnknownMemberYieldsNothingAndRegistersNothing) {
