@@ -53,17 +53,18 @@ struct TypedConnection::Impl {
         return std::nullopt;
     }
 
-    // The next frame, waiting at most `timeout` (negative: for ever). None with no error: the peer closed its end.
-    Result<std::optional<ZemFrame>> nextFrame(std::chrono::milliseconds timeout) {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
+    using Deadline = std::optional<std::chrono::steady_clock::time_point>;
+
+    // The next frame, waiting until `deadline` (none: for ever). None with no error: the peer closed its end.
+    Result<std::optional<ZemFrame>> nextFrame(Deadline deadline) {
         for (;;) {
             if (auto frame = reader.next()) return std::optional<ZemFrame>(std::move(*frame));
             if (reader.error()) return *reader.error();
             if (ended) return std::optional<ZemFrame>();
             int wait = -1;
-            if (timeout.count() >= 0) {
+            if (deadline) {
                 auto left =
-                    std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+                    std::chrono::duration_cast<std::chrono::milliseconds>(*deadline - std::chrono::steady_clock::now());
                 if (left.count() <= 0) return connectionError("no answer in time");
                 wait = static_cast<int>(std::min<int64_t>(left.count(), INT32_MAX));
             }
@@ -127,11 +128,13 @@ Result<Value> TypedConnection::call(std::string_view selector, const Value& argu
     if (auto refused = impl_->interface->checkArguments(selector, MessageDirection::Request, arguments))
         return *refused;
     if (impl_->ended) return connectionError("the connection has ended");
+    // One time limit for the whole call, so that a peer sending other frames cannot keep it waiting.
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
     const uint64_t serial = impl_->nextSerial++;
     if (auto error = impl_->sendFrame(ZemFrameKind::Request, serial, 0, typed::callMessage(selector, arguments)))
         return *error;
     for (;;) {
-        auto frame = impl_->nextFrame(timeout);
+        auto frame = impl_->nextFrame(deadline);
         if (!frame) return frame.error();
         if (!*frame) return connectionError("the peer closed the connection without answering");
         const ZemFrame& got = **frame;
@@ -147,7 +150,7 @@ Result<Value> TypedConnection::call(std::string_view selector, const Value& argu
 std::optional<Error> TypedConnection::serve(const Handler& handler) {
     std::lock_guard lock(impl_->mutex);
     for (;;) {
-        auto frame = impl_->nextFrame(std::chrono::milliseconds(-1));
+        auto frame = impl_->nextFrame(std::nullopt);
         if (!frame) return frame.error();
         if (!*frame) return std::nullopt;
         const ZemFrame& got = **frame;

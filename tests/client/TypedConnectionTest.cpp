@@ -8,6 +8,8 @@
 #include <unistd.h>
 
 #include <array>
+#include <atomic>
+#include <chrono>
 #include <thread>
 
 #include "bexil/TypedConnection.h"
@@ -155,6 +157,31 @@ TEST_F(TypedConnectionTest, IllTypedAndUnreadableMessagesGetErrorRepliesAndServi
     serving_.join();
     ASSERT_TRUE(served_);
     EXPECT_EQ(served_->domain(), "Zem");
+}
+
+// A peer that chatters instead of answering cannot stretch a call beyond its time limit.
+TEST(TypedConnectionTimeLimit, StrayFramesDoNotExtendTheWait) {
+    static Protocols protocols;
+    std::array<int, 2> ends{};
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends.data()), 0);
+    std::atomic<bool> done = false;
+    std::thread chatter([&] {
+        std::vector<uint8_t> frame;
+        ZemFrame::encode(ZemFrameKind::Message, 0, 0, Value::emptyDictionary(), frame);
+        // Chatters for 2.5 s at most, so that a call that waits as long as frames come fails instead of hanging.
+        for (int i = 0; i < 125 && !done && write(ends[1], frame.data(), frame.size()) > 0; ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    });
+    TypedConnection host(ends[0], BXInterface::interfaceWithProtocol(protocolNamed("TypedEcho")));
+    const auto start = std::chrono::steady_clock::now();
+    auto answer = host.call("echo", Value::array({Value::string("anyone?")}), std::chrono::milliseconds(200));
+    const auto waited = std::chrono::steady_clock::now() - start;
+    done = true;
+    chatter.join();
+    close(ends[1]);
+    ASSERT_FALSE(answer.ok());
+    EXPECT_EQ(answer.error().localizedDescription(), "no answer in time");
+    EXPECT_LT(waited, std::chrono::seconds(2));
 }
 
 }  // namespace
