@@ -68,8 +68,9 @@ int main() {
     do {
         peeked = recv(host, &first, 1, MSG_PEEK);
     } while (peeked < 0 && errno == EINTR);
-    if (peeked <= 0) return 0;  // the host closed its end before saying anything
-    if (first == kFrameMagic) return serveTyped(host);
+    if (peeked == 0) return 0;  // the host closed its end before saying anything
+    // A descriptor that cannot be peeked at (not a socket) is read as lines; the reads report any real failure.
+    if (peeked > 0 && first == kFrameMagic) return serveTyped(host);
     std::string line;
     char buffer[4096];
     for (;;) {
