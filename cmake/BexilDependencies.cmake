@@ -1,7 +1,9 @@
 # Every dependency is a Debian package installed by scripts/bootstrap; nothing is downloaded here.
 find_package(PkgConfig REQUIRED)
 find_package(Threads REQUIRED)
-find_package(GTest REQUIRED)
+if(BUILD_TESTING)
+    find_package(GTest REQUIRED)
+endif()
 find_package(fmt REQUIRED)
 find_package(pugixml REQUIRED)
 # The application registry's store; only src/platform/ledgerix includes it.
