@@ -1,7 +1,7 @@
 // Cost of resolving a plug-in's SDK as a client does when it builds a record from a bundle: set up the record from
 // its information dictionary, merge its extension point's SDK under it and canonicalize. The reference in the same
 // run is set-up plus canonicalize alone (what a plug-in without an SDK pays); the SDK comes once from a document on
-// disk through the real registry (read and parsed at every look-up, as the registry keeps no cache) and once from
+// disk through the real registry (opened at every look-up, parsed again only when the file changed) and once from
 // memory, which is the merge alone. Run it as
 //   build/release/bench/sdk_resolution_bench --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
 // and read the medians.

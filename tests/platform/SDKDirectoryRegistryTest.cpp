@@ -89,5 +89,22 @@ TEST_F(SDKDirectoryRegistryTest, SymbolicLinksMustStayInsideTheirDirectory) {
     EXPECT_TRUE(from(registry_.readSDKEntry("com.example.dangling")).find("leads nowhere") != std::string::npos);
 }
 
+// Guards the kept documents: a file edited in place (same size, so only its times tell), replaced by another file,
+// broken or removed is seen at the next look-up, never answered from what was read before.
+TEST_F(SDKDirectoryRegistryTest, EveryChangeToADocumentIsSeenAtTheNextLookUp) {
+    writeSDK(usr_, "com.example.a", "one");
+    EXPECT_EQ(from(registry_.readSDKEntry("com.example.a")), "one");
+    EXPECT_EQ(from(registry_.readSDKEntry("com.example.a")), "one");
+    writeSDK(usr_, "com.example.a", "two");
+    EXPECT_EQ(from(registry_.readSDKEntry("com.example.a")), "two");
+    writeSDK(root_, "replacement", "new");
+    fs::rename(root_ / "replacement.vrec", usr_ / "com.example.a.vrec");
+    EXPECT_EQ(from(registry_.readSDKEntry("com.example.a")), "new");
+    writeText(usr_ / "com.example.a.vrec", "<vrec><dict><key>x</key>");
+    EXPECT_NE(from(registry_.readSDKEntry("com.example.a")).find("is malformed"), std::string::npos);
+    fs::remove(usr_ / "com.example.a.vrec");
+    EXPECT_EQ(from(registry_.readSDKEntry("com.example.a")), "none");
+}
+
 }  // namespace
 }  // namespace bexil

@@ -48,9 +48,7 @@ std::optional<std::string> realPath(const fs::path& path) {
 }
 
 // Reads at most kMaxSDKDocumentBytes + 1 bytes, so that a file that grows while it is read is still caught.
-Result<Value> readDocument(int fd, const fs::path& file) {
-    struct stat st {};
-    if (::fstat(fd, &st) != 0) return posixError(errno, "cannot stat " + file.string());
+Result<Value> readDocument(int fd, const struct stat& st, const fs::path& file) {
     if (!S_ISREG(st.st_mode)) return sdkError(file.string() + " is not a regular file");
     constexpr size_t kLimit = SDKDirectoryRegistry::kMaxSDKDocumentBytes;
     if (static_cast<uint64_t>(st.st_size) > kLimit) {
@@ -119,11 +117,42 @@ Result<std::optional<Value>> SDKDirectoryRegistry::readSDKEntry(std::string_view
         // O_NOFOLLOW: a file swapped for a link after the check above is refused rather than followed.
         UniqueFd fd(::open(target.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
         if (!fd) return posixError(errno, "cannot open " + file.string());
-        Result<Value> document = readDocument(fd.get(), file);
+        struct stat opened {};
+        if (::fstat(fd.get(), &opened) != 0) return posixError(errno, "cannot stat " + file.string());
+        Result<Value> document = documentOf(fd.get(), opened, file);
         if (!document) return document.error();
         return std::optional<Value>(*document);
     }
     return std::optional<Value>();
+}
+
+static bool sameTime(const timespec& a, const timespec& b) { return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec; }
+
+Result<Value> SDKDirectoryRegistry::documentOf(int fd, const struct stat& st, const fs::path& file) const {
+    const std::string key = file.string();
+    {
+        std::lock_guard<std::mutex> guard(keptMutex_);
+        auto found = kept_.find(key);
+        if (found != kept_.end()) {
+            const Kept& k = found->second;
+            if (k.device == st.st_dev && k.inode == st.st_ino && k.size == st.st_size &&
+                sameTime(k.modified, st.st_mtim) && sameTime(k.changed, st.st_ctim))
+                return k.document;
+        }
+    }
+    // Parsed outside the lock: another thread's look-up of another SDK need not wait for this one.
+    Result<Value> document = readDocument(fd, st, file);
+    std::lock_guard<std::mutex> guard(keptMutex_);
+    if (!document) {
+        kept_.erase(key);
+        return document;
+    }
+    if (kept_.size() >= kMaxCachedDocuments && !kept_.contains(key)) {
+        log::ops().notice("sdk documents kept reached %zu; dropping them all and reading afresh", kMaxCachedDocuments);
+        kept_.clear();
+    }
+    kept_.insert_or_assign(key, Kept{st.st_dev, st.st_ino, st.st_size, st.st_mtim, st.st_ctim, *document});
+    return document;
 }
 
 std::optional<Value> SDKDirectoryRegistry::copySDKEntry(std::string_view name) const {

@@ -2,16 +2,20 @@
 
 // SDKDirectoryRegistry finds SDK documents in directories: the SDK of extension point NAME is the structured
 // document NAME.vrec (docs/sdks.md). Directories are searched in precedence order and the first one holding the
-// file wins, so a file in /etc/bexil/sdks replaces the one of the same name in /usr/share/bexil/sdks. Nothing is
-// cached: every look-up reads the file as it is now, so a change is seen at once. SDKs are resolved when a client
-// builds a record from a bundle on disk, which reads that bundle's Info.vrec anyway; one more small document costs
-// about as much again (bench/sdk_resolution_bench), not enough to keep copies in step with the files.
-// Immutable once made; any thread.
+// file wins, so a file in /etc/bexil/sdks replaces the one of the same name in /usr/share/bexil/sdks. Every
+// look-up opens the file as it is now; a document read before is reused only while the file it came from is the
+// same file, unchanged (device, inode, size, modification and change times), so an edited or replaced SDK is seen
+// at once while resolving many plug-ins of one extension point parses its SDK once. Any thread.
+
+#include <sys/stat.h>
 
 #include <cstddef>
 #include <filesystem>
+#include <mutex>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "base/Error.h"
@@ -27,6 +31,9 @@ class SDKDirectoryRegistry : public ExtensionSDKRegistry {
     // Longest SDK name taken; a longer one cannot be a file name once ".vrec" is added.
     static constexpr size_t kMaxSDKNameLength = 250;
     static constexpr std::string_view kDocumentSuffix = ".vrec";
+    // Parsed documents kept at most; past this the kept ones are dropped (logged) and reading starts afresh. A
+    // machine has a few dozen extension points; names that find no file keep nothing.
+    static constexpr size_t kMaxCachedDocuments = 256;
 
     // $BX_SDK_DIR alone when it is set and not empty, else /etc/bexil/sdks then /usr/share/bexil/sdks.
     static std::vector<std::filesystem::path> defaultDirectories();
@@ -47,7 +54,21 @@ class SDKDirectoryRegistry : public ExtensionSDKRegistry {
     std::optional<Value> copySDKEntry(std::string_view name) const override;
 
   private:
+    // A parsed document and the identity of the file it was read from.
+    struct Kept {
+        dev_t device;
+        ino_t inode;
+        off_t size;
+        timespec modified;
+        timespec changed;
+        Value document;
+    };
+    // The document of the open file `fd` (whose status is `st`), parsed now or kept from before.
+    Result<Value> documentOf(int fd, const struct stat& st, const std::filesystem::path& file) const;
+
     const std::vector<std::filesystem::path> directories_;
+    mutable std::mutex keptMutex_;
+    mutable std::unordered_map<std::string, Kept> kept_;
 };
 
 }  // namespace bexil
