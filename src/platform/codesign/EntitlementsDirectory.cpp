@@ -35,6 +35,11 @@ bool EntitlementsDirectory::isTrustedFile(const std::filesystem::path& path, uid
     return ownerAndModeTrusted(st, trustedUid);
 }
 
+bool EntitlementsDirectory::isTrustedDirectory(const std::filesystem::path& path, uid_t trustedUid) {
+    struct stat st {};
+    return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode) && ownerAndModeTrusted(st, trustedUid);
+}
+
 Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string& realPath,
                                                                const struct stat* running) {
     struct stat dirStat {};
@@ -43,7 +48,7 @@ Result<Value> EntitlementsDirectory::entitlementsForExecutable(const std::string
         if (errno == ENOENT) return Value::emptyDictionary();
         return posixError(errno, "cannot read the entitlements directory " + directory_.string());
     }
-    if (!S_ISDIR(dirStat.st_mode) || !ownerAndModeTrusted(dirStat, trustedUid_)) {
+    if (!isTrustedDirectory(directory_, trustedUid_)) {
         log::ops().error("entitlements directory %s is not trusted (owner or mode); no program has entitlements",
                          directory_.c_str());
         return Value::emptyDictionary();

@@ -39,6 +39,9 @@ class EntitlementsDirectory {
 
     // True when `path` is owned by root or `trustedUid` and neither group- nor world-writable.
     static bool isTrustedFile(const std::filesystem::path& path, uid_t trustedUid);
+    // True when `path` is a directory (a link to one counts as what it points at) owned by root or `trustedUid` and
+    // neither group- nor world-writable: the condition for any file in it to count.
+    static bool isTrustedDirectory(const std::filesystem::path& path, uid_t trustedUid);
 
     const std::filesystem::path& directory() const { return directory_; }
 
