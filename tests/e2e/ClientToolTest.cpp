@@ -69,7 +69,7 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
 // Guards the help texts: every subcommand has one with an example, and the top one lists the exit statuses.
 TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
     for (const char* sub : {"add", "remove", "bulk", "match", "ready", "access", "annotate", "elect", "unelect",
-                            "bulk-annotate", "hold", "holds", "release", "launch", "exclusions"}) {
+                            "bulk-annotate", "hold", "holds", "release", "launch", "exclusions", "doctor"}) {
         Outcome run = bexil(std::string(sub) + " --help");
         EXPECT_EQ(run.status, 0) << sub;
         EXPECT_NE(run.out.find("example: bexil"), std::string::npos) << sub << ": " << run.out;

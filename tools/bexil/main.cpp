@@ -2,7 +2,8 @@
 // preference. Every argument is checked before anything is sent; every wait for the daemon has a time limit.
 // Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 65 for a document on disk that
 // cannot be used, 66 for an SDK that is not registered, 69 when bxd is not running, 70 for a reply the tool cannot
-// read, 75 when bxd did not answer in time. `info` and `sdk` read the disk and never talk to bxd.
+// read, 75 when bxd did not answer in time, 78 when `doctor` found something wrong. `info` and `sdk` read the disk
+// and never talk to bxd.
 
 #include <poll.h>
 #include <sys/socket.h>
@@ -17,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "Doctor.h"
 #include "JsonText.h"
 #include "PlugInInfo.h"
 #include "ToolArguments.h"
@@ -653,6 +655,20 @@ int infoCommand(const Options& options, Arguments& arguments) {
     return 0;
 }
 
+// Checks the installation this command would talk to; prints one line per check and fails when any check does.
+int doctorCommand(const Options& options, Arguments&) {
+    std::vector<DoctorCheck> checks =
+        runDoctor(options.service, std::chrono::milliseconds(static_cast<int64_t>(options.timeoutSeconds * 1000)));
+    bool allOk = true;
+    for (const DoctorCheck& check : checks) allOk = allOk && check.ok;
+    if (options.json) {
+        std::printf("%s\n", toJson(doctorValue(checks)).c_str());
+    } else {
+        for (const DoctorCheck& check : checks) std::printf("%s\n", doctorLine(check).c_str());
+    }
+    return allOk ? 0 : kExitConfig;
+}
+
 void pathsArgument(CLI::App& command, Arguments& arguments) {
     command.add_option("paths", arguments.paths, "absolute paths of plug-in bundles")->required();
 }
@@ -740,6 +756,10 @@ const Subcommand kSubcommands[] = {
     {"status",
      "what bxd is doing now: uptime, connections, plug-ins, cache, holds, requests served\n  example: bexil status",
      [](CLI::App&, Arguments&) {}, statusCommand},
+    {"doctor",
+     "check this installation (daemon, directories, entitlements, bubblewrap, MIME database, journal) and say what to "
+     "fix\n  example: bexil doctor",
+     [](CLI::App&, Arguments&) {}, doctorCommand},
     {"info",
      "show a plug-in bundle on disk after SDK resolution: what its extension point gives it\n  example: bexil info "
      "/opt/Greeter.app/PlugIns/Hello.bxplugin",
@@ -762,7 +782,7 @@ int run(int argc, char** argv) {
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
         "annotation); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
-        "69 bxd not running; 70 unreadable reply; 75 no answer in time.",
+        "69 bxd not running; 70 unreadable reply; 75 no answer in time; 78 doctor found a problem.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();
