@@ -68,8 +68,9 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
 
 // Guards the help texts: every subcommand has one with an example, and the top one lists the exit statuses.
 TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
-    for (const char* sub : {"add", "remove", "bulk", "match", "ready", "access", "annotate", "elect", "unelect",
-                            "bulk-annotate", "hold", "holds", "release", "launch", "exclusions", "doctor"}) {
+    for (const char* sub :
+         {"add", "remove", "bulk", "match", "ready", "access", "annotate", "elect", "unelect", "bulk-annotate", "hold",
+          "holds", "release", "launch", "exclusions", "doctor", "completions"}) {
         Outcome run = bexil(std::string(sub) + " --help");
         EXPECT_EQ(run.status, 0) << sub;
         EXPECT_NE(run.out.find("example: bexil"), std::string::npos) << sub << ": " << run.out;
@@ -77,8 +78,9 @@ TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
     EXPECT_NE(bexil("--help").out.find("69 bxd not running"), std::string::npos);
 }
 
-// Guards the installed library: the install holds the tool, its manual, the public header (and no private one),
-// the pkg-config and CMake files, and the example application builds with pkg-config alone and talks to bxd.
+// Guards the installed library: the install holds the tool, its manual and shell completions, the public header (and
+// no private one), the pkg-config and CMake files, and the example application builds with pkg-config alone and
+// talks to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path prefix = bxd_.root() / "prefix", work = bxd_.root() / "example";
     fs::create_directories(work);
@@ -90,7 +92,9 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path libdir = fs::exists(prefix / "lib/pkgconfig/bexil.pc") ? prefix / "lib" : prefix / "lib64";
     for (const fs::path& installed :
          {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h", prefix / "bin/bexil",
-          prefix / "share/man/man1/bexil.1", libdir / "cmake/Bexil/BexilConfig.cmake"})
+          prefix / "share/man/man1/bexil.1", libdir / "cmake/Bexil/BexilConfig.cmake",
+          prefix / "share/bash-completion/completions/bexil", prefix / "share/zsh/vendor-completions/_bexil",
+          prefix / "share/fish/vendor_completions.d/bexil.fish"})
         ASSERT_TRUE(fs::exists(installed)) << installed;
     for (const auto& entry : fs::recursive_directory_iterator(prefix / "include")) {
         if (!entry.is_regular_file()) continue;

@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "Completions.h"
 #include "Doctor.h"
 #include "JsonText.h"
 #include "PlugInInfo.h"
@@ -800,6 +801,16 @@ int run(int argc, char** argv) {
         commands.emplace_back(command, &subcommand);
     }
 
+    // Written from `app` itself, so it knows every subcommand and option declared above (itself included).
+    std::string shell;
+    CLI::App* completions =
+        app.add_subcommand("completions",
+                           "print the completion script for a shell\n  example: bexil completions bash "
+                           ">~/.local/share/bash-completion/completions/bexil");
+    completions->add_option("shell", shell, "bash, zsh or fish")
+        ->required()
+        ->check(CLI::IsMember(std::vector<std::string>(std::begin(kCompletionShells), std::end(kCompletionShells))));
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::CallForHelp& e) {
@@ -814,6 +825,10 @@ int run(int argc, char** argv) {
     // The library logs to the system log; on a terminal without one, its lines would mix with the tool's own.
     log::LogRegistry::shared().setThreshold(options.verbose ? log::Level::Debug : log::Level::Fault);
 
+    if (*completions) {
+        std::fputs(completionScript(app, shell).value_or("").c_str(), stdout);
+        return 0;
+    }
     for (const auto& [command, subcommand] : commands)
         if (*command) return subcommand->action(options, arguments);
     return kExitUsage;
