@@ -39,7 +39,7 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
     const std::tuple<std::string, int, std::string> cases[] = {
         {"ready not-a-uuid", 64, "not a UUID"},
         {"match --rules-file /nonexistent/rules.json", 64, "/nonexistent/rules.json"},
-        {"match --rules-file " + badRules, 64, "JSON line 2: string is not UTF-8 (bad byte 0xff)"},
+        {"match --rules-file " + badRules, 64, "JSON line 2, column 46: text is not UTF-8 (bad byte 0xff)"},
         {"match $(printf 'RZExtensionPointIdentifier=\\377')", 64,
          "bexil: match not sent: it holds text that is not UTF-8"},
         {"annotate " + uuid, 64, "needs --election or --extension"},

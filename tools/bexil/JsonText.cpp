@@ -1,9 +1,13 @@
 #include "JsonText.h"
 
-#include <cmath>
+#include <algorithm>
+#include <cstddef>
 #include <cstdio>
-#include <cstdlib>
+#include <iterator>
+#include <nlohmann/json.hpp>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "base/Text.h"
 
@@ -11,404 +15,213 @@ namespace bexil::tool {
 
 namespace {
 
-class Parser {
-  public:
-    explicit Parser(std::string_view text) : text_(text) {}
+using nlohmann::json;
+using nlohmann::ordered_json;
 
-    Result<Value> document() {
-        Value value;
-        if (!parseValue(value, 0)) return failure();
-        skipSpace();
-        if (pos_ != text_.size()) {
-            error_ = "unexpected text after the value";
-            return failure();
+// "line L, column C" of the byte at `offset` (both counted from 1, columns in bytes).
+std::string where(std::string_view text, size_t offset) {
+    offset = std::min(offset, text.size());
+    size_t line = 1, lineStart = 0;
+    for (size_t i = 0; i < offset; ++i) {
+        if (text[i] == '\n') {
+            ++line;
+            lineStart = i + 1;
         }
-        return value;
+    }
+    return "line " + std::to_string(line) + ", column " + std::to_string(offset - lineStart + 1);
+}
+
+Error malformed(std::string_view text, size_t offset, const std::string& what) {
+    return BXError(ErrorCode::InvalidRequest, "JSON " + where(text, offset) + ": " + what);
+}
+
+// The library's message without its own prefix and position (ours replace them) and without the text it had
+// read, which can be long, and can end inside a UTF-8 sequence.
+std::string describe(const json::exception& error) {
+    std::string what = error.what();
+    if (size_t end = what.find("] "); end != std::string::npos) what.erase(0, end + 2);
+    if (what.starts_with("parse error")) {
+        if (size_t colon = what.find(": "); colon != std::string::npos) what.erase(0, colon + 2);
+    }
+    if (what.starts_with("syntax error")) {
+        if (size_t dash = what.find(" - "); dash != std::string::npos) what.erase(0, dash + 3);
+    }
+    if (size_t read = what.find("; last read: '"); read != std::string::npos) {
+        size_t expected = what.rfind("'; expected ");
+        what.erase(read, expected != std::string::npos && expected > read ? expected + 1 - read : std::string::npos);
+    }
+    return what;
+}
+
+// Hands the parser one byte at a time and remembers how far it has read, so that what the builder refuses (a key
+// given twice, nesting too deep) is placed like the parser's own errors.
+class Cursor {
+  public:
+    using iterator_category = std::input_iterator_tag;
+    using value_type = char;
+    using difference_type = std::ptrdiff_t;
+    using pointer = const char*;
+    using reference = const char&;
+
+    Cursor(const char* at, const char** read) : at_(at), read_(read) {}
+    reference operator*() const { return *at_; }
+    Cursor& operator++() {
+        *read_ = ++at_;
+        return *this;
+    }
+    bool operator==(const Cursor& other) const { return at_ == other.at_; }
+
+  private:
+    const char* at_;
+    const char** read_;
+};
+
+// Builds the Value as the parser reports what it reads, on a stack of its own rather than by recursion.
+class Builder {
+  public:
+    Builder(std::string_view text, const char** read) : text_(text), read_(read) {}
+
+    bool null() { return add(Value::null()); }
+    bool boolean(bool b) { return add(Value::boolean(b)); }
+    bool number_integer(json::number_integer_t i) { return add(Value::int64(i)); }
+    bool number_unsigned(json::number_unsigned_t u) {
+        return add(u <= static_cast<uint64_t>(INT64_MAX) ? Value::int64(static_cast<int64_t>(u)) : Value::uint64(u));
+    }
+    bool number_float(json::number_float_t d, const json::string_t&) { return add(Value::real(d)); }
+    bool string(json::string_t& s) { return add(Value::string(std::move(s))); }
+    // JSON text has no binary values: the parser never reports one.
+    bool binary(json::binary_t&) { return false; }
+
+    bool start_object(size_t) { return open(true); }
+    bool key(json::string_t& key) {
+        Frame& frame = stack_.back();
+        if (frame.dictionary.find(key) != nullptr) return refuse("key \"" + key + "\" given twice");
+        frame.key = std::move(key);
+        return true;
+    }
+    bool end_object() {
+        Value dictionary = stack_.back().dictionary.take();
+        stack_.pop_back();
+        return add(std::move(dictionary));
+    }
+    bool start_array(size_t) { return open(false); }
+    bool end_array() {
+        Value array = stack_.back().array.take();
+        stack_.pop_back();
+        return add(std::move(array));
+    }
+
+    bool parse_error(size_t position, const std::string&, const json::exception& error) {
+        // `position` counts the byte the parser stopped at.
+        error_ = malformed(text_, position > 0 ? position - 1 : 0, describe(error));
+        return false;
+    }
+
+    Result<Value> result() {
+        if (error_) return *error_;
+        return std::move(root_);
     }
 
   private:
-    Error failure() const {
-        size_t line = 1;
-        for (size_t i = 0; i < pos_ && i < text_.size(); ++i)
-            if (text_[i] == '\n') ++line;
-        return BXError(ErrorCode::InvalidRequest, "JSON line " + std::to_string(line) + ": " + error_);
-    }
-
-    void skipSpace() {
-        while (pos_ < text_.size() &&
-               (text_[pos_] == ' ' || text_[pos_] == '\t' || text_[pos_] == '\n' || text_[pos_] == '\r'))
-            ++pos_;
-    }
-
-    bool literal(std::string_view word) {
-        if (text_.substr(pos_, word.size()) != word) return false;
-        pos_ += word.size();
-        return true;
-    }
-
-    bool parseValue(Value& out, int depth) {
-        if (depth > kMaxJsonDepth) {
-            error_ = "nested too deeply";
-            return false;
-        }
-        skipSpace();
-        if (pos_ >= text_.size()) {
-            error_ = "unexpected end of text";
-            return false;
-        }
-        char c = text_[pos_];
-        if (c == '{') return parseObject(out, depth);
-        if (c == '[') return parseArray(out, depth);
-        if (c == '"') {
-            std::string s;
-            if (!parseString(s)) return false;
-            out = Value::string(std::move(s));
-            return true;
-        }
-        if (literal("true")) return out = Value::boolean(true), true;
-        if (literal("false")) return out = Value::boolean(false), true;
-        if (literal("null")) return out = Value::null(), true;
-        if (c == '-' || (c >= '0' && c <= '9')) return parseNumber(out);
-        error_ = std::string("unexpected character '") + c + "'";
-        return false;
-    }
-
-    bool parseObject(Value& out, int depth) {
-        ++pos_;
+    struct Frame {
+        bool isDictionary;
         MutableDictionary dictionary;
-        skipSpace();
-        if (pos_ < text_.size() && text_[pos_] == '}') {
-            ++pos_;
-            out = dictionary.take();
-            return true;
-        }
-        for (;;) {
-            skipSpace();
-            std::string key;
-            if (pos_ >= text_.size() || text_[pos_] != '"') {
-                error_ = "expected a key in double quotes";
-                return false;
-            }
-            if (!parseString(key)) return false;
-            skipSpace();
-            if (pos_ >= text_.size() || text_[pos_] != ':') {
-                error_ = "expected ':' after a key";
-                return false;
-            }
-            ++pos_;
-            Value value;
-            if (!parseValue(value, depth + 1)) return false;
-            if (dictionary.find(key) != nullptr) {
-                error_ = "key \"" + key + "\" given twice";
-                return false;
-            }
-            dictionary.set(key, std::move(value));
-            skipSpace();
-            if (pos_ < text_.size() && text_[pos_] == ',') {
-                ++pos_;
-                continue;
-            }
-            if (pos_ < text_.size() && text_[pos_] == '}') {
-                ++pos_;
-                out = dictionary.take();
-                return true;
-            }
-            error_ = "expected ',' or '}'";
-            return false;
-        }
-    }
-
-    bool parseArray(Value& out, int depth) {
-        ++pos_;
         MutableArray array;
-        skipSpace();
-        if (pos_ < text_.size() && text_[pos_] == ']') {
-            ++pos_;
-            out = array.take();
-            return true;
-        }
-        for (;;) {
-            Value value;
-            if (!parseValue(value, depth + 1)) return false;
-            array.append(std::move(value));
-            skipSpace();
-            if (pos_ < text_.size() && text_[pos_] == ',') {
-                ++pos_;
-                continue;
-            }
-            if (pos_ < text_.size() && text_[pos_] == ']') {
-                ++pos_;
-                out = array.take();
-                return true;
-            }
-            error_ = "expected ',' or ']'";
-            return false;
-        }
+        std::string key;
+    };
+
+    bool open(bool isDictionary) {
+        if (stack_.size() >= static_cast<size_t>(kMaxJsonDepth))
+            return refuse("nested more than " + std::to_string(kMaxJsonDepth) + " deep");
+        stack_.push_back(Frame{isDictionary, {}, {}, {}});
+        return true;
     }
 
-    bool hex4(uint32_t& out) {
-        if (pos_ + 4 > text_.size()) {
-            error_ = "truncated \\u escape";
-            return false;
-        }
-        out = 0;
-        for (int i = 0; i < 4; ++i) {
-            int digit = hexDigitValue(text_[pos_++]);
-            if (digit < 0) {
-                error_ = "bad \\u escape";
-                return false;
-            }
-            out = (out << 4) | static_cast<uint32_t>(digit);
+    bool add(Value value) {
+        if (stack_.empty()) {
+            root_ = std::move(value);
+        } else if (stack_.back().isDictionary) {
+            stack_.back().dictionary.set(stack_.back().key, std::move(value));
+        } else {
+            stack_.back().array.append(std::move(value));
         }
         return true;
     }
 
-    bool parseString(std::string& out) {
-        const size_t start = ++pos_;
-        while (pos_ < text_.size()) {
-            char c = text_[pos_++];
-            if (c == '"') return wellFormed(start, pos_ - 1);
-            if (static_cast<unsigned char>(c) < 0x20) {
-                error_ = "control character in a string";
-                return false;
-            }
-            if (c != '\\') {
-                out += c;
-                continue;
-            }
-            if (pos_ >= text_.size()) break;
-            char e = text_[pos_++];
-            switch (e) {
-                case '"':
-                    out += '"';
-                    break;
-                case '\\':
-                    out += '\\';
-                    break;
-                case '/':
-                    out += '/';
-                    break;
-                case 'b':
-                    out += '\b';
-                    break;
-                case 'f':
-                    out += '\f';
-                    break;
-                case 'n':
-                    out += '\n';
-                    break;
-                case 'r':
-                    out += '\r';
-                    break;
-                case 't':
-                    out += '\t';
-                    break;
-                case 'u': {
-                    uint32_t cp = 0;
-                    if (!hex4(cp)) return false;
-                    if (cp >= 0xD800 && cp <= 0xDBFF) {
-                        uint32_t low = 0;
-                        if (!literal("\\u") || !hex4(low) || low < 0xDC00 || low > 0xDFFF) {
-                            error_ = "unpaired surrogate in \\u escape";
-                            return false;
-                        }
-                        cp = 0x10000 + ((cp - 0xD800) << 10) + (low - 0xDC00);
-                    } else if (cp >= 0xDC00 && cp <= 0xDFFF) {
-                        error_ = "unpaired surrogate in \\u escape";
-                        return false;
-                    }
-                    appendUtf8(out, cp);
-                    break;
-                }
-                default:
-                    error_ = std::string("bad escape \\") + e;
-                    return false;
-            }
-        }
-        error_ = "unterminated string";
+    // Stops the parse at the last byte read, which ended the key or opened the container refused.
+    bool refuse(const std::string& what) {
+        size_t read = static_cast<size_t>(*read_ - text_.data());
+        error_ = malformed(text_, read > 0 ? read - 1 : 0, what);
         return false;
-    }
-
-    // Refuses a string whose bytes between `start` and `end` are not UTF-8 here, where the line can be named: the
-    // escapes are ASCII and what \u makes is well formed, so the raw bytes decide. Without this the text would
-    // reach the encoder and fail there, far from the file that holds it.
-    bool wellFormed(size_t start, size_t end) {
-        size_t bad = firstInvalidUtf8(text_.substr(start, end - start));
-        if (bad == kWellFormedUtf8) return true;
-        pos_ = start + bad;
-        char byte[8];
-        std::snprintf(byte, sizeof byte, "0x%02x", static_cast<unsigned char>(text_[pos_]));
-        error_ = std::string("string is not UTF-8 (bad byte ") + byte + ")";
-        return false;
-    }
-
-    bool parseNumber(Value& out) {
-        size_t start = pos_;
-        bool real = false;
-        if (text_[pos_] == '-') ++pos_;
-        while (pos_ < text_.size()) {
-            char c = text_[pos_];
-            if (c >= '0' && c <= '9') {
-                ++pos_;
-            } else if (c == '.' || c == 'e' || c == 'E' || c == '+' || c == '-') {
-                real = true;
-                ++pos_;
-            } else {
-                break;
-            }
-        }
-        std::string number(text_.substr(start, pos_ - start));
-        char* end = nullptr;
-        errno = 0;
-        if (!real) {
-            if (number[0] == '-') {
-                long long v = std::strtoll(number.c_str(), &end, 10);
-                if (errno == 0 && end && *end == '\0') return out = Value::int64(v), true;
-            } else {
-                unsigned long long v = std::strtoull(number.c_str(), &end, 10);
-                if (errno == 0 && end && *end == '\0') {
-                    out = v <= static_cast<unsigned long long>(INT64_MAX) ? Value::int64(static_cast<int64_t>(v))
-                                                                          : Value::uint64(v);
-                    return true;
-                }
-            }
-            errno = 0;
-        }
-        double d = std::strtod(number.c_str(), &end);
-        if (end == nullptr || *end != '\0' || number == "-" || !std::isfinite(d)) {
-            error_ = "malformed number " + number;
-            return false;
-        }
-        out = Value::real(d);
-        return true;
     }
 
     std::string_view text_;
-    size_t pos_ = 0;
-    std::string error_;
+    const char** read_;
+    std::vector<Frame> stack_;
+    Value root_;
+    std::optional<Error> error_;
 };
 
-void writeString(std::string& out, std::string_view s) {
-    out += '"';
-    for (unsigned char c : s) {
-        switch (c) {
-            case '"':
-                out += "\\\"";
-                break;
-            case '\\':
-                out += "\\\\";
-                break;
-            case '\n':
-                out += "\\n";
-                break;
-            case '\r':
-                out += "\\r";
-                break;
-            case '\t':
-                out += "\\t";
-                break;
-            default:
-                if (c < 0x20) {
-                    char buffer[8];
-                    std::snprintf(buffer, sizeof buffer, "\\u%04x", c);
-                    out += buffer;
-                } else {
-                    out += static_cast<char>(c);
-                }
-        }
-    }
-    out += '"';
-}
-
-void write(std::string& out, const Value& value, JsonLayout layout, int indent) {
-    auto newline = [&](int level) {
-        if (layout == JsonLayout::OneLine) return;
-        out += '\n';
-        out.append(static_cast<size_t>(level) * 2, ' ');
-    };
+ordered_json toLibrary(const Value& value) {
     switch (value.kind()) {
         case ValueKind::Null:
-            out += "null";
-            break;
+            return nullptr;
         case ValueKind::Bool:
-            out += *value.getBool() ? "true" : "false";
-            break;
+            return *value.getBool();
         case ValueKind::Int64:
-            out += std::to_string(*value.getInt64());
-            break;
+            return *value.getInt64();
         case ValueKind::UInt64:
-            out += std::to_string(*value.getUInt64());
-            break;
-        case ValueKind::Real: {
-            double d = *value.getReal();
-            if (!std::isfinite(d)) {
-                out += "null";
-            } else {
-                char buffer[32];
-                std::snprintf(buffer, sizeof buffer, "%.17g", d);
-                out += buffer;
-            }
-            break;
-        }
+            return *value.getUInt64();
+        case ValueKind::Real:
+            return *value.getReal();  // written as null when not finite
         case ValueKind::String:
-            writeString(out, value.stringView());
-            break;
+            return value.stringView();
         case ValueKind::Data:
-            writeString(out, base64(value.dataBytes()));
-            break;
+            return base64(value.dataBytes());
         case ValueKind::Date:
-            writeString(out, value.getDate()->iso8601());
-            break;
+            return value.getDate()->iso8601();
         case ValueKind::Uuid:
-            writeString(out, value.getUuid()->string());
-            break;
+            return value.getUuid()->string();
         case ValueKind::Array: {
-            if (value.count() == 0) {
-                out += "[]";
-                break;
-            }
-            out += '[';
-            bool first = true;
-            for (const Value& item : value.items()) {
-                if (!first) out += ',';
-                first = false;
-                newline(indent + 1);
-                write(out, item, layout, indent + 1);
-            }
-            newline(indent);
-            out += ']';
-            break;
+            ordered_json array = ordered_json::array();
+            auto& items = array.get_ref<ordered_json::array_t&>();
+            items.reserve(value.count());
+            for (const Value& item : value.items()) items.push_back(toLibrary(item));
+            return array;
         }
         case ValueKind::Dictionary: {
-            if (value.count() == 0) {
-                out += "{}";
-                break;
-            }
-            out += '{';
-            bool first = true;
-            for (const DictionaryEntry& entry : value.entries()) {
-                if (!first) out += ',';
-                first = false;
-                newline(indent + 1);
-                writeString(out, entry.key);
-                out += layout == JsonLayout::Pretty ? ": " : ":";
-                write(out, entry.value, layout, indent + 1);
-            }
-            newline(indent);
-            out += '}';
-            break;
+            // Appended as they come: the entries are the Value's, unique and in its order.
+            ordered_json dictionary = ordered_json::object();
+            auto& members = dictionary.get_ref<ordered_json::object_t&>();
+            members.reserve(value.count());
+            for (const DictionaryEntry& entry : value.entries())
+                members.emplace_back(entry.key, toLibrary(entry.value));
+            return dictionary;
         }
     }
+    return nullptr;
 }
 
 }  // namespace
 
-Result<Value> parseJson(std::string_view text) { return Parser(text).document(); }
+Result<Value> parseJson(std::string_view text) {
+    // Checked over the whole text first, so that the error names the byte; the library would refuse it too, but
+    // quoting the raw text around it.
+    if (size_t bad = firstInvalidUtf8(text); bad != kWellFormedUtf8) {
+        char byte[8];
+        std::snprintf(byte, sizeof byte, "0x%02x", static_cast<unsigned char>(text[bad]));
+        return malformed(text, bad, std::string("text is not UTF-8 (bad byte ") + byte + ")");
+    }
+    const char* read = text.data();
+    Builder builder(text, &read);
+    json::sax_parse(Cursor(text.data(), &read), Cursor(text.data() + text.size(), &read), &builder);
+    return builder.result();
+}
 
 std::string toJson(const Value& value, JsonLayout layout) {
-    std::string out;
-    write(out, value, layout, 0);
-    return out;
+    // Text that is not UTF-8 cannot be JSON; it is written with U+FFFD in place of the bad bytes.
+    return toLibrary(value).dump(layout == JsonLayout::Pretty ? 2 : -1, ' ', false,
+                                 ordered_json::error_handler_t::replace);
 }
 
 }  // namespace bexil::tool

@@ -3,7 +3,8 @@
 // JSON for the bexil tool only: reading rule and annotation files, and printing replies with --json. Numbers
 // without a fraction or exponent read as int64 (uint64 above its range), others as reals; null, booleans,
 // strings, arrays and objects map to the Value kinds of the same name. Writing renders data as base64 text, dates
-// as ISO 8601 text and UUIDs as their canonical text, since JSON has none of those kinds. Stateless; any thread.
+// as ISO 8601 text and UUIDs as their canonical text, since JSON has none of those kinds; a whole real keeps its
+// ".0", so that it reads back as a real. Errors name the line and column (in bytes). Stateless; any thread.
 
 #include <string>
 #include <string_view>
@@ -13,7 +14,7 @@
 
 namespace bexil::tool {
 
-// Deepest nesting a JSON file may have; deeper input is refused rather than risk the stack.
+// Most arrays and objects a JSON file may nest inside one another; deeper input is refused rather than risk the stack.
 inline constexpr int kMaxJsonDepth = 128;
 
 Result<Value> parseJson(std::string_view text);
