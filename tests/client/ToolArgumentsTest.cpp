@@ -96,5 +96,45 @@ TEST(JsonTextTest, KindsJsonLacksBecomeText) {
               R"(["11111111-2222-4333-8444-555555555555","aGk="])");
 }
 
+// Guards what the JSON library is trusted with: the Value kind each number becomes and keeps when written and read
+// again, where reading stops (nesting, a key given twice, text that is not UTF-8) and that it says where, and the
+// layouts that scripts and tests search.
+TEST(JsonTextTest, NumberKindsLimitsAndLayouts) {
+    auto numbers = parseJson(
+        "[9223372036854775807, -9223372036854775808, 9223372036854775808, -0, "
+        "18446744073709551616, -9223372036854775809, 1.5, 1e2, 3.0]");
+    ASSERT_TRUE(numbers.ok()) << numbers.error().description();
+    auto kinds = [](const Value& array) {
+        std::vector<ValueKind> kinds;
+        for (const Value& item : array.items()) kinds.push_back(item.kind());
+        return kinds;
+    };
+    const auto I = ValueKind::Int64, U = ValueKind::UInt64, R = ValueKind::Real;
+    EXPECT_EQ(kinds(*numbers), (std::vector<ValueKind>{I, I, U, I, R, R, R, R, R}));
+    EXPECT_EQ(numbers->items()[1].getInt64(), std::optional<int64_t>(INT64_MIN));
+    auto again = parseJson(toJson(*numbers, JsonLayout::OneLine));
+    ASSERT_TRUE(again.ok()) << again.error().description();
+    EXPECT_EQ(kinds(*again), kinds(*numbers)) << "a whole real is written as one";
+    EXPECT_EQ(*again, *numbers);
+
+    auto refusal = [](const std::string& text) -> std::string {
+        auto value = parseJson(text);
+        return value.ok() ? "accepted" : value.error().localizedDescription().value_or("");
+    };
+    EXPECT_EQ(refusal(std::string(128, '[') + std::string(128, ']')), "accepted");
+    EXPECT_EQ(refusal(std::string(129, '[') + std::string(129, ']')),
+              "JSON line 1, column 129: nested more than 128 deep");
+    EXPECT_EQ(refusal("{\"a\": 1,\n \"a\": 2}"), "JSON line 2, column 4: key \"a\" given twice");
+    EXPECT_EQ(refusal("[\"ok\",\n \"\xc3(\"]"), "JSON line 2, column 3: text is not UTF-8 (bad byte 0xc3)");
+    EXPECT_EQ(refusal("{\"a\" 1}"), "JSON line 1, column 6: unexpected number literal; expected ':'");
+    EXPECT_EQ(refusal("[1e999]"), "JSON line 1, column 6: number overflow parsing '1e999'");
+    EXPECT_EQ(refusal("[1,\n tru]"), "JSON line 2, column 5: invalid literal");
+
+    Value value = Value::dictionary(
+        {{"b", Value::string("\t\"\xC3\xA9\x01")}, {"a", Value::array({Value::int64(1), Value::emptyDictionary()})}});
+    EXPECT_EQ(toJson(value), "{\n  \"a\": [\n    1,\n    {}\n  ],\n  \"b\": \"\\t\\\"\xC3\xA9\\u0001\"\n}");
+    EXPECT_EQ(toJson(value, JsonLayout::OneLine), "{\"a\":[1,{}],\"b\":\"\\t\\\"\xC3\xA9\\u0001\"}");
+}
+
 }  // namespace
 }  // namespace bexil::tool
