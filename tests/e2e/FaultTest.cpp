@@ -209,6 +209,13 @@ TEST_F(FaultTest, AKillDuringALongRegistrationKeepsEachBundleWholeAndItsUuid) {
 // Guards running out of descriptors: when bxd may open no more files, accepting fails; it says so once, keeps its
 // listening socket and its clients, and once descriptors are free again takes the connections that waited.
 TEST_F(FaultTest, OutOfDescriptorsAcceptingWaitsAndResumes) {
+#if defined(__SANITIZE_ADDRESS__)
+    // The sanitized daemon cannot run out of descriptors soundly: when its cache misses, UBSan's check of an
+    // object's dynamic type probes memory through a pipe, cannot make one, and stops bxd over a sound object
+    // ("object has invalid vptr" at a plain delete; no suppression applies, as the report cannot be symbolised
+    // either). The release build runs this test.
+    GTEST_SKIP() << "a sanitized bxd cannot run out of descriptors: its own checks need them";
+#endif
     ASSERT_TRUE(start()) << bxd_.log();
     TestClient connected;
     ASSERT_EQ(errorCode(connected.replyTo(request("ready", {{"uuids", Value::emptyArray()}}))), 0);
