@@ -210,11 +210,23 @@ bool BXProtocolRegistry::registerProtocol(std::shared_ptr<const BXProtocol> prot
     return state_->protocols.emplace(protocol->name(), protocol).second;
 }
 
+// Longest protocol name a log line carries in full: a name comes from a spec string, which may be of any length,
+// and one bad spec must not put a megabyte into the journal. The error keeps the whole name.
+constexpr size_t kMaxLoggedProtocolName = 256;
+
 std::shared_ptr<const BXProtocol> protocolNamed(std::string_view name, Error* error) {
     if (auto protocol = BXProtocolRegistry::shared().lookup(name)) return protocol;
-    std::string message = formatPrintf(
-        "unable to locate protocol \"%s\" - check that it is defined and not inadvertently optimized away", name);
-    log::ops().notice("%s", message);
+    constexpr const char* kMissing =
+        "unable to locate protocol \"%s\" - check that it is defined and not inadvertently optimized away";
+    std::string message = formatPrintf(kMissing, name);
+    if (name.size() <= kMaxLoggedProtocolName) {
+        log::ops().notice("%s", message);
+    } else {
+        size_t cut = kMaxLoggedProtocolName;
+        while (cut > 0 && (static_cast<unsigned char>(name[cut]) & 0xC0) == 0x80) --cut;  // not inside a character
+        log::ops().notice(kMissing, std::string(name.substr(0, cut)) + "... (" + std::to_string(name.size()) +
+                                        " bytes, shortened in this line)");
+    }
     if (error) *error = BXError(ErrorCode::InvalidConfiguration, message);
     return nullptr;
 }

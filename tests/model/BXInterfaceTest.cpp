@@ -94,6 +94,15 @@ TEST(InterfaceSpec, MegabyteSpecsAreAnswered) {
     expectSpecError(applyInterfaceSpec(*interface, "run", std::string(mb, ':')), std::string(mb, ':'));
     std::string classes = "request:99999999999999999999999:{" + std::string(mb, '+') + "}";
     expectSpecError(applyInterfaceSpec(*interface, "run", classes), "");
+    // A megabyte protocol name: the error carries it whole, its log line only the start (no cut character).
+    log::CaptureSink capture;
+    const std::string name = "\xC3\xA9" + std::string(mb, 'P');
+    expectSpecError(applyInterfaceSpec(*interface, "run", "reply:0:" + name), name);
+    auto line = capture.find("unable to locate protocol");
+    ASSERT_TRUE(line);
+    EXPECT_LT(line->message.size(), 512u);
+    EXPECT_NE(line->message.find("\"\xC3\xA9PP"), std::string::npos);
+    EXPECT_NE(line->message.find("(1048578 bytes, shortened in this line)"), std::string::npos) << line->message;
 }
 
 TEST(CompoundProtocol, NamesMembersInOrderAndRegistersOnce) {
