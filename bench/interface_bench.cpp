@@ -1,7 +1,7 @@
-// Cost of typed messages between a host and its plug-in. applyInterfaceSpec is measured per spec entry (specs of 1,
-// 10 and 100 entries, each naming a class set of two). The typed round trip (a "greet" call checked on both sides,
-// served by TypedConnection) is measured against its in-run reference: the same call dictionary echoed as a raw Zem
-// frame over the same kind of socket pair, with nothing checked. Compare the two within one run:
+// Cost of typed messages between a host and its plug-in. applyInterfaceSpec is measured per entry of a spec string
+// (strings of 1, 10 and 100 entries, each naming a class set of two). The typed round trip (a "greet" call checked on
+// both sides, served by TypedConnection) is measured against its in-run reference: the same call dictionary echoed as a
+// raw Zem frame over the same kind of socket pair, with nothing checked. Compare the two within one run:
 //
 //   interface_bench --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
 

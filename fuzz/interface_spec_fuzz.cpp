@@ -1,7 +1,7 @@
 // Applies arbitrary bytes as an interface spec string to a fresh interface of a small protocol, for two selectors
 // (the bytes before the first newline, if any, name a third). Besides not faulting, a failure must be a code 6 error
-// in the Bexil domain whose message is text taken from the spec (the whole spec, a field, a type or a class name),
-// an empty spec must fail, and checking messages against whatever was applied must answer without faulting.
+// in the Bexil domain whose message is text taken from the input string (all of it, a field, a type or a class
+// name), an empty string must fail, and checking messages against whatever was applied must answer without faulting.
 
 #include <cstddef>
 #include <cstdint>
@@ -51,9 +51,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (std::optional<Error> error = applyInterfaceSpec(*interface, selector, spec)) {
         if (error->domain() != "Bexil" || error->code() != 6) fail("a failure that is not code 6 in Bexil");
         if (!error->localizedDescription()) fail("a failure without a message");
-        if (spec.find(*error->localizedDescription()) == std::string_view::npos) fail("a message not from the spec");
+        if (spec.find(*error->localizedDescription()) == std::string_view::npos)
+            fail("a message not taken from the input");
     } else if (spec.empty()) {
-        fail("an empty spec succeeded");
+        fail("an empty spec string succeeded");
     }
     // Whatever was applied, checking a message against the result answers without faulting.
     Value arguments = Value::array({Value::dictionary({{"selector", Value::string("call")}}), Value::int64(1)});

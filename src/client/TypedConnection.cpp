@@ -111,7 +111,7 @@ Result<std::unique_ptr<TypedConnection>> TypedConnection::bind(int socket, const
         return error;
     };
     if (socket < 0) return refuse(connectionError("no socket to bind"));
-    Error missing = BXErrorWithFormat(ErrorCode::InvalidConfiguration, "no protocol for the spec %@", protocolSpec);
+    Error missing = BXErrorWithFormat(ErrorCode::InvalidConfiguration, "no protocol named by %@", protocolSpec);
     auto protocol = compoundProtocol(protocolSpec, &missing);
     if (!protocol) return refuse(missing);
     auto interface = BXInterface::interfaceWithProtocol(protocol);
