@@ -2,8 +2,8 @@
 // preference. Every argument is checked before anything is sent; every wait for the daemon has a time limit.
 // Exit status: 0 on success, the reply's error code on failure, 64 for bad arguments, 65 for a document on disk that
 // cannot be used, 66 for an SDK that is not registered, 69 when bxd is not running, 70 for a reply the tool cannot
-// read, 75 when bxd did not answer in time, 78 when `doctor` found something wrong. `info` and `sdk` read the disk
-// and never talk to bxd.
+// read, 73 when the preferences file cannot be written, 75 when bxd did not answer in time, 78 when `doctor`
+// found something wrong. `info` and `sdk` read the disk and never talk to bxd.
 
 #include <poll.h>
 #include <sys/socket.h>
@@ -783,7 +783,8 @@ int run(int argc, char** argv) {
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
         "annotation); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
-        "69 bxd not running; 70 unreadable reply; 75 no answer in time; 78 doctor found a problem.",
+        "69 bxd not running; 70 unreadable reply; 73 preferences not writable; 75 no answer in time;\n"
+        "78 doctor found a problem.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();
