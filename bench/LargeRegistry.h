@@ -20,7 +20,7 @@
 #include <vector>
 
 #include "base/Document.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 

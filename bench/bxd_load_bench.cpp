@@ -49,8 +49,8 @@
 #include <vector>
 
 #include "BxdBench.h"
-#include "base/Value.h"
 #include "bexil/DaemonClient.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemFrame.h"
 

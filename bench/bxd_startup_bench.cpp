@@ -40,7 +40,7 @@
 
 #include "BxdBench.h"
 #include "LargeRegistry.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 #include "platform/zem/ZemFrame.h"
 

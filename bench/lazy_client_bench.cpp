@@ -16,7 +16,7 @@
 #include <thread>
 
 #include "BxdBench.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemFrame.h"
 
 namespace fs = std::filesystem;

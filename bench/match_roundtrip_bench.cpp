@@ -43,7 +43,7 @@
 
 #include "BxdBench.h"
 #include "base/Document.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "database/BXDatabase.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 #include "platform/zem/ZemCodec.h"

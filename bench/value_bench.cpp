@@ -5,7 +5,7 @@
 
 #include <string>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace {
 

@@ -5,7 +5,7 @@
 // client's own serial queue, with the outcome (one callback at a time, in delivery order). Request methods may be
 // called from any thread; wait() blocks the calling thread for one reply and must not be called from a callback.
 //
-// Values are bexil::Value (base/Value.h): immutable, shared property-list values with MutableDictionary and
+// Values are bexil::Value (bexil/Value.h): immutable, shared property-list values with MutableDictionary and
 // MutableArray builders. Errors are bexil::Error in the domain "Bexil" with the daemon's codes.
 
 #include <chrono>
@@ -16,9 +16,9 @@
 #include <string>
 #include <vector>
 
-#include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Error.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

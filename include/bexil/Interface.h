@@ -35,8 +35,8 @@
 #include <string_view>
 #include <vector>
 
-#include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Error.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -28,9 +28,9 @@
 #include <string>
 #include <string_view>
 
-#include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Error.h"
 #include "bexil/Interface.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

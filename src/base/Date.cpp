@@ -1,4 +1,4 @@
-#include "base/Date.h"
+#include "bexil/Date.h"
 
 #include <array>
 #include <bit>

@@ -15,7 +15,7 @@
 #include "base/AtomicFile.h"
 #include "base/Error.h"
 #include "base/PosixError.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -22,11 +22,11 @@
 #include <variant>
 #include <vector>
 
-#include "base/Date.h"
 #include "base/DocumentSyntax.h"
 #include "base/PosixError.h"
 #include "base/Text.h"
 #include "base/UniqueFd.h"
+#include "bexil/Date.h"
 
 namespace bexil {
 

@@ -12,11 +12,11 @@
 #include <variant>
 #include <vector>
 
-#include "base/Date.h"
 #include "base/Document.h"
 #include "base/DocumentSyntax.h"
 #include "base/PosixError.h"
 #include "base/Text.h"
+#include "bexil/Date.h"
 
 namespace bexil::document_detail {
 

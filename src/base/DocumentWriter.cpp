@@ -17,10 +17,10 @@
 #include <variant>
 #include <vector>
 
-#include "base/Date.h"
 #include "base/DocumentSyntax.h"
 #include "base/PosixError.h"
 #include "base/Text.h"
+#include "bexil/Date.h"
 
 namespace bexil {
 

@@ -5,7 +5,7 @@
 #include <cstdio>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 // The renderer walks the format once. Numbers go through snprintf with a conversion we build ourselves from the
 // parsed pieces and with an argument of exactly the type that conversion names, so flags, width and precision

@@ -1,4 +1,4 @@
-#include "base/Uuid.h"
+#include "bexil/Uuid.h"
 
 #include <sys/random.h>
 

@@ -1,4 +1,4 @@
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 #include <sys/random.h>
 

@@ -20,8 +20,8 @@
 #include "base/Error.h"
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
-#include "base/Value.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemError.h"
 

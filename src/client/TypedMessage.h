@@ -15,8 +15,8 @@
 #include <string_view>
 
 #include "base/Error.h"
-#include "base/Value.h"
 #include "bexil/Interface.h"
+#include "bexil/Value.h"
 
 namespace bexil::typed {
 

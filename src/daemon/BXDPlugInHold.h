@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "policy/BXDPlugIn.h"
 
 namespace bexil {

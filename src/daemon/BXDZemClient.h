@@ -13,7 +13,7 @@
 #include <string_view>
 
 #include "base/ActingAs.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemConnection.h"
 #include "policy/HostAccessClient.h"
 

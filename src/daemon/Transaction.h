@@ -17,8 +17,8 @@
 #include "base/ActingAs.h"
 #include "base/Error.h"
 #include "base/UniqueFd.h"
-#include "base/Value.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemMessage.h"
 
 namespace bexil {

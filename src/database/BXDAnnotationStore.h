@@ -12,7 +12,7 @@
 
 #include "base/Document.h"
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

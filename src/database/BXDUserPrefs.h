@@ -6,8 +6,8 @@
 
 #include <vector>
 
-#include "base/Value.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 #include "platform/prefs/PreferencesStore.h"
 
 namespace bexil {

@@ -18,8 +18,8 @@
 #include "base/ActingAs.h"
 #include "base/Error.h"
 #include "base/SyncQueue.h"
-#include "base/Value.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 #include "database/BXDatabaseDelegate.h"
 #include "policy/BXAnnotationSource.h"
 

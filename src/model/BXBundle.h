@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/bundles/PlatformBundle.h"
 
 namespace bexil {

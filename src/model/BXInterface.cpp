@@ -13,6 +13,7 @@
 #include <unordered_map>
 #include <utility>
 
+#include "base/Error.h"
 #include "bexil/Interface.h"
 #include "platform/log/Log.h"
 

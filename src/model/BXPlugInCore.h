@@ -19,7 +19,7 @@
 #include <string_view>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

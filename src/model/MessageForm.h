@@ -9,7 +9,7 @@
 #include <cstdint>
 #include <optional>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

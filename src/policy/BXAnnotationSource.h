@@ -5,7 +5,7 @@
 // and the rules reach it only through it. Implementations are called on the evaluating thread and may block
 // briefly (the database enters its own queue), so rules must never be evaluated from inside that queue.
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "model/BXPlugInCore.h"
 
 namespace bexil {

@@ -12,7 +12,7 @@
 #include <string_view>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "model/BXPlugInCore.h"
 #include "platform/jobard/ServiceManager.h"
 #include "platform/ksn/PrivacyConsent.h"

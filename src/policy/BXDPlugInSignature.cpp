@@ -2,7 +2,7 @@
 
 #include <openssl/sha.h>
 
-#include "base/Uuid.h"
+#include "bexil/Uuid.h"
 
 namespace bexil {
 

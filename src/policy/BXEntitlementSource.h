@@ -7,7 +7,7 @@
 #include <optional>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "model/BXPlugInCore.h"
 
 namespace bexil {

@@ -11,7 +11,7 @@
 #include <string>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "model/BXBundle.h"
 #include "model/BXPlugInCore.h"
 #include "platform/ksn/PrivacyConsent.h"

@@ -17,7 +17,7 @@
 #include <string_view>
 #include <vector>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "model/BXPlugInCore.h"
 #include "platform/types/ActivationRuleEvaluator.h"
 #include "platform/types/TypeRegistry.h"

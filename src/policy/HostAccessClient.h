@@ -11,7 +11,7 @@
 #include <string_view>
 
 #include "base/UniqueFd.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -9,7 +9,7 @@
 #include <cstdint>
 #include <limits>
 
-#include "base/Date.h"
+#include "bexil/Date.h"
 
 namespace bexil {
 namespace {

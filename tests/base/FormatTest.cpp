@@ -8,7 +8,7 @@
 
 #include "base/Error.h"
 #include "base/Format.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 namespace {

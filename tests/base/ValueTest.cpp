@@ -5,7 +5,7 @@
 #include <thread>
 
 #include "TestSupport.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 namespace {

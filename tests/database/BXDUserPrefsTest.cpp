@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "database/BXDUserPrefs.h"
 
 namespace bexil {

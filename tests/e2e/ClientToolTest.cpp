@@ -78,9 +78,9 @@ TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
     EXPECT_NE(bexil("--help").out.find("69 bxd not running"), std::string::npos);
 }
 
-// Guards the installed library: the install holds the tool, its manual and shell completions, the public header (and
-// no private one), the pkg-config and CMake files, and the example application builds with pkg-config alone and
-// talks to bxd.
+// Guards the installed library: the install holds the tool, its manual and shell completions, the public headers
+// (each compiling alone, and no private one), the pkg-config and CMake files, and the example application builds with
+// pkg-config alone and talks to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path prefix = bxd_.root() / "prefix", work = bxd_.root() / "example";
     fs::create_directories(work);
@@ -96,11 +96,17 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
           prefix / "share/bash-completion/completions/bexil", prefix / "share/zsh/vendor-completions/_bexil",
           prefix / "share/fish/vendor_completions.d/bexil.fish"})
         ASSERT_TRUE(fs::exists(installed)) << installed;
+    // Each installed header stands alone on the install tree: nothing of the source tree is on the include path.
     for (const auto& entry : fs::recursive_directory_iterator(prefix / "include")) {
         if (!entry.is_regular_file()) continue;
         std::string text = slurp(entry.path());
         EXPECT_EQ(text.find("asio"), std::string::npos) << entry.path();
+        EXPECT_EQ(text.find("#include \"base/"), std::string::npos) << entry.path();
         EXPECT_EQ(text.find("platform/"), std::string::npos) << entry.path();
+        std::string name = fs::relative(entry.path(), prefix / "include").string();
+        Outcome alone = shell("printf '#include <" + name + ">\\n' | c++ -std=c++20 -fsyntax-only -Wall -Werror -I'" +
+                              (prefix / "include").string() + "' -x c++ -");
+        EXPECT_EQ(alone.status, 0) << name << ": " << alone.err;
     }
 #ifdef __SANITIZE_ADDRESS__
     const std::string extra = "EXTRA_CXXFLAGS='-fsanitize=address,undefined' ";

@@ -26,7 +26,7 @@
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 #include "base/UniqueFd.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 #include "platform/zem/ZemConnection.h"

@@ -6,6 +6,7 @@
 #include <string>
 #include <thread>
 
+#include "base/Error.h"
 #include "bexil/Interface.h"
 #include "platform/log/CaptureSink.h"
 

@@ -7,7 +7,7 @@
 #include <thread>
 #include <vector>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/log/CaptureSink.h"
 #include "platform/log/Log.h"
 #include "platform/log/SystemLogSink.h"

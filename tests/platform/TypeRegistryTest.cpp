@@ -4,7 +4,7 @@
 #include <string>
 
 #include "TestSupport.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/types/ActivationRuleEvaluator.h"
 #include "platform/types/TypeRegistry.h"
 

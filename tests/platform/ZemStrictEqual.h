@@ -8,7 +8,7 @@
 #include <bit>
 #include <cstdint>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil::testing {
 

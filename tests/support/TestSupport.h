@@ -17,7 +17,7 @@
 #include <vector>
 
 #include "base/Document.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil::test {
 

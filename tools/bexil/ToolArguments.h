@@ -10,8 +10,8 @@
 #include <vector>
 
 #include "base/Error.h"
-#include "base/Value.h"
 #include "bexil/Protocol.h"
+#include "bexil/Value.h"
 
 namespace bexil::tool {
 

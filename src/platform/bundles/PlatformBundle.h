@@ -8,7 +8,7 @@
 #include <optional>
 #include <string>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -12,7 +12,7 @@
 #include <string_view>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemPeerCredentials.h"
 
 namespace bexil {

@@ -16,7 +16,7 @@
 #include <string>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

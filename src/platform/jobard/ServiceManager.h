@@ -17,7 +17,7 @@
 #include "base/Error.h"
 #include "base/SerialQueue.h"
 #include "base/UniqueFd.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/runtime/InstanceRecords.h"
 
 namespace bexil {

@@ -12,7 +12,7 @@
 #include <vector>
 
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/ksn/PrivacyConsent.h"
 
 namespace bexil {

@@ -15,7 +15,7 @@
 
 #include "base/ActingAs.h"
 #include "base/Error.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

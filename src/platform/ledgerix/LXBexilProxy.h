@@ -14,7 +14,7 @@
 #include <string>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -11,7 +11,7 @@
 #include <string>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/bundles/DirectoryBundle.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 

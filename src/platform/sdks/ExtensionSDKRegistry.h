@@ -9,7 +9,7 @@
 #include <optional>
 #include <string_view>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -8,7 +8,7 @@
 
 #include <cstddef>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/types/TypeRegistry.h"
 
 namespace bexil {

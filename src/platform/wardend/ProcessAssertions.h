@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/runtime/InstanceRecords.h"
 
 namespace bexil {

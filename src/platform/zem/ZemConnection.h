@@ -15,7 +15,7 @@
 #include <vector>
 
 #include "base/UniqueFd.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemError.h"
 #include "platform/zem/ZemMessage.h"
 #include "platform/zem/ZemPeerCredentials.h"

@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "base/UniqueFd.h"
-#include "base/Value.h"
+#include "bexil/Value.h"
 
 namespace bexil {
 

@@ -13,7 +13,7 @@
 #include <string>
 #include <vector>
 
-#include "base/Value.h"
+#include "bexil/Value.h"
 #include "platform/zem/ZemFrame.h"
 #include "platform/zem/ZemListener.h"
 

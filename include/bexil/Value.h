@@ -16,8 +16,8 @@
 #include <utility>
 #include <vector>
 
-#include "base/Date.h"
-#include "base/Uuid.h"
+#include "bexil/Date.h"
+#include "bexil/Uuid.h"
 
 namespace bexil {
 
