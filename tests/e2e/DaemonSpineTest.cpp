@@ -151,7 +151,8 @@ TEST(BxdService, ASecondDaemonOnTheSameNameFailsAndAStaleSocketIsReplaced) {
 // it is passed.
 TEST(BxdService, FirstConnectionStartsBxdOnTheActivatedSocket) {
     if (access("/usr/bin/systemd-socket-activate", X_OK) != 0) GTEST_SKIP() << "systemd-socket-activate not installed";
-    BxdProcess environment;  // private directories only; bxd is started by the activator
+    // Private directories only, passed on by the activator: the machine's own state is never touched.
+    BxdProcess environment;
     environment.exportEnvironment();
     std::string socketPath = environment.socketPath(), log = (environment.root() / "activated.log").string();
     pid_t activator = fork();
@@ -160,7 +161,8 @@ TEST(BxdService, FirstConnectionStartsBxdOnTheActivatedSocket) {
         std::string listen = "--listen=" + socketPath;
         execl("/usr/bin/systemd-socket-activate", "systemd-socket-activate", listen.c_str(),
               "--fdname=com.quorvel.bexil.bxd", "-E", "BX_LOG_SINK", "-E", "BX_SERVICE_DIR", "-E", "BXD_LOG_LEVEL",
-              BxdProcess::binary().c_str(), nullptr);
+              "-E", "BX_STATE_DIR", "-E", "BX_RUNTIME_DIR", "-E", "BX_ENTITLEMENTS_DIR", BxdProcess::binary().c_str(),
+              nullptr);
         _exit(127);
     }
     for (int i = 0; i < 500 && !std::filesystem::exists(socketPath); ++i)
