@@ -22,5 +22,5 @@ target_include_directories(bexil_asio SYSTEM INTERFACE ${ASIO_INCLUDE_DIR})
 target_compile_definitions(bexil_asio INTERFACE ASIO_STANDALONE ASIO_NO_DEPRECATED)
 target_link_libraries(bexil_asio INTERFACE Threads::Threads)
 find_package(CLI11 CONFIG REQUIRED)
-# JSON for the command-line tool (tools/bexil/JsonText.cpp only): header-only.
+# JSON text of values for the tool and the C interface (src/client/JsonText.cpp only): header-only.
 find_package(nlohmann_json 3.11 CONFIG REQUIRED)

@@ -4,10 +4,10 @@
 
 #include <filesystem>
 
-#include "JsonText.h"
 #include "TestSupport.h"
 #include "ToolArguments.h"
 #include "base/Document.h"
+#include "client/JsonText.h"
 
 namespace bexil::tool {
 namespace {

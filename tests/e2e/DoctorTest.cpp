@@ -6,7 +6,7 @@
 #include <sstream>
 
 #include "E2eSupport.h"
-#include "JsonText.h"
+#include "client/JsonText.h"
 
 namespace bexil {
 namespace {
@@ -41,7 +41,7 @@ TEST_F(DoctorTest, HealthyInstallationPasses) {
 
     Outcome json = bexil("--json doctor");
     EXPECT_EQ(json.status, 0);
-    auto checks = tool::parseJson(json.out);
+    auto checks = parseJson(json.out);
     ASSERT_TRUE(checks) << json.out;
     EXPECT_EQ(checks->count(), 8u);
     for (const Value& check : checks->items()) EXPECT_TRUE(check.get("ok").getBool().value_or(false)) << json.out;
@@ -73,7 +73,7 @@ TEST_F(DoctorTest, BrokenInstallationNamesEachProblem) {
     ASSERT_TRUE(start()) << bxd_.log();
     Outcome json = shell(doctor + "--json doctor");
     EXPECT_EQ(json.status, 78);
-    auto checks = tool::parseJson(json.out);
+    auto checks = parseJson(json.out);
     ASSERT_TRUE(checks) << json.out;
     std::vector<std::string> failed;
     for (const Value& check : checks->items()) {

@@ -9,8 +9,8 @@
 #include <fstream>
 #include <sstream>
 
-#include "JsonText.h"
 #include "base/Document.h"
+#include "client/JsonText.h"
 #include "platform/prefs/PreferencesStore.h"
 
 namespace bexil::tool {

@@ -1,4 +1,4 @@
-#include "JsonText.h"
+#include "client/JsonText.h"
 
 #include <algorithm>
 #include <cstddef>
@@ -11,7 +11,7 @@
 
 #include "base/Text.h"
 
-namespace bexil::tool {
+namespace bexil {
 
 namespace {
 
@@ -224,4 +224,4 @@ std::string toJson(const Value& value, JsonLayout layout) {
                                  ordered_json::error_handler_t::replace);
 }
 
-}  // namespace bexil::tool
+}  // namespace bexil
