@@ -79,22 +79,22 @@ TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
 }
 
 // Guards the installed library: the install holds the tool, its manual and shell completions, the public headers
-// (each compiling alone, and no private one), the pkg-config and CMake files, and the example application builds with
-// pkg-config alone and talks to bxd.
+// (each compiling alone, and no private one), the manual of the C interface, the pkg-config and CMake files, and the
+// example applications, in C++ and in C99, build with pkg-config alone and talk to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path prefix = bxd_.root() / "prefix", work = bxd_.root() / "example";
     fs::create_directories(work);
-    for (const char* file : {"list-plugins.cpp", "Makefile"})
+    for (const char* file : {"list-plugins.cpp", "list-plugins.c", "Makefile"})
         fs::copy(fs::path(BEXIL_SOURCE_DIR) / "examples/client" / file, work);
     Outcome install =
         shell("cmake --install '" + std::string(BEXIL_BINARY_DIR) + "' --prefix '" + prefix.string() + "'");
     ASSERT_EQ(install.status, 0) << install.err;
     fs::path libdir = fs::exists(prefix / "lib/pkgconfig/bexil.pc") ? prefix / "lib" : prefix / "lib64";
     for (const fs::path& installed :
-         {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h", prefix / "bin/bexil",
-          prefix / "share/man/man1/bexil.1", libdir / "cmake/Bexil/BexilConfig.cmake",
-          prefix / "share/bash-completion/completions/bexil", prefix / "share/zsh/vendor-completions/_bexil",
-          prefix / "share/fish/vendor_completions.d/bexil.fish"})
+         {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h", prefix / "include/bexil/bexil-c.h",
+          prefix / "share/man/man3/bexil-c.3", prefix / "bin/bexil", prefix / "share/man/man1/bexil.1",
+          libdir / "cmake/Bexil/BexilConfig.cmake", prefix / "share/bash-completion/completions/bexil",
+          prefix / "share/zsh/vendor-completions/_bexil", prefix / "share/fish/vendor_completions.d/bexil.fish"})
         ASSERT_TRUE(fs::exists(installed)) << installed;
     // Each installed header stands alone on the install tree: nothing of the source tree is on the include path.
     for (const auto& entry : fs::recursive_directory_iterator(prefix / "include")) {
@@ -109,7 +109,8 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
         EXPECT_EQ(alone.status, 0) << name << ": " << alone.err;
     }
 #ifdef __SANITIZE_ADDRESS__
-    const std::string extra = "EXTRA_CXXFLAGS='-fsanitize=address,undefined' ";
+    const std::string extra =
+        "EXTRA_CXXFLAGS='-fsanitize=address,undefined' EXTRA_CFLAGS='-fsanitize=address,undefined' ";
 #else
     const std::string extra;
 #endif
@@ -117,16 +118,23 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
         shell("cd '" + work.string() + "' && PKG_CONFIG_PATH='" + (libdir / "pkgconfig").string() + "' make " + extra);
     ASSERT_EQ(build.status, 0) << build.out << build.err;
 
-    std::string run = "LD_LIBRARY_PATH='" + libdir.string() + "' '" + (work / "list-plugins").string() + "'";
-    Outcome offline = shell(run);
-    EXPECT_EQ(offline.status, 1) << offline.out << offline.err;
-    EXPECT_NE(offline.out.find("bxd is not reachable"), std::string::npos) << offline.out;
+    const std::string run = "LD_LIBRARY_PATH='" + libdir.string() + "' '" + (work / "list-plugins").string() + "'";
+    const std::string runC = "LD_LIBRARY_PATH='" + libdir.string() + "' '" + (work / "list-plugins-c").string() + "'";
+    for (const std::string& program : {run, runC}) {
+        Outcome offline = shell(program);
+        EXPECT_EQ(offline.status, 1) << offline.out << offline.err;
+        EXPECT_NE(offline.out.find("bxd is not reachable"), std::string::npos) << offline.out;
+    }
 
     ASSERT_TRUE(start());
     Outcome online = shell(run);
     EXPECT_EQ(online.status, 0) << online.out << online.err;
     EXPECT_NE(online.out.find("libbexil 0.1.0"), std::string::npos) << online.out;
     EXPECT_NE(online.out.find("match: 0 plug-ins"), std::string::npos) << "nothing is registered" << online.out;
+    Outcome onlineC = shell(runC);
+    EXPECT_EQ(onlineC.status, 0) << onlineC.out << onlineC.err;
+    EXPECT_NE(onlineC.out.find("libbexil 0.1.0 (C)"), std::string::npos) << onlineC.out;
+    EXPECT_NE(onlineC.out.find("\"matches\":[]"), std::string::npos) << "nothing is registered" << onlineC.out;
 }
 
 }  // namespace
