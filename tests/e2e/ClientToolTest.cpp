@@ -79,8 +79,8 @@ TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
 }
 
 // Guards the installed library: the install holds the tool, its manual and shell completions, the public headers
-// (each compiling alone, and no private one), the manual of the C interface, the pkg-config and CMake files, and the
-// example applications, in C++ and in C99, build with pkg-config alone and talk to bxd.
+// (each compiling alone, and no private one), the manual of the C interface, the pkg-config and CMake files, the
+// Python module, and the example applications, in C++ and in C99, build with pkg-config alone and talk to bxd.
 TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path prefix = bxd_.root() / "prefix", work = bxd_.root() / "example";
     fs::create_directories(work);
@@ -92,9 +92,10 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     fs::path libdir = fs::exists(prefix / "lib/pkgconfig/bexil.pc") ? prefix / "lib" : prefix / "lib64";
     for (const fs::path& installed :
          {libdir / "pkgconfig/bexil.pc", prefix / "include/bexil/bexil.h", prefix / "include/bexil/bexil-c.h",
-          prefix / "share/man/man3/bexil-c.3", prefix / "bin/bexil", prefix / "share/man/man1/bexil.1",
-          libdir / "cmake/Bexil/BexilConfig.cmake", prefix / "share/bash-completion/completions/bexil",
-          prefix / "share/zsh/vendor-completions/_bexil", prefix / "share/fish/vendor_completions.d/bexil.fish"})
+          prefix / "share/man/man3/bexil-c.3", prefix / "lib/python3/dist-packages/bexil/__init__.py",
+          prefix / "bin/bexil", prefix / "share/man/man1/bexil.1", libdir / "cmake/Bexil/BexilConfig.cmake",
+          prefix / "share/bash-completion/completions/bexil", prefix / "share/zsh/vendor-completions/_bexil",
+          prefix / "share/fish/vendor_completions.d/bexil.fish"})
         ASSERT_TRUE(fs::exists(installed)) << installed;
     // Each installed header stands alone on the install tree: nothing of the source tree is on the include path.
     for (const auto& entry : fs::recursive_directory_iterator(prefix / "include")) {
@@ -135,6 +136,14 @@ TEST_F(ClientToolTest, InstalledLibraryBuildsAndRunsTheExample) {
     EXPECT_EQ(onlineC.status, 0) << onlineC.out << onlineC.err;
     EXPECT_NE(onlineC.out.find("libbexil 0.1.0 (C)"), std::string::npos) << onlineC.out;
     EXPECT_NE(onlineC.out.find("\"matches\":[]"), std::string::npos) << "nothing is registered" << onlineC.out;
+#ifndef __SANITIZE_ADDRESS__
+    // The installed Python module runs the Python example (python3 cannot load a library built with the sanitizers).
+    Outcome python =
+        shell("PYTHONPATH='" + (prefix / "lib/python3/dist-packages").string() + "' LD_LIBRARY_PATH='" +
+              libdir.string() + "' /usr/bin/python3 -B '" BEXIL_SOURCE_DIR "/examples/python/list_plugins.py'");
+    EXPECT_EQ(python.status, 0) << python.out << python.err;
+    EXPECT_NE(python.out.find("match: 0 plug-ins"), std::string::npos) << python.out;
+#endif
 }
 
 }  // namespace
