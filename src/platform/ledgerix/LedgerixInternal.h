@@ -69,6 +69,9 @@ enum class OpenCheck { Light, Full };
 // Opens (creating when needed) and configures the store at `path`, checks it as `check` says and migrates its
 // schema to kSchemaVersion, through the VFS that `options` names.
 Opened openStore(const std::string& path, const LedgerixWorkspace::Options& options, OpenCheck check);
+// A second connection to the store that openStore opened (and so checked and migrated) at `path`, for look-ups
+// only: it refuses to write.
+Opened openLookupConnection(const std::string& path, const LedgerixWorkspace::Options& options);
 // Moves a damaged database and its companions aside; the error when that is impossible.
 std::optional<Error> quarantine(const std::string& path, std::string* movedTo);
 

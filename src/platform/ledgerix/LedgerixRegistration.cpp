@@ -135,19 +135,20 @@ std::optional<Error> LedgerixWorkspace::makeContainer(const std::string& path) {
 
 std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid& uuid, double registered,
                                                      std::optional<int64_t> replacedApplication) {
-    if (!exec(db_, "BEGIN IMMEDIATE")) return failure("begin a registration");
+    if (!exec(store_.db, "BEGIN IMMEDIATE")) return failure(store_, "begin a registration");
     auto rollback = [&](std::string_view what) {
-        Error error = failure(what);
-        exec(db_, "ROLLBACK");
+        Error error = failure(store_, what);
+        exec(store_.db, "ROLLBACK");
         return error;
     };
 
     std::optional<int64_t> applicationId;
     if (row.appPath) {
-        std::shared_ptr<Statement> stmt = statement(
-            "INSERT INTO applications(path, identifier, name, placeholder) VALUES(?, ?, ?, ?) "
-            "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, name = excluded.name, "
-            "placeholder = excluded.placeholder RETURNING id");
+        std::shared_ptr<Statement> stmt =
+            statement(store_,
+                      "INSERT INTO applications(path, identifier, name, placeholder) VALUES(?, ?, ?, ?) "
+                      "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, name = excluded.name, "
+                      "placeholder = excluded.placeholder RETURNING id");
         if (!stmt) return rollback("prepare the application record");
         StatementUse use(stmt->get());
         use.bind(1, row.appPath);
@@ -161,17 +162,18 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
         }
     }
     {
-        std::shared_ptr<Statement> stmt = statement("DELETE FROM plugins WHERE path = ?");
+        std::shared_ptr<Statement> stmt = statement(store_, "DELETE FROM plugins WHERE path = ?");
         if (!stmt) return rollback("prepare the removal of the old record");
         StatementUse use(stmt->get());
         use.bind(1, std::string_view(row.path));
         if (use.step() != SQLITE_DONE) return rollback("remove the old record");
     }
     {
-        std::shared_ptr<Statement> stmt = statement(
-            "INSERT INTO plugins(uuid, path, identifier, identifier_key, bundle_identifier, bundle_version, "
-            "point_key, point_wild, application_id, system, registered, container, name, short_name, info, "
-            "entitlements) VALUES(?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
+        std::shared_ptr<Statement> stmt =
+            statement(store_,
+                      "INSERT INTO plugins(uuid, path, identifier, identifier_key, bundle_identifier, bundle_version, "
+                      "point_key, point_wild, application_id, system, registered, container, name, short_name, info, "
+                      "entitlements) VALUES(?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
         if (!stmt) return rollback("prepare the plug-in record");
         StatementUse use(stmt->get());
         use.bind(1, uuid);
@@ -194,21 +196,22 @@ std::optional<Error> LedgerixWorkspace::commitLocked(const Row& row, const Uuid&
     }
     if (replacedApplication && replacedApplication != applicationId) {
         if (std::optional<Error> error = dropApplicationIfEmptyLocked(*replacedApplication)) {
-            exec(db_, "ROLLBACK");
+            exec(store_.db, "ROLLBACK");
             return error;
         }
     }
-    if (!exec(db_, "COMMIT")) return rollback("commit a registration");
+    if (!exec(store_.db, "COMMIT")) return rollback("commit a registration");
     return std::nullopt;
 }
 
 std::optional<Error> LedgerixWorkspace::dropApplicationIfEmptyLocked(int64_t applicationId) {
     std::shared_ptr<Statement> stmt = statement(
+        store_,
         "DELETE FROM applications WHERE id = ?1 AND NOT EXISTS (SELECT 1 FROM plugins WHERE application_id = ?1)");
-    if (!stmt) return failure("prepare the removal of an empty application");
+    if (!stmt) return failure(store_, "prepare the removal of an empty application");
     StatementUse use(stmt->get());
     use.bind(1, applicationId);
-    if (use.step() != SQLITE_DONE) return failure("remove an empty application");
+    if (use.step() != SQLITE_DONE) return failure(store_, "remove an empty application");
     return std::nullopt;
 }
 
@@ -239,10 +242,10 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
 
     std::vector<Uuid> announced;
     for (;;) {
-        std::unique_lock lock(mutex_);
+        std::unique_lock lock(store_.mutex);
         bool failed = false;
-        std::optional<Row> old = rowAtPathLocked(candidate.path, &failed);
-        if (failed) return failure("read the current record");
+        std::optional<Row> old = rowAtPathLocked(store_, candidate.path, &failed);
+        if (failed) return failure(store_, "read the current record");
         if (old && old->sameBundleAs(candidate)) {
             lock.unlock();
             log::lx().debug("%s is registered unchanged as %@", candidate.path, old->uuid);
@@ -262,8 +265,8 @@ Result<std::shared_ptr<const LXBexilProxy>> LedgerixWorkspace::registerPlugin(st
         if (std::optional<Error> error =
                 commitLocked(candidate, uuid, Date::now().secondsSince1970, old ? old->applicationId : std::nullopt))
             return *error;
-        std::optional<Row> stored = rowAtPathLocked(candidate.path, &failed);
-        if (!stored) return failure("read the new record back");
+        std::optional<Row> stored = rowAtPathLocked(store_, candidate.path, &failed);
+        if (!stored) return failure(store_, "read the new record back");
         lock.unlock();
         std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(*stored);
         log::lx().debug("registered %@", proxy);
@@ -276,12 +279,12 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
     std::vector<std::string> paths = candidatePaths(url);
     std::vector<Uuid> announced;
     for (;;) {
-        std::unique_lock lock(mutex_);
+        std::unique_lock lock(store_.mutex);
         std::optional<Row> row;
         for (const std::string& path : paths) {
             bool failed = false;
-            row = rowAtPathLocked(path, &failed);
-            if (failed) return failure("read the current record");
+            row = rowAtPathLocked(store_, path, &failed);
+            if (failed) return failure(store_, "read the current record");
             if (row) break;
         }
         if (!row) {
@@ -295,8 +298,8 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
             notifyObservers(Change::Uninstalled, {proxyFromRow(*row)});
             continue;
         }
-        if (!exec(db_, "BEGIN IMMEDIATE")) return failure("begin an unregistration");
-        std::shared_ptr<Statement> stmt = statement("DELETE FROM plugins WHERE uuid = ?");
+        if (!exec(store_.db, "BEGIN IMMEDIATE")) return failure(store_, "begin an unregistration");
+        std::shared_ptr<Statement> stmt = statement(store_, "DELETE FROM plugins WHERE uuid = ?");
         bool deleted = false;
         if (stmt) {
             StatementUse use(stmt->get());
@@ -304,19 +307,19 @@ std::optional<Error> LedgerixWorkspace::unregisterPlugin(std::string_view url) {
             deleted = use.step() == SQLITE_DONE;
         }
         if (!deleted) {
-            Error error = failure("remove a plug-in record");
-            exec(db_, "ROLLBACK");
+            Error error = failure(store_, "remove a plug-in record");
+            exec(store_.db, "ROLLBACK");
             return error;
         }
         if (row->applicationId) {
             if (std::optional<Error> error = dropApplicationIfEmptyLocked(*row->applicationId)) {
-                exec(db_, "ROLLBACK");
+                exec(store_.db, "ROLLBACK");
                 return error;
             }
         }
-        if (!exec(db_, "COMMIT")) {
-            Error error = failure("commit an unregistration");
-            exec(db_, "ROLLBACK");
+        if (!exec(store_.db, "COMMIT")) {
+            Error error = failure(store_, "commit an unregistration");
+            exec(store_.db, "ROLLBACK");
             return error;
         }
         lock.unlock();

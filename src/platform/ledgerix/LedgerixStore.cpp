@@ -268,6 +268,24 @@ Opened openStore(const std::string& path, const LedgerixWorkspace::Options& opti
     return Opened{db, std::nullopt, false};
 }
 
+Opened openLookupConnection(const std::string& path, const LedgerixWorkspace::Options& options) {
+    sqlite3* db = nullptr;
+    int rc = sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX,
+                             options.storeVfs.empty() ? nullptr : options.storeVfs.c_str());
+    if (rc == SQLITE_OK) {
+        sqlite3_extended_result_codes(db, 1);
+        sqlite3_busy_timeout(db, 5000);
+        // The log mode is recorded in the file, so this connection is in it already; query_only keeps it a reader.
+        if (!exec(db, "PRAGMA query_only=ON")) rc = sqlite3_errcode(db);
+    }
+    if (rc != SQLITE_OK) {
+        Opened failure = failedTo(db, "open the database for look-ups", rc);
+        sqlite3_close(db);
+        return failure;
+    }
+    return Opened{db, std::nullopt, false};
+}
+
 std::optional<Error> quarantine(const std::string& path, std::string* movedTo) {
     *movedTo = formatPrintf("%s.corrupt-%lld", path, static_cast<long long>(::time(nullptr)));
     for (std::string_view suffix : {"", "-wal", "-shm"}) {

@@ -1,5 +1,7 @@
-// The registry keeps one SQLite connection and serialises every use of it with mutex_. Registrations are rare and
-// look-ups cheap, so a single connection is enough; the point of the store is durability, not parallel reads.
+// The registry keeps two SQLite connections, each serialised by its own mutex: store_ for changes and lookups_ for
+// everything that only reads. A commit syncs the log while holding store_'s mutex; with one connection every look-up
+// of the daemon waited for that sync. In write-ahead-log mode a reader on the other connection sees every commit
+// that finished before its statement began and never waits for the writer, so look-ups stay as cheap as they were.
 //
 // A change (register, re-register, unregister) runs in three steps so that observers are told about an uninstall
 // before it happens without the registry holding its lock while they run: read what is at the path (locked),
@@ -62,11 +64,18 @@ Result<std::shared_ptr<LedgerixWorkspace>> LedgerixWorkspace::open(Options optio
     }
     if (!opened.db) return *opened.error;
     if (suspect) fs::remove(marker, ec);
-    return std::make_shared<LedgerixWorkspace>(std::move(options), opened.db, Private{});
+    Opened lookups = openLookupConnection(path, options);
+    if (!lookups.db) {
+        sqlite3_close(opened.db);
+        return *lookups.error;
+    }
+    return std::make_shared<LedgerixWorkspace>(std::move(options), opened.db, lookups.db, Private{});
 }
 
-LedgerixWorkspace::LedgerixWorkspace(Options options, sqlite3* db, const Private&)
-    : options_(std::move(options)), databasePath_(options_.stateDirectory / kDatabaseFileName), db_(db) {
+LedgerixWorkspace::LedgerixWorkspace(Options options, sqlite3* db, sqlite3* lookupDb, const Private&)
+    : options_(std::move(options)), databasePath_(options_.stateDirectory / kDatabaseFileName) {
+    store_.db = db;
+    lookups_.db = lookupDb;
     fs::path root = options_.rootDirectory.empty() ? fs::path("/") : options_.rootDirectory;
     std::string rootText = realPath(root.string()).value_or(root.lexically_normal().string());
     while (!rootText.empty() && rootText.back() == '/') rootText.pop_back();
@@ -74,28 +83,32 @@ LedgerixWorkspace::LedgerixWorkspace(Options options, sqlite3* db, const Private
 }
 
 LedgerixWorkspace::~LedgerixWorkspace() {
-    statements_.clear();
-    sqlite3_close(db_);
+    lookups_.statements.clear();
+    sqlite3_close(lookups_.db);
+    store_.statements.clear();
+    // The last connection to close checkpoints the log into the database.
+    sqlite3_close(store_.db);
 }
 
-std::shared_ptr<LedgerixWorkspace::Statement> LedgerixWorkspace::statement(const std::string& sql) {
-    for (const std::shared_ptr<Statement>& cached : statements_) {
+std::shared_ptr<LedgerixWorkspace::Statement> LedgerixWorkspace::statement(Connection& connection,
+                                                                           const std::string& sql) {
+    for (const std::shared_ptr<Statement>& cached : connection.statements) {
         if (cached->sql() == sql) return cached;
     }
-    if (statements_.size() >= kMaxCachedStatements) statements_.clear();
+    if (connection.statements.size() >= kMaxCachedStatements) connection.statements.clear();
     sqlite3_stmt* stmt = nullptr;
-    if (sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT, &stmt, nullptr) !=
-        SQLITE_OK) {
-        failure("prepare a statement");
+    if (sqlite3_prepare_v3(connection.db, sql.c_str(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT, &stmt,
+                           nullptr) != SQLITE_OK) {
+        failure(connection, "prepare a statement");
         return nullptr;
     }
-    statements_.push_back(std::make_shared<Statement>(sql, stmt));
-    return statements_.back();
+    connection.statements.push_back(std::make_shared<Statement>(sql, stmt));
+    return connection.statements.back();
 }
 
-Error LedgerixWorkspace::failure(std::string_view what) {
-    int code = sqlite3_extended_errcode(db_);
-    Error error = storeError(db_, what);
+Error LedgerixWorkspace::failure(Connection& connection, std::string_view what) {
+    int code = sqlite3_extended_errcode(connection.db);
+    Error error = storeError(connection.db, what);
     if (isDamage(code)) {
         // The file is damaged somewhere a light open check does not look; make the next open check every page.
         std::ofstream(databasePath_.string() + std::string(kNeedsCheckSuffix)) << "damage seen: " << what << "\n";
@@ -106,9 +119,11 @@ Error LedgerixWorkspace::failure(std::string_view what) {
 }
 
 void LedgerixWorkspace::LXClearSchemaCaches() {
-    std::lock_guard lock(mutex_);
-    statements_.clear();
-    sqlite3_db_release_memory(db_);
+    for (Connection* connection : {&store_, &lookups_}) {
+        std::lock_guard lock(connection->mutex);
+        connection->statements.clear();
+        sqlite3_db_release_memory(connection->db);
+    }
 }
 
 // ---- Reading rows ----
@@ -146,14 +161,15 @@ void readRowColumns(const StatementUse& use, LedgerixWorkspace::Row& row) {
 }  // namespace
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRowsLocked(
-    std::string_view where, const std::vector<std::string>& arguments, std::optional<int64_t> integerArgument) {
+    Connection& connection, std::string_view where, const std::vector<std::string>& arguments,
+    std::optional<int64_t> integerArgument) {
     std::string sql(kSelectRow);
     if (!where.empty()) {
         sql += " WHERE ";
         sql += where;
     }
     sql += " ORDER BY p.id";
-    std::shared_ptr<Statement> stmt = statement(sql);
+    std::shared_ptr<Statement> stmt = statement(connection, sql);
     if (!stmt) return std::nullopt;
     StatementUse use(stmt->get());
     int index = 1;
@@ -171,7 +187,7 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
         }
     }
     if (rc != SQLITE_DONE) {
-        failure("read plug-in records");
+        failure(connection, "read plug-in records");
         return std::nullopt;
     }
     return rows;
@@ -179,8 +195,8 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows(
     std::string_view where, const std::vector<std::string>& arguments, std::optional<int64_t> integerArgument) {
-    std::lock_guard lock(mutex_);
-    return selectRowsLocked(where, arguments, integerArgument);
+    std::lock_guard lock(lookups_.mutex);
+    return selectRowsLocked(lookups_, where, arguments, integerArgument);
 }
 
 std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationFromRow(const Row& row) {
@@ -228,8 +244,9 @@ LXProxyList LedgerixWorkspace::plugInsOfApplication(int64_t applicationId) {
     return proxiesFromRows(*rows);
 }
 
-std::optional<LedgerixWorkspace::Row> LedgerixWorkspace::rowAtPathLocked(const std::string& path, bool* failed) {
-    std::optional<std::vector<Row>> rows = selectRowsLocked("p.path = ?", {path}, std::nullopt);
+std::optional<LedgerixWorkspace::Row> LedgerixWorkspace::rowAtPathLocked(Connection& connection,
+                                                                         const std::string& path, bool* failed) {
+    std::optional<std::vector<Row>> rows = selectRowsLocked(connection, "p.path = ?", {path}, std::nullopt);
     if (!rows) {
         if (failed) *failed = true;
         return std::nullopt;
@@ -252,8 +269,8 @@ std::vector<std::string> LedgerixWorkspace::candidatePaths(std::string_view url)
 std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::plugInProxyForUUID(const Uuid& uuid) {
     std::optional<Row> found;
     {
-        std::lock_guard lock(mutex_);
-        std::shared_ptr<Statement> stmt = statement(std::string(kSelectRow) + " WHERE p.uuid = ?");
+        std::lock_guard lock(lookups_.mutex);
+        std::shared_ptr<Statement> stmt = statement(lookups_, std::string(kSelectRow) + " WHERE p.uuid = ?");
         if (!stmt) return nullptr;
         StatementUse use(stmt->get());
         use.bind(1, uuid);
@@ -262,7 +279,7 @@ std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::plugInProxyForUUID(const 
             found.emplace();
             readRowColumns(use, *found);
         } else if (rc != SQLITE_DONE) {
-            failure("look a plug-in up by UUID");
+            failure(lookups_, "look a plug-in up by UUID");
         }
     }
     if (!found) {
@@ -276,8 +293,8 @@ std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::plugInProxyForURL(std::st
     for (const std::string& path : candidatePaths(url)) {
         std::optional<Row> row;
         {
-            std::lock_guard lock(mutex_);
-            row = rowAtPathLocked(path, nullptr);
+            std::lock_guard lock(lookups_.mutex);
+            row = rowAtPathLocked(lookups_, path, nullptr);
         }
         if (row) return proxyFromRow(*row);
     }
@@ -290,9 +307,9 @@ std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationProxyFor
         std::optional<LXApplicationProxy::Fields> fields;
         int64_t applicationId = 0;
         {
-            std::lock_guard lock(mutex_);
+            std::lock_guard lock(lookups_.mutex);
             std::shared_ptr<Statement> stmt =
-                statement("SELECT id, path, identifier, name, placeholder FROM applications WHERE path = ?");
+                statement(lookups_, "SELECT id, path, identifier, name, placeholder FROM applications WHERE path = ?");
             if (!stmt) return nullptr;
             StatementUse use(stmt->get());
             use.bind(1, std::string_view(path));
@@ -302,7 +319,7 @@ std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationProxyFor
                 fields = LXApplicationProxy::Fields{use.text(1).value_or(path), use.text(2), use.text(3),
                                                     use.integer(4) != 0};
             } else if (rc != SQLITE_DONE) {
-                failure("look an application up");
+                failure(lookups_, "look an application up");
                 return nullptr;
             }
         }
@@ -362,12 +379,12 @@ std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(co
 }
 
 std::optional<size_t> LedgerixWorkspace::plugInCount() {
-    std::lock_guard lock(mutex_);
-    std::shared_ptr<Statement> stmt = statement("SELECT count(*) FROM plugins");
+    std::lock_guard lock(lookups_.mutex);
+    std::shared_ptr<Statement> stmt = statement(lookups_, "SELECT count(*) FROM plugins");
     if (!stmt) return std::nullopt;
     StatementUse use(stmt->get());
     if (use.step() != SQLITE_ROW) {
-        failure("count plug-ins");
+        failure(lookups_, "count plug-ins");
         return std::nullopt;
     }
     return static_cast<size_t>(use.integer(0));
@@ -375,25 +392,25 @@ std::optional<size_t> LedgerixWorkspace::plugInCount() {
 
 std::optional<Error> LedgerixWorkspace::checkIntegrity() {
     {
-        std::lock_guard lock(mutex_);
+        std::lock_guard lock(lookups_.mutex);
         sqlite3_stmt* stmt = nullptr;
-        if (sqlite3_prepare_v2(db_, "PRAGMA integrity_check", -1, &stmt, nullptr) != SQLITE_OK)
-            return failure("run the integrity check");
+        if (sqlite3_prepare_v2(lookups_.db, "PRAGMA integrity_check", -1, &stmt, nullptr) != SQLITE_OK)
+            return failure(lookups_, "run the integrity check");
         std::string verdict;
         int rc;
         while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
             if (verdict.empty()) verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0));
         }
         sqlite3_finalize(stmt);
-        if (rc != SQLITE_DONE) return failure("run the integrity check");
+        if (rc != SQLITE_DONE) return failure(lookups_, "run the integrity check");
         if (verdict != "ok") return lxError(kLXStoreFailure, "registry integrity check failed: " + verdict);
     }
     std::optional<std::vector<Row>> rows;
     {
-        std::lock_guard lock(mutex_);
-        rows = selectRowsLocked("", {}, std::nullopt);
-        std::shared_ptr<Statement> stmt = statement("SELECT count(*) FROM plugins");
-        if (!rows || !stmt) return failure("read every plug-in record");
+        std::lock_guard lock(lookups_.mutex);
+        rows = selectRowsLocked(lookups_, "", {}, std::nullopt);
+        std::shared_ptr<Statement> stmt = statement(lookups_, "SELECT count(*) FROM plugins");
+        if (!rows || !stmt) return failure(lookups_, "read every plug-in record");
         StatementUse use(stmt->get());
         if (use.step() != SQLITE_ROW || static_cast<size_t>(use.integer(0)) != rows->size())
             return lxError(kLXStoreFailure, "registry holds plug-in rows that cannot be read");

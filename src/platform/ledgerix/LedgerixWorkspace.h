@@ -1,8 +1,9 @@
 #pragma once
 
 // LedgerixWorkspace is the application registry over one SQLite database in the state directory (see
-// docs/ledgerix.md for the file, its schema and what survives a crash). It owns the database handle; one internal
-// mutex serialises every use of it, and is never held while an observer or a query filter runs. Records are read
+// docs/ledgerix.md for the file, its schema and what survives a crash). It owns two handles on the database, one for
+// changes and one for look-ups, each serialised by a mutex of its own that is never held while an observer or a
+// query filter runs. Records are read
 // one row at a time when asked for; opening a large registry reads nothing but the schema.
 
 #include <filesystem>
@@ -80,23 +81,33 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
 
     // Use open(); public only for make_shared.
     struct Private;
-    LedgerixWorkspace(Options options, sqlite3* db, const Private&);
+    LedgerixWorkspace(Options options, sqlite3* db, sqlite3* lookupDb, const Private&);
     // The columns of one stored record; defined and used only by the implementation.
     struct Row;
 
   private:
     class Statement;
 
+    // One SQLite connection with the mutex that serialises its use and its cache of prepared statements.
+    struct Connection {
+        std::mutex mutex;
+        sqlite3* db = nullptr;
+        std::vector<std::shared_ptr<Statement>> statements;
+    };
+
     // The error of a failed store operation (logged); damage it reveals marks the file for a full check at next open.
-    Error failure(std::string_view what);
-    // REQUIRES: mutex_ held, for every member whose name ends in Locked, for statement() and failure().
-    std::shared_ptr<Statement> statement(const std::string& sql);
-    std::optional<std::vector<Row>> selectRowsLocked(std::string_view where, const std::vector<std::string>& arguments,
+    Error failure(Connection& connection, std::string_view what);
+    // REQUIRES: the connection's mutex held, for every member whose name ends in Locked, for statement() and
+    // failure().
+    std::shared_ptr<Statement> statement(Connection& connection, const std::string& sql);
+    std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
+                                                     const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument);
+    // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument);
     // The record at exactly this path; none when there is none or the store failed (then *failed is set).
-    std::optional<Row> rowAtPathLocked(const std::string& path, bool* failed);
+    std::optional<Row> rowAtPathLocked(Connection& connection, const std::string& path, bool* failed);
     std::optional<Error> commitLocked(const Row& row, const Uuid& uuid, double registered,
                                       std::optional<int64_t> replacedApplication);
     std::optional<Error> dropApplicationIfEmptyLocked(int64_t applicationId);
@@ -116,10 +127,10 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
 
     const Options options_;
     const std::filesystem::path databasePath_;
-    // Serialises every use of db_ and of the statement cache.
-    std::mutex mutex_;
-    sqlite3* db_;
-    std::vector<std::shared_ptr<Statement>> statements_;
+    // Changes go through one connection and look-ups through another, so that a look-up never waits while a
+    // commit syncs the log: in write-ahead-log mode a reader sees the last commit without taking the writer's lock.
+    Connection store_;
+    Connection lookups_;
     // Bundles whose real path begins with this lie on the system volume ("/System/" unless tests move the root).
     std::string systemPrefix_;
     std::mutex observersMutex_;
