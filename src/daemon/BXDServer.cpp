@@ -33,6 +33,10 @@ BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
 
 BXDServer::~BXDServer() {
     if (service_) service_->cancel();
+    // What the writer still has queued may call back into the server (as the database's delegate): let it finish
+    // while the server is whole.
+    waitForWriter();
+    setDelegate(nullptr);
     BXDServer* self = this;
     runningServer.compare_exchange_strong(self, nullptr);
 }

@@ -79,13 +79,28 @@ void BXDZemClient::handleEvent(const ZemConnection::Event& event) {
     if (trace::requestInputEnabled()) trace::requestInput(static_cast<int>(pid()), message.description().c_str());
 
     auto transaction = std::make_shared<Transaction>(message, shared_from_this());
-    server_->submitWork([transaction] {
-        BXDZemClient& client = *transaction->client();
-        unsigned count = ++client.requestCount_;
-        if (count % kRequestCountLogInterval == 0)
-            log::ops().debug("client %d used %u requests so far", static_cast<int>(client.pid()), count);
-        transaction->dispatch();
-    });
+    server_->submitWork([transaction] { transaction->client()->run(transaction); });
+}
+
+void BXDZemClient::run(const std::shared_ptr<Transaction>& transaction) {
+    if (writing_) {
+        waiting_.push_back(transaction);
+        return;
+    }
+    unsigned count = ++requestCount_;
+    if (count % kRequestCountLogInterval == 0)
+        log::ops().debug("client %d used %u requests so far", static_cast<int>(pid()), count);
+    transaction->dispatch();
+}
+
+void BXDZemClient::endWrite() {
+    writing_ = false;
+    // A request run here may begin a write of its own; the rest wait for that one in turn.
+    while (!writing_ && !waiting_.empty()) {
+        std::shared_ptr<Transaction> next = std::move(waiting_.front());
+        waiting_.pop_front();
+        run(next);
+    }
 }
 
 void BXDZemClient::dying() { log::ops().debug("client %d termination imminent", static_cast<int>(pid())); }

@@ -3,11 +3,13 @@
 // The daemon's view of one connected peer: who it is (pid, executable, bundle, code-signing identity and its
 // entitlements) and the bridge from its connection to the request queue. Made by the server for each accepted
 // connection and owned by that connection (as its context) and by the client's pending transactions. Connection
-// events run on the connection's queue; requestCount is touched only on the request queue.
+// events run on the connection's queue; requestCount and the requests waiting behind a write are touched only on
+// the request queue.
 
 #include <sys/types.h>
 
 #include <atomic>
+#include <deque>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -22,6 +24,7 @@ namespace bexil {
 class BXBundle;
 class BXDServer;
 class CodeSigningIdentity;
+class Transaction;
 
 class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public HostAccessClient {
   public:
@@ -64,10 +67,18 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }
     unsigned requestCount() const { return requestCount_; }
 
+    // A request of this client is waiting for the disk (see Transaction::holdReply): the client's later requests
+    // wait for its reply, so that each of them still sees what the ones before it did. REQUIRES: on the request
+    // queue, as does endWrite, which runs the requests that waited, in order.
+    void beginWrite() { writing_ = true; }
+    void endWrite();
+
   private:
     BXDZemClient(const std::shared_ptr<ZemConnection>& connection, BXDServer* server);
     void start();
     void handleEvent(const ZemConnection::Event& event);
+    // Dispatches `transaction`, or keeps it for endWrite while a write of this client is pending.
+    void run(const std::shared_ptr<Transaction>& transaction);
 
     std::weak_ptr<ZemConnection> connection_;
     BXDServer* server_;
@@ -76,7 +87,9 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     std::atomic<bool> acceptWork_{true};
     std::atomic<bool> deathNoted_{false};
     std::shared_ptr<const CodeSigningIdentity> codeSigningIdentity_;
-    unsigned requestCount_ = 0;  // request queue only
+    unsigned requestCount_ = 0;                         // request queue only
+    bool writing_ = false;                              // request queue only
+    std::deque<std::shared_ptr<Transaction>> waiting_;  // request queue only
 };
 
 }  // namespace bexil

@@ -108,21 +108,60 @@ void Transaction::dispatch() {
 }
 
 void Transaction::runHandler(Request request) {
-    const HandlerEntry& entry = kHandlers[static_cast<size_t>(request)];
+    handling_ = request;
+    guarded([this, request] { (this->*kHandlers[static_cast<size_t>(request)].handler)(); });
+}
+
+void Transaction::guarded(const std::function<void()>& step) {
     try {
-        (this->*entry.handler)();
+        step();
     } catch (const InternalInconsistency& broken) {
         // One bad record must not take the daemon down for every client: this request fails, the rest go on.
-        log::ops().fault("internal inconsistency while handling %{public}s: %s", protocol::nameOf(request).data(),
+        log::ops().fault("internal inconsistency while handling %{public}s: %s", protocol::nameOf(handling_).data(),
                          broken.what());
         if (!answered()) fail(ErrorCode::OperationFailed, broken.what());
     } catch (...) {
         // Anything else that escapes a handler (an allocation failure, a library's exception) is answered the same
         // way, so that the client never waits for a reply that cannot come.
         std::string what = exceptionMessage(std::current_exception());
-        log::ops().fault("exception while handling %{public}s: %s", protocol::nameOf(request).data(), what.c_str());
+        log::ops().fault("exception while handling %{public}s: %s", protocol::nameOf(handling_).data(), what.c_str());
         if (!answered()) fail(ErrorCode::OperationFailed, "internal error: " + what);
     }
+}
+
+void Transaction::holdReply() {
+    if (holding_) return;
+    holding_ = true;
+    client_->beginWrite();
+}
+
+void Transaction::releaseReply() {
+    holding_ = false;
+    if (heldReply_) {
+        HeldReply held = std::move(*heldReply_);
+        heldReply_.reset();
+        send(std::move(held.reply), std::move(held.descriptors));
+    }
+    client_->endWrite();
+}
+
+void Transaction::continueOnWriter(std::function<void()> work, std::function<void()> finish) {
+    holdReply();
+    // The request queue is a handle: a copy stays usable whatever happens to the server meanwhile.
+    SerialQueue requests = server()->mainQueue();
+    server()->writer().async(
+        [self = shared_from_this(), requests, work = std::move(work), finish = std::move(finish)]() mutable {
+            self->guarded(work);
+            requests.async([self = std::move(self), finish = std::move(finish)] {
+                if (finish) self->guarded(finish);
+                if (!self->answered()) {
+                    log::ops().fault("%{public}s left unanswered for client %d",
+                                     protocol::nameOf(self->handling_).data(), self->client_->pid());
+                    self->fail(ErrorCode::OperationFailed, "internal error: no reply");
+                }
+                self->releaseReply();
+            });
+        });
 }
 
 // The code travels as an unsigned 64-bit number: the signed 32-bit code widened with its sign.
@@ -150,6 +189,14 @@ void Transaction::doneWithDescriptors(std::vector<UniqueFd> descriptors) {
                                         "bytes",
                                         *size, ZemFrame::kMaxPayloadBytes))}});
     }
+    if (holding_) {
+        heldReply_ = HeldReply{std::move(reply), std::move(descriptors)};
+        return;
+    }
+    send(std::move(reply), std::move(descriptors));
+}
+
+void Transaction::send(Value reply, std::vector<UniqueFd> descriptors) {
     if (trace::requestOutputEnabled()) trace::requestOutput(client_->pid(), reply.description().c_str());
     std::shared_ptr<ZemConnection> connection = client_->connection();
     if (!connection) return;  // the peer is gone: there is nobody to answer

@@ -54,6 +54,17 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // The reason a held plug-in is refused.
     static constexpr std::string_view kOnHoldReason = "the plug-in is on hold";
 
+    // Writes that wait for the disk run on the database's writer queue, and a request that makes one answers only
+    // once it is durable. holdReply keeps every reply made from then on (by done() or fail(), on any queue) until
+    // releaseReply sends it, and makes the client's later requests wait until then. REQUIRES: both on the request
+    // queue; releaseReply only after holdReply.
+    void holdReply();
+    void releaseReply();
+    // Holds the reply, runs `work` on the writer queue and then `finish` (when given) back on the request queue,
+    // and only then sends the reply either of them made. An exception from either is answered as from a handler.
+    // REQUIRES: on the request queue.
+    void continueOnWriter(std::function<void()> work, std::function<void()> finish = nullptr);
+
     const std::shared_ptr<BXDZemClient>& client() const { return client_; }
     const Value& request() const { return request_.body(); }
     const ZemMessage& requestMessage() const { return request_; }
@@ -94,16 +105,33 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void launchPlugIn();
     void listHolds();
     void reportStatus();
+    // The parts of "add" and "remove" that run on the writer queue.
+    void registerPaths(std::optional<UserIdentity> caller);
+    void unregisterPaths(bool entitled);
+    // Writes the annotation changes made so far on the writer queue, then answers: done() and the change
+    // notification when `succeeded`, else the failure the handler made already.
+    void saveAnnotationsThenAnswer(bool succeeded);
 
   private:
     void runHandler(protocol::Request request);
+    // Runs `step` of the current request's handler, answering when it throws.
+    void guarded(const std::function<void()>& step);
     void failWithCode(int64_t code, std::string_view message);
+    void send(Value reply, std::vector<UniqueFd> descriptors);
 
     ZemMessage request_;
     std::shared_ptr<BXDZemClient> client_;
     MutableDictionary reply_;
     uint64_t version_ = 0;
     std::atomic<bool> answered_{false};
+    protocol::Request handling_ = protocol::Request::Status;
+    // While set, a reply made is kept in heldReply_ for releaseReply.
+    bool holding_ = false;
+    struct HeldReply {
+        Value reply;
+        std::vector<UniqueFd> descriptors;
+    };
+    std::optional<HeldReply> heldReply_;
 };
 
 }  // namespace bexil

@@ -90,12 +90,22 @@ std::optional<Error> BXDAnnotationStore::loadDb(const std::filesystem::path& url
 }
 
 std::optional<Error> BXDAnnotationStore::saveDb() {
+    Snapshot now = snapshot();
+    std::optional<Error> error = writeSnapshot(now);
+    noteSaved(now, error);
+    return error;
+}
+
+std::optional<Error> BXDAnnotationStore::writeSnapshot(const Snapshot& snapshot) const {
     MutableDictionary root;
     root.set(kVersionKey, Value::int64(kDatabaseVersion));
-    root.set(kDataKey, annotations_);
-    std::optional<Error> error = Document::writeFileAtomically(annotationsURL_, root.take(), fileSystem_);
+    root.set(kDataKey, snapshot.annotations);
+    return Document::writeFileAtomically(snapshot.url, root.take(), fileSystem_);
+}
+
+void BXDAnnotationStore::noteSaved(const Snapshot& snapshot, const std::optional<Error>& error) {
     diskBehind_ = error.has_value();
-    return error;
+    if (!error && snapshot.generation > savedGeneration_) savedGeneration_ = snapshot.generation;
 }
 
 std::filesystem::path BXDAnnotationStore::containerURL() {
@@ -115,6 +125,12 @@ Value BXDAnnotationStore::annotationForIdentifier(std::string_view key) const {
 }
 
 void BXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, std::string_view key) {
+    changeAnnotationForIdentifier(annotation, key);
+    if (std::optional<Error> error = saveDb())
+        log::ops().error("unable to save annotations:%{public}@ error:%{public}@", annotationsURL_.string(), *error);
+}
+
+void BXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, std::string_view key) {
     if (!annotation.isNull() && !annotation.isDictionary())
         throw InternalInconsistency("annotation for \"" + std::string(key) + "\" is of type " +
                                     valueKindName(annotation.kind()) + ", not a dictionary");
@@ -129,13 +145,12 @@ void BXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, std
         map.set(key, merged.take());
     }
     annotations_ = map.take();
-
-    if (std::optional<Error> error = saveDb())
-        log::ops().error("unable to save annotations:%{public}@ error:%{public}@", annotationsURL_.string(), *error);
+    ++generation_;
 }
 
 void BXDAnnotationStore::setAnnotations(Value annotations) {
     annotations_ = annotations.isDictionary() ? std::move(annotations) : Value::emptyDictionary();
+    ++generation_;
 }
 
 void BXDAnnotationStore::removeStaleTemporaries() const {

@@ -1,10 +1,13 @@
 #pragma once
 
 // BXDAnnotationStore keeps the per-plug-in annotations (the user's election, client data) in memory as one map and
-// rewrites the whole annotation document (docs/annotations.md) after every change. The database owns the one store
-// and calls it only while holding its lock `_sync`; the store has no lock of its own, so no other queue may call it.
+// rewrites the whole annotation document (docs/annotations.md) after changes. The database owns the one store and
+// calls it only while holding its lock `_sync`; the store has no lock of its own, so no other queue may call it. The
+// one exception is writeSnapshot(), which touches nothing of the store's and so runs outside the lock: the database
+// takes a snapshot inside `_sync`, writes it without holding anything, and notes the outcome inside `_sync` again.
 
 #include <concepts>
+#include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <string>
@@ -58,6 +61,29 @@ class BXDAnnotationStore {
     // The same, for an annotation key.
     void setAnnotationForIdentifier(const Value& annotation, std::string_view key);
 
+    // The merge of setAnnotationForPlugIn without the write: the change is in memory only until a later save.
+    template <AnnotationKeyed P>
+    void changeAnnotationForPlugIn(const Value& annotation, const P& plugIn) {
+        changeAnnotationForIdentifier(annotation, plugIn.annotationKey());
+    }
+    void changeAnnotationForIdentifier(const Value& annotation, std::string_view key);
+
+    // The map as it is now, numbered by the changes made so far, for writing outside the owner's lock.
+    struct Snapshot {
+        std::filesystem::path url;
+        Value annotations;
+        uint64_t generation = 0;
+    };
+    Snapshot snapshot() const { return {annotationsURL_, annotations_, generation_}; }
+    // Writes `snapshot` atomically and durably. Reads nothing of the store but its file system, so any thread may
+    // call it while another holds the owner's lock.
+    std::optional<Error> writeSnapshot(const Snapshot& snapshot) const;
+    // Takes note of how writing `snapshot` went (its error, or none).
+    void noteSaved(const Snapshot& snapshot, const std::optional<Error>& error);
+    // The number of changes made so far, and how many of them the document on disk holds.
+    uint64_t generation() const { return generation_; }
+    uint64_t savedGeneration() const { return savedGeneration_; }
+
     // Reads the document at `url`; on success its map replaces the store's, on failure the map is unchanged.
     // Fires the trace probe "db-load" on every failure, a missing file (POSIX ENOENT) included.
     std::optional<Error> loadDb(const std::filesystem::path& url);
@@ -88,6 +114,8 @@ class BXDAnnotationStore {
     Value annotations_ = Value::emptyDictionary();
     Document::FileSystem& fileSystem_;
     bool diskBehind_ = false;
+    uint64_t generation_ = 0;
+    uint64_t savedGeneration_ = 0;
 };
 
 }  // namespace bexil

@@ -3,8 +3,15 @@
 // Every record the daemon hands out comes from here. The cache is a plain map guarded by `_sync`; the registry is
 // asked outside `_sync` wherever the algorithm allows (look-ups by path and by application), so a slow registry
 // query never blocks the annotation operations of other requests. The purge is deliberately all or nothing: the
-// limit exists to bound memory in pathological cases, not to implement an eviction policy.
+// limit exists to bound memory in pathological cases, not to implement an eviction policy. Emptying the map is one
+// swap inside `_sync`; freeing what it held (a large cache takes a good fraction of a second) is left to the
+// writer's thread in batches, between whatever writes are queued there.
+//
+// Annotation changes are made in memory inside `_sync` and written by saveAnnotations on the writer, outside
+// `_sync`: a snapshot of the map (a shared, immutable value) is taken inside, written without the lock, and its
+// outcome noted inside again. Writes follow one another on the writer, so a snapshot never overtakes a newer one.
 
+#include <algorithm>
 #include <cctype>
 #include <unordered_set>
 
@@ -73,6 +80,8 @@ BXDatabase::BXDatabase(std::optional<std::string> databasePath, std::shared_ptr<
 
 BXDatabase::~BXDatabase() {
     if (workspace_ && observer_) workspace_->removeObserver(observer_.get());
+    // Changes queued for the disk are written before the store goes away.
+    if (!writer_.isCurrent()) waitForWriter();
 }
 
 std::unique_ptr<BXDatabase> BXDatabase::create(std::optional<std::string> databasePath,
@@ -145,8 +154,21 @@ void BXDatabase::purgeCachesToLimit(unsigned limit) {
     BX_ASSERT_ON_QUEUE(_sync);
     if (cache_.size() <= limit) return;
     log::ops().info("purging cache for %d > %d", cache_.size(), limit);
-    cache_.clear();
+    auto released = std::make_shared<RecordMap>();
+    released->swap(cache_);
+    purgesReleasing_.fetch_add(1);
+    releaseOnWriter(std::move(released));
     workspace_->LXClearSchemaCaches();
+}
+
+void BXDatabase::releaseOnWriter(std::shared_ptr<RecordMap> records) {
+    writer_.async([this, records = std::move(records)] {
+        for (size_t i = 0; i < kPurgeReleaseBatch && !records->empty(); ++i) records->erase(records->begin());
+        if (records->empty())
+            purgesReleasing_.fetch_sub(1);
+        else
+            releaseOnWriter(records);
+    });
 }
 
 std::shared_ptr<BXDPlugIn> BXDatabase::findPlugIn(const Uuid& uuid) {
@@ -307,7 +329,36 @@ Value BXDatabase::annotationForPlugIn(const BXDPlugIn& plugIn) {
 }
 
 void BXDatabase::setAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn) {
-    _sync.sync([&] { annotations_->setAnnotationForPlugIn(annotation, plugIn); });
+    changeAnnotationForPlugIn(annotation, plugIn);
+    if (writer_.isCurrent())
+        saveAnnotations();
+    else
+        writer_.sync([this] { saveAnnotations(); });
+}
+
+void BXDatabase::changeAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn) {
+    _sync.sync([&] { annotations_->changeAnnotationForPlugIn(annotation, plugIn); });
+}
+
+void BXDatabase::saveAnnotations() {
+    BX_ASSERT_ON_QUEUE(writer_);
+    std::optional<BXDAnnotationStore::Snapshot> snapshot =
+        _sync.sync([&]() -> std::optional<BXDAnnotationStore::Snapshot> {
+            if (annotations_->savedGeneration() >= annotations_->generation()) return std::nullopt;
+            return annotations_->snapshot();
+        });
+    if (!snapshot) return;
+    std::optional<Error> error = annotations_->writeSnapshot(*snapshot);
+    _sync.sync([&] { annotations_->noteSaved(*snapshot, error); });
+    if (error)
+        log::ops().error("unable to save annotations:%{public}@ error:%{public}@", snapshot->url.string(), *error);
+}
+
+void BXDatabase::waitForWriter() {
+    BX_ASSERT_NOT_ON_QUEUE(writer_);
+    do {
+        writer_.sync([] {});
+    } while (releasingPurgedRecords());
 }
 
 void BXDatabase::addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& form) {
@@ -325,7 +376,9 @@ void BXDatabase::autoElect(const BXDPlugIn& plugIn) {
     const Value* election = current.find(kElectionKey);
     if (election != nullptr && !(*election == Value::int64(0))) return;
     std::optional<Value> elected = dictionaryChangingTo(current, kElectionKey, Value::int64(kAutoElection));
-    annotations_->setAnnotationForPlugIn(*elected, plugIn);
+    annotations_->changeAnnotationForPlugIn(*elected, plugIn);
+    // Nobody waits for this one: an election lost to a crash is made again when the record is next built.
+    writer_.async([this] { saveAnnotations(); });
 }
 
 // ---- Registry events ----

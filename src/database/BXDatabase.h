@@ -5,6 +5,11 @@
 // owns the annotation store, asks the registry to register and unregister bundles and observes its install and
 // uninstall events. The cache and the annotation store are touched only inside `_sync`; every public operation may
 // be called from any thread that is not inside `_sync` (those marked REQUIRES are the exception).
+//
+// Writes that wait for the disk run on the database's writer queue, a serial queue with a thread of its own, so that
+// nobody else waits for them: the annotation document is written there, outside `_sync`, and the daemon runs its
+// registrations there. Changes reach memory first (what the next look-up sees) and the disk after, in order; a
+// caller that must not answer before its change is durable continues from the writer.
 
 #include <atomic>
 #include <functional>
@@ -17,6 +22,8 @@
 
 #include "base/ActingAs.h"
 #include "base/Error.h"
+#include "base/EventLoop.h"
+#include "base/SerialQueue.h"
 #include "base/SyncQueue.h"
 #include "bexil/Protocol.h"
 #include "bexil/Value.h"
@@ -77,8 +84,15 @@ class BXDatabase {
     // Builds, auto-elects and caches a record (purging first when the cache is over its limit). REQUIRES: inside
     // `_sync`.
     std::shared_ptr<BXDPlugIn> createPlugInForProxy(const std::shared_ptr<const LXBexilProxy>& proxy);
-    // Empties the whole cache when it holds more than `limit` records. REQUIRES: inside `_sync`.
+    // Empties the whole cache when it holds more than `limit` records. REQUIRES: inside `_sync`. The cache is empty
+    // on return; the records it held are released on the writer queue, kPurgeReleaseBatch per block and each block
+    // queued behind the writes that came meanwhile, so that emptying a large cache stalls nobody (records still in
+    // use elsewhere live on as before).
     void purgeCachesToLimit(unsigned limit);
+    // Freeing a record takes a few microseconds; a batch stays near a millisecond.
+    static constexpr size_t kPurgeReleaseBatch = 250;
+    // Whether records of a purge are still waiting to be released (for benchmarks and diagnostics).
+    bool releasingPurgedRecords() const { return purgesReleasing_.load() > 0; }
 
     std::shared_ptr<BXDPlugIn> findPlugIn(const Uuid& uuid);
     // The record of the plug-in bundle at `url` (a path); the registry is asked every time.
@@ -121,14 +135,29 @@ class BXDatabase {
 
     // The stored annotation of the plug-in (a dictionary), or null.
     Value annotationForPlugIn(const BXDPlugIn& plugIn);
-    // Merges `annotation` into the stored one (null removes it) and saves. Posts nothing: callers that change
-    // annotations for a client call notifyAnnotationChange once when they are done.
+    // Merges `annotation` into the stored one (null removes it) and saves, returning once the save is done (a failed
+    // save is logged and the change stays in memory). Posts nothing: callers that change annotations for a client
+    // call notifyAnnotationChange once when they are done.
     void setAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn);
+    // The merge of setAnnotationForPlugIn, in memory only: every reader sees it at once; saveAnnotations writes it.
+    void changeAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn);
+    // Writes the annotation document unless it already holds every change made so far; several changes made
+    // while an earlier write ran thus share the next one. A failure is logged and leaves the changes in memory.
+    // REQUIRES: on the writer queue (each write follows the one before).
+    void saveAnnotations();
     // Sets the form's "annotations" to the plug-in's stored annotation, or to an empty dictionary.
     void addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& form);
     void notifyAnnotationChange();
     // Stores election 1 unless an election is already made. REQUIRES: inside `_sync`.
     void autoElect(const BXDPlugIn& plugIn);
+
+    // ---- Writer ----
+
+    // The queue of the writes that wait for the disk (see the top of this file). Blocks on it may enter `_sync`.
+    const SerialQueue& writer() const { return writer_; }
+    // Returns once every block queued on the writer before the call has run and every purged record is released.
+    // REQUIRES: not on the writer.
+    void waitForWriter();
 
     // ---- Registry events ----
 
@@ -147,6 +176,10 @@ class BXDatabase {
   private:
     class Observer;
     class AnnotationReader;
+    using RecordMap = std::unordered_map<Uuid, std::shared_ptr<BXDPlugIn>>;
+
+    // Releases a batch of `records` on the writer and queues the next batch behind whatever came meanwhile.
+    void releaseOnWriter(std::shared_ptr<RecordMap> records);
 
     // The registry's filter for a wanted election list: reads each candidate's election inside `_sync`.
     bool electionFilter(const std::vector<std::string>& wanted, std::string_view identifier,
@@ -162,7 +195,11 @@ class BXDatabase {
     std::shared_ptr<Observer> observer_;
     std::unique_ptr<BXAnnotationSource> annotationSource_;
     SyncQueue _sync{"BXDatabase"};
-    std::unordered_map<Uuid, std::shared_ptr<BXDPlugIn>> cache_;
+    RecordMap cache_;
+    std::atomic<unsigned> purgesReleasing_{0};
+    // Last, so that the writer's thread has stopped before anything its blocks use goes away.
+    EventLoop writerLoop_{1};
+    SerialQueue writer_{"writer", writerLoop_};
 };
 
 }  // namespace bexil

@@ -1,8 +1,10 @@
 // The requests that change plug-in annotations: "annotate" (an election and/or client data for plug-ins named by
 // UUID) and "bulk-annotate" (client data for many plug-ins keyed by UUID text). Neither checks an entitlement: any
-// client may change the annotations of any plug-in it can name. Changes are saved one plug-in at a time, so when a
-// later plug-in fails the earlier ones keep their change; other processes are told through the change notification
-// only when the whole request succeeded.
+// client may change the annotations of any plug-in it can name. Changes are made in memory one plug-in at a time,
+// so when a later plug-in fails the earlier ones keep their change; the document is then written once on the
+// database's writer queue (together with whatever other changes are waiting for it), and the reply, a failure
+// included, goes out only after that write. Other processes are told through the change notification only when the
+// whole request succeeded.
 
 #include <memory>
 #include <optional>
@@ -66,18 +68,26 @@ void Transaction::annotatePlugIns() {
     const Value changeValue = change.take();
     const Value* newElection = changeValue.find(kElectionKey);
     const pid_t pid = client()->pid();
+    holdReply();
     bool walked = processUuidList([&](const std::shared_ptr<BXDPlugIn>& plugIn) {
         std::optional<std::string> identifier = plugIn->identifier();
         std::string uuid = uuidText(*plugIn);
         log::ops().debug("client %d plug-in %@(%{public}@) annotation change: %@", pid, identifier, uuid, changeValue);
         if (newElection != nullptr)
             log::ops().info("client %d plug-in %@(%{public}@) election := %@", pid, identifier, uuid, *newElection);
-        server()->setAnnotationForPlugIn(changeValue, *plugIn);
+        server()->changeAnnotationForPlugIn(changeValue, *plugIn);
         return true;
     });
-    if (!walked) return;
-    server()->notifyAnnotationChange();
-    done();
+    saveAnnotationsThenAnswer(walked);
+}
+
+void Transaction::saveAnnotationsThenAnswer(bool succeeded) {
+    continueOnWriter([this] { server()->saveAnnotations(); },
+                     [this, succeeded] {
+                         if (!succeeded) return;
+                         server()->notifyAnnotationChange();
+                         done();
+                     });
 }
 
 void Transaction::bulkAnnotatePlugIns() {
@@ -89,28 +99,31 @@ void Transaction::bulkAnnotatePlugIns() {
     log::ops().debug("bulk change requested for %u plug-ins", annotations->count());
 
     const pid_t pid = client()->pid();
+    holdReply();
     for (const DictionaryEntry& entry : annotations->entries()) {
         if (!entry.value.isDictionary()) {
             fail(ErrorCode::BadBulkAnnotation, "annotations values must be dictionaries");
+            saveAnnotationsThenAnswer(false);
             return;
         }
         std::optional<Uuid> uuid = Uuid::parse(entry.key);
         if (!uuid) {
             fail(ErrorCode::BadBulkAnnotation, "invalid plug-in UUID value");
+            saveAnnotationsThenAnswer(false);
             return;
         }
         std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(*uuid);
         if (!plugIn) {
             fail(ErrorCode::RegistryRefused, "no plug-in with the requested uuid");
+            saveAnnotationsThenAnswer(false);
             return;
         }
         log::ops().debug("client %d bulk plug-in %@(%{public}@) annotation change: %@", pid, plugIn->identifier(),
                          uuid->string(), entry.value);
         // The whole "extension" annotation is replaced; the election is a separate key and stays.
-        server()->setAnnotationForPlugIn(Value::dictionary({{std::string(kExtensionKey), entry.value}}), *plugIn);
+        server()->changeAnnotationForPlugIn(Value::dictionary({{std::string(kExtensionKey), entry.value}}), *plugIn);
     }
-    server()->notifyAnnotationChange();
-    done();
+    saveAnnotationsThenAnswer(true);
 }
 
 void Transaction::addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& entry) {

@@ -1,6 +1,8 @@
 // The registration requests ("add", "remove", "bulk") and the two walkers that other handlers build on: the path
 // walker and the UUID-list walker. Every walker stops at the first element that fails and leaves the reply to the
 // code that failed; work done for earlier elements is not undone, because the registry's changes are per bundle.
+// "add" and "remove" walk their paths on the database's writer queue, where each registry change waits for its
+// commit to reach the disk; the reply goes out from the request queue once the walk is done.
 
 #include <climits>
 #include <cstdlib>
@@ -97,6 +99,10 @@ void Transaction::addPlugIns() {
     // whose connection is already gone has no known rights, and an identity the kernel cannot take reads nothing.
     const std::optional<UserIdentity> caller =
         client()->user().value_or(UserIdentity{static_cast<uid_t>(-1), static_cast<gid_t>(-1)});
+    continueOnWriter([this, caller] { registerPaths(caller); });
+}
+
+void Transaction::registerPaths(std::optional<UserIdentity> caller) {
     processPaths(
         [this, &caller](const std::string& path, bool resolved) {
             if (!resolved) {
@@ -116,9 +122,15 @@ void Transaction::addPlugIns() {
 }
 
 void Transaction::removePlugIns() {
-    processPaths([this](const std::string& path, bool resolved) {
+    // The entitlement is read here, on the request queue, where the client's identity lives.
+    const bool entitled = client()->hasEntitlement(protocol::kManagerEntitlement);
+    continueOnWriter([this, entitled] { unregisterPaths(entitled); });
+}
+
+void Transaction::unregisterPaths(bool entitled) {
+    processPaths([this, entitled](const std::string& path, bool resolved) {
         trace::pluginRemove(path.c_str(), resolved);
-        if (!client()->hasEntitlement(protocol::kManagerEntitlement)) {
+        if (!entitled) {
             log::defaultLog().notice(
                 "refused request from pid=%d to remove plug-in at %@ - client lacks required entitlement",
                 client()->pid(), path);

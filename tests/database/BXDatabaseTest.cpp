@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <filesystem>
+#include <future>
 #include <mutex>
 
 #include "TestSupport.h"
@@ -163,6 +165,34 @@ TEST_F(BXDatabaseTest, PurgeIsAllOrNothingAboveTheLimit) {
     EXPECT_TRUE(*again == *first);
 }
 
+// Guards the release of a purged cache on the writer: the cache is empty at once, and while the purged records wait
+// there to be freed every look-up builds the right record again (none of the purged ones comes back, a caller's
+// copy lives on and equals the new one); after the release the new records are still the cached ones.
+TEST_F(BXDatabaseTest, LookUpsWhileAPurgedCacheIsReleasedBuildTheRightRecords) {
+    std::vector<std::string> all = {hello(), bonjour(), nightTheme(), bundle("Notes.app/PlugIns/Stationery.bxplugin")};
+    std::vector<std::shared_ptr<BXDPlugIn>> purged;
+    for (const std::string& path : all) purged.push_back(addAndFind(path));
+    for (const auto& plugIn : purged) ASSERT_TRUE(plugIn);
+
+    std::promise<void> gate;
+    database_->writer().async([released = gate.get_future().share()] { released.wait(); });
+    database_->sync().sync([&] { database_->purgeCachesToLimit(0); });
+    EXPECT_EQ(database_->cachedCount(), 0u);
+
+    std::vector<std::shared_ptr<BXDPlugIn>> rebuilt;
+    for (const auto& old : purged) {
+        std::shared_ptr<BXDPlugIn> plugIn = database_->findPlugIn(*old->uuid());
+        ASSERT_TRUE(plugIn);
+        EXPECT_NE(plugIn.get(), old.get());
+        EXPECT_TRUE(*plugIn == *old) << old->identifier().value_or("");
+        rebuilt.push_back(plugIn);
+    }
+    gate.set_value();
+    database_->waitForWriter();
+    EXPECT_EQ(database_->cachedCount(), all.size());
+    for (const auto& plugIn : rebuilt) EXPECT_EQ(database_->findPlugIn(*plugIn->uuid()).get(), plugIn.get());
+}
+
 // ---- uninstall ----
 
 // Guards uninstall: the record goes, and the delegate (which ends running instances) is told outside the lock,
@@ -200,6 +230,38 @@ TEST_F(BXDatabaseTest, AnnotationsSurviveUninstallAndReachTheForm) {
     EXPECT_EQ(form.value().get("annotations"), expected);
 }
 
+// Guards the writer's saves: a change is seen by every reader at once and reaches the disk with the next save, and
+// changes made while the writer was busy share one write (the save after it finds nothing left to write);
+// setAnnotationForPlugIn returns with its change on disk.
+TEST_F(BXDatabaseTest, ChangesAreSeenAtOnceAndThoseMadeMeanwhileShareOneSave) {
+    std::shared_ptr<BXDPlugIn> hello = addAndFind(this->hello()), theme = addAndFind(nightTheme());
+    ASSERT_TRUE(hello && theme);
+    database_->setAnnotationForPlugIn(Value::dictionary({{"election", Value::int64(1)}}), *hello);
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello").get("election"), Value::int64(1));
+
+    std::promise<void> gate;
+    database_->writer().async([released = gate.get_future().share()] { released.wait(); });
+    const Value elected = Value::dictionary({{"election", Value::int64(2)}});
+    database_->changeAnnotationForPlugIn(elected, *hello);
+    database_->changeAnnotationForPlugIn(elected, *theme);
+    EXPECT_EQ(database_->annotationForPlugIn(*theme), elected);
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello").get("election"), Value::int64(1));
+
+    auto inode = [this] {
+        struct stat status {};
+        return ::stat(annotationsPath().c_str(), &status) == 0 ? status.st_ino : 0;
+    };
+    ino_t afterFirst = 0;
+    database_->writer().async([this] { database_->saveAnnotations(); });
+    database_->writer().async([&] { afterFirst = inode(); });
+    database_->writer().async([this] { database_->saveAnnotations(); });
+    gate.set_value();
+    database_->waitForWriter();
+    EXPECT_EQ(inode(), afterFirst) << "the second save wrote again";
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.hello"), elected);
+    EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.night-theme"), elected);
+}
+
 // Guards automatic election: building the record of an entitled plug-in elects it (1, persisted, without a
 // notification) unless an election other than 0 is stored: a stored 2 survives however often the record is
 // rebuilt, a stored 0 is replaced with the rest of the annotation kept, and a plug-in without the entitlement is
@@ -224,6 +286,8 @@ TEST_F(BXDatabaseTest, AutomaticElectionStoresOneButNeverOverridesAnElectionMade
             EXPECT_EQ(database_->annotationForPlugIn(*plugIn).get("election"), Value::int64(election)) << path;
         }
     }
+    // Nobody waits for an automatic election's save; it is queued on the writer like every other.
+    database_->waitForWriter();
     EXPECT_EQ(annotationsOnDisk().get("com.example.greeter.night-theme"),
               Value::dictionary({{"election", Value::int64(1)}, {"extension", Value::string("kept")}}));
     EXPECT_TRUE(posted_.empty()) << "automatic election posts no notification";

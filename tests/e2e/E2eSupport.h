@@ -75,6 +75,24 @@ class TestClient {
         return {received->body(), std::move(descriptor)};
     }
 
+    // Sends every message before waiting for any reply; the replies (or errors) in the order sent.
+    std::vector<Reply> pipeline(const std::vector<Value>& messages) {
+        std::vector<std::future<Reply>> futures;
+        for (const Value& message : messages) {
+            auto promise = std::make_shared<std::promise<Reply>>();
+            futures.push_back(promise->get_future());
+            connection_->sendWithReply(message, queue_, [promise](const Reply& reply) { promise->set_value(reply); });
+        }
+        std::vector<Reply> replies;
+        for (std::future<Reply>& future : futures) {
+            if (future.wait_for(std::chrono::seconds(10)) != std::future_status::ready)
+                replies.emplace_back(ZemError(ZemError::Kind::ConnectionInvalid));
+            else
+                replies.push_back(future.get());
+        }
+        return replies;
+    }
+
     // Sends `messages` as requests whose replies nobody waits for, then closes the connection.
     void sendAndHangUp(const std::vector<Value>& messages) {
         for (const Value& message : messages) connection_->sendWithReply(message, queue_, [](const Reply&) {});
