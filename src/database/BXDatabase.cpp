@@ -158,16 +158,19 @@ void BXDatabase::purgeCachesToLimit(unsigned limit) {
     released->swap(cache_);
     purgesReleasing_.fetch_add(1);
     releaseOnWriter(std::move(released));
-    workspace_->LXClearSchemaCaches();
 }
 
 void BXDatabase::releaseOnWriter(std::shared_ptr<RecordMap> records) {
     writer_.async([this, records = std::move(records)] {
         for (size_t i = 0; i < kPurgeReleaseBatch && !records->empty(); ++i) records->erase(records->begin());
-        if (records->empty())
-            purgesReleasing_.fetch_sub(1);
-        else
+        if (!records->empty()) {
             releaseOnWriter(records);
+            return;
+        }
+        // The registry's statement and page caches go last, also off the purging thread: freeing them takes
+        // milliseconds with a large registry.
+        workspace_->LXClearSchemaCaches();
+        purgesReleasing_.fetch_sub(1);
     });
 }
 
