@@ -85,6 +85,15 @@ inline int connectTo(const std::string& path) {
     return fd;
 }
 
+// The pid of the process at the other end of a connected Unix socket. A daemon started under a wrapper (a profiler,
+// a sandbox tool) is not the child this program forked, so figures about the daemon's process start from here.
+inline pid_t peerPid(int fd) {
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) die("SO_PEERCRED");
+    return credentials.pid;
+}
+
 inline void writeAll(int fd, const uint8_t* bytes, size_t length) {
     while (length > 0) {
         ssize_t n = write(fd, bytes, length);
