@@ -16,8 +16,9 @@
 // Both send the request the library builds for "ready" with no plug-ins, byte for byte the same: bxd answers it
 // without touching a plug-in (the reply it gave is printed with the figures), after the whole path of any request:
 // frame cutting, decoding, the request queue, the envelope checks, the handler table, the reply and its encoding. The
-// raw side sends as many bytes as that request frame and answers with as many as bxd's reply. --payload pads the
-// hand-written request (frames and raw only: the library sends no padding).
+// raw side sends as many bytes as that request frame and answers with as many as bxd's reply. --payload BYTES makes
+// the request, on every side, the library's "match" for an extension point nobody offers with BYTES of padding in
+// its rules (the large-request case, e.g. --payload 1048576); bxd decodes it whole and answers with no matches.
 //
 // Clients, the echo server and bxd are all processes forked from this one, so `taskset -c 0 bxd_load_bench ...`
 // pins every one of them to one CPU (the CPU cost alone), while an unpinned run shows what wake-ups across CPUs add.
@@ -163,10 +164,6 @@ Options parseOptions(int argc, char** argv) {
         }
     }
     if (optind < argc) usage();
-    if (options.payload > 0 && options.wants(Side::Library)) {
-        fputs("bxd_load_bench: --payload pads hand-written requests only; use it with --mode raw,frames\n", stderr);
-        exit(2);
-    }
     if (options.bxdPath.empty()) options.bxdPath = bench::defaultBxdPath();
     return options;
 }
@@ -304,6 +301,7 @@ struct Exchange {
     std::vector<uint8_t> request;  // raw and frames: a whole message, header included
     size_t replyBytes = 0;         // raw and frames: the whole reply, header included
     std::string expectedReply;     // frames and lib: the description of the reply bxd gave the probe
+    Value paddedRules;             // lib, with --payload: the rules of its padded "match"
 };
 
 // The first reply of each client is decoded in full: the run measures nothing unless bxd really answered, and
@@ -322,15 +320,31 @@ std::string describeReplyFrame(const std::vector<uint8_t>& frame, uint32_t paylo
     return body ? body->description() : "undecodable: " + body.error().description();
 }
 
-// The request the library builds for "ready" with no plug-ins, key for key in its order; the hand-written side sends
-// it with `padding` more bytes in a "pad" entry when asked.
-Value readyRequest(size_t padding) {
+// The request the library builds for "ready" with no plug-ins, key for key in its order.
+Value readyRequest() {
     MutableDictionary body;
     body.set("request", Value::string("ready"));
     body.set("version", Value::uint64(3));
     body.set("flags", Value::uint64(0));
     body.set("uuids", Value::emptyArray());
-    if (padding > 0) body.set("pad", Value::data(std::vector<uint8_t>(padding, 0xA5)));
+    return body.take();
+}
+
+// With --payload: rules for an extension point nobody offers, carrying `padding` bytes under a key of their own, so
+// that the request is as large as asked for and bxd still answers it after decoding all of it (no candidate, so
+// the rules are never evaluated against a plug-in).
+Value paddedRules(size_t padding) {
+    return Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.load.nobody")},
+                              {"pad", Value::data(std::vector<uint8_t>(padding, 0xA5))}});
+}
+
+// The request the library builds for "match" with those rules and no flags, key for key in its order.
+Value paddedMatchRequest(size_t padding) {
+    MutableDictionary body;
+    body.set("request", Value::string("match"));
+    body.set("version", Value::uint64(3));
+    body.set("rules", paddedRules(padding));
+    body.set("flags", Value::uint64(0));
     return body.take();
 }
 
@@ -346,7 +360,12 @@ void runLibraryClient(const Exchange& exchange, unsigned warmUp, unsigned count,
     const std::vector<Uuid> none;
     for (unsigned i = 0; i < warmUp + count; ++i) {
         Clock::time_point start = Clock::now();
-        DaemonClient::Reply reply = client.wait([&](DaemonClient::Callback done) { client.ready(none, done); });
+        DaemonClient::Reply reply = client.wait([&](DaemonClient::Callback done) {
+            if (exchange.paddedRules.isNull())
+                client.ready(none, done);
+            else
+                client.match(exchange.paddedRules, 0, done);
+        });
         Clock::time_point end = Clock::now();
         if (reply.connectionFailed) {
             fprintf(stderr, "bxd_load_bench: libbexil lost bxd: %s\n", reply.error->description().c_str());
@@ -535,8 +554,9 @@ int main(int argc, char** argv) {
     raw.side = Side::Raw;
     frames.side = Side::Frames;
     library.side = Side::Library;
-    if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, readyRequest(options.payload), frames.request))
-        die("encoding the request");
+    const Value request = options.payload > 0 ? paddedMatchRequest(options.payload) : readyRequest();
+    if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, request, frames.request)) die("encoding the request");
+    if (options.payload > 0) library.paddedRules = paddedRules(options.payload);
     frames.socketPath = (root / "service" / kBxdServiceName).string();
     library.serviceDirectory = (root / "service").string();
     raw.socketPath = (root / "echo.sock").string();
@@ -629,9 +649,9 @@ int main(int argc, char** argv) {
 
     printf("bxd_load_bench: %u rounds x %u requests per client and side, %u CPU%s usable\n", options.rounds,
            options.requests, cpusAvailable(), cpusAvailable() == 1 ? "" : "s");
-    printf("request: \"ready\" with no plug-ins%s, %zu bytes; reply %zu bytes: %s\n",
-           options.payload > 0 ? " and padding" : "", frames.request.size(), frames.replyBytes,
-           frames.expectedReply.c_str());
+    printf("request: %s, %zu bytes; reply %zu bytes: %s\n",
+           options.payload > 0 ? "\"match\" with padded rules" : "\"ready\" with no plug-ins", frames.request.size(),
+           frames.replyBytes, frames.expectedReply.c_str());
     struct Ratio {
         const char* name;
         Side over;
