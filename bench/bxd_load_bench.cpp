@@ -19,6 +19,8 @@
 // raw side sends as many bytes as that request frame and answers with as many as bxd's reply. --payload BYTES makes
 // the request, on every side, the library's "match" for an extension point nobody offers with BYTES of padding in
 // its rules (the large-request case, e.g. --payload 1048576); bxd decodes it whole and answers with no matches.
+// --reply-payload BYTES registers plug-ins whose forms add up to about BYTES and makes the request, on every side,
+// the library's "match" of them (the large-reply case); the raw side then answers with as many bytes.
 //
 // Clients, the echo server and bxd are all processes forked from this one, so `taskset -c 0 bxd_load_bench ...`
 // pins every one of them to one CPU (the CPU cost alone), while an unpinned run shows what wake-ups across CPUs add.
@@ -50,6 +52,7 @@
 #include <vector>
 
 #include "BxdBench.h"
+#include "base/Document.h"
 #include "bexil/DaemonClient.h"
 #include "bexil/Value.h"
 #include "platform/zem/ZemCodec.h"
@@ -92,6 +95,7 @@ struct Options {
     std::vector<unsigned> clients{1, 8};
     unsigned requests = 20000;
     size_t payload = 0;
+    size_t replyPayload = 0;
     unsigned rounds = 3;
     bool sides[3] = {true, true, true};  // indexed by Side
     std::string bxdPath;
@@ -102,7 +106,7 @@ struct Options {
 [[noreturn]] void usage() {
     fputs(
         "Usage: bxd_load_bench [--clients N[,N...]] [--requests M] [--rounds R] [--mode SIDE[,SIDE...]]\n"
-        "                      [--payload BYTES] [--bxd PATH]\n"
+        "                      [--payload BYTES | --reply-payload BYTES] [--bxd PATH]\n"
         "SIDE is raw, frames or lib (also: bxd = frames, both = raw,frames, all = every side).\n",
         stderr);
     exit(2);
@@ -116,13 +120,10 @@ unsigned long parseNumber(const char* text, unsigned long max) {
 
 Options parseOptions(int argc, char** argv) {
     static const option kLong[] = {
-        {"clients", required_argument, nullptr, 'c'},
-        {"requests", required_argument, nullptr, 'n'},
-        {"payload", required_argument, nullptr, 'p'},
-        {"rounds", required_argument, nullptr, 'r'},
-        {"mode", required_argument, nullptr, 'm'},
-        {"bxd", required_argument, nullptr, 'b'},
-        {nullptr, 0, nullptr, 0},
+        {"clients", required_argument, nullptr, 'c'}, {"requests", required_argument, nullptr, 'n'},
+        {"payload", required_argument, nullptr, 'p'}, {"reply-payload", required_argument, nullptr, 'P'},
+        {"rounds", required_argument, nullptr, 'r'},  {"mode", required_argument, nullptr, 'm'},
+        {"bxd", required_argument, nullptr, 'b'},     {nullptr, 0, nullptr, 0},
     };
     Options options;
     int c;
@@ -138,6 +139,9 @@ Options parseOptions(int argc, char** argv) {
                 break;
             case 'p':
                 options.payload = parseNumber(optarg, kMaxPayloadBytes);
+                break;
+            case 'P':
+                options.replyPayload = parseNumber(optarg, kMaxPayloadBytes);
                 break;
             case 'r':
                 options.rounds = static_cast<unsigned>(parseNumber(optarg, 100));
@@ -163,7 +167,7 @@ Options parseOptions(int argc, char** argv) {
                 usage();
         }
     }
-    if (optind < argc) usage();
+    if (optind < argc || (options.payload > 0 && options.replyPayload > 0)) usage();
     if (options.bxdPath.empty()) options.bxdPath = bench::defaultBxdPath();
     return options;
 }
@@ -301,7 +305,7 @@ struct Exchange {
     std::vector<uint8_t> request;  // raw and frames: a whole message, header included
     size_t replyBytes = 0;         // raw and frames: the whole reply, header included
     std::string expectedReply;     // frames and lib: the description of the reply bxd gave the probe
-    Value paddedRules;             // lib, with --payload: the rules of its padded "match"
+    Value matchRules;              // lib, with --payload or --reply-payload: the rules of its "match"
 };
 
 // The first reply of each client is decoded in full: the run measures nothing unless bxd really answered, and
@@ -338,14 +342,60 @@ Value paddedRules(size_t padding) {
                               {"pad", Value::data(std::vector<uint8_t>(padding, 0xA5))}});
 }
 
-// The request the library builds for "match" with those rules and no flags, key for key in its order.
-Value paddedMatchRequest(size_t padding) {
+// The request the library builds for "match" with `rules` and no flags, key for key in its order.
+Value matchRequest(const Value& rules) {
     MutableDictionary body;
     body.set("request", Value::string("match"));
     body.set("version", Value::uint64(3));
-    body.set("rules", paddedRules(padding));
+    body.set("rules", rules);
     body.set("flags", Value::uint64(0));
     return body.take();
+}
+
+// With --reply-payload: the point of the plug-ins registered so that its match answers with about that many bytes.
+const Value kLargeReplyRules =
+    Value::dictionary({{"RZExtensionPointIdentifier", Value::string("com.example.load.large")}});
+constexpr size_t kPaddingPerPlugIn = 64 * 1024;
+
+// Writes Load.app with enough plug-ins of the large-reply point, each carrying kPaddingPerPlugIn bytes in its
+// attributes (which every form of the match reply carries twice: in its bundle information and its attributes),
+// and registers them through a hand-written "add".
+void registerLargeReplyPlugIns(const fs::path& root, const std::string& socketPath, size_t replyBytes) {
+    const fs::path app = root / "bundles" / "Load.app";
+    fs::create_directories(app / "PlugIns");
+    if (Document::writeFileAtomically(app / "Info.vrec",
+                                      Value::dictionary({{"BDBundleIdentifier", Value::string("com.example.load")}})))
+        die("writing Load.app");
+    std::vector<Value> paths;
+    for (size_t i = 0; i * 2 * kPaddingPerPlugIn < replyBytes; ++i) {
+        fs::path bundle = app / "PlugIns" / ("P" + std::to_string(i) + ".bxplugin");
+        fs::create_directories(bundle);
+        Value attributes =
+            Value::dictionary({{"RZExtensionVersion", Value::string("1")},
+                               {"Pad", Value::data(std::vector<uint8_t>(kPaddingPerPlugIn, static_cast<uint8_t>(i)))}});
+        Value info = Value::dictionary(
+            {{"BDBundleIdentifier", Value::string("com.example.load.p" + std::to_string(i))},
+             {"BDBundleVersion", Value::string("1")},
+             {"RZExtension", Value::dictionary({{"PrincipalClass", Value::string("Load")},
+                                                {"RZExtensionPointIdentifier", Value::string("com.example.load.large")},
+                                                {"RZExtensionProtocol", Value::string("Loading")},
+                                                {"RZExtensionAttributes", attributes}})}});
+        if (Document::writeFileAtomically(bundle / "Info.vrec", info)) die("writing a plug-in");
+        paths.push_back(Value::string(bundle.string()));
+    }
+    Value add = Value::dictionary(
+        {{"request", Value::string("add")}, {"version", Value::uint64(3)}, {"paths", Value::array(std::move(paths))}});
+    std::vector<uint8_t> frame;
+    if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, add, frame)) die("encoding the registration");
+    int fd = connectTo(socketPath);
+    if (fd < 0) die("connect");
+    writeAll(fd, frame.data(), frame.size());
+    std::vector<uint8_t> reply(ZemFrame::kHeaderBytes);
+    readMessage(fd, reply, ZemFrame::kHeaderBytes, [](const uint8_t* h) {
+        return ZemFrame::decodeHeader(std::span<const uint8_t, ZemFrame::kHeaderBytes>(h, ZemFrame::kHeaderBytes))
+            ->payloadLength;
+    });
+    close(fd);
 }
 
 // A client process of the library side: an application with one DaemonClient that waits for every reply.
@@ -361,10 +411,10 @@ void runLibraryClient(const Exchange& exchange, unsigned warmUp, unsigned count,
     for (unsigned i = 0; i < warmUp + count; ++i) {
         Clock::time_point start = Clock::now();
         DaemonClient::Reply reply = client.wait([&](DaemonClient::Callback done) {
-            if (exchange.paddedRules.isNull())
+            if (exchange.matchRules.isNull())
                 client.ready(none, done);
             else
-                client.match(exchange.paddedRules, 0, done);
+                client.match(exchange.matchRules, 0, done);
         });
         Clock::time_point end = Clock::now();
         if (reply.connectionFailed) {
@@ -554,9 +604,10 @@ int main(int argc, char** argv) {
     raw.side = Side::Raw;
     frames.side = Side::Frames;
     library.side = Side::Library;
-    const Value request = options.payload > 0 ? paddedMatchRequest(options.payload) : readyRequest();
+    if (options.payload > 0) library.matchRules = paddedRules(options.payload);
+    if (options.replyPayload > 0) library.matchRules = kLargeReplyRules;
+    const Value request = library.matchRules.isNull() ? readyRequest() : matchRequest(library.matchRules);
     if (ZemFrame::encode(ZemFrameKind::Request, 1, 0, request, frames.request)) die("encoding the request");
-    if (options.payload > 0) library.paddedRules = paddedRules(options.payload);
     frames.socketPath = (root / "service" / kBxdServiceName).string();
     library.serviceDirectory = (root / "service").string();
     raw.socketPath = (root / "echo.sock").string();
@@ -583,6 +634,8 @@ int main(int argc, char** argv) {
         cleanUp();
         return 1;
     }
+
+    if (options.replyPayload > 0) registerLargeReplyPlugIns(root, frames.socketPath, options.replyPayload);
 
     // The probe: one hand-written request, whose reply every later first reply must equal.
     {
@@ -650,8 +703,10 @@ int main(int argc, char** argv) {
     printf("bxd_load_bench: %u rounds x %u requests per client and side, %u CPU%s usable\n", options.rounds,
            options.requests, cpusAvailable(), cpusAvailable() == 1 ? "" : "s");
     printf("request: %s, %zu bytes; reply %zu bytes: %s\n",
-           options.payload > 0 ? "\"match\" with padded rules" : "\"ready\" with no plug-ins", frames.request.size(),
-           frames.replyBytes, frames.expectedReply.c_str());
+           options.payload > 0        ? "\"match\" with padded rules"
+           : options.replyPayload > 0 ? "\"match\" of large plug-ins"
+                                      : "\"ready\" with no plug-ins",
+           frames.request.size(), frames.replyBytes, frames.expectedReply.c_str());
     struct Ratio {
         const char* name;
         Side over;
