@@ -260,6 +260,20 @@ bool BXDatabase::electionFilter(const std::vector<std::string>& wanted, std::str
     return keep;
 }
 
+LXPreselection BXDatabase::preselectionFor(const Value& query) const {
+    return LXPreselection{
+        .extensionPoints = BXMatchRules::requiredValues(query, BXMatchRules::kExtensionPointKey),
+        .identifiers = BXMatchRules::requiredValues(query, BXMatchRules::kIdentifierKey),
+    };
+}
+
+LXPlugInFilter BXDatabase::filterFor(const Value& query) {
+    return
+        [this, wanted = wantedElections(query)](std::string_view identifier, const std::optional<Value>& entitlements) {
+            return !wanted || electionFilter(*wanted, identifier, entitlements);
+        };
+}
+
 std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query) {
     BX_ASSERT_NOT_ON_QUEUE(_sync);
     std::optional<LXProxyList> proxies;
@@ -267,24 +281,32 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
         proxies = workspace_->installedPlugins();
         log::lx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
     } else {
-        std::optional<std::vector<std::string>> wanted = wantedElections(query);
-        LXPlugInFilter filter = [this, &wanted](std::string_view identifier, const std::optional<Value>& entitlements) {
-            return !wanted || electionFilter(*wanted, identifier, entitlements);
-        };
-        LXPreselection preselection{
-            .extensionPoints = BXMatchRules::requiredValues(query, BXMatchRules::kExtensionPointKey),
-            .identifiers = BXMatchRules::requiredValues(query, BXMatchRules::kIdentifierKey),
-        };
-        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filter, preselection);
+        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filterFor(query), preselectionFor(query));
         log::lx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, query, proxies);
     }
 
     size_t cachedBefore = cachedCount();
     if (!proxies) return std::nullopt;
+    PlugInSet result = recordsForProxies(*proxies);
+    log::ops().debug("LX reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore, cachedCount());
+    return result;
+}
 
+std::optional<BXDatabase::PlugInSlice> BXDatabase::findPlugInsAfterIdentifier(const Value& query,
+                                                                              const std::optional<std::string>& after,
+                                                                              size_t rows) {
+    BX_ASSERT_NOT_ON_QUEUE(_sync);
+    // An empty query is every installed plug-in, as in findPlugIns: no pre-selection, and no election is wanted.
+    std::optional<LXWalkSlice> slice =
+        workspace_->pluginsMatchingQueryAfterIdentifier(query, filterFor(query), preselectionFor(query), after, rows);
+    if (!slice) return std::nullopt;
+    return PlugInSlice{recordsForProxies(slice->plugIns), std::move(slice->last), slice->ended};
+}
+
+BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) {
     PlugInSet result;
     std::unordered_set<Uuid> seen;
-    for (const std::shared_ptr<const LXBexilProxy>& proxy : *proxies) {
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : proxies) {
         if (!proxy->bundleURL()) {
             log::ops().info("skipping lx proxy %@ with nil bundleURL", proxy->description());
             continue;
@@ -300,7 +322,6 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
         if (!plugIn) continue;
         if (seen.insert(*plugIn->uuid()).second) result.push_back(std::move(plugIn));
     }
-    log::ops().debug("LX reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore, cachedCount());
     return result;
 }
 

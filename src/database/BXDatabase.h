@@ -28,6 +28,7 @@
 #include "bexil/Protocol.h"
 #include "bexil/Value.h"
 #include "database/BXDatabaseDelegate.h"
+#include "platform/ledgerix/LXApplicationWorkspace.h"
 #include "policy/BXAnnotationSource.h"
 
 namespace bexil {
@@ -113,6 +114,20 @@ class BXDatabase {
     // REQUIRES: not inside `_sync` (the election filter and the record look-ups enter it).
     std::optional<PlugInSet> findPlugIns(const Value& query);
 
+    // One stretch of the paged discovery walk (see LXWalkSlice): the records findPlugIns would give for the
+    // candidates, in the walk's order (identifier, then registration).
+    struct PlugInSlice {
+        PlugInSet plugIns;
+        // The identifier of the last candidate walked; none when the stretch was empty.
+        std::optional<std::string> last;
+        bool ended = false;
+    };
+    // findPlugIns over at least `rows` candidates whose identifier sorts after `after` (from the start when none),
+    // every candidate of the last identifier reached included. None when the registry gave nothing.
+    // REQUIRES: not inside `_sync`.
+    std::optional<PlugInSlice> findPlugInsAfterIdentifier(const Value& query, const std::optional<std::string>& after,
+                                                          size_t rows);
+
     // One wanted election value of a query: "=x" is "x" (possibly empty), an alphanumeric start is the whole
     // string; none for anything else (not a string, empty, another first character).
     static std::optional<std::string> normalizeElection(const Value& value);
@@ -180,6 +195,13 @@ class BXDatabase {
 
     // Releases a batch of `records` on the writer and queues the next batch behind whatever came meanwhile.
     void releaseOnWriter(std::shared_ptr<RecordMap> records);
+
+    // The records of the registry's candidates, without duplicates, skipping those without bundle URL and those of
+    // placeholder applications. REQUIRES: not inside `_sync`.
+    PlugInSet recordsForProxies(const LXProxyList& proxies);
+    // The registry's pre-selection and election filter for a query.
+    LXPreselection preselectionFor(const Value& query) const;
+    LXPlugInFilter filterFor(const Value& query);
 
     // The registry's filter for a wanted election list: reads each candidate's election inside `_sync`.
     bool electionFilter(const std::vector<std::string>& wanted, std::string_view identifier,

@@ -59,6 +59,17 @@ struct LXPreselection {
     std::optional<std::vector<std::string>> identifiers = std::nullopt;
 };
 
+// One stretch of the discovery walk, which visits plug-ins in the order of their identifiers (byte order, a missing
+// identifier counting as the empty one) and, within an identifier, in registration order.
+struct LXWalkSlice {
+    // The candidates of the stretch that passed the filter.
+    LXProxyList plugIns;
+    // The identifier of the last candidate walked, whether or not it passed; none when the stretch was empty.
+    std::optional<std::string> last;
+    // True when no candidate sorts after `last`: the walk is over.
+    bool ended = false;
+};
+
 class LXApplicationWorkspace {
   public:
     virtual ~LXApplicationWorkspace() = default;
@@ -104,6 +115,15 @@ class LXApplicationWorkspace {
     // every rule itself. The filter runs once per candidate on the calling thread.
     virtual std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query, const LXPlugInFilter& filter,
                                                                        const LXPreselection& preselection = {}) = 0;
+    // The next stretch of the walk over the same candidates: at least `rows` of those whose identifier sorts after
+    // `after` (from the start when none), fewer only where the walk ends, and always every candidate of the last
+    // identifier it reaches, so that no identifier is split between two stretches. The default sorts the whole
+    // candidate list; a registry with an index on the walk's order answers in proportion to the stretch.
+    virtual std::optional<LXWalkSlice> pluginsMatchingQueryAfterIdentifier(const Value& query,
+                                                                           const LXPlugInFilter& filter,
+                                                                           const LXPreselection& preselection,
+                                                                           const std::optional<std::string>& after,
+                                                                           size_t rows);
 };
 
 }  // namespace bexil

@@ -52,6 +52,11 @@ constexpr const char* kMigrations[] = {
     CREATE INDEX plugins_point_wild ON plugIns(point_wild) WHERE point_wild = 1;
     CREATE INDEX plugins_application ON plugIns(application_id);
     )sql",
+    // The paged discovery walk visits plug-ins by identifier, then registration; without this index every page
+    // would sort the whole table.
+    R"sql(
+    CREATE INDEX plugins_walk ON plugIns(coalesce(identifier, ''), id);
+    )sql",
 };
 static_assert(std::size(kMigrations) == LedgerixWorkspace::kSchemaVersion);
 

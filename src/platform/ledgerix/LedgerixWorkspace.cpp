@@ -19,6 +19,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <cstring>
 #include <fstream>
 #include <utility>
@@ -162,13 +163,13 @@ void readRowColumns(const StatementUse& use, LedgerixWorkspace::Row& row) {
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRowsLocked(
     Connection& connection, std::string_view where, const std::vector<std::string>& arguments,
-    std::optional<int64_t> integerArgument) {
+    std::optional<int64_t> integerArgument, std::string_view order) {
     std::string sql(kSelectRow);
     if (!where.empty()) {
         sql += " WHERE ";
         sql += where;
     }
-    sql += " ORDER BY p.id";
+    sql += order;
     std::shared_ptr<Statement> stmt = statement(connection, sql);
     if (!stmt) return std::nullopt;
     StatementUse use(stmt->get());
@@ -194,9 +195,10 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
 }
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows(
-    std::string_view where, const std::vector<std::string>& arguments, std::optional<int64_t> integerArgument) {
+    std::string_view where, const std::vector<std::string>& arguments, std::optional<int64_t> integerArgument,
+    std::string_view order) {
     std::lock_guard lock(lookups_.mutex);
-    return selectRowsLocked(lookups_, where, arguments, integerArgument);
+    return selectRowsLocked(lookups_, where, arguments, integerArgument, order);
 }
 
 std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationFromRow(const Row& row) {
@@ -338,16 +340,22 @@ std::optional<LXProxyList> LedgerixWorkspace::installedPlugins() {
     return proxiesFromRows(*rows);
 }
 
-std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(const Value& query,
-                                                                              const LXPlugInFilter& filter,
-                                                                              const LXPreselection& preselection) {
-    // The indexes narrow by what the rule engine says the query pins. A plug-in whose point is not one plain string
-    // (point_wild), or that has no identifier, may still answer such a rule from its dictionaries, so it always
-    // stays a candidate.
+namespace {
+
+// The condition that narrows the candidates by what the rule engine says the query pins, with its arguments. A
+// plug-in whose point is not one plain string (point_wild), or that has no identifier, may still answer such a rule
+// from its dictionaries, so it always stays a candidate.
+struct Preselected {
     std::string where;
     std::vector<std::string> arguments;
-    auto constrain = [&](const std::optional<std::vector<std::string>>& values, std::string_view column,
-                         std::string_view orElse) {
+
+    explicit Preselected(const LXPreselection& preselection) {
+        constrain(preselection.extensionPoints, "p.point_key", "p.point_wild = 1");
+        constrain(preselection.identifiers, "p.identifier_key", "p.identifier_key IS NULL");
+    }
+
+    void constrain(const std::optional<std::vector<std::string>>& values, std::string_view column,
+                   std::string_view orElse) {
         if (!values || values->empty()) return;
         if (!where.empty()) where += " AND ";
         where += "(";
@@ -358,14 +366,27 @@ std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(co
         where += orElse;
         where += ")";
         for (const std::string& value : *values) arguments.push_back(matchForm(value));
-    };
-    constrain(preselection.extensionPoints, "p.point_key", "p.point_wild = 1");
-    constrain(preselection.identifiers, "p.identifier_key", "p.identifier_key IS NULL");
+    }
 
-    std::optional<std::vector<Row>> rows = selectRows(where, arguments, std::nullopt);
+    // The condition with `more` joined to it.
+    std::string whereAnd(std::string_view more) const {
+        return where.empty() ? std::string(more) : "(" + where + ") AND " + std::string(more);
+    }
+};
+
+// The walk's order; the index plugins_walk holds exactly this expression.
+constexpr std::string_view kWalkKey = "coalesce(p.identifier, '')";
+
+}  // namespace
+
+std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(const Value& query,
+                                                                              const LXPlugInFilter& filter,
+                                                                              const LXPreselection& preselection) {
+    Preselected preselected(preselection);
+    std::optional<std::vector<Row>> rows = selectRows(preselected.where, preselected.arguments, std::nullopt);
     if (!rows) return std::nullopt;
     log::lx().debug("%zu candidate(s) for %@ (pre-selection: %s)", rows->size(), query,
-                    where.empty() ? std::string("none") : where);
+                    preselected.where.empty() ? std::string("none") : preselected.where);
 
     // The filter runs without the lock: it may call back into the registry.
     LXProxyList matches;
@@ -376,6 +397,49 @@ std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(co
     }
     log::lx().debug("%zu plug-in(s) pass the filter", matches.size());
     return matches;
+}
+
+std::optional<LXWalkSlice> LedgerixWorkspace::pluginsMatchingQueryAfterIdentifier(
+    const Value& query, const LXPlugInFilter& filter, const LXPreselection& preselection,
+    const std::optional<std::string>& after, size_t rows) {
+    Preselected preselected(preselection);
+    const std::string key(kWalkKey);
+    const int64_t limit = static_cast<int64_t>(std::clamp<size_t>(rows, 1, INT32_MAX));
+    std::optional<std::vector<Row>> stretch;
+    bool full = false;
+    {
+        std::lock_guard lock(lookups_.mutex);
+        std::vector<std::string> arguments = preselected.arguments;
+        std::string where = preselected.where;
+        if (after) {
+            where = preselected.whereAnd(key + " > ?");
+            arguments.push_back(*after);
+        }
+        stretch = selectRowsLocked(lookups_, where, arguments, limit, " ORDER BY " + key + ", p.id LIMIT ?");
+        if (!stretch) return std::nullopt;
+        full = static_cast<int64_t>(stretch->size()) == limit;
+        // A full stretch may have cut its last identifier short: the rest of that identifier comes with it.
+        if (full) {
+            const Row& last = stretch->back();
+            std::vector<std::string> sameArguments = preselected.arguments;
+            sameArguments.push_back(last.identifier.value_or(""));
+            std::optional<std::vector<Row>> rest =
+                selectRowsLocked(lookups_, preselected.whereAnd(key + " = ? AND p.id > ?"), sameArguments, last.id);
+            if (!rest) return std::nullopt;
+            for (Row& row : *rest) stretch->push_back(std::move(row));
+        }
+    }
+    LXWalkSlice slice;
+    slice.ended = !full;
+    if (!stretch->empty()) slice.last = stretch->back().identifier.value_or("");
+    log::lx().debug("%zu candidate(s) for %@ after %s", stretch->size(), query, after ? *after : std::string("-"));
+    // The filter runs without the lock: it may call back into the registry.
+    for (const Row& row : *stretch) {
+        std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(row);
+        if (filter && !filter(row.identifier.value_or(""), proxy->entitlements())) continue;
+        slice.plugIns.push_back(std::move(proxy));
+    }
+    return slice;
 }
 
 std::optional<size_t> LedgerixWorkspace::plugInCount() {

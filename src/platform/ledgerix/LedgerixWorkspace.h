@@ -23,7 +23,7 @@ namespace bexil {
 
 class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enable_shared_from_this<LedgerixWorkspace> {
   public:
-    static constexpr int kSchemaVersion = 1;
+    static constexpr int kSchemaVersion = 2;
     static constexpr std::string_view kDatabaseFileName = "registry.sqlite3";
     static constexpr std::string_view kContainersDirectoryName = "containers";
 
@@ -72,6 +72,10 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     std::optional<LXProxyList> installedPlugins() override;
     std::optional<LXProxyList> pluginsMatchingQueryApplyFilter(const Value& query, const LXPlugInFilter& filter,
                                                                const LXPreselection& preselection = {}) override;
+    std::optional<LXWalkSlice> pluginsMatchingQueryAfterIdentifier(const Value& query, const LXPlugInFilter& filter,
+                                                                   const LXPreselection& preselection,
+                                                                   const std::optional<std::string>& after,
+                                                                   size_t rows) override;
 
     const std::filesystem::path& databasePath() const { return databasePath_; }
     // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
@@ -100,12 +104,16 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // REQUIRES: the connection's mutex held, for every member whose name ends in Locked, for statement() and
     // failure().
     std::shared_ptr<Statement> statement(Connection& connection, const std::string& sql);
+    // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
+    // anything after it, such as a LIMIT that `integerArgument` binds).
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
-                                                     std::optional<int64_t> integerArgument);
+                                                     std::optional<int64_t> integerArgument,
+                                                     std::string_view order = " ORDER BY p.id");
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
-                                               std::optional<int64_t> integerArgument);
+                                               std::optional<int64_t> integerArgument,
+                                               std::string_view order = " ORDER BY p.id");
     // The record at exactly this path; none when there is none or the store failed (then *failed is set).
     std::optional<Row> rowAtPathLocked(Connection& connection, const std::string& path, bool* failed);
     std::optional<Error> commitLocked(const Row& row, const Uuid& uuid, double registered,
