@@ -69,7 +69,12 @@ class DaemonClient {
     void bulk(uint64_t flags, Callback done);
     void ready(const std::vector<Uuid>& plugIns, Callback done);
     void access(const std::vector<Uuid>& plugIns, Callback done);
+    // Discovery. Pages through bxd (pages of protocol::page::kDefaultForms) and answers once with every form, in
+    // the walk's order (identifier, then registration), with replacement links across pages.
     void match(const Value& rules, uint64_t flags, Callback done);
+    // One page of discovery for callers that stream: at most `pageSize` forms after `continuation` (null for the
+    // first page); unless it is the last page, the reply carries "continuation", to pass to the next call.
+    void matchPage(const Value& rules, uint64_t flags, uint64_t pageSize, const Value& continuation, Callback done);
     void annotate(const std::vector<Uuid>& plugIns, const Value& annotations, Callback done);
     void bulkAnnotate(const Value& annotations, Callback done);
     void hold(const std::vector<std::string>& paths, uint64_t flags, Callback done);

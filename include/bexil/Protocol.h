@@ -96,10 +96,15 @@ inline constexpr std::string_view kCachedRecords = "cachedRecords";  // uint64, 
 inline constexpr std::string_view kCacheLimit = "cacheLimit";        // uint64, records past which it is purged
 inline constexpr std::string_view kHoldCount = "holdCount";          // uint64, holds in force
 inline constexpr std::string_view kRegistered = "registered";        // uint64, plug-ins in the registry
-inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,     kFlags,       kRules,
-                                  kAnnotations,   kErrorCode,  kError,     kMatches,   kConflicts,   kExtensions,
-                                  kPid,           kBundleInfo, kHolds,     kUptime,    kConnections, kServed,
-                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered};
+// Paged discovery, an extension of ours: in a "match" request, the most forms a page may carry (uint64, see
+// page::), and the continuation of the previous page (data); in a reply, the continuation of this page (data,
+// absent on the last page).
+inline constexpr std::string_view kPageSize = "pagesize";
+inline constexpr std::string_view kContinuation = "continuation";
+inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
+                                  kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
+                                  kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
+                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").
@@ -177,13 +182,17 @@ enum class ErrorCode : int {
     PlugInsBusy = 14,
     // A bulk annotation entry is malformed.
     BadBulkAnnotation = 18,
+    // A discovery continuation that this run of bxd did not issue to this connection for this request: malformed,
+    // altered, another client's, or from before bxd restarted (an extension of ours).
+    BadContinuation = 19,
 };
 
 // Every code once (OperationFailed shares InvalidRequest's).
-inline constexpr std::array<ErrorCode, 9> kErrorCodes{
+inline constexpr std::array<ErrorCode, 10> kErrorCodes{
     ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest, ErrorCode::BadInterfaceSpec,
     ErrorCode::VersionMismatch,      ErrorCode::BadPath,        ErrorCode::NotAllowed,
-    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,    ErrorCode::BadBulkAnnotation};
+    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,    ErrorCode::BadBulkAnnotation,
+    ErrorCode::BadContinuation};
 
 constexpr int codeOf(ErrorCode code) { return static_cast<int>(code); }
 
@@ -195,6 +204,17 @@ inline constexpr uint64_t kSystemOnly = 0x8;    // only plug-ins on the system v
 inline constexpr uint64_t kAll = 0x200;         // skip visibility, holds and host policy (manager, not sandboxed, only)
 inline constexpr std::array kBits{kAllVersions, kAllInstances, kSystemOnly, kAll};
 }  // namespace discover
+
+// Bounds of paged discovery (key::kPageSize).
+namespace page {
+// A larger page size is served as this one: a page is one reply frame, and the daemon serves other clients only
+// between pages.
+inline constexpr uint64_t kMaxForms = 10000;
+// A page also ends before its forms would take more than this many bytes (half a frame), whatever the page size.
+inline constexpr uint64_t kMaxBytes = 8u << 20;
+// The page size the client library and the tool ask for.
+inline constexpr uint64_t kDefaultForms = 256;
+}  // namespace page
 
 // Flag bits of "lock" (key::kFlags).
 namespace hold {

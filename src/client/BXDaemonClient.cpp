@@ -1,5 +1,6 @@
 #include "client/BXDaemonClient.h"
 
+#include <unordered_map>
 #include <utility>
 
 #include "model/MessageForm.h"
@@ -106,6 +107,99 @@ void BXDaemonClient::matchPlugInsFlagsReply(const Value& rules, uint64_t flags, 
     message.set(key::kRules, rules);
     message.set(key::kFlags, Value::uint64(flags));
     sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::matchPagePlugInsFlagsReply(const Value& rules, uint64_t flags, uint64_t pageSize,
+                                                const Value& continuation, ReplyHandler reply) {
+    MutableDictionary message = request(Request::Match);
+    message.set(key::kRules, rules);
+    message.set(key::kFlags, Value::uint64(flags));
+    message.set(key::kPageSize, Value::uint64(pageSize));
+    if (!continuation.isNull()) message.set(key::kContinuation, continuation);
+    sendReply(message.take(), std::move(reply));
+}
+
+struct BXDaemonClient::PagedWalk {
+    Value rules;
+    uint64_t flags;
+    uint64_t pageSize;
+    PageProgress progress;
+    ReplyHandler reply;
+    std::vector<Value> forms;
+    size_t pages = 0;
+    bool sawMatches = false;
+};
+
+void BXDaemonClient::matchAllPagesReply(const Value& rules, uint64_t flags, uint64_t pageSize, PageProgress progress,
+                                        ReplyHandler reply) {
+    auto walk = std::make_shared<PagedWalk>();
+    walk->rules = rules;
+    walk->flags = flags;
+    walk->pageSize = pageSize;
+    walk->progress = std::move(progress);
+    walk->reply = std::move(reply);
+    continueWalk(walk, Value());
+}
+
+void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation) {
+    matchPagePlugInsFlagsReply(walk->rules, walk->flags, walk->pageSize, continuation, [this, walk](const Reply& raw) {
+        const Value* message = std::get_if<Value>(&raw);
+        bool failed = message == nullptr;
+        try {
+            failed = failed || errorInReply(raw).has_value();
+        } catch (const InternalInconsistency&) {
+            failed = true;
+        }
+        if (failed) return walk->reply(raw);
+        ++walk->pages;
+        // The message form of the discovery result is the value itself, so pages join as they come.
+        if (const Value* matches = message->find(key::kMatches); matches != nullptr && matches->isArray()) {
+            walk->sawMatches = true;
+            walk->forms.insert(walk->forms.end(), matches->items().begin(), matches->items().end());
+        }
+        const Value* next = message->find(key::kContinuation);
+        if (next != nullptr && next->isData()) {
+            if (walk->progress) walk->progress(walk->forms.size());
+            return continueWalk(walk, *next);
+        }
+        MutableDictionary whole(*message);
+        whole.remove(key::kContinuation);
+        if (walk->sawMatches) {
+            if (walk->pages > 1) linkReplacements(walk->forms);
+            whole.set(key::kMatches, Value::array(std::move(walk->forms)));
+        }
+        walk->reply(Reply(whole.take()));
+    });
+}
+
+void BXDaemonClient::linkReplacements(std::vector<Value>& forms) {
+    // The entitlement a plug-in names the identifiers it replaces with: a string, or an array of strings.
+    static constexpr std::string_view kReplaces = "com.quorvel.developer.replace-plugin";
+    // As in the daemon, the last form to claim an identifier takes it over.
+    std::unordered_map<std::string, size_t> replacing;
+    for (size_t i = 0; i < forms.size(); ++i) {
+        const Value* claim = forms[i].get(protocol::form::kEntitlements).find(kReplaces);
+        if (claim == nullptr) continue;
+        if (claim->isString()) replacing[std::string(claim->stringView())] = i;
+        for (const Value& element : claim->items())
+            if (element.isString()) replacing[std::string(element.stringView())] = i;
+    }
+    if (replacing.empty()) return;
+    std::vector<std::optional<MutableDictionary>> changed(forms.size());
+    auto edit = [&](size_t i) -> MutableDictionary& {
+        if (!changed[i]) changed[i].emplace(forms[i]);
+        return *changed[i];
+    };
+    for (size_t i = 0; i < forms.size(); ++i) {
+        std::string identifier(forms[i].get(protocol::form::kIdentifier).stringView());
+        auto claim = replacing.find(identifier);
+        if (claim == replacing.end()) continue;
+        Value uuid = forms[claim->second].get(protocol::form::kUuid);
+        edit(i).set(protocol::form::kOverrider, uuid);
+        edit(claim->second).set(protocol::form::kOverriding, Value::string(identifier));
+    }
+    for (size_t i = 0; i < forms.size(); ++i)
+        if (changed[i]) forms[i] = changed[i]->take();
 }
 
 void BXDaemonClient::setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,

@@ -61,6 +61,17 @@ class BXDaemonClient {
     void readyPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply);
     void accessPlugInsFlagsReply(const std::vector<Uuid>& uuids, uint64_t flags, ReplyHandler reply);
     void matchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply);
+    // One page of paged discovery (an extension of the protocol): at most `pageSize` forms, after the position
+    // that `continuation` (the previous page's, data) names, or from the start when it is null.
+    void matchPagePlugInsFlagsReply(const Value& rules, uint64_t flags, uint64_t pageSize, const Value& continuation,
+                                    ReplyHandler reply);
+    // Called on the reply queue after each page of matchAllPagesReply but the last, with the forms received so far.
+    using PageProgress = std::function<void(size_t formsSoFar)>;
+    // Asks for page after page until the last, then answers `reply` once as an unpaged match would: "matches"
+    // holds the forms of every page in order, with the replacement links written across pages. A page that fails
+    // answers in place of the whole. A daemon that does not page answers everything in its first reply.
+    void matchAllPagesReply(const Value& rules, uint64_t flags, uint64_t pageSize, PageProgress progress,
+                            ReplyHandler reply);
     void setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,
                                               ReplyHandler reply);
     void bulkSetPluginAnnotationsReply(const Value& annotations, ReplyHandler reply);
@@ -88,7 +99,14 @@ class BXDaemonClient {
     // The value decoded from the message form; none unless this client's protocolVersion is 3.
     std::optional<Value> convertFromZEM(const Value& value) const;
 
+    // Writes the replacement links ("overrider", "overriding") among `forms` as the daemon writes them within one
+    // reply: a form whose entitlements name identifiers it replaces links with every form of those identifiers.
+    static void linkReplacements(std::vector<Value>& forms);
+
   private:
+    struct PagedWalk;
+    void continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation);
+
     std::string serviceName_;
     SerialQueue replyQueue_;
     std::shared_ptr<ZemConnection> bxd_;

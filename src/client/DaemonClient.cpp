@@ -83,7 +83,11 @@ void DaemonClient::access(const std::vector<Uuid>& plugIns, Callback done) {
     impl_->client.accessPlugInsFlagsReply(plugIns, 0, adapt(std::move(done)));
 }
 void DaemonClient::match(const Value& rules, uint64_t flags, Callback done) {
-    impl_->client.matchPlugInsFlagsReply(rules, flags, adapt(std::move(done)));
+    impl_->client.matchAllPagesReply(rules, flags, protocol::page::kDefaultForms, nullptr, adapt(std::move(done)));
+}
+void DaemonClient::matchPage(const Value& rules, uint64_t flags, uint64_t pageSize, const Value& continuation,
+                             Callback done) {
+    impl_->client.matchPagePlugInsFlagsReply(rules, flags, pageSize, continuation, adapt(std::move(done)));
 }
 void DaemonClient::annotate(const std::vector<Uuid>& plugIns, const Value& annotations, Callback done) {
     impl_->client.setPluginAnnotationsAnnotationsReply(plugIns, annotations, adapt(std::move(done)));

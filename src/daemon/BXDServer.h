@@ -17,6 +17,7 @@
 #include "base/SerialQueue.h"
 #include "base/SyncQueue.h"
 #include "bexil/Protocol.h"
+#include "daemon/DiscoveryContinuation.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
@@ -108,6 +109,9 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     }
     std::chrono::steady_clock::time_point started() const { return started_; }
 
+    // Makes and checks the continuations of paged discovery with this run's key.
+    const DiscoveryContinuation& continuations() const { return continuations_; }
+
   private:
     BXDServer(const char* databasePath, EventLoop& loop);
 
@@ -125,6 +129,7 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::shared_ptr<const PrivacyConsent> consent_;
     std::array<std::atomic<uint64_t>, protocol::kRequests.size()> served_{};
     const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
+    const DiscoveryContinuation continuations_;
 };
 
 }  // namespace bexil

@@ -1,5 +1,6 @@
 #include "daemon/BXDZemClient.h"
 
+#include <atomic>
 #include <cinttypes>
 #include <cstdio>
 
@@ -15,8 +16,12 @@ namespace bexil {
 // Every this-many requests of one client, a debug line counts them.
 static constexpr unsigned kRequestCountLogInterval = 1000;
 
+namespace {
+std::atomic<uint64_t> lastSerial{0};
+}  // namespace
+
 BXDZemClient::BXDZemClient(const std::shared_ptr<ZemConnection>& connection, BXDServer* server)
-    : connection_(connection), server_(server) {}
+    : connection_(connection), server_(server), serial_(lastSerial.fetch_add(1, std::memory_order_relaxed) + 1) {}
 
 std::shared_ptr<BXDZemClient> BXDZemClient::initWithConnectionServer(const std::shared_ptr<ZemConnection>& connection,
                                                                      BXDServer* server) {

@@ -66,6 +66,8 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     const std::shared_ptr<BXBundle>& bundle() const { return bundle_; }
     bool acceptWork() const { return acceptWork_.load(std::memory_order_acquire); }
     unsigned requestCount() const { return requestCount_; }
+    // The connection's number in this run of bxd: never 0, never given to another connection.
+    uint64_t serial() const { return serial_; }
 
     // A request of this client is waiting for the disk (see Transaction::holdReply): the client's later requests
     // wait for its reply, so that each of them still sees what the ones before it did. REQUIRES: on the request
@@ -90,6 +92,7 @@ class BXDZemClient : public std::enable_shared_from_this<BXDZemClient>, public H
     unsigned requestCount_ = 0;                         // request queue only
     bool writing_ = false;                              // request queue only
     std::deque<std::shared_ptr<Transaction>> waiting_;  // request queue only
+    const uint64_t serial_;
 };
 
 }  // namespace bexil

@@ -7,15 +7,26 @@
 // The result is a list of forms, not records, because the duplicate resolution compares against what was
 // accepted (the form's version, residence and registration time), and the replacement links are written into the
 // forms after every candidate has been seen.
+//
+// A "match" with a page size walks the registry in the order of identifiers instead (then registration, so the
+// forms of one identifier meet in the same order as without paging) and cuts pages only between identifiers: all
+// candidates of an identifier compete within one page, exactly as they would in one reply. The continuation names
+// the last identifier walked, so a page costs what it walks, registrations and annotation changes between pages
+// neither skip nor repeat a plug-in that stayed visible, and replacement links are written among the forms of a
+// page (the client library links across pages when it puts them together).
 
+#include <algorithm>
 #include <memory>
+#include <span>
 #include <string>
 #include <unordered_map>
+#include <variant>
 #include <vector>
 
 #include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
+#include "daemon/DiscoveryContinuation.h"
 #include "daemon/Transaction.h"
 #include "model/BXBundle.h"
 #include "model/BXUtilities.h"
@@ -23,6 +34,7 @@
 #include "platform/log/Log.h"
 #include "platform/sandbox/ProcessSandbox.h"
 #include "platform/trace/Probes.h"
+#include "platform/zem/ZemCodec.h"
 #include "policy/BXDPlugIn.h"
 #include "policy/BXHostAccessPolicy.h"
 
@@ -32,6 +44,13 @@ namespace {
 
 namespace discover = protocol::discover;
 namespace formKey = protocol::form;
+namespace page = protocol::page;
+
+// The most candidates one page walks: a page whose rules reject nearly everything still answers (with fewer
+// forms, possibly none, and a continuation) before it has held the request queue for long.
+constexpr size_t kMaxPageWalk = 20000;
+// The fewest candidates asked of the registry at a time while a page fills, so that rejections cost few queries.
+constexpr size_t kMinWalkStretch = 16;
 
 using Form = std::shared_ptr<MutableDictionary>;
 
@@ -164,6 +183,16 @@ class AcceptedForms {
 
     size_t count() const { return kept_; }
 
+    // Appends the kept forms and replacement claims of `group`, whose identifier none of this one's forms have.
+    void absorb(AcceptedForms&& group) {
+        for (Form& form : group.forms_) {
+            if (!form) continue;
+            forms_.push_back(std::move(form));
+            ++kept_;
+        }
+        for (auto& [identifier, form] : group.replacements_) replacements_[identifier] = std::move(form);
+    }
+
     // The kept forms as values. The builders are not used again: their entries move rather than being copied.
     std::vector<Value> take() {
         std::vector<Value> values;
@@ -182,6 +211,171 @@ class AcceptedForms {
     size_t kept_ = 0;
 };
 
+// Exports the candidates that pass the filter and lets them compete.
+void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t to, const CandidateFilter& filter,
+                   AcceptedForms& accepted, BXDServer& database) {
+    for (size_t i = from; i < to; ++i) {
+        BXDPlugIn& plugIn = *candidates[i];
+        if (!filter.admits(plugIn)) continue;
+        Result<MutableDictionary> exported = plugIn.exportForm();
+        if (!exported) {
+            log::ops().error("failed to export matching plug-in %{public}@: %{public}@",
+                             plugIn.uuid() ? plugIn.uuid()->string() : std::string(), exported.error());
+            continue;
+        }
+        accepted.offer(plugIn, std::move(*exported), database);
+    }
+}
+
+// The page size of a paged "match": a positive integer of either integer kind; none for anything else.
+std::optional<uint64_t> pageSizeOf(const Value& entry) {
+    std::optional<uint64_t> size = entry.getUInt64();
+    if (!size) {
+        std::optional<int64_t> signedSize = entry.getInt64();
+        if (signedSize && *signedSize > 0) size = static_cast<uint64_t>(*signedSize);
+    }
+    if (!size || *size == 0) return std::nullopt;
+    return size;
+}
+
+// One page of a paged "match" (see the top of this file). Answers the transaction.
+void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, const Value* pageSizeEntry,
+               const Value* continuationEntry) {
+    if (pageSizeEntry == nullptr) {
+        transaction.fail(ErrorCode::InvalidRequest, "invalid request format (continuation without page size)");
+        return;
+    }
+    std::optional<uint64_t> asked = pageSizeOf(*pageSizeEntry);
+    if (!asked) {
+        transaction.fail(ErrorCode::InvalidRequest, "invalid request format (page size must be a positive integer)");
+        return;
+    }
+    if (continuationEntry != nullptr && !continuationEntry->isData()) {
+        transaction.fail(ErrorCode::InvalidRequest, "invalid request format (continuation must be data)");
+        return;
+    }
+    BXDZemClient& client = *transaction.client();
+    BXDServer& database = *transaction.server();
+    const pid_t pid = client.pid();
+    if (*asked > page::kMaxForms)
+        log::ops().info("client %d asked for pages of %llu forms; serving %llu (page::kMaxForms)", pid,
+                        static_cast<unsigned long long>(*asked), static_cast<unsigned long long>(page::kMaxForms));
+    const size_t wanted = static_cast<size_t>(std::min(*asked, page::kMaxForms));
+
+    DiscoveryContinuation::Binding binding{.connection = client.serial(),
+                                           .uid = client.user() ? client.user()->uid : static_cast<uid_t>(-1),
+                                           .pid = pid,
+                                           .flags = flags,
+                                           .rules = {}};
+    if (Result<std::vector<uint8_t>> encoded = ZemCodec::encode(rules); encoded)
+        binding.rules.assign(encoded->begin(), encoded->end());
+    std::optional<std::string> after;
+    if (continuationEntry != nullptr) {
+        std::span<const uint8_t> bytes = continuationEntry->dataBytes();
+        auto position = database.continuations().read(
+            std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), binding);
+        if (const auto* problem = std::get_if<DiscoveryContinuation::Problem>(&position)) {
+            switch (*problem) {
+                case DiscoveryContinuation::Problem::Malformed:
+                    transaction.fail(ErrorCode::BadContinuation, "malformed continuation");
+                    break;
+                case DiscoveryContinuation::Problem::Expired:
+                    transaction.fail(ErrorCode::BadContinuation,
+                                     "continuation expired: bxd restarted since it was issued; start again");
+                    break;
+                case DiscoveryContinuation::Problem::Foreign:
+                    transaction.fail(ErrorCode::BadContinuation,
+                                     "continuation not issued to this connection for these rules and flags");
+                    break;
+            }
+            log::ops().info("client %d sent a continuation that is not valid here", pid);
+            return;
+        }
+        after = std::get<std::string>(std::move(position));
+    }
+
+    BXMatchContext context{.annotations = &database.annotationSource()};
+    AcceptedForms accepted(flags);
+    // Where each identifier's forms end in the page, for cutting it by size later.
+    std::vector<std::pair<std::string, size_t>> groupEnds;
+    std::optional<std::string> walkedTo = after;
+    bool ended = false;
+    {
+        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database.userPrefs().exclusions());
+        CandidateFilter filter{rules, exclusions, flags, client, database, context};
+        size_t walked = 0;
+        bool full = false;
+        while (!full && walked < kMaxPageWalk) {
+            size_t stretch = std::max(wanted - accepted.count(), kMinWalkStretch);
+            std::optional<BXDatabase::PlugInSlice> slice =
+                database.findPlugInsAfterIdentifier(rules, walkedTo, stretch);
+            walked += stretch;
+            if (!slice) {
+                ended = true;
+                break;
+            }
+            trace::discoverRaw(static_cast<unsigned>(slice->plugIns.size()));
+            const BXDatabase::PlugInSet& candidates = slice->plugIns;
+            for (size_t first = 0; first < candidates.size();) {
+                std::string identifier = candidates[first]->identifier().value_or("");
+                size_t end = first + 1;
+                while (end < candidates.size() && candidates[end]->identifier().value_or("") == identifier) ++end;
+                AcceptedForms group(flags);
+                offerAdmitted(candidates, first, end, filter, group, database);
+                if (accepted.count() > 0 && accepted.count() + group.count() > wanted) {
+                    full = true;
+                    break;
+                }
+                accepted.absorb(std::move(group));
+                groupEnds.emplace_back(identifier, accepted.count());
+                walkedTo = std::move(identifier);
+                first = end;
+            }
+            if (full) break;
+            // Identifiers whose candidates the registry's election filter dropped were walked too.
+            if (slice->last) walkedTo = slice->last;
+            if (slice->ended) {
+                ended = true;
+                break;
+            }
+            full = accepted.count() >= wanted;
+        }
+        accepted.linkReplacements();
+    }
+
+    std::vector<Value> forms = accepted.take();
+    // The page ends before the identifier whose forms would take it past page::kMaxBytes (the first is always kept).
+    size_t bytes = 0;
+    for (size_t group = 0, at = 0; group < groupEnds.size(); ++group) {
+        size_t groupBytes = 0;
+        for (; at < groupEnds[group].second; ++at) {
+            Result<size_t> size = ZemCodec::encodedSize(forms[at]);
+            groupBytes += size ? *size : 0;
+        }
+        if (group > 0 && bytes + groupBytes > page::kMaxBytes) {
+            log::ops().info("page for client %d cut at %zu forms: more would exceed %llu bytes (page::kMaxBytes)", pid,
+                            groupEnds[group - 1].second, static_cast<unsigned long long>(page::kMaxBytes));
+            forms.resize(groupEnds[group - 1].second);
+            walkedTo = groupEnds[group - 1].first;
+            ended = false;
+            break;
+        }
+        bytes += groupBytes;
+    }
+
+    log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms.size()));
+    const uint64_t version = transaction.version();
+    if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version))
+        transaction.reply().set(protocol::key::kMatches, std::move(*encoded));
+    if (!ended && walkedTo) {
+        std::string continuation = database.continuations().issue(*walkedTo, binding);
+        transaction.reply().set(protocol::key::kContinuation,
+                                Value::data(std::span<const uint8_t>(
+                                    reinterpret_cast<const uint8_t*>(continuation.data()), continuation.size())));
+    }
+    transaction.done();
+}
+
 }  // namespace
 
 void Transaction::matchPlugIns() {
@@ -197,6 +391,13 @@ void Transaction::matchPlugIns() {
     if ((flags & discover::kAll) &&
         (!client()->hasEntitlement(protocol::kManagerEntitlement) || processIsSandboxed(pid))) {
         fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
+        return;
+    }
+
+    const Value* pageSize = request().find(protocol::key::kPageSize);
+    const Value* continuation = request().find(protocol::key::kContinuation);
+    if (pageSize != nullptr || continuation != nullptr) {
+        matchPage(*this, rules, flags, pageSize, continuation);
         return;
     }
 

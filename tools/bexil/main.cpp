@@ -10,17 +10,21 @@
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <csignal>
 #include <cstdio>
 #include <filesystem>
 #include <future>
 #include <iostream>
+#include <span>
 #include <string>
+#include <variant>
 #include <vector>
 
 #include "Completions.h"
 #include "Doctor.h"
 #include "PlugInInfo.h"
+#include "Progress.h"
 #include "ToolArguments.h"
 #include "base/Document.h"
 #include "client/BXDaemonClient.h"
@@ -344,8 +348,50 @@ int annotateWith(const Options& options, const Arguments& arguments, const Value
                      {});
 }
 
+// Whether a reply reports success (a reply the tool cannot read counts as a failure).
+bool succeeded(const BXDaemonClient::Reply& reply) {
+    try {
+        return std::holds_alternative<Value>(reply) && !BXDaemonClient::errorInReply(reply);
+    } catch (const InternalInconsistency&) {
+        return false;
+    }
+}
+
+// Wraps a reply handler so that the progress line is gone before a failure is reported.
+BXDaemonClient::ReplyHandler clearingOnFailure(Progress& progress, BXDaemonClient::ReplyHandler handler) {
+    return [&progress, handler = std::move(handler)](const BXDaemonClient::Reply& reply) {
+        if (!succeeded(reply)) progress.clear();
+        handler(reply);
+    };
+}
+
+// Paths per "add" request when many bundles are registered: each request is answered before the next goes out, so
+// the progress line moves, and the first path that fails still stops the walk with the paths before it handled.
+constexpr size_t kAddBatch = 64;
+
 int addCommand(const Options& options, Arguments& arguments) {
-    return withPaths(options, arguments, "add", &BXDaemonClient::addPlugInsReply);
+    auto array = absolutePaths(arguments.paths);
+    if (!array) return usageFailure(array.error());
+    std::span<const Value> paths = array->items();
+    if (paths.size() <= kAddBatch) return withPaths(options, arguments, "add", &BXDaemonClient::addPlugInsReply);
+    Progress progress(!options.json);
+    Value last = Value::emptyDictionary();
+    for (size_t at = 0; at < paths.size(); at += kAddBatch) {
+        progress.update("registering: " + std::to_string(at) + " of " + std::to_string(paths.size()) + " bundles");
+        size_t end = std::min(paths.size(), at + kAddBatch);
+        Value batch = Value::array(std::vector<Value>(paths.begin() + at, paths.begin() + end));
+        int status = roundTrip(
+            options, "add",
+            [&](BXDaemonClient& c, auto h) { c.addPlugInsReply(batch, clearingOnFailure(progress, std::move(h))); },
+            [&](BXDaemonClient&, const Value& message) {
+                last = message;
+                return 0;
+            });
+        if (status != 0) return status;
+    }
+    progress.clear();
+    if (options.json) std::printf("%s\n", toJson(last).c_str());
+    return 0;
 }
 
 int removeCommand(const Options& options, Arguments& arguments) {
@@ -369,9 +415,21 @@ int matchCommand(const Options& options, Arguments& arguments) {
     }
     auto matchFlags = discoveryFlags(arguments.flagNames);
     if (!matchFlags) return usageFailure(matchFlags.error());
+    // Paged, so that any number of plug-ins fits: each page is one reply frame.
+    Progress progress(!options.json);
+    auto pageDone = [&progress](size_t forms) {
+        progress.update("discovering: " + std::to_string(forms) + " plug-ins so far");
+    };
     return roundTrip(
-        options, "match", [&](BXDaemonClient& c, auto h) { c.matchPlugInsFlagsReply(combined, *matchFlags, h); },
-        [&](BXDaemonClient& c, const Value& m) { return printMatches(options, c, m); });
+        options, "match",
+        [&](BXDaemonClient& c, auto h) {
+            c.matchAllPagesReply(combined, *matchFlags, protocol::page::kDefaultForms, pageDone,
+                                 clearingOnFailure(progress, std::move(h)));
+        },
+        [&](BXDaemonClient& c, const Value& m) {
+            progress.clear();
+            return printMatches(options, c, m);
+        });
 }
 
 int readyCommand(const Options& options, Arguments& arguments) {

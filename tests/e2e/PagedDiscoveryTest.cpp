@@ -1,0 +1,263 @@
+// Paged discovery through the real daemon: a "match" with a page size walks the plug-ins by identifier and hands
+// out a continuation per page. The pages put together must be the unpaged answer, whatever the page size and
+// whatever changes between pages, and a continuation works only on the connection, rules and run it came from.
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <set>
+
+#include "E2eSupport.h"
+#include "client/BXDaemonClient.h"
+#include "client/BXDaemonClientSync.h"
+
+namespace bexil {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace test;
+
+Value str(std::string_view s) { return Value::string(s); }
+
+class PagedDiscoveryTest : public DaemonTest {
+  protected:
+    void SetUp() override {
+        fs::create_directories(bxd_.root() / "bundles");
+        bundles_ = fs::canonical(bxd_.root() / "bundles");
+    }
+
+    // Writes a plug-in bundle inside Paged.app and returns its path.
+    std::string writePlugIn(const std::string& name, const std::string& identifier, const std::string& version) {
+        fs::path app = bundles_ / "Paged.app";
+        if (!fs::exists(app / "Info.vrec")) {
+            fs::create_directories(app / "PlugIns");
+            std::ofstream(app / "Info.vrec") << Document::write(Value::dictionary({
+                                                                    {"BDBundleIdentifier", str("com.example.paged")},
+                                                                    {"BDBundleVersion", str("1")},
+                                                                }))
+                                                    .value();
+        }
+        fs::path bundle = app / "PlugIns" / (name + ".bxplugin");
+        fs::create_directories(bundle);
+        Value attributes = Value::dictionary({{"RZExtensionVersion", str(version)}});
+        std::ofstream(bundle / "Info.vrec")
+            << Document::write(Value::dictionary({
+                                   {"BDBundleIdentifier", str(identifier)},
+                                   {"BDBundleVersion", str(version)},
+                                   {"RZExtension", Value::dictionary({
+                                                       {"RZExtensionPointIdentifier", str(kPoint)},
+                                                       {"RZExtensionProtocol", str("#Data")},
+                                                       {"PrincipalClass", str("PagedPrincipal")},
+                                                       {"RZExtensionAttributes", attributes},
+                                                   })},
+                               }))
+                   .value();
+        return bundle.string();
+    }
+
+    // Starts bxd with 20 plug-ins: p00..p16 once each, and three versions of p09 (one identifier group of 3).
+    void startWithPlugIns() {
+        ASSERT_TRUE(start()) << bxd_.log();
+        std::vector<std::string> paths;
+        for (int i = 0; i < 17; ++i) paths.push_back(writePlugIn(name(i), identifier(i), "1"));
+        paths.push_back(writePlugIn("p09v2", identifier(9), "2"));
+        paths.push_back(writePlugIn("p09v3", identifier(9), "3"));
+        add(paths);
+    }
+    static std::string name(int i) { return (i < 10 ? "p0" : "p") + std::to_string(i); }
+    static std::string identifier(int i) { return "com.example.paged." + name(i); }
+
+    static Value pageRequest(Value pageSize, std::optional<Value> continuation = std::nullopt, uint64_t flags = 0,
+                             std::string_view point = kPoint) {
+        std::vector<std::pair<std::string, Value>> fields{
+            {"rules", Value::dictionary({{"RZExtensionPointIdentifier", str(point)}})}, {"pagesize", pageSize}};
+        if (flags) fields.emplace_back("flags", Value::uint64(flags));
+        if (continuation) fields.emplace_back("continuation", *continuation);
+        return request("match", std::move(fields));
+    }
+
+    // Walks every page of `size` on one connection; `between` runs after each page but the last.
+    std::vector<Value> walk(uint64_t size, uint64_t flags = 0, const std::function<void()>& between = nullptr) {
+        TestClient client;
+        std::vector<Value> pages;
+        std::optional<Value> continuation;
+        do {
+            Value reply = client.replyTo(pageRequest(Value::uint64(size), continuation, flags));
+            EXPECT_EQ(errorCode(reply), 0) << errorText(reply);
+            pages.push_back(reply);
+            continuation = reply.contains("continuation") ? std::optional(reply.get("continuation")) : std::nullopt;
+            if (continuation && between) between();
+        } while (continuation && pages.size() < 100);
+        return pages;
+    }
+
+    static std::vector<std::string> uuidsOf(const std::vector<Value>& replies) {
+        std::vector<std::string> uuids;
+        for (const Value& reply : replies)
+            for (const Value& form : reply.get("matches").items()) uuids.emplace_back(form.get("uuid").stringView());
+        return uuids;
+    }
+    std::multiset<std::string> unpaged(uint64_t flags = 0) {
+        std::vector<std::pair<std::string, Value>> fields{
+            {"rules", Value::dictionary({{"RZExtensionPointIdentifier", str(kPoint)}})}};
+        if (flags) fields.emplace_back("flags", Value::uint64(flags));
+        std::vector<std::string> uuids = uuidsOf({succeed(request("match", std::move(fields)))});
+        return {uuids.begin(), uuids.end()};
+    }
+
+    static constexpr std::string_view kPoint = "com.example.paged.point";
+};
+
+// Guards the paging contract: whatever the page size, the pages put together are the unpaged answer (the best
+// version of p09 once; with all versions, its three forms in one page even when pages hold one form), no page
+// holds more than asked unless one identifier alone has more, only the last page lacks a continuation, and the
+// client library's match() puts the pages together into the same answer.
+TEST_F(PagedDiscoveryTest, PagesOfAnySizeMakeUpTheUnpagedAnswerWithoutSplittingAnIdentifier) {
+    startWithPlugIns();
+    for (uint64_t flags : {uint64_t{0}, kAllVersions}) {
+        std::multiset<std::string> whole = unpaged(flags);
+        ASSERT_EQ(whole.size(), flags ? 19u : 17u);
+        for (uint64_t size : {1u, 7u, 1000u}) {
+            std::vector<Value> pages = walk(size, flags);
+            std::vector<std::string> uuids = uuidsOf(pages);
+            EXPECT_EQ(std::multiset<std::string>(uuids.begin(), uuids.end()), whole) << "pages of " << size;
+            EXPECT_EQ(pages.size(), size == 1 ? 17u : size == 7 ? 3u : 1u) << "pages of " << size;
+            std::set<std::string> seenIdentifiers;
+            for (const Value& page : pages) {
+                std::set<std::string> identifiers;
+                for (const Value& form : page.get("matches").items())
+                    identifiers.emplace(form.get("identifier").stringView());
+                EXPECT_TRUE(page.get("matches").count() <= size || identifiers.size() == 1) << page.description();
+                for (const std::string& id : identifiers) EXPECT_TRUE(seenIdentifiers.insert(id).second) << id;
+            }
+        }
+    }
+    // What DaemonClient::match runs, with pages of 2 and progress after each page but the last.
+    BXDaemonClient client;
+    std::vector<size_t> progress;
+    std::optional<BXDaemonClient::Reply> reply = sendAndWait([&](auto done) {
+        client.matchAllPagesReply(
+            Value::dictionary({{"RZExtensionPointIdentifier", str(kPoint)}}), kAllVersions, 2,
+            [&](size_t forms) { progress.push_back(forms); }, done);
+    });
+    ASSERT_TRUE(reply && std::holds_alternative<Value>(*reply));
+    const Value& whole = std::get<Value>(*reply);
+    std::vector<std::string> uuids = uuidsOf({whole});
+    EXPECT_EQ(std::multiset<std::string>(uuids.begin(), uuids.end()), unpaged(kAllVersions));
+    EXPECT_FALSE(whole.contains("continuation"));
+    EXPECT_EQ(progress.size(), 9u) << "pages of 2 over 17 identifiers, one of them of 3 forms";
+}
+
+// Guards the position being an identifier, not an offset: after the first page, a registration before the position
+// is not served, one after it is, a plug-in removed before its turn is not, and an annotation change repeats
+// nothing. Every plug-in visible both before and after the walk is served exactly once.
+TEST_F(PagedDiscoveryTest, ChangesBetweenPagesNeitherSkipNorRepeatPlugInsThatStayed) {
+    startWithPlugIns();
+    grantSelfManager();
+    std::multiset<std::string> before = unpaged();
+    bool changed = false;
+    std::vector<Value> pages = walk(5, 0, [&] {
+        if (std::exchange(changed, true)) return;
+        add({writePlugIn("early", "com.example.paged.a-early", "1"), writePlugIn("late", "com.example.paged.z", "1")});
+        succeed(pathsRequest("remove", {plugIn("Paged.app/PlugIns/p15.bxplugin")}));
+        std::optional<Uuid> p02 = registeredUuid(plugIn("Paged.app/PlugIns/p02.bxplugin"));
+        std::optional<Uuid> p12 = registeredUuid(plugIn("Paged.app/PlugIns/p12.bxplugin"));
+        ASSERT_TRUE(p02 && p12);
+        succeed(request("annotate", {{"uuids", Value::array({Value::uuid(*p02), Value::uuid(*p12)})},
+                                     {"annotations", Value::dictionary({{"election", Value::int64(1)}})}}));
+    });
+    std::multiset<std::string> after = unpaged();
+    std::vector<std::string> served = uuidsOf(pages);
+    std::multiset<std::string> servedSet(served.begin(), served.end());
+    for (const std::string& uuid : before)
+        if (after.count(uuid)) {
+            EXPECT_EQ(servedSet.count(uuid), 1u) << uuid;
+        }
+    auto servedPath = [&](const std::string& path) {
+        std::optional<Uuid> uuid = registeredUuid(path);
+        return uuid && servedSet.count(uuid->string()) > 0;
+    };
+    EXPECT_FALSE(servedPath(plugIn("Paged.app/PlugIns/early.bxplugin"))) << "registered behind the position";
+    EXPECT_TRUE(servedPath(plugIn("Paged.app/PlugIns/late.bxplugin"))) << "registered ahead of the position";
+    EXPECT_EQ(served.size(), before.size()) << "one removed ahead, one added ahead";
+}
+
+// Guards the continuation's binding: another connection, other rules, an altered or truncated one and one from
+// before a restart are refused with code 19 and their own message, and the daemon goes on serving.
+TEST_F(PagedDiscoveryTest, ContinuationsWorkOnlyOnTheirConnectionRulesAndRun) {
+    startWithPlugIns();
+    TestClient owner;
+    Value first = owner.replyTo(pageRequest(Value::uint64(4)));
+    ASSERT_TRUE(first.get("continuation").isData()) << first.description();
+    Value continuation = first.get("continuation");
+    std::span<const uint8_t> bytes = continuation.dataBytes();
+
+    const std::string foreign = "continuation not issued to this connection for these rules and flags";
+    auto refused = [](TestClient& client, const Value& message, const std::string& text) {
+        Value reply = client.replyTo(message);
+        EXPECT_EQ(errorCode(reply), 19) << reply.description();
+        EXPECT_EQ(errorText(reply), text);
+        EXPECT_FALSE(reply.contains("matches"));
+    };
+    TestClient other;
+    refused(other, pageRequest(Value::uint64(4), continuation), foreign);
+    refused(owner, pageRequest(Value::uint64(4), continuation, kAllVersions), foreign);
+    refused(owner, pageRequest(Value::uint64(4), continuation, 0, "com.example.other"), foreign);
+    std::vector<uint8_t> altered(bytes.begin(), bytes.end());
+    altered[12] ^= 1;  // a byte of the position
+    refused(owner, pageRequest(Value::uint64(4), Value::data(altered)), foreign);
+    std::vector<uint8_t> truncated(bytes.begin(), bytes.end() - 1);
+    refused(owner, pageRequest(Value::uint64(4), Value::data(std::move(truncated))), "malformed continuation");
+    refused(owner, pageRequest(Value::uint64(4), Value::data(std::vector<uint8_t>{})), "malformed continuation");
+    // The page size may change from page to page; the continuation still works where it belongs.
+    EXPECT_EQ(owner.replyTo(pageRequest(Value::uint64(100), continuation)).get("matches").count(), 13u);
+
+    bxd_.stop();
+    ASSERT_TRUE(start()) << bxd_.log();
+    TestClient afterRestart;
+    refused(afterRestart, pageRequest(Value::uint64(4), continuation),
+            "continuation expired: bxd restarted since it was issued; start again");
+}
+
+// Guards the page size's bounds: zero, negative, of another kind, a continuation without a page size or of the
+// wrong kind are invalid requests; a huge page size is served as the largest, logged.
+TEST_F(PagedDiscoveryTest, BadPageSizesAreRefusedAndHugeOnesServedAsTheLargest) {
+    startWithPlugIns();
+    const std::string badSize = "invalid request format (page size must be a positive integer)";
+    for (const Value& size : {Value::uint64(0), Value::int64(0), Value::int64(-3), str("7"), Value::real(7.0),
+                              Value::boolean(true), Value::array({Value::uint64(7)})})
+        expectFailure(pageRequest(size), 4, badSize);
+    expectFailure(request("match", {{"continuation", Value::data(std::vector<uint8_t>{1})}}), 4,
+                  "invalid request format (continuation without page size)");
+    expectFailure(pageRequest(Value::uint64(3), str("abc")), 4, "invalid request format (continuation must be data)");
+
+    Value all = succeed(pageRequest(Value::uint64(UINT64_MAX)));
+    EXPECT_EQ(all.get("matches").count(), 17u);
+    EXPECT_FALSE(all.contains("continuation"));
+    expectLog("serving 10000 (page::kMaxForms)");
+    EXPECT_EQ(succeed(pageRequest(Value::int64(5))).get("matches").count(), 5u) << "a positive int64 is a size";
+}
+
+// Guards the tool on more plug-ins than one default page: `bexil add` registers them in batches and `bexil match`
+// pages through all of them, both silent on standard error when it is not a terminal.
+TEST_F(PagedDiscoveryTest, TheToolRegistersAndDiscoversMoreThanAPage) {
+    ASSERT_TRUE(start()) << bxd_.log();
+    std::string paths;
+    const int count = static_cast<int>(protocol::page::kDefaultForms) + 44;
+    for (int i = 0; i < count; ++i)
+        paths += " '" + writePlugIn("t" + std::to_string(i), "com.example.t" + std::to_string(i), "1") + "'";
+    Outcome added = bexil("add" + paths);
+    EXPECT_EQ(added.status, 0) << added.err;
+    EXPECT_EQ(added.err, "");
+    Outcome matched = bexil("--json match RZExtensionPointIdentifier=" + std::string(kPoint));
+    EXPECT_EQ(matched.status, 0) << matched.err;
+    EXPECT_EQ(matched.err, "");
+    size_t forms = 0;
+    for (size_t at = matched.out.find("\"uuid\""); at != std::string::npos; at = matched.out.find("\"uuid\"", at + 1))
+        ++forms;
+    EXPECT_EQ(forms, static_cast<size_t>(count));
+    EXPECT_GE(bxd_.countInLog("match returned"), 2u) << "more than one page";
+}
+
+}  // namespace
+}  // namespace bexil
