@@ -9,7 +9,11 @@
 //    query, the rules, export, annotations, tokens and the encoding of the forms) as the server-side figure;
 //  - the match with no rules (every visible plug-in): round trip and server-side time per returned plug-in, the
 //    reply's size in bytes and the count at which it would pass the frame limit. Only for sizes up to --all-max,
-//    since past some count the reply cannot be sent at all.
+//    since past some count the reply cannot be sent at all;
+//  - the paged match with no rules (pages of --page-size, every page asked on one connection until the last):
+//    time per returned plug-in at every size, since no reply is larger than a page;
+//  - the point match beside a client that runs paged full discoveries back to back on another connection: its
+//    p50 / p99 against the idle figures of the same run.
 //
 // Registries take a while to build (the 100,000 one minutes), so they are built once with the registry library
 // under --cache (default: <tmp>/bexil-match-bench-cache) and reused; each run copies the state directory so that
@@ -26,6 +30,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <csignal>
@@ -73,12 +78,15 @@ struct Options {
     std::string bxdPath;
     std::string wrapper;
     bool serverSide = true;
+    uint64_t pageSize = 256;
+    unsigned pagedWalks = 3;
 };
 
 [[noreturn]] void usage() {
     fputs(
         "Usage: match_roundtrip_bench [--counts N,N,...] [--requests M] [--all-requests M] [--all-max N]\n"
-        "                             [--cache DIR] [--bxd PATH] [--wrapper CMD] [--no-server-side]\n",
+        "                             [--cache DIR] [--bxd PATH] [--wrapper CMD] [--no-server-side]\n"
+        "                             [--page-size N] [--paged-walks M]\n",
         stderr);
     exit(2);
 }
@@ -93,6 +101,8 @@ Options parseOptions(int argc, char** argv) {
         {"bxd", required_argument, nullptr, 'b'},
         {"wrapper", required_argument, nullptr, 'w'},
         {"no-server-side", no_argument, nullptr, 's'},
+        {"page-size", required_argument, nullptr, 'p'},
+        {"paged-walks", required_argument, nullptr, 'W'},
         {nullptr, 0, nullptr, 0},
     };
     Options options;
@@ -132,6 +142,12 @@ Options parseOptions(int argc, char** argv) {
                 break;
             case 's':
                 options.serverSide = false;
+                break;
+            case 'p':
+                options.pageSize = static_cast<uint64_t>(std::max(1, atoi(optarg)));
+                break;
+            case 'W':
+                options.pagedWalks = static_cast<unsigned>(std::max(1, atoi(optarg)));
                 break;
             default:
                 usage();
@@ -244,6 +260,41 @@ struct Connection {
         return forms.items().size();
     }
 };
+
+// Walks every page of a match with no rules on `connection`; returns the forms and pages it got.
+std::pair<size_t, size_t> pagedWalk(Connection& connection, uint64_t pageSize) {
+    size_t forms = 0, pages = 0;
+    Value continuation;
+    do {
+        std::vector<std::pair<std::string, Value>> fields{{"request", Value::string("match")},
+                                                          {"version", Value::uint64(3)},
+                                                          {"rules", Value::emptyDictionary()},
+                                                          {"pagesize", Value::uint64(pageSize)}};
+        if (!continuation.isNull()) fields.emplace_back("continuation", continuation);
+        connection.roundTrip(Value::dictionary(std::move(fields)));
+        Result<Value> body = ZemCodec::decode(std::span<const uint8_t>(
+            connection.reply.data() + ZemFrame::kHeaderBytes, connection.reply.size() - ZemFrame::kHeaderBytes));
+        if (!body || body->find("errorcode")) {
+            fprintf(stderr, "match_roundtrip_bench: bad page: %s\n",
+                    body ? body->description().c_str() : body.error().description().c_str());
+            exit(1);
+        }
+        forms += body->get("matches").count();
+        ++pages;
+        continuation = body->get("continuation");
+    } while (!continuation.isNull());
+    return {forms, pages};
+}
+
+Connection connectWhenUp(const std::string& socketPath, pid_t bxd) {
+    Connection connection;
+    for (Clock::time_point deadline = Clock::now() + kStartTimeout; connection.fd < 0;) {
+        if (Clock::now() > deadline || waitpid(bxd, nullptr, WNOHANG) != 0) die("bxd did not come up (see bxd.log)");
+        connection.fd = connectTo(socketPath);
+        if (connection.fd < 0) std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return connection;
+}
 
 Value matchRequest(const Value& rules) {
     return Value::dictionary({{"request", Value::string("match")},
@@ -393,12 +444,7 @@ void runSize(const Options& options, int count) {
 
     pid_t bxd = startBxd(options, run);
     std::string socketPath = (run / "service" / kBxdServiceName).string();
-    Connection connection;
-    for (Clock::time_point deadline = Clock::now() + kStartTimeout; connection.fd < 0;) {
-        if (Clock::now() > deadline || waitpid(bxd, nullptr, WNOHANG) != 0) die("bxd did not come up (see bxd.log)");
-        connection.fd = connectTo(socketPath);
-        if (connection.fd < 0) std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
+    Connection connection = connectWhenUp(socketPath, bxd);
 
     // The CPU figures are bxd's own, also when it runs under --wrapper (whose process is the one forked here).
     const pid_t server = peerPid(connection.fd);
@@ -444,6 +490,56 @@ void runSize(const Options& options, int count) {
             "%.2f us per plug-in (load %.2f)\n",
             allCount, bytes, perForm, ZemFrame::kMaxFrameBytes, static_cast<double>(ZemFrame::kMaxFrameBytes) / perForm,
             coldUs, a.p50Us, a.p50Us / static_cast<double>(allCount), a.p99Us, allCpu, loadAverage());
+    }
+
+    // Paged discovery of everything; the first walk builds every record.
+    {
+        Clock::time_point cold = Clock::now();
+        auto [forms, pages] = pagedWalk(connection, options.pageSize);
+        double coldUs = elapsedUs(cold);
+        std::vector<double> walkTimes;
+        double cpuBeforeWalks = cpuUs(bxd);
+        for (unsigned i = 0; i < options.pagedWalks; ++i) {
+            Clock::time_point start = Clock::now();
+            pagedWalk(connection, options.pageSize);
+            walkTimes.push_back(elapsedUs(start));
+        }
+        double walkCpu = (cpuUs(bxd) - cpuBeforeWalks) / options.pagedWalks / static_cast<double>(forms);
+        Percentiles w = percentiles(walkTimes);
+        printf(
+            "round trip paged match all: %zu forms in %zu pages of %llu, first (cold) %.0f ms, p50 %.0f ms = %.2f us "
+            "per plug-in, bxd CPU %.2f us per plug-in (load %.2f)\n",
+            forms, pages, static_cast<unsigned long long>(options.pageSize), coldUs / 1000, w.p50Us / 1000,
+            w.p50Us / static_cast<double>(forms), walkCpu, loadAverage());
+    }
+
+    // The point match beside a client that discovers everything, page after page, on its own connection.
+    {
+        std::atomic<bool> stop{false};
+        std::atomic<unsigned> walks{0};
+        std::thread discoverer([&] {
+            Connection other = connectWhenUp(socketPath, bxd);
+            while (!stop.load()) {
+                pagedWalk(other, options.pageSize);
+                walks.fetch_add(1);
+            }
+            close(other.fd);
+        });
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+        std::vector<double> busy;
+        busy.reserve(options.requests);
+        for (unsigned i = 0; i < options.requests; ++i) {
+            Clock::time_point start = Clock::now();
+            connection.roundTrip(matchRequest(pointRules));
+            busy.push_back(elapsedUs(start));
+        }
+        stop.store(true);
+        discoverer.join();
+        Percentiles b = percentiles(busy);
+        printf(
+            "point match beside paged full discovery (%u walks meanwhile): p50 %.1f us (%.2fx idle), p99 %.1f us "
+            "(%.2fx idle)\n",
+            walks.load(), b.p50Us, b.p50Us / p.p50Us, b.p99Us, b.p99Us / p.p99Us);
     }
     fflush(stdout);
 
