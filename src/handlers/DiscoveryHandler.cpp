@@ -16,6 +16,7 @@
 // page (the client library links across pages when it puts them together).
 
 #include <algorithm>
+#include <chrono>
 #include <memory>
 #include <span>
 #include <string>
@@ -49,8 +50,13 @@ namespace page = protocol::page;
 // The most candidates one page walks: a page whose rules reject nearly everything still answers (with fewer
 // forms, possibly none, and a continuation) before it has held the request queue for long.
 constexpr size_t kMaxPageWalk = 20000;
-// The fewest candidates asked of the registry at a time while a page fills, so that rejections cost few queries.
-constexpr size_t kMinWalkStretch = 16;
+// The longest a page keeps the request queue once it holds a form: the daemon serves one request at a time, so
+// another client's request waits for the page in progress, and a point match must not wait for a whole page of
+// hundreds of forms. A page that runs out of time ends after the stretch in progress, with a continuation.
+constexpr std::chrono::microseconds kPageTimeBudget{500};
+// The most candidates asked of the registry at a time. The time budget is checked between stretches, so a stretch
+// is never read and then thrown away; small stretches keep a page close to its budget.
+constexpr size_t kWalkStretch = 16;
 
 using Form = std::shared_ptr<MutableDictionary>;
 
@@ -305,8 +311,9 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
         CandidateFilter filter{rules, exclusions, flags, client, database, context};
         size_t walked = 0;
         bool full = false;
+        const auto deadline = std::chrono::steady_clock::now() + kPageTimeBudget;
         while (!full && walked < kMaxPageWalk) {
-            size_t stretch = std::max(wanted - accepted.count(), kMinWalkStretch);
+            size_t stretch = std::clamp<size_t>(wanted - accepted.count(), 1, kWalkStretch);
             std::optional<BXDatabase::PlugInSlice> slice =
                 database.findPlugInsAfterIdentifier(rules, walkedTo, stretch);
             walked += stretch;
@@ -338,7 +345,7 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
                 ended = true;
                 break;
             }
-            full = accepted.count() >= wanted;
+            full = accepted.count() >= wanted || (accepted.count() > 0 && std::chrono::steady_clock::now() > deadline);
         }
         accepted.linkReplacements();
     }
