@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <random>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -525,6 +526,54 @@ TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandid
     // Without an identifier a plug-in may still answer an identifier rule from its dictionaries.
     seen = filtered({.identifiers = Strings{"com.example.q1"}});
     EXPECT_EQ(seen, (std::vector<std::string>{"com.example.q1", ""}));
+}
+
+// The paged walk: stretches of any size, from the indexed query and from the interface's default (which sorts the
+// whole candidate list), visit every candidate once, by identifier (none first) and then registration; no
+// identifier is split between stretches, a stretch that is not the last has at least the rows asked for, and the
+// pre-selection narrows the walk as it narrows a query.
+TEST_F(LedgerixQueryTest, TheWalkVisitsEveryCandidateOnceByIdentifierWithoutSplittingOne) {
+    for (const char* copy : {"Q7b", "Q7c"})
+        registerOK(writePlugIn(bundles_ / (std::string(copy) + ".bxplugin"),
+                               {.identifier = "com.example.q7", .point = "com.example.b"}));
+    registerOK(writePlugIn(bundles_ / "W3.bxplugin", {.identifier = ""}));
+    auto keepAll = [](std::string_view, const std::optional<Value>&) { return true; };
+    auto identifierOf = [](const auto& proxy) { return proxy->pluginIdentifier().value_or(""); };
+    for (const LXPreselection& preselection :
+         {LXPreselection{}, LXPreselection{.extensionPoints = Strings{"com.example.b"}}}) {
+        std::optional<LXProxyList> all = workspace_->pluginsMatchingQueryApplyFilter(Value(), keepAll, preselection);
+        ASSERT_TRUE(all);
+        std::stable_sort(all->begin(), all->end(),
+                         [&](const auto& a, const auto& b) { return identifierOf(a) < identifierOf(b); });
+        Strings expected;
+        for (const auto& proxy : *all) expected.push_back(*proxy->bundleURL());
+        for (bool indexed : {true, false}) {
+            for (size_t rows : {1u, 2u, 5u, 100u}) {
+                Strings walked;
+                std::set<std::string> earlierIdentifiers;
+                std::optional<std::string> after;
+                for (int stretches = 0; stretches < 100; ++stretches) {
+                    std::optional<LXWalkSlice> slice =
+                        indexed ? workspace_->pluginsMatchingQueryAfterIdentifier(Value(), keepAll, preselection, after,
+                                                                                  rows)
+                                : workspace_->LXApplicationWorkspace::pluginsMatchingQueryAfterIdentifier(
+                                      Value(), keepAll, preselection, after, rows);
+                    ASSERT_TRUE(slice);
+                    std::set<std::string> identifiers;
+                    for (const auto& proxy : slice->plugIns) {
+                        walked.push_back(*proxy->bundleURL());
+                        identifiers.insert(identifierOf(proxy));
+                        EXPECT_FALSE(earlierIdentifiers.count(identifierOf(proxy))) << identifierOf(proxy);
+                    }
+                    earlierIdentifiers.insert(identifiers.begin(), identifiers.end());
+                    if (slice->ended) break;
+                    EXPECT_GE(slice->plugIns.size(), rows);
+                    after = slice->last;
+                }
+                EXPECT_EQ(walked, expected) << (indexed ? "indexed" : "default") << ", stretches of " << rows;
+            }
+        }
+    }
 }
 
 // ---- Bundles the registry refuses ----
