@@ -9,11 +9,23 @@ namespace bexil {
 
 std::optional<BXDaemonClient::Reply> sendAndWait(const std::function<void(BXDaemonClient::ReplyHandler)>& start,
                                                  std::chrono::milliseconds timeout) {
+    return sendAndWait(start, timeout, nullptr);
+}
+
+std::optional<BXDaemonClient::Reply> sendAndWait(
+    const std::function<void(BXDaemonClient::ReplyHandler)>& start, std::chrono::milliseconds timeout,
+    const std::function<std::chrono::steady_clock::time_point()>& lastActivity) {
     // The promise is shared with the handler: a reply that arrives after the wait gave up must still find it.
     auto promise = std::make_shared<std::promise<BXDaemonClient::Reply>>();
     std::future<BXDaemonClient::Reply> future = promise->get_future();
     start([promise](const BXDaemonClient::Reply& reply) { promise->set_value(reply); });
-    if (future.wait_for(timeout) != std::future_status::ready) {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (future.wait_until(deadline) != std::future_status::ready) {
+        auto extended = lastActivity ? lastActivity() + timeout : deadline;
+        if (extended > deadline) {
+            deadline = extended;
+            continue;
+        }
         log::ops().error("no reply from bxd within %lld ms", static_cast<long long>(timeout.count()));
         return std::nullopt;
     }

@@ -19,5 +19,10 @@ inline constexpr std::chrono::milliseconds kDefaultReplyTimeout = std::chrono::s
 // Example: sendAndWait([&](auto reply) { client.bulkPluginsReply(0, std::move(reply)); });
 std::optional<BXDaemonClient::Reply> sendAndWait(const std::function<void(BXDaemonClient::ReplyHandler)>& start,
                                                  std::chrono::milliseconds timeout = kDefaultReplyTimeout);
+// The same for work of many round trips (a paged discovery): the time limit counts from the later of the start and
+// `lastActivity()`, the moment the work last moved on, so only a stalled exchange gives up.
+std::optional<BXDaemonClient::Reply> sendAndWait(
+    const std::function<void(BXDaemonClient::ReplyHandler)>& start, std::chrono::milliseconds timeout,
+    const std::function<std::chrono::steady_clock::time_point()>& lastActivity);
 
 }  // namespace bexil

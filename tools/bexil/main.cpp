@@ -11,6 +11,8 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <atomic>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <filesystem>
@@ -89,13 +91,15 @@ int unsent(const Options& options, const char* what, const ZemError& error) {
 }
 
 // Sends one request and turns the outcome into an exit status; on success `onSuccess` prints the reply.
+// The time limit applies to the wait for the reply, or with `lastActivity` to each stretch without progress.
 int roundTrip(const Options& options, const char* what,
               const std::function<void(BXDaemonClient&, BXDaemonClient::ReplyHandler)>& send,
-              const std::function<int(BXDaemonClient&, const Value&)>& onSuccess) {
+              const std::function<int(BXDaemonClient&, const Value&)>& onSuccess,
+              const std::function<std::chrono::steady_clock::time_point()>& lastActivity = nullptr) {
     BXDaemonClient client(options.service.c_str());
     auto timeout = std::chrono::milliseconds(static_cast<int64_t>(options.timeoutSeconds * 1000));
-    std::optional<BXDaemonClient::Reply> reply =
-        sendAndWait([&](BXDaemonClient::ReplyHandler handler) { send(client, std::move(handler)); }, timeout);
+    std::optional<BXDaemonClient::Reply> reply = sendAndWait(
+        [&](BXDaemonClient::ReplyHandler handler) { send(client, std::move(handler)); }, timeout, lastActivity);
     if (!reply) {
         std::fprintf(stderr, "bexil: bxd did not answer %s within %g seconds on service %s\n", what,
                      options.timeoutSeconds, options.service.c_str());
@@ -417,7 +421,10 @@ int matchCommand(const Options& options, Arguments& arguments) {
     if (!matchFlags) return usageFailure(matchFlags.error());
     // Paged, so that any number of plug-ins fits: each page is one reply frame.
     Progress progress(!options.json);
-    auto pageDone = [&progress](size_t forms) {
+    // --timeout bounds the wait for each page, not for the whole discovery.
+    std::atomic<std::chrono::steady_clock::rep> lastPage{std::chrono::steady_clock::now().time_since_epoch().count()};
+    auto pageDone = [&](size_t forms) {
+        lastPage.store(std::chrono::steady_clock::now().time_since_epoch().count());
         progress.update("discovering: " + std::to_string(forms) + " plug-ins so far");
     };
     return roundTrip(
@@ -429,7 +436,8 @@ int matchCommand(const Options& options, Arguments& arguments) {
         [&](BXDaemonClient& c, const Value& m) {
             progress.clear();
             return printMatches(options, c, m);
-        });
+        },
+        [&] { return std::chrono::steady_clock::time_point(std::chrono::steady_clock::duration(lastPage.load())); });
 }
 
 int readyCommand(const Options& options, Arguments& arguments) {
