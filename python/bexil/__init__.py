@@ -309,7 +309,8 @@ class Client:
         return Matches(self._match_pages({} if rules is None else rules, flags))
 
     def _match_pages(self, rules, flags):
-        # FIXME: one page, until the library offers page-by-page discovery; then this loops over its pages.
+        # bexil_match pages through bxd inside the library and hands out the whole result in one piece; once the C
+        # interface offers a call per page, this yields each page as it comes and callers iterate the same way.
         reply = self._call(_lib.bexil_match, _encode(rules), flags)
         yield [_form(form) for form in reply.get("matches", [])]
 
