@@ -848,9 +848,9 @@ int run(int argc, char** argv) {
         "bexil: talk to bxd, the plug-in registry daemon.\n"
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
-        "annotation); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
-        "69 bxd not running; 70 unreadable reply; 73 preferences not writable; 75 no answer in time;\n"
-        "78 doctor found a problem.",
+        "annotation, 19 paged discovery must start again); 64 bad arguments (nothing sent); 65 unusable SDK or\n"
+        "Info.vrec; 66 SDK not registered; 69 bxd not running; 70 unreadable reply; 73 preferences not writable;\n"
+        "75 no answer in time; 78 doctor found a problem.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();
