@@ -16,7 +16,9 @@
 // page (the client library links across pages when it puts them together).
 
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
+#include <cstring>
 #include <memory>
 #include <span>
 #include <string>
@@ -39,6 +41,7 @@
 #include "platform/zem/ZemCodec.h"
 #include "policy/BXDPlugIn.h"
 #include "policy/BXHostAccessPolicy.h"
+#include "policy/BXIssueReadExtension.h"
 
 namespace bexil {
 
@@ -242,6 +245,10 @@ void Transaction::matchPlugIns() {
         fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
         return;
     }
+
+    // Forms carry tokens made for earlier replies; they must stay checkable even if the key file was removed.
+    if (!BXKeepReadExtensionsCheckable())
+        log::ops().error("cannot restore the sandbox extension key: %{public}s", strerror(errno));
 
     const Value* pageSize = request().find(protocol::key::kPageSize);
     const Value* continuation = request().find(protocol::key::kContinuation);

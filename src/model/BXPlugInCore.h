@@ -193,7 +193,9 @@ class BXPlugInCore {
     std::optional<std::string> requirement() const;
     void setRequirement(std::optional<std::string> v);
 
-  private:
+  protected:
+    // Reads and replaces one stored property under the record's lock; subclasses keep their own lazily made
+    // properties the same way, without a lock of their own.
     template <typename T>
     T load(const T& field) const {
         std::lock_guard<std::mutex> guard(mutex_);
@@ -209,6 +211,7 @@ class BXPlugInCore {
         }
     }
 
+  private:
     // Text properties are kept as string Values so that exporting and reading forms share them instead of copying.
     std::optional<std::string> loadText(const std::optional<Value>& field) const;
     static std::optional<Value> textValue(std::optional<std::string> text);

@@ -170,17 +170,29 @@ std::optional<std::string> BXDPlugIn::localizedContainingName() const {
 // ---- Resource extensions ----
 
 void BXDPlugIn::augmentForm(MutableDictionary& form) const {
+    if (std::optional<Value> made = load(resourceTokens_)) {
+        form.set(kExtensionsFormKey, std::move(*made));
+        return;
+    }
     std::optional<Value> resources = pluginKey(kSharedKey);
     // An application extension's host may read its whole bundle; its "Shared" entry is not used.
     if (isAppExtension()) resources = Value::array({Value::string(kWholeBundle)});
     if (!resources) return;
-    form.set(kExtensionsFormKey, issueResourceExtensions(*resources));
+    bool complete = false;
+    Value tokens = issueResourceExtensions(*resources, &complete);
+    // A resource without a token (missing for now, say) is asked again next time, and logged again.
+    if (complete) {
+        BXDPlugIn* self = const_cast<BXDPlugIn*>(this);
+        self->store(self->resourceTokens_, std::optional<Value>(tokens));
+    }
+    form.set(kExtensionsFormKey, std::move(tokens));
 }
 
-Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
+Value BXDPlugIn::issueResourceExtensions(const Value& paths, bool* complete) const {
     Value list = paths.isString() ? Value::array({paths}) : paths;
     std::string bundle = url().value_or(std::string());
     MutableDictionary result;
+    if (complete != nullptr) *complete = true;
     for (const Value& element : list.items()) {
         const std::string* resource = element.getString();
         if (resource == nullptr) continue;
@@ -190,6 +202,7 @@ Value BXDPlugIn::issueResourceExtensions(const Value& paths) const {
             result.set(*resource, Value::string(std::move(*token)));
         } else {
             int cause = errno;
+            if (complete != nullptr) *complete = false;
             log::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", target, bundle,
                             strerror(cause));
         }

@@ -63,11 +63,14 @@ class BXDPlugIn : public BXPlugInCore {
     std::optional<std::string> localizedContainingName() const override;
 
     // Adds "extensions" to the form: read-only tokens for the whole bundle (".") of an application extension, else
-    // for the plug-in dictionary's "Shared" resources; a plug-in with neither leaves the form unchanged.
+    // for the plug-in dictionary's "Shared" resources; a plug-in with neither leaves the form unchanged. The tokens
+    // are made once per record, the first time every resource gets one, and shared by every later form: a token
+    // names the path the resource resolved to then, and stays good for the run of the daemon.
     void augmentForm(MutableDictionary& form) const;
     // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
-    // is one string or an array; other elements are passed over; paths that get no token are left out (logged).
-    Value issueResourceExtensions(const Value& paths) const;
+    // is one string or an array; other elements are passed over; paths that get no token are left out (logged), and
+    // `complete`, when given, says whether none was.
+    Value issueResourceExtensions(const Value& paths, bool* complete = nullptr) const;
 
     // The privacy-consent service that lets a typepad plug-in that asks for open access run in the ordinary
     // plug-in sandbox, which may reach the network.
@@ -122,6 +125,9 @@ class BXDPlugIn : public BXPlugInCore {
     std::optional<Value> lookUp(std::string_view key, int scope) const;
 
     std::shared_ptr<const LXBexilProxy> lxproxy_;
+    // The "extensions" of augmentForm once every resource got its token; guarded by the record's lock. Resolving a
+    // resource's real path costs system calls that walk the path, most of what exporting a form cost.
+    std::optional<Value> resourceTokens_;
 };
 
 }  // namespace bexil

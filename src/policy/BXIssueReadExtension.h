@@ -12,4 +12,8 @@ namespace bexil {
 // set it (for example ENOENT when the path does not exist).
 std::optional<std::string> BXIssueReadExtension(const std::string& url);
 
+// Puts the key that checks this run's tokens back in place when somebody removed it; false (errno set) when it
+// cannot be written. Called before handing out tokens that were made earlier.
+bool BXKeepReadExtensionsCheckable();
+
 }  // namespace bexil

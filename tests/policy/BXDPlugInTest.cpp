@@ -14,6 +14,7 @@
 #include "platform/sandbox/SandboxExtensions.h"
 #include "policy/BXDPlugIn.h"
 #include "policy/BXDPlugInSignature.h"
+#include "policy/BXIssueReadExtension.h"
 #include "policy/BXMatchRules.h"
 
 namespace bexil {
@@ -310,6 +311,41 @@ TEST_F(BXDPlugInExtensionsTest, ApplicationExtensionGetsOneTokenForItsWholeBundl
     Value extensions = form.value().get("extensions");
     ASSERT_EQ(extensions.count(), 1u);
     EXPECT_EQ(grantedPath(extensions.get(".")), *plugIn->url());
+}
+
+// A record's tokens are made once and handed out again: later forms keep the path the resource resolved to first,
+// even when a link inside the bundle now leads elsewhere, and stay checkable after the key file was removed. A
+// resource that got no token is asked again, so it gets one once it exists.
+TEST_F(BXDPlugInExtensionsTest, TokensAreMadeOncePerRecordAndMissingOnesAreAskedAgain) {
+    namespace fs = std::filesystem;
+    fs::path bundle = root_ / "Greeter.app/PlugIns/Hello.bxplugin";
+    fs::create_directories(root_ / "elsewhere");
+    fs::create_directory_symlink(bundle / "Resources", bundle / "Current");
+    auto plugIn = plugInAt("Greeter.app/PlugIns/Hello.bxplugin",
+                           plugInDictionary({{"Shared", Value::array({str("Current"), str("Later.txt")})}}));
+    ASSERT_NE(plugIn, nullptr);
+
+    auto extensionsOf = [&] {
+        MutableDictionary form;
+        plugIn->augmentForm(form);
+        return form.value().get("extensions");
+    };
+    Value first = extensionsOf();
+    ASSERT_EQ(first.count(), 1u) << "Later.txt does not exist yet";
+    std::ofstream(bundle / "Later.txt") << "now";
+    Value second = extensionsOf();
+    ASSERT_EQ(second.count(), 2u) << second.description();
+    EXPECT_EQ(second.get("Current"), first.get("Current"));
+
+    fs::remove(bundle / "Current");
+    fs::create_directory_symlink(root_ / "elsewhere", bundle / "Current");
+    Value third = extensionsOf();
+    EXPECT_EQ(third, second);
+    EXPECT_EQ(grantedPath(third.get("Current")), (bundle / "Resources").string());
+
+    fs::remove(SandboxExtensions::shared().keyPath());
+    ASSERT_TRUE(BXKeepReadExtensionsCheckable());
+    EXPECT_EQ(grantedPath(extensionsOf().get("Later.txt")), (bundle / "Later.txt").string());
 }
 
 // ---- Enabling for a host ----

@@ -115,6 +115,11 @@ bool SandboxExtensions::ensureIssuingKeyLocked() {
     return true;
 }
 
+bool SandboxExtensions::ensureIssuingKey() {
+    std::lock_guard lock(mutex_);
+    return issuingKey_.empty() || ensureIssuingKeyLocked();
+}
+
 void SandboxExtensions::MacStateFree::operator()(evp_mac_ctx_st* state) const { EVP_MAC_CTX_free(state); }
 
 namespace {

@@ -41,6 +41,10 @@ class SandboxExtensions {
     // Issues a token of `extensionClass` for the canonical form of `path` (which must exist). None on failure,
     // with errno set (the path's resolution error, or the key file's).
     std::optional<std::string> issueFileExtension(std::string_view extensionClass, const std::string& path);
+    // Writes the key file back when it has disappeared, so that consumers can still check the tokens issued
+    // before (tokens handed out again from a cache, say). True when there is no key yet or the file is in place;
+    // false with errno set when it cannot be written.
+    bool ensureIssuingKey();
     // Checks a token against the current key and, when valid, records it: a positive handle. -1 with errno EPERM
     // for a token that is malformed or not signed with the current key, or the errno of reading the key.
     int64_t consume(const std::string& token);
