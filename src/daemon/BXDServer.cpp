@@ -8,12 +8,15 @@
 #include "base/EventLoop.h"
 #include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDZemClient.h"
+#include "daemon/GenerationStore.h"
 #include "platform/codesign/EntitlementsDirectory.h"
 #include "platform/ksn/ConsentStore.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
+#include "platform/prefs/PreferencesWatch.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemListener.h"
+#include "policy/BXDPlugIn.h"
 
 namespace bexil {
 
@@ -32,6 +35,7 @@ BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
       consent_(std::make_shared<ConsentStore>()) {}
 
 BXDServer::~BXDServer() {
+    preferencesWatch_.reset();
     if (service_) service_->cancel();
     // What the writer still has queued may call back into the server (as the database's delegate): let it finish
     // while the server is whole.
@@ -73,6 +77,19 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
         [raw] { raw->mainQueue_.asyncAfter(kTerminationGrace, [raw] { raw->loop_.stop(); }); });
 
     server->userPrefs_ = std::make_unique<BXDUserPrefs>();
+    // What the exclusions are at start is no change; a difference from here on is.
+    server->lastExclusions_ = server->userPrefs_->exclusions();
+    server->changeFeed_ = std::make_shared<ChangeFeed>(
+        std::make_unique<GenerationStore>(GenerationStore::defaultPath()), server->mainQueue_);
+    Result<std::unique_ptr<PreferencesWatch>> watch = PreferencesWatch::start(
+        PreferencesStore::shared().directory(), server->mainQueue_, [raw] { raw->currentExclusions(); });
+    if (watch)
+        server->preferencesWatch_ = std::move(*watch);
+    else
+        log::ops().error(
+            "cannot watch the preferences folder: %@; an exclusions change is noticed at the next "
+            "discovery",
+            watch.error());
     return server;
 }
 
@@ -89,8 +106,93 @@ void BXDServer::run() {
 // request queue is free, so a request goes from its bytes to its reply without another turn of the loop.
 void BXDServer::submitWork(std::function<void()> work) { mainQueue_.dispatch(std::move(work)); }
 
+namespace {
+
+// The UUIDs and identifiers of registry records, as a change names them.
+void describe(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns, std::vector<Uuid>& uuids,
+              std::vector<std::string>& identifiers) {
+    for (const std::shared_ptr<const LXBexilProxy>& plugIn : plugIns) {
+        if (!plugIn->pluginUUID()) continue;
+        uuids.push_back(*plugIn->pluginUUID());
+        identifiers.push_back(plugIn->pluginIdentifier().value_or(""));
+    }
+}
+
+}  // namespace
+
 void BXDServer::removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
+    std::vector<Uuid> uuids;
+    std::vector<std::string> identifiers;
+    describe(plugIns, uuids, identifiers);
+    if (changeFeed_) noteChange(Change::Kind::Unregistered, std::move(uuids), std::move(identifiers));
     terminatePlugInsReply(plugIns, [plugIns] { log::ops().debug("removal complete for %@", plugIns); });
+}
+
+void BXDServer::installedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {
+    std::vector<Uuid> uuids;
+    std::vector<std::string> identifiers;
+    describe(plugIns, uuids, identifiers);
+    if (changeFeed_) noteChange(Change::Kind::Registered, std::move(uuids), std::move(identifiers));
+}
+
+void BXDServer::electedAutomatically(const BXDPlugIn& plugIn) {
+    if (!changeFeed_ || !plugIn.uuid()) return;
+    noteChange(Change::Kind::Annotated, {*plugIn.uuid()}, {plugIn.identifier().value_or("")});
+}
+
+// ---- Changes ----
+
+void BXDServer::noteChange(Change::Kind kind, std::vector<Uuid> plugIns, std::vector<std::string> identifiers) {
+    // The publication waits for the writer's current block in either case: an automatic election is saved by a
+    // block queued before this one, and an uninstall is committed by the rest of the block that announced it.
+    auto publishAfterWriter = [this] {
+        noteWriterChanges();
+        mainQueue_.async(publishingPending());
+    };
+    if (writer().isCurrent()) {
+        writerChanges_.push_back(Change{0, kind, std::move(plugIns), std::move(identifiers)});
+    } else {
+        changeFeed_->note(kind, std::move(plugIns), std::move(identifiers));
+    }
+    writer().async(publishAfterWriter);
+}
+
+void BXDServer::noteWriterChanges() {
+    std::vector<Change> changes;
+    changes.swap(writerChanges_);
+    for (Change& change : changes)
+        changeFeed_->note(change.kind, std::move(change.plugIns), std::move(change.identifiers));
+}
+
+void BXDServer::publishChange(Change::Kind kind, const std::vector<std::shared_ptr<BXDPlugIn>>& plugIns) {
+    std::vector<Uuid> uuids;
+    std::vector<std::string> identifiers;
+    for (const std::shared_ptr<BXDPlugIn>& plugIn : plugIns) {
+        if (!plugIn || !plugIn->uuid()) continue;
+        uuids.push_back(*plugIn->uuid());
+        identifiers.push_back(plugIn->identifier().value_or(""));
+    }
+    if (mainQueue_.isCurrent()) {
+        changeFeed_->publish(kind, std::move(uuids), std::move(identifiers));
+        return;
+    }
+    changeFeed_->note(kind, std::move(uuids), std::move(identifiers));
+    mainQueue_.async(publishingPending());
+}
+
+std::function<void()> BXDServer::publishingPending() const {
+    return [feed = std::weak_ptr<ChangeFeed>(changeFeed_)] {
+        if (std::shared_ptr<ChangeFeed> alive = feed.lock()) alive->publishPending();
+    };
+}
+
+Value BXDServer::currentExclusions() {
+    Value exclusions = userPrefs_->exclusions();
+    if (!(exclusions == lastExclusions_)) {
+        lastExclusions_ = exclusions;
+        changeFeed_->publish(Change::Kind::ExclusionsChanged, {}, {});
+    }
+    return exclusions;
 }
 
 // Every record gets one request to the service manager; their completions run on this call's "killer" queue, one
@@ -154,10 +256,12 @@ bool BXDServer::addHold(std::shared_ptr<BXDPlugInHold> hold, const BXDZemClient*
     // either come before that release (which then takes the hold) or see the death.
     bool added = syncQueue_.sync([&] {
         if (placer != nullptr && placer->isDead()) return false;
-        holds_.push_back(std::move(hold));
+        holds_.push_back(hold);
         return true;
     });
     if (!added) return false;
+    publishChange(Change::Kind::HoldPlaced, hold->blocked());
+    hold.reset();
     log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
     notifyAnnotationChange();
     return true;
@@ -175,6 +279,7 @@ void BXDServer::unholdToken(const Uuid& uuid) {
         holds_.erase(found);
     });
     if (!released) return;
+    publishChange(Change::Kind::HoldReleased, released->blocked());
     released.reset();
     log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());
     notifyAnnotationChange();
@@ -195,6 +300,8 @@ void BXDServer::unholdClient(const BXDZemClient* client) {
         }
     });
     if (released.empty()) return;
+    for (const std::shared_ptr<BXDPlugInHold>& hold : released)
+        publishChange(Change::Kind::HoldReleased, hold->blocked());
     size_t count = released.size();
     released.clear();
     log::ops().debug("keep-alive units open: %zu", BXDPlugInHold::openKeepAliveUnits());

@@ -17,6 +17,7 @@
 #include "base/SerialQueue.h"
 #include "base/SyncQueue.h"
 #include "bexil/Protocol.h"
+#include "daemon/ChangeFeed.h"
 #include "daemon/DiscoveryContinuation.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
@@ -32,6 +33,7 @@ class BXDZemClient;
 class EntitlementsDirectory;
 class EventLoop;
 class LXBexilProxy;
+class PreferencesWatch;
 class ZemListener;
 
 class BXDServer : public BXDatabase, public BXDatabaseDelegate {
@@ -57,8 +59,11 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // initForServiceDatabase). Lives as long as the server; safe from any thread.
     EntitlementsDirectory* entitlementsDirectory() const { return entitlements_.get(); }
 
-    // Database delegate: plug-ins about to be uninstalled.
+    // Database delegate: plug-ins about to be uninstalled, plug-ins installed, elections made automatically. Each
+    // is a change of the feed (see noteChange).
     void removedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
+    void installedPlugIns(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) override;
+    void electedAutomatically(const BXDPlugIn& plugIn) override;
     // Asks the service manager to end every running instance of `plugIns`; `reply` runs once, on a queue of this
     // call, after every request has been answered. Returns at once; nothing blocks while processes end.
     void terminatePlugInsReply(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns,
@@ -112,6 +117,27 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // Makes and checks the continuations of paged discovery with this run's key.
     const DiscoveryContinuation& continuations() const { return continuations_; }
 
+    // ---- Changes ----
+
+    // Every change a client could observe through "match", with its generation. REQUIRES: on mainQueue (but see
+    // ChangeFeed::note).
+    ChangeFeed& changeFeed() { return *changeFeed_; }
+    // Publishes a change of `plugIns` on mainQueue: at once when called there, else as soon as it is free.
+    void publishChange(Change::Kind kind, const std::vector<std::shared_ptr<BXDPlugIn>>& plugIns);
+    // A change made on any thread that becomes public once the writer has finished what it is doing: on the writer
+    // (registry events come there, before the registry's own commit for an uninstall) it waits for
+    // noteWriterChanges, which continueOnWriter calls after a request's work on the writer, and else for the end of
+    // the writer's current block; elsewhere it is noted at once. The feed publishes it on mainQueue.
+    void noteChange(Change::Kind kind, std::vector<Uuid> plugIns, std::vector<std::string> identifiers);
+    // Hands the changes made by the writer's current block to the feed. REQUIRES: on the writer.
+    void noteWriterChanges();
+    // A block for mainQueue that publishes what the feed has noted, unless the server has gone meanwhile.
+    std::function<void()> publishingPending() const;
+    // The global exclusions as stored now, as discovery reads them. Reading them also compares them with the last
+    // value seen, and a difference is published as one exclusions change first, so nothing a "match" or "changes"
+    // sees is missed. REQUIRES: on mainQueue.
+    Value currentExclusions();
+
   private:
     BXDServer(const char* databasePath, EventLoop& loop);
 
@@ -130,6 +156,13 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::array<std::atomic<uint64_t>, protocol::kRequests.size()> served_{};
     const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
     const DiscoveryContinuation continuations_;
+    // Shared so that a publication queued on mainQueue can tell that the server has gone meanwhile.
+    std::shared_ptr<ChangeFeed> changeFeed_;
+    // Changes made by the writer's current block (touched on the writer only).
+    std::vector<Change> writerChanges_;
+    // The exclusions as last seen, to notice a change, and the watch that looks again when the folder changes.
+    Value lastExclusions_;
+    std::unique_ptr<PreferencesWatch> preferencesWatch_;
 };
 
 }  // namespace bexil

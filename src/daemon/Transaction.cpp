@@ -52,6 +52,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Launch, &Transaction::launchPlugIn},
     {Request::Holds, &Transaction::listHolds},
     {Request::Status, &Transaction::reportStatus},
+    {Request::Changes, &Transaction::changesSince},
 }};
 
 constexpr bool handlersFollowTheProtocol() {
@@ -152,7 +153,11 @@ void Transaction::continueOnWriter(std::function<void()> work, std::function<voi
     server()->writer().async(
         [self = shared_from_this(), requests, work = std::move(work), finish = std::move(finish)]() mutable {
             self->guarded(work);
+            // What the work changed is published before the reply goes out, so a client that has its answer and
+            // then asks for changes sees its own.
+            self->server()->noteWriterChanges();
             requests.async([self = std::move(self), finish = std::move(finish)] {
+                self->server()->changeFeed().publishPending();
                 if (finish) self->guarded(finish);
                 if (!self->answered()) {
                     log::ops().fault("%{public}s left unanswered for client %d",

@@ -105,12 +105,14 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void launchPlugIn();
     void listHolds();
     void reportStatus();
+    void changesSince();
     // The parts of "add" and "remove" that run on the writer queue.
     void registerPaths(std::optional<UserIdentity> caller);
     void unregisterPaths(bool entitled);
-    // Writes the annotation changes made so far on the writer queue, then answers: done() and the change
-    // notification when `succeeded`, else the failure the handler made already.
-    void saveAnnotationsThenAnswer(bool succeeded);
+    // Writes the annotation changes made so far on the writer queue, then publishes them as one change of
+    // `changed` (whatever the outcome: they are in memory) and answers: done() and the change notification when
+    // `succeeded`, else the failure the handler made already.
+    void saveAnnotationsThenAnswer(bool succeeded, std::vector<std::shared_ptr<BXDPlugIn>> changed);
 
   private:
     void runHandler(protocol::Request request);

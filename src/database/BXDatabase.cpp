@@ -403,6 +403,7 @@ void BXDatabase::autoElect(const BXDPlugIn& plugIn) {
     annotations_->changeAnnotationForPlugIn(*elected, plugIn);
     // Nobody waits for this one: an election lost to a crash is made again when the record is next built.
     writer_.async([this] { saveAnnotations(); });
+    if (BXDatabaseDelegate* target = delegate()) target->electedAutomatically(plugIn);
 }
 
 // ---- Registry events ----
@@ -412,6 +413,7 @@ void BXDatabase::pluginsDidInstall(const std::vector<std::shared_ptr<const LXBex
         log::ops().notice("plug-in INSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
                           proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
     }
+    if (BXDatabaseDelegate* target = delegate()) target->installedPlugIns(plugIns);
 }
 
 void BXDatabase::pluginsWillUninstall(const std::vector<std::shared_ptr<const LXBexilProxy>>& plugIns) {

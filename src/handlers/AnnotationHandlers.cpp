@@ -69,6 +69,7 @@ void Transaction::annotatePlugIns() {
     const Value* newElection = changeValue.find(kElectionKey);
     const pid_t pid = client()->pid();
     holdReply();
+    std::vector<std::shared_ptr<BXDPlugIn>> changed;
     bool walked = processUuidList([&](const std::shared_ptr<BXDPlugIn>& plugIn) {
         std::optional<std::string> identifier = plugIn->identifier();
         std::string uuid = uuidText(*plugIn);
@@ -76,14 +77,16 @@ void Transaction::annotatePlugIns() {
         if (newElection != nullptr)
             log::ops().info("client %d plug-in %@(%{public}@) election := %@", pid, identifier, uuid, *newElection);
         server()->changeAnnotationForPlugIn(changeValue, *plugIn);
+        changed.push_back(plugIn);
         return true;
     });
-    saveAnnotationsThenAnswer(walked);
+    saveAnnotationsThenAnswer(walked, std::move(changed));
 }
 
-void Transaction::saveAnnotationsThenAnswer(bool succeeded) {
+void Transaction::saveAnnotationsThenAnswer(bool succeeded, std::vector<std::shared_ptr<BXDPlugIn>> changed) {
     continueOnWriter([this] { server()->saveAnnotations(); },
-                     [this, succeeded] {
+                     [this, succeeded, changed = std::move(changed)] {
+                         if (!changed.empty()) server()->publishChange(Change::Kind::Annotated, changed);
                          if (!succeeded) return;
                          server()->notifyAnnotationChange();
                          done();
@@ -100,30 +103,32 @@ void Transaction::bulkAnnotatePlugIns() {
 
     const pid_t pid = client()->pid();
     holdReply();
+    std::vector<std::shared_ptr<BXDPlugIn>> changed;
     for (const DictionaryEntry& entry : annotations->entries()) {
         if (!entry.value.isDictionary()) {
             fail(ErrorCode::BadBulkAnnotation, "annotations values must be dictionaries");
-            saveAnnotationsThenAnswer(false);
+            saveAnnotationsThenAnswer(false, std::move(changed));
             return;
         }
         std::optional<Uuid> uuid = Uuid::parse(entry.key);
         if (!uuid) {
             fail(ErrorCode::BadBulkAnnotation, "invalid plug-in UUID value");
-            saveAnnotationsThenAnswer(false);
+            saveAnnotationsThenAnswer(false, std::move(changed));
             return;
         }
         std::shared_ptr<BXDPlugIn> plugIn = server()->findPlugIn(*uuid);
         if (!plugIn) {
             fail(ErrorCode::RegistryRefused, "no plug-in with the requested uuid");
-            saveAnnotationsThenAnswer(false);
+            saveAnnotationsThenAnswer(false, std::move(changed));
             return;
         }
         log::ops().debug("client %d bulk plug-in %@(%{public}@) annotation change: %@", pid, plugIn->identifier(),
                          uuid->string(), entry.value);
         // The whole "extension" annotation is replaced; the election is a separate key and stays.
         server()->changeAnnotationForPlugIn(Value::dictionary({{std::string(kExtensionKey), entry.value}}), *plugIn);
+        changed.push_back(std::move(plugIn));
     }
-    saveAnnotationsThenAnswer(true);
+    saveAnnotationsThenAnswer(true, std::move(changed));
 }
 
 void Transaction::addAnnotationForPlugInIn(const BXDPlugIn& plugIn, MutableDictionary& entry) {
