@@ -11,8 +11,8 @@
 //           back), so what is measured is the daemon and the kernel, not a client library;
 //   lib     the clients are applications of the shared library libbexil: each holds one DaemonClient and waits for
 //           every reply with its wait(), as a program that needs the answer before going on does. The difference
-//           to "frames" is the library's own cost: building the request, its event-loop thread, the hand-over of
-//           the reply to the waiting thread.
+//           to "frames" is the library's own cost: building the request, encoding it, reading and decoding the
+//           reply (on the waiting thread itself while the connection is otherwise idle), handing it back.
 // Both send the request the library builds for "ready" with no plug-ins, byte for byte the same: bxd answers it
 // without touching a plug-in (the reply it gave is printed with the figures), after the whole path of any request:
 // frame cutting, decoding, the request queue, the envelope checks, the handler table, the reply and its encoding. The
@@ -20,7 +20,9 @@
 // the request, on every side, the library's "match" for an extension point nobody offers with BYTES of padding in
 // its rules (the large-request case, e.g. --payload 1048576); bxd decodes it whole and answers with no matches.
 // --reply-payload BYTES registers plug-ins whose forms add up to about BYTES and makes the request, on every side,
-// the library's "match" of them (the large-reply case); the raw side then answers with as many bytes.
+// the library's "match" of them (the large-reply case); the raw side then answers with as many bytes. With either,
+// the library side sends what DaemonClient::match sends, which asks for pages: bxd then takes its paged path (it
+// binds a continuation to the rules), which the frames side's unpaged "match" does not.
 //
 // Clients, the echo server and bxd are all processes forked from this one, so `taskset -c 0 bxd_load_bench ...`
 // pins every one of them to one CPU (the CPU cost alone), while an unpinned run shows what wake-ups across CPUs add.

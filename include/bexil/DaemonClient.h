@@ -99,6 +99,8 @@ class DaemonClient {
 
     // Runs `start` with a callback and waits for its reply at most `timeout`:
     //     auto reply = client.wait([&](auto done) { client.bulk(0, done); });
+    // When the connection has nothing else in flight, the waiting thread sends the request and reads the reply
+    // itself; a callback of the application's own that `start` passes instead still runs on the client's queue.
     Reply wait(const std::function<void(Callback)>& start,
                std::chrono::milliseconds timeout = std::chrono::seconds(30));
 

@@ -1,5 +1,6 @@
 #include "client/BXDaemonClient.h"
 
+#include <deque>
 #include <unordered_map>
 #include <utility>
 
@@ -14,6 +15,32 @@ namespace key = protocol::key;
 using protocol::Request;
 
 constexpr std::string_view kUnknownErrorMessage = "unknown error returned by Bexil subsystem";
+
+// The requests made with a CallerThreadHandler inside waitOnCallingThread on this thread, waiting to be sent. A
+// handler that runs on the waiting thread and asks again (the next page) only adds to the list, so a long exchange
+// of pages is a loop, not a recursion.
+struct CallerThreadRequests {
+    struct Request {
+        BXDaemonClient* client;
+        Value message;
+        BXDaemonClient::ReplyHandler reply;
+    };
+    std::deque<Request> requests;
+};
+thread_local CallerThreadRequests* callerThreadRequests = nullptr;
+
+BXDaemonClient::Reply replyOf(const std::variant<ZemMessage, ZemError>& answer) {
+    if (const auto* message = std::get_if<ZemMessage>(&answer)) return BXDaemonClient::Reply(message->body());
+    return BXDaemonClient::Reply(std::get<ZemError>(answer));
+}
+
+void traceReply(const BXDaemonClient::Reply& answer) {
+    if (const auto* error = std::get_if<ZemError>(&answer)) {
+        log::traffic().debug("reply: %@", *error);
+    } else {
+        log::traffic().debug("reply: %@", std::get<Value>(answer));
+    }
+}
 
 }  // namespace
 
@@ -63,15 +90,48 @@ void BXDaemonClient::setUuids(MutableDictionary& request, const std::vector<Uuid
 }
 
 void BXDaemonClient::sendReply(const Value& request, ReplyHandler reply) {
+    if (callerThreadRequests != nullptr && reply.target<CallerThreadHandler>() != nullptr) {
+        callerThreadRequests->requests.push_back({this, request, std::move(reply)});
+        return;
+    }
+    sendOnQueue(request, std::move(reply));
+}
+
+void BXDaemonClient::sendOnQueue(const Value& request, ReplyHandler reply) {
     log::traffic().debug("request: %@", request);
     bxd_->sendWithReply(request, replyQueue_, [reply = std::move(reply)](const Reply& answer) {
-        if (const auto* error = std::get_if<ZemError>(&answer)) {
-            log::traffic().debug("reply: %@", *error);
-        } else {
-            log::traffic().debug("reply: %@", std::get<Value>(answer));
-        }
+        traceReply(answer);
         if (reply) reply(answer);
     });
+}
+
+void BXDaemonClient::exchangeOnCallingThread(const Value& request, ReplyHandler reply,
+                                             std::chrono::steady_clock::time_point deadline) {
+    log::traffic().debug("request: %@", request);
+    ZemConnection::MessageReplyHandler handler =
+        [reply = std::move(reply)](const std::variant<ZemMessage, ZemError>& answer) {
+            Reply raw = replyOf(answer);
+            traceReply(raw);
+            reply(raw);
+        };
+    if (bxd_->exchangeOnCallingThread(request, replyQueue_, handler, deadline)) return;
+    bxd_->sendWithMessageReply(request, replyQueue_, std::move(handler));
+}
+
+void BXDaemonClient::waitOnCallingThread(const std::function<void()>& start,
+                                         const std::function<std::chrono::steady_clock::time_point()>& deadline) {
+    CallerThreadRequests pending;
+    struct Scope {
+        CallerThreadRequests* outer;
+        explicit Scope(CallerThreadRequests* mine) : outer(std::exchange(callerThreadRequests, mine)) {}
+        ~Scope() { callerThreadRequests = outer; }
+    } scope(&pending);
+    start();
+    while (!pending.requests.empty()) {
+        CallerThreadRequests::Request next = std::move(pending.requests.front());
+        pending.requests.pop_front();
+        next.client->exchangeOnCallingThread(next.message, std::move(next.reply), deadline());
+    }
 }
 
 void BXDaemonClient::addPlugInsReply(const Value& paths, ReplyHandler reply) {
@@ -143,7 +203,7 @@ void BXDaemonClient::matchAllPagesReply(const Value& rules, uint64_t flags, uint
 }
 
 void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation) {
-    matchPagePlugInsFlagsReply(walk->rules, walk->flags, walk->pageSize, continuation, [this, walk](const Reply& raw) {
+    auto onPage = [this, walk](const Reply& raw) {
         const Value* message = std::get_if<Value>(&raw);
         bool failed = message == nullptr;
         try {
@@ -171,7 +231,13 @@ void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const 
             whole.set(key::kMatches, Value::array(std::move(walk->forms)));
         }
         walk->reply(Reply(whole.take()));
-    });
+    };
+    // A walk for a waiting thread stays on it from page to page.
+    if (walk->reply.target<CallerThreadHandler>() != nullptr)
+        matchPagePlugInsFlagsReply(walk->rules, walk->flags, walk->pageSize, continuation,
+                                   CallerThreadHandler{std::move(onPage)});
+    else
+        matchPagePlugInsFlagsReply(walk->rules, walk->flags, walk->pageSize, continuation, std::move(onPage));
 }
 
 void BXDaemonClient::linkReplacements(std::vector<Value>& forms) {

@@ -4,11 +4,13 @@
 // builds one request dictionary per operation, sends it with a reply expected and hands the raw reply (the reply
 // dictionary or the connection error in its place) to the caller's callback on its own serial queue, "bxd_client".
 // The request methods may be called from any thread; every callback and connection event of one client runs on
-// its replyQueue, one at a time, in delivery order. The object keeps its one connection for its whole life and
-// never reconnects; destroying it cancels the connection, and replies still outstanding then arrive as
-// connection errors.
+// its replyQueue, one at a time, in delivery order, except the library's own hand-backs to a thread that waits for
+// its reply (CallerThreadHandler), which may run on that thread. The object keeps its one connection for its whole life
+// and never reconnects; destroying it cancels the connection, and replies still outstanding then arrive as connection
+// errors.
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -39,6 +41,20 @@ class BXDaemonClient {
     using ReplyHandler = std::function<void(const Reply&)>;
     // A reply together with the descriptors it passed (only "launch" passes one).
     using MessageReplyHandler = ZemConnection::MessageReplyHandler;
+    // A reply handler of the library's own that only hands the reply to a thread blocked in waitOnCallingThread
+    // (it runs no application code). A request made with one inside that wait may be answered on the waiting thread
+    // instead of the reply queue.
+    struct CallerThreadHandler {
+        ReplyHandler handler;
+        void operator()(const Reply& reply) const { handler(reply); }
+    };
+    // Runs `start`, then sends the requests that it (and the handlers of their replies) made with a
+    // CallerThreadHandler one after the other, each exchanged on this thread when its connection allows
+    // (ZemConnection::exchangeOnCallingThread) and sent as usual otherwise; `deadline()` bounds each exchange.
+    // Returns when no such request is left to send; the caller then waits for the reply it wants as before.
+    // REQUIRES: not called on a reply queue.
+    static void waitOnCallingThread(const std::function<void()>& start,
+                                    const std::function<std::chrono::steady_clock::time_point()>& deadline);
 
     // Connects to `serviceName`, or to kDefaultServiceName when it is null. The reply queue runs on `loop`.
     explicit BXDaemonClient(const char* serviceName = nullptr, EventLoop& loop = EventLoop::shared());
@@ -108,6 +124,11 @@ class BXDaemonClient {
 
   private:
     struct PagedWalk;
+    // Sends `request` on the connection, answering `reply` on the reply queue.
+    void sendOnQueue(const Value& request, ReplyHandler reply);
+    // One exchange of waitOnCallingThread.
+    void exchangeOnCallingThread(const Value& request, ReplyHandler reply,
+                                 std::chrono::steady_clock::time_point deadline);
     void continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation);
 
     std::string serviceName_;

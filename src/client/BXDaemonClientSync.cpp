@@ -1,5 +1,6 @@
 #include "client/BXDaemonClientSync.h"
 
+#include <algorithm>
 #include <future>
 #include <memory>
 
@@ -18,8 +19,14 @@ std::optional<BXDaemonClient::Reply> sendAndWait(
     // The promise is shared with the handler: a reply that arrives after the wait gave up must still find it.
     auto promise = std::make_shared<std::promise<BXDaemonClient::Reply>>();
     std::future<BXDaemonClient::Reply> future = promise->get_future();
-    start([promise](const BXDaemonClient::Reply& reply) { promise->set_value(reply); });
     auto deadline = std::chrono::steady_clock::now() + timeout;
+    // The handler only fulfils the promise, so the reply may be read on this thread, which waits for it anyway.
+    BXDaemonClient::waitOnCallingThread(
+        [&] {
+            start(BXDaemonClient::CallerThreadHandler{
+                [promise](const BXDaemonClient::Reply& reply) { promise->set_value(reply); }});
+        },
+        [&] { return lastActivity ? std::max(deadline, lastActivity() + timeout) : deadline; });
     while (future.wait_until(deadline) != std::future_status::ready) {
         auto extended = lastActivity ? lastActivity() + timeout : deadline;
         if (extended > deadline) {

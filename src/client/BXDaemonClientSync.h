@@ -1,7 +1,8 @@
 #pragma once
 
 // A synchronous layer over BXDaemonClient for tools and simple programs: start a request, wait for its reply with
-// a time limit. The callback API stays the primary one; this only parks the calling thread on a future.
+// a time limit. The callback API stays the primary one. The waiting thread sends the request and reads the reply
+// itself when the connection is idle (BXDaemonClient::waitOnCallingThread), and otherwise parks on a future.
 // REQUIRES: not called on the client's replyQueue (the reply could never be delivered while it waits).
 
 #include <chrono>

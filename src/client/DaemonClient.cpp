@@ -54,10 +54,21 @@ DaemonClient::Reply makeReply(const BXDaemonClient::Reply& raw) {
     return reply;
 }
 
+// wait()'s own callback: it only fulfils the waiting thread's promise.
+struct WaitDone {
+    std::shared_ptr<std::promise<DaemonClient::Reply>> promise;
+    void operator()(const DaemonClient::Reply& reply) const { promise->set_value(reply); }
+};
+
 BXDaemonClient::ReplyHandler adapt(DaemonClient::Callback done) {
-    return [done = std::move(done)](const BXDaemonClient::Reply& raw) {
+    const bool forWait = done.target<WaitDone>() != nullptr;
+    auto handler = [done = std::move(done)](const BXDaemonClient::Reply& raw) {
         if (done) done(makeReply(raw));
     };
+    // wait()'s callback runs no application code: its reply may be read on the thread that waits for it. Every
+    // other callback runs on the client's queue.
+    if (forWait) return BXDaemonClient::CallerThreadHandler{std::move(handler)};
+    return handler;
 }
 
 }  // namespace
@@ -134,8 +145,9 @@ DaemonClient::Reply DaemonClient::wait(const std::function<void(Callback)>& star
     // Shared with the callback: a reply that arrives after the wait gave up must still find its promise.
     auto promise = std::make_shared<std::promise<Reply>>();
     std::future<Reply> future = promise->get_future();
-    start([promise](const Reply& reply) { promise->set_value(reply); });
-    if (future.wait_for(timeout) == std::future_status::ready) return future.get();
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    BXDaemonClient::waitOnCallingThread([&] { start(WaitDone{promise}); }, [deadline] { return deadline; });
+    if (future.wait_until(deadline) == std::future_status::ready) return future.get();
     log::ops().error("no reply from bxd within %lld ms", static_cast<long long>(timeout.count()));
     Reply reply;
     reply.connectionFailed = true;

@@ -8,6 +8,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <string>
@@ -65,6 +66,22 @@ class ZemConnection {
     virtual void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) = 0;
     // The same, handing over the whole reply message with any descriptors it carries.
     virtual void sendWithMessageReply(const Value& message, SerialQueue& replyQueue, MessageReplyHandler handler) = 0;
+    // Client side, for a thread that would otherwise only block until the reply has come: sends `message` and reads
+    // its reply on the calling thread, with no trip through the connection's queue, when the connection is idle
+    // (nothing of it in flight or queued, as after an earlier exchange of this kind). Returns false, having sent
+    // nothing and kept `handler`, when it is not; the caller then sends as usual and later calls may succeed. When
+    // it returns true `handler` has run here with the reply or the error in its place, or, when `deadline` came
+    // first, it has been handed over to run on `replyQueue` once the reply comes, as sendWithMessageReply's would.
+    // `handler` runs no application code (the library's own hand-back to the waiting thread).
+    // Client side: whether the connection may stop reading while it is idle, so that waiting threads read their own
+    // replies (exchangeOnCallingThread). True by default. A client that expects messages it did not ask for turns it
+    // off; they then reach the event handler as they come, not only once the next request is made.
+    virtual void setParkable(bool parkable) { (void)parkable; }
+    virtual bool exchangeOnCallingThread(const Value& message, SerialQueue& replyQueue, MessageReplyHandler& handler,
+                                         std::chrono::steady_clock::time_point deadline) {
+        (void)message, (void)replyQueue, (void)handler, (void)deadline;
+        return false;
+    }
 
     // The peer's credentials taken when the connection was accepted (peer connections) or made (client side:
     // the service's). A pid of 0 when they are unknown.

@@ -24,6 +24,16 @@
 // delivering the request further out on the stack: every member function is safe to enter that way. The queued-bytes
 // limit bounds what a peer that stops reading can cost us. Every pending operation holds a strong reference, so the
 // object lives exactly as long as it has I/O in flight or an owner outside.
+//
+// A client connection may also be driven by the thread that waits for a reply. Handing every request to the loop's
+// thread and every reply back costs two wake-ups per round trip, more than the rest of a small request. So once a
+// waiting caller has asked for it (exchangeOnCallingThread) and the connection is idle, the queue parks it: the
+// socket leaves the reactor, so data arriving on it wakes nobody. A later caller that finds it parked, with no send
+// of its own thread still queued, takes it over, writes its request and reads the reply itself, then parks it again;
+// while it does, any work that reaches the queue waits in `deferred_`. A caller that leaves anything behind (a
+// request whose reply did not come before its deadline, frames that were not its reply, a broken stream) gives the
+// socket back to the queue (Owner::Returning), which takes over from where the caller stopped. Peer connections are
+// never parked.
 
 namespace bexil {
 
@@ -100,6 +110,7 @@ void ZemSocketConnection::watchStall() {
 }
 
 ZemSocketConnection::~ZemSocketConnection() {
+    if (parkedFd_ >= 0) ::close(parkedFd_);
     if (finalizer_) finalizer_(std::move(context_));
 }
 
@@ -113,19 +124,23 @@ std::shared_ptr<void> ZemSocketConnection::context() const { return context_; }
 void ZemSocketConnection::setFinalizer(Finalizer finalizer) { finalizer_ = std::move(finalizer); }
 
 void ZemSocketConnection::resume() {
-    queue_.async([self = shared_from_this()] {
-        if (!self->suspended_) return;
-        self->suspended_ = false;
-        if (self->side_ == Side::Client && self->state_ == State::Idle && !self->connectClient()) return;
-        std::vector<ZemFrame> held = std::move(self->heldFrames_);
-        self->heldFrames_.clear();
-        for (ZemFrame& frame : held) {
-            if (self->state_ != State::Open) break;
-            self->handleFrame(std::move(frame));
-        }
-        self->readMore();
-        self->writeMore();
-    });
+    queue_.async([self = shared_from_this()] { self->resumeOnQueue(); });
+}
+
+void ZemSocketConnection::resumeOnQueue() {
+    if (!suspended_) return;
+    if (takeSocketBack([this] { return [self = shared_from_this()] { self->resumeOnQueue(); }; }) == Reclaim::Deferred)
+        return;
+    suspended_ = false;
+    if (side_ == Side::Client && state_ == State::Idle && !connectClient()) return;
+    std::vector<ZemFrame> held = std::move(heldFrames_);
+    heldFrames_.clear();
+    for (ZemFrame& frame : held) {
+        if (state_ != State::Open) break;
+        handleFrame(std::move(frame));
+    }
+    readMore();
+    writeMore();
 }
 
 void ZemSocketConnection::suspend() {
@@ -143,8 +158,11 @@ void ZemSocketConnection::deliverTerminationImminent() {
 }
 
 void ZemSocketConnection::send(const Value& message) {
-    queue_.async(
-        [self = shared_from_this(), message] { self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt); });
+    if (side_ == Side::Client) posted_.fetch_add(1, std::memory_order_acq_rel);
+    queue_.async([self = shared_from_this(), message] {
+        self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt);
+        if (self->side_ == Side::Client) self->posted_.fetch_sub(1, std::memory_order_acq_rel);
+    });
 }
 
 void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& reply) {
@@ -185,9 +203,241 @@ void ZemSocketConnection::sendWithReply(const Value& message, SerialQueue& reply
 
 void ZemSocketConnection::sendWithMessageReply(const Value& message, SerialQueue& replyQueue,
                                                MessageReplyHandler handler) {
+    // Counted until it has run, so that a caller on this thread waiting for a later request cannot overtake it.
+    if (side_ == Side::Client) posted_.fetch_add(1, std::memory_order_acq_rel);
     queue_.async([self = shared_from_this(), message, pending = PendingReply{replyQueue, std::move(handler)}] {
         self->enqueueFrame(ZemFrameKind::Request, 0, message, pending);
+        if (self->side_ == Side::Client) self->posted_.fetch_sub(1, std::memory_order_acq_rel);
     });
+}
+
+template <class MakeRetry>
+ZemSocketConnection::Reclaim ZemSocketConnection::takeSocketBack(MakeRetry&& makeRetry) {
+    if (side_ != Side::Client) return Reclaim::Owned;
+    std::lock_guard lock(ownerMutex_);
+    switch (owner_) {
+        case Owner::Loop:
+            return Reclaim::Owned;
+        case Owner::Caller:
+        case Owner::Returning:
+            deferred_.emplace_back(makeRetry());
+            return Reclaim::Deferred;
+        case Owner::Parked:
+            break;
+    }
+    reclaimLocked();
+    return Reclaim::Reclaimed;
+}
+
+void ZemSocketConnection::reclaimLocked() {
+    asio::error_code error;
+    socket_.assign(asio::local::stream_protocol(), parkedFd_, error);
+    if (error) {
+        // The socket cannot be watched again (the reactor is out of memory): what uses it next fails and ends the
+        // connection the usual way.
+        log::ops().error("cannot watch the connection to %s again: %s", serviceName_.c_str(), error.message().c_str());
+        ::close(parkedFd_);
+    }
+    parkedFd_ = -1;
+    owner_ = Owner::Loop;
+}
+
+void ZemSocketConnection::setParkable(bool parkable) {
+    parkable_.store(parkable, std::memory_order_relaxed);
+    if (!parkable) queue_.async([self = shared_from_this()] { self->unpark(); });
+}
+
+void ZemSocketConnection::unpark() {
+    if (takeSocketBack([this] { return [self = shared_from_this()] { self->unpark(); }; }) == Reclaim::Reclaimed)
+        readMore();
+}
+
+bool ZemSocketConnection::parkIfIdle() {
+    if (side_ != Side::Client || !parkWanted_.load(std::memory_order_relaxed) ||
+        !parkable_.load(std::memory_order_relaxed))
+        return false;
+    if (!pendingReplies_.empty() || !outgoing_.empty() || !writing_.empty() || writeInFlight_ ||
+        !attachments_.empty() || reader_.hasPartialFrame() || !receivedFds_.empty() || !heldFrames_.empty())
+        return false;
+    std::lock_guard lock(ownerMutex_);
+    if (owner_ != Owner::Loop || !deferred_.empty()) return false;
+    asio::error_code error;
+    int fd = socket_.release(error);
+    if (error) return false;
+    parkedFd_ = fd;
+    owner_ = Owner::Parked;
+    return true;
+}
+
+bool ZemSocketConnection::pollUntil(int fd, short events, std::chrono::steady_clock::time_point deadline) {
+    for (;;) {
+        auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        pollfd probe{.fd = fd, .events = events, .revents = 0};
+        int ready = ::poll(&probe, 1, static_cast<int>(std::clamp<int64_t>(left.count(), 0, INT32_MAX)));
+        if (ready > 0) return true;
+        if (ready < 0 && errno == EINTR) continue;
+        if (ready < 0 || left.count() <= 0) return false;
+    }
+}
+
+bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQueue& replyQueue,
+                                                  MessageReplyHandler& handler,
+                                                  std::chrono::steady_clock::time_point deadline) {
+    if (side_ != Side::Client || !parkable_.load(std::memory_order_relaxed)) return false;
+    {
+        std::lock_guard lock(ownerMutex_);
+        if (owner_ != Owner::Parked || posted_.load(std::memory_order_acquire) != 0) {
+            parkWanted_.store(true, std::memory_order_relaxed);
+            return false;
+        }
+        owner_ = Owner::Caller;
+    }
+    // From here on this thread owns the socket, the reader, the buffers and the serials, until handBack.
+    const int fd = parkedFd_;
+    // What came while the connection was parked (a message, the end of the stream) is the queue's to handle before
+    // this request, which then goes the usual way.
+    pollfd probe{.fd = fd, .events = POLLIN | POLLRDHUP, .revents = 0};
+    if (::poll(&probe, 1, 0) != 0) {
+        HandBack work;
+        work.readFirst = true;
+        handBack(std::move(work));
+        return false;
+    }
+    const uint64_t serial = nextSerial_++;
+    if (std::optional<Error> error = ZemFrame::encode(ZemFrameKind::Request, serial, 0, message, outgoing_)) {
+        log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(ZemFrameKind::Request),
+                         static_cast<int>(pid_), *error);
+        handBack({});
+        handler(std::variant<ZemMessage, ZemError>(ZemError(ZemError::Kind::MessageInvalid)));
+        return true;
+    }
+    auto answer = [&](std::variant<ZemMessage, ZemError> reply, HandBack work) {
+        handBack(std::move(work));
+        handler(reply);
+        return true;
+    };
+    auto fail = [&](ZemError::Kind kind) {
+        outgoing_.clear();
+        HandBack work;
+        work.broken = kind;
+        return answer(ZemError(kind), std::move(work));
+    };
+    // The deadline came first: the queue waits for the reply in this thread's place.
+    auto adopt = [&](size_t sent) {
+        outgoing_.erase(outgoing_.begin(), outgoing_.begin() + static_cast<std::ptrdiff_t>(sent));
+        HandBack work;
+        work.adopted.emplace(serial, PendingReply{replyQueue, std::move(handler)});
+        handBack(std::move(work));
+        return true;
+    };
+    for (size_t sent = 0; sent < outgoing_.size();) {
+        ssize_t bytes = ::send(fd, outgoing_.data() + sent, outgoing_.size() - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
+        if (bytes >= 0) {
+            sent += static_cast<size_t>(bytes);
+            continue;
+        }
+        if (errno == EINTR) continue;
+        if (errno != EAGAIN && errno != EWOULDBLOCK) return fail(ZemError::Kind::ConnectionInterrupted);
+        if (!pollUntil(fd, POLLOUT, deadline)) return adopt(sent);
+    }
+    outgoing_.clear();
+    for (;;) {
+        while (std::optional<ZemFrame> frame = reader_.next()) {
+            if (frame->kind() != ZemFrameKind::Reply || frame->inReplyTo() != serial) {
+                strayFrames_.push_back(std::move(*frame));
+                continue;
+            }
+            Result<Value> body = frame->decodePayload();
+            if (!body) {
+                log::ops().error("protocol violation by peer %d in %s: %@; disconnecting", static_cast<int>(pid_),
+                                 frame->description().c_str(), body.error());
+                return fail(ZemError::Kind::ConnectionInvalid);
+            }
+            const size_t announced = frame->header().descriptorCount;
+            if (receivedFds_.size() < announced) {
+                log::ops().error(
+                    "protocol violation by peer %d: %s announces %zu descriptors but %zu arrived; disconnecting",
+                    static_cast<int>(pid_), frame->description().c_str(), announced, receivedFds_.size());
+                return fail(ZemError::Kind::ConnectionInvalid);
+            }
+            std::vector<UniqueFd> descriptors;
+            for (size_t i = 0; i < announced; ++i) {
+                descriptors.push_back(std::move(receivedFds_.front()));
+                receivedFds_.pop_front();
+            }
+            // Frames behind the reply that came with it are the queue's.
+            while (std::optional<ZemFrame> behind = reader_.next()) strayFrames_.push_back(std::move(*behind));
+            return answer(ZemMessage(std::move(*body), frame->serial(), false, std::move(descriptors)), {});
+        }
+        if (reader_.error()) {
+            log::ops().error("protocol violation by peer %d: %@; disconnecting", static_cast<int>(pid_),
+                             *reader_.error());
+            return fail(ZemError::Kind::ConnectionInvalid);
+        }
+        if (!pollUntil(fd, POLLIN, deadline)) return adopt(0);
+        bool overflow = false;
+        ssize_t bytes = receiveInto(fd, overflow);
+        if (overflow) {
+            log::ops().error(
+                "protocol violation by peer %d: more descriptors than its frames may carry "
+                "(kMaxPendingDescriptors %zu); disconnecting",
+                static_cast<int>(pid_), kMaxPendingDescriptors);
+            return fail(ZemError::Kind::ConnectionInvalid);
+        }
+        if (bytes == 0) {
+            if (reader_.hasPartialFrame())
+                log::ops().error("peer %d closed its connection in the middle of a frame", static_cast<int>(pid_));
+            return fail(ZemError::Kind::ConnectionInterrupted);
+        }
+        if (bytes < 0) {
+            if (errno == EINTR || errno == EAGAIN || errno == EWOULDBLOCK) continue;
+            return fail(ZemError::Kind::ConnectionInterrupted);
+        }
+        reader_.feed(std::span<const uint8_t>(readBuffer_.data(), static_cast<size_t>(bytes)));
+    }
+}
+
+void ZemSocketConnection::handBack(HandBack work) {
+    const bool leftovers = work.adopted || work.broken || work.readFirst || !strayFrames_.empty() ||
+                           reader_.hasPartialFrame() || !receivedFds_.empty() || !outgoing_.empty();
+    {
+        std::lock_guard lock(ownerMutex_);
+        if (!leftovers && deferred_.empty()) {
+            owner_ = Owner::Parked;
+            return;
+        }
+        owner_ = Owner::Returning;
+    }
+    queue_.async(
+        [self = shared_from_this(), work = std::move(work)]() mutable { self->finishHandBack(std::move(work)); });
+}
+
+void ZemSocketConnection::finishHandBack(HandBack work) {
+    std::vector<std::function<void()>> deferred;
+    {
+        std::lock_guard lock(ownerMutex_);
+        deferred.swap(deferred_);
+        reclaimLocked();
+    }
+    if (work.adopted) {
+        if (state_ == State::Open)
+            pendingReplies_.emplace(work.adopted->first, std::move(work.adopted->second));
+        else
+            answerWithError(work.adopted->second, ZemError::Kind::ConnectionInvalid);
+    }
+    if (work.broken) {
+        close(*work.broken);
+    } else if (state_ == State::Open) {
+        std::vector<ZemFrame> strays = std::move(strayFrames_);
+        strayFrames_.clear();
+        for (ZemFrame& frame : strays) {
+            if (state_ != State::Open) break;
+            handleFrame(std::move(frame));
+        }
+        writeMore();
+        readMore();
+    }
+    for (std::function<void()>& block : deferred) block();
 }
 
 bool ZemSocketConnection::connectClient() {
@@ -241,6 +491,7 @@ void ZemSocketConnection::readMore() {
         return endOfStream();
     }
     if (suspended_ || reading_ || state_ != State::Open) return;
+    if (parkIfIdle()) return;
     watchStall();
     reading_ = true;
     socket_.async_wait(Socket::wait_read,
@@ -253,6 +504,21 @@ void ZemSocketConnection::readMore() {
 }
 
 ssize_t ZemSocketConnection::receive() {
+    bool overflow = false;
+    ssize_t bytes = receiveInto(socket_.native_handle(), overflow);
+    if (overflow) {
+        log::ops().error(
+            "protocol violation by peer %d: more descriptors than its frames may carry "
+            "(kMaxPendingDescriptors %zu); disconnecting",
+            static_cast<int>(pid_), kMaxPendingDescriptors);
+        close(ZemError::Kind::ConnectionInvalid);
+        errno = ECONNABORTED;
+        return -1;
+    }
+    return bytes;
+}
+
+ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
     if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
     iovec chunk{readBuffer_.data(), readBuffer_.size()};
     // Room for one frame's descriptors: the kernel never joins the descriptors of two sends in one read.
@@ -262,7 +528,7 @@ ssize_t ZemSocketConnection::receive() {
     message.msg_iovlen = 1;
     message.msg_control = control;
     message.msg_controllen = sizeof control;
-    ssize_t bytes = ::recvmsg(socket_.native_handle(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    ssize_t bytes = ::recvmsg(fd, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
     if (bytes < 0) return bytes;
     for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr; header = CMSG_NXTHDR(&message, header)) {
         if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
@@ -273,15 +539,7 @@ ssize_t ZemSocketConnection::receive() {
             receivedFds_.emplace_back(fd);
         }
     }
-    if ((message.msg_flags & MSG_CTRUNC) != 0 || receivedFds_.size() > kMaxPendingDescriptors) {
-        log::ops().error(
-            "protocol violation by peer %d: more descriptors than its frames may carry "
-            "(kMaxPendingDescriptors %zu); disconnecting",
-            static_cast<int>(pid_), kMaxPendingDescriptors);
-        close(ZemError::Kind::ConnectionInvalid);
-        errno = ECONNABORTED;
-        return -1;
-    }
+    overflow = (message.msg_flags & MSG_CTRUNC) != 0 || receivedFds_.size() > kMaxPendingDescriptors;
     return bytes;
 }
 
@@ -362,6 +620,21 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
 
 void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
                                        std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors) {
+    const Reclaim reclaim = takeSocketBack([&] {
+        auto owned = std::make_shared<std::vector<UniqueFd>>(std::move(descriptors));
+        return [self = shared_from_this(), kind, inReplyTo, payload, pending = std::move(pending), owned] {
+            self->enqueueFrame(kind, inReplyTo, payload, pending, std::move(*owned));
+        };
+    });
+    if (reclaim == Reclaim::Deferred) return;
+    const bool reconnecting = side_ == Side::Client && state_ == State::Interrupted;
+    enqueueOwnedFrame(kind, inReplyTo, payload, std::move(pending), std::move(descriptors));
+    // A socket back from a park, or a new one, must be read again.
+    if (reclaim == Reclaim::Reclaimed || reconnecting) readMore();
+}
+
+void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
+                                            std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors) {
     if (side_ == Side::Client && state_ == State::Interrupted) {
         // The service went away earlier; a new message tries to reach it again.
         state_ = State::Idle;
@@ -369,7 +642,7 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
             if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
             return;
         }
-        readMore();
+        // enqueueFrame reads the new socket once this frame is queued (an idle connection might park at once).
     }
     if (state_ == State::Closed) {
         if (pending) answerWithError(*pending, ZemError::Kind::ConnectionInvalid);
@@ -536,6 +809,9 @@ bool ZemSocketConnection::peerHasHungUp() const {
 
 void ZemSocketConnection::close(ZemError::Kind kind) {
     if (state_ == State::Closed) return;
+    if (takeSocketBack([this, kind] { return [self = shared_from_this(), kind] { self->close(kind); }; }) ==
+        Reclaim::Deferred)
+        return;
     bool interrupted = side_ == Side::Client && kind == ZemError::Kind::ConnectionInterrupted;
     state_ = interrupted ? State::Interrupted : State::Closed;
     {

@@ -2,7 +2,9 @@
 
 // INTERNAL to the IPC layer: the Unix-socket implementation of ZemConnection. Every piece of its state is touched
 // on its queue only (the strand of the connection's SerialQueue): reading, cutting frames, decoding, delivering
-// events, encoding and writing. Sends from other threads are posted there first. Includes Asio, so only .cpp files
+// events, encoding and writing. Sends from other threads are posted there first. The one exception is a client
+// connection lent to a waiting thread (exchangeOnCallingThread): that thread then owns the I/O state alone, and the
+// queue keeps its hands off until it is given back (Owner in the class). Includes Asio, so only .cpp files
 // of src/platform/zem include it.
 
 #include <asio.hpp>
@@ -67,6 +69,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
                                   std::vector<UniqueFd> descriptors) override;
     void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) override;
     void sendWithMessageReply(const Value& message, SerialQueue& replyQueue, MessageReplyHandler handler) override;
+    void setParkable(bool parkable) override;
+    bool exchangeOnCallingThread(const Value& message, SerialQueue& replyQueue, MessageReplyHandler& handler,
+                                 std::chrono::steady_clock::time_point deadline) override;
     pid_t peerPid() const override { return pid_.load(); }
     uid_t peerUid() const override { return uid_.load(); }
     gid_t peerGid() const override { return gid_.load(); }
@@ -86,13 +91,48 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
         std::vector<UniqueFd> descriptors;
     };
     enum class State { Idle, Open, Interrupted, Closed };
+    // Who does the I/O of a client connection. Loop: the queue, with the socket in the loop's reactor. Parked: nobody;
+    // the connection is idle and its socket out of the reactor, so that data arriving on it wakes no loop thread.
+    // Caller: one thread in exchangeOnCallingThread, which then owns every piece of I/O state (the socket, the
+    // reader, the buffers, the serials). Returning: nobody, but the queue must take the socket back before anyone
+    // else uses it (a caller left it work). Peer connections stay with the loop.
+    enum class Owner { Loop, Parked, Caller, Returning };
+    // How a caller leaves the connection: Idle as it found it, or with work for the queue.
+    struct HandBack {
+        std::optional<std::pair<uint64_t, PendingReply>> adopted;  // its request, still waiting for the reply
+        std::optional<ZemError::Kind> broken;                      // the stream ended or broke under it
+        bool readFirst = false;                                    // something came while the connection was parked
+    };
 
     // All of the following run on queue_.
     void start();
+    void resumeOnQueue();
     bool connectClient();
     void readMore();
+    // Client side, when the connection has nothing in flight and a caller has asked for it: takes the socket out
+    // of the reactor (Owner::Parked). True when it did.
+    bool parkIfIdle();
+    // Makes the queue read the socket again if it is parked.
+    void unpark();
+    enum class Reclaim { Owned, Reclaimed, Deferred };
+    // Client side: makes the queue the socket's owner again before it touches the I/O state. Deferred while a caller
+    // is in an exchange or has left work: `makeRetry()` then makes the block that does the work again on the queue once
+    // the caller's work is done.
+    template <class MakeRetry>
+    Reclaim takeSocketBack(MakeRetry&& makeRetry);
+    // Runs on the queue after a caller left work: adopts its unanswered request, handles the frames it read that
+    // were not its reply, reads on, or ends the connection.
+    void finishHandBack(HandBack work);
+    // Puts the parked socket back into the reactor. REQUIRES: ownerMutex_ held, the socket parked.
+    void reclaimLocked();
+    // The caller's side of the hand-over (any thread but the queue's, owner_ == Caller).
+    void handBack(HandBack work);
+    // Waits on the calling thread until `fd` is ready for `events`; false once `deadline` has passed.
+    static bool pollUntil(int fd, short events, std::chrono::steady_clock::time_point deadline);
     // One recvmsg: the bytes read (0 at the end of the stream) or -1 with errno; descriptors go to receivedFds_.
     ssize_t receive();
+    // The recvmsg behind receive() on `fd`; sets `overflow` when the peer passed more descriptors than allowed.
+    ssize_t receiveInto(int fd, bool& overflow);
     // Cuts and handles the frames in the `bytes` just read. False when the connection ended on the way.
     bool consume(size_t bytes);
     // The peer closed its end, or the socket failed.
@@ -103,6 +143,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void handleFrame(ZemFrame frame);
     void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending,
                       std::vector<UniqueFd> descriptors = {});
+    // enqueueFrame once the queue owns the socket.
+    void enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
+                           std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors);
     void writeMore();
     // writeMore's path while descriptors wait in outgoing_: every piece is sent with the descriptors of the frame
     // it starts, and never runs into the next frame that carries some.
@@ -151,6 +194,17 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     uint64_t nextSerial_ = 1;
     std::map<uint64_t, PendingReply> pendingReplies_;
     std::vector<ZemFrame> heldFrames_;  // frames read while suspended
+
+    // Client connections only. Guards owner_, parkedFd_ and deferred_; the I/O state itself needs no lock, since only
+    // the owner touches it.
+    std::mutex ownerMutex_;
+    Owner owner_ = Owner::Loop;
+    int parkedFd_ = -1;                            // the socket while it is out of the reactor
+    std::vector<std::function<void()>> deferred_;  // queue work that came while a caller owned the I/O
+    std::atomic<bool> parkWanted_{false};          // some caller wants the connection parked when idle
+    std::atomic<bool> parkable_{true};             // see setParkable
+    std::atomic<size_t> posted_{0};                // sends posted to the queue and not yet run there
+    std::vector<ZemFrame> strayFrames_;            // frames a caller read that were not its reply
 
     // The socket's descriptor for peerHasHungUp, which runs on other queues: -1 until the socket is open and again
     // from the moment close() starts (then `probeClosed_`), so a probe never touches a descriptor number that has
