@@ -118,11 +118,16 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
                                            .pid = pid,
                                            .flags = flags,
                                            .rules = {}};
-    if (Result<std::vector<uint8_t>> encoded = ZemCodec::encode(rules); encoded)
-        binding.rules.assign(encoded->begin(), encoded->end());
+    // The rules are bound only when a continuation is read or issued: a walk that fits one page never encodes
+    // them again, which matters for large rule sets.
+    auto bindRules = [&binding, &rules] {
+        if (Result<std::vector<uint8_t>> encoded = ZemCodec::encode(rules); encoded)
+            binding.rules.assign(encoded->begin(), encoded->end());
+    };
     std::optional<std::string> after;
     if (continuationEntry != nullptr) {
         std::span<const uint8_t> bytes = continuationEntry->dataBytes();
+        bindRules();
         auto position = database.continuations().read(
             std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), binding);
         if (const auto* problem = std::get_if<DiscoveryContinuation::Problem>(&position)) {
@@ -224,6 +229,7 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
     if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version))
         transaction.reply().set(protocol::key::kMatches, std::move(*encoded));
     if (!ended && walkedTo) {
+        if (continuationEntry == nullptr) bindRules();
         std::string continuation = database.continuations().issue(*walkedTo, binding);
         transaction.reply().set(protocol::key::kContinuation,
                                 Value::data(std::span<const uint8_t>(
