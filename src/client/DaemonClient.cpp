@@ -104,6 +104,9 @@ void DaemonClient::releaseHold(const Uuid& hold, Callback done) {
 void DaemonClient::holds(Callback done) { impl_->client.listHoldsReply(adapt(std::move(done))); }
 
 void DaemonClient::status(Callback done) { impl_->client.statusReply(adapt(std::move(done))); }
+void DaemonClient::explain(const Value& rules, uint64_t flags, const Value& plugIn, Callback done) {
+    impl_->client.explainPlugInRulesFlagsReply(plugIn, rules, flags, adapt(std::move(done)));
+}
 void DaemonClient::launch(const Uuid& plugIn, Callback done) {
     impl_->client.launchPlugInReply(plugIn, [done = std::move(done)](const std::variant<ZemMessage, ZemError>& raw) {
         if (!done) return;

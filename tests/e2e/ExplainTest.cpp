@@ -298,5 +298,26 @@ TEST_F(ExplainTest, BadRequestsAreRefusedWithClearErrors) {
     EXPECT_EQ(outcome(onlyEntry(client.replyTo(explainRequest(str(kHello))))), "matched");
 }
 
+// Guards the tool: one heading per candidate and one marked line per step, the failing rule with the plug-in's
+// value; --json prints the reply; --plugin is required.
+TEST_F(ExplainTest, ToolPrintsOneLinePerStep) {
+    Outcome run = bexil("explain BDBundleName=Hello Language=fr --plugin " + kHello);
+    EXPECT_EQ(run.status, 0) << run.err;
+    EXPECT_EQ(run.out.rfind(kHello + " 1.2 (" + uuidOf(hello()) + "): rejected\n  " + hello() + "\n", 0), 0u)
+        << run.out;
+    EXPECT_NE(run.out.find("  [ ok ] registry     found by the registry's query for these rules\n"), std::string::npos)
+        << run.out;
+    EXPECT_NE(run.out.find("  [FAIL] rules        BDBundleName = \"Hello\": value \"Hello\", holds; Language = \"fr\": "
+                           "value \"en\", fails\n"),
+              std::string::npos)
+        << run.out;
+    EXPECT_EQ(run.out.find("exclusions"), std::string::npos) << "steps after the failure are not shown";
+
+    Outcome json = bexil("--json explain --plugin " + kNightTheme);
+    EXPECT_EQ(json.status, 0) << json.err;
+    EXPECT_NE(json.out.find("\"notFound\": \"not registered, or not visible to you\""), std::string::npos) << json.out;
+    EXPECT_EQ(bexil("explain " + kHello).status, 64);
+}
+
 }  // namespace
 }  // namespace bexil
