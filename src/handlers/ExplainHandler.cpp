@@ -48,6 +48,10 @@ namespace formKey = protocol::form;
 
 using PlugIns = std::vector<std::shared_ptr<BXDPlugIn>>;
 
+// What a manager is told about a plug-in that is registered but of which no record can be made; to anybody else
+// it is one that is not registered.
+constexpr std::string_view kRefusedRecord = "registered, but refused as mis-configured (the log says why)";
+
 std::string uuidTextOf(const BXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); }
 
 // The plug-in a request names: exactly one of the three is set.
@@ -142,6 +146,9 @@ void Transaction::explainPlugIn() {
     PlugIns explained;
     std::optional<std::string> identifier = identity->identifier;
     bool noBundle = false;
+    // The registry knows the plug-in, but no record can be made of it (a bundle it refuses as mis-configured):
+    // nobody discovers it.
+    bool refused = false;
     if (identifier) {
         std::optional<BXDatabase::PlugInSet> found = database.findPlugIns(
             Value::dictionary({{std::string(BXMatchRules::kIdentifierKey), exactly(*identifier)}}));
@@ -151,10 +158,12 @@ void Transaction::explainPlugIn() {
         std::shared_ptr<BXDPlugIn> plugIn;
         if (identity->uuid) {
             plugIn = database.findPlugIn(*identity->uuid);
+            refused = !plugIn && database.workspace()->plugInProxyForUUID(*identity->uuid);
         } else {
             std::string path = lookupPath(*identity->path, reader);
             noBundle = !bundleAt(path, reader);
             plugIn = database.findPlugInAtPath(path);
+            refused = !plugIn && database.workspace()->plugInProxyForURL(path);
         }
         if (plugIn) {
             explained.push_back(plugIn);
@@ -177,9 +186,10 @@ void Transaction::explainPlugIn() {
     log::ops().info("client %d asked to explain %@: %u candidates, %u shown", static_cast<int>(caller.pid()), *named,
                     static_cast<unsigned>(explained.size()), static_cast<unsigned>(shown.size()));
     if (shown.empty()) {
-        std::string_view why = noBundle  ? explain::kNoBundle
-                               : manager ? explain::kNotRegistered
-                                         : explain::kNotRegisteredOrHidden;
+        std::string_view why = manager && refused ? kRefusedRecord
+                               : noBundle         ? explain::kNoBundle
+                               : manager          ? explain::kNotRegistered
+                                                  : explain::kNotRegisteredOrHidden;
         reply().set(protocol::key::kExplanation, Value::emptyArray());
         reply().set(protocol::key::kNotFound, Value::string(why));
         done();

@@ -185,6 +185,11 @@ TEST_F(ExplainTest, HiddenPlugInsLookUnregisteredToOthersAndAreExplainedToTheMan
                                 str(kBonjour), str(uuidOf(bonjour())), str(bonjour())})
         EXPECT_EQ(client.replyTo(explainRequest(hidden)), nobody) << hidden.description();
     EXPECT_EQ(client.replyTo(explainRequest(str(Uuid::random().string()))), nobody);
+    // A plug-in refused as mis-configured (outside every application) is discovered by nobody.
+    copyExamples({"OutsideApplication.bxplugin"});
+    const std::string outside = plugIn("OutsideApplication.bxplugin");
+    add({outside});
+    EXPECT_EQ(client.replyTo(explainRequest(str(outside))), nobody);
     // A path is looked at with the caller's rights: no bundle there is something it can see for itself.
     Value noBundle = client.replyTo(explainRequest(str(plugIn("Greeter.app/PlugIns/None.bxplugin"))));
     EXPECT_EQ(noBundle.get("notFound").stringView(), "no bundle at this path");
@@ -196,6 +201,8 @@ TEST_F(ExplainTest, HiddenPlugInsLookUnregisteredToOthersAndAreExplainedToTheMan
     TestClient manager;
     EXPECT_EQ(manager.replyTo(explainRequest(str("com.example.nobody"))).get("notFound").stringView(),
               "not registered");
+    EXPECT_EQ(manager.replyTo(explainRequest(str(outside))).get("notFound").stringView(),
+              "registered, but refused as mis-configured (the log says why)");
     Value dedicated = lastStep(onlyEntry(manager.replyTo(explainRequest(str(kNightTheme)))));
     EXPECT_EQ(dedicated.get("step").stringView(), "dedication");
     EXPECT_EQ(dedicated.get("dedicated"), Value::boolean(true));
