@@ -12,9 +12,14 @@
 //    since past some count the reply cannot be sent at all;
 //  - the paged match with no rules (pages of --page-size, every page asked on one connection until the last):
 //    time per returned plug-in at every size, since no reply is larger than a page;
+//  - "explain" of one plug-in on the point with the point's rules, beside the point match and a match of that one
+//    plug-in by identifier: round trips and their ratios, in the same run;
 //  - the point match beside a client that runs paged full discoveries back to back on another connection: its
 //    p50 / p99 against the idle figures of the same run, once with that client at normal priority and once at
 //    nice 19 (on 2 cores the first also measures the client's own decoding competing for the CPU).
+//
+// --point-only stops after the point match and "explain" (the other figures take long at 100,000); --no-explain
+// leaves "explain" out, to measure a bxd that does not serve it.
 //
 // Registries take a while to build (the 100,000 one minutes), so they are built once with the registry library
 // under --cache (default: <tmp>/bexil-match-bench-cache) and reused; each run copies the state directory so that
@@ -82,13 +87,15 @@ struct Options {
     bool serverSide = true;
     uint64_t pageSize = 256;
     unsigned pagedWalks = 3;
+    bool pointOnly = false;
+    bool explain = true;
 };
 
 [[noreturn]] void usage() {
     fputs(
         "Usage: match_roundtrip_bench [--counts N,N,...] [--requests M] [--all-requests M] [--all-max N]\n"
         "                             [--cache DIR] [--bxd PATH] [--wrapper CMD] [--no-server-side]\n"
-        "                             [--page-size N] [--paged-walks M]\n",
+        "                             [--page-size N] [--paged-walks M] [--point-only] [--no-explain]\n",
         stderr);
     exit(2);
 }
@@ -105,6 +112,8 @@ Options parseOptions(int argc, char** argv) {
         {"no-server-side", no_argument, nullptr, 's'},
         {"page-size", required_argument, nullptr, 'p'},
         {"paged-walks", required_argument, nullptr, 'W'},
+        {"point-only", no_argument, nullptr, 'P'},
+        {"no-explain", no_argument, nullptr, 'E'},
         {nullptr, 0, nullptr, 0},
     };
     Options options;
@@ -150,6 +159,12 @@ Options parseOptions(int argc, char** argv) {
                 break;
             case 'W':
                 options.pagedWalks = static_cast<unsigned>(std::max(1, atoi(optarg)));
+                break;
+            case 'P':
+                options.pointOnly = true;
+                break;
+            case 'E':
+                options.explain = false;
                 break;
             default:
                 usage();
@@ -469,6 +484,57 @@ void runSize(const Options& options, int count) {
         "round trip point match: %zu forms, %zu bytes, p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request "
         "(load %.2f)\n",
         pointCount, pointBytes, p.p50Us, p.p99Us, pointCpu, loadAverage());
+
+    // "explain" of the first plug-in on the point, with the point's rules (so the claimers of its identifier are
+    // looked for among the point's plug-ins too), against the point match and a match of that plug-in alone.
+    if (options.explain) {
+        const std::string identifier = "com.example.bench.p0";
+        const Value explain = Value::dictionary({{"request", Value::string("explain")},
+                                                 {"version", Value::uint64(3)},
+                                                 {"rules", pointRules},
+                                                 {"flags", Value::uint64(0)},
+                                                 {"plugin", Value::string(identifier)}});
+        const Value single = matchRequest(Value::dictionary({{"RZExtensionIdentifier", Value::string(identifier)}}));
+        for (int i = 0; i < 20; ++i) connection.roundTrip(explain);
+        Result<Value> body = ZemCodec::decode(std::span<const uint8_t>(
+            connection.reply.data() + ZemFrame::kHeaderBytes, connection.reply.size() - ZemFrame::kHeaderBytes));
+        if (!body || body->get("explanation").count() != 1 ||
+            body->get("explanation").items()[0].get("outcome").stringView() != "matched") {
+            fprintf(stderr, "match_roundtrip_bench: bad explain reply: %s\n",
+                    body ? body->description().c_str() : body.error().description().c_str());
+            exit(1);
+        }
+        // Interleaved, so that both see the same load.
+        std::vector<double> explainTimes, singleTimes, pointTimes;
+        double explainCpu = 0;
+        for (unsigned i = 0; i < options.requests; ++i) {
+            Clock::time_point start = Clock::now();
+            double before = cpuUs(server);
+            connection.roundTrip(explain);
+            explainCpu += cpuUs(server) - before;
+            explainTimes.push_back(elapsedUs(start));
+            start = Clock::now();
+            connection.roundTrip(single);
+            singleTimes.push_back(elapsedUs(start));
+            start = Clock::now();
+            connection.roundTrip(matchRequest(pointRules));
+            pointTimes.push_back(elapsedUs(start));
+        }
+        Percentiles e = percentiles(explainTimes), s1 = percentiles(singleTimes), pt = percentiles(pointTimes);
+        printf(
+            "round trip explain: p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request; point match p50 %.1f us "
+            "(explain/point %.2f), match by identifier p50 %.1f us (explain/identifier %.2f) (load %.2f)\n",
+            e.p50Us, e.p99Us, explainCpu / options.requests, pt.p50Us, e.p50Us / pt.p50Us, s1.p50Us, e.p50Us / s1.p50Us,
+            loadAverage());
+    }
+    if (options.pointOnly) {
+        fflush(stdout);
+        close(connection.fd);
+        stopProcess(bxd);
+        std::error_code ignored;
+        fs::remove_all(run, ignored);
+        return;
+    }
 
     if (all) {
         Clock::time_point cold = Clock::now();

@@ -93,6 +93,12 @@ class DaemonClient {
     // bxd keeps fails with code 20 (ErrorCode::GenerationTooOld): match() again. An extension of the protocol
     // (docs/protocol.md).
     void changes(uint64_t generation, Callback done);
+    // Why match(rules, flags) returns a plug-in or not, step by step. `plugIn` names it: an identifier (string), a
+    // UUID (value or text) or an absolute path. The reply's "explanation" holds one entry per candidate ("uuid",
+    // "identifier", "version", "path", "outcome", "steps"); when there is none, "notFound" says why. A plug-in this
+    // client could never discover is answered as one that is not registered. An extension of the protocol
+    // (docs/protocol.md).
+    void explain(const Value& rules, uint64_t flags, const Value& plugIn, Callback done);
     // Starts a plug-in that ready() made runnable for this process, in its sandbox; the reply carries "pid" and
     // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
     void launch(const Uuid& plugIn, Callback done);

@@ -31,9 +31,10 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch", "holds" and "status" are extensions of ours: on Linux nobody but bxd starts plug-ins, and administrators
-// want to see what holds plug-ins out of use and what the daemon is doing (docs/protocol.md). "changes" is one too:
-// a client that keeps a copy of a discovery learns what changed since it was made instead of discovering again.
+// "launch", "holds", "status", "changes" and "explain" are extensions of ours: on Linux nobody but bxd starts
+// plug-ins, administrators want to see what holds plug-ins out of use and what the daemon is doing, a client that
+// keeps a copy of a discovery learns what changed since it was made instead of discovering again, and a discovery
+// that returns nothing should be able to say why (docs/protocol.md).
 enum class Request {
     Add,
     Remove,
@@ -47,7 +48,8 @@ enum class Request {
     Launch,
     Holds,
     Status,
-    Changes
+    Changes,
+    Explain
 };
 
 struct RequestInfo {
@@ -72,6 +74,7 @@ inline constexpr std::array<RequestInfo, 13> kRequests{{
     {Request::Holds, "holds", "list the holds in force (manager only)"},
     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
     {Request::Changes, "changes", "the plug-ins added, removed and changed since a generation"},
+    {Request::Explain, "explain", "say, step by step, why discovery with rules finds a plug-in or not"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -124,11 +127,16 @@ inline constexpr std::string_view kGeneration = "generation";
 // exclusions change lies in the answered span, so that every plug-in may have changed (bool, absent when not).
 inline constexpr std::string_view kChanges = "changes";
 inline constexpr std::string_view kResync = "resync";
+// "explain", an extension of ours: in the request, the plug-in asked about (an identifier, a UUID, UUID text or an
+// absolute path); in the reply, one explanation per candidate (see explain::), and when there is none, why.
+inline constexpr std::string_view kPlugIn = "plugin";
+inline constexpr std::string_view kExplanation = "explanation";
+inline constexpr std::string_view kNotFound = "notFound";
 inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
                                   kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
                                   kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
                                   kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
-                                  kGeneration,    kChanges,    kResync};
+                                  kGeneration,    kChanges,    kResync,    kPlugIn,     kExplanation, kNotFound};
 }  // namespace key
 
 // Entries of one element of a "changes" reply's key::kChanges (an extension of ours).
@@ -263,6 +271,91 @@ inline constexpr uint64_t kMaxBytes = 8u << 20;
 // The page size the client library and the tool ask for.
 inline constexpr uint64_t kDefaultForms = 256;
 }  // namespace page
+
+// The explanation of one candidate in an "explain" reply (key::kExplanation): the plug-in, its outcome and the
+// steps of discovery it went through, in order, up to the first it failed. docs/protocol.md says what each holds.
+namespace explain {
+// Entries of one candidate's explanation, beside form::kUuid, form::kIdentifier, form::kVersion and form::kPath.
+inline constexpr std::string_view kOutcome = "outcome";
+inline constexpr std::string_view kSteps = "steps";
+// Outcomes.
+inline constexpr std::string_view kMatched = "matched";    // "match" with these rules and flags returns it
+inline constexpr std::string_view kRejected = "rejected";  // a step before the duplicates left it out
+inline constexpr std::string_view kLost = "lost";          // another plug-in of its identifier was preferred
+// Entries of one step.
+inline constexpr std::string_view kStep = "step";
+inline constexpr std::string_view kPassed = "passed";
+inline constexpr std::string_view kSkipped = "skipped";  // bool: the flags skip this step (discover all)
+inline constexpr std::string_view kReason = "reason";    // string: why it failed, in words
+// The steps, in the order discovery takes them.
+inline constexpr std::string_view kRegistry = "registry";
+inline constexpr std::string_view kResidence = "residence";
+inline constexpr std::string_view kDedication = "dedication";
+inline constexpr std::string_view kHold = "hold";
+inline constexpr std::string_view kRulesStep = "rules";
+inline constexpr std::string_view kExclusions = "exclusions";
+inline constexpr std::string_view kHostPolicy = "host-policy";
+inline constexpr std::string_view kExport = "export";
+inline constexpr std::string_view kDuplicates = "duplicates";
+inline constexpr std::array kStepNames{kRegistry,   kResidence,  kDedication, kHold,      kRulesStep,
+                                       kExclusions, kHostPolicy, kExport,     kDuplicates};
+// Details of the steps.
+inline constexpr std::string_view kBundleOnDisk = "bundleOnDisk";                    // registry: bool
+inline constexpr std::string_view kSystemVolume = "systemVolume";                    // residence: bool
+inline constexpr std::string_view kContainingApplication = "containingApplication";  // residence: path
+inline constexpr std::string_view kDedicated = "dedicated";                          // dedication: bool
+inline constexpr std::string_view kHost = "host";          // dedication: the caller's bundle path
+inline constexpr std::string_view kHoldUuid = "holdUuid";  // hold: the hold's UUID
+inline constexpr std::string_view kPlacedBy = "placedBy";  // hold: {"pid", "executable"} of who placed it
+inline constexpr std::string_view kExecutable = "executable";
+inline constexpr std::string_view kFindings = "findings";  // rules, exclusions: per rule evaluated, in order
+inline constexpr std::string_view kKey = "key";
+inline constexpr std::string_view kValue = "value";      // the plug-in's value for the key; absent when it has none
+inline constexpr std::string_view kPattern = "pattern";  // the pattern as the rule set holds it
+inline constexpr std::string_view kOperator = "operator";
+inline constexpr std::string_view kOperand = "operand";
+inline constexpr std::string_view kExclusion = "exclusion";  // exclusions: the index of the entry that matched
+inline constexpr std::string_view kExclusionRules = "exclusionRules";  // exclusions: that entry's rule set
+inline constexpr std::string_view kCount = "count";                    // exclusions: how many were tried
+inline constexpr std::string_view kWinner = "winner";                  // duplicates: UUID text of who won
+inline constexpr std::string_view kTieBreak = "tieBreak";              // duplicates: by what it won
+inline constexpr std::string_view kReplacedBy = "replacedBy";  // duplicates: UUID text of the plug-in replacing it
+// Tie-breaks.
+inline constexpr std::string_view kHigherVersion = "higher version";
+inline constexpr std::string_view kSystemVolumeWins = "system volume";
+inline constexpr std::string_view kLaterRegistration = "later registration";
+inline constexpr std::string_view kFoundFirst = "found first";
+// What a caller is told about an identity with no candidate to explain.
+inline constexpr std::string_view kNotRegistered = "not registered";
+inline constexpr std::string_view kNotRegisteredOrHidden = "not registered, or not visible to you";
+inline constexpr std::string_view kNoBundle = "no bundle at this path";
+inline constexpr std::array kList{kOutcome,
+                                  kSteps,
+                                  kStep,
+                                  kPassed,
+                                  kSkipped,
+                                  kReason,
+                                  kBundleOnDisk,
+                                  kSystemVolume,
+                                  kContainingApplication,
+                                  kDedicated,
+                                  kHost,
+                                  kHoldUuid,
+                                  kPlacedBy,
+                                  kExecutable,
+                                  kFindings,
+                                  kKey,
+                                  kValue,
+                                  kPattern,
+                                  kOperator,
+                                  kOperand,
+                                  kExclusion,
+                                  kExclusionRules,
+                                  kCount,
+                                  kWinner,
+                                  kTieBreak,
+                                  kReplacedBy};
+}  // namespace explain
 
 // Flag bits of "lock" (key::kFlags).
 namespace hold {

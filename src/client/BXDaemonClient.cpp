@@ -179,6 +179,15 @@ void BXDaemonClient::matchPagePlugInsFlagsReply(const Value& rules, uint64_t fla
     sendReply(message.take(), std::move(reply));
 }
 
+void BXDaemonClient::explainPlugInRulesFlagsReply(const Value& plugIn, const Value& rules, uint64_t flags,
+                                                  ReplyHandler reply) {
+    MutableDictionary message = request(Request::Explain);
+    message.set(key::kPlugIn, plugIn);
+    if (!rules.isNull()) message.set(key::kRules, rules);
+    message.set(key::kFlags, Value::uint64(flags));
+    sendReply(message.take(), std::move(reply));
+}
+
 struct BXDaemonClient::PagedWalk {
     Value rules;
     uint64_t flags;

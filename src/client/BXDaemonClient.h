@@ -100,6 +100,9 @@ class BXDaemonClient {
     void statusReply(ReplyHandler reply);
     // The plug-ins added, removed and changed since `generation` (an extension of ours).
     void changesReply(uint64_t generation, ReplyHandler reply);
+    // Why a match with `rules` (none when null) and `flags` returns the plug-in `plugIn` (an identifier, UUID, UUID
+    // text or absolute path) or not (an extension of the protocol).
+    void explainPlugInRulesFlagsReply(const Value& plugIn, const Value& rules, uint64_t flags, ReplyHandler reply);
     // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
     void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
 

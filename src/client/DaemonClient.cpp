@@ -118,6 +118,9 @@ void DaemonClient::status(Callback done) { impl_->client.statusReply(adapt(std::
 void DaemonClient::changes(uint64_t generation, Callback done) {
     impl_->client.changesReply(generation, adapt(std::move(done)));
 }
+void DaemonClient::explain(const Value& rules, uint64_t flags, const Value& plugIn, Callback done) {
+    impl_->client.explainPlugInRulesFlagsReply(plugIn, rules, flags, adapt(std::move(done)));
+}
 void DaemonClient::launch(const Uuid& plugIn, Callback done) {
     impl_->client.launchPlugInReply(plugIn, [done = std::move(done)](const std::variant<ZemMessage, ZemError>& raw) {
         if (!done) return;

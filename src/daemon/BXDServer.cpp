@@ -251,6 +251,14 @@ bool BXDServer::holdOnPlugIn(const BXDPlugIn& plugIn) {
     });
 }
 
+std::shared_ptr<BXDPlugInHold> BXDServer::holdNamingPlugIn(const BXDPlugIn& plugIn) {
+    return syncQueue_.sync([&]() -> std::shared_ptr<BXDPlugInHold> {
+        for (const std::shared_ptr<BXDPlugInHold>& hold : holds_)
+            if (hold->blocks(plugIn)) return hold;
+        return nullptr;
+    });
+}
+
 bool BXDServer::addHold(std::shared_ptr<BXDPlugInHold> hold, const BXDZemClient* placer) {
     // A client's death is noted before its holds are released on this queue, so the check and the addition here
     // either come before that release (which then takes the hold) or see the death.

@@ -84,6 +84,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // set of holds posts the annotation-change notification once, after leaving syncQueue.
     // holdOnPlugIn: whether some hold names the plug-in.
     bool holdOnPlugIn(const BXDPlugIn& plugIn);
+    // The first hold in force that names the plug-in, or none.
+    std::shared_ptr<BXDPlugInHold> holdNamingPlugIn(const BXDPlugIn& plugIn);
     // Appends `hold` to the holds, unless `placer` has already been seen to die: its holds were released then, and
     // one added now would outlive it. Returns whether the hold was added.
     bool addHold(std::shared_ptr<BXDPlugInHold> hold, const BXDZemClient* placer = nullptr);

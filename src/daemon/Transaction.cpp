@@ -53,6 +53,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Holds, &Transaction::listHolds},
     {Request::Status, &Transaction::reportStatus},
     {Request::Changes, &Transaction::changesSince},
+    {Request::Explain, &Transaction::explainPlugIn},
 }};
 
 constexpr bool handlersFollowTheProtocol() {

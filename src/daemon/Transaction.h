@@ -106,6 +106,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void listHolds();
     void reportStatus();
     void changesSince();
+    void explainPlugIn();
     // The parts of "add" and "remove" that run on the writer queue.
     void registerPaths(std::optional<UserIdentity> caller);
     void unregisterPaths(bool entitled);

@@ -3,10 +3,13 @@
 #include "handlers/DiscoveryFilter.h"
 
 #include "bexil/Protocol.h"
+#include "daemon/BXDPlugInHold.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
+#include "daemon/Transaction.h"
 #include "model/BXUtilities.h"
 #include "platform/log/Log.h"
+#include "platform/sandbox/ProcessSandbox.h"
 #include "policy/BXDPlugIn.h"
 #include "policy/BXHostAccessPolicy.h"
 
@@ -15,6 +18,7 @@ namespace bexil {
 namespace {
 
 namespace discover = protocol::discover;
+namespace explain = protocol::explain;
 namespace formKey = protocol::form;
 
 std::string textOf(const MutableDictionary& form, std::string_view key) {
@@ -27,18 +31,64 @@ std::string versionOf(const BXDPlugIn& plugIn) {
     return version && version->isString() ? std::string(version->stringView()) : std::string();
 }
 
-// Whether the new plug-in wins against an accepted form of the same identifier and version: a system plug-in beats
-// one that is not, otherwise the later registration wins and equal times keep what was accepted first.
-bool winsTieBreak(const BXDPlugIn& plugIn, const MutableDictionary& form) {
+std::string uuidTextOf(const BXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); }
+
+// Whether the new plug-in wins against an accepted form of the same identifier and version, and by which rule: a
+// system plug-in beats one that is not, otherwise the later registration wins and equal times keep what was
+// accepted first.
+std::pair<bool, DuplicateRule> tieBreak(const BXDPlugIn& plugIn, const MutableDictionary& form) {
     const Value* resident = form.find(formKey::kSystemResident);
     bool formResident = resident != nullptr && resident->getBool().value_or(false);
-    if (plugIn.onSystemVolume() && !formResident) return true;
+    if (plugIn.onSystemVolume() && !formResident) return {true, DuplicateRule::SystemVolume};
     const Value* modified = form.find(formKey::kLastModified);
     int32_t formModified = modified != nullptr ? static_cast<int32_t>(modified->numberAsInt64().value_or(0)) : 0;
-    return plugIn.lastModified() > formModified;
+    if (plugIn.lastModified() != formModified)
+        return {plugIn.lastModified() > formModified, DuplicateRule::LaterRegistration};
+    return {false, DuplicateRule::FoundFirst};
 }
 
-// The identifiers a plug-in says it replaces: a string names one, an array every string in it.
+// The observer of discovery: it only hears whether a step passed, and the filter stops at the first that failed.
+struct Deciding {
+    template <class Detail>
+    bool step(std::string_view, bool passed, Detail&&) {
+        return passed;
+    }
+    void skipped(std::string_view) {}
+};
+
+// The observer of "explain": it keeps every step with its details and lets the filter go on after a failure, so
+// that whether the caller may see the plug-in at all is known even when an earlier step failed.
+struct Tracing {
+    FilterTrace trace;
+
+    template <class Detail>
+    bool step(std::string_view name, bool passed, Detail&& detail) {
+        MutableDictionary entry;
+        entry.set(explain::kStep, Value::string(name));
+        entry.set(explain::kPassed, Value::boolean(passed));
+        detail(entry);
+        if (!passed) {
+            if (!trace.firstFailure) trace.firstFailure = trace.steps.size();
+            // Living outside every application is hidden; being left out by the system-only flag is the caller's
+            // own choice.
+            const Value* onSystem = entry.find(explain::kSystemVolume);
+            bool outside = name == explain::kResidence && !entry.find(explain::kContainingApplication) &&
+                           !(onSystem != nullptr && onSystem->getBool().value_or(false));
+            if (outside || name == explain::kDedication || name == explain::kHold || name == explain::kHostPolicy)
+                trace.hidden = true;
+        }
+        trace.steps.push_back(entry.take());
+        return true;
+    }
+    void skipped(std::string_view name) {
+        trace.steps.push_back(Value::dictionary({{std::string(explain::kStep), Value::string(name)},
+                                                 {std::string(explain::kPassed), Value::boolean(true)},
+                                                 {std::string(explain::kSkipped), Value::boolean(true)}}));
+    }
+};
+
+}  // namespace
+
 std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn) {
     std::vector<std::string> identifiers;
     std::optional<Value> value = plugIn.valueForEntitlement(BXDPlugIn::kReplacePlugInEntitlement);
@@ -53,36 +103,134 @@ std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn) {
     return identifiers;
 }
 
-}  // namespace
+std::string_view nameOf(DuplicateRule rule) {
+    switch (rule) {
+        case DuplicateRule::HigherVersion:
+            return explain::kHigherVersion;
+        case DuplicateRule::SystemVolume:
+            return explain::kSystemVolumeWins;
+        case DuplicateRule::LaterRegistration:
+            return explain::kLaterRegistration;
+        case DuplicateRule::FoundFirst:
+            return explain::kFoundFirst;
+    }
+    return {};
+}
+
+std::optional<DiscoveryQuery> readDiscoveryQuery(Transaction& transaction) {
+    const Value* rulesEntry = transaction.request().find(protocol::key::kRules);
+    if (rulesEntry != nullptr && !rulesEntry->isDictionary()) {
+        transaction.fail(ErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
+        return std::nullopt;
+    }
+    DiscoveryQuery query{.rules = rulesEntry != nullptr ? *rulesEntry : Value(),
+                         .flags = transaction.request().get(protocol::key::kFlags).numberAsUInt64().value_or(0)};
+    if ((query.flags & discover::kAll) && (!transaction.client()->hasEntitlement(protocol::kManagerEntitlement) ||
+                                           processIsSandboxed(transaction.client()->pid()))) {
+        transaction.fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
+        return std::nullopt;
+    }
+    return query;
+}
 
 bool CandidateFilter::all() const { return (flags & discover::kAll) != 0; }
 
 bool CandidateFilter::admits(BXDPlugIn& plugIn) const {
+    Deciding deciding;
+    return run(plugIn, deciding);
+}
+
+FilterTrace CandidateFilter::explain(BXDPlugIn& plugIn) const {
+    Tracing tracing;
+    run(plugIn, tracing);
+    return std::move(tracing.trace);
+}
+
+// Each step hands the observer its outcome and a function that writes its details; only an explaining observer
+// calls it, so discovery builds no text for a step that passed or failed.
+template <class Observer>
+bool CandidateFilter::run(BXDPlugIn& plugIn, Observer& observer) const {
     // Only the logs name the candidate, and they are rare: the text is made when one is written.
-    auto uuidText = [&plugIn] { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); };
+    auto uuidText = [&plugIn] { return uuidTextOf(plugIn); };
     const pid_t pid = client.pid();
     if (!all()) {
         // Plug-ins outside the system volume are visible only inside an application, and not at all when the
         // caller asked for system plug-ins only.
-        if (!plugIn.onSystemVolume() && (!plugIn.containingUrl() || (flags & discover::kSystemOnly))) return false;
-        if (!BXHostAccessPolicy::dedicatedPlugInVisibleToHost(plugIn, client.bundle().get())) return false;
-        if (database.holdOnPlugIn(plugIn)) return false;
+        bool resident = plugIn.onSystemVolume() || (plugIn.containingUrl() && !(flags & discover::kSystemOnly));
+        if (!observer.step(explain::kResidence, resident, [&](MutableDictionary& detail) {
+                detail.set(explain::kSystemVolume, Value::boolean(plugIn.onSystemVolume()));
+                if (std::optional<std::string> application = plugIn.containingPath())
+                    detail.set(explain::kContainingApplication, Value::string(*application));
+                if (resident) return;
+                detail.set(explain::kReason,
+                           Value::string(plugIn.containingUrl()
+                                             ? "outside the system volume, and the flags ask for system plug-ins only"
+                                             : "outside the system volume and inside no application"));
+            }))
+            return false;
+        bool shown = BXHostAccessPolicy::dedicatedPlugInVisibleToHost(plugIn, client.bundle().get());
+        if (!observer.step(explain::kDedication, shown, [&](MutableDictionary& detail) {
+                detail.set(explain::kDedicated, Value::boolean(plugIn.isDedicated()));
+                if (client.bundle() && client.bundle()->path())
+                    detail.set(explain::kHost, Value::string(*client.bundle()->path()));
+                if (!shown) detail.set(explain::kReason, Value::string("dedicated to another application"));
+            }))
+            return false;
+        std::shared_ptr<BXDPlugInHold> hold = database.holdNamingPlugIn(plugIn);
+        if (!observer.step(explain::kHold, !hold, [&](MutableDictionary& detail) {
+                if (!hold) return;
+                detail.set(explain::kHoldUuid, Value::uuid(hold->uuid()));
+                detail.set(
+                    explain::kPlacedBy,
+                    Value::dictionary(
+                        {{std::string(protocol::key::kPid), Value::uint64(static_cast<uint64_t>(hold->ownerPid()))},
+                         {std::string(explain::kExecutable), Value::string(hold->ownerExecutable())}}));
+                detail.set(explain::kReason, Value::string("held out of use"));
+            }))
+            return false;
+    } else {
+        observer.skipped(explain::kResidence);
+        observer.skipped(explain::kDedication);
+        observer.skipped(explain::kHold);
     }
-    if (!plugIn.match(rules, context)) return false;
-    for (const Value& exclusion : exclusions) {
-        if (plugIn.match(exclusion, context)) {
+    bool matched = plugIn.match(rules, context);
+    if (!observer.step(explain::kRulesStep, matched, [&](MutableDictionary& detail) {
+            detail.set(explain::kFindings, BXMatchRules::explainMatch(rules, plugIn, context));
+        }))
+        return false;
+    std::optional<size_t> excludedBy;
+    for (size_t i = 0; i < exclusions.size(); ++i) {
+        if (plugIn.match(exclusions[i], context)) {
             log::ops().debug("client %d plugin %{public}@ globally excluded", pid, uuidText());
-            return false;
+            excludedBy = i;
+            break;
         }
     }
+    if (!observer.step(explain::kExclusions, !excludedBy, [&](MutableDictionary& detail) {
+            detail.set(explain::kCount, Value::uint64(exclusions.size()));
+            if (!excludedBy) return;
+            const Value& exclusion = exclusions[*excludedBy];
+            detail.set(explain::kExclusion, Value::uint64(*excludedBy));
+            detail.set(explain::kExclusionRules, exclusion);
+            detail.set(explain::kFindings, BXMatchRules::explainMatch(exclusion, plugIn, context));
+            detail.set(explain::kReason, Value::string("a global exclusion matches it"));
+        }))
+        return false;
     if (!all()) {
-        if (std::optional<std::string> reason = plugIn.allowForClient(client, context)) {
-            log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(), *reason);
+        std::optional<std::string> reason = plugIn.allowForClient(client, context);
+        if (reason) log::ops().debug("client %d cannot use plugin %{public}@: %{public}@", pid, uuidText(), *reason);
+        if (!observer.step(explain::kHostPolicy, !reason, [&](MutableDictionary& detail) {
+                if (reason) detail.set(explain::kReason, Value::string(*reason));
+            }))
             return false;
-        }
+    } else {
+        observer.skipped(explain::kHostPolicy);
     }
     return true;
 }
+
+template bool CandidateFilter::run<Deciding>(BXDPlugIn&, Deciding&) const;
+template bool CandidateFilter::run<Tracing>(BXDPlugIn&, Tracing&) const;
 
 void AcceptedForms::offer(const BXDPlugIn& plugIn, MutableDictionary exported, BXDServer& database) {
     std::string version = versionOf(plugIn);
@@ -92,8 +240,13 @@ void AcceptedForms::offer(const BXDPlugIn& plugIn, MutableDictionary exported, B
         ComparisonResult order = compareVersionString(version, textOf(*other, formKey::kVersion));
         bool same = order == ComparisonResult::Same;
         if ((flags_ & discover::kAllVersions) && (!same || (flags_ & discover::kAllInstances))) continue;
-        bool wins = same ? winsTieBreak(plugIn, *other) : order == ComparisonResult::Descending;
-        if (!wins) return;
+        auto [wins, rule] = same ? tieBreak(plugIn, *other)
+                                 : std::pair{order == ComparisonResult::Descending, DuplicateRule::HigherVersion};
+        if (!wins) {
+            if (defeats_ != nullptr) (*defeats_)[uuidTextOf(plugIn)] = {textOf(*other, formKey::kUuid), rule};
+            return;
+        }
+        if (defeats_ != nullptr) (*defeats_)[textOf(*other, formKey::kUuid)] = {uuidTextOf(plugIn), rule};
         other.reset();
         sameIdentifier.erase(at);
         --kept_;

@@ -5,6 +5,7 @@
 // the request queue, for the length of one request; neither owns the records or the client it is given.
 
 #include <memory>
+#include <optional>
 #include <string>
 #include <unordered_map>
 #include <vector>
@@ -17,6 +18,28 @@ namespace bexil {
 class BXDPlugIn;
 class BXDServer;
 class BXDZemClient;
+class Transaction;
+
+// The "rules" and "flags" of a discovery request ("match", "explain"), read and checked alike for both.
+struct DiscoveryQuery {
+    Value rules;
+    uint64_t flags = 0;
+};
+// The query of `transaction`'s request, or none once it has answered the failure: rules that are not a dictionary
+// (code 4) or the discover-all flag without the manager entitlement or from a sandboxed caller (code 11).
+std::optional<DiscoveryQuery> readDiscoveryQuery(Transaction& transaction);
+
+// What the filter found for one candidate, step by step (see CandidateFilter::explain).
+struct FilterTrace {
+    // One dictionary per step ({"step", "passed", details...}), in the filter's order, every step evaluated even
+    // after one failed.
+    std::vector<Value> steps;
+    // The index in steps of the first that failed; none when the candidate passed.
+    std::optional<size_t> firstFailure;
+    // Whether a step that decides who may see the plug-in at all failed: it lives where the caller cannot see it,
+    // is dedicated to another application, is held, or the host policy refuses it to this caller.
+    bool hidden = false;
+};
 
 // The filter that every candidate passes, in this order, before it competes with the others: where it lives,
 // dedication and holds (all three skipped for the discover-all flag), the client's rules, the global exclusions and
@@ -32,7 +55,21 @@ struct CandidateFilter {
 
     bool all() const;
     bool admits(BXDPlugIn& plugIn) const;
+    // The same decisions as admits, made by the same code, with what each step compared; slower, for "explain".
+    FilterTrace explain(BXDPlugIn& plugIn) const;
+
+  private:
+    // The filter itself; `observer` sees each step's outcome and may ask for its details (only explain does).
+    template <class Observer>
+    bool run(BXDPlugIn& plugIn, Observer& observer) const;
 };
+
+// By what one of two forms of the same identifier is preferred to the other, in the order the rules are tried.
+enum class DuplicateRule { HigherVersion, SystemVolume, LaterRegistration, FoundFirst };
+std::string_view nameOf(DuplicateRule rule);
+
+// The identifiers a plug-in says it replaces: a string names one, an array every string in it.
+std::vector<std::string> replacedIdentifiers(const BXDPlugIn& plugIn);
 
 // The forms accepted so far, in the order of acceptance, with the duplicate resolution among forms of the same
 // identifier: a form that a later duplicate beat is left as an empty slot, so that the positions recorded per
@@ -40,6 +77,16 @@ struct CandidateFilter {
 class AcceptedForms {
   public:
     explicit AcceptedForms(uint64_t flags) : flags_(flags) {}
+
+    // Who beat a plug-in (UUID text) among forms of its identifier, and by what.
+    struct Defeat {
+        std::string winner;
+        DuplicateRule rule;
+    };
+    using Defeats = std::unordered_map<std::string, Defeat>;
+    // From now on, every form beaten (the one offered or one accepted before) is recorded in `defeats`, which must
+    // outlive the offers. For "explain"; discovery itself records nothing.
+    void recordDefeats(Defeats* defeats) { defeats_ = defeats; }
 
     // Offers the exported form of a candidate that passed the filter; it is kept unless an accepted form of its
     // identifier beats it, and it replaces one that it beats.
@@ -56,6 +103,7 @@ class AcceptedForms {
     using Form = std::shared_ptr<MutableDictionary>;
 
     uint64_t flags_;
+    Defeats* defeats_ = nullptr;
     std::vector<Form> forms_;
     // The positions in forms_ of the live forms of each identifier, in the order of forms_.
     std::unordered_map<std::string, std::vector<size_t>> positions_;

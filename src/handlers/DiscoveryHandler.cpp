@@ -36,7 +36,6 @@
 #include "model/BXUtilities.h"
 #include "model/MessageForm.h"
 #include "platform/log/Log.h"
-#include "platform/sandbox/ProcessSandbox.h"
 #include "platform/trace/Probes.h"
 #include "platform/zem/ZemCodec.h"
 #include "policy/BXDPlugIn.h"
@@ -241,20 +240,10 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
 }  // namespace
 
 void Transaction::matchPlugIns() {
-    const Value* rulesEntry = request().find(protocol::key::kRules);
-    if (rulesEntry != nullptr && !rulesEntry->isDictionary()) {
-        fail(ErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
-        return;
-    }
-    Value rules = rulesEntry != nullptr ? *rulesEntry : Value();
-    uint64_t flags = request().get(protocol::key::kFlags).numberAsUInt64().value_or(0);
-    pid_t pid = client()->pid();
-
-    if ((flags & discover::kAll) &&
-        (!client()->hasEntitlement(protocol::kManagerEntitlement) || processIsSandboxed(pid))) {
-        fail(ErrorCode::NotAllowed, "unauthorized discovery flag (BXDiscoverAll)");
-        return;
-    }
+    std::optional<DiscoveryQuery> query = readDiscoveryQuery(*this);
+    if (!query) return;
+    const Value& rules = query->rules;
+    const uint64_t flags = query->flags;
 
     // Forms carry tokens made for earlier replies; they must stay checkable even if the key file was removed.
     if (!BXKeepReadExtensionsCheckable())

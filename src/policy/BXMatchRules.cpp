@@ -92,23 +92,30 @@ bool BXMatchRules::match(const Value& rules, const BXPlugInCore& plugIn, const B
     return true;
 }
 
-bool BXMatchRules::matchKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
-                                   const BXMatchContext& context) {
+namespace {
+
+// The plug-in's value for a rule's key, as every rule test reads it. `settled` is set when the key alone decides:
+// a containing-application rule on a plug-in inside no application never matches, whatever the pattern.
+std::optional<Value> ruleValue(std::string_view key, const BXPlugInCore& plugIn, const BXMatchContext& context,
+                               bool& settled) {
     std::optional<Value> value;
-    if (key.starts_with(kEntitlementKeyPrefix)) {
+    if (key.starts_with(BXMatchRules::kEntitlementKeyPrefix)) {
         const BXEntitlementSource& entitlements =
             context.entitlements != nullptr ? *context.entitlements : BXEntitlementSource::recordEntitlements();
-        value = entitlements.valueForEntitlement(plugIn, key.substr(kEntitlementKeyPrefix.size()));
+        value = entitlements.valueForEntitlement(plugIn, key.substr(BXMatchRules::kEntitlementKeyPrefix.size()));
     } else {
-        if (key == kIdentifierKey) {
+        if (key == BXMatchRules::kIdentifierKey) {
             if (auto identifier = plugIn.identifier()) value = Value::string(std::move(*identifier));
-        } else if (key == kUuidKey) {
+        } else if (key == BXMatchRules::kUuidKey) {
             if (auto uuid = plugIn.uuid()) value = Value::string(uuid->string());
-        } else if (key == kUserElectionKey) {
-            value = Value::string(userElectionValue(plugIn, context));
-        } else if (key == kContainingAppKey) {
+        } else if (key == BXMatchRules::kUserElectionKey) {
+            value = Value::string(BXMatchRules::userElectionValue(plugIn, context));
+        } else if (key == BXMatchRules::kContainingAppKey) {
             auto containing = plugIn.containingPath();
-            if (!containing) return false;  // whatever the pattern, even false
+            if (!containing) {
+                settled = true;
+                return std::nullopt;
+            }
             value = Value::string(std::move(*containing));
         }
         if (!value) value = plugIn.attribute(key);
@@ -116,18 +123,107 @@ bool BXMatchRules::matchKeyPattern(std::string_view key, const Value& pattern, c
     }
     // A null Value (possible in values that came over the wire) is no value at all.
     if (value && value->isNull()) value.reset();
+    return value;
+}
 
+// The pattern's test of the value the plug-in has for its key (none: it has no value).
+bool patternHolds(const std::optional<Value>& value, const Value& pattern, const BXMatchContext& context) {
     if (isTrue(pattern)) return value.has_value() && !isFalse(*value);
     if (isFalse(pattern)) return !value || isFalse(*value);
     if (!value) return false;
-    if (pattern.isDictionary()) return matchDictionaryPattern(*value, pattern, context);
-    if (value->isString()) return matchValuePatterns(*value, pattern, context);
+    if (pattern.isDictionary()) return BXMatchRules::matchDictionaryPattern(*value, pattern, context);
+    if (value->isString()) return BXMatchRules::matchValuePatterns(*value, pattern, context);
     if (value->isArray()) {
         for (const Value& element : value->items()) {
-            if (matchValuePatterns(element, pattern, context)) return true;
+            if (BXMatchRules::matchValuePatterns(element, pattern, context)) return true;
         }
     }
     return false;
+}
+
+// How one pattern string tests: its operator and operand as comparisonOf and matchValuePattern read them.
+void describePatternString(std::string_view text, MutableDictionary& finding) {
+    namespace explain = protocol::explain;
+    if (text.starts_with(BXMatchRules::kConformsOperator)) {
+        finding.set(explain::kOperator, Value::string("conforms to"));
+        finding.set(explain::kOperand, Value::string(text.substr(BXMatchRules::kConformsOperator.size())));
+        return;
+    }
+    if (text.starts_with(BXMatchRules::kIsOperator)) {
+        finding.set(explain::kOperator, Value::string("is conformed to by"));
+        finding.set(explain::kOperand, Value::string(text.substr(BXMatchRules::kIsOperator.size())));
+        return;
+    }
+    if (text.starts_with('?')) {
+        finding.set(explain::kOperator, Value::string("unrecognized operator (never matches)"));
+        return;
+    }
+    Comparison comparison = comparisonOf(text);
+    std::string_view name = "=";
+    if (comparison.negated) {
+        name = comparison.wanted == ComparisonResult::Same         ? "<>"
+               : comparison.wanted == ComparisonResult::Descending ? "<="
+                                                                   : ">=";
+    } else if (comparison.wanted != ComparisonResult::Same) {
+        name = comparison.wanted == ComparisonResult::Ascending ? "<" : ">";
+    }
+    finding.set(explain::kOperator, Value::string(name));
+    finding.set(explain::kOperand, Value::string(comparison.operand));
+}
+
+// The operator of a whole pattern, for an explanation: presence tests, activation rules, lists of alternatives and
+// single comparisons.
+void describePattern(const Value& pattern, MutableDictionary& finding) {
+    namespace explain = protocol::explain;
+    if (isTrue(pattern)) {
+        finding.set(explain::kOperator, Value::string("present"));
+    } else if (isFalse(pattern)) {
+        finding.set(explain::kOperator, Value::string("absent"));
+    } else if (pattern.isDictionary()) {
+        finding.set(explain::kOperator, Value::string("activation rule"));
+    } else if (pattern.isString()) {
+        describePatternString(pattern.stringView(), finding);
+    } else if (pattern.isArray()) {
+        finding.set(explain::kOperator, Value::string("any of"));
+    } else {
+        finding.set(explain::kOperator, Value::string("unusable pattern (never matches)"));
+    }
+}
+
+}  // namespace
+
+bool BXMatchRules::matchKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
+                                   const BXMatchContext& context) {
+    bool settled = false;
+    std::optional<Value> value = ruleValue(key, plugIn, context, settled);
+    if (settled) return false;
+    return patternHolds(value, pattern, context);
+}
+
+Value BXMatchRules::explainKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
+                                      const BXMatchContext& context) {
+    namespace explain = protocol::explain;
+    bool settled = false;
+    std::optional<Value> value = ruleValue(key, plugIn, context, settled);
+    MutableDictionary finding;
+    finding.set(explain::kKey, Value::string(key));
+    if (value) finding.set(explain::kValue, *value);
+    finding.set(explain::kPattern, pattern);
+    describePattern(pattern, finding);
+    finding.set(explain::kPassed, Value::boolean(!settled && patternHolds(value, pattern, context)));
+    return finding.take();
+}
+
+Value BXMatchRules::explainMatch(const Value& rules, const BXPlugInCore& plugIn, const BXMatchContext& context) {
+    MutableArray findings;
+    if (!rules.isDictionary()) return findings.take();
+    for (const auto& entry : rules.entries()) {
+        Value finding = explainKeyPattern(entry.key, entry.value, plugIn, context);
+        bool passed = finding.get(protocol::explain::kPassed) == trueValue();
+        findings.append(std::move(finding));
+        if (!passed) break;
+    }
+    return findings.take();
 }
 
 bool BXMatchRules::matchValuePatterns(const Value& value, const Value& patterns, const BXMatchContext& context) {

@@ -56,6 +56,14 @@ class BXMatchRules {
     static bool matchKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
                                 const BXMatchContext& context = {});
 
+    // explain variants: what match and matchKeyPattern decide, with what they compared, for a person to read. One
+    // rule gives {"key", "value" (the plug-in's; absent when it has none), "pattern", "operator", "operand" (for a
+    // comparison or type test), "passed"}; a rule set gives one such entry per rule, in order, up to the first that
+    // failed (empty for a null rule set). The decision is made by the same code as match's.
+    static Value explainKeyPattern(std::string_view key, const Value& pattern, const BXPlugInCore& plugIn,
+                                   const BXMatchContext& context = {});
+    static Value explainMatch(const Value& rules, const BXPlugInCore& plugIn, const BXMatchContext& context = {});
+
     // The pattern-list test: `patterns` is one pattern string or an array of alternatives. False when `value` is
     // not a string, or `patterns` is neither a string nor an array.
     static bool matchValuePatterns(const Value& value, const Value& patterns, const BXMatchContext& context = {});

@@ -79,12 +79,18 @@ TEST_F(ProtocolDocument, ListsExactlyTheDefinedErrorCodes) {
 }
 
 TEST_F(ProtocolDocument, DescribesEveryKeyFlagAndName) {
-    for (auto keys : {std::vector<std::string_view>(key::kList.begin(), key::kList.end()),
-                      std::vector<std::string_view>(form::kList.begin(), form::kList.end()),
-                      std::vector<std::string_view>(annotation::kList.begin(), annotation::kList.end()),
-                      std::vector<std::string_view>(change::kList.begin(), change::kList.end()),
-                      std::vector<std::string_view>{change::kAdded, change::kRemoved, change::kChanged},
-                      std::vector<std::string_view>(change::kKindList.begin(), change::kKindList.end())})
+    for (auto keys :
+         {std::vector<std::string_view>(key::kList.begin(), key::kList.end()),
+          std::vector<std::string_view>(form::kList.begin(), form::kList.end()),
+          std::vector<std::string_view>(annotation::kList.begin(), annotation::kList.end()),
+          std::vector<std::string_view>(change::kList.begin(), change::kList.end()),
+          std::vector<std::string_view>{change::kAdded, change::kRemoved, change::kChanged},
+          std::vector<std::string_view>(change::kKindList.begin(), change::kKindList.end()),
+          std::vector<std::string_view>(explain::kList.begin(), explain::kList.end()),
+          std::vector<std::string_view>(explain::kStepNames.begin(), explain::kStepNames.end()),
+          std::vector<std::string_view>{explain::kMatched, explain::kRejected, explain::kLost, explain::kHigherVersion,
+                                        explain::kSystemVolumeWins, explain::kLaterRegistration, explain::kFoundFirst,
+                                        explain::kNotRegistered, explain::kNotRegisteredOrHidden, explain::kNoBundle}})
         for (std::string_view name : keys) EXPECT_NE(document_.find(quoted(name)), std::string::npos) << name;
 
     std::string matchFlags = document_.substr(document_.find("Flags of \"match\""));

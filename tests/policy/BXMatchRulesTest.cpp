@@ -231,6 +231,67 @@ TEST_F(BXMatchRulesTest, RequiredValuesNeverLeaveOutAValueTheRuleAccepts) {
     EXPECT_FALSE(BXMatchRules::requiredValues(str("K"), "K")) << "not a rule set";
 }
 
+// The explaining variant decides with the same code: over every kind of pattern and key (presence, comparisons,
+// lists, type tests, activation rules, the containing application of a plug-in inside none) it passes exactly when
+// the rule matches, reports the value the rule read and names the operator that the pattern's text carries.
+TEST_F(BXMatchRulesTest, ExplanationsDecideAsMatchAndNameTheValueAndOperator) {
+    auto outside = makePlugIn(Value::emptyDictionary(), std::nullopt);
+    const std::pair<const char*, Value> rules[] = {
+        {"Language", str("en")},
+        {"Language", str("<>en")},
+        {"Language", str("<=dz")},
+        {"Language", str(">=fr")},
+        {"Language", str("<fr")},
+        {"Language", str(">a")},
+        {"Language", str("==en")},
+        {"Language", Value::boolean(true)},
+        {"Missing", Value::boolean(false)},
+        {"Missing", str("x")},
+        {"Zero", Value::boolean(true)},
+        {"Languages", arr({str("it"), str("fr")})},
+        {"Languages", Value::emptyArray()},
+        {"Images", str("?ZQ-CONFORMS:image/x-raster")},
+        {"Picture", str("?ZQ-IS:image/png")},
+        {"Language", str("?ZQ-NOPE:x")},
+        {"ActivationRule", dict({{"image/png", Value::int64(1)}})},
+        {"RZExtensionContainingApp", Value::boolean(false)},
+        {"RZUserElection", str("0")},
+        {"Language", Value::int64(3)},
+    };
+    for (const auto* record : {plugIn_.get(), outside.get()}) {
+        for (const auto& [key, pattern] : rules) {
+            Value finding = BXMatchRules::explainKeyPattern(key, pattern, *record, context_);
+            EXPECT_EQ(finding.get("passed"),
+                      Value::boolean(BXMatchRules::matchKeyPattern(key, pattern, *record, context_)))
+                << key << " " << pattern.description();
+            EXPECT_EQ(finding.get("key").stringView(), key);
+            EXPECT_EQ(finding.get("pattern"), pattern);
+        }
+    }
+    auto operatorOf = [&](const Value& pattern) {
+        return std::string(
+            BXMatchRules::explainKeyPattern("Language", pattern, *plugIn_, context_).get("operator").stringView());
+    };
+    EXPECT_EQ(operatorOf(str("<>en")), "<>");
+    EXPECT_EQ(operatorOf(str("<=en")), "<=");
+    EXPECT_EQ(operatorOf(str(">=en")), ">=");
+    EXPECT_EQ(operatorOf(str("<en")), "<");
+    EXPECT_EQ(operatorOf(str(">en")), ">");
+    EXPECT_EQ(operatorOf(str("en")), "=");
+    EXPECT_EQ(operatorOf(str("?ZQ-CONFORMS:a")), "conforms to");
+    EXPECT_EQ(operatorOf(arr({str("a")})), "any of");
+    Value compared = BXMatchRules::explainKeyPattern("Language", str("==en"), *plugIn_, context_);
+    EXPECT_EQ(compared.get("operand"), str("=en")) << "only one operator is stripped";
+    EXPECT_EQ(compared.get("value"), str("en"));
+
+    // A rule set is explained up to its first failing rule, in order.
+    Value findings = BXMatchRules::explainMatch(
+        dict({{"Language", str("en")}, {"Missing", str("x")}, {"Shown", Value::boolean(true)}}), *plugIn_, context_);
+    ASSERT_EQ(findings.count(), 2u) << findings.description();
+    EXPECT_FALSE(findings.items()[1].contains("value")) << "a key the plug-in lacks has no value";
+    EXPECT_EQ(BXMatchRules::explainMatch(Value(), *plugIn_, context_), Value::emptyArray());
+}
+
 // "?ZQ-CONFORMS:" matches a more specific type, "?ZQ-IS:" a more general one. The prefixes are exact: any other
 // question-mark operator fails (and is logged for the operator).
 TEST_F(BXMatchRulesTest, ConformanceOperatorsAndUnknownOperators) {

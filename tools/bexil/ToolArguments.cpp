@@ -49,6 +49,15 @@ Result<std::vector<Uuid>> parseUuids(const std::vector<std::string>& texts) {
     return uuids;
 }
 
+Result<Value> plugInArgument(const std::string& text) {
+    if (text.empty()) return BXError(ErrorCode::InvalidRequest, "--plugin needs an identifier, a UUID or a path");
+    if (text.find('/') == std::string::npos || text.front() == '/') return Value::string(text);
+    std::error_code error;
+    fs::path absolute = fs::absolute(text, error);
+    if (error) return BXError(ErrorCode::InvalidRequest, "cannot make \"" + text + "\" an absolute path");
+    return Value::string(absolute.lexically_normal().string());
+}
+
 Result<Value> absolutePaths(const std::vector<std::string>& texts) {
     MutableArray paths;
     for (const std::string& text : texts) {

@@ -34,6 +34,9 @@ Result<Value> absolutePaths(const std::vector<std::string>& texts);
 Result<Value> rulesFromArguments(const std::vector<std::string>& arguments);
 // A dictionary from a file: the structured-document form when it ends in ".vrec", JSON otherwise.
 Result<Value> readDictionaryFile(const std::filesystem::path& path);
+// The plug-in an "explain" asks about, as sent: an identifier or UUID text as it is, a path made absolute (a text
+// with a "/" in it is a path). Empty text is refused.
+Result<Value> plugInArgument(const std::string& text);
 // Discovery flags by name: all-versions, all-instances, system-only, all.
 Result<uint64_t> discoveryFlags(const std::vector<std::string>& names);
 

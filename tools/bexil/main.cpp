@@ -324,6 +324,7 @@ struct Arguments {
     bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false, wait = false;
     std::vector<std::string> say;
     std::string point;
+    std::string plugIn;
 };
 
 using Printer = std::function<int(BXDaemonClient&, const Value&)>;
@@ -406,17 +407,21 @@ int bulkCommand(const Options& options, Arguments& arguments) {
     return roundTrip(options, "bulk", [&](BXDaemonClient& c, auto h) { c.bulkPluginsReply(arguments.flags, h); }, {});
 }
 
-int matchCommand(const Options& options, Arguments& arguments) {
+// The rules of a discovery: the KEY=PATTERN arguments over those of --rules-file.
+Result<Value> discoveryRules(const Arguments& arguments) {
     auto ruleSet = rulesFromArguments(arguments.rules);
-    if (!ruleSet) return usageFailure(ruleSet.error());
-    Value combined = *ruleSet;
-    if (!arguments.file.empty()) {
-        auto fromFile = readDictionaryFile(arguments.file);
-        if (!fromFile) return usageFailure(fromFile.error());
-        MutableDictionary merged(*fromFile);
-        for (const DictionaryEntry& entry : ruleSet->entries()) merged.set(entry.key, entry.value);
-        combined = merged.take();
-    }
+    if (!ruleSet || arguments.file.empty()) return ruleSet;
+    auto fromFile = readDictionaryFile(arguments.file);
+    if (!fromFile) return fromFile;
+    MutableDictionary merged(*fromFile);
+    for (const DictionaryEntry& entry : ruleSet->entries()) merged.set(entry.key, entry.value);
+    return merged.take();
+}
+
+int matchCommand(const Options& options, Arguments& arguments) {
+    auto rules = discoveryRules(arguments);
+    if (!rules) return usageFailure(rules.error());
+    const Value& combined = *rules;
     auto matchFlags = discoveryFlags(arguments.flagNames);
     if (!matchFlags) return usageFailure(matchFlags.error());
     // Paged, so that any number of plug-ins fits: each page is one reply frame.
@@ -438,6 +443,109 @@ int matchCommand(const Options& options, Arguments& arguments) {
             return printMatches(options, c, m);
         },
         [&] { return std::chrono::steady_clock::time_point(std::chrono::steady_clock::duration(lastPage.load())); });
+}
+
+// The words after a step's mark in `bexil explain`: what the step found, from its details.
+std::string stepDetail(const Value& step) {
+    namespace explain = protocol::explain;
+    const bool passed = step.get(explain::kPassed).getBool().value_or(false);
+    const std::string_view name = step.get(explain::kStep).stringView();
+    auto text = [&](std::string_view key) { return std::string(step.get(key).stringView()); };
+    auto json = [](const Value& value) { return toJson(value, JsonLayout::OneLine); };
+    std::string reason = text(explain::kReason);
+    if (step.get(explain::kSkipped).getBool().value_or(false)) return "skipped: the flags discover all";
+    if (name == explain::kRegistry) {
+        std::string found = passed ? "found by the registry's query for these rules" : reason;
+        if (!step.get(explain::kBundleOnDisk).getBool().value_or(true)) found += "; its bundle is missing on disk";
+        return found;
+    }
+    if (name == explain::kResidence) {
+        std::string where = step.get(explain::kSystemVolume).getBool().value_or(false) ? "on the system volume"
+                            : step.contains(explain::kContainingApplication)
+                                ? "inside " + text(explain::kContainingApplication)
+                                : "outside every application";
+        return passed ? where : where + ": " + reason;
+    }
+    if (name == explain::kDedication) {
+        if (!step.get(explain::kDedicated).getBool().value_or(false)) return "not dedicated";
+        return passed ? "dedicated to this application" : reason;
+    }
+    if (name == explain::kHold) {
+        if (passed) return "not held";
+        const Value& placer = step.get(explain::kPlacedBy);
+        const Uuid* hold = step.get(explain::kHoldUuid).getUuid();
+        return "held by " + (hold ? hold->string() : std::string("a hold")) + ", placed by pid " +
+               std::to_string(placer.get(protocol::key::kPid).numberAsUInt64().value_or(0)) + " (" +
+               std::string(placer.get(explain::kExecutable).stringView()) + ")";
+    }
+    if (name == explain::kRulesStep || name == explain::kExclusions) {
+        std::string findings;
+        for (const Value& finding : step.get(explain::kFindings).items()) {
+            if (!findings.empty()) findings += "; ";
+            findings += std::string(finding.get(explain::kKey).stringView()) + " " +
+                        std::string(finding.get(explain::kOperator).stringView());
+            if (finding.contains(explain::kOperand))
+                findings += " " + json(finding.get(explain::kOperand));
+            else if (!finding.get(explain::kPattern).isBool())
+                findings += " " + json(finding.get(explain::kPattern));
+            findings += ": value " + (finding.contains(explain::kValue) ? json(finding.get(explain::kValue)) : "none");
+            findings += finding.get(explain::kPassed).getBool().value_or(false) ? ", holds" : ", fails";
+        }
+        if (name == explain::kRulesStep) return findings.empty() ? "no rules" : findings;
+        if (passed)
+            return "none of " + std::to_string(step.get(explain::kCount).numberAsUInt64().value_or(0)) + " matches";
+        return "exclusion " + std::to_string(step.get(explain::kExclusion).numberAsUInt64().value_or(0)) + " " +
+               json(step.get(explain::kExclusionRules)) + " matches: " + findings;
+    }
+    if (name == explain::kHostPolicy) return passed ? "allowed for this host" : reason;
+    if (name == explain::kDuplicates) {
+        if (!passed) return "lost to " + text(explain::kWinner) + " by " + text(explain::kTieBreak);
+        return step.contains(explain::kReplacedBy) ? "kept; replaced by " + text(explain::kReplacedBy) : "kept";
+    }
+    return reason;
+}
+
+// One block per candidate: a heading with the plug-in and its outcome, then one line per step with its mark.
+int printExplanation(const Options& options, const Value& plugIn, const Value& message) {
+    namespace explain = protocol::explain;
+    if (options.json) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    const Value& entries = message.get(protocol::key::kExplanation);
+    if (entries.count() == 0) {
+        std::printf("%s: %s\n", std::string(plugIn.stringView()).c_str(),
+                    std::string(message.get(protocol::key::kNotFound).stringView()).c_str());
+        return 0;
+    }
+    for (const Value& entry : entries.items()) {
+        auto text = [&](std::string_view key) { return std::string(entry.get(key).stringView()); };
+        std::printf("%s %s (%s): %s\n  %s\n", text(protocol::form::kIdentifier).c_str(),
+                    text(protocol::form::kVersion).c_str(), text(protocol::form::kUuid).c_str(),
+                    text(explain::kOutcome).c_str(), text(protocol::form::kPath).c_str());
+        for (const Value& step : entry.get(explain::kSteps).items()) {
+            bool passed = step.get(explain::kPassed).getBool().value_or(false);
+            const char* mark = step.get(explain::kSkipped).getBool().value_or(false) ? "skip"
+                               : passed                                              ? " ok "
+                                                                                     : "FAIL";
+            std::printf("  [%s] %-12s %s\n", mark, std::string(step.get(explain::kStep).stringView()).c_str(),
+                        stepDetail(step).c_str());
+        }
+    }
+    return 0;
+}
+
+int explainCommand(const Options& options, Arguments& arguments) {
+    auto rules = discoveryRules(arguments);
+    if (!rules) return usageFailure(rules.error());
+    auto flags = discoveryFlags(arguments.flagNames);
+    if (!flags) return usageFailure(flags.error());
+    auto plugIn = plugInArgument(arguments.plugIn);
+    if (!plugIn) return usageFailure(plugIn.error());
+    return roundTrip(
+        options, "explain",
+        [&](BXDaemonClient& c, auto h) { c.explainPlugInRulesFlagsReply(*plugIn, *rules, *flags, std::move(h)); },
+        [&](BXDaemonClient&, const Value& m) { return printExplanation(options, *plugIn, m); });
 }
 
 int readyCommand(const Options& options, Arguments& arguments) {
@@ -801,6 +909,16 @@ const Subcommand kSubcommands[] = {
          c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
      },
      matchCommand},
+    {"explain",
+     "say step by step why match with these rules finds a plug-in or not\n  example: bexil explain "
+     "RZExtensionPointIdentifier=com.example.greeting --plugin com.example.greeter.hello",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
+         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
+         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+         c.add_option("--plugin", a.plugIn, "the plug-in: its identifier, UUID or bundle path")->required();
+     },
+     explainCommand},
     {"ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...", uuidsArgument, readyCommand},
     {"launch",
      "make a plug-in ready for this command and start it in its sandbox, then talk to it\n  example: bexil launch "
