@@ -219,6 +219,7 @@ TEST_F(ChangesTest, GenerationsNeverGoBackAcrossSigkillsDuringChanges) {
     const fs::path markFile = bxd_.root() / "state" / "generation";
     std::mt19937 random(20261125);
     uint64_t highest = 0;
+    int roundsWithChanges = 0;
     for (int round = 0; round < 100; ++round) {
         std::atomic<uint64_t> seen{0};
         std::atomic<bool> stop{false};
@@ -241,6 +242,7 @@ TEST_F(ChangesTest, GenerationsNeverGoBackAcrossSigkillsDuringChanges) {
         bxd_.stop(SIGKILL);
         stop.store(true);
         changer.join();
+        if (seen.load() > highest) ++roundsWithChanges;
         uint64_t before = std::max(highest, seen.load());
         std::optional<uint64_t> mark = markIn(slurp(markFile));
         ASSERT_TRUE(mark) << "round " << round;
@@ -249,6 +251,7 @@ TEST_F(ChangesTest, GenerationsNeverGoBackAcrossSigkillsDuringChanges) {
         highest = currentGeneration();
         ASSERT_GT(highest, before) << "round " << round;
     }
+    EXPECT_GE(roundsWithChanges, 25) << "most kills should land while changes are made";
 }
 
 }  // namespace
