@@ -60,7 +60,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 13> kRequests{{
+inline constexpr std::array<RequestInfo, 14> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
