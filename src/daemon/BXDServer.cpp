@@ -190,7 +190,8 @@ Value BXDServer::currentExclusions() {
     Value exclusions = userPrefs_->exclusions();
     if (!(exclusions == lastExclusions_)) {
         lastExclusions_ = exclusions;
-        changeFeed_->publish(Change::Kind::ExclusionsChanged, {}, {});
+        uint64_t generation = changeFeed_->publish(Change::Kind::ExclusionsChanged, {}, {});
+        log::ops().info("the global exclusions changed (generation %llu)", static_cast<unsigned long long>(generation));
     }
     return exclusions;
 }

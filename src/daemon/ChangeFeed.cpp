@@ -33,8 +33,12 @@ std::string_view nameOf(Change::Kind kind) {
     return "unknown";
 }
 
-ChangeFeed::ChangeFeed(std::unique_ptr<GenerationStore> store, std::optional<SerialQueue> queue, size_t capacity)
-    : store_(std::move(store)), queue_(std::move(queue)), capacity_(std::max<size_t>(capacity, 1)) {
+ChangeFeed::ChangeFeed(std::unique_ptr<GenerationStore> store, std::optional<SerialQueue> queue, size_t capacity,
+                       size_t plugInCapacity)
+    : store_(std::move(store)),
+      queue_(std::move(queue)),
+      capacity_(std::max<size_t>(capacity, 1)),
+      plugInCapacity_(plugInCapacity) {
     if (store_) current_ = store_->start();
     windowStart_ = current_;
 }
@@ -68,18 +72,21 @@ uint64_t ChangeFeed::publish(Change::Kind kind, std::vector<Uuid> plugIns, std::
     // The store makes the generation durable before anyone hears of it.
     if (store_) store_->reserveThrough(generation);
     current_ = generation;
-    if (log_.size() >= capacity_) {
+    loggedPlugIns_ += plugIns.size();
+    log_.push_back(Change{generation, kind, std::move(plugIns), std::move(identifiers)});
+    while (log_.size() > capacity_ || (log_.size() > 1 && loggedPlugIns_ > plugInCapacity_)) {
         // Dropping one at a time keeps the window as long as it can be; the log says so at the first drop and
         // then once per log's worth, not for every change.
         if (dropped_++ % capacity_ == 0)
             log::ops().info(
-                "change log full (%zu changes, kLogCapacity): dropping the oldest; \"changes\" before "
-                "generation %llu now answers too old",
-                capacity_, static_cast<unsigned long long>(log_.front().generation));
+                "change log full (%zu changes, kLogCapacity, or %zu plug-ins, kLogPlugInCapacity): "
+                "dropping the oldest; \"changes\" before generation %llu now answers too old",
+                capacity_, plugInCapacity_, static_cast<unsigned long long>(log_.front().generation));
         windowStart_ = log_.front().generation;
+        loggedPlugIns_ -= log_.front().plugIns.size();
         log_.pop_front();
     }
-    log_.push_back(Change{generation, kind, std::move(plugIns), std::move(identifiers)});
+    if (observers_.empty()) return generation;
     const Change& change = log_.back();
     // An observer may subscribe or unsubscribe others: each is looked up again just before it is called, and one
     // that subscribes now first hears of the next change.

@@ -47,11 +47,15 @@ class ChangeFeed {
     // The most changes the log keeps; older ones are dropped (logged once per drop) and "changes" for a generation
     // before the oldest kept answers "too old".
     static constexpr size_t kLogCapacity = 65536;
+    // The most plug-ins the kept changes may name together (a bulk annotation of many plug-ins is one change):
+    // past it the oldest changes are dropped too, so the log stays within some tens of megabytes.
+    static constexpr size_t kLogPlugInCapacity = 1000000;
 
     // Generations from `store` (none: counted in memory from 0, for tests). `queue` (none: unchecked) is the queue
-    // every member but note() must be called on. `capacity` bounds the log (tests use small ones).
+    // every member but note() must be called on. `capacity` and `plugInCapacity` bound the log (tests use small
+    // ones); the newest change is always kept.
     explicit ChangeFeed(std::unique_ptr<GenerationStore> store = nullptr, std::optional<SerialQueue> queue = {},
-                        size_t capacity = kLogCapacity);
+                        size_t capacity = kLogCapacity, size_t plugInCapacity = kLogPlugInCapacity);
     ~ChangeFeed();
     ChangeFeed(const ChangeFeed&) = delete;
     ChangeFeed& operator=(const ChangeFeed&) = delete;
@@ -104,6 +108,9 @@ class ChangeFeed {
     std::unique_ptr<GenerationStore> store_;
     std::optional<SerialQueue> queue_;
     size_t capacity_;
+    size_t plugInCapacity_;
+    // The plug-ins the changes in log_ name together.
+    size_t loggedPlugIns_ = 0;
     uint64_t current_ = 0;
     // The generation before the oldest change in log_ (current_ while nothing was ever dropped in this run).
     uint64_t windowStart_ = 0;

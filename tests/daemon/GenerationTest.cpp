@@ -210,6 +210,17 @@ TEST(ChangeFeedTest, TheWindowDropsTheOldestAndAnswersTooOldBeforeIt) {
     ASSERT_EQ(edge.outcome, ChangeFeed::Since::Outcome::Answered);
     ASSERT_EQ(edge.plugIns.size(), 4u);
     EXPECT_EQ(edge.plugIns.front().uuid, uuidOf(7));
+
+    // Few changes naming many plug-ins fill it too, but the newest is kept whatever its size.
+    ChangeFeed bulky(nullptr, std::nullopt, 100, 5);
+    bulky.publish(Kind::Annotated, {uuidOf(1), uuidOf(2)}, {"x", "y"});
+    bulky.publish(Kind::Annotated, {uuidOf(3), uuidOf(4)}, {"x", "y"});
+    EXPECT_EQ(bulky.oldestAnswerable(), 0u);
+    bulky.publish(Kind::Annotated, {uuidOf(5), uuidOf(6)}, {"x", "y"});
+    EXPECT_EQ(bulky.oldestAnswerable(), 1u);
+    bulky.publish(Kind::Annotated, std::vector<Uuid>(9, uuidOf(7)), std::vector<std::string>(9, "z"));
+    EXPECT_EQ(bulky.oldestAnswerable(), 3u);
+    EXPECT_EQ(bulky.changesSince(3).plugIns.size(), 1u);
 }
 
 TEST(ChangeFeedTest, AStoredFeedStartsAboveTheLastRunAndAnswersItsGenerationsTooOld) {
