@@ -98,6 +98,8 @@ class FuzzConnection final : public ZemConnection {
     uid_t peerUid() const override { return credentials_.uid; }
     gid_t peerGid() const override { return credentials_.gid; }
     bool peerHasHungUp() const override { return false; }
+    // What the daemon sends is recorded at once: nothing ever waits to be written.
+    size_t queuedBytes() const override { return 0; }
     const ZemPeerCredentials& peerCredentials() const override { return credentials_; }
     const std::string& serviceName() const override { return serviceName_; }
     std::string description() const override { return "<fuzz connection>"; }

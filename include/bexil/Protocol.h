@@ -31,9 +31,25 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch", "holds" and "status" are extensions of ours: on Linux nobody but bxd starts plug-ins, and administrators
-// want to see what holds plug-ins out of use and what the daemon is doing (docs/protocol.md).
-enum class Request { Add, Remove, Bulk, Match, Ready, Access, Annotate, BulkAnnotate, Lock, Launch, Holds, Status };
+// "launch", "holds", "status", "watch" and "unwatch" are extensions of ours: on Linux nobody but bxd starts plug-ins,
+// administrators want to see what holds plug-ins out of use and what the daemon is doing, and an application that
+// shows plug-ins wants to hear of changes rather than poll (docs/protocol.md).
+enum class Request {
+    Add,
+    Remove,
+    Bulk,
+    Match,
+    Ready,
+    Access,
+    Annotate,
+    BulkAnnotate,
+    Lock,
+    Launch,
+    Holds,
+    Status,
+    Watch,
+    Unwatch
+};
 
 struct RequestInfo {
     Request request;
@@ -43,7 +59,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 12> kRequests{{
+inline constexpr std::array<RequestInfo, 14> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -56,6 +72,8 @@ inline constexpr std::array<RequestInfo, 12> kRequests{{
     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
     {Request::Holds, "holds", "list the holds in force (manager only)"},
     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
+    {Request::Watch, "watch", "discover like match, then hear of every change of the result on this connection"},
+    {Request::Unwatch, "unwatch", "cancel a watch of this connection"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -101,10 +119,21 @@ inline constexpr std::string_view kRegistered = "registered";        // uint64, 
 // absent on the last page).
 inline constexpr std::string_view kPageSize = "pagesize";
 inline constexpr std::string_view kContinuation = "continuation";
+// Standing queries, an extension of ours: the watch's id (uint64) in a "watch" reply, an "unwatch" request and every
+// message of the watch; the generation (uint64) a result or a change belongs to; in a watch's messages, what kind of
+// message it is (string, watch::kUpdate or watch::kResync) and the forms added (array of forms), the UUIDs removed
+// (array of UUID texts) and the forms changed (array of forms).
+inline constexpr std::string_view kWatch = "watch";
+inline constexpr std::string_view kGeneration = "generation";
+inline constexpr std::string_view kEvent = "event";
+inline constexpr std::string_view kAdded = "added";
+inline constexpr std::string_view kRemoved = "removed";
+inline constexpr std::string_view kChanged = "changed";
 inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
                                   kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
                                   kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
-                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation};
+                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
+                                  kWatch,         kGeneration, kEvent,     kAdded,      kRemoved,     kChanged};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").
@@ -185,14 +214,17 @@ enum class ErrorCode : int {
     // A discovery continuation that this run of bxd did not issue to this connection for this request: malformed,
     // altered, another client's, or from before bxd restarted (an extension of ours).
     BadContinuation = 19,
+    // A "watch" refused because the connection, or bxd as a whole, keeps as many watches as it may (watch::; an
+    // extension of ours).
+    WatchLimit = 21,
 };
 
 // Every code once (OperationFailed shares InvalidRequest's).
-inline constexpr std::array<ErrorCode, 10> kErrorCodes{
+inline constexpr std::array<ErrorCode, 11> kErrorCodes{
     ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest, ErrorCode::BadInterfaceSpec,
     ErrorCode::VersionMismatch,      ErrorCode::BadPath,        ErrorCode::NotAllowed,
     ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,    ErrorCode::BadBulkAnnotation,
-    ErrorCode::BadContinuation};
+    ErrorCode::BadContinuation,      ErrorCode::WatchLimit};
 
 constexpr int codeOf(ErrorCode code) { return static_cast<int>(code); }
 
@@ -215,6 +247,20 @@ inline constexpr uint64_t kMaxBytes = 8u << 20;
 // The page size the client library and the tool ask for.
 inline constexpr uint64_t kDefaultForms = 256;
 }  // namespace page
+
+// Standing queries ("watch", "unwatch"): the values of key::kEvent in a watch's messages, and the limits.
+namespace watch {
+// A change of the result: key::kAdded, key::kRemoved, key::kChanged, at key::kGeneration.
+inline constexpr std::string_view kUpdate = "update";
+// The watcher fell behind: the messages it missed are not sent, the watch has ended, and its result must be
+// fetched afresh (the client library does that on its own).
+inline constexpr std::string_view kResync = "resync";
+// The most watches one connection may keep, and all connections together.
+inline constexpr uint64_t kMaxPerClient = 64;
+inline constexpr uint64_t kMaxTotal = 4096;
+// The bytes that may wait unwritten towards a watcher: a watch message that finds more ends the watch with a resync.
+inline constexpr uint64_t kMaxQueuedBytes = 1u << 20;
+}  // namespace watch
 
 // Flag bits of "lock" (key::kFlags).
 namespace hold {

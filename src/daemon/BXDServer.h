@@ -19,6 +19,7 @@
 #include "bexil/Protocol.h"
 #include "daemon/ChangeFeed.h"
 #include "daemon/DiscoveryContinuation.h"
+#include "daemon/StandingQueries.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
@@ -135,6 +136,10 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // sees is missed. REQUIRES: on mainQueue.
     Value currentExclusions();
 
+    // The standing queries, made by the first "watch" (null before). REQUIRES: on the request queue.
+    StandingQueries* standingQueries() const { return standingQueries_.get(); }
+    void setStandingQueries(std::unique_ptr<StandingQueries> queries) { standingQueries_ = std::move(queries); }
+
   private:
     BXDServer(const char* databasePath, EventLoop& loop);
 
@@ -158,6 +163,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::vector<Change> writerChanges_;
     // The exclusions as last seen, to notice a change.
     Value lastExclusions_;
+    // Last, so that the watches (which observe the server's changes) go first.
+    std::unique_ptr<StandingQueries> standingQueries_;
 };
 
 }  // namespace bexil

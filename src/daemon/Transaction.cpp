@@ -52,6 +52,8 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Launch, &Transaction::launchPlugIn},
     {Request::Holds, &Transaction::listHolds},
     {Request::Status, &Transaction::reportStatus},
+    {Request::Watch, &Transaction::watchPlugIns},
+    {Request::Unwatch, &Transaction::unwatchPlugIns},
 }};
 
 constexpr bool handlersFollowTheProtocol() {

@@ -105,6 +105,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void launchPlugIn();
     void listHolds();
     void reportStatus();
+    void watchPlugIns();
+    void unwatchPlugIns();
     // The parts of "add" and "remove" that run on the writer queue.
     void registerPaths(std::optional<UserIdentity> caller);
     void unregisterPaths(bool entitled);

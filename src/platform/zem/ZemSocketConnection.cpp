@@ -143,8 +143,15 @@ void ZemSocketConnection::deliverTerminationImminent() {
 }
 
 void ZemSocketConnection::send(const Value& message) {
-    queue_.async(
-        [self = shared_from_this(), message] { self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt); });
+    // Counted from here, so that a sender that hands over many messages in one turn sees them in queuedBytes before
+    // this queue has encoded any.
+    Result<size_t> size = ZemCodec::encodedSize(message);
+    const size_t bytes = (size ? *size : 0) + ZemFrame::kHeaderBytes;
+    posted_.fetch_add(bytes);
+    queue_.async([self = shared_from_this(), message, bytes] {
+        self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt);
+        self->posted_.fetch_sub(bytes);
+    });
 }
 
 void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& reply) {
@@ -403,6 +410,11 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
 }
 
 void ZemSocketConnection::writeMore() {
+    writeMoreNow();
+    buffered_.store(outgoing_.size() + writing_.size());
+}
+
+void ZemSocketConnection::writeMoreNow() {
     if (writeInFlight_ || outgoing_.empty() || state_ != State::Open) return;
     if (!attachments_.empty()) return writeWithAttachments();
     // The socket buffer almost always has room: try a non-blocking send first, so that a reply costs one system
@@ -495,6 +507,7 @@ void ZemSocketConnection::dropSent(size_t bytes) {
 void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
     writeInFlight_ = false;
     writing_.clear();
+    buffered_.store(outgoing_.size());
     if (state_ != State::Open) return;
     if (error) {
         close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
@@ -549,6 +562,7 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     stallTimer_.cancel();
     reader_ = ZemFrameReader();
     outgoing_.clear();
+    buffered_.store(writing_.size());
     attachments_.clear();
     receivedFds_.clear();
     heldFrames_.clear();
