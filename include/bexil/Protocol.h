@@ -114,6 +114,7 @@ inline constexpr std::string_view kCachedRecords = "cachedRecords";  // uint64, 
 inline constexpr std::string_view kCacheLimit = "cacheLimit";        // uint64, records past which it is purged
 inline constexpr std::string_view kHoldCount = "holdCount";          // uint64, holds in force
 inline constexpr std::string_view kRegistered = "registered";        // uint64, plug-ins in the registry
+inline constexpr std::string_view kWatchCount = "watchCount";        // uint64, watches in force
 // Paged discovery, an extension of ours: in a "match" request, the most forms a page may carry (uint64, see
 // page::), and the continuation of the previous page (data); in a reply, the continuation of this page (data,
 // absent on the last page).
@@ -133,7 +134,8 @@ inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuid
                                   kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
                                   kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
                                   kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
-                                  kWatch,         kGeneration, kEvent,     kAdded,      kRemoved,     kChanged};
+                                  kWatch,         kGeneration, kEvent,     kAdded,      kRemoved,     kChanged,
+                                  kWatchCount};
 }  // namespace key
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").

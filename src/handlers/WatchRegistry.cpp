@@ -339,7 +339,7 @@ void WatchRegistry::releaseClient(const BXDZemClient& client) {
     std::set<uint64_t> ids = std::move(mine->second);
     byClient_.erase(mine);
     for (uint64_t id : ids) watches_.erase(id);
-    log::ops().debug("released %zu watches of client %d", ids.size(), static_cast<int>(client.pid()));
+    log::ops().info("released %zu watches of client %d", ids.size(), static_cast<int>(client.pid()));
 }
 
 void WatchRegistry::apply(const Change& change) {
