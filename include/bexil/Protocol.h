@@ -31,9 +31,10 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch", "holds", "status", "watch" and "unwatch" are extensions of ours: on Linux nobody but bxd starts plug-ins,
-// administrators want to see what holds plug-ins out of use and what the daemon is doing, and an application that
-// shows plug-ins wants to hear of changes rather than poll (docs/protocol.md).
+// "launch", "holds", "status", "changes", "watch" and "unwatch" are extensions of ours: on Linux nobody but bxd
+// starts plug-ins, administrators want to see what holds plug-ins out of use and what the daemon is doing, a
+// client that keeps a copy of a discovery learns what changed since it was made instead of discovering again, and
+// an application that shows plug-ins wants to hear of changes rather than poll (docs/protocol.md).
 enum class Request {
     Add,
     Remove,
@@ -47,6 +48,7 @@ enum class Request {
     Launch,
     Holds,
     Status,
+    Changes,
     Watch,
     Unwatch
 };
@@ -59,7 +61,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 14> kRequests{{
+inline constexpr std::array<RequestInfo, 15> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -72,8 +74,9 @@ inline constexpr std::array<RequestInfo, 14> kRequests{{
     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
     {Request::Holds, "holds", "list the holds in force (manager only)"},
     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
-    {Request::Watch, "watch", "discover like match, then hear of every change of the result on this connection"},
-    {Request::Unwatch, "unwatch", "cancel a watch of this connection"},
+    Changes,
+    Watch,
+    Unwatch
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -120,12 +123,18 @@ inline constexpr std::string_view kWatchCount = "watchCount";        // uint64, 
 // absent on the last page).
 inline constexpr std::string_view kPageSize = "pagesize";
 inline constexpr std::string_view kContinuation = "continuation";
+// Change generations, an extension of ours (docs/generations.md): in a "match" reply, the generation it was computed
+// at (uint64); in a "changes" request, the generation to answer from, and in its reply, the current one.
+inline constexpr std::string_view kGeneration = "generation";
+// In a "changes" reply: one entry per plug-in that changed (array of dictionaries, see change::), and whether an
+// exclusions change lies in the answered span, so that every plug-in may have changed (bool, absent when not).
+inline constexpr std::string_view kChanges = "changes";
+inline constexpr std::string_view kResync = "resync";
 // Standing queries, an extension of ours: the watch's id (uint64) in a "watch" reply, an "unwatch" request and every
-// message of the watch; the generation (uint64) a result or a change belongs to; in a watch's messages, what kind of
+// message of the watch; "generation" (above) the generation a result or a change belongs to; in a watch's messages, what kind of
 // message it is (string, watch::kUpdate or watch::kResync) and the forms added (array of forms), the UUIDs removed
 // (array of UUID texts) and the forms changed (array of forms).
 inline constexpr std::string_view kWatch = "watch";
-inline constexpr std::string_view kGeneration = "generation";
 inline constexpr std::string_view kEvent = "event";
 inline constexpr std::string_view kAdded = "added";
 inline constexpr std::string_view kRemoved = "removed";
@@ -134,9 +143,31 @@ inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuid
                                   kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
                                   kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
                                   kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
-                                  kWatch,         kGeneration, kEvent,     kAdded,      kRemoved,     kChanged,
-                                  kWatchCount};
+    Changes,
+    Watch,
+    Unwatch
 }  // namespace key
+
+// Entries of one element of a "changes" reply's key::kChanges (an extension of ours).
+namespace change {
+inline constexpr std::string_view kUuid = "uuid";              // UUID of the plug-in
+inline constexpr std::string_view kEffect = "effect";          // string, one of the effects below
+inline constexpr std::string_view kKinds = "kinds";            // array of kind strings, for kChanged only
+inline constexpr std::string_view kGeneration = "generation";  // uint64, the plug-in's latest change
+inline constexpr std::string_view kIdentifier = "identifier";  // string, absent for a removed plug-in
+inline constexpr std::array kList{kUuid, kEffect, kKinds, kGeneration, kIdentifier};
+// Effects: present now and not at the generation asked from; there then and gone now; there both times.
+inline constexpr std::string_view kAdded = "added";
+inline constexpr std::string_view kRemoved = "removed";
+inline constexpr std::string_view kChanged = "changed";
+// Kinds of change a "changed" entry went through.
+inline constexpr std::string_view kRegistration = "registration";
+inline constexpr std::string_view kUnregistration = "unregistration";
+inline constexpr std::string_view kAnnotation = "annotation";
+inline constexpr std::string_view kHold = "hold";
+inline constexpr std::string_view kRelease = "release";
+inline constexpr std::array kKindList{kRegistration, kUnregistration, kAnnotation, kHold, kRelease};
+}  // namespace change
 
 // Keys of an annotation (the value of key::kAnnotations in "annotate", per plug-in in "bulk-annotate").
 namespace annotation {
@@ -216,17 +247,20 @@ enum class ErrorCode : int {
     // A discovery continuation that this run of bxd did not issue to this connection for this request: malformed,
     // altered, another client's, or from before bxd restarted (an extension of ours).
     BadContinuation = 19,
+    // A "changes" request for a generation older than the changes bxd keeps, or from before it started: discover
+    // again with "match" (an extension of ours).
+    GenerationTooOld = 20,
     // A "watch" refused because the connection, or bxd as a whole, keeps as many watches as it may (watch::; an
     // extension of ours).
     WatchLimit = 21,
 };
 
 // Every code once (OperationFailed shares InvalidRequest's).
-inline constexpr std::array<ErrorCode, 11> kErrorCodes{
-    ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest, ErrorCode::BadInterfaceSpec,
-    ErrorCode::VersionMismatch,      ErrorCode::BadPath,        ErrorCode::NotAllowed,
-    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,    ErrorCode::BadBulkAnnotation,
-    ErrorCode::BadContinuation,      ErrorCode::WatchLimit};
+inline constexpr std::array<ErrorCode, 12> kErrorCodes{
+    ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest,   ErrorCode::BadInterfaceSpec,
+    ErrorCode::VersionMismatch,      ErrorCode::BadPath,          ErrorCode::NotAllowed,
+    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,      ErrorCode::BadBulkAnnotation,
+    ErrorCode::BadContinuation,      ErrorCode::GenerationTooOld, ErrorCode::WatchLimit};
 
 constexpr int codeOf(ErrorCode code) { return static_cast<int>(code); }
 

@@ -13,6 +13,7 @@
 #include "platform/ksn/ConsentStore.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/log/Log.h"
+#include "platform/prefs/PreferencesWatch.h"
 #include "platform/zem/ZemConnection.h"
 #include "platform/zem/ZemListener.h"
 #include "policy/BXDPlugIn.h"
@@ -34,6 +35,7 @@ BXDServer::BXDServer(const char* databasePath, EventLoop& loop)
       consent_(std::make_shared<ConsentStore>()) {}
 
 BXDServer::~BXDServer() {
+    preferencesWatch_.reset();
     if (service_) service_->cancel();
     // What the writer still has queued may call back into the server (as the database's delegate): let it finish
     // while the server is whole.
@@ -79,6 +81,15 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
     server->lastExclusions_ = server->userPrefs_->exclusions();
     server->changeFeed_ = std::make_unique<ChangeFeed>(
         std::make_unique<GenerationStore>(GenerationStore::defaultPath()), &server->mainQueue_);
+    Result<std::unique_ptr<PreferencesWatch>> watch = PreferencesWatch::start(
+        PreferencesStore::shared().directory(), server->mainQueue_, [raw] { raw->currentExclusions(); });
+    if (watch)
+        server->preferencesWatch_ = std::move(*watch);
+    else
+        log::ops().error(
+            "cannot watch the preferences folder: %@; an exclusions change is noticed at the next "
+            "discovery",
+            watch.error());
     return server;
 }
 

@@ -34,6 +34,7 @@ class BXDZemClient;
 class EntitlementsDirectory;
 class EventLoop;
 class LXBexilProxy;
+class PreferencesWatch;
 class ZemListener;
 
 class BXDServer : public BXDatabase, public BXDatabaseDelegate {
@@ -161,8 +162,9 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::unique_ptr<ChangeFeed> changeFeed_;
     // Changes made by the writer's current block (touched on the writer only).
     std::vector<Change> writerChanges_;
-    // The exclusions as last seen, to notice a change.
+    // The exclusions as last seen, to notice a change, and the watch that looks again when the folder changes.
     Value lastExclusions_;
+    std::unique_ptr<PreferencesWatch> preferencesWatch_;
     // Last, so that the watches (which observe the server's changes) go first.
     std::unique_ptr<StandingQueries> standingQueries_;
 };

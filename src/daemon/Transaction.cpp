@@ -52,6 +52,7 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Launch, &Transaction::launchPlugIn},
     {Request::Holds, &Transaction::listHolds},
     {Request::Status, &Transaction::reportStatus},
+    {Request::Changes, &Transaction::changesSince},
     {Request::Watch, &Transaction::watchPlugIns},
     {Request::Unwatch, &Transaction::unwatchPlugIns},
 }};

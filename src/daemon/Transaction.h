@@ -105,6 +105,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void launchPlugIn();
     void listHolds();
     void reportStatus();
+    void changesSince();
     void watchPlugIns();
     void unwatchPlugIns();
     // The parts of "add" and "remove" that run on the writer queue.

@@ -144,13 +144,16 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
 
     BXMatchContext context{.annotations = &database.annotationSource()};
     AcceptedForms accepted(flags);
+    // Taken after the exclusions are read, since reading them may publish their change, which the page reflects.
+    uint64_t generation = 0;
     // Where each identifier's forms end in the page, for cutting it by size later.
     std::vector<std::pair<std::string, size_t>> groupEnds;
     std::optional<std::string> walkedTo = after;
     bool ended = false;
     {
-        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database.userPrefs().exclusions());
+        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database.currentExclusions());
         CandidateFilter filter{rules, exclusions, flags, client, database, context};
+        generation = database.changeFeed().current();
         size_t walked = 0;
         bool full = false;
         const auto deadline = std::chrono::steady_clock::now() + kPageTimeBudget;
@@ -213,6 +216,7 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
     }
 
     log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms.size()));
+    transaction.reply().set(protocol::key::kGeneration, Value::uint64(generation));
     const uint64_t version = transaction.version();
     if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version))
         transaction.reply().set(protocol::key::kMatches, std::move(*encoded));
@@ -255,8 +259,9 @@ void Transaction::matchPlugIns() {
     AcceptedForms accepted(flags);
     {
         // The candidates and the rejected forms live in this scope, so they are gone before the reply is encoded.
-        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database->userPrefs().exclusions());
+        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database->currentExclusions());
         CandidateFilter filter{rules, exclusions, flags, *client(), *database, context};
+        reply().set(protocol::key::kGeneration, Value::uint64(database->changeFeed().current()));
         std::optional<BXDatabase::PlugInSet> candidates = database->findPlugIns(rules);
         trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
         for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {

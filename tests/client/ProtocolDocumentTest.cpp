@@ -74,14 +74,17 @@ TEST_F(ProtocolDocument, ListsExactlyTheDefinedErrorCodes) {
     // The document names each code as the header does, so a reader can go from one to the other.
     for (const char* name : {"`RegistryRefused`", "`InvalidRequest`, `OperationFailed`", "`BadInterfaceSpec`",
                              "`VersionMismatch`", "`BadPath`", "`NotAllowed`", "`InvalidConfiguration`",
-                             "`PlugInsBusy`", "`BadBulkAnnotation`", "`BadContinuation`"})
+                             "`PlugInsBusy`", "`BadBulkAnnotation`", "`BadContinuation`", "`GenerationTooOld`"})
         EXPECT_NE(document_.find(name), std::string::npos) << name;
 }
 
 TEST_F(ProtocolDocument, DescribesEveryKeyFlagAndName) {
     for (auto keys : {std::vector<std::string_view>(key::kList.begin(), key::kList.end()),
                       std::vector<std::string_view>(form::kList.begin(), form::kList.end()),
-                      std::vector<std::string_view>(annotation::kList.begin(), annotation::kList.end())})
+                      std::vector<std::string_view>(annotation::kList.begin(), annotation::kList.end()),
+                      std::vector<std::string_view>(change::kList.begin(), change::kList.end()),
+                      std::vector<std::string_view>{change::kAdded, change::kRemoved, change::kChanged},
+                      std::vector<std::string_view>(change::kKindList.begin(), change::kKindList.end())})
         for (std::string_view name : keys) EXPECT_NE(document_.find(quoted(name)), std::string::npos) << name;
 
     std::string matchFlags = document_.substr(document_.find("Flags of \"match\""));
