@@ -61,23 +61,22 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 15> kRequests{{
-    {Request::Add, "add", "register the plug-in bundles at paths"},
-    {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
-    {Request::Bulk, "bulk", "bulk registration options (none supported)"},
-    {Request::Match, "match", "discover the plug-ins that match rules"},
-    {Request::Ready, "ready", "make plug-ins ready for the calling host"},
-    {Request::Access, "access", "read-only access tokens for plug-ins"},
-    {Request::Annotate, "annotate", "set the annotations of plug-ins"},
-    {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
-    {Request::Lock, "lock", "place or release a hold on plug-ins"},
-    {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
-    {Request::Holds, "holds", "list the holds in force (manager only)"},
-    {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
-    Changes,
-    Watch,
-    Unwatch
-}};
+inline constexpr std::array<RequestInfo, 15> kRequests{
+    {{Request::Add, "add", "register the plug-in bundles at paths"},
+     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
+     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
+     {Request::Match, "match", "discover the plug-ins that match rules"},
+     {Request::Ready, "ready", "make plug-ins ready for the calling host"},
+     {Request::Access, "access", "read-only access tokens for plug-ins"},
+     {Request::Annotate, "annotate", "set the annotations of plug-ins"},
+     {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
+     {Request::Lock, "lock", "place or release a hold on plug-ins"},
+     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
+     {Request::Holds, "holds", "list the holds in force (manager only)"},
+     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
+     Changes,
+     Watch,
+     Unwatch}};
 
 constexpr std::string_view nameOf(Request request) {
     for (const RequestInfo& info : kRequests)
@@ -131,21 +130,18 @@ inline constexpr std::string_view kGeneration = "generation";
 inline constexpr std::string_view kChanges = "changes";
 inline constexpr std::string_view kResync = "resync";
 // Standing queries, an extension of ours: the watch's id (uint64) in a "watch" reply, an "unwatch" request and every
-// message of the watch; "generation" (above) the generation a result or a change belongs to; in a watch's messages, what kind of
-// message it is (string, watch::kUpdate or watch::kResync) and the forms added (array of forms), the UUIDs removed
-// (array of UUID texts) and the forms changed (array of forms).
+// message of the watch; "generation" (above) the generation a result or a change belongs to; in a watch's messages,
+// what kind of message it is (string, watch::kUpdate or watch::kResync) and the forms added (array of forms), the UUIDs
+// removed (array of UUID texts) and the forms changed (array of forms).
 inline constexpr std::string_view kWatch = "watch";
 inline constexpr std::string_view kEvent = "event";
 inline constexpr std::string_view kAdded = "added";
 inline constexpr std::string_view kRemoved = "removed";
 inline constexpr std::string_view kChanged = "changed";
-inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
-                                  kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
-                                  kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
-                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
-    Changes,
-    Watch,
-    Unwatch
+inline constexpr std::array kList {
+    kRequest, kVersion, kPaths, kUuids, kFlags, kRules, kAnnotations, kErrorCode, kError, kMatches, kConflicts,
+        kExtensions, kPid, kBundleInfo, kHolds, kUptime, kConnections, kServed, kCachedRecords, kCacheLimit, kHoldCount,
+        kRegistered, kPageSize, kContinuation, Changes, Watch, Unwatch
 }  // namespace key
 
 // Entries of one element of a "changes" reply's key::kChanges (an extension of ours).
