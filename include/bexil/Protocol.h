@@ -61,22 +61,23 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 15> kRequests{
-    {{Request::Add, "add", "register the plug-in bundles at paths"},
-     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
-     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
-     {Request::Match, "match", "discover the plug-ins that match rules"},
-     {Request::Ready, "ready", "make plug-ins ready for the calling host"},
-     {Request::Access, "access", "read-only access tokens for plug-ins"},
-     {Request::Annotate, "annotate", "set the annotations of plug-ins"},
-     {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
-     {Request::Lock, "lock", "place or release a hold on plug-ins"},
-     {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
-     {Request::Holds, "holds", "list the holds in force (manager only)"},
-     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
-     Changes,
-     Watch,
-     Unwatch}};
+inline constexpr std::array<RequestInfo, 15> kRequests{{
+    {Request::Add, "add", "register the plug-in bundles at paths"},
+    {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
+    {Request::Bulk, "bulk", "bulk registration options (none supported)"},
+    {Request::Match, "match", "discover the plug-ins that match rules"},
+    {Request::Ready, "ready", "make plug-ins ready for the calling host"},
+    {Request::Access, "access", "read-only access tokens for plug-ins"},
+    {Request::Annotate, "annotate", "set the annotations of plug-ins"},
+    {Request::BulkAnnotate, "bulk-annotate", "set the annotations of many plug-ins by UUID text"},
+    {Request::Lock, "lock", "place or release a hold on plug-ins"},
+    {Request::Launch, "launch", "start a plug-in made ready for the calling host, with a socket to it"},
+    {Request::Holds, "holds", "list the holds in force (manager only)"},
+    {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
+    {Request::Changes, "changes", "the plug-ins added, removed and changed since a generation"},
+    {Request::Watch, "watch", "discover like match, then hear of every change of the result on this connection"},
+    {Request::Unwatch, "unwatch", "cancel a watch of this connection"},
+}};
 
 constexpr std::string_view nameOf(Request request) {
     for (const RequestInfo& info : kRequests)
@@ -138,10 +139,12 @@ inline constexpr std::string_view kEvent = "event";
 inline constexpr std::string_view kAdded = "added";
 inline constexpr std::string_view kRemoved = "removed";
 inline constexpr std::string_view kChanged = "changed";
-inline constexpr std::array kList {
-    kRequest, kVersion, kPaths, kUuids, kFlags, kRules, kAnnotations, kErrorCode, kError, kMatches, kConflicts,
-        kExtensions, kPid, kBundleInfo, kHolds, kUptime, kConnections, kServed, kCachedRecords, kCacheLimit, kHoldCount,
-        kRegistered, kPageSize, kContinuation, Changes, Watch, Unwatch
+inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
+                                  kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
+                                  kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
+                                  kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
+                                  kGeneration,    kChanges,    kResync,    kWatch,      kEvent,       kAdded,
+                                  kRemoved,       kChanged,    kWatchCount};
 }  // namespace key
 
 // Entries of one element of a "changes" reply's key::kChanges (an extension of ours).
