@@ -40,6 +40,9 @@ void BXDaemonWatches::start(const std::shared_ptr<Watch>& watch) {
         } catch (const InternalInconsistency& broken) {
             error = BXError(ErrorCode::OperationFailed, broken.what());
         }
+        // A watch that could not reach bxd ends as one whose connection was lost later does.
+        if (const auto* lost = std::get_if<ZemError>(&raw); lost && lost->kind() != ZemError::Kind::MessageInvalid)
+            error = BXError(ErrorCode::OperationFailed, std::string(kConnectionLost) + lost->description());
         const Value* reply = std::get_if<Value>(&raw);
         std::optional<uint64_t> id =
             !error && reply != nullptr ? reply->get(key::kWatch).getUInt64() : std::optional<uint64_t>();
@@ -134,7 +137,7 @@ void BXDaemonWatches::connectionLost(const ZemError& error) {
             at = watches_.erase(at);
         }
     }
-    Error reason = BXError(ErrorCode::OperationFailed, "the connection to bxd was lost: " + error.description());
+    Error reason = BXError(ErrorCode::OperationFailed, std::string(kConnectionLost) + error.description());
     for (const std::shared_ptr<Watch>& watch : ended)
         if (watch->callbacks.ended) watch->callbacks.ended(reason);
 }

@@ -10,6 +10,8 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <string>
+#include <string_view>
 
 #include "bexil/DaemonClient.h"
 #include "bexil/Value.h"
@@ -20,6 +22,8 @@ namespace bexil {
 class BXDaemonWatches {
   public:
     using Callbacks = DaemonClient::WatchCallbacks;
+    // How the message of a watch that ended because bxd could not be reached, or went away, begins.
+    static constexpr std::string_view kConnectionLost = "the connection to bxd was lost: ";
     using Change = DaemonClient::WatchChange;
 
     explicit BXDaemonWatches(BXDaemonClient& client) : client_(client) {}

@@ -248,7 +248,7 @@ TEST_F(WatchTest, EveryWatcherViewEqualsAFreshMatchAfterEachOf200RandomChanges) 
     add(initial);
 
     Watcher pointA(Value::dictionary({{"RZExtensionPointIdentifier", str(kPointA)}}), 0);
-    Watcher allVersions(Value(), kAllVersions);
+    Watcher allVersions(Value::emptyDictionary(), kAllVersions);
     Watcher oneIdentifier(identifierRule("com.example.watch.p1"), 0);
     std::vector<Watcher*> watchers{&pointA, &allVersions, &oneIdentifier};
     for (Watcher* watcher : watchers) ASSERT_TRUE(watcher->start()) << watcher->ended() << bxd_.log();
@@ -264,13 +264,12 @@ TEST_F(WatchTest, EveryWatcherViewEqualsAFreshMatchAfterEachOf200RandomChanges) 
     };
     auto uuidOf = [&](const PlugIn& plugIn) { return registeredUuid(plugIn.path); };
     auto writeExclusions = [&] {
-        std::string arguments = "exclusions --clear";
-        if (!exclusions.empty()) {
-            ASSERT_EQ(bexil("exclusions --clear").status, 0);
-            arguments = "exclusions";
-            for (const std::string& identifier : exclusions) arguments += " --add RZExtensionIdentifier=" + identifier;
-        }
-        Outcome written = bexil(arguments);
+        fs::path file = bxd_.root() / "exclusions.json";
+        std::string rules;
+        for (const std::string& identifier : exclusions)
+            rules += (rules.empty() ? "" : ", ") + std::string("{\"RZExtensionIdentifier\": \"") + identifier + "\"}";
+        std::ofstream(file) << "{\"exclusions\": [" << rules << "]}";
+        Outcome written = bexil("exclusions --set " + file.string());
         ASSERT_EQ(written.status, 0) << written.err;
     };
 
@@ -374,7 +373,7 @@ TEST_F(WatchTest, TheWatchesOfOneConnectionAreLimitedAndUnwatchFreesOne) {
         ASSERT_EQ(errorCode(message), 0) << errorText(message);
         ids.insert(message.get("watch").getUInt64().value_or(0));
         EXPECT_EQ(message.get("matches").count(), 1u);
-        EXPECT_TRUE(message.get("generation").isUInt64());
+        EXPECT_TRUE(message.get("generation").getUInt64().has_value());
     }
     EXPECT_EQ(ids.size(), protocol::watch::kMaxPerClient) << "every watch has its own id";
     EXPECT_EQ(watchCount(), protocol::watch::kMaxPerClient);
@@ -499,12 +498,17 @@ TEST_F(WatchTest, TheToolPrintsOneLinePerChangeWhenNotOnATerminal) {
         EXPECT_EQ(posix_spawn(&pid, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
         return pid;
     };
-    auto waitForText = [&](const std::string& text) {
-        for (int i = 0; i < 500; ++i) {
-            if (slurp(out).find(text) != std::string::npos) return true;
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        ADD_FAILURE() << "no \"" << text << "\" in:\n" << slurp(out) << slurp(err);
+    // Waits until `text` is in the output `times` times.
+    auto waitForText = [&](const std::string& text, size_t times = 1) {
+        auto count = [&] {
+            std::string all = slurp(out);
+            size_t found = 0;
+            for (size_t at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++found;
+            return found;
+        };
+        for (int i = 0; i < 500 && count() < times; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        if (count() >= times) return true;
+        ADD_FAILURE() << "not " << times << " times \"" << text << "\" in:\n" << slurp(out) << slurp(err);
         return false;
     };
     pid_t tool = run();
@@ -518,7 +522,7 @@ TEST_F(WatchTest, TheToolPrintsOneLinePerChangeWhenNotOnATerminal) {
     Value held = holder.replyTo(lock.take());
     ASSERT_TRUE(waitForText(" - " + uuid + "\n"));
     holder.replyTo(request("lock", {{"uuids", Value::array({held.get("uuids")})}}));
-    ASSERT_TRUE(waitForText(" + com.example.watch.hello 1 " + uuid + " " + hello + "\n"));
+    ASSERT_TRUE(waitForText(" + com.example.watch.hello 1 " + uuid + " " + hello + "\n", 2));
     succeed(request("annotate", {{"uuids", Value::array({Value::uuid(*Uuid::parse(uuid))})},
                                  {"annotations", Value::dictionary({{"election", Value::int64(1)}})}}));
     ASSERT_TRUE(waitForText(" ~ com.example.watch.hello 1 " + uuid));

@@ -488,10 +488,8 @@ int watchCommand(const Options& options, Arguments& arguments) {
         if (outcome->status) return;
         std::string message = error.localizedDescription().value_or(error.description());
         std::fprintf(stderr, "bexil: watch: %s\n", message.c_str());
-        bool lost = message.starts_with("the connection to bxd was lost") || !outcome->started;
-        outcome->status = error.code() == protocol::codeOf(ErrorCode::OperationFailed) && lost
-                              ? kExitUnavailable
-                              : exitStatusForCode(error.code());
+        outcome->status =
+            message.starts_with(BXDaemonWatches::kConnectionLost) ? kExitUnavailable : exitStatusForCode(error.code());
     };
     watches.watch(*rules, *watchFlags, std::move(callbacks));
 
