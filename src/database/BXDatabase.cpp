@@ -295,12 +295,9 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
 std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugInsWithIdentifier(const Value& query,
                                                                            const std::string& identifier) {
     BX_ASSERT_NOT_ON_QUEUE(_sync);
-    LXPreselection preselection = preselectionFor(query);
-    // The query's own identifiers still narrow: one that does not name this identifier leaves no candidate.
-    if (preselection.identifiers && std::find(preselection.identifiers->begin(), preselection.identifiers->end(),
-                                              identifier) == preselection.identifiers->end())
-        return PlugInSet{};
-    preselection.identifiers = std::vector<std::string>{identifier};
+    // Pre-selected by the identifier alone: it names a handful of rows, where the query's extension point may name
+    // thousands, each of which would be read only to be dropped. The caller checks every rule anyway.
+    LXPreselection preselection{.extensionPoints = std::nullopt, .identifiers = std::vector<std::string>{identifier}};
     std::optional<LXProxyList> proxies =
         workspace_->pluginsMatchingQueryApplyFilter(query, filterFor(query), preselection);
     if (!proxies) return std::nullopt;
