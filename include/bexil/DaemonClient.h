@@ -70,7 +70,8 @@ class DaemonClient {
     void ready(const std::vector<Uuid>& plugIns, Callback done);
     void access(const std::vector<Uuid>& plugIns, Callback done);
     // Discovery. Pages through bxd (pages of protocol::page::kDefaultForms) and answers once with every form, in
-    // the walk's order (identifier, then registration), with replacement links across pages.
+    // the walk's order (identifier, then registration), with replacement links across pages, and with "generation",
+    // the change generation from which changes() follows it.
     void match(const Value& rules, uint64_t flags, Callback done);
     // One page of discovery for callers that stream: at most `pageSize` forms after `continuation` (null for the
     // first page); unless it is the last page, the reply carries "continuation", to pass to the next call.
@@ -86,6 +87,12 @@ class DaemonClient {
     // "cachedRecords", "cacheLimit", "holdCount" and "registered" (absent when the registry cannot be read). Any
     // client may ask. An extension of the protocol (docs/protocol.md).
     void status(Callback done);
+    // What changed since `generation` (a "generation" of an earlier match() or changes() reply): "generation", the
+    // current one, and "changes", per plug-in its "uuid", "effect" ("added", "removed", "changed"), "kinds" (for
+    // "changed"), "generation" and "identifier"; "resync" true when the exclusions changed. A generation older than
+    // bxd keeps fails with code 20 (ErrorCode::GenerationTooOld): match() again. An extension of the protocol
+    // (docs/protocol.md).
+    void changes(uint64_t generation, Callback done);
     // Starts a plug-in that ready() made runnable for this process, in its sandbox; the reply carries "pid" and
     // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
     void launch(const Uuid& plugIn, Callback done);

@@ -149,6 +149,7 @@ struct BXDaemonClient::PagedWalk {
     std::vector<Value> forms;
     size_t pages = 0;
     bool sawMatches = false;
+    Value generation;
 };
 
 void BXDaemonClient::matchAllPagesReply(const Value& rules, uint64_t flags, uint64_t pageSize, PageProgress progress,
@@ -172,7 +173,7 @@ void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const 
             failed = true;
         }
         if (failed) return walk->reply(raw);
-        ++walk->pages;
+        if (++walk->pages == 1) walk->generation = message->get(key::kGeneration);
         // The message form of the discovery result is the value itself, so pages join as they come.
         if (const Value* matches = message->find(key::kMatches); matches != nullptr && matches->isArray()) {
             walk->sawMatches = true;
@@ -185,6 +186,7 @@ void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const 
         }
         MutableDictionary whole(*message);
         whole.remove(key::kContinuation);
+        if (!walk->generation.isNull()) whole.set(key::kGeneration, walk->generation);
         if (walk->sawMatches) {
             if (walk->pages > 1) linkReplacements(walk->forms);
             whole.set(key::kMatches, Value::array(std::move(walk->forms)));
@@ -252,6 +254,12 @@ void BXDaemonClient::releaseHoldReply(const Uuid& hold, ReplyHandler reply) {
 void BXDaemonClient::listHoldsReply(ReplyHandler reply) { sendReply(request(Request::Holds).take(), std::move(reply)); }
 
 void BXDaemonClient::statusReply(ReplyHandler reply) { sendReply(request(Request::Status).take(), std::move(reply)); }
+
+void BXDaemonClient::changesReply(uint64_t generation, ReplyHandler reply) {
+    MutableDictionary message = request(Request::Changes);
+    message.set(key::kGeneration, Value::uint64(generation));
+    sendReply(message.take(), std::move(reply));
+}
 
 void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply) {
     MutableDictionary message = request(Request::Launch);

@@ -69,8 +69,9 @@ class BXDaemonClient {
     // Called on the reply queue after each page of matchAllPagesReply but the last, with the forms received so far.
     using PageProgress = std::function<void(size_t formsSoFar)>;
     // Asks for page after page until the last, then answers `reply` once as an unpaged match would: "matches"
-    // holds the forms of every page in order, with the replacement links written across pages. A page that fails
-    // answers in place of the whole. A daemon that does not page answers everything in its first reply.
+    // holds the forms of every page in order, with the replacement links written across pages, and "generation"
+    // is the first page's (the walk reflects at least every change up to it). A page that fails answers in place of
+    // the whole. A daemon that does not page answers everything in its first reply.
     void matchAllPagesReply(const Value& rules, uint64_t flags, uint64_t pageSize, PageProgress progress,
                             ReplyHandler reply);
     void setPluginAnnotationsAnnotationsReply(const std::vector<Uuid>& uuids, const Value& annotations,
@@ -82,6 +83,8 @@ class BXDaemonClient {
     void listHoldsReply(ReplyHandler reply);
     // What bxd is doing now (any client may ask).
     void statusReply(ReplyHandler reply);
+    // The plug-ins added, removed and changed since `generation` (an extension of ours).
+    void changesReply(uint64_t generation, ReplyHandler reply);
     // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
     void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
     // Standing queries (an extension of the protocol): "watch" answers with the watch's id, its result and its

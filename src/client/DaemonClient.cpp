@@ -106,6 +106,9 @@ void DaemonClient::releaseHold(const Uuid& hold, Callback done) {
 void DaemonClient::holds(Callback done) { impl_->client.listHoldsReply(adapt(std::move(done))); }
 
 void DaemonClient::status(Callback done) { impl_->client.statusReply(adapt(std::move(done))); }
+void DaemonClient::changes(uint64_t generation, Callback done) {
+    impl_->client.changesReply(generation, adapt(std::move(done)));
+}
 void DaemonClient::launch(const Uuid& plugIn, Callback done) {
     impl_->client.launchPlugInReply(plugIn, [done = std::move(done)](const std::variant<ZemMessage, ZemError>& raw) {
         if (!done) return;

@@ -79,8 +79,8 @@ std::unique_ptr<BXDServer> BXDServer::initForServiceDatabase(const char* service
     server->userPrefs_ = std::make_unique<BXDUserPrefs>();
     // What the exclusions are at start is no change; a difference from here on is.
     server->lastExclusions_ = server->userPrefs_->exclusions();
-    server->changeFeed_ = std::make_unique<ChangeFeed>(
-        std::make_unique<GenerationStore>(GenerationStore::defaultPath()), &server->mainQueue_);
+    server->changeFeed_ = std::make_shared<ChangeFeed>(
+        std::make_unique<GenerationStore>(GenerationStore::defaultPath()), server->mainQueue_);
     Result<std::unique_ptr<PreferencesWatch>> watch = PreferencesWatch::start(
         PreferencesStore::shared().directory(), server->mainQueue_, [raw] { raw->currentExclusions(); });
     if (watch)
@@ -146,8 +146,8 @@ void BXDServer::noteChange(Change::Kind kind, std::vector<Uuid> plugIns, std::ve
     // The publication waits for the writer's current block in either case: an automatic election is saved by a
     // block queued before this one, and an uninstall is committed by the rest of the block that announced it.
     auto publishAfterWriter = [this] {
-        if (writer().isCurrent()) noteWriterChanges();
-        mainQueue_.async([this] { changeFeed_->publishPending(); });
+        noteWriterChanges();
+        mainQueue_.async(publishingPending());
     };
     if (writer().isCurrent()) {
         writerChanges_.push_back(Change{0, kind, std::move(plugIns), std::move(identifiers)});
@@ -177,7 +177,13 @@ void BXDServer::publishChange(Change::Kind kind, const std::vector<std::shared_p
         return;
     }
     changeFeed_->note(kind, std::move(uuids), std::move(identifiers));
-    mainQueue_.async([this] { changeFeed_->publishPending(); });
+    mainQueue_.async(publishingPending());
+}
+
+std::function<void()> BXDServer::publishingPending() const {
+    return [feed = std::weak_ptr<ChangeFeed>(changeFeed_)] {
+        if (std::shared_ptr<ChangeFeed> alive = feed.lock()) alive->publishPending();
+    };
 }
 
 Value BXDServer::currentExclusions() {

@@ -132,6 +132,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     void noteChange(Change::Kind kind, std::vector<Uuid> plugIns, std::vector<std::string> identifiers);
     // Hands the changes made by the writer's current block to the feed. REQUIRES: on the writer.
     void noteWriterChanges();
+    // A block for mainQueue that publishes what the feed has noted, unless the server has gone meanwhile.
+    std::function<void()> publishingPending() const;
     // The global exclusions as stored now, as discovery reads them. Reading them also compares them with the last
     // value seen, and a difference is published as one exclusions change first, so nothing a "match" or "changes"
     // sees is missed. REQUIRES: on mainQueue.
@@ -159,7 +161,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     std::array<std::atomic<uint64_t>, protocol::kRequests.size()> served_{};
     const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
     const DiscoveryContinuation continuations_;
-    std::unique_ptr<ChangeFeed> changeFeed_;
+    // Shared so that a publication queued on mainQueue can tell that the server has gone meanwhile.
+    std::shared_ptr<ChangeFeed> changeFeed_;
     // Changes made by the writer's current block (touched on the writer only).
     std::vector<Change> writerChanges_;
     // The exclusions as last seen, to notice a change, and the watch that looks again when the folder changes.

@@ -10,7 +10,6 @@
 #include <unordered_map>
 
 #include "base/QueueAssert.h"
-#include "base/SerialQueue.h"
 #include "daemon/GenerationStore.h"
 #include "platform/log/Log.h"
 
@@ -34,8 +33,8 @@ std::string_view nameOf(Change::Kind kind) {
     return "unknown";
 }
 
-ChangeFeed::ChangeFeed(std::unique_ptr<GenerationStore> store, const SerialQueue* queue, size_t capacity)
-    : store_(std::move(store)), queue_(queue), capacity_(std::max<size_t>(capacity, 1)) {
+ChangeFeed::ChangeFeed(std::unique_ptr<GenerationStore> store, std::optional<SerialQueue> queue, size_t capacity)
+    : store_(std::move(store)), queue_(std::move(queue)), capacity_(std::max<size_t>(capacity, 1)) {
     if (store_) current_ = store_->start();
     windowStart_ = current_;
 }
@@ -43,7 +42,7 @@ ChangeFeed::ChangeFeed(std::unique_ptr<GenerationStore> store, const SerialQueue
 ChangeFeed::~ChangeFeed() = default;
 
 void ChangeFeed::assertOnQueue() const {
-    if (queue_ != nullptr) BX_ASSERT_ON_QUEUE(*queue_);
+    if (queue_) BX_ASSERT_ON_QUEUE(*queue_);
 }
 
 uint64_t ChangeFeed::subscribe(Observer observer) {

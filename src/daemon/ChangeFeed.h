@@ -20,12 +20,12 @@
 #include <string_view>
 #include <vector>
 
+#include "base/SerialQueue.h"
 #include "bexil/Uuid.h"
 
 namespace bexil {
 
 class GenerationStore;
-class SerialQueue;
 
 // One change a client could observe through "match", as bxd applied it (on the request queue).
 struct Change {
@@ -50,7 +50,7 @@ class ChangeFeed {
 
     // Generations from `store` (none: counted in memory from 0, for tests). `queue` (none: unchecked) is the queue
     // every member but note() must be called on. `capacity` bounds the log (tests use small ones).
-    explicit ChangeFeed(std::unique_ptr<GenerationStore> store = nullptr, const SerialQueue* queue = nullptr,
+    explicit ChangeFeed(std::unique_ptr<GenerationStore> store = nullptr, std::optional<SerialQueue> queue = {},
                         size_t capacity = kLogCapacity);
     ~ChangeFeed();
     ChangeFeed(const ChangeFeed&) = delete;
@@ -102,7 +102,7 @@ class ChangeFeed {
     void assertOnQueue() const;
 
     std::unique_ptr<GenerationStore> store_;
-    const SerialQueue* queue_;
+    std::optional<SerialQueue> queue_;
     size_t capacity_;
     uint64_t current_ = 0;
     // The generation before the oldest change in log_ (current_ while nothing was ever dropped in this run).

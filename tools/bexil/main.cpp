@@ -322,7 +322,7 @@ int exclusionsCommand(const Options& options, const std::string& setFile, const 
 struct Arguments {
     std::vector<std::string> paths, uuids, rules, flagNames, addRules;
     std::string file, setFile;
-    uint64_t flags = 0;
+    uint64_t flags = 0, generation = 0;
     int64_t election = -1;
     bool plugInPaths = false, refuseBusy = false, terminate = false, clear = false, wait = false;
     std::vector<std::string> say;
@@ -587,6 +587,38 @@ int holdsCommand(const Options& options, Arguments&) {
     return roundTrip(
         options, "holds", [](BXDaemonClient& c, auto h) { c.listHoldsReply(h); },
         [&](BXDaemonClient& c, const Value& m) { return printHolds(options, c, m); });
+}
+
+// One line per plug-in of a "changes" reply: what happened to it, its UUID, its identifier, the kinds of change (for
+// a changed one) and the generation of its latest change; first the generation to follow on from.
+int printChanges(const Options& options, BXDaemonClient&, const Value& message) {
+    if (options.json) {
+        std::printf("%s\n", toJson(message).c_str());
+        return 0;
+    }
+    std::optional<uint64_t> current = message.get(protocol::key::kGeneration).numberAsUInt64();
+    std::printf("generation %s\n", current ? std::to_string(*current).c_str() : "unknown");
+    if (message.get(protocol::key::kResync).getBool().value_or(false))
+        std::printf("resync: the global exclusions changed; any plug-in may have changed, match again\n");
+    for (const Value& change : message.get(protocol::key::kChanges).items()) {
+        const Uuid* uuid = change.get(protocol::change::kUuid).getUuid();
+        std::string kinds;
+        for (const Value& kind : change.get(protocol::change::kKinds).items())
+            kinds += (kinds.empty() ? "" : ",") + std::string(kind.stringView());
+        const std::string* identifier = change.get(protocol::change::kIdentifier).getString();
+        std::printf(
+            "%-8s %-36s %s%s%s @%llu\n", std::string(change.get(protocol::change::kEffect).stringView()).c_str(),
+            uuid ? uuid->string().c_str() : "-", identifier ? identifier->c_str() : "-", kinds.empty() ? "" : " ",
+            kinds.empty() ? "" : ("(" + kinds + ")").c_str(),
+            static_cast<unsigned long long>(change.get(protocol::change::kGeneration).numberAsUInt64().value_or(0)));
+    }
+    return 0;
+}
+
+int changesCommand(const Options& options, Arguments& arguments) {
+    return roundTrip(
+        options, "changes", [&](BXDaemonClient& c, auto h) { c.changesReply(arguments.generation, h); },
+        [&](BXDaemonClient& c, const Value& m) { return printChanges(options, c, m); });
 }
 
 int statusCommand(const Options& options, Arguments&) {
@@ -900,6 +932,13 @@ const Subcommand kSubcommands[] = {
     {"status",
      "what bxd is doing now: uptime, connections, plug-ins, cache, holds, requests served\n  example: bexil status",
      [](CLI::App&, Arguments&) {}, statusCommand},
+    {"changes",
+     "what changed since a generation (from a match or changes reply): plug-ins added, removed, changed\n  example: "
+     "bexil changes 1764090000000001",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("generation", a.generation, "the generation to answer from")->required();
+     },
+     changesCommand},
     {"doctor",
      "check this installation (daemon, directories, entitlements, bubblewrap, MIME database, journal) and say what to "
      "fix\n  example: bexil doctor",
@@ -925,9 +964,10 @@ int run(int argc, char** argv) {
         "bexil: talk to bxd, the plug-in registry daemon.\n"
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
-        "annotation, 19 paged discovery must start again, 21 too many watches); 64 bad arguments (nothing sent);\n"
-        "65 unusable SDK or Info.vrec; 66 SDK not registered; 69 bxd not running or gone; 70 unreadable reply;\n"
-        "73 preferences not writable; 75 no answer in time; 78 doctor found a problem.",
+        "annotation, 19 paged discovery must start again, 20 generation too old: match again, 21 too many\n"
+        "watches); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
+        "69 bxd not running or gone; 70 unreadable reply; 73 preferences not writable; 75 no answer in time;\n"
+        "78 doctor found a problem.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();

@@ -5,6 +5,7 @@
 
 #include <array>
 #include <asio.hpp>
+#include <atomic>
 #include <cerrno>
 #include <climits>
 #include <cstring>
@@ -21,7 +22,7 @@ struct PreferencesWatch::State {
     asio::posix::stream_descriptor descriptor;
     SerialQueue queue;
     std::function<void()> changed;
-    bool stopped = false;
+    std::atomic<bool> stopped{false};
 };
 
 namespace {
