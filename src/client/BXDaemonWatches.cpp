@@ -7,9 +7,11 @@ namespace bexil {
 namespace key = protocol::key;
 
 BXDaemonWatches::~BXDaemonWatches() {
-    // The handlers point here; the reply queue may still hold a block that would call them.
     client_.setMessageHandler(nullptr);
     client_.setConnectionHandler(nullptr);
+    // Blocks already queued find the object gone; one running now finishes first.
+    std::lock_guard lock(life_->mutex);
+    life_->alive = false;
 }
 
 std::optional<uint64_t> BXDaemonWatches::watch(const Value& rules, uint64_t flags, Callbacks callbacks) {
@@ -24,8 +26,14 @@ std::optional<uint64_t> BXDaemonWatches::watch(const Value& rules, uint64_t flag
         watches_.emplace(watch->handle, watch);
         if (!routing_) {
             routing_ = true;
-            client_.setMessageHandler([this](const Value& body) { message(body); });
-            client_.setConnectionHandler([this](const ZemError& error) { connectionLost(error); });
+            client_.setMessageHandler([this, life = life_](const Value& body) {
+                std::lock_guard alive(life->mutex);
+                if (life->alive) message(body);
+            });
+            client_.setConnectionHandler([this, life = life_](const ZemError& error) {
+                std::lock_guard alive(life->mutex);
+                if (life->alive) connectionLost(error);
+            });
         }
     }
     start(watch);
@@ -33,48 +41,51 @@ std::optional<uint64_t> BXDaemonWatches::watch(const Value& rules, uint64_t flag
 }
 
 void BXDaemonWatches::start(const std::shared_ptr<Watch>& watch) {
-    client_.watchPlugInsFlagsReply(watch->rules, watch->flags, [this, watch](const BXDaemonClient::Reply& raw) {
-        std::optional<Error> error;
-        try {
-            error = BXDaemonClient::errorInReply(raw);
-        } catch (const InternalInconsistency& broken) {
-            error = BXError(ErrorCode::OperationFailed, broken.what());
-        }
-        // A watch that could not reach bxd ends as one whose connection was lost later does.
-        if (const auto* lost = std::get_if<ZemError>(&raw); lost && lost->kind() != ZemError::Kind::MessageInvalid)
-            error = BXError(ErrorCode::OperationFailed, std::string(kConnectionLost) + lost->description());
-        const Value* reply = std::get_if<Value>(&raw);
-        std::optional<uint64_t> id =
-            !error && reply != nullptr ? reply->get(key::kWatch).getUInt64() : std::optional<uint64_t>();
-        bool wanted = false;
-        {
-            std::lock_guard lock(mutex_);
-            wanted = !watch->cancelled;
-            if (wanted && id) {
-                watch->id = id;
-                ids_[*id] = watch;
-            } else if (wanted) {
-                watches_.erase(watch->handle);
+    client_.watchPlugInsFlagsReply(
+        watch->rules, watch->flags, [this, watch, life = life_](const BXDaemonClient::Reply& raw) {
+            std::lock_guard alive(life->mutex);
+            if (!life->alive) return;
+            std::optional<Error> error;
+            try {
+                error = BXDaemonClient::errorInReply(raw);
+            } catch (const InternalInconsistency& broken) {
+                error = BXError(ErrorCode::OperationFailed, broken.what());
             }
-        }
-        if (!wanted) {
-            // Unwatched while bxd was starting it: end it there too.
-            if (id) client_.unwatchReply(*id, nullptr);
-            return;
-        }
-        if (!id) {
-            if (watch->callbacks.ended)
-                watch->callbacks.ended(
-                    error.value_or(BXError(ErrorCode::OperationFailed, "bxd answered a watch without id")));
-            return;
-        }
-        std::vector<Value> forms;
-        if (std::optional<Value> decoded = client_.convertFromZEM(reply->get(key::kMatches));
-            decoded && decoded->isArray())
-            forms.assign(decoded->items().begin(), decoded->items().end());
-        uint64_t generation = reply->get(key::kGeneration).getUInt64().value_or(0);
-        if (watch->callbacks.result) watch->callbacks.result(forms, generation);
-    });
+            // A watch that could not reach bxd ends as one whose connection was lost later does.
+            if (const auto* lost = std::get_if<ZemError>(&raw); lost && lost->kind() != ZemError::Kind::MessageInvalid)
+                error = BXError(ErrorCode::OperationFailed, std::string(kConnectionLost) + lost->description());
+            const Value* reply = std::get_if<Value>(&raw);
+            std::optional<uint64_t> id =
+                !error && reply != nullptr ? reply->get(key::kWatch).getUInt64() : std::optional<uint64_t>();
+            bool wanted = false;
+            {
+                std::lock_guard lock(mutex_);
+                wanted = !watch->cancelled;
+                if (wanted && id) {
+                    watch->id = id;
+                    ids_[*id] = watch;
+                } else if (wanted) {
+                    watches_.erase(watch->handle);
+                }
+            }
+            if (!wanted) {
+                // Unwatched while bxd was starting it: end it there too.
+                if (id) client_.unwatchReply(*id, nullptr);
+                return;
+            }
+            if (!id) {
+                if (watch->callbacks.ended)
+                    watch->callbacks.ended(
+                        error.value_or(BXError(ErrorCode::OperationFailed, "bxd answered a watch without id")));
+                return;
+            }
+            std::vector<Value> forms;
+            if (std::optional<Value> decoded = client_.convertFromZEM(reply->get(key::kMatches));
+                decoded && decoded->isArray())
+                forms.assign(decoded->items().begin(), decoded->items().end());
+            uint64_t generation = reply->get(key::kGeneration).getUInt64().value_or(0);
+            if (watch->callbacks.result) watch->callbacks.result(forms, generation);
+        });
 }
 
 std::shared_ptr<BXDaemonWatches::Watch> BXDaemonWatches::withId(uint64_t id) {

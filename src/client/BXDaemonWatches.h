@@ -51,7 +51,15 @@ class BXDaemonWatches {
     void connectionLost(const ZemError& error);
     std::shared_ptr<Watch> withId(uint64_t id);
 
+    // Whether this object still exists, for the blocks of the reply queue that refer to it: a reply to "watch" or a
+    // message can still be on its way when the owner destroys it. Held while such a block runs here.
+    struct Life {
+        std::recursive_mutex mutex;
+        bool alive = true;
+    };
+
     BXDaemonClient& client_;
+    std::shared_ptr<Life> life_ = std::make_shared<Life>();
     std::mutex mutex_;
     uint64_t lastHandle_ = 0;
     bool routing_ = false;
