@@ -15,7 +15,8 @@
 //
 // Whatever the messages: every dictionary is answered exactly once (the client stays connected throughout), with
 // a dictionary the connection can encode; nothing else is answered; the daemon logs no fault and lets no
-// exception escape; and once the connection has ended, no hold of the client is left.
+// exception escape; the only one-way messages are well-formed ones of its watches; and once the connection has
+// ended, no hold or watch of the client is left.
 
 #include <openssl/crypto.h>
 #include <stdlib.h>
@@ -81,7 +82,15 @@ class FuzzConnection final : public ZemConnection {
     void suspend() override {}
     void cancel() override { fail("the daemon cancelled a client's connection"); }
 
-    void send(const Value&) override { fail("the daemon sent a one-way message to a client"); }
+    // The only one-way messages bxd sends a client are its watches': each names its watch and what it is.
+    void send(const Value& message) override {
+        const std::string* event = message.get(protocol::key::kEvent).getString();
+        if (!message.get(protocol::key::kWatch).getUInt64() || !message.get(protocol::key::kGeneration).getUInt64() ||
+            event == nullptr || (*event != protocol::watch::kUpdate && *event != protocol::watch::kResync))
+            fail("the daemon sent a one-way message that is no watch's: " + message.description());
+        if (Result<size_t> size = ZemCodec::encodedSize(message); !size || *size > ZemFrame::kMaxPayloadBytes)
+            fail("a watch message cannot be sent in a frame");
+    }
     void sendReply(const ZemMessage& request, const Value& reply) override { record(request, reply, 0); }
     void sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
                                   std::vector<UniqueFd> descriptors) override {
@@ -98,6 +107,8 @@ class FuzzConnection final : public ZemConnection {
     uid_t peerUid() const override { return credentials_.uid; }
     gid_t peerGid() const override { return credentials_.gid; }
     bool peerHasHungUp() const override { return false; }
+    // What the daemon sends is recorded at once: nothing ever waits to be written.
+    size_t queuedBytes() const override { return 0; }
     const ZemPeerCredentials& peerCredentials() const override { return credentials_; }
     const std::string& serviceName() const override { return serviceName_; }
     std::string description() const override { return "<fuzz connection>"; }
@@ -372,6 +383,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     size_t holdsLeft = w.server->syncQueue().sync([&] { return w.server->holds().size(); });
     if (holdsLeft != 0) fail("holds outlive the client that placed them");
     if (BXDPlugInHold::openKeepAliveUnits() != 0) fail("keep-alive units outlive their holds");
+    // The client's watches are released on the request queue, after its death was noted.
+    size_t watchesLeft = 0;
+    w.server->mainQueue().sync([&] {
+        if (StandingQueries* queries = w.server->standingQueries()) watchesLeft = queries->count();
+    });
+    if (watchesLeft != 0) fail("watches outlive the client that made them");
 
     if (std::optional<std::string> fault = w.logCheck->takeFault()) fail("the daemon logged a fault: " + *fault);
     return 0;

@@ -103,6 +103,33 @@ class DaemonClient {
     // the socket to the plug-in (Reply::channel). An extension of the protocol (docs/protocol.md).
     void launch(const Uuid& plugIn, Callback done);
 
+    // A standing query (an extension of the protocol, docs/protocol.md): the result of a match() of `rules` and
+    // `flags`, kept up to date by bxd, one change at a time, for as long as the watch lasts. Every callback runs on
+    // the client's queue, in order; any may be empty.
+    struct WatchChange {
+        uint64_t generation = 0;
+        std::vector<Value> added;          // forms that entered the result
+        std::vector<std::string> removed;  // UUID texts of the plug-ins that left it
+        std::vector<Value> changed;        // forms that replace the ones held for the same UUIDs
+    };
+    struct WatchCallbacks {
+        // The whole result: when the watch starts, and again after a resync (it replaces everything held before).
+        std::function<void(const std::vector<Value>& forms, uint64_t generation)> result;
+        // One change of the result.
+        std::function<void(const WatchChange& change)> change;
+        // The watcher fell behind and bxd dropped what it missed; the library asks for the result again, and
+        // `result` follows (or `ended`, when that fails).
+        std::function<void(uint64_t generation)> resync;
+        // The watch is over without unwatch(): it could not start, or the connection to bxd was lost. Nothing
+        // follows.
+        std::function<void(const Error& error)> ended;
+    };
+    // Starts a watch and answers its handle for unwatch(); none, calling nothing, when `rules` is neither null nor
+    // a dictionary. A refusal by bxd (code 21 past the limits of watches, the codes of match()) comes to `ended`.
+    std::optional<uint64_t> watch(const Value& rules, uint64_t flags, WatchCallbacks callbacks);
+    // Ends the watch: no callback of it runs after `done` (which may be empty) has been called.
+    void unwatch(uint64_t handle, Callback done = nullptr);
+
     // Runs `start` with a callback and waits for its reply at most `timeout`:
     //     auto reply = client.wait([&](auto done) { client.bulk(0, done); });
     // When the connection has nothing else in flight, the waiting thread sends the request and reads the reply

@@ -31,10 +31,11 @@ inline constexpr std::string_view kManagerEntitlement = "com.quorvel.private.bex
 inline constexpr std::string_view kUserPrefsDomain = "com.quorvel.bexil.userprefs";
 
 // The requests, in the order the daemon compares their names (byte for byte; the first match wins).
-// "launch", "holds", "status", "changes" and "explain" are extensions of ours: on Linux nobody but bxd starts
-// plug-ins, administrators want to see what holds plug-ins out of use and what the daemon is doing, a client that
-// keeps a copy of a discovery learns what changed since it was made instead of discovering again, and a discovery
-// that returns nothing should be able to say why (docs/protocol.md).
+// "launch", "holds", "status", "changes", "explain", "watch" and "unwatch" are extensions of ours: on Linux nobody
+// but bxd starts plug-ins, administrators want to see what holds plug-ins out of use and what the daemon is doing, a
+// client that keeps a copy of a discovery learns what changed since it was made instead of discovering again, a
+// discovery that returns nothing should be able to say why, and an application that shows plug-ins wants to hear of
+// changes rather than poll (docs/protocol.md).
 enum class Request {
     Add,
     Remove,
@@ -49,7 +50,9 @@ enum class Request {
     Holds,
     Status,
     Changes,
-    Explain
+    Explain,
+    Watch,
+    Unwatch
 };
 
 struct RequestInfo {
@@ -60,7 +63,7 @@ struct RequestInfo {
     std::string_view summary;
 };
 
-inline constexpr std::array<RequestInfo, 14> kRequests{{
+inline constexpr std::array<RequestInfo, 16> kRequests{{
     {Request::Add, "add", "register the plug-in bundles at paths"},
     {Request::Remove, "remove", "unregister the plug-ins at paths (manager only)"},
     {Request::Bulk, "bulk", "bulk registration options (none supported)"},
@@ -75,6 +78,8 @@ inline constexpr std::array<RequestInfo, 14> kRequests{{
     {Request::Status, "status", "what bxd is doing now: uptime, connections, requests served, cache, holds"},
     {Request::Changes, "changes", "the plug-ins added, removed and changed since a generation"},
     {Request::Explain, "explain", "say, step by step, why discovery with rules finds a plug-in or not"},
+    {Request::Watch, "watch", "discover like match, then hear of every change of the result on this connection"},
+    {Request::Unwatch, "unwatch", "cancel a watch of this connection"},
 }};
 
 constexpr std::string_view nameOf(Request request) {
@@ -115,6 +120,7 @@ inline constexpr std::string_view kCachedRecords = "cachedRecords";  // uint64, 
 inline constexpr std::string_view kCacheLimit = "cacheLimit";        // uint64, records past which it is purged
 inline constexpr std::string_view kHoldCount = "holdCount";          // uint64, holds in force
 inline constexpr std::string_view kRegistered = "registered";        // uint64, plug-ins in the registry
+inline constexpr std::string_view kWatchCount = "watchCount";        // uint64, watches in force
 // Paged discovery, an extension of ours: in a "match" request, the most forms a page may carry (uint64, see
 // page::), and the continuation of the previous page (data); in a reply, the continuation of this page (data,
 // absent on the last page).
@@ -132,11 +138,21 @@ inline constexpr std::string_view kResync = "resync";
 inline constexpr std::string_view kPlugIn = "plugin";
 inline constexpr std::string_view kExplanation = "explanation";
 inline constexpr std::string_view kNotFound = "notFound";
+// Standing queries, an extension of ours: the watch's id (uint64) in a "watch" reply, an "unwatch" request and every
+// message of the watch; "generation" (above) the generation a result or a change belongs to; in a watch's messages,
+// what kind of message it is (string, watch::kUpdate or watch::kResync) and the forms added (array of forms), the UUIDs
+// removed (array of UUID texts) and the forms changed (array of forms).
+inline constexpr std::string_view kWatch = "watch";
+inline constexpr std::string_view kEvent = "event";
+inline constexpr std::string_view kAdded = "added";
+inline constexpr std::string_view kRemoved = "removed";
+inline constexpr std::string_view kChanged = "changed";
 inline constexpr std::array kList{kRequest,       kVersion,    kPaths,     kUuids,      kFlags,       kRules,
                                   kAnnotations,   kErrorCode,  kError,     kMatches,    kConflicts,   kExtensions,
                                   kPid,           kBundleInfo, kHolds,     kUptime,     kConnections, kServed,
                                   kCachedRecords, kCacheLimit, kHoldCount, kRegistered, kPageSize,    kContinuation,
-                                  kGeneration,    kChanges,    kResync,    kPlugIn,     kExplanation, kNotFound};
+                                  kGeneration,    kChanges,    kResync,    kPlugIn,     kExplanation, kNotFound,
+                                  kWatch,         kEvent,      kAdded,     kRemoved,    kChanged,     kWatchCount};
 }  // namespace key
 
 // Entries of one element of a "changes" reply's key::kChanges (an extension of ours).
@@ -241,14 +257,17 @@ enum class ErrorCode : int {
     // A "changes" request for a generation older than the changes bxd keeps, or from before it started: discover
     // again with "match" (an extension of ours).
     GenerationTooOld = 20,
+    // A "watch" refused because the connection, or bxd as a whole, keeps as many watches as it may (watch::; an
+    // extension of ours).
+    WatchLimit = 21,
 };
 
 // Every code once (OperationFailed shares InvalidRequest's).
-inline constexpr std::array<ErrorCode, 11> kErrorCodes{
-    ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest,  ErrorCode::BadInterfaceSpec,
-    ErrorCode::VersionMismatch,      ErrorCode::BadPath,         ErrorCode::NotAllowed,
-    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,     ErrorCode::BadBulkAnnotation,
-    ErrorCode::BadContinuation,      ErrorCode::GenerationTooOld};
+inline constexpr std::array<ErrorCode, 12> kErrorCodes{
+    ErrorCode::RegistryRefused,      ErrorCode::InvalidRequest,   ErrorCode::BadInterfaceSpec,
+    ErrorCode::VersionMismatch,      ErrorCode::BadPath,          ErrorCode::NotAllowed,
+    ErrorCode::InvalidConfiguration, ErrorCode::PlugInsBusy,      ErrorCode::BadBulkAnnotation,
+    ErrorCode::BadContinuation,      ErrorCode::GenerationTooOld, ErrorCode::WatchLimit};
 
 constexpr int codeOf(ErrorCode code) { return static_cast<int>(code); }
 
@@ -356,6 +375,19 @@ inline constexpr std::array kList{kOutcome,
                                   kTieBreak,
                                   kReplacedBy};
 }  // namespace explain
+// Standing queries ("watch", "unwatch"): the values of key::kEvent in a watch's messages, and the limits.
+namespace watch {
+// A change of the result: key::kAdded, key::kRemoved, key::kChanged, at key::kGeneration.
+inline constexpr std::string_view kUpdate = "update";
+// The watcher fell behind: the messages it missed are not sent, the watch has ended, and its result must be
+// fetched afresh (the client library does that on its own).
+inline constexpr std::string_view kResync = "resync";
+// The most watches one connection may keep, and all connections together.
+inline constexpr uint64_t kMaxPerClient = 64;
+inline constexpr uint64_t kMaxTotal = 4096;
+// The bytes that may wait unwritten towards a watcher: a watch message that finds more ends the watch with a resync.
+inline constexpr uint64_t kMaxQueuedBytes = 1u << 20;
+}  // namespace watch
 
 // Flag bits of "lock" (key::kFlags).
 namespace hold {

@@ -49,14 +49,35 @@ BXDaemonClient::BXDaemonClient(const char* serviceName, EventLoop& loop)
       replyQueue_(kReplyQueueLabel, loop),
       bxd_(ZemConnection::createClient(serviceName_, replyQueue_)),
       protocolVersion_(0) {
-    // Connection events carry no work for a client: replies come through their own handlers, and a failed
-    // connection answers every outstanding request with the error. The event is only worth a log line.
-    bxd_->setEventHandler([](const ZemConnection::Event& event) {
+    // Replies come through their own handlers, and a failed connection answers every outstanding request with the
+    // error. What remains are the messages of watches and the end of the connection, for whoever set a handler.
+    // Replies are queued to the reply queue as their frames are read, while events are delivered at once: both
+    // go through the queue here, so a watch's messages never overtake the reply that started the watch.
+    bxd_->setEventHandler([handlers = handlers_, queue = replyQueue_](const ZemConnection::Event& event) {
         if (const auto* error = std::get_if<ZemError>(&event)) {
             log::ops().error("Communications error: %{public}@", *error);
-        } else {
-            log::ops().error("Communications error: %{public}@", std::get<ZemMessage>(event));
+            queue.async([handlers, error = *error] {
+                ConnectionHandler handler;
+                {
+                    std::lock_guard lock(handlers->mutex);
+                    handler = handlers->connection;
+                }
+                if (handler) handler(error);
+            });
+            return;
         }
+        const ZemMessage& message = std::get<ZemMessage>(event);
+        queue.async([handlers, body = message.body()] {
+            MessageHandler handler;
+            {
+                std::lock_guard lock(handlers->mutex);
+                handler = handlers->message;
+            }
+            if (handler)
+                handler(body);
+            else
+                log::ops().error("Communications error: %{public}@", body);
+        });
     });
     protocolVersion_.store(kProtocolVersion, std::memory_order_relaxed);
     bxd_->resume();
@@ -321,6 +342,29 @@ void BXDaemonClient::launchPlugInReply(const Uuid& plugIn, MessageReplyHandler r
     Value request = message.take();
     log::traffic().debug("request: %@", request);
     bxd_->sendWithMessageReply(request, replyQueue_, std::move(reply));
+}
+
+void BXDaemonClient::watchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply) {
+    MutableDictionary message = request(Request::Watch);
+    if (!rules.isNull()) message.set(key::kRules, rules);
+    message.set(key::kFlags, Value::uint64(flags));
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::unwatchReply(uint64_t watch, ReplyHandler reply) {
+    MutableDictionary message = request(Request::Unwatch);
+    message.set(key::kWatch, Value::uint64(watch));
+    sendReply(message.take(), std::move(reply));
+}
+
+void BXDaemonClient::setMessageHandler(MessageHandler handler) {
+    std::lock_guard lock(handlers_->mutex);
+    handlers_->message = std::move(handler);
+}
+
+void BXDaemonClient::setConnectionHandler(ConnectionHandler handler) {
+    std::lock_guard lock(handlers_->mutex);
+    handlers_->connection = std::move(handler);
 }
 
 std::optional<Error> BXDaemonClient::errorInReply(const Reply& reply) {

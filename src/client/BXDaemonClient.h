@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <variant>
@@ -105,6 +106,18 @@ class BXDaemonClient {
     void explainPlugInRulesFlagsReply(const Value& plugIn, const Value& rules, uint64_t flags, ReplyHandler reply);
     // Starts a plug-in made ready for this process; the reply passes the socket to it as descriptor 0.
     void launchPlugInReply(const Uuid& plugIn, MessageReplyHandler reply);
+    // Standing queries (an extension of the protocol): "watch" answers with the watch's id, its result and its
+    // generation; the watch's messages then come to the message handler. "unwatch" ends one.
+    void watchPlugInsFlagsReply(const Value& rules, uint64_t flags, ReplyHandler reply);
+    void unwatchReply(uint64_t watch, ReplyHandler reply);
+
+    // What bxd sends on its own (the messages of watches), and the end of the connection. Both run on the reply
+    // queue, in the order of the frames they come from relative to replies: a watch's messages never overtake the
+    // reply that started it. Either may be set at any time, from any thread.
+    using MessageHandler = std::function<void(const Value& message)>;
+    using ConnectionHandler = std::function<void(const ZemError& error)>;
+    void setMessageHandler(MessageHandler handler);
+    void setConnectionHandler(ConnectionHandler handler);
 
     // Building blocks of the request methods.
     MutableDictionary request(protocol::Request name) const;
@@ -134,8 +147,16 @@ class BXDaemonClient {
                                  std::chrono::steady_clock::time_point deadline);
     void continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation);
 
+    struct Handlers {
+        std::mutex mutex;
+        MessageHandler message;
+        ConnectionHandler connection;
+    };
+
     std::string serviceName_;
     SerialQueue replyQueue_;
+    // Shared with the connection's event handler, which may outlive this object by a queued block.
+    std::shared_ptr<Handlers> handlers_ = std::make_shared<Handlers>();
     std::shared_ptr<ZemConnection> bxd_;
     std::atomic<int64_t> protocolVersion_;
 };

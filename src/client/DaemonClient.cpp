@@ -13,6 +13,7 @@
 
 #include "bexil/bexil.h"
 #include "client/BXDaemonClient.h"
+#include "client/BXDaemonWatches.h"
 #include "platform/log/Log.h"
 #include "platform/notify/SystemNotifications.h"
 
@@ -24,6 +25,7 @@ struct DaemonClient::Impl {
     explicit Impl(const std::string& serviceName) : client(serviceName.empty() ? nullptr : serviceName.c_str()) {}
 
     BXDaemonClient client;
+    BXDaemonWatches watches{client};
     std::unique_ptr<SystemNotifications> notifications;
     std::mutex notificationsMutex;
 };
@@ -143,6 +145,12 @@ int DaemonClient::Reply::takeChannel() {
     if (!channel_) return -1;
     return std::exchange(*channel_, -1);
 }
+
+std::optional<uint64_t> DaemonClient::watch(const Value& rules, uint64_t flags, WatchCallbacks callbacks) {
+    return impl_->watches.watch(rules, flags, std::move(callbacks));
+}
+
+void DaemonClient::unwatch(uint64_t handle, Callback done) { impl_->watches.unwatch(handle, adapt(std::move(done))); }
 
 DaemonClient::Reply DaemonClient::wait(const std::function<void(Callback)>& start, std::chrono::milliseconds timeout) {
     // Shared with the callback: a reply that arrives after the wait gave up must still find its promise.

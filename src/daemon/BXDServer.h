@@ -19,6 +19,7 @@
 #include "bexil/Protocol.h"
 #include "daemon/ChangeFeed.h"
 #include "daemon/DiscoveryContinuation.h"
+#include "daemon/StandingQueries.h"
 #include "database/BXDUserPrefs.h"
 #include "database/BXDatabase.h"
 #include "platform/jobard/ServiceManager.h"
@@ -140,6 +141,10 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // sees is missed. REQUIRES: on mainQueue.
     Value currentExclusions();
 
+    // The standing queries, made by the first "watch" (null before). REQUIRES: on the request queue.
+    StandingQueries* standingQueries() const { return standingQueries_.get(); }
+    void setStandingQueries(std::unique_ptr<StandingQueries> queries) { standingQueries_ = std::move(queries); }
+
   private:
     BXDServer(const char* databasePath, EventLoop& loop);
 
@@ -165,6 +170,8 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // The exclusions as last seen, to notice a change, and the watch that looks again when the folder changes.
     Value lastExclusions_;
     std::unique_ptr<PreferencesWatch> preferencesWatch_;
+    // Last, so that the watches (which observe the server's changes) go first.
+    std::unique_ptr<StandingQueries> standingQueries_;
 };
 
 }  // namespace bexil

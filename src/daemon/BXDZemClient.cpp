@@ -113,6 +113,11 @@ void BXDZemClient::dying() { log::ops().debug("client %d termination imminent", 
 void BXDZemClient::dead() {
     if (deathNoted_.exchange(true)) return;
     server_->unholdClient(this);
+    // Watches live on the request queue. A "watch" of this client that runs after this point sees the death and
+    // starts nothing; one that ran before is released here.
+    server_->submitWork([server = server_, self = shared_from_this()] {
+        if (StandingQueries* queries = server->standingQueries()) queries->releaseClient(*self);
+    });
     log::ops().debug("client %d is dead", static_cast<int>(pid()));
     acceptWork_.store(false, std::memory_order_release);
     trace::clientDone(static_cast<int>(pid()));

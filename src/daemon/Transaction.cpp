@@ -54,6 +54,8 @@ constexpr std::array<HandlerEntry, protocol::kRequests.size()> kHandlers{{
     {Request::Status, &Transaction::reportStatus},
     {Request::Changes, &Transaction::changesSince},
     {Request::Explain, &Transaction::explainPlugIn},
+    {Request::Watch, &Transaction::watchPlugIns},
+    {Request::Unwatch, &Transaction::unwatchPlugIns},
 }};
 
 constexpr bool handlersFollowTheProtocol() {

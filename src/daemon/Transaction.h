@@ -107,6 +107,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void reportStatus();
     void changesSince();
     void explainPlugIn();
+    void watchPlugIns();
+    void unwatchPlugIns();
     // The parts of "add" and "remove" that run on the writer queue.
     void registerPaths(std::optional<UserIdentity> caller);
     void unregisterPaths(bool entitled);

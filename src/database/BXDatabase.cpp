@@ -292,6 +292,22 @@ std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query)
     return result;
 }
 
+std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugInsWithIdentifier(const Value& query,
+                                                                           const std::string& identifier) {
+    BX_ASSERT_NOT_ON_QUEUE(_sync);
+    // Pre-selected by the identifier alone: it names a handful of rows, where the query's extension point may name
+    // thousands, each of which would be read only to be dropped. The caller checks every rule anyway.
+    LXPreselection preselection{.extensionPoints = std::nullopt, .identifiers = std::vector<std::string>{identifier}};
+    std::optional<LXProxyList> proxies =
+        workspace_->pluginsMatchingQueryApplyFilter(query, filterFor(query), preselection);
+    if (!proxies) return std::nullopt;
+    // The pre-selection keeps plug-ins without an identifier key as candidates, and compares keys, not identifiers.
+    std::erase_if(*proxies, [&](const std::shared_ptr<const LXBexilProxy>& proxy) {
+        return proxy->pluginIdentifier().value_or("") != identifier;
+    });
+    return recordsForProxies(*proxies);
+}
+
 std::optional<BXDatabase::PlugInSlice> BXDatabase::findPlugInsAfterIdentifier(const Value& query,
                                                                               const std::optional<std::string>& after,
                                                                               size_t rows) {

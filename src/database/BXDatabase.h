@@ -128,6 +128,11 @@ class BXDatabase {
     std::optional<PlugInSlice> findPlugInsAfterIdentifier(const Value& query, const std::optional<std::string>& after,
                                                           size_t rows);
 
+    // findPlugIns narrowed to the candidates whose identifier is `identifier`, in the registry's order (a standing
+    // query recomputes one identifier at a time). None when the registry gave nothing.
+    // REQUIRES: not inside `_sync`.
+    std::optional<PlugInSet> findPlugInsWithIdentifier(const Value& query, const std::string& identifier);
+
     // One wanted election value of a query: "=x" is "x" (possibly empty), an alphanumeric start is the whole
     // string; none for anything else (not a string, empty, another first character).
     static std::optional<std::string> normalizeElection(const Value& value);

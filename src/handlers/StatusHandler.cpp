@@ -24,6 +24,8 @@ void Transaction::reportStatus() {
     reply().set(protocol::key::kCachedRecords, Value::uint64(daemon.cachedCount()));
     reply().set(protocol::key::kCacheLimit, Value::uint64(daemon.cacheLimit()));
     reply().set(protocol::key::kHoldCount, Value::uint64(holds));
+    StandingQueries* watches = daemon.standingQueries();
+    reply().set(protocol::key::kWatchCount, Value::uint64(watches != nullptr ? watches->count() : 0));
     // Left out when the registry cannot be read: a status must answer even then.
     if (std::optional<size_t> registered = daemon.workspace()->plugInCount())
         reply().set(protocol::key::kRegistered, Value::uint64(*registered));

@@ -105,5 +105,17 @@ TEST_F(ProtocolDocument, DescribesEveryKeyFlagAndName) {
               std::string::npos);
 }
 
+// Guards the limits of standing queries: each is named with its value in the document's table, so that a change of
+// the constant cannot leave the document behind.
+TEST_F(ProtocolDocument, StatesTheLimitsOfWatches) {
+    for (auto [name, value] :
+         {std::pair{"watch::kMaxPerClient", std::to_string(watch::kMaxPerClient)},
+          std::pair{"watch::kMaxTotal", std::to_string(watch::kMaxTotal)},
+          std::pair{"watch::kMaxQueuedBytes", std::to_string(watch::kMaxQueuedBytes >> 20) + " MiB"}})
+        EXPECT_NE(document_.find("| `" + std::string(name) + "` | " + value + " |"), std::string::npos) << name;
+    for (std::string_view event : {watch::kUpdate, watch::kResync})
+        EXPECT_NE(document_.find(quoted(event)), std::string::npos) << event;
+}
+
 }  // namespace
 }  // namespace bexil

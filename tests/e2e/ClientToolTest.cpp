@@ -70,7 +70,7 @@ TEST_F(ClientToolTest, ExitStatusesAndOneLineErrors) {
 TEST_F(ClientToolTest, EverySubcommandHasHelpWithAnExample) {
     for (const char* sub :
          {"add", "remove", "bulk", "match", "ready", "access", "annotate", "elect", "unelect", "bulk-annotate", "hold",
-          "holds", "release", "launch", "exclusions", "changes", "doctor", "completions"}) {
+          "holds", "release", "launch", "exclusions", "changes", "watch", "doctor", "completions"}) {
         Outcome run = bexil(std::string(sub) + " --help");
         EXPECT_EQ(run.status, 0) << sub;
         EXPECT_NE(run.out.find("example: bexil"), std::string::npos) << sub << ": " << run.out;

@@ -18,6 +18,7 @@
 #include <filesystem>
 #include <future>
 #include <iostream>
+#include <mutex>
 #include <span>
 #include <string>
 #include <variant>
@@ -28,9 +29,11 @@
 #include "PlugInInfo.h"
 #include "Progress.h"
 #include "ToolArguments.h"
+#include "WatchView.h"
 #include "base/Document.h"
 #include "client/BXDaemonClient.h"
 #include "client/BXDaemonClientSync.h"
+#include "client/BXDaemonWatches.h"
 #include "client/BXPlugInMatches.h"
 #include "client/JsonText.h"
 #include "model/BXBundle.h"
@@ -407,7 +410,7 @@ int bulkCommand(const Options& options, Arguments& arguments) {
     return roundTrip(options, "bulk", [&](BXDaemonClient& c, auto h) { c.bulkPluginsReply(arguments.flags, h); }, {});
 }
 
-// The rules of a discovery: the KEY=PATTERN arguments over those of --rules-file.
+// The rules of a discovery (match, explain, watch): the KEY=PATTERN arguments over those of --rules-file.
 Result<Value> discoveryRules(const Arguments& arguments) {
     auto ruleSet = rulesFromArguments(arguments.rules);
     if (!ruleSet || arguments.file.empty()) return ruleSet;
@@ -546,6 +549,66 @@ int explainCommand(const Options& options, Arguments& arguments) {
         options, "explain",
         [&](BXDaemonClient& c, auto h) { c.explainPlugInRulesFlagsReply(*plugIn, *rules, *flags, std::move(h)); },
         [&](BXDaemonClient&, const Value& m) { return printExplanation(options, *plugIn, m); });
+}
+
+// Shows the result of a watch until interrupted (status 0) or until bxd goes away (69) or refuses (its code).
+int watchCommand(const Options& options, Arguments& arguments) {
+    auto rules = discoveryRules(arguments);
+    if (!rules) return usageFailure(rules.error());
+    auto watchFlags = discoveryFlags(arguments.flagNames);
+    if (!watchFlags) return usageFailure(watchFlags.error());
+    // Blocked before any thread starts, so that every thread inherits the mask and only sigtimedwait below takes
+    // them: an interrupt ends the command cleanly.
+    sigset_t stops;
+    sigemptyset(&stops);
+    for (int stop : {SIGINT, SIGTERM, SIGHUP}) sigaddset(&stops, stop);
+    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+
+    WatchView::Style style = options.json                   ? WatchView::Style::Json
+                             : ::isatty(STDOUT_FILENO) == 1 ? WatchView::Style::Table
+                                                            : WatchView::Style::Lines;
+    WatchView view(style, stdout);
+    struct Outcome {
+        std::mutex mutex;
+        std::optional<int> status;
+        bool started = false;
+    };
+    auto outcome = std::make_shared<Outcome>();
+    BXDaemonClient client(options.service.c_str());
+    BXDaemonWatches watches(client);
+    DaemonClient::WatchCallbacks callbacks;
+    callbacks.result = [&view, outcome](const std::vector<Value>& forms, uint64_t generation) {
+        {
+            std::lock_guard lock(outcome->mutex);
+            outcome->started = true;
+        }
+        view.result(forms, generation);
+    };
+    callbacks.change = [&view](const DaemonClient::WatchChange& change) { view.change(change); };
+    callbacks.resync = [&view](uint64_t generation) { view.resync(generation); };
+    callbacks.ended = [outcome](const Error& error) {
+        std::lock_guard lock(outcome->mutex);
+        if (outcome->status) return;
+        std::string message = error.localizedDescription().value_or(error.description());
+        std::fprintf(stderr, "bexil: watch: %s\n", message.c_str());
+        outcome->status =
+            message.starts_with(BXDaemonWatches::kConnectionLost) ? kExitUnavailable : exitStatusForCode(error.code());
+    };
+    watches.watch(*rules, *watchFlags, std::move(callbacks));
+
+    const auto startDeadline = std::chrono::steady_clock::now() +
+                               std::chrono::milliseconds(static_cast<int64_t>(options.timeoutSeconds * 1000));
+    for (;;) {
+        timespec tick{0, 100 * 1000 * 1000};
+        int received = sigtimedwait(&stops, nullptr, &tick);
+        if (received > 0) return 0;
+        std::lock_guard lock(outcome->mutex);
+        if (outcome->status) return *outcome->status;
+        if (!outcome->started && std::chrono::steady_clock::now() > startDeadline) {
+            std::fprintf(stderr, "bexil: bxd did not answer watch within %g seconds\n", options.timeoutSeconds);
+            return kExitTimeout;
+        }
+    }
 }
 
 int readyCommand(const Options& options, Arguments& arguments) {
@@ -919,6 +982,15 @@ const Subcommand kSubcommands[] = {
          c.add_option("--plugin", a.plugIn, "the plug-in: its identifier, UUID or bundle path")->required();
      },
      explainCommand},
+    {"watch",
+     "show the plug-ins that match rules and every change of them until interrupted (a table on a terminal, one "
+     "line per change otherwise)\n  example: bexil watch RZExtensionPointIdentifier=com.example.greeting",
+     [](CLI::App& c, Arguments& a) {
+         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
+         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
+         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+     },
+     watchCommand},
     {"ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...", uuidsArgument, readyCommand},
     {"launch",
      "make a plug-in ready for this command and start it in its sandbox, then talk to it\n  example: bexil launch "
@@ -1005,9 +1077,10 @@ int run(int argc, char** argv) {
         "bexil: talk to bxd, the plug-in registry daemon.\n"
         "Exit status: 0 on success; the daemon's error code when a request fails (2 unknown plug-in, 4 malformed\n"
         "request, 7 version mismatch, 9 bad path, 11 not allowed, 12 invalid plug-in, 14 busy, 18 bad bulk\n"
-        "annotation, 19 paged discovery must start again, 20 generation too old: match again); 64 bad arguments\n"
-        "(nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered; 69 bxd not running; 70 unreadable\n"
-        "reply; 73 preferences not writable; 75 no answer in time; 78 doctor found a problem.",
+        "annotation, 19 paged discovery must start again, 20 generation too old: match again, 21 too many\n"
+        "watches); 64 bad arguments (nothing sent); 65 unusable SDK or Info.vrec; 66 SDK not registered;\n"
+        "69 bxd not running or gone; 70 unreadable reply; 73 preferences not writable; 75 no answer in time;\n"
+        "78 doctor found a problem.",
         "bexil"};
     app.require_subcommand(1);
     app.add_option("--service", options.service, "Zem service name of bxd")->capture_default_str();

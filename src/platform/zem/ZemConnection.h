@@ -91,6 +91,9 @@ class ZemConnection {
     // True once the peer has closed its end or the connection is closed, even while frames it sent before that are
     // still waiting to be handled: the daemon runs no request of a peer that is gone. Safe from any thread.
     virtual bool peerHasHungUp() const = 0;
+    // Bytes of frames this side has been handed to send (replies and messages) that the socket has not taken yet,
+    // messages still on their way to the connection's queue included. Safe from any thread; a snapshot.
+    virtual size_t queuedBytes() const = 0;
     // What the kernel said about the peer at accept (peer connections only; empty with a failure on client ones).
     virtual const ZemPeerCredentials& peerCredentials() const = 0;
 

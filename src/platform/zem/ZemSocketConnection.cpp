@@ -159,8 +159,14 @@ void ZemSocketConnection::deliverTerminationImminent() {
 
 void ZemSocketConnection::send(const Value& message) {
     if (side_ == Side::Client) posted_.fetch_add(1, std::memory_order_acq_rel);
-    queue_.async([self = shared_from_this(), message] {
+    // Counted from here, so that a sender that hands over many messages in one turn sees them in queuedBytes before
+    // this queue has encoded any.
+    Result<size_t> size = ZemCodec::encodedSize(message);
+    const size_t bytes = (size ? *size : 0) + ZemFrame::kHeaderBytes;
+    postedBytes_.fetch_add(bytes);
+    queue_.async([self = shared_from_this(), message, bytes] {
         self->enqueueFrame(ZemFrameKind::Message, 0, message, std::nullopt);
+        self->postedBytes_.fetch_sub(bytes);
         if (self->side_ == Side::Client) self->posted_.fetch_sub(1, std::memory_order_acq_rel);
     });
 }
@@ -676,6 +682,11 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
 }
 
 void ZemSocketConnection::writeMore() {
+    writeMoreNow();
+    buffered_.store(outgoing_.size() + writing_.size());
+}
+
+void ZemSocketConnection::writeMoreNow() {
     if (writeInFlight_ || outgoing_.empty() || state_ != State::Open) return;
     if (!attachments_.empty()) return writeWithAttachments();
     // The socket buffer almost always has room: try a non-blocking send first, so that a reply costs one system
@@ -768,6 +779,7 @@ void ZemSocketConnection::dropSent(size_t bytes) {
 void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
     writeInFlight_ = false;
     writing_.clear();
+    buffered_.store(outgoing_.size());
     if (state_ != State::Open) return;
     if (error) {
         close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
@@ -825,6 +837,7 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     stallTimer_.cancel();
     reader_ = ZemFrameReader();
     outgoing_.clear();
+    buffered_.store(writing_.size());
     attachments_.clear();
     receivedFds_.clear();
     heldFrames_.clear();

@@ -77,6 +77,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     gid_t peerGid() const override { return gid_.load(); }
     bool peerHasHungUp() const override;
     const ZemPeerCredentials& peerCredentials() const override { return peer_; }
+    size_t queuedBytes() const override { return buffered_.load() + postedBytes_.load(); }
     const std::string& serviceName() const override { return serviceName_; }
     std::string description() const override;
 
@@ -146,7 +147,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // enqueueFrame once the queue owns the socket.
     void enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
                            std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors);
+    // Writes what the socket takes now and notes what remains for queuedBytes.
     void writeMore();
+    void writeMoreNow();
     // writeMore's path while descriptors wait in outgoing_: every piece is sent with the descriptors of the frame
     // it starts, and never runs into the next frame that carries some.
     void writeWithAttachments();
@@ -186,6 +189,10 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
     std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
+    // outgoing_ and writing_ together, for queuedBytes on other threads; and the encoded size of the messages
+    // handed to send() whose frames are not in outgoing_ yet.
+    std::atomic<size_t> buffered_{0};
+    std::atomic<size_t> postedBytes_{0};
     asio::steady_timer stallTimer_;
     bool stallArmed_ = false;
     bool framed_ = false;      // a complete frame has arrived
