@@ -942,6 +942,13 @@ int doctorCommand(const Options& options, Arguments&) {
 void pathsArgument(CLI::App& command, Arguments& arguments) {
     command.add_option("paths", arguments.paths, "absolute paths of plug-in bundles")->required();
 }
+// The rules and flags of a discovery, shared by match, explain and watch (see discoveryRules).
+void discoveryArguments(CLI::App& c, Arguments& a) {
+    c.add_option("rules", a.rules, "rules as KEY=PATTERN");
+    c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
+    c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+}
+
 void uuidsArgument(CLI::App& command, Arguments& arguments) {
     command.add_option("uuids", arguments.uuids, "plug-in UUIDs")->required();
 }
@@ -966,31 +973,19 @@ const Subcommand kSubcommands[] = {
      [](CLI::App& c, Arguments& a) { c.add_option("--flags", a.flags, "option bits"); }, bulkCommand},
     {"match",
      "discover plug-ins\n  example: bexil match RZExtensionPointIdentifier=com.example.greeting --flag all-versions",
-     [](CLI::App& c, Arguments& a) {
-         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
-         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
-         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
-     },
-     matchCommand},
+     discoveryArguments, matchCommand},
     {"explain",
      "say step by step why match with these rules finds a plug-in or not\n  example: bexil explain "
      "RZExtensionPointIdentifier=com.example.greeting --plugin com.example.greeter.hello",
      [](CLI::App& c, Arguments& a) {
-         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
-         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
-         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
+         discoveryArguments(c, a);
          c.add_option("--plugin", a.plugIn, "the plug-in: its identifier, UUID or bundle path")->required();
      },
      explainCommand},
     {"watch",
      "show the plug-ins that match rules and every change of them until interrupted (a table on a terminal, one "
      "line per change otherwise)\n  example: bexil watch RZExtensionPointIdentifier=com.example.greeting",
-     [](CLI::App& c, Arguments& a) {
-         c.add_option("rules", a.rules, "rules as KEY=PATTERN");
-         c.add_option("--rules-file", a.file, "rule dictionary from a .vrec or JSON file");
-         c.add_option("--flag", a.flagNames, "all-versions, all-instances, system-only or all (repeatable)");
-     },
-     watchCommand},
+     discoveryArguments, watchCommand},
     {"ready", "make plug-ins ready for this host\n  example: bexil ready 2F1C...-...", uuidsArgument, readyCommand},
     {"launch",
      "make a plug-in ready for this command and start it in its sandbox, then talk to it\n  example: bexil launch "
