@@ -144,7 +144,7 @@ void Transaction::releaseReply() {
     if (heldReply_) {
         HeldReply held = std::move(*heldReply_);
         heldReply_.reset();
-        send(std::move(held.reply), std::move(held.descriptors));
+        send(std::move(held));
     }
     client_->endWrite();
 }
@@ -187,31 +187,69 @@ void Transaction::doneWithDescriptors(std::vector<UniqueFd> descriptors) {
     Value reply = reply_.take();
     // A reply larger than a frame can carry would be dropped by the connection and leave the client waiting for
     // ever; it is answered as an internal failure instead. Measuring walks the reply once without allocating.
-    if (Result<size_t> size = ZemCodec::encodedSize(reply); size && *size > ZemFrame::kMaxPayloadBytes) {
-        log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", *size,
-                         client_->pid(), ZemFrame::kMaxPayloadBytes);
-        reply = Value::dictionary(
-            {{std::string(protocol::key::kErrorCode), wireErrorCode(protocol::codeOf(ErrorCode::OperationFailed))},
-             {std::string(protocol::key::kError),
-              Value::string(fmt::format("reply of {} bytes exceeds the frame limit of {} "
-                                        "bytes",
-                                        *size, ZemFrame::kMaxPayloadBytes))}});
-    }
-    if (holding_) {
-        heldReply_ = HeldReply{std::move(reply), std::move(descriptors)};
-        return;
-    }
-    send(std::move(reply), std::move(descriptors));
+    if (Result<size_t> size = ZemCodec::encodedSize(reply); size && *size > ZemFrame::kMaxPayloadBytes)
+        reply = tooLargeReply(*size);
+    answer(HeldReply{std::move(reply), std::move(descriptors), {}});
 }
 
-void Transaction::send(Value reply, std::vector<UniqueFd> descriptors) {
-    if (trace::requestOutputEnabled()) trace::requestOutput(client_->pid(), reply.description().c_str());
+void Transaction::doneWithEncodedEntries(const ZemCodec::Entries& entries) {
+    if (answered_.exchange(true)) {
+        log::ops().fault("transaction answered twice for client %d", client_->pid());
+        return;
+    }
+    std::vector<uint8_t> encoded;
+    if (std::optional<Error> error = ZemCodec::encodeMerged(entries, reply_.take(), encoded)) {
+        log::ops().error("cannot encode the reply to client %d: %@", client_->pid(), *error);
+        answer(HeldReply{
+            Value::dictionary(
+                {{std::string(protocol::key::kErrorCode), wireErrorCode(protocol::codeOf(ErrorCode::OperationFailed))},
+                 {std::string(protocol::key::kError), Value::string("cannot encode the reply")}}),
+            {},
+            {}});
+        return;
+    }
+    if (encoded.size() > ZemFrame::kMaxPayloadBytes) {
+        answer(HeldReply{tooLargeReply(encoded.size()), {}, {}});
+        return;
+    }
+    answer(HeldReply{Value(), {}, std::move(encoded)});
+}
+
+Value Transaction::tooLargeReply(size_t size) const {
+    log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", size,
+                     client_->pid(), ZemFrame::kMaxPayloadBytes);
+    return Value::dictionary(
+        {{std::string(protocol::key::kErrorCode), wireErrorCode(protocol::codeOf(ErrorCode::OperationFailed))},
+         {std::string(protocol::key::kError),
+          Value::string(fmt::format("reply of {} bytes exceeds the frame limit of {} bytes", size,
+                                    ZemFrame::kMaxPayloadBytes))}});
+}
+
+void Transaction::answer(HeldReply reply) {
+    if (holding_) {
+        heldReply_ = std::move(reply);
+        return;
+    }
+    send(std::move(reply));
+}
+
+void Transaction::send(HeldReply reply) {
+    if (trace::requestOutputEnabled()) {
+        Value shown = reply.reply;
+        if (!reply.encoded.empty()) {
+            Result<Value> decoded = ZemCodec::decode(reply.encoded);
+            shown = decoded ? *decoded : Value();
+        }
+        trace::requestOutput(client_->pid(), shown.description().c_str());
+    }
     std::shared_ptr<ZemConnection> connection = client_->connection();
     if (!connection) return;  // the peer is gone: there is nobody to answer
-    if (descriptors.empty())
-        connection->sendReply(request_, reply);
+    if (!reply.encoded.empty())
+        connection->sendEncodedReply(request_, std::move(reply.encoded));
+    else if (reply.descriptors.empty())
+        connection->sendReply(request_, reply.reply);
     else
-        connection->sendReplyWithDescriptors(request_, reply, std::move(descriptors));
+        connection->sendReplyWithDescriptors(request_, reply.reply, std::move(reply.descriptors));
 }
 
 void Transaction::denyAccess(const BXDPlugIn& plugIn, std::string_view reason) {

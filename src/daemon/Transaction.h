@@ -19,6 +19,7 @@
 #include "base/UniqueFd.h"
 #include "bexil/Protocol.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemMessage.h"
 
 namespace bexil {
@@ -44,6 +45,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void done();
     // The same, passing `descriptors` with the reply (closed here once sent, or if the client is gone).
     void doneWithDescriptors(std::vector<UniqueFd> descriptors);
+    // The same, with the reply's dictionary made of what the handler set and `entries`, encoded already (the
+    // handler's entry of a key replaces the encoded one). For replies most of whose bytes were kept encoded.
+    void doneWithEncodedEntries(const ZemCodec::Entries& entries);
     // Sets "errorcode" and "error" in the reply, then done().
     void fail(ErrorCode code, std::string_view message);
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.
@@ -122,7 +126,6 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // Runs `step` of the current request's handler, answering when it throws.
     void guarded(const std::function<void()>& step);
     void failWithCode(int64_t code, std::string_view message);
-    void send(Value reply, std::vector<UniqueFd> descriptors);
 
     ZemMessage request_;
     std::shared_ptr<BXDZemClient> client_;
@@ -135,8 +138,15 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     struct HeldReply {
         Value reply;
         std::vector<UniqueFd> descriptors;
+        // When not empty, the whole reply encoded (and `reply` is unused).
+        std::vector<uint8_t> encoded;
     };
     std::optional<HeldReply> heldReply_;
+    // Sends the reply, or keeps it while holding.
+    void answer(HeldReply reply);
+    void send(HeldReply reply);
+    // The failure that replaces a reply of `size` bytes, more than a frame carries.
+    Value tooLargeReply(size_t size) const;
 };
 
 }  // namespace bexil

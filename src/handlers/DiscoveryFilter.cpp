@@ -232,29 +232,60 @@ bool CandidateFilter::run(BXDPlugIn& plugIn, Observer& observer) const {
 template bool CandidateFilter::run<Deciding>(BXDPlugIn&, Deciding&) const;
 template bool CandidateFilter::run<Tracing>(BXDPlugIn&, Tracing&) const;
 
-void AcceptedForms::offer(const BXDPlugIn& plugIn, MutableDictionary exported, BXDServer& database) {
+namespace {
+
+// What the competition and the replacement links read of an accepted form: its record's answers when it has one
+// (the form was offered encoded), else the form's own entries, which exportForm took from the same answers.
+template <class Form>
+std::string versionOfForm(const Form& form) {
+    return form.record ? versionOf(*form.record) : textOf(form.entries, formKey::kVersion);
+}
+template <class Form>
+std::string uuidTextOfForm(const Form& form) {
+    return form.record ? uuidTextOf(*form.record) : textOf(form.entries, formKey::kUuid);
+}
+template <class Form>
+std::string identifierOfForm(const Form& form) {
+    return form.record ? form.record->identifier().value_or("") : textOf(form.entries, formKey::kIdentifier);
+}
+template <class Form>
+std::pair<bool, DuplicateRule> tieBreakWithForm(const BXDPlugIn& plugIn, const Form& form) {
+    if (!form.record) return tieBreak(plugIn, form.entries);
+    if (plugIn.onSystemVolume() && !form.record->onSystemVolume()) return {true, DuplicateRule::SystemVolume};
+    if (plugIn.lastModified() != form.record->lastModified())
+        return {plugIn.lastModified() > form.record->lastModified(), DuplicateRule::LaterRegistration};
+    return {false, DuplicateRule::FoundFirst};
+}
+
+// The level of a form in a reply: reply, matches array, form.
+constexpr size_t kFormDepth = 2;
+
+}  // namespace
+
+std::vector<size_t>* AcceptedForms::compete(const BXDPlugIn& plugIn) {
     std::string version = versionOf(plugIn);
     std::vector<size_t>& sameIdentifier = positions_[plugIn.identifier().value_or("")];
     for (auto at = sameIdentifier.begin(); at != sameIdentifier.end(); ++at) {
-        Form& other = forms_[*at];
-        ComparisonResult order = compareVersionString(version, textOf(*other, formKey::kVersion));
+        const Form& other = *forms_[*at];
+        ComparisonResult order = compareVersionString(version, versionOfForm(other));
         bool same = order == ComparisonResult::Same;
         if ((flags_ & discover::kAllVersions) && (!same || (flags_ & discover::kAllInstances))) continue;
-        auto [wins, rule] = same ? tieBreak(plugIn, *other)
+        auto [wins, rule] = same ? tieBreakWithForm(plugIn, other)
                                  : std::pair{order == ComparisonResult::Descending, DuplicateRule::HigherVersion};
         if (!wins) {
-            if (defeats_ != nullptr) (*defeats_)[uuidTextOf(plugIn)] = {textOf(*other, formKey::kUuid), rule};
-            return;
+            if (defeats_ != nullptr) (*defeats_)[uuidTextOf(plugIn)] = {uuidTextOfForm(other), rule};
+            return nullptr;
         }
-        if (defeats_ != nullptr) (*defeats_)[textOf(*other, formKey::kUuid)] = {uuidTextOf(plugIn), rule};
-        other.reset();
+        if (defeats_ != nullptr) (*defeats_)[uuidTextOfForm(other)] = {uuidTextOf(plugIn), rule};
+        forms_[*at].reset();
         sameIdentifier.erase(at);
         --kept_;
         break;
     }
-    Form form = std::make_shared<MutableDictionary>(std::move(exported));
-    database.addAnnotationForPlugInIn(plugIn, *form);
-    plugIn.augmentForm(*form);
+    return &sameIdentifier;
+}
+
+void AcceptedForms::keep(const BXDPlugIn& plugIn, std::vector<size_t>& sameIdentifier, FormPointer form) {
     sameIdentifier.push_back(forms_.size());
     forms_.push_back(form);
     ++kept_;
@@ -262,22 +293,47 @@ void AcceptedForms::offer(const BXDPlugIn& plugIn, MutableDictionary exported, B
     for (const std::string& replaced : replacedIdentifiers(plugIn)) replacements_[replaced] = form;
 }
 
+void AcceptedForms::offer(const BXDPlugIn& plugIn, MutableDictionary exported, BXDServer& database) {
+    std::vector<size_t>* sameIdentifier = compete(plugIn);
+    if (sameIdentifier == nullptr) return;
+    auto form = std::make_shared<Form>();
+    form->entries = std::move(exported);
+    database.addAnnotationForPlugInIn(plugIn, form->entries);
+    plugIn.augmentForm(form->entries);
+    keep(plugIn, *sameIdentifier, std::move(form));
+}
+
+bool AcceptedForms::offerEncoded(const std::shared_ptr<BXDPlugIn>& plugIn, BXDServer& database) {
+    std::shared_ptr<const ZemCodec::Entries> kept = plugIn->keptFormEntries();
+    if (!kept) return false;
+    std::vector<size_t>* sameIdentifier = compete(*plugIn);
+    if (sameIdentifier == nullptr) return true;
+    auto form = std::make_shared<Form>();
+    form->record = plugIn;
+    form->kept = std::move(kept);
+    database.addAnnotationForPlugInIn(*plugIn, form->entries);
+    plugIn->addChangingFormEntries(form->entries);
+    plugIn->augmentForm(form->entries);
+    keep(*plugIn, *sameIdentifier, std::move(form));
+    return true;
+}
+
 void AcceptedForms::linkReplacements() {
     if (replacements_.empty()) return;
-    for (const Form& form : forms_) {
+    for (const FormPointer& form : forms_) {
         if (!form) continue;
-        std::string identifier = textOf(*form, formKey::kIdentifier);
+        std::string identifier = identifierOfForm(*form);
         auto replacing = replacements_.find(identifier);
         if (replacing == replacements_.end()) continue;
-        std::string replacingUuid = textOf(*replacing->second, formKey::kUuid);
-        form->set(formKey::kOverrider, Value::string(replacingUuid));
-        replacing->second->set(formKey::kOverriding, Value::string(identifier));
-        log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid, textOf(*form, formKey::kUuid));
+        std::string replacingUuid = uuidTextOfForm(*replacing->second);
+        form->entries.set(formKey::kOverrider, Value::string(replacingUuid));
+        replacing->second->entries.set(formKey::kOverriding, Value::string(identifier));
+        log::ops().info("plug-in %{public}@ overrides %{public}@", replacingUuid, uuidTextOfForm(*form));
     }
 }
 
 void AcceptedForms::absorb(AcceptedForms&& group) {
-    for (Form& form : group.forms_) {
+    for (FormPointer& form : group.forms_) {
         if (!form) continue;
         forms_.push_back(std::move(form));
         ++kept_;
@@ -288,9 +344,33 @@ void AcceptedForms::absorb(AcceptedForms&& group) {
 std::vector<Value> AcceptedForms::take() {
     std::vector<Value> values;
     values.reserve(kept_);
-    for (const Form& form : forms_)
-        if (form) values.push_back(form->take());
+    for (const FormPointer& form : forms_)
+        if (form) values.push_back(form->entries.take());
     return values;
+}
+
+std::vector<AcceptedForms::EncodedForm> AcceptedForms::takeEncoded() {
+    std::vector<EncodedForm> encoded;
+    encoded.reserve(kept_);
+    for (const FormPointer& form : forms_)
+        if (form) encoded.push_back(EncodedForm{form->kept, form->entries.take()});
+    return encoded;
+}
+
+Result<size_t> AcceptedForms::encodedSize(const EncodedForm& form) {
+    return ZemCodec::mergedSize(*form.kept, form.changing, kFormDepth);
+}
+
+std::optional<Error> AcceptedForms::appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out) {
+    size_t start = out.size();
+    ZemCodec::appendArrayHeader(forms.size(), out);
+    for (const EncodedForm& form : forms) {
+        if (std::optional<Error> error = ZemCodec::encodeMerged(*form.kept, form.changing, out, kFormDepth)) {
+            out.resize(start);
+            return error;
+        }
+    }
+    return std::nullopt;
 }
 
 }  // namespace bexil

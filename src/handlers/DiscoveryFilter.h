@@ -6,11 +6,14 @@
 
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "base/Error.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemCodec.h"
 #include "policy/BXMatchRules.h"
 
 namespace bexil {
@@ -91,6 +94,10 @@ class AcceptedForms {
     // Offers the exported form of a candidate that passed the filter; it is kept unless an accepted form of its
     // identifier beats it, and it replaces one that it beats.
     void offer(const BXDPlugIn& plugIn, MutableDictionary exported, BXDServer& database);
+    // The same for a reply that is sent encoded: the form is the record's kept entries (encoded once per record)
+    // and the entries that change, which alone are built here. False when the form cannot be made (logged). Forms
+    // offered this way are handed over by takeEncoded, the others by take; an instance takes one kind only.
+    bool offerEncoded(const std::shared_ptr<BXDPlugIn>& plugIn, BXDServer& database);
     // Writes the replacement links into the forms, once every candidate has been seen.
     void linkReplacements();
     size_t count() const { return kept_; }
@@ -99,15 +106,39 @@ class AcceptedForms {
     // The kept forms as values. The builders are not used again: their entries move rather than being copied.
     std::vector<Value> take();
 
+    // A form offered encoded: the record's kept entries merged with the changing ones.
+    struct EncodedForm {
+        std::shared_ptr<const ZemCodec::Entries> kept;
+        Value changing;
+    };
+    std::vector<EncodedForm> takeEncoded();
+    // The bytes `form` takes within a reply, or why it cannot be encoded.
+    static Result<size_t> encodedSize(const EncodedForm& form);
+    // Appends the value of a reply's matches entry, an array of `forms`; the entry nests the forms two levels below
+    // the reply.
+    static std::optional<Error> appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out);
+
   private:
-    using Form = std::shared_ptr<MutableDictionary>;
+    struct Form {
+        // The whole form when offered with offer, else the entries that change.
+        MutableDictionary entries;
+        // Set for a form offered encoded: its record answers what the competition asks.
+        std::shared_ptr<const BXDPlugIn> record;
+        std::shared_ptr<const ZemCodec::Entries> kept;
+    };
+    using FormPointer = std::shared_ptr<Form>;
+
+    // Lets `plugIn` compete with the accepted forms of its identifier: false when one of them beats it; otherwise
+    // the one it beats, if any, is dropped, and the positions of its identifier are where its form goes.
+    std::vector<size_t>* compete(const BXDPlugIn& plugIn);
+    void keep(const BXDPlugIn& plugIn, std::vector<size_t>& sameIdentifier, FormPointer form);
 
     uint64_t flags_;
     Defeats* defeats_ = nullptr;
-    std::vector<Form> forms_;
+    std::vector<FormPointer> forms_;
     // The positions in forms_ of the live forms of each identifier, in the order of forms_.
     std::unordered_map<std::string, std::vector<size_t>> positions_;
-    std::unordered_map<std::string, Form> replacements_;
+    std::unordered_map<std::string, FormPointer> replacements_;
     size_t kept_ = 0;
 };
 

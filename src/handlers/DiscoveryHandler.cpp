@@ -65,16 +65,32 @@ constexpr size_t kWalkStretch = 16;
 void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t to, const CandidateFilter& filter,
                    AcceptedForms& accepted, BXDServer& database) {
     for (size_t i = from; i < to; ++i) {
-        BXDPlugIn& plugIn = *candidates[i];
-        if (!filter.admits(plugIn)) continue;
-        Result<MutableDictionary> exported = plugIn.exportForm();
-        if (!exported) {
-            log::ops().error("failed to export matching plug-in %{public}@: %{public}@",
-                             plugIn.uuid() ? plugIn.uuid()->string() : std::string(), exported.error());
-            continue;
-        }
-        accepted.offer(plugIn, std::move(*exported), database);
+        const std::shared_ptr<BXDPlugIn>& plugIn = candidates[i];
+        if (!filter.admits(*plugIn)) continue;
+        if (!accepted.offerEncoded(plugIn, database))
+            log::ops().error("failed to export matching plug-in %{public}@",
+                             plugIn->uuid() ? plugIn->uuid()->string() : std::string());
     }
+}
+
+// Answers with `forms` as the reply's matches, written from the encoded entries the records keep and the few that
+// change, so that no form is built as a dictionary and encoded again on its way out.
+void answerWithForms(Transaction& transaction, std::span<const AcceptedForms::EncodedForm> forms) {
+    if (!carriesMessageForms(transaction.version())) {
+        transaction.done();
+        return;
+    }
+    std::vector<uint8_t> matches;
+    ZemCodec::Entries entries;
+    // The forms were checked at their own level within the reply; the entry's value is the array that holds them.
+    std::optional<Error> error = AcceptedForms::appendMatches(forms, matches);
+    if (!error) error = ZemCodec::appendEntry(entries, protocol::key::kMatches, matches, forms.empty() ? 1 : 2);
+    if (error) {
+        log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(), *error);
+        transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");
+        return;
+    }
+    transaction.doneWithEncodedEntries(entries);
 }
 
 // The page size of a paged "match": a positive integer of either integer kind; none for anything else.
@@ -202,19 +218,19 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
         accepted.linkReplacements();
     }
 
-    std::vector<Value> forms = accepted.take();
+    std::vector<AcceptedForms::EncodedForm> forms = accepted.takeEncoded();
     // The page ends before the identifier whose forms would take it past page::kMaxBytes (the first is always kept).
     size_t bytes = 0;
     for (size_t group = 0, at = 0; group < groupEnds.size(); ++group) {
         size_t groupBytes = 0;
         for (; at < groupEnds[group].second; ++at) {
-            Result<size_t> size = ZemCodec::encodedSize(forms[at]);
+            Result<size_t> size = AcceptedForms::encodedSize(forms[at]);
             groupBytes += size ? *size : 0;
         }
         if (group > 0 && bytes + groupBytes > page::kMaxBytes) {
             log::ops().info("page for client %d cut at %zu forms: more would exceed %llu bytes (page::kMaxBytes)", pid,
                             groupEnds[group - 1].second, static_cast<unsigned long long>(page::kMaxBytes));
-            forms.resize(groupEnds[group - 1].second);
+            forms.erase(forms.begin() + static_cast<ptrdiff_t>(groupEnds[group - 1].second), forms.end());
             walkedTo = groupEnds[group - 1].first;
             ended = false;
             break;
@@ -224,9 +240,6 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
 
     log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms.size()));
     transaction.reply().set(protocol::key::kGeneration, Value::uint64(generation));
-    const uint64_t version = transaction.version();
-    if (std::optional<Value> encoded = toMessageForm(Value::array(std::move(forms)), version))
-        transaction.reply().set(protocol::key::kMatches, std::move(*encoded));
     if (!ended && walkedTo) {
         if (continuationEntry == nullptr) bindRules();
         std::string continuation = database.continuations().issue(*walkedTo, binding);
@@ -234,7 +247,7 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
                                 Value::data(std::span<const uint8_t>(
                                     reinterpret_cast<const uint8_t*>(continuation.data()), continuation.size())));
     }
-    transaction.done();
+    answerWithForms(transaction, forms);
 }
 
 }  // namespace
@@ -266,24 +279,13 @@ void Transaction::matchPlugIns() {
         reply().set(protocol::key::kGeneration, Value::uint64(database->changeFeed().current()));
         std::optional<BXDatabase::PlugInSet> candidates = database->findPlugIns(rules);
         trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
-        for (const std::shared_ptr<BXDPlugIn>& plugIn : candidates ? *candidates : BXDatabase::PlugInSet{}) {
-            if (!filter.admits(*plugIn)) continue;
-            Result<MutableDictionary> exported = plugIn->exportForm();
-            if (!exported) {
-                log::ops().error("failed to export matching plug-in %{public}@: %{public}@",
-                                 plugIn->uuid() ? plugIn->uuid()->string() : std::string(), exported.error());
-                continue;
-            }
-            accepted.offer(*plugIn, std::move(*exported), *database);
-        }
+        if (candidates) offerAdmitted(*candidates, 0, candidates->size(), filter, accepted, *database);
         accepted.linkReplacements();
     }
 
     log::ops().info("match returned %u plug-ins", static_cast<unsigned>(accepted.count()));
-    if (std::optional<Value> encoded = toMessageForm(Value::array(accepted.take()), version()))
-        reply().set(protocol::key::kMatches, std::move(*encoded));
+    answerWithForms(*this, accepted.takeEncoded());
     log::ops().debug("reply marshalled");
-    done();
 }
 
 }  // namespace bexil

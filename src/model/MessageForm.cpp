@@ -4,8 +4,10 @@
 
 namespace bexil {
 
+bool carriesMessageForms(uint64_t version) { return version == protocol::kCurrentVersion; }
+
 std::optional<Value> toMessageForm(const Value& value, uint64_t version) {
-    if (version != protocol::kCurrentVersion) return std::nullopt;
+    if (!carriesMessageForms(version)) return std::nullopt;
     return value;
 }
 

@@ -13,6 +13,8 @@
 
 namespace bexil {
 
+// Whether a reply for protocol `version` carries message forms at all: only the current version's does.
+bool carriesMessageForms(uint64_t version);
 // The message form of `value` for protocol `version`; none for every version but the current one.
 std::optional<Value> toMessageForm(const Value& value, uint64_t version);
 // The value decoded from its message form by a client speaking `version`; none for every version but the current.

@@ -188,6 +188,44 @@ void BXDPlugIn::augmentForm(MutableDictionary& form) const {
     form.set(kExtensionsFormKey, std::move(tokens));
 }
 
+namespace {
+
+// The entries of the exported form that can change while the record lives.
+bool changesWhileKept(std::string_view key) {
+    return key == protocol::form::kAnnotations || key == protocol::form::kLocalizedDisplayName ||
+           key == protocol::form::kLocalizedShortName || key == protocol::form::kLocalizedContainingDisplayName;
+}
+
+}  // namespace
+
+std::shared_ptr<const ZemCodec::Entries> BXDPlugIn::keptFormEntries() const {
+    if (std::shared_ptr<const ZemCodec::Entries> kept = load(keptFormEntries_)) return kept;
+    Result<MutableDictionary> exported = exportForm();
+    if (!exported) return nullptr;
+    for (std::string_view key : protocol::form::kList)
+        if (changesWhileKept(key)) exported->remove(key);
+    Result<ZemCodec::Entries> encoded = ZemCodec::encodeEntries(exported->take());
+    if (!encoded) {
+        log::ops().error("cannot encode the form of plug-in %@: %@", description(), encoded.error());
+        return nullptr;
+    }
+    auto kept = std::make_shared<const ZemCodec::Entries>(std::move(*encoded));
+    // Two first discoveries at once may both encode it; either result is the same.
+    BXDPlugIn* self = const_cast<BXDPlugIn*>(this);
+    self->store(self->keptFormEntries_, std::shared_ptr<const ZemCodec::Entries>(kept));
+    return kept;
+}
+
+void BXDPlugIn::addChangingFormEntries(MutableDictionary& form) const {
+    auto setText = [&form](std::string_view key, std::optional<std::string> text) {
+        if (text) form.set(key, Value::string(std::move(*text)));
+    };
+    // The names as the record holds them, as exportForm writes them: asking the registry is for other requests.
+    setText(protocol::form::kLocalizedContainingDisplayName, BXPlugInCore::localizedContainingName());
+    setText(protocol::form::kLocalizedDisplayName, BXPlugInCore::localizedName());
+    setText(protocol::form::kLocalizedShortName, BXPlugInCore::localizedShortName());
+}
+
 Value BXDPlugIn::issueResourceExtensions(const Value& paths, bool* complete) const {
     Value list = paths.isString() ? Value::array({paths}) : paths;
     std::string bundle = url().value_or(std::string());

@@ -17,6 +17,7 @@
 #include "platform/jobard/ServiceManager.h"
 #include "platform/ksn/PrivacyConsent.h"
 #include "platform/wardend/ProcessAssertions.h"
+#include "platform/zem/ZemCodec.h"
 #include "policy/BXMatchRules.h"
 #include "policy/HostAccessClient.h"
 
@@ -67,6 +68,14 @@ class BXDPlugIn : public BXPlugInCore {
     // are made once per record, the first time every resource gets one, and shared by every later form: a token
     // names the path the resource resolved to then, and stays good for the run of the daemon.
     void augmentForm(MutableDictionary& form) const;
+    // The exported form splits in two for discovery, which sends many forms and most of each again and again. The
+    // kept entries are those that stay as they are for the record's life, encoded once, the first time they are
+    // asked for, and shared by every later reply: the record is dropped when its registration changes. They are
+    // everything exportForm writes but the annotations (the database's, changed by annotating and electing) and
+    // the display names (filled in when first asked of the registry), which addChangingFormEntries writes on every
+    // call, besides what augmentForm adds. Null when the form cannot be encoded (logged).
+    std::shared_ptr<const ZemCodec::Entries> keptFormEntries() const;
+    void addChangingFormEntries(MutableDictionary& form) const;
     // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
     // is one string or an array; other elements are passed over; paths that get no token are left out (logged), and
     // `complete`, when given, says whether none was.
@@ -128,6 +137,8 @@ class BXDPlugIn : public BXPlugInCore {
     // The "extensions" of augmentForm once every resource got its token; guarded by the record's lock. Resolving a
     // resource's real path costs system calls that walk the path, most of what exporting a form cost.
     std::optional<Value> resourceTokens_;
+    // What keptFormEntries made; guarded by the record's lock.
+    std::shared_ptr<const ZemCodec::Entries> keptFormEntries_;
 };
 
 }  // namespace bexil

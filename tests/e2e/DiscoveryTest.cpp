@@ -179,5 +179,48 @@ TEST_F(DiscoveryTest, ReplacingPlugInIsLinkedToThePlugInItReplaces) {
               std::string(hello.get("uuid").stringView()));
 }
 
+// Guards the forms a match sends from what each record keeps encoded between requests: an annotation made after a
+// match shows in the very next one, paged or not, and so does a registration that changed the bundle; the forms of
+// a match are those "watch" builds for the same plug-ins, entry for entry.
+TEST_F(DiscoveryTest, KeptFormsShowAnnotationsAndRegistrationChangesInTheNextMatch) {
+    startWithExamples();
+    TestClient client;
+    const Value rules = identifierRule(kHello);
+    const Value paged = request("match", {{"rules", rules}, {"pagesize", Value::uint64(10)}});
+    Value first = formsOf(client.replyTo(matchRequest(rules)), kHello).at(0);
+    EXPECT_EQ(first, formsOf(client.replyTo(paged), kHello).at(0)) << "paged and unpaged forms are alike";
+    const Value uuid = first.get("uuid");
+
+    Value note = Value::dictionary({{"colour", str("green")}});
+    succeed(request("annotate", {{"annotations", Value::dictionary({{"extension", note}})},
+                                 {"uuids", Value::array({Value::uuid(*Uuid::parse(uuid.stringView()))})}}));
+    for (const Value& message : {matchRequest(rules), paged}) {
+        Value form = formsOf(client.replyTo(message), kHello).at(0);
+        EXPECT_EQ(form.get("annotations").get("extension"), note) << form.description();
+        MutableDictionary unchanged(form);
+        unchanged.set("annotations", first.get("annotations"));
+        EXPECT_EQ(unchanged.take(), first) << "only the annotations changed";
+    }
+
+    TestClient watcher;
+    Value watched = watcher.replyTo(request("watch", {{"rules", rules}, {"flags", Value::uint64(0)}}));
+    Value matched = formsOf(client.replyTo(matchRequest(rules)), kHello).at(0);
+    ASSERT_TRUE(watched.get("matches").isArray()) << watched.description();
+    ASSERT_EQ(watched.get("matches").count(), 1u) << watched.description();
+    EXPECT_EQ(watched.get("matches").items()[0], matched);
+
+    // The same bundle registered again with another version.
+    fs::path hello = bundles_ / "Greeter.app/PlugIns/Hello.bxplugin";
+    Result<Value> info = Document::readFile(hello / "Info.vrec");
+    ASSERT_TRUE(info.ok());
+    MutableDictionary root(*info);
+    root.set("BDBundleVersion", str("7.7"));
+    ASSERT_FALSE(Document::writeFileAtomically(hello / "Info.vrec", root.take()));
+    add({hello.string()});
+    Value again = formsOf(client.replyTo(matchRequest(rules)), kHello).at(0);
+    EXPECT_EQ(again.get("bundleInfo").get("BDBundleVersion").stringView(), "7.7") << again.description();
+    EXPECT_EQ(formsOf(client.replyTo(paged), kHello).at(0).get("bundleInfo"), again.get("bundleInfo"));
+}
+
 }  // namespace
 }  // namespace bexil

@@ -90,6 +90,8 @@ class Sizer {
   public:
     std::optional<Error> error;
     size_t size = 0;
+    // The deepest level at which a container was entered.
+    size_t deepest = 0;
 
     void visit(const Value& v, size_t depth) {
         switch (v.kind()) {
@@ -145,6 +147,7 @@ class Sizer {
 
   private:
     bool enter(size_t depth) {
+        deepest = std::max(deepest, depth);
         if (depth < ZemCodec::kMaxDepth) return true;
         error = zemError(
             ZemErrorCode::TooDeep,
@@ -152,6 +155,7 @@ class Sizer {
         return false;
     }
 
+  public:
     void text(std::string_view s, const char* what) {
         size_t bad = firstInvalidUtf8(s);
         if (bad == kWellFormedUtf8) return;
@@ -418,6 +422,61 @@ class Decoder {
     }
 };
 
+// ---- Merging kept entries ----
+
+std::optional<Error> tooDeep(size_t depth) {
+    return zemError(ZemErrorCode::TooDeep, fmt::format("dictionary entries kept at level {} nest deeper than the "
+                                                       "limit of {} levels",
+                                                       depth, ZemCodec::kMaxDepth));
+}
+
+size_t entrySize(const ZemCodec::Entries& entries, size_t index) {
+    size_t end = index + 1 < entries.count() ? entries.starts[index + 1] : entries.bytes.size();
+    return end - entries.starts[index];
+}
+
+// What a merge writes: the number of entries and the exact size, once the extra entries are checked.
+struct MergePlan {
+    std::optional<Error> error;
+    size_t count = 0;
+    size_t size = 0;
+};
+
+MergePlan planMerge(const ZemCodec::Entries& entries, std::span<const DictionaryEntry> extra, size_t depth) {
+    MergePlan plan;
+    if (depth >= ZemCodec::kMaxDepth || (entries.levels > 0 && depth + entries.levels >= ZemCodec::kMaxDepth)) {
+        plan.error = tooDeep(depth);
+        return plan;
+    }
+    Sizer sizer;
+    size_t replaced = 0;
+    size_t kept = 0;
+    for (const DictionaryEntry& e : extra) {
+        sizer.text(e.key, "dictionary key");
+        if (sizer.error) break;
+        sizer.size += varintSize(e.key.size()) + e.key.size();
+        sizer.visit(e.value, depth + 1);
+        if (sizer.error) break;
+    }
+    if (sizer.error) {
+        plan.error = std::move(sizer.error);
+        return plan;
+    }
+    // Both lists are in ascending key order: a walk of both finds the kept entries that the extra ones replace.
+    for (size_t i = 0, j = 0; i < entries.count(); ++i) {
+        std::string_view key = entries.key(i);
+        while (j < extra.size() && std::string_view(extra[j].key) < key) ++j;
+        if (j < extra.size() && extra[j].key == key) {
+            ++replaced;
+            continue;
+        }
+        kept += entrySize(entries, i);
+    }
+    plan.count = entries.count() - replaced + extra.size();
+    plan.size = 1 + varintSize(plan.count) + kept + sizer.size;
+    return plan;
+}
+
 }  // namespace
 
 Result<size_t> ZemCodec::encodedSize(const Value& value) {
@@ -457,6 +516,95 @@ Result<Value> ZemCodec::decode(std::span<const uint8_t> bytes) {
                         fmt::format("{} bytes follow the value that ends at offset {}",
                                     bytes.size() - decoder.position(), decoder.position()));
     return result;
+}
+
+std::string_view ZemCodec::Entries::key(size_t index) const {
+    const uint8_t* p = bytes.data() + starts[index];
+    uint64_t length = 0;
+    for (unsigned shift = 0;; shift += 7) {
+        uint8_t byte = *p++;
+        length |= static_cast<uint64_t>(byte & 0x7F) << shift;
+        if (!(byte & 0x80)) break;
+    }
+    return std::string_view(reinterpret_cast<const char*>(p), length);
+}
+
+std::span<const uint8_t> ZemCodec::Entries::entry(size_t index) const {
+    return std::span<const uint8_t>(bytes.data() + starts[index], entrySize(*this, index));
+}
+
+Result<ZemCodec::Entries> ZemCodec::encodeEntries(const Value& dictionary) {
+    Entries entries;
+    std::vector<uint8_t> value;
+    for (const DictionaryEntry& e : dictionary.entries()) {
+        Sizer sizer;
+        sizer.visit(e.value, 1);
+        if (sizer.error) return *sizer.error;
+        value.resize(sizer.size);
+        if (write(value.data(), e.value) != value.data() + value.size())
+            throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
+        if (auto error = appendEntry(entries, e.key, value, static_cast<uint32_t>(sizer.deepest))) return *error;
+    }
+    entries.bytes.shrink_to_fit();
+    entries.starts.shrink_to_fit();
+    return entries;
+}
+
+std::optional<Error> ZemCodec::appendEntry(Entries& entries, std::string_view key,
+                                           std::span<const uint8_t> encodedValue, uint32_t levels) {
+    Sizer sizer;
+    sizer.text(key, "dictionary key");
+    if (sizer.error) return sizer.error;
+    if (entries.count() > 0 && !(entries.key(entries.count() - 1) < key))
+        throw InternalInconsistency("dictionary entries kept out of key order");
+    if (entries.bytes.size() > UINT32_MAX - 10 - key.size() - encodedValue.size())
+        return zemError(ZemErrorCode::FrameTooLarge, "dictionary entries kept exceed 4 GiB");
+    size_t start = entries.bytes.size();
+    entries.starts.push_back(static_cast<uint32_t>(start));
+    entries.bytes.resize(start + varintSize(key.size()) + key.size() + encodedValue.size());
+    uint8_t* p = putBytes(putVarint(entries.bytes.data() + start, key.size()), key.data(), key.size());
+    putBytes(p, encodedValue.data(), encodedValue.size());
+    entries.levels = std::max(entries.levels, levels);
+    return std::nullopt;
+}
+
+Result<size_t> ZemCodec::mergedSize(const Entries& entries, const Value& extra, size_t depth) {
+    MergePlan plan = planMerge(entries, extra.entries(), depth);
+    if (plan.error) return *plan.error;
+    return plan.size;
+}
+
+std::optional<Error> ZemCodec::encodeMerged(const Entries& entries, const Value& extra, std::vector<uint8_t>& out,
+                                            size_t depth) {
+    std::span<const DictionaryEntry> more = extra.entries();
+    MergePlan plan = planMerge(entries, more, depth);
+    if (plan.error) return plan.error;
+    size_t start = out.size();
+    out.resize(start + plan.size);
+    uint8_t* p = putVarint(putTag(out.data() + start, ZemTag::Dictionary), plan.count);
+    auto writeExtra = [&p](const DictionaryEntry& e) {
+        p = write(putBytes(putVarint(p, e.key.size()), e.key.data(), e.key.size()), e.value);
+    };
+    size_t j = 0;
+    for (size_t i = 0; i < entries.count(); ++i) {
+        std::string_view key = entries.key(i);
+        while (j < more.size() && std::string_view(more[j].key) < key) writeExtra(more[j++]);
+        if (j < more.size() && more[j].key == key) {
+            writeExtra(more[j++]);
+            continue;
+        }
+        p = putBytes(p, entries.bytes.data() + entries.starts[i], entrySize(entries, i));
+    }
+    while (j < more.size()) writeExtra(more[j++]);
+    if (p != out.data() + out.size())
+        throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
+    return std::nullopt;
+}
+
+void ZemCodec::appendArrayHeader(size_t count, std::vector<uint8_t>& out) {
+    size_t start = out.size();
+    out.resize(start + 1 + varintSize(count));
+    putVarint(putTag(out.data() + start, ZemTag::Array), count);
 }
 
 }  // namespace bexil

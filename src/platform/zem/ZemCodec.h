@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <optional>
 #include <span>
+#include <string_view>
 #include <vector>
 
 #include "base/Error.h"
@@ -48,6 +49,39 @@ class ZemCodec {
 
     // Decodes exactly one value that fills all of `bytes`. The error names what was wrong and its byte offset.
     static Result<Value> decode(std::span<const uint8_t> bytes);
+
+    // Encoded dictionary entries kept for merging into dictionaries later, so that what many messages repeat is
+    // checked and encoded once: each entry is its key's length and bytes followed by its encoded value, in
+    // ascending key order; `starts` holds where each entry begins.
+    struct Entries {
+        std::vector<uint8_t> bytes;
+        std::vector<uint32_t> starts;
+        // How many container levels the deepest value nests below the dictionary the entries are merged into
+        // (0 when no value is a container).
+        uint32_t levels = 0;
+
+        size_t count() const { return starts.size(); }
+        // The key of entry `index`.
+        std::string_view key(size_t index) const;
+        // The encoded entry `index`: its key, then its value.
+        std::span<const uint8_t> entry(size_t index) const;
+    };
+    // The entries of `dictionary` (a non-dictionary has none), checked as encode() checks them.
+    static Result<Entries> encodeEntries(const Value& dictionary);
+    // Appends one entry: `key` and then `encodedValue`, an encoding made by this codec that nests `levels` container
+    // levels below the entry's dictionary. Entries must come in ascending key order.
+    static std::optional<Error> appendEntry(Entries& entries, std::string_view key,
+                                            std::span<const uint8_t> encodedValue, uint32_t levels);
+    // Appends the encoding of one dictionary made of `entries` and the entries of `extra` (a dictionary; anything
+    // else counts as none), keys in ascending order as encode() writes them; an entry of `extra` takes the place of
+    // a kept one with the same key. `depth` is the level of the dictionary within the value being encoded (0 when it
+    // is the whole value). Errors as encode()'s; `out` is then left as it was.
+    static std::optional<Error> encodeMerged(const Entries& entries, const Value& extra, std::vector<uint8_t>& out,
+                                             size_t depth = 0);
+    // The bytes encodeMerged would append.
+    static Result<size_t> mergedSize(const Entries& entries, const Value& extra, size_t depth = 0);
+    // Appends the start of an array of `count` items; the caller appends the items' encodings after it.
+    static void appendArrayHeader(size_t count, std::vector<uint8_t>& out);
 };
 
 }  // namespace bexil

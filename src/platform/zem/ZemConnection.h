@@ -62,6 +62,9 @@ class ZemConnection {
     // once sent, or when the connection ends first.
     virtual void sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
                                           std::vector<UniqueFd> descriptors) = 0;
+    // The answer to `request` already encoded: `payload` is one dictionary as ZemCodec writes it. The connection
+    // only frames it. This one decodes it and sends it as sendReply would.
+    virtual void sendEncodedReply(const ZemMessage& request, std::vector<uint8_t> payload);
     // A message that expects one reply; `handler` runs on `replyQueue` with the reply or the error in its place.
     virtual void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) = 0;
     // The same, handing over the whole reply message with any descriptors it carries.

@@ -136,4 +136,27 @@ std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64
     return std::nullopt;
 }
 
+std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                             std::span<const uint8_t> payload, std::vector<uint8_t>& out,
+                                             uint8_t descriptorCount) {
+    if (payload.empty() || payload[0] != static_cast<uint8_t>(ZemTag::Dictionary))
+        return zemError(
+            ZemErrorCode::NotDictionary,
+            fmt::format("a {} carries a dictionary; this payload is something else", zemFrameKindName(kind)));
+    ZemFrameHeader header{kind, serial, inReplyTo, 0, descriptorCount};
+    if (descriptorCount > kMaxDescriptorsPerFrame)
+        return zemError(ZemErrorCode::BadHeader, fmt::format("a frame carries at most {} descriptors, not {}",
+                                                             kMaxDescriptorsPerFrame, descriptorCount));
+    if (auto error = checkHeader(header)) return error;
+    if (payload.size() > kMaxPayloadBytes)
+        return zemError(ZemErrorCode::FrameTooLarge, fmt::format("frame of {} bytes exceeds limit kMaxFrameBytes ({})",
+                                                                 kHeaderBytes + payload.size(), kMaxFrameBytes));
+    header.payloadLength = static_cast<uint32_t>(payload.size());
+    size_t start = out.size();
+    out.resize(start + kHeaderBytes + payload.size());
+    encodeHeader(header, std::span<uint8_t, kHeaderBytes>(out.data() + start, kHeaderBytes));
+    std::memcpy(out.data() + start + kHeaderBytes, payload.data(), payload.size());
+    return std::nullopt;
+}
+
 }  // namespace bexil

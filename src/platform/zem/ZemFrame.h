@@ -79,6 +79,10 @@ class ZemFrame {
     // On any error, `out` is left as it was.
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
                                        std::vector<uint8_t>& out, uint8_t descriptorCount = 0);
+    // The same with the payload already encoded (one dictionary, as ZemCodec writes it).
+    static std::optional<Error> encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                              std::span<const uint8_t> payload, std::vector<uint8_t>& out,
+                                              uint8_t descriptorCount = 0);
 
   private:
     ZemFrameHeader header_;

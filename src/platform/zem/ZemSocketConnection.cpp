@@ -114,6 +114,16 @@ ZemSocketConnection::~ZemSocketConnection() {
     if (finalizer_) finalizer_(std::move(context_));
 }
 
+void ZemConnection::sendEncodedReply(const ZemMessage& request, std::vector<uint8_t> payload) {
+    Result<Value> reply = ZemCodec::decode(payload);
+    if (!reply) {
+        log::ops().error("cannot send reply to message #%llu: %@", static_cast<unsigned long long>(request.serial()),
+                         reply.error());
+        return;
+    }
+    sendReply(request, *reply);
+}
+
 std::shared_ptr<ZemConnection> ZemConnection::createClient(const std::string& serviceName, SerialQueue& queue) {
     return std::make_shared<ZemSocketConnection>(queue, serviceName);
 }
@@ -181,6 +191,18 @@ void ZemSocketConnection::sendReply(const ZemMessage& request, const Value& repl
     // instead of taking another turn of the loop (which costs a reactor poll, more than the whole reply).
     queue_.dispatch([self = shared_from_this(), serial = request.serial(), reply] {
         self->enqueueFrame(ZemFrameKind::Reply, serial, reply, std::nullopt);
+    });
+}
+
+void ZemSocketConnection::sendEncodedReply(const ZemMessage& request, std::vector<uint8_t> payload) {
+    if (!request.expectsReply()) {
+        log::ops().error("reply to message #%llu, which expects none, dropped",
+                         static_cast<unsigned long long>(request.serial()));
+        return;
+    }
+    queue_.dispatch([self = shared_from_this(), serial = request.serial(),
+                     bytes = std::make_shared<const std::vector<uint8_t>>(std::move(payload))] {
+        self->enqueueFrame(ZemFrameKind::Reply, serial, Payload(bytes), std::nullopt);
     });
 }
 
@@ -624,7 +646,7 @@ void ZemSocketConnection::handleFrame(ZemFrame frame) {
     }
 }
 
-void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
+void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Payload& payload,
                                        std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors) {
     const Reclaim reclaim = takeSocketBack([&] {
         auto owned = std::make_shared<std::vector<UniqueFd>>(std::move(descriptors));
@@ -639,7 +661,7 @@ void ZemSocketConnection::enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, co
     if (reclaim == Reclaim::Reclaimed || reconnecting) readMore();
 }
 
-void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
+void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Payload& payload,
                                             std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors) {
     if (side_ == Side::Client && state_ == State::Interrupted) {
         // The service went away earlier; a new message tries to reach it again.
@@ -663,8 +685,11 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
         if (pending) answerWithError(*pending, ZemError::Kind::MessageInvalid);
         return;
     }
+    const auto descriptorCount = static_cast<uint8_t>(descriptors.size());
     if (std::optional<Error> error =
-            ZemFrame::encode(kind, serial, inReplyTo, payload, outgoing_, static_cast<uint8_t>(descriptors.size()))) {
+            payload.encoded
+                ? ZemFrame::encodeEncoded(kind, serial, inReplyTo, *payload.encoded, outgoing_, descriptorCount)
+                : ZemFrame::encode(kind, serial, inReplyTo, payload.value, outgoing_, descriptorCount)) {
         log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(kind), static_cast<int>(pid_), *error);
         if (pending) answerWithError(*pending, ZemError::Kind::MessageInvalid);
         return;

@@ -67,6 +67,7 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void sendReply(const ZemMessage& request, const Value& reply) override;
     void sendReplyWithDescriptors(const ZemMessage& request, const Value& reply,
                                   std::vector<UniqueFd> descriptors) override;
+    void sendEncodedReply(const ZemMessage& request, std::vector<uint8_t> payload) override;
     void sendWithReply(const Value& message, SerialQueue& replyQueue, ReplyHandler handler) override;
     void sendWithMessageReply(const Value& message, SerialQueue& replyQueue, MessageReplyHandler handler) override;
     void setParkable(bool parkable) override;
@@ -142,10 +143,17 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // replies the peer does not read; cancels it otherwise.
     void watchStall();
     void handleFrame(ZemFrame frame);
-    void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload, std::optional<PendingReply> pending,
-                      std::vector<UniqueFd> descriptors = {});
+    // What a frame carries: a dictionary to encode, or one encoded already.
+    struct Payload {
+        Payload(const Value& dictionary) : value(dictionary) {}  // NOLINT(google-explicit-constructor)
+        explicit Payload(std::shared_ptr<const std::vector<uint8_t>> bytes) : encoded(std::move(bytes)) {}
+        Value value;
+        std::shared_ptr<const std::vector<uint8_t>> encoded;
+    };
+    void enqueueFrame(ZemFrameKind kind, uint64_t inReplyTo, const Payload& payload,
+                      std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors = {});
     // enqueueFrame once the queue owns the socket.
-    void enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Value& payload,
+    void enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Payload& payload,
                            std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors);
     // Writes what the socket takes now and notes what remains for queuedBytes.
     void writeMore();
