@@ -268,10 +268,13 @@ LXPreselection BXDatabase::preselectionFor(const Value& query) const {
 }
 
 LXPlugInFilter BXDatabase::filterFor(const Value& query) {
-    return
-        [this, wanted = wantedElections(query)](std::string_view identifier, const std::optional<Value>& entitlements) {
-            return !wanted || electionFilter(*wanted, identifier, entitlements);
-        };
+    // No filter at all when the query wants no election: the registry then never reads a candidate's entitlements
+    // for it, which costs decoding them for every row of every query.
+    std::optional<std::vector<std::string>> wanted = wantedElections(query);
+    if (!wanted) return {};
+    return [this, wanted = std::move(*wanted)](std::string_view identifier, const std::optional<Value>& entitlements) {
+        return electionFilter(wanted, identifier, entitlements);
+    };
 }
 
 std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query) {
@@ -321,7 +324,10 @@ std::optional<BXDatabase::PlugInSlice> BXDatabase::findPlugInsAfterIdentifier(co
 
 BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) {
     PlugInSet result;
+    result.reserve(proxies.size());
     std::unordered_set<Uuid> seen;
+    std::vector<const std::shared_ptr<const LXBexilProxy>*> wanted;
+    wanted.reserve(proxies.size());
     for (const std::shared_ptr<const LXBexilProxy>& proxy : proxies) {
         if (!proxy->bundleURL()) {
             log::ops().info("skipping lx proxy %@ with nil bundleURL", proxy->description());
@@ -334,9 +340,27 @@ BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) 
             log::ops().info("skipping lx proxy %@ because its app is a placeholder", proxy->description());
             continue;
         }
-        std::shared_ptr<BXDPlugIn> plugIn = plugInForProxy(proxy);
-        if (!plugIn) continue;
-        if (seen.insert(*plugIn->uuid()).second) result.push_back(std::move(plugIn));
+        wanted.push_back(&proxy);
+    }
+    // The records are looked up a stretch at a time inside `_sync`, not one entry each: a discovery of every plug-in
+    // would otherwise enter it once per candidate. A stretch bounds how long a cold cache, which builds the records,
+    // keeps others out.
+    constexpr size_t kStretch = 64;
+    for (size_t from = 0; from < wanted.size(); from += kStretch) {
+        const size_t to = std::min(wanted.size(), from + kStretch);
+        _sync.sync([&] {
+            for (size_t i = from; i < to; ++i) {
+                const std::shared_ptr<const LXBexilProxy>& proxy = *wanted[i];
+                std::shared_ptr<BXDPlugIn> plugIn;
+                if (proxy->pluginUUID()) {
+                    auto hit = cache_.find(*proxy->pluginUUID());
+                    if (hit != cache_.end()) plugIn = hit->second;
+                }
+                if (!plugIn) plugIn = createPlugInForProxy(proxy);
+                if (!plugIn) continue;
+                if (seen.insert(*plugIn->uuid()).second) result.push_back(std::move(plugIn));
+            }
+        });
     }
     return result;
 }

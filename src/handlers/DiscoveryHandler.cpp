@@ -80,11 +80,10 @@ void answerWithForms(Transaction& transaction, std::span<const AcceptedForms::En
         transaction.done();
         return;
     }
-    std::vector<uint8_t> matches;
     ZemCodec::Entries entries;
     // The forms were checked at their own level within the reply; the entry's value is the array that holds them.
-    std::optional<Error> error = AcceptedForms::appendMatches(forms, matches);
-    if (!error) error = ZemCodec::appendEntry(entries, protocol::key::kMatches, matches, forms.empty() ? 1 : 2);
+    std::optional<Error> error = ZemCodec::beginEntry(entries, protocol::key::kMatches, forms.empty() ? 1 : 2);
+    if (!error) error = AcceptedForms::appendMatches(forms, entries.bytes);
     if (error) {
         log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(), *error);
         transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");

@@ -44,7 +44,7 @@ std::optional<LXWalkSlice> LXApplicationWorkspace::pluginsMatchingQueryAfterIden
         if (walked >= rows && identifier != slice.last) break;
         ++walked;
         slice.last = identifier;
-        if (filter(identifier, (*at)->entitlements())) slice.plugIns.push_back(*at);
+        if (!filter || filter(identifier, (*at)->entitlements())) slice.plugIns.push_back(*at);
     }
     slice.ended = at == candidates->end();
     return slice;

@@ -47,7 +47,8 @@ enum LXErrorCode : int {
 
 using LXProxyList = std::vector<std::shared_ptr<const LXBexilProxy>>;
 // A discovery filter: called once per candidate with its identifier (empty when it has none) and its entitlements
-// (none when it has none); true keeps the candidate.
+// (none when it has none); true keeps the candidate. An empty filter keeps every candidate, and a registry then
+// reads no entitlements for it.
 using LXPlugInFilter = std::function<bool(std::string_view identifier, const std::optional<Value>& entitlements)>;
 
 // What a discovery query pins, as the rule engine that owns the query language reads it: for the extension point

@@ -550,21 +550,28 @@ Result<ZemCodec::Entries> ZemCodec::encodeEntries(const Value& dictionary) {
     return entries;
 }
 
-std::optional<Error> ZemCodec::appendEntry(Entries& entries, std::string_view key,
-                                           std::span<const uint8_t> encodedValue, uint32_t levels) {
+std::optional<Error> ZemCodec::beginEntry(Entries& entries, std::string_view key, uint32_t levels) {
     Sizer sizer;
     sizer.text(key, "dictionary key");
     if (sizer.error) return sizer.error;
     if (entries.count() > 0 && !(entries.key(entries.count() - 1) < key))
         throw InternalInconsistency("dictionary entries kept out of key order");
-    if (entries.bytes.size() > UINT32_MAX - 10 - key.size() - encodedValue.size())
+    if (entries.bytes.size() > UINT32_MAX - 10 - key.size())
         return zemError(ZemErrorCode::FrameTooLarge, "dictionary entries kept exceed 4 GiB");
     size_t start = entries.bytes.size();
     entries.starts.push_back(static_cast<uint32_t>(start));
-    entries.bytes.resize(start + varintSize(key.size()) + key.size() + encodedValue.size());
-    uint8_t* p = putBytes(putVarint(entries.bytes.data() + start, key.size()), key.data(), key.size());
-    putBytes(p, encodedValue.data(), encodedValue.size());
+    entries.bytes.resize(start + varintSize(key.size()) + key.size());
+    putBytes(putVarint(entries.bytes.data() + start, key.size()), key.data(), key.size());
     entries.levels = std::max(entries.levels, levels);
+    return std::nullopt;
+}
+
+std::optional<Error> ZemCodec::appendEntry(Entries& entries, std::string_view key,
+                                           std::span<const uint8_t> encodedValue, uint32_t levels) {
+    if (entries.bytes.size() + encodedValue.size() > UINT32_MAX - 10 - key.size())
+        return zemError(ZemErrorCode::FrameTooLarge, "dictionary entries kept exceed 4 GiB");
+    if (std::optional<Error> error = beginEntry(entries, key, levels)) return error;
+    entries.bytes.insert(entries.bytes.end(), encodedValue.begin(), encodedValue.end());
     return std::nullopt;
 }
 

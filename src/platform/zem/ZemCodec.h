@@ -72,6 +72,9 @@ class ZemCodec {
     // levels below the entry's dictionary. Entries must come in ascending key order.
     static std::optional<Error> appendEntry(Entries& entries, std::string_view key,
                                             std::span<const uint8_t> encodedValue, uint32_t levels);
+    // The same in two steps, for a value encoded straight into the entries: appends `key` as the start of a new
+    // entry, and the caller then appends the value's encoding to `bytes` before anything else is appended.
+    static std::optional<Error> beginEntry(Entries& entries, std::string_view key, uint32_t levels);
     // Appends the encoding of one dictionary made of `entries` and the entries of `extra` (a dictionary; anything
     // else counts as none), keys in ascending order as encode() writes them; an entry of `extra` takes the place of
     // a kept one with the same key. `depth` is the level of the dictionary within the value being encoded (0 when it
