@@ -243,6 +243,71 @@ TEST(LXBexilProxyTest, OldStyleBundleFallsBackToItsBexilDictionary) {
               str("b"));
 }
 
+// Guards the records' dictionaries read from text: they decode once, on first use from whichever thread, and the
+// text is then dropped, so what every later call sees must be that one decoding; text that does not decode, or
+// whose root is not a dictionary, reads as absent every time, and a value given beside text wins.
+TEST(LXBexilProxyTest, DictionariesDecodeOnceFromTextAndUnreadableTextStaysAbsent) {
+    Value info = Value::dictionary(
+        {{"RZExtension", Value::dictionary({{"RZExtensionAttributes", Value::dictionary({{"Flavour", str("salt")}})}})},
+         {"BDBundleIdentifier", str("com.example.dr\u00e9sser.long-identifier")}});
+    Value entitlements = Value::dictionary({{"com.example.entitled", Value::boolean(true)}});
+    for (int round = 0; round < 20; ++round) {
+        LXBexilProxy::Fields fields;
+        fields.infoVrecDocument = Document::write(info).value();
+        fields.entitlementsDocument = Document::write(entitlements).value();
+        LXBexilProxy proxy(std::move(fields));
+        std::optional<Value> seen[2];
+        std::optional<Value> seenEntitlements[2];
+        std::thread a([&] {
+            seen[0] = proxy.infoVrec();
+            seenEntitlements[0] = proxy.entitlements();
+        });
+        std::thread b([&] {
+            seenEntitlements[1] = proxy.entitlements();
+            seen[1] =
+                proxy.objectForInfoDictionaryKeyOfClassInScope("BDBundleIdentifier", std::nullopt, LXInfoScope::Info)
+                    ? proxy.infoVrec()
+                    : std::nullopt;
+        });
+        a.join();
+        b.join();
+        ASSERT_TRUE(seen[0] && seen[1] && seenEntitlements[0] && seenEntitlements[1]);
+        EXPECT_EQ(*seen[0], info);
+        EXPECT_TRUE(seen[0]->identical(*seen[1]));
+        EXPECT_TRUE(seenEntitlements[0]->identical(*seenEntitlements[1]));
+        EXPECT_EQ(*seenEntitlements[0], entitlements);
+        // Asked again after the text is gone, the same decoding answers.
+        EXPECT_TRUE(proxy.infoVrec()->identical(*seen[0]));
+        EXPECT_EQ(proxy.objectForInfoDictionaryKeyOfClassInScope("Flavour", ValueKind::String, LXInfoScope::Attributes),
+                  str("salt"));
+    }
+
+    for (std::string text : {std::string("<vrec version=\"1\"><dict><key>a</key>"), std::string("not a document"),
+                             Document::write(Value::array({str("x")})).value(), Document::write(str("x")).value()}) {
+        LXBexilProxy::Fields fields;
+        fields.infoVrecDocument = text;
+        fields.entitlementsDocument = text;
+        LXBexilProxy proxy(std::move(fields));
+        for (int twice = 0; twice < 2; ++twice) {
+            EXPECT_FALSE(proxy.infoVrec()) << text;
+            EXPECT_FALSE(proxy.bexilDictionary()) << text;
+            EXPECT_FALSE(proxy.entitlements()) << text;
+            EXPECT_FALSE(proxy.objectForInfoDictionaryKeyOfClassInScope("a", std::nullopt, LXInfoScope::Info));
+        }
+    }
+
+    LXBexilProxy::Fields both;
+    both.infoVrec = info;
+    both.infoVrecDocument = Document::write(Value::dictionary({{"other", str("text")}})).value();
+    both.entitlements = str("not a dictionary");
+    both.entitlementsDocument = Document::write(entitlements).value();
+    LXBexilProxy proxy(std::move(both));
+    ASSERT_TRUE(proxy.infoVrec());
+    EXPECT_TRUE(proxy.infoVrec()->identical(info));
+    // A value given wins over text even when it is not a dictionary: the record then has none.
+    EXPECT_FALSE(proxy.entitlements());
+}
+
 // Registering a bundle again is silent when nothing changed, keeps the UUID when only the content changed, and
 // makes a new record under a new UUID for a new version; every change is announced as uninstall then install, the
 // uninstall while the old record is still there, so that whoever caches records by UUID rebuilds them.

@@ -6,24 +6,39 @@
 
 namespace bexil {
 
-LXBexilProxy::LXBexilProxy(Fields fields) : fields_(std::move(fields)) {}
+LXBexilProxy::LXBexilProxy(Fields fields)
+    : fields_(std::move(fields)),
+      info_(std::move(fields_.infoVrec)),
+      entitlements_(std::move(fields_.entitlements)),
+      infoText_(std::move(fields_.infoVrecDocument)),
+      entitlementsText_(std::move(fields_.entitlementsDocument)) {
+    fields_.infoVrec.reset();
+    fields_.entitlements.reset();
+}
 
-std::optional<Value> LXBexilProxy::decodeDictionary(const std::optional<Value>& value, const std::string& document) {
-    if (value) return value->isDictionary() ? value : std::nullopt;
+std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, const std::string& document) {
+    if (value) return value->isDictionary() ? std::move(value) : std::nullopt;
     if (document.empty()) return std::nullopt;
     Result<Value> decoded = Document::read(document);
     if (!decoded.ok() || !decoded->isDictionary()) return std::nullopt;
     return std::move(decoded).value();
 }
 
+// The text is read only here, once: after decoding it is dropped, so that a record never keeps a dictionary twice
+// (the decoded one is the larger part of a cached plug-in record).
 const std::optional<Value>& LXBexilProxy::infoVrec() const {
-    std::call_once(infoDecoded_, [this] { info_ = decodeDictionary(fields_.infoVrec, fields_.infoVrecDocument); });
+    std::call_once(infoDecoded_, [this] {
+        info_ = decodeDictionary(std::move(info_), infoText_);
+        std::string().swap(infoText_);
+    });
     return info_;
 }
 
 const std::optional<Value>& LXBexilProxy::entitlements() const {
-    std::call_once(entitlementsDecoded_,
-                   [this] { entitlements_ = decodeDictionary(fields_.entitlements, fields_.entitlementsDocument); });
+    std::call_once(entitlementsDecoded_, [this] {
+        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_);
+        std::string().swap(entitlementsText_);
+    });
     return entitlements_;
 }
 

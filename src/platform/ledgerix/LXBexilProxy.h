@@ -95,13 +95,17 @@ class LXBexilProxy {
     std::string description() const;
 
   private:
-    static std::optional<Value> decodeDictionary(const std::optional<Value>& value, const std::string& document);
+    static std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string& document);
 
+    // Every field but the dictionaries, which live below: before their first use as the values or text given,
+    // afterwards as the decoded dictionaries alone (the text is dropped then).
     Fields fields_;
     mutable std::once_flag infoDecoded_;
     mutable std::once_flag entitlementsDecoded_;
     mutable std::optional<Value> info_;
     mutable std::optional<Value> entitlements_;
+    mutable std::string infoText_;
+    mutable std::string entitlementsText_;
 };
 
 }  // namespace bexil
