@@ -471,6 +471,18 @@ std::optional<Value> BXPlugInCore::textEntry(const Value& form, std::string_view
     return formOfKind(form, key, ValueKind::String);
 }
 
+std::optional<Value> BXPlugInCore::sharedText(const Value& text) {
+    if (!text.isString()) return std::nullopt;
+    return text;
+}
+
+void BXPlugInCore::shareIdentifier(const Value& text) { store(identifier_, sharedText(text)); }
+void BXPlugInCore::shareOriginalIdentifier(const Value& text) { store(originalIdentifier_, sharedText(text)); }
+void BXPlugInCore::shareUrl(const Value& text) { store(url_, sharedText(text)); }
+void BXPlugInCore::shareContainingUrl(const Value& text) { store(containingUrl_, sharedText(text)); }
+void BXPlugInCore::shareLocalizedName(const Value& text) { store(localizedName_, sharedText(text)); }
+void BXPlugInCore::shareLocalizedShortName(const Value& text) { store(localizedShortName_, sharedText(text)); }
+
 std::optional<std::string> BXPlugInCore::identifier() const { return loadText(identifier_); }
 void BXPlugInCore::setIdentifier(std::optional<std::string> v) { store(identifier_, textValue(std::move(v))); }
 std::optional<std::string> BXPlugInCore::originalIdentifier() const { return loadText(originalIdentifier_); }

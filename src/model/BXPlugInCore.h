@@ -194,6 +194,15 @@ class BXPlugInCore {
     void setRequirement(std::optional<std::string> v);
 
   protected:
+    // Counterparts of the text setters for a string Value made elsewhere (the registry's record), which the record
+    // then shares instead of keeping a copy of its own. Anything but a string makes the property absent.
+    void shareIdentifier(const Value& text);
+    void shareOriginalIdentifier(const Value& text);
+    void shareUrl(const Value& text);
+    void shareContainingUrl(const Value& text);
+    void shareLocalizedName(const Value& text);
+    void shareLocalizedShortName(const Value& text);
+
     // Reads and replaces one stored property under the record's lock; subclasses keep their own lazily made
     // properties the same way, without a lock of their own.
     template <typename T>
@@ -216,6 +225,7 @@ class BXPlugInCore {
     std::optional<std::string> loadText(const std::optional<Value>& field) const;
     static std::optional<Value> textValue(std::optional<std::string> text);
     static std::optional<Value> textEntry(const Value& form, std::string_view key);
+    static std::optional<Value> sharedText(const Value& text);
 
     // Guards every stored property, one at a time; never held while calling anything else.
     mutable std::mutex mutex_;

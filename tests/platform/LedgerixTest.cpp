@@ -233,6 +233,42 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
+// Guards the sharing of application records between the records of their plug-ins: plug-ins of one application
+// share one, never one of another application, and never one whose plug-in list was read before they were looked
+// up (it would miss plug-ins registered since); a record's own list stays the one it read.
+TEST_F(LedgerixRegistrationTest, PlugInsOfOneApplicationShareItsRecordUntilItsListIsRead) {
+    auto plugIn = [&](const std::string& app, int i) {
+        return writePlugIn(bundles_ / (app + ".app/PlugIns/P" + std::to_string(i) + ".bxplugin"),
+                           {.identifier = "com.example." + app + std::to_string(i)});
+    };
+    fs::path p0 = plugIn("App", 0), p1 = plugIn("App", 1), other = plugIn("Other", 0);
+    for (const fs::path& path : {p0, p1, other}) registerOK(path);
+
+    std::shared_ptr<const LXBexilProxy> a = workspace_->plugInProxyForURL(p0.string());
+    std::shared_ptr<const LXBexilProxy> b = workspace_->plugInProxyForURL(p1.string());
+    std::shared_ptr<const LXBexilProxy> c = workspace_->plugInProxyForURL(other.string());
+    ASSERT_TRUE(a && b && c && a->containingBundle() && c->containingBundle());
+    EXPECT_EQ(a->containingBundle(), b->containingBundle());
+    EXPECT_NE(a->containingBundle(), c->containingBundle());
+    EXPECT_EQ(c->containingBundle()->bundleURL(), fs::canonical(bundles_ / "Other.app").string());
+    EXPECT_EQ(a->containingBundle()->plugIns().size(), 2u);
+
+    fs::path p2 = plugIn("App", 2);
+    registerOK(p2);
+    std::shared_ptr<const LXBexilProxy> d = workspace_->plugInProxyForURL(p2.string());
+    ASSERT_TRUE(d && d->containingBundle());
+    EXPECT_NE(d->containingBundle(), a->containingBundle());
+    EXPECT_EQ(d->containingBundle()->bundleURL(), a->containingBundle()->bundleURL());
+    EXPECT_EQ(d->containingBundle()->plugIns().size(), 3u);
+    EXPECT_EQ(a->containingBundle()->plugIns().size(), 2u);
+    // Shared again by the next record while its list is unread.
+    std::shared_ptr<const LXBexilProxy> e = workspace_->plugInProxyForURL(p0.string());
+    std::shared_ptr<const LXBexilProxy> f = workspace_->plugInProxyForURL(p1.string());
+    ASSERT_TRUE(e && f);
+    EXPECT_EQ(e->containingBundle(), f->containingBundle());
+    EXPECT_NE(e->containingBundle(), d->containingBundle());
+}
+
 // Guards old-style bundles: their "Bexil" dictionary stands in for the plug-in dictionary.
 TEST(LXBexilProxyTest, OldStyleBundleFallsBackToItsBexilDictionary) {
     LXBexilProxy::Fields oldStyle;

@@ -1,20 +1,40 @@
 #include "platform/ledgerix/LXBexilProxy.h"
 
+#include <initializer_list>
 #include <utility>
 
 #include "base/Document.h"
 
 namespace bexil {
 
-LXBexilProxy::LXBexilProxy(Fields fields)
-    : fields_(std::move(fields)),
-      info_(std::move(fields_.infoVrec)),
-      entitlements_(std::move(fields_.entitlements)),
-      infoText_(std::move(fields_.infoVrecDocument)),
-      entitlementsText_(std::move(fields_.entitlementsDocument)) {
-    fields_.infoVrec.reset();
-    fields_.entitlements.reset();
+namespace {
+// A string Value of `text`, or null when absent; equal texts given side by side (the registry gives a plug-in's
+// identifiers so) share one.
+Value textValue(std::optional<std::string>& text, std::initializer_list<const Value*> earlier = {}) {
+    if (!text) return Value();
+    for (const Value* other : earlier)
+        if (other->isString() && other->stringView() == *text) return *other;
+    return Value::string(std::move(*text));
 }
+}  // namespace
+
+LXBexilProxy::LXBexilProxy(Fields fields)
+    : bundleURL_(textValue(fields.bundleURL)),
+      pluginIdentifier_(textValue(fields.pluginIdentifier)),
+      originalIdentifier_(textValue(fields.originalIdentifier, {&pluginIdentifier_})),
+      bundleIdentifier_(textValue(fields.bundleIdentifier, {&originalIdentifier_, &pluginIdentifier_})),
+      bundleVersion_(textValue(fields.bundleVersion)),
+      dataContainerURL_(textValue(fields.dataContainerURL)),
+      localizedName_(textValue(fields.localizedName)),
+      localizedShortName_(textValue(fields.localizedShortName, {&localizedName_})),
+      containingBundle_(std::move(fields.containingBundle)),
+      registrationDate_(fields.registrationDate),
+      pluginUUID_(fields.pluginUUID),
+      isOnSystemPartition_(fields.isOnSystemPartition),
+      info_(std::move(fields.infoVrec)),
+      entitlements_(std::move(fields.entitlements)),
+      infoText_(std::move(fields.infoVrecDocument)),
+      entitlementsText_(std::move(fields.entitlementsDocument)) {}
 
 std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, const std::string& document) {
     if (value) return value->isDictionary() ? std::move(value) : std::nullopt;
@@ -98,11 +118,11 @@ std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std:
 
 std::string LXBexilProxy::description() const {
     std::string text = "<plug-in ";
-    text += fields_.pluginIdentifier.value_or("(no identifier)");
+    text += pluginIdentifier_.isString() ? pluginIdentifier_.stringView() : "(no identifier)";
     text += ' ';
-    text += fields_.pluginUUID ? fields_.pluginUUID->string() : std::string("(no uuid)");
+    text += pluginUUID_ ? pluginUUID_->string() : std::string("(no uuid)");
     text += ' ';
-    text += fields_.bundleURL.value_or("(no path)");
+    text += bundleURL_.isString() ? bundleURL_.stringView() : "(no path)";
     text += '>';
     return text;
 }
