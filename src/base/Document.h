@@ -9,6 +9,7 @@
 #include <cstddef>
 #include <filesystem>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -47,6 +48,10 @@ class Document {
     // The value a document holds. Malformed text is an error naming what is wrong, where it is in the value
     // (root["key"][index]) and its byte offset; no partial value is ever returned.
     static Result<Value> read(std::string_view text);
+    // The same, where every string of the value equal to one of `known` (string Values the caller already holds)
+    // is that Value itself rather than a copy: a record that keeps texts from its document beside the document's
+    // value then keeps each once.
+    static Result<Value> read(std::string_view text, std::span<const Value> known);
     // The document text of a value. A value that cannot be represented (see docs/vrec.md) is an error naming
     // where it is; nothing is silently dropped or changed.
     static Result<std::string> write(const Value& value);

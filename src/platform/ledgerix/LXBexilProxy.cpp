@@ -16,6 +16,12 @@ Value textValue(std::optional<std::string>& text, std::initializer_list<const Va
         if (other->isString() && other->stringView() == *text) return *other;
     return Value::string(std::move(*text));
 }
+
+// Text is kept apart until it is decoded, and not at all when there is none.
+std::unique_ptr<const std::string> pendingText(std::string& text) {
+    if (text.empty()) return nullptr;
+    return std::make_unique<const std::string>(std::move(text));
+}
 }  // namespace
 
 LXBexilProxy::LXBexilProxy(Fields fields)
@@ -33,13 +39,14 @@ LXBexilProxy::LXBexilProxy(Fields fields)
       isOnSystemPartition_(fields.isOnSystemPartition),
       info_(std::move(fields.infoVrec)),
       entitlements_(std::move(fields.entitlements)),
-      infoText_(std::move(fields.infoVrecDocument)),
-      entitlementsText_(std::move(fields.entitlementsDocument)) {}
+      infoText_(pendingText(fields.infoVrecDocument)),
+      entitlementsText_(pendingText(fields.entitlementsDocument)) {}
 
-std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, const std::string& document) {
+std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, const std::string* document,
+                                                    std::span<const Value> known) {
     if (value) return value->isDictionary() ? std::move(value) : std::nullopt;
-    if (document.empty()) return std::nullopt;
-    Result<Value> decoded = Document::read(document);
+    if (document == nullptr) return std::nullopt;
+    Result<Value> decoded = Document::read(*document, known);
     if (!decoded.ok() || !decoded->isDictionary()) return std::nullopt;
     return std::move(decoded).value();
 }
@@ -48,16 +55,20 @@ std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, 
 // (the decoded one is the larger part of a cached plug-in record).
 const std::optional<Value>& LXBexilProxy::infoVrec() const {
     std::call_once(infoDecoded_, [this] {
-        info_ = decodeDictionary(std::move(info_), infoText_);
-        std::string().swap(infoText_);
+        // The information dictionary repeats the identifiers, version and names this record holds: the decoded
+        // dictionary shares their Values.
+        const Value known[] = {pluginIdentifier_, bundleIdentifier_, bundleVersion_, localizedName_,
+                               localizedShortName_};
+        info_ = decodeDictionary(std::move(info_), infoText_.get(), known);
+        infoText_.reset();
     });
     return info_;
 }
 
 const std::optional<Value>& LXBexilProxy::entitlements() const {
     std::call_once(entitlementsDecoded_, [this] {
-        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_);
-        std::string().swap(entitlementsText_);
+        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_.get(), {});
+        entitlementsText_.reset();
     });
     return entitlements_;
 }

@@ -11,6 +11,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -103,7 +104,8 @@ class LXBexilProxy {
     std::string description() const;
 
   private:
-    static std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string& document);
+    static std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string* document,
+                                                 std::span<const Value> known);
     static std::optional<std::string> text(const Value& value) {
         if (!value.isString()) return std::nullopt;
         return std::string(value.stringView());
@@ -127,8 +129,8 @@ class LXBexilProxy {
     // alone (the text is dropped then).
     mutable std::optional<Value> info_;
     mutable std::optional<Value> entitlements_;
-    mutable std::string infoText_;
-    mutable std::string entitlementsText_;
+    mutable std::unique_ptr<const std::string> infoText_;
+    mutable std::unique_ptr<const std::string> entitlementsText_;
 };
 
 }  // namespace bexil
