@@ -233,6 +233,49 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
+// Guards the strings a decoded information dictionary shares: with the record's own identifier and name, and
+// short strings with other records' dictionaries (each record still reads back exactly what its text says, odd
+// texts too); a long string is every record's own.
+TEST(LXBexilProxyTest, DecodedDictionariesShareTheRecordsTextsAndRepeatedShortStrings) {
+    const std::string longText(200, 'x');
+    auto proxyFor = [&](const std::string& identifier) {
+        LXBexilProxy::Fields fields;
+        fields.pluginIdentifier = identifier;
+        fields.bundleIdentifier = identifier;
+        fields.localizedName = "Name \xc3\xa9";
+        fields.infoVrecDocument =
+            Document::write(
+                Value::dictionary(
+                    {{"BDBundleIdentifier", str(identifier)},
+                     {"BDBundleName", str("Name \xc3\xa9")},
+                     {"RZExtension", Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.point.shared")},
+                                                        {"Long", str(longText)},
+                                                        {"Empty", str("")},
+                                                        {"List", Value::array({str("\xe2\x9c\x93")})}})}}))
+                .value();
+        return std::make_shared<LXBexilProxy>(std::move(fields));
+    };
+    auto a = proxyFor("com.example.first.plug-in"), b = proxyFor("com.example.second.plug-in");
+    ASSERT_TRUE(a->infoVrec() && b->infoVrec());
+    EXPECT_EQ(a->infoVrec()->get("BDBundleIdentifier"), str("com.example.first.plug-in"));
+    EXPECT_TRUE(a->infoVrec()->get("BDBundleIdentifier").identical(a->pluginIdentifierValue()));
+    EXPECT_TRUE(a->infoVrec()->get("BDBundleName").identical(a->localizedNameValue()));
+    EXPECT_EQ(b->infoVrec()->get("BDBundleIdentifier"), str("com.example.second.plug-in"));
+    Value pointA = a->objectForInfoDictionaryKeyOfClassInScope("RZExtensionPointIdentifier", ValueKind::String,
+                                                               LXInfoScope::PlugIn)
+                       .value();
+    Value pointB = b->objectForInfoDictionaryKeyOfClassInScope("RZExtensionPointIdentifier", ValueKind::String,
+                                                               LXInfoScope::PlugIn)
+                       .value();
+    EXPECT_EQ(pointA, str("com.example.point.shared"));
+    EXPECT_TRUE(pointA.identical(pointB));
+    Value plugInA = *a->bexilDictionary(), plugInB = *b->bexilDictionary();
+    EXPECT_EQ(plugInA.get("Long").stringView(), longText);
+    EXPECT_FALSE(plugInA.get("Long").identical(plugInB.get("Long")));
+    EXPECT_EQ(plugInA.get("Empty"), str(""));
+    EXPECT_EQ(plugInB.get("List"), Value::array({str("\xe2\x9c\x93")}));
+}
+
 // Guards the sharing of application records between the records of their plug-ins: plug-ins of one application
 // share one, never one of another application, and never one whose plug-in list was read before they were looked
 // up (it would miss plug-ins registered since); a record's own list stays the one it read.

@@ -1,6 +1,8 @@
 #include "platform/ledgerix/LXBexilProxy.h"
 
 #include <initializer_list>
+#include <mutex>
+#include <unordered_map>
 #include <utility>
 
 #include "base/Document.h"
@@ -42,24 +44,62 @@ LXBexilProxy::LXBexilProxy(Fields fields)
       infoText_(pendingText(fields.infoVrecDocument)),
       entitlementsText_(pendingText(fields.entitlementsDocument)) {}
 
-std::optional<Value> LXBexilProxy::decodeDictionary(std::optional<Value> value, const std::string* document,
-                                                    std::span<const Value> known) {
+namespace {
+
+// The given value when it is a dictionary, else the document decoded when it holds one, else none.
+std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string* document,
+                                      const Document::StringMaker& makeString) {
     if (value) return value->isDictionary() ? std::move(value) : std::nullopt;
     if (document == nullptr) return std::nullopt;
-    Result<Value> decoded = Document::read(*document, known);
+    Result<Value> decoded = Document::read(*document, makeString);
     if (!decoded.ok() || !decoded->isDictionary()) return std::nullopt;
     return std::move(decoded).value();
 }
+
+// Strings that information dictionaries repeat from plug-in to plug-in (extension points, protocols, classes,
+// versions, flags) are kept once for the process: the first kSharedStrings short strings decoded are kept for
+// good and handed out to every later dictionary that has them. The bound keeps what is kept small (well under a
+// megabyte) whatever the registry holds; strings met after it is reached are each a Value of their own again.
+class SharedStrings {
+  public:
+    static constexpr size_t kSharedStrings = 4096;
+    static constexpr size_t kLongestShared = 64;
+
+    Value make(std::string&& text) {
+        if (text.size() > kLongestShared) return Value::string(std::move(text));
+        std::lock_guard lock(mutex_);
+        if (auto it = strings_.find(std::string_view(text)); it != strings_.end()) return it->second;
+        Value made = Value::string(std::move(text));
+        // The key views the Value's own text, which never changes or moves while the Value is kept here.
+        if (strings_.size() < kSharedStrings) strings_.emplace(made.stringView(), made);
+        return made;
+    }
+
+  private:
+    std::mutex mutex_;
+    std::unordered_map<std::string_view, Value> strings_;
+};
+
+SharedStrings& sharedStrings() {
+    static SharedStrings* strings = new SharedStrings;  // never destroyed: records may outlive static destructors
+    return *strings;
+}
+
+}  // namespace
 
 // The text is read only here, once: after decoding it is dropped, so that a record never keeps a dictionary twice
 // (the decoded one is the larger part of a cached plug-in record).
 const std::optional<Value>& LXBexilProxy::infoVrec() const {
     std::call_once(infoDecoded_, [this] {
         // The information dictionary repeats the identifiers, version and names this record holds: the decoded
-        // dictionary shares their Values.
-        const Value known[] = {pluginIdentifier_, bundleIdentifier_, bundleVersion_, localizedName_,
-                               localizedShortName_};
-        info_ = decodeDictionary(std::move(info_), infoText_.get(), known);
+        // dictionary shares their Values, and those of the strings that other plug-ins' dictionaries have too.
+        auto makeString = [this](std::string&& text) -> Value {
+            for (const Value* known :
+                 {&pluginIdentifier_, &bundleIdentifier_, &bundleVersion_, &localizedName_, &localizedShortName_})
+                if (known->isString() && known->stringView() == text) return *known;
+            return sharedStrings().make(std::move(text));
+        };
+        info_ = decodeDictionary(std::move(info_), infoText_.get(), makeString);
         infoText_.reset();
     });
     return info_;
@@ -67,7 +107,8 @@ const std::optional<Value>& LXBexilProxy::infoVrec() const {
 
 const std::optional<Value>& LXBexilProxy::entitlements() const {
     std::call_once(entitlementsDecoded_, [this] {
-        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_.get(), {});
+        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_.get(),
+                                         [](std::string&& text) { return Value::string(std::move(text)); });
         entitlementsText_.reset();
     });
     return entitlements_;

@@ -11,7 +11,6 @@
 #include <memory>
 #include <mutex>
 #include <optional>
-#include <span>
 #include <string>
 #include <string_view>
 
@@ -104,8 +103,6 @@ class LXBexilProxy {
     std::string description() const;
 
   private:
-    static std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string* document,
-                                                 std::span<const Value> known);
     static std::optional<std::string> text(const Value& value) {
         if (!value.isString()) return std::nullopt;
         return std::string(value.stringView());
