@@ -6,10 +6,10 @@
 // in-use bytes that emptying the cache gives back (the records alone, without what the registry's own page cache
 // grew by), and how much of that is the registry's record of the plug-in, which each cached record keeps (the same
 // look-ups held as registry records only), and what decoding those records' dictionaries adds to them (the decoded
-// dictionaries less the text they replace; the rest of a cached record is the daemon's own). BM_PurgeFullCache empties the full cache and reports the purging
-// thread's stall (CPU time and wall-clock) and how the writer then frees the records: in total, and its longest
-// block, the longest a write queued meanwhile waits. The small registry lives under the temporary directory, the
-// large one on /dev/shm when there is one (see LargeRegistry.h).
+// dictionaries less the text they replace; the rest of a cached record is the daemon's own). BM_PurgeFullCache empties
+// the full cache and reports the purging thread's stall (CPU time and wall-clock) and how the writer then frees the
+// records: in total, and its longest block, the longest a write queued meanwhile waits. The small registry lives under
+// the temporary directory, the large one on /dev/shm when there is one (see LargeRegistry.h).
 //
 //     cmake --build --preset release --target database_bench
 //     build/release/bench/database_bench [--benchmark_filter=Large|Memory]
