@@ -8,6 +8,7 @@
 
 #include <cstddef>
 #include <filesystem>
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -47,6 +48,11 @@ class Document {
     // The value a document holds. Malformed text is an error naming what is wrong, where it is in the value
     // (root["key"][index]) and its byte offset; no partial value is ever returned.
     static Result<Value> read(std::string_view text);
+    // The same, with the string Values of the document made by `makeString` from their text (which it may take)
+    // rather than each a new Value: a caller that already holds equal strings can hand those out, so that a record
+    // keeping texts beside the document's value keeps each once. It must return a string Value of that text.
+    using StringMaker = std::function<Value(std::string&& text)>;
+    static Result<Value> read(std::string_view text, const StringMaker& makeString);
     // The document text of a value. A value that cannot be represented (see docs/vrec.md) is an error naming
     // where it is; nothing is silently dropped or changed.
     static Result<std::string> write(const Value& value);

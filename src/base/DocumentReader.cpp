@@ -41,7 +41,7 @@ Error fileError(int err, std::string_view operation, const std::filesystem::path
 
 class Reader {
   public:
-    explicit Reader(std::string_view text) : text_(text) {}
+    Reader(std::string_view text, const Document::StringMaker* makeString) : text_(text), makeString_(makeString) {}
 
     Result<Value> run() {
         if (text_.size() > kMaxDocumentBytes) {
@@ -179,7 +179,7 @@ class Reader {
 
         auto text = textOf(node);
         if (!text) return std::nullopt;
-        if (name == "string") return Value::string(std::move(*text));
+        if (name == "string") return makeString_ ? (*makeString_)(std::move(*text)) : Value::string(std::move(*text));
         if (name == "data") {
             auto bytes = decodeDataText(*text);
             if (auto* problem = std::get_if<std::string>(&bytes))
@@ -278,6 +278,7 @@ class Reader {
     }
 
     std::string_view text_;
+    const Document::StringMaker* makeString_;
     pugi::xml_document document_;
     std::vector<PathStep> path_;
     std::optional<Error> error_;
@@ -285,7 +286,10 @@ class Reader {
 
 }  // namespace
 
-Result<Value> Document::read(std::string_view text) { return Reader(text).run(); }
+Result<Value> Document::read(std::string_view text) { return Reader(text, nullptr).run(); }
+Result<Value> Document::read(std::string_view text, const StringMaker& makeString) {
+    return Reader(text, &makeString).run();
+}
 
 Result<Value> Document::readFile(const std::filesystem::path& path) {
     // Not blocking, so that opening a pipe returns at once; for a regular file the flag changes nothing.

@@ -11,7 +11,9 @@
 #include <cstring>
 #include <ctime>
 #include <functional>
+#include <new>
 #include <stdexcept>
+#include <type_traits>
 
 #include "base/Text.h"
 
@@ -20,9 +22,12 @@ namespace bexil {
 // Scalars live inline in the Value; everything else lives in a reference-counted node that is never edited after
 // it has been built, which is what makes sharing across threads safe without locks.
 namespace detail {
+// Nodes carry no type of their own: the Value that points at one knows its kind, and that chooses how it is freed.
+// Arrays and dictionaries keep their elements in the same allocation as the node, sized exactly: a record caches
+// many small dictionaries, and a separate vector (with its spare capacity) would double their allocations.
 struct Node {
     std::atomic<uint32_t> refs{1};
-    virtual ~Node() = default;
+    uint32_t count = 0;  // elements of an array or dictionary
 };
 struct StringNode final : Node {
     explicit StringNode(std::string s) : text(std::move(s)) {}
@@ -36,14 +41,53 @@ struct UuidNode final : Node {
     explicit UuidNode(const Uuid& u) : uuid(u) {}
     Uuid uuid;
 };
-struct ArrayNode final : Node {
-    explicit ArrayNode(std::vector<Value> v) : items(std::move(v)) {}
-    std::vector<Value> items;
+
+// A node followed by `count` elements of type T.
+template <typename T>
+struct SequenceNode final : Node {
+    static_assert(alignof(T) <= alignof(Node) || sizeof(Node) % alignof(T) == 0);
+    T* begin() { return reinterpret_cast<T*>(reinterpret_cast<char*>(this) + sizeof(Node)); }
+    const T* begin() const { return reinterpret_cast<const T*>(reinterpret_cast<const char*>(this) + sizeof(Node)); }
+    std::span<const T> elements() const { return {begin(), count}; }
+
+    // Moves the elements of `from` into a new node.
+    static SequenceNode* make(std::vector<T>&& from) {
+        if (from.size() > UINT32_MAX) throw std::length_error("Value: too many elements");
+        void* memory = ::operator new(sizeof(Node) + from.size() * sizeof(T));
+        auto* node = new (memory) SequenceNode();
+        T* out = node->begin();
+        static_assert(std::is_nothrow_move_constructible_v<T>);
+        for (T& element : from) {
+            new (out + node->count) T(std::move(element));
+            ++node->count;
+        }
+        return node;
+    }
+    static SequenceNode* copy(std::span<const T> from) {
+        if (from.size() > UINT32_MAX) throw std::length_error("Value: too many elements");
+        void* memory = ::operator new(sizeof(Node) + from.size() * sizeof(T));
+        auto* node = new (memory) SequenceNode();
+        T* out = node->begin();
+        try {
+            for (const T& element : from) {
+                new (out + node->count) T(element);
+                ++node->count;
+            }
+        } catch (...) {
+            destroy(node);
+            throw;
+        }
+        return node;
+    }
+    static void destroy(SequenceNode* node) {
+        T* elements = node->begin();
+        for (uint32_t i = node->count; i > 0; --i) elements[i - 1].~T();
+        node->~SequenceNode();
+        ::operator delete(node);
+    }
 };
-struct DictionaryNode final : Node {
-    explicit DictionaryNode(std::vector<DictionaryEntry> e) : entries(std::move(e)) {}
-    std::vector<DictionaryEntry> entries;
-};
+using ArrayNode = SequenceNode<Value>;
+using DictionaryNode = SequenceNode<DictionaryEntry>;
 }  // namespace detail
 
 using detail::ArrayNode;
@@ -82,6 +126,28 @@ const char* valueKindName(ValueKind kind) {
 
 // ---- Value: lifetime ----
 
+static void destroyNode(ValueKind kind, detail::Node* node) noexcept {
+    switch (kind) {
+        case ValueKind::String:
+            delete static_cast<StringNode*>(node);
+            return;
+        case ValueKind::Data:
+            delete static_cast<DataNode*>(node);
+            return;
+        case ValueKind::Uuid:
+            delete static_cast<UuidNode*>(node);
+            return;
+        case ValueKind::Array:
+            ArrayNode::destroy(static_cast<ArrayNode*>(node));
+            return;
+        case ValueKind::Dictionary:
+            DictionaryNode::destroy(static_cast<DictionaryNode*>(node));
+            return;
+        default:
+            return;
+    }
+}
+
 Value::Value(const Value& other) noexcept : kind_(other.kind_), scalar_(other.scalar_) { retain(); }
 
 Value::Value(Value&& other) noexcept : kind_(other.kind_), scalar_(other.scalar_) {
@@ -118,7 +184,7 @@ void Value::retain() const noexcept {
 
 void Value::release() noexcept {
     if (holdsNode()) {
-        if (scalar_.node->refs.fetch_sub(1, std::memory_order_acq_rel) == 1) delete scalar_.node;
+        if (scalar_.node->refs.fetch_sub(1, std::memory_order_acq_rel) == 1) destroyNode(kind_, scalar_.node);
         kind_ = ValueKind::Null;
         scalar_.u = 0;
     }
@@ -164,7 +230,7 @@ Value Value::data(std::span<const uint8_t> bytes) {
 }
 Value Value::data(std::vector<uint8_t>&& bytes) { return Value(ValueKind::Data, new DataNode(std::move(bytes))); }
 Value Value::uuid(const Uuid& u) { return Value(ValueKind::Uuid, new UuidNode(u)); }
-Value Value::array(std::vector<Value> items) { return Value(ValueKind::Array, new ArrayNode(std::move(items))); }
+Value Value::array(std::vector<Value> items) { return Value(ValueKind::Array, ArrayNode::make(std::move(items))); }
 
 static bool entryLess(const DictionaryEntry& a, const DictionaryEntry& b) { return a.key < b.key; }
 
@@ -182,11 +248,11 @@ Value Value::dictionary(std::vector<std::pair<std::string, Value>> pairs) {
         else
             unique.push_back(std::move(e));
     }
-    return Value(ValueKind::Dictionary, new DictionaryNode(std::move(unique)));
+    return Value(ValueKind::Dictionary, DictionaryNode::make(std::move(unique)));
 }
 
-Value Value::emptyDictionary() { return Value(ValueKind::Dictionary, new DictionaryNode({})); }
-Value Value::emptyArray() { return Value(ValueKind::Array, new ArrayNode({})); }
+Value Value::emptyDictionary() { return Value(ValueKind::Dictionary, DictionaryNode::make({})); }
+Value Value::emptyArray() { return Value(ValueKind::Array, ArrayNode::make({})); }
 
 // ---- Value: access ----
 
@@ -287,12 +353,12 @@ std::optional<double> Value::numberAsDouble() const {
 
 std::span<const Value> Value::items() const {
     if (kind_ != ValueKind::Array) return {};
-    return static_cast<const ArrayNode*>(scalar_.node)->items;
+    return static_cast<const ArrayNode*>(scalar_.node)->elements();
 }
 
 std::span<const DictionaryEntry> Value::entries() const {
     if (kind_ != ValueKind::Dictionary) return {};
-    return static_cast<const DictionaryNode*>(scalar_.node)->entries;
+    return static_cast<const DictionaryNode*>(scalar_.node)->elements();
 }
 
 size_t Value::count() const {
@@ -581,9 +647,9 @@ const Value* MutableDictionary::find(std::string_view key) const {
     return e ? &e->value : nullptr;
 }
 
-Value MutableDictionary::value() const { return Value(ValueKind::Dictionary, new DictionaryNode(entries_)); }
+Value MutableDictionary::value() const { return Value(ValueKind::Dictionary, DictionaryNode::copy(entries_)); }
 Value MutableDictionary::take() {
-    Value v(ValueKind::Dictionary, new DictionaryNode(std::move(entries_)));
+    Value v(ValueKind::Dictionary, DictionaryNode::make(std::move(entries_)));
     entries_.clear();
     return v;
 }
@@ -593,9 +659,9 @@ MutableArray::MutableArray(const Value& array) {
     items_.assign(i.begin(), i.end());
 }
 void MutableArray::append(Value value) { items_.push_back(std::move(value)); }
-Value MutableArray::value() const { return Value(ValueKind::Array, new ArrayNode(items_)); }
+Value MutableArray::value() const { return Value(ValueKind::Array, ArrayNode::copy(items_)); }
 Value MutableArray::take() {
-    Value v(ValueKind::Array, new ArrayNode(std::move(items_)));
+    Value v(ValueKind::Array, ArrayNode::make(std::move(items_)));
     items_.clear();
     return v;
 }

@@ -106,6 +106,11 @@ void setIfPresent(MutableDictionary& out, std::string_view key, const std::optio
     if (v) out.set(key, *v);
 }
 
+// A text property: null when absent.
+void setIfPresent(MutableDictionary& out, std::string_view key, const Value& text) {
+    if (text.isString()) out.set(key, text);
+}
+
 }  // namespace
 
 // ---- Construction ----
@@ -272,7 +277,7 @@ void BXPlugInCore::setAnnotationValue(std::string_view key, const std::optional<
     for (;;) {
         std::optional<Value> before = annotations();
         std::optional<Value> after = dictionaryChangingTo(before, key, value);
-        std::lock_guard<std::mutex> guard(mutex_);
+        std::lock_guard<std::mutex> guard(mutex());
         bool unchanged =
             before.has_value() == annotations_.has_value() && (!before || before->identical(*annotations_));
         if (unchanged) {
@@ -456,20 +461,39 @@ void BXPlugInCore::updateFromForm(const Value& form) {
 
 // ---- Stored properties ----
 
-std::optional<std::string> BXPlugInCore::loadText(const std::optional<Value>& field) const {
-    std::optional<Value> v = load(field);
-    if (!v) return std::nullopt;
-    return std::string(v->stringView());
+std::mutex& BXPlugInCore::mutex() const {
+    // Enough locks that records rarely share one; each on its own cache line.
+    struct alignas(64) Lock {
+        std::mutex mutex;
+    };
+    static Lock locks[64];
+    auto address = reinterpret_cast<uintptr_t>(this);
+    return locks[(address >> 6 ^ address >> 12) % 64].mutex;
 }
 
-std::optional<Value> BXPlugInCore::textValue(std::optional<std::string> text) {
-    if (!text) return std::nullopt;
+std::optional<std::string> BXPlugInCore::loadText(const Value& field) const {
+    Value v = load(field);
+    if (!v.isString()) return std::nullopt;
+    return std::string(v.stringView());
+}
+
+Value BXPlugInCore::textValue(std::optional<std::string> text) {
+    if (!text) return Value();
     return Value::string(std::move(*text));
 }
 
-std::optional<Value> BXPlugInCore::textEntry(const Value& form, std::string_view key) {
-    return formOfKind(form, key, ValueKind::String);
+Value BXPlugInCore::textEntry(const Value& form, std::string_view key) {
+    return formOfKind(form, key, ValueKind::String).value_or(Value());
 }
+
+Value BXPlugInCore::sharedText(const Value& text) { return text.isString() ? text : Value(); }
+
+void BXPlugInCore::shareIdentifier(const Value& text) { store(identifier_, sharedText(text)); }
+void BXPlugInCore::shareOriginalIdentifier(const Value& text) { store(originalIdentifier_, sharedText(text)); }
+void BXPlugInCore::shareUrl(const Value& text) { store(url_, sharedText(text)); }
+void BXPlugInCore::shareContainingUrl(const Value& text) { store(containingUrl_, sharedText(text)); }
+void BXPlugInCore::shareLocalizedName(const Value& text) { store(localizedName_, sharedText(text)); }
+void BXPlugInCore::shareLocalizedShortName(const Value& text) { store(localizedShortName_, sharedText(text)); }
 
 std::optional<std::string> BXPlugInCore::identifier() const { return loadText(identifier_); }
 void BXPlugInCore::setIdentifier(std::optional<std::string> v) { store(identifier_, textValue(std::move(v))); }

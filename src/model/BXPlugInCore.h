@@ -4,8 +4,8 @@
 // in serialised form. It names a bundle, holds its information dictionaries and the facts its builder supplied, and
 // derives the plug-in's configuration from three primitive look-ups (infoKey, pluginKey, attribute) that a subclass
 // may redirect. Records are shared through std::shared_ptr between queues: each stored property is read and written
-// atomically on its own (a small per-record lock, never held across records or while calling out), so any thread may
-// read a record while another replaces, say, its annotations.
+// atomically on its own (under one of a fixed set of locks, never held across records or while calling out), so any
+// thread may read a record while another replaces, say, its annotations.
 //
 // URLs are kept as file-system paths (std::string): every URL a record holds is a file URL, and the path is all that
 // anyone reads from it. Dictionaries are Values holding a dictionary, shared by reference count and never edited in
@@ -194,11 +194,20 @@ class BXPlugInCore {
     void setRequirement(std::optional<std::string> v);
 
   protected:
+    // Counterparts of the text setters for a string Value made elsewhere (the registry's record), which the record
+    // then shares instead of keeping a copy of its own. Anything but a string makes the property absent.
+    void shareIdentifier(const Value& text);
+    void shareOriginalIdentifier(const Value& text);
+    void shareUrl(const Value& text);
+    void shareContainingUrl(const Value& text);
+    void shareLocalizedName(const Value& text);
+    void shareLocalizedShortName(const Value& text);
+
     // Reads and replaces one stored property under the record's lock; subclasses keep their own lazily made
     // properties the same way, without a lock of their own.
     template <typename T>
     T load(const T& field) const {
-        std::lock_guard<std::mutex> guard(mutex_);
+        std::lock_guard<std::mutex> guard(mutex());
         return field;
     }
     template <typename T>
@@ -206,36 +215,40 @@ class BXPlugInCore {
         // The old value is released outside the lock: dropping the last reference to a large dictionary may take a
         // while and must not stall readers of the other properties.
         {
-            std::lock_guard<std::mutex> guard(mutex_);
+            std::lock_guard<std::mutex> guard(mutex());
             std::swap(field, value);
         }
     }
 
   private:
     // Text properties are kept as string Values so that exporting and reading forms share them instead of copying.
-    std::optional<std::string> loadText(const std::optional<Value>& field) const;
-    static std::optional<Value> textValue(std::optional<std::string> text);
-    static std::optional<Value> textEntry(const Value& form, std::string_view key);
+    // Text properties hold only strings, so a null Value stands for an absent one (8 bytes less per property than
+    // an optional, which a cache of many records notices).
+    std::optional<std::string> loadText(const Value& field) const;
+    static Value textValue(std::optional<std::string> text);
+    static Value textEntry(const Value& form, std::string_view key);
+    static Value sharedText(const Value& text);
+    // One lock of a fixed set, chosen by the record's address: records are many, and a lock each would be a large
+    // part of one. Never held while taking another, so records sharing one cannot deadlock.
+    std::mutex& mutex() const;
 
-    // Guards every stored property, one at a time; never held while calling anything else.
-    mutable std::mutex mutex_;
-    std::optional<Value> identifier_;
-    std::optional<Value> originalIdentifier_;
-    std::optional<Value> url_;
+    Value identifier_;
+    Value originalIdentifier_;
+    Value url_;
     std::optional<Value> bundleInfoDictionary_;
     std::optional<Value> plugInDictionary_;
     std::optional<Value> entitlements_;
     std::optional<Value> annotations_;
-    std::optional<Value> containingUrl_;
+    Value containingUrl_;
     bool onSystemVolume_ = false;
     uint32_t hubProtocolVersion_ = 0;
-    std::optional<Value> localizedName_;
-    std::optional<Value> localizedShortName_;
-    std::optional<Value> localizedContainingName_;
+    Value localizedName_;
+    Value localizedShortName_;
+    Value localizedContainingName_;
     int32_t lastModified_ = 0;
     std::optional<Uuid> uuid_;
     std::optional<Value> cdhash_;
-    std::optional<Value> requirement_;
+    Value requirement_;
 };
 
 // Identity of records by UUID, for std::unordered_set/map keyed by shared records. An empty pointer equals only an

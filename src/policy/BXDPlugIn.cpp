@@ -79,9 +79,13 @@ std::shared_ptr<BXDPlugIn> BXDPlugIn::initWithLXData(std::shared_ptr<const LXBex
     if (!record->plugInDictionary() && plugInDictionary && plugInDictionary->isDictionary())
         record->setPlugInDictionary(*plugInDictionary);
 
+    // The texts the registry's record already holds are shared rather than copied: a cached record would otherwise
+    // keep each of them twice.
+    record->shareIdentifier(proxy->pluginIdentifierValue());
+    record->shareUrl(proxy->bundleURLValue());
     record->setLxproxy(proxy);
     record->setEntitlements(proxy->entitlements());
-    record->setOriginalIdentifier(proxy->originalIdentifier());
+    record->shareOriginalIdentifier(proxy->originalIdentifierValue());
     record->setLastModified(proxy->registrationDate() ? secondsAsInt32(proxy->registrationDate()->secondsSince1970)
                                                       : 0);
     record->setOnSystemVolume(proxy->isOnSystemPartition());
@@ -96,7 +100,7 @@ std::shared_ptr<BXDPlugIn> BXDPlugIn::initWithLXData(std::shared_ptr<const LXBex
     }
 
     if (const std::shared_ptr<const LXApplicationProxy>& container = proxy->containingBundle())
-        record->setContainingUrl(container->bundleURL());
+        record->shareContainingUrl(container->bundleURLValue());
 
     if (std::optional<Error> error = record->diagnose()) {
         log::ops().info("ignoring mis-configured plug-in at %@: %{public}@", *proxy->bundleURL(),
@@ -148,14 +152,14 @@ Value BXDPlugIn::prunedInfoDictionaryFor(const Value& dictionary) {
 std::optional<std::string> BXDPlugIn::localizedName() const {
     if (std::optional<std::string> cached = BXPlugInCore::localizedName()) return cached;
     std::optional<std::string> fetched = lxproxy_ ? lxproxy_->localizedName() : std::nullopt;
-    if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedName(fetched);
+    if (fetched) const_cast<BXDPlugIn*>(this)->shareLocalizedName(lxproxy_->localizedNameValue());
     return fetched;
 }
 
 std::optional<std::string> BXDPlugIn::localizedShortName() const {
     if (std::optional<std::string> cached = BXPlugInCore::localizedShortName()) return cached;
     std::optional<std::string> fetched = lxproxy_ ? lxproxy_->localizedShortName() : std::nullopt;
-    if (fetched) const_cast<BXDPlugIn*>(this)->setLocalizedShortName(fetched);
+    if (fetched) const_cast<BXDPlugIn*>(this)->shareLocalizedShortName(lxproxy_->localizedShortNameValue());
     return fetched;
 }
 

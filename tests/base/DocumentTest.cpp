@@ -108,6 +108,40 @@ TEST(DocumentRead, AcceptsTheLatitudeXmlAllows) {
 // Guards the reader's refusals: every malformed input is the one malformed-document error (never a crash nor a
 // half-read value), naming what and where; rows with a path and byte offset prove that also several levels down.
 // The fuzzer holds the rest of the refusals in its corpus.
+// Guards reading with a maker of strings: every string of the document, wherever it sits, is what the maker made
+// of exactly its text (a string that only resembles another, a prefix or in other case, is its own), and nothing
+// that is not a string in the document goes through the maker.
+TEST(DocumentRead, StringsAreWhatTheMakerMakesOfTheirText) {
+    const std::string longText = "com.example.known.identifier-longer-than-a-short-string";
+    Value original = dict({{"exact", Value::string(longText)},
+                           {"nested", Value::array({Value::array({Value::string(longText)}), Value::string("7")})},
+                           {"prefix", Value::string(longText.substr(0, 20))},
+                           {"upper", Value::string("ONE")},
+                           {"empty", Value::string("")},
+                           {"number", Value::int64(7)},
+                           {"data", Value::data(std::vector<uint8_t>{'o', 'n', 'e'})}});
+    const Value known[] = {Value::string(longText), Value::string("one"), Value::string("")};
+    std::vector<std::string> asked;
+    auto maker = [&](std::string&& text) {
+        asked.push_back(text);
+        for (const Value& candidate : known)
+            if (candidate.stringView() == text) return candidate;
+        return Value::string(std::move(text));
+    };
+    Result<Value> read = Document::read(Document::write(original).value(), maker);
+    ASSERT_TRUE(read.ok()) << read.error().description();
+    EXPECT_EQ(*read, original);
+    EXPECT_EQ(asked.size(), 6u);
+    EXPECT_TRUE(read->get("exact").identical(known[0]));
+    EXPECT_TRUE(read->get("nested").items()[0].items()[0].identical(known[0]));
+    EXPECT_TRUE(read->get("empty").identical(known[2]));
+    EXPECT_FALSE(read->get("prefix").identical(known[0]));
+    EXPECT_FALSE(read->get("upper").identical(known[1]));
+    EXPECT_EQ(read->get("number").kind(), ValueKind::Int64);
+    // Without a maker nothing is shared.
+    EXPECT_FALSE(Document::read(Document::write(original).value())->get("exact").identical(known[0]));
+}
+
 TEST(DocumentRead, MalformedInputIsAnErrorNamingWhatAndWhere) {
     const std::vector<std::pair<std::string, std::string>> cases = {
         {"", "no root element"},

@@ -120,6 +120,69 @@ TEST(Uuid, CanonicalTextIsUpperCase8_4_4_4_12AndParsingAcceptsEitherCaseOnly) {
         EXPECT_FALSE(Uuid::parse(bad)) << bad;
 }
 
+// Guards the containers' storage, which keeps the elements in the node itself: whatever goes in (nothing, keys and
+// strings long enough to live apart from their string object, non-ASCII bytes, embedded zeros, nesting) comes back
+// equal through every way of building and copying a container, and a copy outlives the builder and the original.
+TEST(ValueStorage, ContainersGiveBackWhatWentInThroughEveryBuilder) {
+    const std::string longKey(300, 'k');
+    const std::string accented = "cl\xc3\xa9 \xe2\x9c\x93";
+    const std::string withZero("a\0b", 3);
+    std::vector<std::pair<std::string, Value>> pairs = {
+        {"", Value::string("")},
+        {longKey, Value::string(std::string(1000, 's'))},
+        {accented, Value::string(accented)},
+        {withZero, Value::string(withZero)},
+        {"nested", Value::array({Value::array({}), Value::array({Value::string(longKey), Value::emptyDictionary()}),
+                                 Value::uuid(Uuid::random()), Value::data(std::vector<uint8_t>{0, 255})})},
+        {"number", Value::int64(-7)},
+    };
+    std::optional<Value> built;
+    {
+        std::vector<std::pair<std::string, Value>> copy = pairs;
+        built = Value::dictionary(std::move(copy));
+    }
+    ASSERT_EQ(built->count(), pairs.size());
+    for (const auto& [key, value] : pairs) {
+        const Value* found = built->find(key);
+        ASSERT_NE(found, nullptr) << key;
+        EXPECT_EQ(*found, value) << key;
+    }
+    EXPECT_EQ(built->get(withZero).stringView().size(), 3u);
+    EXPECT_EQ(built->find("a"), nullptr);
+    EXPECT_EQ(built->get("nested").items()[1].items()[0].stringView(), longKey);
+
+    std::optional<Value> viaBuilder;
+    {
+        MutableDictionary builder;
+        for (auto it = pairs.rbegin(); it != pairs.rend(); ++it) builder.set(it->first, it->second);
+        Value copied = builder.value();
+        viaBuilder = builder.take();
+        EXPECT_EQ(copied, *viaBuilder);
+        EXPECT_FALSE(copied.identical(*viaBuilder));
+    }
+    EXPECT_EQ(*viaBuilder, *built);
+    Value edited = [&] {
+        MutableDictionary builder(*built);
+        builder.remove(longKey);
+        return builder.value();
+    }();
+    built.reset();
+    EXPECT_EQ(edited.count(), pairs.size() - 1);
+    EXPECT_EQ(edited.get(accented), Value::string(accented));
+    EXPECT_EQ(viaBuilder->get(longKey).stringView().size(), 1000u);
+
+    MutableArray items;
+    for (const auto& [key, value] : pairs) items.append(value);
+    Value array = items.value();
+    items.append(Value::string("one more"));
+    EXPECT_EQ(array.count(), pairs.size());
+    EXPECT_EQ(items.take().count(), pairs.size() + 1);
+    EXPECT_EQ(MutableArray(array).take(), array);
+    EXPECT_EQ(Value::emptyArray().count(), 0u);
+    EXPECT_TRUE(Value::emptyDictionary().entries().empty());
+    EXPECT_EQ(Value::emptyDictionary(), Value::dictionary({}));
+}
+
 // Guards the log against huge values: descriptions are cut at a bound and say so.
 TEST(ValueDescription, Bounded) {
     MutableArray huge;

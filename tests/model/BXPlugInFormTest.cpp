@@ -44,6 +44,30 @@ std::shared_ptr<BXPlugInCore> read(const Value& form) {
 
 // ---- Writing ----
 
+// Guards the text properties' storage, where absence is not an optional of its own: an empty text is present (and
+// written), a text set to nothing is absent (and left out), in the record and through a form read back.
+TEST(BXPlugInFormExport, EmptyTextsArePresentAndClearedTextsAbsent) {
+    auto record = fullRecord();
+    record->setLocalizedName(std::string());
+    record->setRequirement(std::string());
+    record->setOriginalIdentifier(std::nullopt);
+    record->setLocalizedShortName(std::nullopt);
+    EXPECT_EQ(record->localizedName(), std::optional<std::string>(""));
+    EXPECT_EQ(record->requirement(), std::optional<std::string>(""));
+    EXPECT_FALSE(record->originalIdentifier());
+    EXPECT_FALSE(record->localizedShortName());
+    Value form = exported(*record);
+    EXPECT_EQ(form.get("localizedDisplayName"), str(""));
+    EXPECT_FALSE(form.contains("original-identifier"));
+    EXPECT_FALSE(form.contains("localizedShortName"));
+    auto back = read(form);
+    ASSERT_TRUE(back);
+    EXPECT_EQ(back->localizedName(), std::optional<std::string>(""));
+    EXPECT_FALSE(back->originalIdentifier());
+    EXPECT_FALSE(back->localizedShortName());
+    EXPECT_EQ(back->localizedContainingName(), std::optional<std::string>("Mail"));
+}
+
 // Every entry under its own key; the information dictionary never carries its own location, though the record keeps
 // it; hash and requirement are never written.
 TEST(BXPlugInFormExport, FullRecordWritesEveryEntryUnderItsKey) {

@@ -233,6 +233,85 @@ TEST_F(LedgerixRegistrationTest, ConcurrentRegistrationsAllLand) {
     EXPECT_FALSE(workspace_->checkIntegrity());
 }
 
+// Guards the strings a decoded information dictionary shares: with the record's own identifier and name, and
+// short strings with other records' dictionaries (each record still reads back exactly what its text says, odd
+// texts too); a long string is every record's own.
+TEST(LXBexilProxyTest, DecodedDictionariesShareTheRecordsTextsAndRepeatedShortStrings) {
+    const std::string longText(200, 'x');
+    auto proxyFor = [&](const std::string& identifier) {
+        LXBexilProxy::Fields fields;
+        fields.pluginIdentifier = identifier;
+        fields.bundleIdentifier = identifier;
+        fields.localizedName = "Name \xc3\xa9";
+        fields.infoVrecDocument =
+            Document::write(
+                Value::dictionary(
+                    {{"BDBundleIdentifier", str(identifier)},
+                     {"BDBundleName", str("Name \xc3\xa9")},
+                     {"RZExtension", Value::dictionary({{"RZExtensionPointIdentifier", str("com.example.point.shared")},
+                                                        {"Long", str(longText)},
+                                                        {"Empty", str("")},
+                                                        {"List", Value::array({str("\xe2\x9c\x93")})}})}}))
+                .value();
+        return std::make_shared<LXBexilProxy>(std::move(fields));
+    };
+    auto a = proxyFor("com.example.first.plug-in"), b = proxyFor("com.example.second.plug-in");
+    ASSERT_TRUE(a->infoVrec() && b->infoVrec());
+    EXPECT_EQ(a->infoVrec()->get("BDBundleIdentifier"), str("com.example.first.plug-in"));
+    EXPECT_TRUE(a->infoVrec()->get("BDBundleIdentifier").identical(a->pluginIdentifierValue()));
+    EXPECT_TRUE(a->infoVrec()->get("BDBundleName").identical(a->localizedNameValue()));
+    EXPECT_EQ(b->infoVrec()->get("BDBundleIdentifier"), str("com.example.second.plug-in"));
+    Value pointA = a->objectForInfoDictionaryKeyOfClassInScope("RZExtensionPointIdentifier", ValueKind::String,
+                                                               LXInfoScope::PlugIn)
+                       .value();
+    Value pointB = b->objectForInfoDictionaryKeyOfClassInScope("RZExtensionPointIdentifier", ValueKind::String,
+                                                               LXInfoScope::PlugIn)
+                       .value();
+    EXPECT_EQ(pointA, str("com.example.point.shared"));
+    EXPECT_TRUE(pointA.identical(pointB));
+    Value plugInA = *a->bexilDictionary(), plugInB = *b->bexilDictionary();
+    EXPECT_EQ(plugInA.get("Long").stringView(), longText);
+    EXPECT_FALSE(plugInA.get("Long").identical(plugInB.get("Long")));
+    EXPECT_EQ(plugInA.get("Empty"), str(""));
+    EXPECT_EQ(plugInB.get("List"), Value::array({str("\xe2\x9c\x93")}));
+}
+
+// Guards the sharing of application records between the records of their plug-ins: plug-ins of one application
+// share one, never one of another application, and never one whose plug-in list was read before they were looked
+// up (it would miss plug-ins registered since); a record's own list stays the one it read.
+TEST_F(LedgerixRegistrationTest, PlugInsOfOneApplicationShareItsRecordUntilItsListIsRead) {
+    auto plugIn = [&](const std::string& app, int i) {
+        return writePlugIn(bundles_ / (app + ".app/PlugIns/P" + std::to_string(i) + ".bxplugin"),
+                           {.identifier = "com.example." + app + std::to_string(i)});
+    };
+    fs::path p0 = plugIn("App", 0), p1 = plugIn("App", 1), other = plugIn("Other", 0);
+    for (const fs::path& path : {p0, p1, other}) registerOK(path);
+
+    std::shared_ptr<const LXBexilProxy> a = workspace_->plugInProxyForURL(p0.string());
+    std::shared_ptr<const LXBexilProxy> b = workspace_->plugInProxyForURL(p1.string());
+    std::shared_ptr<const LXBexilProxy> c = workspace_->plugInProxyForURL(other.string());
+    ASSERT_TRUE(a && b && c && a->containingBundle() && c->containingBundle());
+    EXPECT_EQ(a->containingBundle(), b->containingBundle());
+    EXPECT_NE(a->containingBundle(), c->containingBundle());
+    EXPECT_EQ(c->containingBundle()->bundleURL(), fs::canonical(bundles_ / "Other.app").string());
+    EXPECT_EQ(a->containingBundle()->plugIns().size(), 2u);
+
+    fs::path p2 = plugIn("App", 2);
+    registerOK(p2);
+    std::shared_ptr<const LXBexilProxy> d = workspace_->plugInProxyForURL(p2.string());
+    ASSERT_TRUE(d && d->containingBundle());
+    EXPECT_NE(d->containingBundle(), a->containingBundle());
+    EXPECT_EQ(d->containingBundle()->bundleURL(), a->containingBundle()->bundleURL());
+    EXPECT_EQ(d->containingBundle()->plugIns().size(), 3u);
+    EXPECT_EQ(a->containingBundle()->plugIns().size(), 2u);
+    // Shared again by the next record while its list is unread.
+    std::shared_ptr<const LXBexilProxy> e = workspace_->plugInProxyForURL(p0.string());
+    std::shared_ptr<const LXBexilProxy> f = workspace_->plugInProxyForURL(p1.string());
+    ASSERT_TRUE(e && f);
+    EXPECT_EQ(e->containingBundle(), f->containingBundle());
+    EXPECT_NE(e->containingBundle(), d->containingBundle());
+}
+
 // Guards old-style bundles: their "Bexil" dictionary stands in for the plug-in dictionary.
 TEST(LXBexilProxyTest, OldStyleBundleFallsBackToItsBexilDictionary) {
     LXBexilProxy::Fields oldStyle;
@@ -241,6 +320,71 @@ TEST(LXBexilProxyTest, OldStyleBundleFallsBackToItsBexilDictionary) {
     LXBexilProxy proxy(oldStyle);
     EXPECT_EQ(proxy.objectForInfoDictionaryKeyOfClassInScope("a", ValueKind::String, LXInfoScope::Attributes),
               str("b"));
+}
+
+// Guards the records' dictionaries read from text: they decode once, on first use from whichever thread, and the
+// text is then dropped, so what every later call sees must be that one decoding; text that does not decode, or
+// whose root is not a dictionary, reads as absent every time, and a value given beside text wins.
+TEST(LXBexilProxyTest, DictionariesDecodeOnceFromTextAndUnreadableTextStaysAbsent) {
+    Value info = Value::dictionary(
+        {{"RZExtension", Value::dictionary({{"RZExtensionAttributes", Value::dictionary({{"Flavour", str("salt")}})}})},
+         {"BDBundleIdentifier", str("com.example.dr\u00e9sser.long-identifier")}});
+    Value entitlements = Value::dictionary({{"com.example.entitled", Value::boolean(true)}});
+    for (int round = 0; round < 20; ++round) {
+        LXBexilProxy::Fields fields;
+        fields.infoVrecDocument = Document::write(info).value();
+        fields.entitlementsDocument = Document::write(entitlements).value();
+        LXBexilProxy proxy(std::move(fields));
+        std::optional<Value> seen[2];
+        std::optional<Value> seenEntitlements[2];
+        std::thread a([&] {
+            seen[0] = proxy.infoVrec();
+            seenEntitlements[0] = proxy.entitlements();
+        });
+        std::thread b([&] {
+            seenEntitlements[1] = proxy.entitlements();
+            seen[1] =
+                proxy.objectForInfoDictionaryKeyOfClassInScope("BDBundleIdentifier", std::nullopt, LXInfoScope::Info)
+                    ? proxy.infoVrec()
+                    : std::nullopt;
+        });
+        a.join();
+        b.join();
+        ASSERT_TRUE(seen[0] && seen[1] && seenEntitlements[0] && seenEntitlements[1]);
+        EXPECT_EQ(*seen[0], info);
+        EXPECT_TRUE(seen[0]->identical(*seen[1]));
+        EXPECT_TRUE(seenEntitlements[0]->identical(*seenEntitlements[1]));
+        EXPECT_EQ(*seenEntitlements[0], entitlements);
+        // Asked again after the text is gone, the same decoding answers.
+        EXPECT_TRUE(proxy.infoVrec()->identical(*seen[0]));
+        EXPECT_EQ(proxy.objectForInfoDictionaryKeyOfClassInScope("Flavour", ValueKind::String, LXInfoScope::Attributes),
+                  str("salt"));
+    }
+
+    for (std::string text : {std::string("<vrec version=\"1\"><dict><key>a</key>"), std::string("not a document"),
+                             Document::write(Value::array({str("x")})).value(), Document::write(str("x")).value()}) {
+        LXBexilProxy::Fields fields;
+        fields.infoVrecDocument = text;
+        fields.entitlementsDocument = text;
+        LXBexilProxy proxy(std::move(fields));
+        for (int twice = 0; twice < 2; ++twice) {
+            EXPECT_FALSE(proxy.infoVrec()) << text;
+            EXPECT_FALSE(proxy.bexilDictionary()) << text;
+            EXPECT_FALSE(proxy.entitlements()) << text;
+            EXPECT_FALSE(proxy.objectForInfoDictionaryKeyOfClassInScope("a", std::nullopt, LXInfoScope::Info));
+        }
+    }
+
+    LXBexilProxy::Fields both;
+    both.infoVrec = info;
+    both.infoVrecDocument = Document::write(Value::dictionary({{"other", str("text")}})).value();
+    both.entitlements = str("not a dictionary");
+    both.entitlementsDocument = Document::write(entitlements).value();
+    LXBexilProxy proxy(std::move(both));
+    ASSERT_TRUE(proxy.infoVrec());
+    EXPECT_TRUE(proxy.infoVrec()->identical(info));
+    // A value given wins over text even when it is not a dictionary: the record then has none.
+    EXPECT_FALSE(proxy.entitlements());
 }
 
 // Registering a bundle again is silent when nothing changed, keeps the UUID when only the content changed, and

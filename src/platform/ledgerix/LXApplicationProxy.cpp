@@ -7,10 +7,13 @@
 namespace bexil {
 
 LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInLoader loader)
-    : fields_(std::move(fields)), loader_(std::move(loader)) {}
+    : bundleURL_(Value::string(std::move(fields.bundleURL))), fields_(std::move(fields)), loader_(std::move(loader)) {}
 
 LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInList plugIns)
-    : fields_(std::move(fields)), plugIns_(std::move(plugIns)) {}
+    : bundleURL_(Value::string(std::move(fields.bundleURL))),
+      fields_(std::move(fields)),
+      plugIns_(std::move(plugIns)),
+      plugInsRead_(true) {}
 
 const LXApplicationProxy::PlugInList& LXApplicationProxy::plugIns() const {
     std::call_once(loaded_, [this] {
@@ -19,6 +22,7 @@ const LXApplicationProxy::PlugInList& LXApplicationProxy::plugIns() const {
             // The loader may hold the registry alive; it is not needed any more.
             loader_ = nullptr;
         }
+        plugInsRead_.store(true, std::memory_order_release);
     });
     return plugIns_;
 }
@@ -27,7 +31,7 @@ std::string LXApplicationProxy::description() const {
     std::string text = "<application ";
     text += fields_.bundleIdentifier.value_or("(no identifier)");
     text += ' ';
-    text += fields_.bundleURL;
+    text += bundleURL();
     if (fields_.isPlaceholder) text += " placeholder";
     text += '>';
     return text;

@@ -1,29 +1,116 @@
 #include "platform/ledgerix/LXBexilProxy.h"
 
+#include <initializer_list>
+#include <mutex>
+#include <unordered_map>
 #include <utility>
 
 #include "base/Document.h"
 
 namespace bexil {
 
-LXBexilProxy::LXBexilProxy(Fields fields) : fields_(std::move(fields)) {}
+namespace {
+// A string Value of `text`, or null when absent; equal texts given side by side (the registry gives a plug-in's
+// identifiers so) share one.
+Value textValue(std::optional<std::string>& text, std::initializer_list<const Value*> earlier = {}) {
+    if (!text) return Value();
+    for (const Value* other : earlier)
+        if (other->isString() && other->stringView() == *text) return *other;
+    return Value::string(std::move(*text));
+}
 
-std::optional<Value> LXBexilProxy::decodeDictionary(const std::optional<Value>& value, const std::string& document) {
-    if (value) return value->isDictionary() ? value : std::nullopt;
-    if (document.empty()) return std::nullopt;
-    Result<Value> decoded = Document::read(document);
+// Text is kept apart until it is decoded, and not at all when there is none.
+std::unique_ptr<const std::string> pendingText(std::string& text) {
+    if (text.empty()) return nullptr;
+    return std::make_unique<const std::string>(std::move(text));
+}
+}  // namespace
+
+LXBexilProxy::LXBexilProxy(Fields fields)
+    : bundleURL_(textValue(fields.bundleURL)),
+      pluginIdentifier_(textValue(fields.pluginIdentifier)),
+      originalIdentifier_(textValue(fields.originalIdentifier, {&pluginIdentifier_})),
+      bundleIdentifier_(textValue(fields.bundleIdentifier, {&originalIdentifier_, &pluginIdentifier_})),
+      bundleVersion_(textValue(fields.bundleVersion)),
+      dataContainerURL_(textValue(fields.dataContainerURL)),
+      localizedName_(textValue(fields.localizedName)),
+      localizedShortName_(textValue(fields.localizedShortName, {&localizedName_})),
+      containingBundle_(std::move(fields.containingBundle)),
+      registrationDate_(fields.registrationDate),
+      pluginUUID_(fields.pluginUUID),
+      isOnSystemPartition_(fields.isOnSystemPartition),
+      info_(std::move(fields.infoVrec)),
+      entitlements_(std::move(fields.entitlements)),
+      infoText_(pendingText(fields.infoVrecDocument)),
+      entitlementsText_(pendingText(fields.entitlementsDocument)) {}
+
+namespace {
+
+// The given value when it is a dictionary, else the document decoded when it holds one, else none.
+std::optional<Value> decodeDictionary(std::optional<Value> value, const std::string* document,
+                                      const Document::StringMaker& makeString) {
+    if (value) return value->isDictionary() ? std::move(value) : std::nullopt;
+    if (document == nullptr) return std::nullopt;
+    Result<Value> decoded = Document::read(*document, makeString);
     if (!decoded.ok() || !decoded->isDictionary()) return std::nullopt;
     return std::move(decoded).value();
 }
 
+// Strings that information dictionaries repeat from plug-in to plug-in (extension points, protocols, classes,
+// versions, flags) are kept once for the process: the first kSharedStrings short strings decoded are kept for
+// good and handed out to every later dictionary that has them. The bound keeps what is kept small (well under a
+// megabyte) whatever the registry holds; strings met after it is reached are each a Value of their own again.
+class SharedStrings {
+  public:
+    static constexpr size_t kSharedStrings = 4096;
+    static constexpr size_t kLongestShared = 64;
+
+    Value make(std::string&& text) {
+        if (text.size() > kLongestShared) return Value::string(std::move(text));
+        std::lock_guard lock(mutex_);
+        if (auto it = strings_.find(std::string_view(text)); it != strings_.end()) return it->second;
+        Value made = Value::string(std::move(text));
+        // The key views the Value's own text, which never changes or moves while the Value is kept here.
+        if (strings_.size() < kSharedStrings) strings_.emplace(made.stringView(), made);
+        return made;
+    }
+
+  private:
+    std::mutex mutex_;
+    std::unordered_map<std::string_view, Value> strings_;
+};
+
+SharedStrings& sharedStrings() {
+    static SharedStrings* strings = new SharedStrings;  // never destroyed: records may outlive static destructors
+    return *strings;
+}
+
+}  // namespace
+
+// The text is read only here, once: after decoding it is dropped, so that a record never keeps a dictionary twice
+// (the decoded one is the larger part of a cached plug-in record).
 const std::optional<Value>& LXBexilProxy::infoVrec() const {
-    std::call_once(infoDecoded_, [this] { info_ = decodeDictionary(fields_.infoVrec, fields_.infoVrecDocument); });
+    std::call_once(infoDecoded_, [this] {
+        // The information dictionary repeats the identifiers, version and names this record holds: the decoded
+        // dictionary shares their Values, and those of the strings that other plug-ins' dictionaries have too.
+        auto makeString = [this](std::string&& text) -> Value {
+            for (const Value* known :
+                 {&pluginIdentifier_, &bundleIdentifier_, &bundleVersion_, &localizedName_, &localizedShortName_})
+                if (known->isString() && known->stringView() == text) return *known;
+            return sharedStrings().make(std::move(text));
+        };
+        info_ = decodeDictionary(std::move(info_), infoText_.get(), makeString);
+        infoText_.reset();
+    });
     return info_;
 }
 
 const std::optional<Value>& LXBexilProxy::entitlements() const {
-    std::call_once(entitlementsDecoded_,
-                   [this] { entitlements_ = decodeDictionary(fields_.entitlements, fields_.entitlementsDocument); });
+    std::call_once(entitlementsDecoded_, [this] {
+        entitlements_ = decodeDictionary(std::move(entitlements_), entitlementsText_.get(),
+                                         [](std::string&& text) { return Value::string(std::move(text)); });
+        entitlementsText_.reset();
+    });
     return entitlements_;
 }
 
@@ -83,11 +170,11 @@ std::optional<Value> LXBexilProxy::objectForInfoDictionaryKeyOfClassInScope(std:
 
 std::string LXBexilProxy::description() const {
     std::string text = "<plug-in ";
-    text += fields_.pluginIdentifier.value_or("(no identifier)");
+    text += pluginIdentifier_.isString() ? pluginIdentifier_.stringView() : "(no identifier)";
     text += ' ';
-    text += fields_.pluginUUID ? fields_.pluginUUID->string() : std::string("(no uuid)");
+    text += pluginUUID_ ? pluginUUID_->string() : std::string("(no uuid)");
     text += ' ';
-    text += fields_.bundleURL.value_or("(no path)");
+    text += bundleURL_.isString() ? bundleURL_.stringView() : "(no path)";
     text += '>';
     return text;
 }

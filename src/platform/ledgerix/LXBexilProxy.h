@@ -59,23 +59,31 @@ class LXBexilProxy {
     LXBexilProxy(const LXBexilProxy&) = delete;
     LXBexilProxy& operator=(const LXBexilProxy&) = delete;
 
-    const std::optional<std::string>& bundleURL() const { return fields_.bundleURL; }
+    // The texts are kept as string Values (null when absent), which the daemon's records share instead of copying;
+    // the accessors below hand out copies, the *Value accessors the shared Values themselves.
+    std::optional<std::string> bundleURL() const { return text(bundleURL_); }
     // The plug-in's identifier: the plug-in dictionary's "RZExtensionIdentifier", else "BDBundleIdentifier".
-    const std::optional<std::string>& pluginIdentifier() const { return fields_.pluginIdentifier; }
+    std::optional<std::string> pluginIdentifier() const { return text(pluginIdentifier_); }
     // The identifier the bundle was shipped under ("BDBundleIdentifier").
-    const std::optional<std::string>& originalIdentifier() const { return fields_.originalIdentifier; }
-    const std::optional<std::string>& bundleIdentifier() const { return fields_.bundleIdentifier; }
+    std::optional<std::string> originalIdentifier() const { return text(originalIdentifier_); }
+    std::optional<std::string> bundleIdentifier() const { return text(bundleIdentifier_); }
     // "BDBundleVersion" of the information dictionary.
-    const std::optional<std::string>& bundleVersion() const { return fields_.bundleVersion; }
-    const std::optional<Uuid>& pluginUUID() const { return fields_.pluginUUID; }
-    const std::optional<Date>& registrationDate() const { return fields_.registrationDate; }
-    bool isOnSystemPartition() const { return fields_.isOnSystemPartition; }
+    std::optional<std::string> bundleVersion() const { return text(bundleVersion_); }
+    const std::optional<Uuid>& pluginUUID() const { return pluginUUID_; }
+    const std::optional<Date>& registrationDate() const { return registrationDate_; }
+    bool isOnSystemPartition() const { return isOnSystemPartition_; }
     // The application that contains the plug-in; none outside applications.
-    const std::shared_ptr<const LXApplicationProxy>& containingBundle() const { return fields_.containingBundle; }
+    const std::shared_ptr<const LXApplicationProxy>& containingBundle() const { return containingBundle_; }
     // The plug-in's data container directory; none for data plug-ins.
-    const std::optional<std::string>& dataContainerURL() const { return fields_.dataContainerURL; }
-    const std::optional<std::string>& localizedName() const { return fields_.localizedName; }
-    const std::optional<std::string>& localizedShortName() const { return fields_.localizedShortName; }
+    std::optional<std::string> dataContainerURL() const { return text(dataContainerURL_); }
+    std::optional<std::string> localizedName() const { return text(localizedName_); }
+    std::optional<std::string> localizedShortName() const { return text(localizedShortName_); }
+
+    const Value& bundleURLValue() const { return bundleURL_; }
+    const Value& pluginIdentifierValue() const { return pluginIdentifier_; }
+    const Value& originalIdentifierValue() const { return originalIdentifier_; }
+    const Value& localizedNameValue() const { return localizedName_; }
+    const Value& localizedShortNameValue() const { return localizedShortName_; }
 
     // The whole information dictionary (Info.vrec), or none.
     const std::optional<Value>& infoVrec() const;
@@ -95,13 +103,31 @@ class LXBexilProxy {
     std::string description() const;
 
   private:
-    static std::optional<Value> decodeDictionary(const std::optional<Value>& value, const std::string& document);
+    static std::optional<std::string> text(const Value& value) {
+        if (!value.isString()) return std::nullopt;
+        return std::string(value.stringView());
+    }
 
-    Fields fields_;
+    Value bundleURL_;
+    Value pluginIdentifier_;
+    Value originalIdentifier_;
+    Value bundleIdentifier_;
+    Value bundleVersion_;
+    Value dataContainerURL_;
+    Value localizedName_;
+    Value localizedShortName_;
+    std::shared_ptr<const LXApplicationProxy> containingBundle_;
+    std::optional<Date> registrationDate_;
+    std::optional<Uuid> pluginUUID_;
+    bool isOnSystemPartition_ = false;
     mutable std::once_flag infoDecoded_;
     mutable std::once_flag entitlementsDecoded_;
+    // The dictionaries: before their first use as the values or text given, afterwards as the decoded dictionaries
+    // alone (the text is dropped then).
     mutable std::optional<Value> info_;
     mutable std::optional<Value> entitlements_;
+    mutable std::unique_ptr<const std::string> infoText_;
+    mutable std::unique_ptr<const std::string> entitlementsText_;
 };
 
 }  // namespace bexil

@@ -201,16 +201,38 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
     return selectRowsLocked(lookups_, where, arguments, integerArgument, order);
 }
 
+// Every plug-in record carries its application's record, and most applications have several plug-ins: while one
+// application record is alive, the records of its other plug-ins share it as long as it still says what the row
+// says and has not read its plug-in list yet (a list read before a record was made could miss that record's
+// plug-in; one read later is what a record of its own would read too).
 std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationFromRow(const Row& row) {
     if (!row.appPath || !row.applicationId) return nullptr;
+    int64_t applicationId = *row.applicationId;
+    auto sameAsRow = [&row](const LXApplicationProxy& application) {
+        return !application.plugInsRead() && application.bundleURL() == *row.appPath &&
+               application.bundleIdentifier() == row.appIdentifier && application.localizedName() == row.appName &&
+               application.isPlaceholder() == row.appPlaceholder;
+    };
+    {
+        std::lock_guard lock(applicationsMutex_);
+        if (auto it = applications_.find(applicationId); it != applications_.end())
+            if (std::shared_ptr<const LXApplicationProxy> shared = it->second.lock(); shared && sameAsRow(*shared))
+                return shared;
+    }
     LXApplicationProxy::Fields fields{*row.appPath, row.appIdentifier, row.appName, row.appPlaceholder};
     std::weak_ptr<LedgerixWorkspace> weak = weak_from_this();
-    int64_t applicationId = *row.applicationId;
-    return std::make_shared<const LXApplicationProxy>(
+    auto made = std::make_shared<const LXApplicationProxy>(
         std::move(fields), [weak, applicationId]() -> LXApplicationProxy::PlugInList {
             std::shared_ptr<LedgerixWorkspace> workspace = weak.lock();
             return workspace ? workspace->plugInsOfApplication(applicationId) : LXApplicationProxy::PlugInList{};
         });
+    std::lock_guard lock(applicationsMutex_);
+    applications_[applicationId] = made;
+    if (applications_.size() >= applicationsSweepAt_) {
+        std::erase_if(applications_, [](const auto& entry) { return entry.second.expired(); });
+        applicationsSweepAt_ = std::max<size_t>(64, 2 * applications_.size());
+    }
+    return made;
 }
 
 std::shared_ptr<const LXBexilProxy> LedgerixWorkspace::proxyFromRow(const Row& row) {

@@ -12,6 +12,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "platform/ledgerix/LXApplicationWorkspace.h"
@@ -143,6 +144,11 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     std::string systemPrefix_;
     std::mutex observersMutex_;
     std::vector<std::weak_ptr<LXApplicationWorkspaceObserverProtocol>> observers_;
+    // The application records that plug-in records carry, by application row, so that the plug-ins of one
+    // application share one (see applicationFromRow). Entries of records gone are swept when the map has doubled.
+    std::mutex applicationsMutex_;
+    std::unordered_map<int64_t, std::weak_ptr<const LXApplicationProxy>> applications_;
+    size_t applicationsSweepAt_ = 64;
 };
 
 }  // namespace bexil
