@@ -427,7 +427,9 @@ Result<size_t> ZemCodec::encodedSize(const Value& value) {
     return sizer.size;
 }
 
-std::optional<Error> ZemCodec::encode(const Value& value, std::vector<uint8_t>& out, size_t maxBytes) {
+template <class Bytes>
+requires std::same_as<Bytes, std::vector<uint8_t>> || std::same_as<Bytes, ZemBytes> std::optional<Error>
+ZemCodec::encode(const Value& value, Bytes& out, size_t maxBytes) {
     Sizer sizer;
     sizer.visit(value, 0);
     if (sizer.error) return sizer.error;
@@ -441,6 +443,9 @@ std::optional<Error> ZemCodec::encode(const Value& value, std::vector<uint8_t>& 
         throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
     return std::nullopt;
 }
+
+template std::optional<Error> ZemCodec::encode(const Value&, std::vector<uint8_t>&, size_t);
+template std::optional<Error> ZemCodec::encode(const Value&, ZemBytes&, size_t);
 
 Result<std::vector<uint8_t>> ZemCodec::encode(const Value& value) {
     std::vector<uint8_t> out;

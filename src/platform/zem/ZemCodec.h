@@ -3,6 +3,7 @@
 // ZemCodec turns a Value into the compact binary encoding of the Zem wire format and back (docs/protocol.md).
 // It holds no state: every function may be called from any thread at any time.
 
+#include <concepts>
 #include <cstddef>
 #include <cstdint>
 #include <optional>
@@ -11,6 +12,7 @@
 
 #include "base/Error.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemBytes.h"
 #include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
@@ -40,7 +42,10 @@ class ZemCodec {
 
     // Appends the encoding of `value` to `out`, growing it once. On an error (a string or key that is not
     // UTF-8, containers nested deeper than kMaxDepth, an encoding longer than `maxBytes`) `out` is left as it was.
-    static std::optional<Error> encode(const Value& value, std::vector<uint8_t>& out, size_t maxBytes = SIZE_MAX);
+    // `out` is a std::vector<uint8_t> or a ZemBytes, which is not zero-filled before the encoding is written.
+    template <class Bytes>
+    requires std::same_as<Bytes, std::vector<uint8_t>> || std::same_as<Bytes, ZemBytes>
+    static std::optional<Error> encode(const Value& value, Bytes& out, size_t maxBytes = SIZE_MAX);
     static Result<std::vector<uint8_t>> encode(const Value& value);
 
     // The exact number of bytes encode() would append, or the error it would return.

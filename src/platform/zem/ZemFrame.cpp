@@ -109,8 +109,10 @@ Result<ZemFrameHeader> ZemFrame::decodeHeader(std::span<const uint8_t, kHeaderBy
     return header;
 }
 
-std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                      std::vector<uint8_t>& out, uint8_t descriptorCount) {
+template <class Bytes>
+requires std::same_as<Bytes, std::vector<uint8_t>> || std::same_as<Bytes, ZemBytes> std::optional<Error>
+ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload, Bytes& out,
+                 uint8_t descriptorCount) {
     if (!payload.isDictionary())
         return zemError(ZemErrorCode::NotDictionary,
                         fmt::format("a {} cannot carry a {}; payloads are dictionaries", zemFrameKindName(kind),
@@ -135,5 +137,9 @@ std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64
     encodeHeader(header, std::span<uint8_t, kHeaderBytes>(out.data() + start, kHeaderBytes));
     return std::nullopt;
 }
+
+template std::optional<Error> ZemFrame::encode(ZemFrameKind, uint64_t, uint64_t, const Value&, std::vector<uint8_t>&,
+                                               uint8_t);
+template std::optional<Error> ZemFrame::encode(ZemFrameKind, uint64_t, uint64_t, const Value&, ZemBytes&, uint8_t);
 
 }  // namespace bexil

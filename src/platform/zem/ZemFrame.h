@@ -4,6 +4,7 @@
 // payload, one encoded dictionary (docs/protocol.md). A frame is a plain value that owns its payload bytes; it
 // may be moved between queues freely.
 
+#include <concepts>
 #include <cstddef>
 #include <cstdint>
 #include <optional>
@@ -13,6 +14,7 @@
 
 #include "base/Error.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemBytes.h"
 #include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
@@ -49,14 +51,14 @@ class ZemFrame {
     static constexpr uint8_t kMaxDescriptorsPerFrame = 4;
 
     ZemFrame() = default;
-    ZemFrame(ZemFrameHeader header, std::vector<uint8_t> payload) : header_(header), payload_(std::move(payload)) {}
+    ZemFrame(ZemFrameHeader header, ZemBytes payload) : header_(header), payload_(std::move(payload)) {}
 
     const ZemFrameHeader& header() const { return header_; }
     ZemFrameKind kind() const { return header_.kind; }
     uint64_t serial() const { return header_.serial; }
     uint64_t inReplyTo() const { return header_.inReplyTo; }
-    const std::vector<uint8_t>& payload() const { return payload_; }
-    std::vector<uint8_t> takePayload() { return std::move(payload_); }
+    const ZemBytes& payload() const { return payload_; }
+    ZemBytes takePayload() { return std::move(payload_); }
 
     // The payload as a Value; a payload that decodes to anything but a dictionary is a NotDictionary error.
     Result<Value> decodePayload() const;
@@ -76,13 +78,15 @@ class ZemFrame {
 
     // Appends a complete frame (header and encoded `payload`, which must be a dictionary) to `out`, which grows
     // once; the header announces `descriptorCount` descriptors, which the caller sends with the frame's first byte.
-    // On any error, `out` is left as it was.
+    // On any error, `out` is left as it was. `out` is a std::vector<uint8_t> or a ZemBytes (see ZemCodec::encode).
+    template <class Bytes>
+    requires std::same_as<Bytes, std::vector<uint8_t>> || std::same_as<Bytes, ZemBytes>
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                       std::vector<uint8_t>& out, uint8_t descriptorCount = 0);
+                                       Bytes& out, uint8_t descriptorCount = 0);
 
   private:
     ZemFrameHeader header_;
-    std::vector<uint8_t> payload_;
+    ZemBytes payload_;
 };
 
 }  // namespace bexil

@@ -399,7 +399,6 @@ bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQu
             if (errno == EINTR || errno == EAGAIN || errno == EWOULDBLOCK) continue;
             return fail(ZemError::Kind::ConnectionInterrupted);
         }
-        reader_.feed(std::span<const uint8_t>(readBuffer_.data(), static_cast<size_t>(bytes)));
     }
 }
 
@@ -488,7 +487,7 @@ void ZemSocketConnection::readMore() {
         }
         ssize_t bytes = receive();
         if (bytes > 0) {
-            if (!consume(static_cast<size_t>(bytes))) return;
+            if (!consume()) return;
             continue;
         }
         if (bytes == 0) return endOfStream();
@@ -525,8 +524,15 @@ ssize_t ZemSocketConnection::receive() {
 }
 
 ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
-    if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
-    iovec chunk{readBuffer_.data(), readBuffer_.size()};
+    // The bulk of a large payload goes straight into the frame; anything else into the read buffer, from which one
+    // read may cut several frames.
+    std::span<uint8_t> into = reader_.payloadRoom();
+    const bool inPlace = !into.empty();
+    if (!inPlace) {
+        if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
+        into = readBuffer_;
+    }
+    iovec chunk{into.data(), into.size()};
     // Room for one frame's descriptors: the kernel never joins the descriptors of two sends in one read.
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * ZemFrame::kMaxDescriptorsPerFrame)];
     msghdr message{};
@@ -546,6 +552,12 @@ ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
         }
     }
     overflow = (message.msg_flags & MSG_CTRUNC) != 0 || receivedFds_.size() > kMaxPendingDescriptors;
+    if (bytes > 0 && !overflow) {
+        if (inPlace)
+            reader_.receivedInPlace(static_cast<size_t>(bytes));
+        else
+            reader_.feed(std::span<const uint8_t>(readBuffer_.data(), static_cast<size_t>(bytes)));
+    }
     return bytes;
 }
 
@@ -556,8 +568,8 @@ void ZemSocketConnection::endOfStream() {
     close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
 }
 
-bool ZemSocketConnection::consume(size_t bytes) {
-    std::optional<Error> broken = reader_.feed(std::span<const uint8_t>(readBuffer_.data(), bytes));
+bool ZemSocketConnection::consume() {
+    std::optional<Error> broken = reader_.error();
     // Frames completed before a bad header are still whole and are handled; then the stream is dropped.
     while (std::optional<ZemFrame> frame = reader_.next()) {
         if (state_ != State::Open) return false;
