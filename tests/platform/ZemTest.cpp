@@ -131,6 +131,66 @@ TEST(ZemCodec, EncoderAppendsOrRefusesWhatAPeerWouldRejectLeavingTheBufferAlone)
     }
 }
 
+// An encoding with the referenced bytes put back where they belong.
+template <class Buffer>
+Bytes withReferences(const Buffer& out, const std::vector<ZemCodec::Reference>& references) {
+    Bytes whole;
+    size_t from = 0;
+    for (const ZemCodec::Reference& reference : references) {
+        whole.insert(whole.end(), out.begin() + static_cast<ptrdiff_t>(from),
+                     out.begin() + static_cast<ptrdiff_t>(reference.offset));
+        whole.insert(whole.end(), reference.bytes.begin(), reference.bytes.end());
+        from = reference.offset;
+    }
+    whole.insert(whole.end(), out.begin() + static_cast<ptrdiff_t>(from), out.end());
+    return whole;
+}
+
+// Guards the encoding that a gathering send takes: strings and data from the minimum size on (and only those) are
+// left out and referenced in place, in order, wherever they are nested, and putting them back gives exactly what
+// encode() writes; a frame's header counts them. What encode() refuses, it refuses too, touching nothing.
+TEST(ZemCodec, ReferencingEncodingLeavesOutLargeContentsAndIsEncodeWithThemPutBack) {
+    const size_t minimum = 100;
+    std::string text(minimum, 'x');
+    Bytes blob(minimum + 1, 0x5A), small(minimum - 1, 0x33);
+    Value value =
+        Value::dictionary({{"a", Value::string(text)},
+                           {"b", Value::array({Value::data(small), Value::data(blob), Value::string(text.substr(1))})},
+                           {"c", Value::dictionary({{"d", Value::data(blob)}, {"e", Value::uint64(300)}})},
+                           {"f", sample()}});
+    ZemBytes out = {0xAA};
+    std::vector<ZemCodec::Reference> references;
+    ASSERT_FALSE(ZemCodec::encodeReferencing(value, out, references, minimum));
+    ASSERT_EQ(references.size(), 3u);
+    EXPECT_EQ(references[0].bytes.data(), reinterpret_cast<const uint8_t*>(value.get("a").stringView().data()));
+    EXPECT_EQ(references[1].bytes.data(), value.get("b").items()[1].dataBytes().data());
+    EXPECT_EQ(references[2].bytes.data(), value.get("c").get("d").dataBytes().data());
+    Bytes expected = {0xAA};
+    Bytes alone = encodeOrDie(value);
+    expected.insert(expected.end(), alone.begin(), alone.end());
+    EXPECT_EQ(withReferences(out, references), expected);
+    EXPECT_EQ(out.size() + 2 * blob.size() + text.size(), expected.size());
+
+    ZemBytes frame;
+    std::vector<ZemCodec::Reference> inFrame;
+    ASSERT_FALSE(ZemFrame::encodeReferencing(ZemFrameKind::Request, 4, 0, value, frame, inFrame, minimum));
+    Bytes plain;
+    ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 4, 0, value, plain));
+    EXPECT_EQ(withReferences(frame, inFrame), plain);
+
+    const std::pair<Value, size_t> refused[] = {
+        {Value::dictionary({{"a", Value::string(text)}, {"b", Value::string("\xff")}}), SIZE_MAX},
+        {Value::dictionary({{"a", Value::string(text)}}), 50},
+    };
+    for (const auto& [bad, limit] : refused) {
+        ZemBytes untouched = {1, 2};
+        std::vector<ZemCodec::Reference> none;
+        EXPECT_TRUE(ZemCodec::encodeReferencing(bad, untouched, none, minimum, limit));
+        EXPECT_EQ(untouched, (ZemBytes{1, 2}));
+        EXPECT_TRUE(none.empty());
+    }
+}
+
 // Guards the decoder's bounds checks: every prefix of an encoding fails cleanly, and so does one byte too many.
 TEST(ZemCodec, EveryTruncationOfAValidEncodingIsRefused) {
     Bytes full = encodeOrDie(sample());

@@ -4,7 +4,6 @@
 // payload, one encoded dictionary (docs/protocol.md). A frame is a plain value that owns its payload bytes; it
 // may be moved between queues freely.
 
-#include <concepts>
 #include <cstddef>
 #include <cstdint>
 #include <optional>
@@ -15,6 +14,7 @@
 #include "base/Error.h"
 #include "bexil/Value.h"
 #include "platform/zem/ZemBytes.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
@@ -80,11 +80,24 @@ class ZemFrame {
     // once; the header announces `descriptorCount` descriptors, which the caller sends with the frame's first byte.
     // On any error, `out` is left as it was. `out` is a std::vector<uint8_t> or a ZemBytes (see ZemCodec::encode).
     template <class Bytes>
-    requires std::same_as<Bytes, std::vector<uint8_t>> || std::same_as<Bytes, ZemBytes>
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
                                        Bytes& out, uint8_t descriptorCount = 0);
 
+    // encode() for a sender that gathers: the contents of strings and data of at least `minimum` bytes are not
+    // copied into `out` but listed in `references` (ZemCodec::encodeReferencing), and the header counts them. The
+    // frame is `out` with each reference's bytes inserted at its offset; they stay valid while `payload` lives.
+    static std::optional<Error> encodeReferencing(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                                  const Value& payload, ZemBytes& out,
+                                                  std::vector<ZemCodec::Reference>& references, size_t minimum);
+
   private:
+    // The checks and the header around a payload that `encodePayload()` appends to `out`, of which `elsewhere()`
+    // bytes are not in `out`.
+    template <class Bytes, class EncodePayload, class Elsewhere>
+    static std::optional<Error> encodeAround(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                             const Value& payload, Bytes& out, uint8_t descriptorCount,
+                                             EncodePayload&& encodePayload, Elsewhere&& elsewhere);
+
     ZemFrameHeader header_;
     ZemBytes payload_;
 };

@@ -32,6 +32,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
     // Size of one read from the socket.
     static constexpr size_t kReadChunkBytes = 64 * 1024;
+    // Strings and data of at least this many bytes in a request that a waiting thread sends itself go to the socket
+    // straight from the request (a gathering send), not copied into the outgoing buffer first.
+    static constexpr size_t kGatherMinimum = 16 * 1024;
     // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
     // requests, few enough that one peer cannot keep the loop to itself.
     static constexpr int kReadsPerTurn = 4;
