@@ -559,9 +559,11 @@ ssize_t ZemSocketConnection::receive() {
 }
 
 ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
-    // The bulk of a large payload goes straight into the frame; anything else into the read buffer, from which one
-    // read may cut several frames.
-    std::span<uint8_t> into = reader_.payloadRoom();
+    // On the daemon's side the bulk of a large payload goes straight into the frame; anything else into the read
+    // buffer, from which one read may cut several frames. A client reads its replies through the buffer: in a
+    // client process that decodes a large reply and lets it go again, reading in place measured many times slower,
+    // since the heap was then given back to the system and faulted in again on every reply.
+    std::span<uint8_t> into = side_ == Side::Peer ? reader_.payloadRoom() : std::span<uint8_t>();
     const bool inPlace = !into.empty();
     if (!inPlace) {
         if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
