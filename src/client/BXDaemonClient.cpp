@@ -83,7 +83,13 @@ BXDaemonClient::BXDaemonClient(const char* serviceName, EventLoop& loop)
     bxd_->resume();
 }
 
-BXDaemonClient::~BXDaemonClient() { bxd_->cancel(); }
+BXDaemonClient::~BXDaemonClient() {
+    {
+        std::lock_guard lock(life_->mutex);
+        life_->alive = false;
+    }
+    bxd_->cancel();
+}
 
 std::shared_ptr<BXDaemonClient> BXDaemonClient::initWithServiceName(const char* serviceName) {
     return std::make_shared<BXDaemonClient>(serviceName);
@@ -233,7 +239,7 @@ void BXDaemonClient::matchAllPagesReply(const Value& rules, uint64_t flags, uint
 }
 
 void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const Value& continuation) {
-    auto onPage = [this, walk](const Reply& raw) {
+    auto onPage = [this, walk, life = life_](const Reply& raw) {
         const Value* message = std::get_if<Value>(&raw);
         bool failed = message == nullptr;
         try {
@@ -251,7 +257,12 @@ void BXDaemonClient::continueWalk(const std::shared_ptr<PagedWalk>& walk, const 
         const Value* next = message->find(key::kContinuation);
         if (next != nullptr && next->isData()) {
             if (walk->progress) walk->progress(walk->forms.size());
-            return continueWalk(walk, *next);
+            {
+                std::lock_guard lock(life->mutex);
+                if (life->alive) return continueWalk(walk, *next);
+            }
+            // The client went away with this page on its way: the walk ends as its outstanding requests did.
+            return walk->reply(Reply(ZemError(ZemError::Kind::ConnectionInvalid)));
         }
         MutableDictionary whole(*message);
         whole.remove(key::kContinuation);

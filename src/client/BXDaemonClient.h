@@ -153,6 +153,15 @@ class BXDaemonClient {
         ConnectionHandler connection;
     };
 
+    // Whether this object still exists, for the reply blocks of a paged walk that would ask for the next page
+    // through it: a page can be read and queued just before the owner destroys the client. Held while such a block
+    // uses the object (it runs no application code meanwhile), so the destructor waits for one that is running.
+    struct Life {
+        std::mutex mutex;
+        bool alive = true;
+    };
+
+    std::shared_ptr<Life> life_ = std::make_shared<Life>();
     std::string serviceName_;
     SerialQueue replyQueue_;
     // Shared with the connection's event handler, which may outlive this object by a queued block.

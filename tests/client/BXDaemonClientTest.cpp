@@ -2,10 +2,16 @@
 // listener on a private service directory), how replies become errors, and the message-form conversions.
 
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
+#include <cstring>
 #include <future>
 #include <mutex>
 #include <optional>
+#include <thread>
 #include <tuple>
 
 #include "TestSupport.h"
@@ -15,6 +21,8 @@
 #include "client/BXDaemonClientSync.h"
 #include "client/BXPlugInMatches.h"
 #include "platform/log/CaptureSink.h"
+#include "platform/zem/ZemFrame.h"
+#include "platform/zem/ZemFrameReader.h"
 #include "platform/zem/ZemListener.h"
 
 namespace bexil {
@@ -203,6 +211,99 @@ TEST_F(BXDaemonClientRequestTest, ARequestThatCannotBeEncodedFailsAloneAndTheCon
     ASSERT_TRUE(next.has_value());
     EXPECT_TRUE(std::holds_alternative<Value>(*next)) << "the connection must survive a request it could not send";
     EXPECT_EQ(service_.lastRequest().get("request"), Value::string("bulk"));
+}
+
+// A service written frame by frame: it answers the first request with a one-way message and, in the same write (so
+// that the client reads both at once and queues their blocks in that order), a page of a paged match that asks for
+// more. It counts the requests that come until the client hangs up.
+class FirstPageService {
+  public:
+    FirstPageService() {
+        std::string path = ZemListener::socketPathForService(BXDaemonClient::kDefaultServiceName).string();
+        listener_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        EXPECT_LT(path.size(), sizeof address.sun_path);
+        std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+        EXPECT_EQ(bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+        EXPECT_EQ(listen(listener_, 1), 0);
+        serving_ = std::thread([this] { serve(); });
+    }
+    ~FirstPageService() {
+        shutdown(listener_, SHUT_RDWR);
+        if (serving_.joinable()) serving_.join();
+        close(listener_);
+    }
+
+    // The requests received, once the client has hung up (waited for up to a time limit).
+    size_t requestsWhenClosed() {
+        if (serving_.joinable()) serving_.join();
+        return requests_;
+    }
+
+  private:
+    void serve() {
+        pollfd incoming{listener_, POLLIN, 0};
+        if (poll(&incoming, 1, 10000) != 1) return;
+        int peer = accept4(listener_, nullptr, nullptr, SOCK_CLOEXEC);
+        if (peer < 0) return;
+        ZemFrameReader reader;
+        uint8_t chunk[4096];
+        for (;;) {
+            while (std::optional<ZemFrame> frame = reader.next()) {
+                if (frame->kind() != ZemFrameKind::Request || ++requests_ > 1) continue;
+                std::vector<uint8_t> both;
+                Value page = Value::dictionary({{"matches", Value::emptyArray()},
+                                                {"continuation", Value::data(std::vector<uint8_t>{1})},
+                                                {"generation", Value::uint64(7)}});
+                EXPECT_FALSE(
+                    ZemFrame::encode(ZemFrameKind::Message, 1, 0, Value::dictionary({{"note", test::str("x")}}), both));
+                EXPECT_FALSE(ZemFrame::encode(ZemFrameKind::Reply, 2, frame->serial(), page, both));
+                EXPECT_EQ(write(peer, both.data(), both.size()), static_cast<ssize_t>(both.size()));
+            }
+            pollfd ready{peer, POLLIN, 0};
+            if (poll(&ready, 1, 10000) != 1) break;
+            ssize_t n = read(peer, chunk, sizeof chunk);
+            if (n <= 0 || reader.feed(std::span<const uint8_t>(chunk, static_cast<size_t>(n)))) break;
+        }
+        close(peer);
+    }
+
+    int listener_ = -1;
+    std::thread serving_;
+    size_t requests_ = 0;
+};
+
+// Guards a paged match whose client is destroyed while a page that asks for more is already read and queued: the
+// walk must not ask for the next page through the destroyed client (it used to, touching freed memory), but end as
+// the client's outstanding requests do, with a connection error, and nothing more reaches the service.
+TEST(BXDaemonClientPagedMatchTest, APageArrivingAfterTheClientIsDestroyedEndsTheWalkWithAConnectionError) {
+    test::TempDir dir("bexil-client-pages");
+    test::ScopedEnv serviceDir("BX_SERVICE_DIR", dir.path().string());
+    FirstPageService service;
+    auto client = std::make_unique<BXDaemonClient>();
+    // The message's block runs first on the reply queue and holds it while this thread destroys the client; the
+    // page's block comes next.
+    std::promise<void> messageArrived, clientGone;
+    std::shared_future<void> gone = clientGone.get_future().share();
+    client->setMessageHandler([&messageArrived, gone](const Value&) {
+        messageArrived.set_value();
+        gone.wait();
+    });
+    std::promise<Reply> walked;
+    client->matchAllPagesReply(Value::dictionary({{"RZExtensionPointIdentifier", test::str("com.example.paged")}}), 0,
+                               4, nullptr, [&walked](const Reply& reply) { walked.set_value(reply); });
+    auto arrived = messageArrived.get_future();
+    ASSERT_EQ(arrived.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    client.reset();
+    clientGone.set_value();
+
+    auto reply = walked.get_future();
+    ASSERT_EQ(reply.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    Reply answer = reply.get();
+    ASSERT_TRUE(std::holds_alternative<ZemError>(answer));
+    EXPECT_EQ(std::get<ZemError>(answer).kind(), ZemError::Kind::ConnectionInvalid);
+    EXPECT_EQ(service.requestsWhenClosed(), 1u);
 }
 
 // ---- errorInReply ----

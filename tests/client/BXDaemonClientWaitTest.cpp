@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <future>
 #include <mutex>
@@ -79,6 +80,16 @@ class EchoService {
     }
 
     void setLateBy(std::chrono::milliseconds delay) { lateBy_.store(delay); }
+    // Stops reading what the clients send, for `pause`; returns once no connection reads any more.
+    void holdReading(std::chrono::milliseconds pause) {
+        queue_.sync([this] {
+            for (auto& peer : peers_) peer->suspend();
+        });
+        queue_.sync([] {});
+        queue_.asyncAfter(pause, [this] {
+            for (auto& peer : peers_) peer->resume();
+        });
+    }
     // The "flags" of every request received, in arrival order.
     std::vector<Value> received() {
         std::lock_guard lock(mutex_);
@@ -262,6 +273,37 @@ TEST_F(BXDaemonClientWaitTest, LargeRequestsAndRepliesCrossIntact) {
             EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), blob.begin(), blob.end())) << size;
         }
     }
+}
+
+// Guards a large request that a waiting thread sends straight from the request's own bytes and cannot finish before
+// its time limit (the service reads nothing for a while): the queue takes over the rest, which must be copied out
+// of the request before the waiting thread lets go of it, and the reply still reaches the request's handler with
+// the request byte for byte.
+TEST_F(BXDaemonClientWaitTest, ALargeRequestCutShortByTheTimeLimitIsFinishedByTheQueue) {
+    BXDaemonClient client;
+    ASSERT_EQ(echoed(bulk(client, 1)), 1u);
+    std::vector<uint8_t> blob(4 << 20);
+    for (size_t i = 0; i < blob.size(); ++i) blob[i] = static_cast<uint8_t>((i * 151) >> 5);
+    service_->holdReading(300ms);
+    auto promise = std::make_shared<std::promise<Reply>>();
+    {
+        Value rules = Value::dictionary({{"blob", Value::data(blob)}});
+        BXDaemonClient::waitOnCallingThread(
+            [&] {
+                client.matchPlugInsFlagsReply(
+                    rules, 9,
+                    BXDaemonClient::CallerThreadHandler{[promise](const Reply& reply) { promise->set_value(reply); }});
+            },
+            [] { return std::chrono::steady_clock::now() + 30ms; });
+    }
+    auto late = promise->get_future();
+    ASSERT_EQ(late.wait_for(10s), std::future_status::ready);
+    Reply reply = late.get();
+    ASSERT_TRUE(std::holds_alternative<Value>(reply));
+    Value back = std::get<Value>(reply).get("echo").get("rules").get("blob");
+    ASSERT_TRUE(back.isData());
+    EXPECT_TRUE(std::ranges::equal(back.dataBytes(), blob));
+    EXPECT_EQ(echoed(bulk(client, 2)), 2u);
 }
 
 }  // namespace

@@ -131,6 +131,66 @@ TEST(ZemCodec, EncoderAppendsOrRefusesWhatAPeerWouldRejectLeavingTheBufferAlone)
     }
 }
 
+// An encoding with the referenced bytes put back where they belong.
+template <class Buffer>
+Bytes withReferences(const Buffer& out, const std::vector<ZemCodec::Reference>& references) {
+    Bytes whole;
+    size_t from = 0;
+    for (const ZemCodec::Reference& reference : references) {
+        whole.insert(whole.end(), out.begin() + static_cast<ptrdiff_t>(from),
+                     out.begin() + static_cast<ptrdiff_t>(reference.offset));
+        whole.insert(whole.end(), reference.bytes.begin(), reference.bytes.end());
+        from = reference.offset;
+    }
+    whole.insert(whole.end(), out.begin() + static_cast<ptrdiff_t>(from), out.end());
+    return whole;
+}
+
+// Guards the encoding that a gathering send takes: strings and data from the minimum size on (and only those) are
+// left out and referenced in place, in order, wherever they are nested, and putting them back gives exactly what
+// encode() writes; a frame's header counts them. What encode() refuses, it refuses too, touching nothing.
+TEST(ZemCodec, ReferencingEncodingLeavesOutLargeContentsAndIsEncodeWithThemPutBack) {
+    const size_t minimum = 100;
+    std::string text(minimum, 'x');
+    Bytes blob(minimum + 1, 0x5A), small(minimum - 1, 0x33);
+    Value value =
+        Value::dictionary({{"a", Value::string(text)},
+                           {"b", Value::array({Value::data(small), Value::data(blob), Value::string(text.substr(1))})},
+                           {"c", Value::dictionary({{"d", Value::data(blob)}, {"e", Value::uint64(300)}})},
+                           {"f", sample()}});
+    ZemBytes out = {0xAA};
+    std::vector<ZemCodec::Reference> references;
+    ASSERT_FALSE(ZemCodec::encodeReferencing(value, out, references, minimum));
+    ASSERT_EQ(references.size(), 3u);
+    EXPECT_EQ(references[0].bytes.data(), reinterpret_cast<const uint8_t*>(value.get("a").stringView().data()));
+    EXPECT_EQ(references[1].bytes.data(), value.get("b").items()[1].dataBytes().data());
+    EXPECT_EQ(references[2].bytes.data(), value.get("c").get("d").dataBytes().data());
+    Bytes expected = {0xAA};
+    Bytes alone = encodeOrDie(value);
+    expected.insert(expected.end(), alone.begin(), alone.end());
+    EXPECT_EQ(withReferences(out, references), expected);
+    EXPECT_EQ(out.size() + 2 * blob.size() + text.size(), expected.size());
+
+    ZemBytes frame;
+    std::vector<ZemCodec::Reference> inFrame;
+    ASSERT_FALSE(ZemFrame::encodeReferencing(ZemFrameKind::Request, 4, 0, value, frame, inFrame, minimum));
+    Bytes plain;
+    ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 4, 0, value, plain));
+    EXPECT_EQ(withReferences(frame, inFrame), plain);
+
+    const std::pair<Value, size_t> refused[] = {
+        {Value::dictionary({{"a", Value::string(text)}, {"b", Value::string("\xff")}}), SIZE_MAX},
+        {Value::dictionary({{"a", Value::string(text)}}), 50},
+    };
+    for (const auto& [bad, limit] : refused) {
+        ZemBytes untouched = {1, 2};
+        std::vector<ZemCodec::Reference> none;
+        EXPECT_TRUE(ZemCodec::encodeReferencing(bad, untouched, none, minimum, limit));
+        EXPECT_EQ(untouched, (ZemBytes{1, 2}));
+        EXPECT_TRUE(none.empty());
+    }
+}
+
 // Guards the decoder's bounds checks: every prefix of an encoding fails cleanly, and so does one byte too many.
 TEST(ZemCodec, EveryTruncationOfAValidEncodingIsRefused) {
     Bytes full = encodeOrDie(sample());
@@ -336,6 +396,112 @@ TEST(ZemFrameReader, FramesBeforeABadHeaderSurviveAndTheErrorSticks) {
     // Nothing after the bad header is trusted, now or later.
     EXPECT_EQ(reader.feed(more), error);
     EXPECT_FALSE(reader.next());
+}
+
+// The payload of frame `serial` in framesOfLengths: bytes that tell frames and offsets apart.
+Bytes payloadOf(uint64_t serial, size_t length) {
+    Bytes payload(length);
+    for (size_t i = 0; i < length; ++i) payload[i] = static_cast<uint8_t>((i * 7 + serial * 13) ^ (i >> 8));
+    return payload;
+}
+
+// A stream of message frames with these payload lengths; frame i (from 1) has serial i and payloadOf(i, length).
+Bytes framesOfLengths(const std::vector<size_t>& lengths) {
+    Bytes stream;
+    uint64_t serial = 0;
+    for (size_t length : lengths) {
+        std::array<uint8_t, ZemFrame::kHeaderBytes> h{};
+        ZemFrame::encodeHeader({ZemFrameKind::Message, ++serial, 0, static_cast<uint32_t>(length), 0}, h);
+        stream.insert(stream.end(), h.begin(), h.end());
+        Bytes payload = payloadOf(serial, length);
+        stream.insert(stream.end(), payload.begin(), payload.end());
+    }
+    return stream;
+}
+
+// Guards the reader's buffer management at each of its boundaries: payloads just under, at and over the size below
+// which nothing is read in place, the first reservation, the point where the rest is reserved at once, and a large
+// frame. Each stream is read in several read sizes, once all through feed() and once as the connection reads it,
+// straight into payloadRoom() whenever that offers room: every frame must come out whole, in order, with nothing
+// of its neighbours, and the in-place reads must carry the bulk of the large payloads.
+TEST(ZemFrameReader, FramesAtEveryBufferBoundaryComeOutWholeWhetherFedOrReadInPlace) {
+    const size_t first = ZemFrameReader::kInitialPayloadReserve;
+    const size_t inPlace = ZemFrameReader::kInPlaceMinimum;
+    const std::vector<size_t> lengths = {
+        0,         1, inPlace - 1,     inPlace,       inPlace + 1,     first - 1, first,
+        first + 1, 3, first + inPlace, 2 * first + 3, size_t{1} << 20, 0,         (size_t{1} << 20) + 13};
+    const Bytes stream = framesOfLengths(lengths);
+    for (size_t readSize : {size_t{7}, size_t{4096}, inPlace + 5, size_t{65536}, stream.size()}) {
+        for (bool useRoom : {false, true}) {
+            SCOPED_TRACE(::testing::Message() << "reads of " << readSize << (useRoom ? " in place" : " fed"));
+            ZemFrameReader reader;
+            size_t at = 0, taken = 0, placed = 0;
+            while (at < stream.size()) {
+                size_t n = std::min(readSize, stream.size() - at);
+                std::span<uint8_t> room = useRoom ? reader.payloadRoom() : std::span<uint8_t>();
+                if (!room.empty()) {
+                    n = std::min(n, room.size());
+                    std::copy_n(stream.begin() + static_cast<ptrdiff_t>(at), n, room.begin());
+                    reader.receivedInPlace(n);
+                    placed += n;
+                } else {
+                    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(stream.data() + at, n)));
+                }
+                at += n;
+                while (std::optional<ZemFrame> frame = reader.next()) {
+                    ASSERT_LT(taken, lengths.size());
+                    ++taken;
+                    EXPECT_EQ(frame->serial(), taken);
+                    Bytes expected = payloadOf(taken, lengths[taken - 1]);
+                    EXPECT_TRUE(
+                        std::equal(frame->payload().begin(), frame->payload().end(), expected.begin(), expected.end()))
+                        << "frame " << taken;
+                }
+            }
+            EXPECT_EQ(taken, lengths.size());
+            EXPECT_FALSE(reader.hasPartialFrame());
+            EXPECT_EQ(reader.bufferedBytes(), 0u);
+            if (useRoom && readSize >= 4096 && readSize < stream.size()) {
+                EXPECT_GT(placed, size_t{1} << 20) << "the large payloads went through feed";
+            } else if (!useRoom) {
+                EXPECT_EQ(placed, 0u);
+            }
+        }
+    }
+}
+
+// Guards what a peer can make the reader allocate: a header announcing a large frame gets room for the first
+// reservation only, the rest once that much has arrived, and never more than the frame announced. A payload with
+// less than kInPlaceMinimum bytes missing is not offered for reading in place, nor one of a broken stream.
+TEST(ZemFrameReader, RoomForAPayloadFollowsTheBytesThatArrive) {
+    const size_t first = ZemFrameReader::kInitialPayloadReserve;
+    const size_t large = size_t{1} << 20;
+    Bytes stream = framesOfLengths({large});
+    ZemFrameReader reader;
+    EXPECT_TRUE(reader.payloadRoom().empty()) << "no header yet";
+    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(stream.data(), ZemFrame::kHeaderBytes + 10)));
+    std::span<uint8_t> room = reader.payloadRoom();
+    EXPECT_EQ(room.size(), first - 10);
+    std::copy_n(stream.begin() + ZemFrame::kHeaderBytes + 10, room.size(), room.begin());
+    reader.receivedInPlace(room.size());
+    EXPECT_EQ(reader.bufferedBytes(), first);
+    EXPECT_TRUE(reader.hasPartialFrame());
+    room = reader.payloadRoom();
+    EXPECT_EQ(room.size(), large - first) << "the rest at once, and not a byte more";
+    const size_t upTo = large - ZemFrameReader::kInPlaceMinimum + 1;
+    std::copy_n(stream.begin() + static_cast<ptrdiff_t>(ZemFrame::kHeaderBytes + first), upTo - first, room.begin());
+    reader.receivedInPlace(upTo - first);
+    EXPECT_TRUE(reader.payloadRoom().empty()) << "the last bytes go through feed()";
+    ASSERT_FALSE(reader.feed(std::span<const uint8_t>(stream.data() + ZemFrame::kHeaderBytes + upTo, large - upTo)));
+    std::optional<ZemFrame> frame = reader.next();
+    ASSERT_TRUE(frame);
+    EXPECT_TRUE(std::equal(frame->payload().begin(), frame->payload().end(), stream.begin() + ZemFrame::kHeaderBytes));
+
+    Bytes broken = framesOfLengths({large});
+    broken[0] = 0;
+    ZemFrameReader refused;
+    EXPECT_TRUE(refused.feed(broken));
+    EXPECT_TRUE(refused.payloadRoom().empty());
 }
 
 }  // namespace

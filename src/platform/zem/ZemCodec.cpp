@@ -165,8 +165,23 @@ class Sizer {
     }
 };
 
-// Second pass: writes what the first pass measured and validated.
-uint8_t* write(uint8_t* p, const Value& v) {
+// Second pass: writes what the first pass measured and validated. Given `references`, it leaves the contents of
+// strings and data of at least `minimum` bytes out and lists them there.
+struct Writer {
+    const uint8_t* base = nullptr;
+    std::vector<ZemCodec::Reference>* references = nullptr;
+    size_t minimum = SIZE_MAX;
+
+    uint8_t* write(uint8_t* p, const Value& v);
+
+    uint8_t* putContents(uint8_t* p, const void* bytes, size_t n) {
+        if (n < minimum) return putBytes(p, bytes, n);
+        references->push_back({static_cast<size_t>(p - base), std::span(static_cast<const uint8_t*>(bytes), n)});
+        return p;
+    }
+};
+
+uint8_t* Writer::write(uint8_t* p, const Value& v) {
     switch (v.kind()) {
         case ValueKind::Null:
             return putTag(p, ZemTag::Null);
@@ -184,11 +199,11 @@ uint8_t* write(uint8_t* p, const Value& v) {
             return putBytes(putTag(p, ZemTag::Uuid), v.getUuid()->bytes().data(), 16);
         case ValueKind::String: {
             std::string_view s = v.stringView();
-            return putBytes(putVarint(putTag(p, ZemTag::String), s.size()), s.data(), s.size());
+            return putContents(putVarint(putTag(p, ZemTag::String), s.size()), s.data(), s.size());
         }
         case ValueKind::Data: {
             auto bytes = v.dataBytes();
-            return putBytes(putVarint(putTag(p, ZemTag::Data), bytes.size()), bytes.data(), bytes.size());
+            return putContents(putVarint(putTag(p, ZemTag::Data), bytes.size()), bytes.data(), bytes.size());
         }
         case ValueKind::Array:
             p = putVarint(putTag(p, ZemTag::Array), v.count());
@@ -486,7 +501,8 @@ Result<size_t> ZemCodec::encodedSize(const Value& value) {
     return sizer.size;
 }
 
-std::optional<Error> ZemCodec::encode(const Value& value, std::vector<uint8_t>& out, size_t maxBytes) {
+template <class Bytes>
+std::optional<Error> ZemCodec::encode(const Value& value, Bytes& out, size_t maxBytes) {
     Sizer sizer;
     sizer.visit(value, 0);
     if (sizer.error) return sizer.error;
@@ -495,9 +511,34 @@ std::optional<Error> ZemCodec::encode(const Value& value, std::vector<uint8_t>& 
                         fmt::format("encoding of {} bytes exceeds the limit of {} bytes", sizer.size, maxBytes));
     size_t start = out.size();
     out.resize(start + sizer.size);
-    uint8_t* end = write(out.data() + start, value);
+    uint8_t* end = Writer{}.write(out.data() + start, value);
     if (end != out.data() + out.size())
         throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
+    return std::nullopt;
+}
+
+template std::optional<Error> ZemCodec::encode(const Value&, std::vector<uint8_t>&, size_t);
+template std::optional<Error> ZemCodec::encode(const Value&, ZemBytes&, size_t);
+
+std::optional<Error> ZemCodec::encodeReferencing(const Value& value, ZemBytes& out, std::vector<Reference>& references,
+                                                 size_t minimum, size_t maxBytes) {
+    Sizer sizer;
+    sizer.visit(value, 0);
+    if (sizer.error) return sizer.error;
+    if (sizer.size > maxBytes)
+        return zemError(ZemErrorCode::FrameTooLarge,
+                        fmt::format("encoding of {} bytes exceeds the limit of {} bytes", sizer.size, maxBytes));
+    // Room for the whole encoding, of which the referenced bytes are then given back (nothing is written there).
+    const size_t start = out.size();
+    const size_t listed = references.size();
+    out.resize(start + sizer.size);
+    Writer writer{out.data(), &references, minimum};
+    uint8_t* end = writer.write(out.data() + start, value);
+    size_t referenced = 0;
+    for (size_t i = listed; i < references.size(); ++i) referenced += references[i].bytes.size();
+    if (static_cast<size_t>(end - out.data()) + referenced != out.size())
+        throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
+    out.resize(static_cast<size_t>(end - out.data()));
     return std::nullopt;
 }
 
@@ -541,7 +582,7 @@ Result<ZemCodec::Entries> ZemCodec::encodeEntries(const Value& dictionary) {
         sizer.visit(e.value, 1);
         if (sizer.error) return *sizer.error;
         value.resize(sizer.size);
-        if (write(value.data(), e.value) != value.data() + value.size())
+        if (Writer{}.write(value.data(), e.value) != value.data() + value.size())
             throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
         if (auto error = appendEntry(entries, e.key, value, static_cast<uint32_t>(sizer.deepest))) return *error;
     }
@@ -590,7 +631,7 @@ std::optional<Error> ZemCodec::encodeMerged(const Entries& entries, const Value&
     out.resize(start + plan.size);
     uint8_t* p = putVarint(putTag(out.data() + start, ZemTag::Dictionary), plan.count);
     auto writeExtra = [&p](const DictionaryEntry& e) {
-        p = write(putBytes(putVarint(p, e.key.size()), e.key.data(), e.key.size()), e.value);
+        p = Writer{}.write(putBytes(putVarint(p, e.key.size()), e.key.data(), e.key.size()), e.value);
     };
     size_t j = 0;
     for (size_t i = 0; i < entries.count(); ++i) {

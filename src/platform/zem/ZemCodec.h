@@ -12,6 +12,7 @@
 
 #include "base/Error.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemBytes.h"
 #include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
@@ -41,8 +42,22 @@ class ZemCodec {
 
     // Appends the encoding of `value` to `out`, growing it once. On an error (a string or key that is not
     // UTF-8, containers nested deeper than kMaxDepth, an encoding longer than `maxBytes`) `out` is left as it was.
-    static std::optional<Error> encode(const Value& value, std::vector<uint8_t>& out, size_t maxBytes = SIZE_MAX);
+    // `out` is a std::vector<uint8_t> or a ZemBytes, which is not zero-filled before the encoding is written.
+    template <class Bytes>
+    static std::optional<Error> encode(const Value& value, Bytes& out, size_t maxBytes = SIZE_MAX);
     static Result<std::vector<uint8_t>> encode(const Value& value);
+
+    // Bytes that an encoding refers to instead of holding them: the contents of a large string or data value,
+    // which belong in `out` right before its byte `offset`. They are the value's own, valid while it lives.
+    struct Reference {
+        size_t offset;
+        std::span<const uint8_t> bytes;
+    };
+    // encode(), except that the contents of every string and data of at least `minimum` bytes are left out of `out`
+    // and appended to `references`, in order: the encoding is `out` with each reference's bytes inserted at its
+    // offset. A sender that gathers the pieces so copies none of those bytes. On an error neither is touched.
+    static std::optional<Error> encodeReferencing(const Value& value, ZemBytes& out, std::vector<Reference>& references,
+                                                  size_t minimum, size_t maxBytes = SIZE_MAX);
 
     // The exact number of bytes encode() would append, or the error it would return.
     static Result<size_t> encodedSize(const Value& value);

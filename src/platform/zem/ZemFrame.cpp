@@ -109,8 +109,10 @@ Result<ZemFrameHeader> ZemFrame::decodeHeader(std::span<const uint8_t, kHeaderBy
     return header;
 }
 
-std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                      std::vector<uint8_t>& out, uint8_t descriptorCount) {
+template <class Bytes, class EncodePayload, class Elsewhere>
+std::optional<Error> ZemFrame::encodeAround(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                            const Value& payload, Bytes& out, uint8_t descriptorCount,
+                                            EncodePayload&& encodePayload, Elsewhere&& elsewhere) {
     if (!payload.isDictionary())
         return zemError(ZemErrorCode::NotDictionary,
                         fmt::format("a {} cannot carry a {}; payloads are dictionaries", zemFrameKindName(kind),
@@ -122,7 +124,7 @@ std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64
     if (auto error = checkHeader(header)) return error;
     size_t start = out.size();
     out.resize(start + kHeaderBytes);
-    if (auto error = ZemCodec::encode(payload, out, kMaxPayloadBytes)) {
+    if (auto error = encodePayload()) {
         out.resize(start);
         if (isZemError(*error, ZemErrorCode::FrameTooLarge)) {
             size_t size = kHeaderBytes + ZemCodec::encodedSize(payload).value();
@@ -131,14 +133,40 @@ std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64
         }
         return error;
     }
-    header.payloadLength = static_cast<uint32_t>(out.size() - start - kHeaderBytes);
+    header.payloadLength = static_cast<uint32_t>(out.size() - start - kHeaderBytes + elsewhere());
     encodeHeader(header, std::span<uint8_t, kHeaderBytes>(out.data() + start, kHeaderBytes));
     return std::nullopt;
 }
 
+template <class Bytes>
+std::optional<Error> ZemFrame::encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
+                                      Bytes& out, uint8_t descriptorCount) {
+    return encodeAround(
+        kind, serial, inReplyTo, payload, out, descriptorCount,
+        [&] { return ZemCodec::encode(payload, out, kMaxPayloadBytes); }, [] { return size_t{0}; });
+}
+
+template std::optional<Error> ZemFrame::encode(ZemFrameKind, uint64_t, uint64_t, const Value&, std::vector<uint8_t>&,
+                                               uint8_t);
+template std::optional<Error> ZemFrame::encode(ZemFrameKind, uint64_t, uint64_t, const Value&, ZemBytes&, uint8_t);
+
+std::optional<Error> ZemFrame::encodeReferencing(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                                 const Value& payload, ZemBytes& out,
+                                                 std::vector<ZemCodec::Reference>& references, size_t minimum) {
+    const size_t listed = references.size();
+    return encodeAround(
+        kind, serial, inReplyTo, payload, out, 0,
+        [&] { return ZemCodec::encodeReferencing(payload, out, references, minimum, kMaxPayloadBytes); },
+        [&] {
+            size_t referenced = 0;
+            for (size_t i = listed; i < references.size(); ++i) referenced += references[i].bytes.size();
+            return referenced;
+        });
+}
+
+template <class Bytes>
 std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
-                                             std::span<const uint8_t> payload, std::vector<uint8_t>& out,
-                                             uint8_t descriptorCount) {
+                                             std::span<const uint8_t> payload, Bytes& out, uint8_t descriptorCount) {
     if (payload.empty() || payload[0] != static_cast<uint8_t>(ZemTag::Dictionary))
         return zemError(
             ZemErrorCode::NotDictionary,
@@ -158,5 +186,10 @@ std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind kind, uint64_t serial,
     std::memcpy(out.data() + start + kHeaderBytes, payload.data(), payload.size());
     return std::nullopt;
 }
+
+template std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind, uint64_t, uint64_t, std::span<const uint8_t>,
+                                                      std::vector<uint8_t>&, uint8_t);
+template std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind, uint64_t, uint64_t, std::span<const uint8_t>,
+                                                      ZemBytes&, uint8_t);
 
 }  // namespace bexil

@@ -13,6 +13,8 @@
 
 #include "base/Error.h"
 #include "bexil/Value.h"
+#include "platform/zem/ZemBytes.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemProtocolError.h"
 
 namespace bexil {
@@ -49,14 +51,14 @@ class ZemFrame {
     static constexpr uint8_t kMaxDescriptorsPerFrame = 4;
 
     ZemFrame() = default;
-    ZemFrame(ZemFrameHeader header, std::vector<uint8_t> payload) : header_(header), payload_(std::move(payload)) {}
+    ZemFrame(ZemFrameHeader header, ZemBytes payload) : header_(header), payload_(std::move(payload)) {}
 
     const ZemFrameHeader& header() const { return header_; }
     ZemFrameKind kind() const { return header_.kind; }
     uint64_t serial() const { return header_.serial; }
     uint64_t inReplyTo() const { return header_.inReplyTo; }
-    const std::vector<uint8_t>& payload() const { return payload_; }
-    std::vector<uint8_t> takePayload() { return std::move(payload_); }
+    const ZemBytes& payload() const { return payload_; }
+    ZemBytes takePayload() { return std::move(payload_); }
 
     // The payload as a Value; a payload that decodes to anything but a dictionary is a NotDictionary error.
     Result<Value> decodePayload() const;
@@ -76,17 +78,33 @@ class ZemFrame {
 
     // Appends a complete frame (header and encoded `payload`, which must be a dictionary) to `out`, which grows
     // once; the header announces `descriptorCount` descriptors, which the caller sends with the frame's first byte.
-    // On any error, `out` is left as it was.
+    // On any error, `out` is left as it was. `out` is a std::vector<uint8_t> or a ZemBytes (see ZemCodec::encode).
+    template <class Bytes>
     static std::optional<Error> encode(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Value& payload,
-                                       std::vector<uint8_t>& out, uint8_t descriptorCount = 0);
-    // The same with the payload already encoded (one dictionary, as ZemCodec writes it).
+                                       Bytes& out, uint8_t descriptorCount = 0);
+
+    // encode() for a sender that gathers: the contents of strings and data of at least `minimum` bytes are not
+    // copied into `out` but listed in `references` (ZemCodec::encodeReferencing), and the header counts them. The
+    // frame is `out` with each reference's bytes inserted at its offset; they stay valid while `payload` lives.
+    static std::optional<Error> encodeReferencing(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                                  const Value& payload, ZemBytes& out,
+                                                  std::vector<ZemCodec::Reference>& references, size_t minimum);
+    // encode() with the payload already encoded (one dictionary, as ZemCodec writes it).
+    template <class Bytes>
     static std::optional<Error> encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
-                                              std::span<const uint8_t> payload, std::vector<uint8_t>& out,
+                                              std::span<const uint8_t> payload, Bytes& out,
                                               uint8_t descriptorCount = 0);
 
   private:
+    // The checks and the header around a payload that `encodePayload()` appends to `out`, of which `elsewhere()`
+    // bytes are not in `out`.
+    template <class Bytes, class EncodePayload, class Elsewhere>
+    static std::optional<Error> encodeAround(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                             const Value& payload, Bytes& out, uint8_t descriptorCount,
+                                             EncodePayload&& encodePayload, Elsewhere&& elsewhere);
+
     ZemFrameHeader header_;
-    std::vector<uint8_t> payload_;
+    ZemBytes payload_;
 };
 
 }  // namespace bexil

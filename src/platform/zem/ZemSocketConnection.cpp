@@ -2,10 +2,12 @@
 
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/uio.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cinttypes>
+#include <climits>
 #include <cstring>
 
 #include "base/EventLoopAsio.h"
@@ -332,13 +334,26 @@ bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQu
         return false;
     }
     const uint64_t serial = nextSerial_++;
-    if (std::optional<Error> error = ZemFrame::encode(ZemFrameKind::Request, serial, 0, message, outgoing_)) {
+    std::vector<ZemCodec::Reference> references;
+    if (std::optional<Error> error = ZemFrame::encodeReferencing(ZemFrameKind::Request, serial, 0, message, outgoing_,
+                                                                 references, kGatherMinimum)) {
         log::ops().error("cannot send %s to peer %d: %@", zemFrameKindName(ZemFrameKind::Request),
                          static_cast<int>(pid_), *error);
         handBack({});
         handler(std::variant<ZemMessage, ZemError>(ZemError(ZemError::Kind::MessageInvalid)));
         return true;
     }
+    // The frame in the pieces a gathering send takes: outgoing_, with the referenced bytes of `message` between its
+    // parts. Pieces before `first` have gone; the one at `first` may have gone in part.
+    std::vector<iovec> pieces;
+    size_t from = 0;
+    for (const ZemCodec::Reference& reference : references) {
+        if (reference.offset > from) pieces.push_back({outgoing_.data() + from, reference.offset - from});
+        pieces.push_back({const_cast<uint8_t*>(reference.bytes.data()), reference.bytes.size()});
+        from = reference.offset;
+    }
+    if (outgoing_.size() > from) pieces.push_back({outgoing_.data() + from, outgoing_.size() - from});
+    size_t first = 0;
     auto answer = [&](std::variant<ZemMessage, ZemError> reply, HandBack work) {
         handBack(std::move(work));
         handler(reply);
@@ -350,23 +365,43 @@ bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQu
         work.broken = kind;
         return answer(ZemError(kind), std::move(work));
     };
-    // The deadline came first: the queue waits for the reply in this thread's place.
-    auto adopt = [&](size_t sent) {
-        outgoing_.erase(outgoing_.begin(), outgoing_.begin() + static_cast<std::ptrdiff_t>(sent));
+    // The deadline came first: the queue sends the rest, which `message` will not outlive, and waits for the reply
+    // in this thread's place.
+    auto adopt = [&] {
+        ZemBytes rest;
+        for (size_t i = first; i < pieces.size(); ++i) {
+            const auto* bytes = static_cast<const uint8_t*>(pieces[i].iov_base);
+            rest.insert(rest.end(), bytes, bytes + pieces[i].iov_len);
+        }
+        outgoing_.swap(rest);
         HandBack work;
         work.adopted.emplace(serial, PendingReply{replyQueue, std::move(handler)});
         handBack(std::move(work));
         return true;
     };
-    for (size_t sent = 0; sent < outgoing_.size();) {
-        ssize_t bytes = ::send(fd, outgoing_.data() + sent, outgoing_.size() - sent, MSG_DONTWAIT | MSG_NOSIGNAL);
+    while (first < pieces.size()) {
+        msghdr gathered{};
+        gathered.msg_iov = pieces.data() + first;
+        gathered.msg_iovlen = std::min<size_t>(pieces.size() - first, IOV_MAX);
+        ssize_t bytes = gathered.msg_iovlen == 1
+                            ? ::send(fd, pieces[first].iov_base, pieces[first].iov_len, MSG_DONTWAIT | MSG_NOSIGNAL)
+                            : ::sendmsg(fd, &gathered, MSG_DONTWAIT | MSG_NOSIGNAL);
         if (bytes >= 0) {
-            sent += static_cast<size_t>(bytes);
+            for (auto left = static_cast<size_t>(bytes); left > 0;) {
+                iovec& piece = pieces[first];
+                if (left < piece.iov_len) {
+                    piece.iov_base = static_cast<uint8_t*>(piece.iov_base) + left;
+                    piece.iov_len -= left;
+                    break;
+                }
+                left -= piece.iov_len;
+                ++first;
+            }
             continue;
         }
         if (errno == EINTR) continue;
         if (errno != EAGAIN && errno != EWOULDBLOCK) return fail(ZemError::Kind::ConnectionInterrupted);
-        if (!pollUntil(fd, POLLOUT, deadline)) return adopt(sent);
+        if (!pollUntil(fd, POLLOUT, deadline)) return adopt();
     }
     outgoing_.clear();
     for (;;) {
@@ -402,7 +437,7 @@ bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQu
                              *reader_.error());
             return fail(ZemError::Kind::ConnectionInvalid);
         }
-        if (!pollUntil(fd, POLLIN, deadline)) return adopt(0);
+        if (!pollUntil(fd, POLLIN, deadline)) return adopt();
         bool overflow = false;
         ssize_t bytes = receiveInto(fd, overflow);
         if (overflow) {
@@ -421,7 +456,6 @@ bool ZemSocketConnection::exchangeOnCallingThread(const Value& message, SerialQu
             if (errno == EINTR || errno == EAGAIN || errno == EWOULDBLOCK) continue;
             return fail(ZemError::Kind::ConnectionInterrupted);
         }
-        reader_.feed(std::span<const uint8_t>(readBuffer_.data(), static_cast<size_t>(bytes)));
     }
 }
 
@@ -510,7 +544,7 @@ void ZemSocketConnection::readMore() {
         }
         ssize_t bytes = receive();
         if (bytes > 0) {
-            if (!consume(static_cast<size_t>(bytes))) return;
+            if (!consume()) return;
             continue;
         }
         if (bytes == 0) return endOfStream();
@@ -547,8 +581,17 @@ ssize_t ZemSocketConnection::receive() {
 }
 
 ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
-    if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
-    iovec chunk{readBuffer_.data(), readBuffer_.size()};
+    // On the daemon's side the bulk of a large payload goes straight into the frame; anything else into the read
+    // buffer, from which one read may cut several frames. A client reads its replies through the buffer: in a
+    // client process that decodes a large reply and lets it go again, reading in place measured many times slower,
+    // since the heap was then given back to the system and faulted in again on every reply.
+    std::span<uint8_t> into = side_ == Side::Peer ? reader_.payloadRoom() : std::span<uint8_t>();
+    const bool inPlace = !into.empty();
+    if (!inPlace) {
+        if (readBuffer_.size() != kReadChunkBytes) readBuffer_.resize(kReadChunkBytes);
+        into = readBuffer_;
+    }
+    iovec chunk{into.data(), into.size()};
     // Room for one frame's descriptors: the kernel never joins the descriptors of two sends in one read.
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * ZemFrame::kMaxDescriptorsPerFrame)];
     msghdr message{};
@@ -568,6 +611,12 @@ ssize_t ZemSocketConnection::receiveInto(int fd, bool& overflow) {
         }
     }
     overflow = (message.msg_flags & MSG_CTRUNC) != 0 || receivedFds_.size() > kMaxPendingDescriptors;
+    if (bytes > 0 && !overflow) {
+        if (inPlace)
+            reader_.receivedInPlace(static_cast<size_t>(bytes));
+        else
+            reader_.feed(std::span<const uint8_t>(readBuffer_.data(), static_cast<size_t>(bytes)));
+    }
     return bytes;
 }
 
@@ -578,8 +627,8 @@ void ZemSocketConnection::endOfStream() {
     close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
 }
 
-bool ZemSocketConnection::consume(size_t bytes) {
-    std::optional<Error> broken = reader_.feed(std::span<const uint8_t>(readBuffer_.data(), bytes));
+bool ZemSocketConnection::consume() {
+    std::optional<Error> broken = reader_.error();
     // Frames completed before a bad header are still whole and are handled; then the stream is dropped.
     while (std::optional<ZemFrame> frame = reader_.next()) {
         if (state_ != State::Open) return false;

@@ -32,6 +32,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     static constexpr size_t kMaxQueuedBytes = 64 * 1024 * 1024;
     // Size of one read from the socket.
     static constexpr size_t kReadChunkBytes = 64 * 1024;
+    // Strings and data of at least this many bytes in a request that a waiting thread sends itself go to the socket
+    // straight from the request (a gathering send), not copied into the outgoing buffer first.
+    static constexpr size_t kGatherMinimum = 16 * 1024;
     // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
     // requests, few enough that one peer cannot keep the loop to itself.
     static constexpr int kReadsPerTurn = 4;
@@ -131,12 +134,14 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     void handBack(HandBack work);
     // Waits on the calling thread until `fd` is ready for `events`; false once `deadline` has passed.
     static bool pollUntil(int fd, short events, std::chrono::steady_clock::time_point deadline);
-    // One recvmsg: the bytes read (0 at the end of the stream) or -1 with errno; descriptors go to receivedFds_.
+    // One recvmsg: the bytes read (0 at the end of the stream) or -1 with errno. The bytes go to reader_,
+    // descriptors to receivedFds_.
     ssize_t receive();
-    // The recvmsg behind receive() on `fd`; sets `overflow` when the peer passed more descriptors than allowed.
+    // The recvmsg behind receive() on `fd`; sets `overflow` when the peer passed more descriptors than allowed (the
+    // bytes then stay out of reader_).
     ssize_t receiveInto(int fd, bool& overflow);
-    // Cuts and handles the frames in the `bytes` just read. False when the connection ended on the way.
-    bool consume(size_t bytes);
+    // Handles the frames that reader_ has completed. False when the connection ended on the way.
+    bool consume();
     // The peer closed its end, or the socket failed.
     void endOfStream();
     // Peer side: arms the stall timer while no frame has come yet, part of one waits, or reading is paused for
@@ -192,8 +197,8 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     bool reading_ = false;
     ZemFrameReader reader_;
     std::vector<uint8_t> readBuffer_;
-    std::vector<uint8_t> outgoing_;       // frames waiting for the write in flight to finish
-    std::vector<uint8_t> writing_;        // the frames of the write in flight
+    ZemBytes outgoing_;                   // frames waiting for the write in flight to finish
+    ZemBytes writing_;                    // the frames of the write in flight
     std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
     std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
