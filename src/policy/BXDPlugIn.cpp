@@ -1,5 +1,6 @@
 #include "policy/BXDPlugIn.h"
 
+#include <atomic>
 #include <cerrno>
 #include <cmath>
 #include <cstdint>
@@ -200,7 +201,16 @@ bool changesWhileKept(std::string_view key) {
            key == protocol::form::kLocalizedShortName || key == protocol::form::kLocalizedContainingDisplayName;
 }
 
+std::atomic<size_t> keptBytes{0};
+std::atomic<size_t> keptBudget{BXDPlugIn::kKeptFormBudgetBytes};
+// Set when the budget was reached and not logged since; the log says so once per time it fills up.
+std::atomic<bool> budgetReached{false};
+
 }  // namespace
+
+size_t BXDPlugIn::keptFormBytes() { return keptBytes.load(std::memory_order_relaxed); }
+
+void BXDPlugIn::setKeptFormBudget(size_t bytes) { keptBudget.store(bytes, std::memory_order_relaxed); }
 
 std::shared_ptr<const ZemCodec::Entries> BXDPlugIn::keptFormEntries() const {
     if (std::shared_ptr<const ZemCodec::Entries> kept = load(keptFormEntries_)) return kept;
@@ -213,7 +223,24 @@ std::shared_ptr<const ZemCodec::Entries> BXDPlugIn::keptFormEntries() const {
         log::ops().error("cannot encode the form of plug-in %@: %@", description(), encoded.error());
         return nullptr;
     }
-    auto kept = std::make_shared<const ZemCodec::Entries>(std::move(*encoded));
+    // The entries charge the budget for as long as they live: in the record, or in a reply still being written.
+    const size_t bytes = sizeof(ZemCodec::Entries) + encoded->bytes.capacity() +
+                         encoded->starts.capacity() * sizeof(decltype(encoded->starts)::value_type);
+    if (keptBytes.fetch_add(bytes, std::memory_order_relaxed) + bytes > keptBudget.load(std::memory_order_relaxed)) {
+        keptBytes.fetch_sub(bytes, std::memory_order_relaxed);
+        if (!budgetReached.exchange(true))
+            log::ops().info(
+                "kept forms hold %zu bytes, the budget (kKeptFormBudgetBytes): further forms are "
+                "encoded for each reply",
+                keptFormBytes());
+        return std::make_shared<const ZemCodec::Entries>(std::move(*encoded));
+    }
+    std::shared_ptr<const ZemCodec::Entries> kept(new ZemCodec::Entries(std::move(*encoded)),
+                                                  [bytes](const ZemCodec::Entries* entries) {
+                                                      delete entries;
+                                                      keptBytes.fetch_sub(bytes, std::memory_order_relaxed);
+                                                      budgetReached.store(false, std::memory_order_relaxed);
+                                                  });
     // Two first discoveries at once may both encode it; either result is the same.
     BXDPlugIn* self = const_cast<BXDPlugIn*>(this);
     self->store(self->keptFormEntries_, std::shared_ptr<const ZemCodec::Entries>(kept));

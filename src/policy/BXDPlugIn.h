@@ -41,6 +41,10 @@ class BXDPlugIn : public BXPlugInCore {
     static constexpr std::string_view kAutoElectEntitlement = "com.quorvel.developer.auto-elect-plugin";
     // Plug-ins outside any application must live below this directory.
     static constexpr std::string_view kSystemPrefix = "/System/";
+    // What the kept form entries of all records may hold together (see keptFormEntries). A full discovery keeps
+    // about 1 KB per plug-in, so a large registry would otherwise double the cache's memory; past the budget a
+    // form's entries are encoded for the reply at hand and not kept (logged when first reached).
+    static constexpr size_t kKeptFormBudgetBytes = 16 * 1024 * 1024;
 
     BXDPlugIn() = default;
 
@@ -75,6 +79,10 @@ class BXDPlugIn : public BXPlugInCore {
     // the display names (filled in when first asked of the registry), which addChangingFormEntries writes on every
     // call, besides what augmentForm adds. Null when the form cannot be encoded (logged).
     std::shared_ptr<const ZemCodec::Entries> keptFormEntries() const;
+    // The bytes the kept form entries of all records hold now, and the budget they may hold (kKeptFormBudgetBytes
+    // unless changed, as tests and benchmarks do). Safe on any thread.
+    static size_t keptFormBytes();
+    static void setKeptFormBudget(size_t bytes);
     void addChangingFormEntries(MutableDictionary& form) const;
     // Tokens for resource paths inside the bundle ("." is the bundle itself), keyed by the path as given. `paths`
     // is one string or an array; other elements are passed over; paths that get no token are left out (logged), and

@@ -220,6 +220,39 @@ TEST(BXDPlugInInfo, DisplayNamesAreFetchedLazilyAndCached) {
     EXPECT_EQ(form->value().get("bundleInfo"), helloInfo());
 }
 
+// Discovery keeps each record's encoded form while the budget allows. Past it the entries are made for each reply
+// and must be the same bytes; what records keep is given back to the budget when they go, or a long-running daemon
+// would stop keeping forms for good after enough registrations.
+TEST(BXDPlugInInfo, KeptFormsStayWithinTheirBudgetAndGiveItBack) {
+    const size_t before = BXDPlugIn::keptFormBytes();
+    std::shared_ptr<BXDPlugIn> kept = build(helloFields());
+    ASSERT_NE(kept, nullptr);
+    std::shared_ptr<const ZemCodec::Entries> first = kept->keptFormEntries();
+    ASSERT_NE(first, nullptr);
+    EXPECT_EQ(kept->keptFormEntries(), first) << "a kept form is made once";
+    const size_t charged = BXDPlugIn::keptFormBytes() - before;
+    EXPECT_GE(charged, first->bytes.size());
+
+    BXDPlugIn::setKeptFormBudget(before + charged);  // full: nothing more fits
+    std::shared_ptr<BXDPlugIn> over = build(helloFields());
+    ASSERT_NE(over, nullptr);
+    std::shared_ptr<const ZemCodec::Entries> a = over->keptFormEntries();
+    std::shared_ptr<const ZemCodec::Entries> b = over->keptFormEntries();
+    ASSERT_NE(a, nullptr);
+    ASSERT_NE(b, nullptr);
+    EXPECT_NE(a, b) << "past the budget nothing is kept";
+    EXPECT_EQ(a->bytes, first->bytes);
+    EXPECT_EQ(a->starts, first->starts);
+    EXPECT_EQ(BXDPlugIn::keptFormBytes(), before + charged);
+
+    first.reset();
+    kept.reset();
+    EXPECT_EQ(BXDPlugIn::keptFormBytes(), before) << "a dropped record gives its bytes back";
+    std::shared_ptr<const ZemCodec::Entries> now = over->keptFormEntries();
+    EXPECT_EQ(over->keptFormEntries(), now) << "room again: the form is kept";
+    BXDPlugIn::setKeptFormBudget(BXDPlugIn::kKeptFormBudgetBytes);
+}
+
 // Only the build tools' "DT" keys go, by a case-sensitive prefix: a key that merely starts with "dt", or holds
 // "DT" later, is the bundle's own.
 TEST(BXDPlugInInfo, PruningDropsTheBuildToolKeysOnly) {
