@@ -13,6 +13,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <mutex>
 #include <unordered_set>
 
 #include "base/QueueAssert.h"
@@ -145,8 +146,13 @@ std::shared_ptr<BXDPlugIn> BXDatabase::createPlugInForProxy(const std::shared_pt
     if (!plugIn) return nullptr;
     if (plugIn->hasEntitlement(BXDPlugIn::kAutoElectEntitlement)) autoElect(*plugIn);
     purgeCachesToLimit(cacheLimit());
-    // A record always has a UUID after set-up (a random one when the registry gave none).
-    cache_[*plugIn->uuid()] = plugIn;
+    // A record always has a UUID after set-up (a random one when the registry gave none). One it replaces is let go
+    // outside cacheEntries_, which is held around the change itself only.
+    std::shared_ptr<BXDPlugIn> replaced = plugIn;
+    {
+        std::unique_lock entries(cacheEntries_);
+        cache_[*plugIn->uuid()].swap(replaced);
+    }
     return plugIn;
 }
 
@@ -155,7 +161,10 @@ void BXDatabase::purgeCachesToLimit(unsigned limit) {
     if (cache_.size() <= limit) return;
     log::ops().info("purging cache for %d > %d", cache_.size(), limit);
     auto released = std::make_shared<RecordMap>();
-    released->swap(cache_);
+    {
+        std::unique_lock entries(cacheEntries_);
+        released->swap(cache_);
+    }
     purgesReleasing_.fetch_add(1);
     releaseOnWriter(std::move(released));
 }
@@ -279,20 +288,38 @@ LXPlugInFilter BXDatabase::filterFor(const Value& query) {
 
 std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugIns(const Value& query) {
     BX_ASSERT_NOT_ON_QUEUE(_sync);
-    std::optional<LXProxyList> proxies;
-    if (!query.isDictionary() || query.count() == 0) {
-        proxies = workspace_->installedPlugins();
-        log::lx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
-    } else {
-        proxies = workspace_->pluginsMatchingQueryApplyFilter(query, filterFor(query), preselectionFor(query));
-        log::lx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, query, proxies);
-    }
-
+    const bool all = !query.isDictionary() || query.count() == 0;
+    const LXPlugInFilter filter = all ? LXPlugInFilter() : filterFor(query);
+    const LXPreselection preselection = all ? LXPreselection{} : preselectionFor(query);
     size_t cachedBefore = cachedCount();
-    if (!proxies) return std::nullopt;
-    PlugInSet result = recordsForProxies(*proxies);
-    log::ops().debug("LX reported %u plug-ins (cache %u/%u)", result.size(), cachedBefore, cachedCount());
+    std::optional<PlugInSet> result = recordsAsking([&](const LXKnownRecord& known) {
+        std::optional<LXCandidateList> candidates =
+            all ? workspace_->installedCandidates(known)
+                : workspace_->candidatesMatchingQuery(query, filter, preselection, known);
+        log::lx().debug("%d plugin(s) matching %@", candidates ? candidates->size() : 0, query);
+        return candidates;
+    });
+    if (!result) return std::nullopt;
+    log::ops().debug("LX reported %u plug-ins (cache %u/%u)", result->size(), cachedBefore, cachedCount());
     return result;
+}
+
+bool BXDatabase::cacheHolds(const Uuid& uuid) const {
+    std::shared_lock entries(cacheEntries_);
+    return cache_.count(uuid) > 0;
+}
+
+std::optional<BXDatabase::PlugInSet> BXDatabase::recordsAsking(
+    const std::function<std::optional<LXCandidateList>(const LXKnownRecord& known)>& ask) {
+    std::optional<LXCandidateList> candidates = ask([this](const Uuid& uuid) { return cacheHolds(uuid); });
+    if (!candidates) return std::nullopt;
+    if (std::optional<PlugInSet> records = recordsForCandidates(*candidates)) return records;
+    // What the registry left out may have changed since: its record is read again rather than guessed, the
+    // query's other candidates with it, so that the answer is one state of the registry.
+    log::ops().debug("a record left out of a query went from the cache meanwhile; asking the registry again");
+    candidates = ask(LXKnownRecord());
+    if (!candidates) return std::nullopt;
+    return recordsForCandidates(*candidates);
 }
 
 std::optional<BXDatabase::PlugInSet> BXDatabase::findPlugInsWithIdentifier(const Value& query,
@@ -316,19 +343,43 @@ std::optional<BXDatabase::PlugInSlice> BXDatabase::findPlugInsAfterIdentifier(co
                                                                               size_t rows) {
     BX_ASSERT_NOT_ON_QUEUE(_sync);
     // An empty query is every installed plug-in, as in findPlugIns: no pre-selection, and no election is wanted.
-    std::optional<LXWalkSlice> slice =
-        workspace_->pluginsMatchingQueryAfterIdentifier(query, filterFor(query), preselectionFor(query), after, rows);
-    if (!slice) return std::nullopt;
-    return PlugInSlice{recordsForProxies(slice->plugIns), std::move(slice->last), slice->ended};
+    const LXPlugInFilter filter = filterFor(query);
+    const LXPreselection preselection = preselectionFor(query);
+    std::optional<LXCandidateSlice> slice;
+    std::optional<PlugInSet> records = recordsAsking([&](const LXKnownRecord& known) -> std::optional<LXCandidateList> {
+        slice = workspace_->candidatesAfterIdentifier(query, filter, preselection, after, rows, known);
+        if (!slice) return std::nullopt;
+        return std::move(slice->candidates);
+    });
+    if (!records) return std::nullopt;
+    return PlugInSlice{std::move(*records), std::move(slice->last), slice->ended};
 }
 
 BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) {
+    LXCandidateList candidates;
+    candidates.reserve(proxies.size());
+    for (const std::shared_ptr<const LXBexilProxy>& proxy : proxies)
+        candidates.push_back(LXCandidate{proxy, {}, false});
+    // Every candidate has its registry record: there is none to miss in the cache.
+    return *recordsForCandidates(candidates);
+}
+
+std::optional<BXDatabase::PlugInSet> BXDatabase::recordsForCandidates(const LXCandidateList& candidates) {
     PlugInSet result;
-    result.reserve(proxies.size());
+    result.reserve(candidates.size());
     std::unordered_set<Uuid> seen;
-    std::vector<const std::shared_ptr<const LXBexilProxy>*> wanted;
-    wanted.reserve(proxies.size());
-    for (const std::shared_ptr<const LXBexilProxy>& proxy : proxies) {
+    std::vector<const LXCandidate*> wanted;
+    wanted.reserve(candidates.size());
+    for (const LXCandidate& candidate : candidates) {
+        const std::shared_ptr<const LXBexilProxy>& proxy = candidate.proxy;
+        if (!proxy) {
+            if (candidate.inPlaceholderApplication) {
+                log::ops().info("skipping plug-in %@ because its app is a placeholder", candidate.uuid.string());
+                continue;
+            }
+            wanted.push_back(&candidate);
+            continue;
+        }
         if (!proxy->bundleURL()) {
             log::ops().info("skipping lx proxy %@ with nil bundleURL", proxy->description());
             continue;
@@ -340,19 +391,27 @@ BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) 
             log::ops().info("skipping lx proxy %@ because its app is a placeholder", proxy->description());
             continue;
         }
-        wanted.push_back(&proxy);
+        wanted.push_back(&candidate);
     }
     // The records are looked up a stretch at a time inside `_sync`, not one entry each: a discovery of every plug-in
     // would otherwise enter it once per candidate. A stretch bounds how long a cold cache, which builds the records,
     // keeps others out.
     constexpr size_t kStretch = 64;
-    for (size_t from = 0; from < wanted.size(); from += kStretch) {
+    bool uncached = false;
+    for (size_t from = 0; from < wanted.size() && !uncached; from += kStretch) {
         const size_t to = std::min(wanted.size(), from + kStretch);
         _sync.sync([&] {
             for (size_t i = from; i < to; ++i) {
-                const std::shared_ptr<const LXBexilProxy>& proxy = *wanted[i];
+                const std::shared_ptr<const LXBexilProxy>& proxy = wanted[i]->proxy;
                 std::shared_ptr<BXDPlugIn> plugIn;
-                if (proxy->pluginUUID()) {
+                if (!proxy) {
+                    auto hit = cache_.find(wanted[i]->uuid);
+                    if (hit == cache_.end()) {
+                        uncached = true;
+                        return;
+                    }
+                    plugIn = hit->second;
+                } else if (proxy->pluginUUID()) {
                     auto hit = cache_.find(*proxy->pluginUUID());
                     if (hit != cache_.end()) plugIn = hit->second;
                 }
@@ -362,6 +421,7 @@ BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) 
             }
         });
     }
+    if (uncached) return std::nullopt;
     return result;
 }
 
@@ -461,7 +521,15 @@ void BXDatabase::pluginsWillUninstall(const std::vector<std::shared_ptr<const LX
         for (const std::shared_ptr<const LXBexilProxy>& proxy : plugIns) {
             log::ops().notice("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier(),
                               proxy->pluginIdentifier(), proxy->bundleVersion(), uuidText(proxy), pathOf(proxy));
-            if (proxy->pluginUUID()) cache_.erase(*proxy->pluginUUID());
+            if (!proxy->pluginUUID()) continue;
+            std::shared_ptr<BXDPlugIn> dropped;
+            {
+                std::unique_lock entries(cacheEntries_);
+                auto hit = cache_.find(*proxy->pluginUUID());
+                if (hit == cache_.end()) continue;
+                dropped = std::move(hit->second);
+                cache_.erase(hit);
+            }
         }
     });
     if (BXDatabaseDelegate* target = delegate()) target->removedPlugIns(plugIns);

@@ -15,6 +15,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <shared_mutex>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -204,6 +205,16 @@ class BXDatabase {
     // The records of the registry's candidates, without duplicates, skipping those without bundle URL and those of
     // placeholder applications. REQUIRES: not inside `_sync`.
     PlugInSet recordsForProxies(const LXProxyList& proxies);
+    // The same for candidates some of which are UUIDs only, taken from the cache; none when one of those is no
+    // longer cached (its plug-in changed, or the cache was purged, since the query).
+    std::optional<PlugInSet> recordsForCandidates(const LXCandidateList& candidates);
+    // The records of what `ask` hands back when told which records the cache holds, so that the registry reads only
+    // the others. When one of those left the cache before it was looked up, `ask` is asked again told nothing, and
+    // every record comes from what it reads then; none when the registry cannot be read.
+    std::optional<PlugInSet> recordsAsking(
+        const std::function<std::optional<LXCandidateList>(const LXKnownRecord& known)>& ask);
+    // Whether the cache holds a record for the UUID, callable outside `_sync` (while the registry holds its lock).
+    bool cacheHolds(const Uuid& uuid) const;
     // The registry's pre-selection and election filter for a query.
     LXPreselection preselectionFor(const Value& query) const;
     LXPlugInFilter filterFor(const Value& query);
@@ -223,6 +234,10 @@ class BXDatabase {
     std::unique_ptr<BXAnnotationSource> annotationSource_;
     SyncQueue _sync{"BXDatabase"};
     RecordMap cache_;
+    // Changes to cache_'s entries take this as well as `_sync`, so that cacheHolds() can read it without `_sync`:
+    // the registry asks while holding its lock, which a thread inside `_sync` may be waiting for. Held only around
+    // the change itself.
+    mutable std::shared_mutex cacheEntries_;
     std::atomic<unsigned> purgesReleasing_{0};
     // Last, so that the writer's thread has stopped before anything its blocks use goes away.
     EventLoop writerLoop_{1};

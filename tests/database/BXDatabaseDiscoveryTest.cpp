@@ -2,6 +2,8 @@
 
 #include <algorithm>
 #include <filesystem>
+#include <functional>
+#include <utility>
 
 #include "TestSupport.h"
 #include "database/BXDAnnotationStore.h"
@@ -55,8 +57,44 @@ class ScriptedWorkspace : public LXApplicationWorkspace {
         }
         return kept;
     }
+    // As a registry does: a candidate whose record the caller holds comes back as its UUID, unless a filter needs
+    // it. `betweenQueryAndLookUp` runs once, after the answer is made and before the database looks it up.
+    std::optional<LXCandidateList> installedCandidates(const LXKnownRecord& known) override {
+        return held(LXApplicationWorkspace::installedCandidates(known), {}, known);
+    }
+    std::optional<LXCandidateList> candidatesMatchingQuery(const Value& query, const LXPlugInFilter& filter,
+                                                           const LXPreselection& preselection,
+                                                           const LXKnownRecord& known) override {
+        return held(LXApplicationWorkspace::candidatesMatchingQuery(query, filter, preselection, known), filter, known);
+    }
+    std::optional<LXCandidateSlice> candidatesAfterIdentifier(const Value& query, const LXPlugInFilter& filter,
+                                                              const LXPreselection& preselection,
+                                                              const std::optional<std::string>& after, size_t rows,
+                                                              const LXKnownRecord& known) override {
+        std::optional<LXCandidateSlice> slice =
+            LXApplicationWorkspace::candidatesAfterIdentifier(query, filter, preselection, after, rows, known);
+        if (slice) slice->candidates = *held(std::move(slice->candidates), filter, known);
+        return slice;
+    }
+
+    std::optional<LXCandidateList> held(std::optional<LXCandidateList> candidates, const LXPlugInFilter& filter,
+                                        const LXKnownRecord& known) {
+        if (!known) ++toldNothing;
+        if (candidates && known && !filter) {
+            for (LXCandidate& candidate : *candidates) {
+                if (!known(candidate.uuid)) continue;
+                candidate.proxy = nullptr;
+                ++leftOut;
+            }
+        }
+        if (betweenQueryAndLookUp) std::exchange(betweenQueryAndLookUp, nullptr)();
+        return candidates;
+    }
 
     std::optional<LXProxyList> answer = LXProxyList{};
+    int leftOut = 0;
+    int toldNothing = 0;
+    std::function<void()> betweenQueryAndLookUp;
     Value lastQuery;
     LXPreselection lastPreselection;
     int installedCalls = 0;
@@ -166,6 +204,68 @@ TEST_F(BXDatabaseDiscoveryTest, EmptyQueryListsEveryUsablePlugInOnceFromTheCache
     ASSERT_TRUE(first && second);
     ASSERT_EQ(second->size(), 2u);
     for (size_t i = 0; i < 2; ++i) EXPECT_EQ((*first)[i].get(), (*second)[i].get());
+}
+
+// Guards the records a registry leaves out because the cache holds them: discovery, paged or not, hands out the
+// cached records themselves. One that leaves the cache between the registry's answer and its look-up (its plug-in
+// re-registered under the same UUID, announced in between) is neither handed out stale nor left out: the registry
+// is asked again, told nothing, and the record is built from what it reads then.
+TEST_F(BXDatabaseDiscoveryTest, RecordsLeftOutForTheCacheAreTheCachedOnesAndOneDroppedMeanwhileIsReadAgain) {
+    auto hello = plugIn("hello");
+    auto bonjour = plugIn("bonjour");
+    workspace_->answer = LXProxyList{hello, bonjour};
+    std::optional<BXDatabase::PlugInSet> first = database_->findPlugIns(Value());
+    ASSERT_TRUE(first);
+    ASSERT_EQ(first->size(), 2u);
+    EXPECT_EQ(workspace_->leftOut, 0) << "a cold cache holds nothing";
+
+    auto sameRecords = [&](const std::optional<BXDatabase::PlugInSet>& found) {
+        ASSERT_TRUE(found);
+        ASSERT_EQ(found->size(), 2u);
+        for (size_t i = 0; i < 2; ++i) EXPECT_EQ((*found)[i].get(), (*first)[i].get());
+    };
+    sameRecords(database_->findPlugIns(Value()));
+    sameRecords(database_->findPlugIns(dict({{"RZExtensionPointIdentifier", str("com.example.greeting")}})));
+    std::optional<BXDatabase::PlugInSlice> page = database_->findPlugInsAfterIdentifier(Value(), std::nullopt, 10);
+    ASSERT_TRUE(page);
+    EXPECT_TRUE(page->ended);
+    // The walk goes by identifier: bonjour first.
+    sameRecords(BXDatabase::PlugInSet{page->plugIns.rbegin(), page->plugIns.rend()});
+    EXPECT_EQ(workspace_->leftOut, 6);
+    // A query that wants an election needs every candidate's entitlements: nothing is left out for it.
+    sameRecords(database_->findPlugIns(electionQuery(str("0"))));
+    EXPECT_EQ(workspace_->leftOut, 6);
+    EXPECT_EQ(workspace_->toldNothing, 0);
+
+    const Value tag = dict({{"com.example.tag", str("again")}});
+    auto reregister = [&](int round) {
+        auto again = plugIn("hello", tag, hello->pluginUUID());
+        workspace_->betweenQueryAndLookUp = [this, hello, again, bonjour, round] {
+            workspace_->answer = round == 0 ? LXProxyList{again, bonjour} : LXProxyList{bonjour};
+            database_->pluginsWillUninstall({hello});
+        };
+    };
+    reregister(0);
+    std::optional<BXDatabase::PlugInSet> raced = database_->findPlugIns(Value());
+    EXPECT_EQ(workspace_->toldNothing, 1);
+    ASSERT_TRUE(raced);
+    ASSERT_EQ(raced->size(), 2u);
+    EXPECT_NE((*raced)[0].get(), (*first)[0].get());
+    EXPECT_EQ((*raced)[0]->uuid(), hello->pluginUUID());
+    EXPECT_TRUE((*raced)[0]->hasEntitlement("com.example.tag")) << "built from the record read again";
+    EXPECT_EQ((*raced)[1].get(), (*first)[1].get()) << "what stayed cached is still the cached record";
+
+    // The same in a walk, with the plug-in gone for good: it is not handed out, from the cache or otherwise.
+    workspace_->answer = LXProxyList{plugIn("hello", tag, hello->pluginUUID()), bonjour};
+    hello = workspace_->answer->front();
+    ASSERT_EQ(database_->findPlugIns(Value())->size(), 2u);
+    reregister(1);
+    page = database_->findPlugInsAfterIdentifier(Value(), std::nullopt, 10);
+    EXPECT_EQ(workspace_->toldNothing, 2);
+    ASSERT_TRUE(page);
+    ASSERT_EQ(page->plugIns.size(), 1u);
+    EXPECT_EQ(page->plugIns[0].get(), (*first)[1].get());
+    EXPECT_EQ(page->last, "com.example.bonjour");
 }
 
 // Guards filtering by election. A wanted election is a string of digits, optionally after "=", or an array of

@@ -133,6 +133,38 @@ TEST_F(BXDatabaseTest, LookUpsFindAnInstalledPlugInAsOneCachedRecordAndUnknownOn
     EXPECT_EQ(database_->cachedCount(), 1u);
 }
 
+// Guards discovery with a warm cache over the real registry, which then leaves the cached records out of what it
+// reads: the records handed out are the cached ones, and a plug-in re-registered since (a changed bundle, under
+// the same UUID) gets a new record built from what its bundle says now.
+TEST_F(BXDatabaseTest, DiscoveryHandsOutTheCachedRecordsAndBuildsAReRegisteredOneAfresh) {
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    ASSERT_FALSE(database_->addPlugIn(bonjour()));
+    std::shared_ptr<BXDPlugIn> cached = database_->findPlugInAtPath(hello());
+    ASSERT_TRUE(cached);
+    std::optional<BXDatabase::PlugInSet> first = database_->findPlugIns(Value());
+    ASSERT_TRUE(first);
+    ASSERT_EQ(first->size(), 2u);
+    EXPECT_EQ((*first)[0].get(), cached.get());
+    std::optional<BXDatabase::PlugInSet> second = database_->findPlugIns(Value());
+    ASSERT_TRUE(second);
+    ASSERT_EQ(second->size(), 2u);
+    for (size_t i = 0; i < 2; ++i) EXPECT_EQ((*second)[i].get(), (*first)[i].get());
+
+    grantAutoElection(hello());
+    ASSERT_FALSE(database_->addPlugIn(hello()));
+    std::optional<BXDatabase::PlugInSlice> walked = database_->findPlugInsAfterIdentifier(Value(), std::nullopt, 10);
+    ASSERT_TRUE(walked);
+    ASSERT_EQ(walked->plugIns.size(), 2u);
+    for (const std::shared_ptr<BXDPlugIn>& record : walked->plugIns) {
+        if (record->uuid() == cached->uuid()) {
+            EXPECT_NE(record.get(), cached.get());
+            EXPECT_TRUE(record->hasEntitlement(BXDPlugIn::kAutoElectEntitlement));
+        } else {
+            EXPECT_EQ(record.get(), (*first)[1].get());
+        }
+    }
+}
+
 // Guards the lock discipline: what must run under the database's lock refuses to run outside it.
 TEST_F(BXDatabaseTest, CreatingOutsideTheLockIsAnInternalInconsistency) {
     ASSERT_FALSE(database_->addPlugIn(hello()));

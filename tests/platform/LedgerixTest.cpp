@@ -720,6 +720,72 @@ TEST_F(LedgerixQueryTest, TheWalkVisitsEveryCandidateOnceByIdentifierWithoutSpli
     }
 }
 
+// A query told which records the caller holds hands those back as UUIDs in their place and the others as records,
+// the same candidates in the same order (and with the same placeholder flag) as a query told nothing, in the walk too
+// (where a held candidate still counts towards its stretch and its identifier). A query with a filter reads every
+// candidate for it and never asks.
+TEST_F(LedgerixQueryTest, RecordsTheCallerHoldsComeBackAsUuidsInTheirPlaceUnlessAFilterNeedsThem) {
+    std::optional<LXProxyList> installed = workspace_->installedPlugins();
+    ASSERT_TRUE(installed);
+    std::set<Uuid> holding;
+    for (size_t i = 0; i < installed->size(); i += 3) holding.insert(*(*installed)[i]->pluginUUID());
+    int asked = 0;
+    LXKnownRecord known = [&](const Uuid& uuid) {
+        ++asked;
+        return holding.count(uuid) > 0;
+    };
+    auto expectSame = [&](const std::optional<LXCandidateList>& candidates, const LXProxyList& expected) {
+        ASSERT_TRUE(candidates);
+        ASSERT_EQ(candidates->size(), expected.size());
+        for (size_t i = 0; i < expected.size(); ++i) {
+            const LXCandidate& candidate = (*candidates)[i];
+            EXPECT_EQ(candidate.uuid, *expected[i]->pluginUUID()) << i;
+            EXPECT_EQ(candidate.proxy == nullptr, holding.count(candidate.uuid) > 0) << i;
+            if (candidate.proxy) {
+                EXPECT_EQ(candidate.proxy->bundleURL(), expected[i]->bundleURL()) << i;
+            }
+            const auto& application = expected[i]->containingBundle();
+            EXPECT_EQ(candidate.inPlaceholderApplication, application && application->isPlaceholder()) << i;
+        }
+    };
+    expectSame(workspace_->installedCandidates(known), *installed);
+    EXPECT_EQ(asked, 30);
+    const LXPreselection pointB{.extensionPoints = Strings{"com.example.b"}};
+    expectSame(workspace_->candidatesMatchingQuery(Value(), {}, pointB, known),
+               *workspace_->pluginsMatchingQueryApplyFilter(Value(), {}, pointB));
+    EXPECT_EQ(asked, 40);
+
+    for (size_t rows : {1u, 4u}) {
+        std::optional<std::string> after;
+        for (int stretches = 0; stretches < 100; ++stretches) {
+            std::optional<LXWalkSlice> told =
+                workspace_->pluginsMatchingQueryAfterIdentifier(Value(), {}, {}, after, rows);
+            std::optional<LXCandidateSlice> slice =
+                workspace_->candidatesAfterIdentifier(Value(), {}, {}, after, rows, known);
+            ASSERT_TRUE(told && slice);
+            expectSame(slice->candidates, told->plugIns);
+            EXPECT_EQ(slice->last, told->last);
+            EXPECT_EQ(slice->ended, told->ended);
+            if (slice->ended) break;
+            after = slice->last;
+        }
+    }
+
+    asked = 0;
+    int filtered = 0;
+    auto keepOdd = [&](std::string_view, const std::optional<Value>&) { return ++filtered % 2 == 1; };
+    std::optional<LXCandidateList> withFilter = workspace_->candidatesMatchingQuery(Value(), keepOdd, {}, known);
+    ASSERT_TRUE(withFilter);
+    EXPECT_EQ(filtered, 30);
+    EXPECT_EQ(withFilter->size(), 15u);
+    for (const LXCandidate& candidate : *withFilter) EXPECT_TRUE(candidate.proxy);
+    std::optional<LXCandidateSlice> walkedWithFilter =
+        workspace_->candidatesAfterIdentifier(Value(), keepOdd, {}, std::nullopt, 100, known);
+    ASSERT_TRUE(walkedWithFilter);
+    EXPECT_EQ(walkedWithFilter->candidates.size(), 15u);
+    EXPECT_EQ(asked, 0);
+}
+
 // ---- Bundles the registry refuses ----
 
 using LedgerixBadBundleTest = LedgerixTest;

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <mutex>
 
+#include "platform/ledgerix/LXApplicationProxy.h"
 #include "platform/ledgerix/LXBexilProxy.h"
 #include "platform/ledgerix/LedgerixWorkspace.h"
 
@@ -48,6 +49,45 @@ std::optional<LXWalkSlice> LXApplicationWorkspace::pluginsMatchingQueryAfterIden
     }
     slice.ended = at == candidates->end();
     return slice;
+}
+
+namespace {
+
+LXCandidateList candidatesOf(LXProxyList proxies) {
+    LXCandidateList candidates;
+    candidates.reserve(proxies.size());
+    for (std::shared_ptr<const LXBexilProxy>& proxy : proxies) {
+        LXCandidate& candidate = candidates.emplace_back();
+        candidate.uuid = proxy->pluginUUID().value_or(Uuid());
+        candidate.inPlaceholderApplication = proxy->containingBundle() && proxy->containingBundle()->isPlaceholder();
+        candidate.proxy = std::move(proxy);
+    }
+    return candidates;
+}
+
+}  // namespace
+
+std::optional<LXCandidateList> LXApplicationWorkspace::installedCandidates(const LXKnownRecord&) {
+    std::optional<LXProxyList> proxies = installedPlugins();
+    if (!proxies) return std::nullopt;
+    return candidatesOf(std::move(*proxies));
+}
+
+std::optional<LXCandidateList> LXApplicationWorkspace::candidatesMatchingQuery(const Value& query,
+                                                                               const LXPlugInFilter& filter,
+                                                                               const LXPreselection& preselection,
+                                                                               const LXKnownRecord&) {
+    std::optional<LXProxyList> proxies = pluginsMatchingQueryApplyFilter(query, filter, preselection);
+    if (!proxies) return std::nullopt;
+    return candidatesOf(std::move(*proxies));
+}
+
+std::optional<LXCandidateSlice> LXApplicationWorkspace::candidatesAfterIdentifier(
+    const Value& query, const LXPlugInFilter& filter, const LXPreselection& preselection,
+    const std::optional<std::string>& after, size_t rows, const LXKnownRecord&) {
+    std::optional<LXWalkSlice> slice = pluginsMatchingQueryAfterIdentifier(query, filter, preselection, after, rows);
+    if (!slice) return std::nullopt;
+    return LXCandidateSlice{candidatesOf(std::move(slice->plugIns)), std::move(slice->last), slice->ended};
 }
 
 }  // namespace bexil

@@ -15,6 +15,7 @@
 
 #include "base/ActingAs.h"
 #include "base/Error.h"
+#include "bexil/Uuid.h"
 #include "bexil/Value.h"
 
 namespace bexil {
@@ -51,6 +52,21 @@ using LXProxyList = std::vector<std::shared_ptr<const LXBexilProxy>>;
 // reads no entitlements for it.
 using LXPlugInFilter = std::function<bool(std::string_view identifier, const std::optional<Value>& entitlements)>;
 
+// Says whether the caller already holds its own record of the plug-in with this UUID. A query given one hands back
+// only the UUID of such a candidate, without reading or building its registry record. It runs with the registry's
+// look-up lock held: it must not call the registry, nor take any lock that is held while calling the registry.
+using LXKnownRecord = std::function<bool(const Uuid& uuid)>;
+
+// One candidate of a discovery query that was told which records the caller holds.
+struct LXCandidate {
+    // The registry's record; none when the caller said it holds its own.
+    std::shared_ptr<const LXBexilProxy> proxy;
+    Uuid uuid;
+    // Whether the plug-in lies in an application that is only a placeholder (also said when `proxy` is none).
+    bool inPlaceholderApplication = false;
+};
+using LXCandidateList = std::vector<LXCandidate>;
+
 // What a discovery query pins, as the rule engine that owns the query language reads it: for the extension point
 // and for the identifier, the strings that a matching plug-in's value must equal (any one of them), or none when
 // the query lets other values through. The registry narrows its candidates by its indexes with it and never reads
@@ -68,6 +84,13 @@ struct LXWalkSlice {
     // The identifier of the last candidate walked, whether or not it passed; none when the stretch was empty.
     std::optional<std::string> last;
     // True when no candidate sorts after `last`: the walk is over.
+    bool ended = false;
+};
+
+// LXWalkSlice for a walk that was told which records the caller holds.
+struct LXCandidateSlice {
+    LXCandidateList candidates;
+    std::optional<std::string> last;
     bool ended = false;
 };
 
@@ -125,6 +148,18 @@ class LXApplicationWorkspace {
                                                                            const LXPreselection& preselection,
                                                                            const std::optional<std::string>& after,
                                                                            size_t rows);
+
+    // The same three, handing back only the UUID of a candidate for which `known` (when given) says the caller holds
+    // the record. A query with a filter reads every candidate for it and never asks `known`. The defaults build
+    // every record and never ask either.
+    virtual std::optional<LXCandidateList> installedCandidates(const LXKnownRecord& known);
+    virtual std::optional<LXCandidateList> candidatesMatchingQuery(const Value& query, const LXPlugInFilter& filter,
+                                                                   const LXPreselection& preselection,
+                                                                   const LXKnownRecord& known);
+    virtual std::optional<LXCandidateSlice> candidatesAfterIdentifier(const Value& query, const LXPlugInFilter& filter,
+                                                                      const LXPreselection& preselection,
+                                                                      const std::optional<std::string>& after,
+                                                                      size_t rows, const LXKnownRecord& known);
 };
 
 }  // namespace bexil

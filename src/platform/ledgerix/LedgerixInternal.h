@@ -172,6 +172,9 @@ struct LedgerixWorkspace::Row {
     std::optional<std::string> appIdentifier;
     std::optional<std::string> appName;
     bool appPlaceholder = false;
+    // Read for a query told that the caller holds this record: only the id, UUID, identifier and placeholder flag
+    // were read.
+    bool held = false;
     // Only for rows about to be written.
     std::optional<std::string> identifierKey;
     std::optional<std::string> pointKey;

@@ -159,11 +159,27 @@ void readRowColumns(const StatementUse& use, LedgerixWorkspace::Row& row) {
     row.appPlaceholder = use.integer(17) != 0;
 }
 
+// Reads of the row only what a candidate the caller holds needs, when `known` says the caller holds it. The other
+// columns, the information and entitlements documents among them, are never copied out of the statement.
+bool readHeldRow(const StatementUse& use, const LXKnownRecord& known, LedgerixWorkspace::Row& row) {
+    std::optional<std::string> uuid = use.blob(1);
+    if (!uuid || uuid->size() != 16) return false;
+    std::array<uint8_t, 16> bytes;
+    std::memcpy(bytes.data(), uuid->data(), 16);
+    row.uuid = Uuid(bytes);
+    if (!known(row.uuid)) return false;
+    row.id = use.integer(0);
+    row.identifier = use.text(3);
+    row.appPlaceholder = use.integer(17) != 0;
+    row.held = true;
+    return true;
+}
+
 }  // namespace
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRowsLocked(
     Connection& connection, std::string_view where, const std::vector<std::string>& arguments,
-    std::optional<int64_t> integerArgument, std::string_view order) {
+    std::optional<int64_t> integerArgument, std::string_view order, const LXKnownRecord* known) {
     std::string sql(kSelectRow);
     if (!where.empty()) {
         sql += " WHERE ";
@@ -180,6 +196,7 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
     int rc;
     while ((rc = use.step()) == SQLITE_ROW) {
         Row& row = rows.emplace_back();
+        if (known && readHeldRow(use, *known, row)) continue;
         readRowColumns(use, row);
         if (!row.uuidValid) {
             log::ops().fault("registry row %lld at %s has no valid UUID; ignoring it", static_cast<long long>(row.id),
@@ -196,9 +213,9 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows(
     std::string_view where, const std::vector<std::string>& arguments, std::optional<int64_t> integerArgument,
-    std::string_view order) {
+    std::string_view order, const LXKnownRecord* known) {
     std::lock_guard lock(lookups_.mutex);
-    return selectRowsLocked(lookups_, where, arguments, integerArgument, order);
+    return selectRowsLocked(lookups_, where, arguments, integerArgument, order, known);
 }
 
 // Every plug-in record carries its application's record, and most applications have several plug-ins: while one
@@ -259,6 +276,21 @@ LXProxyList LedgerixWorkspace::proxiesFromRows(const std::vector<Row>& rows) {
     proxies.reserve(rows.size());
     for (const Row& row : rows) proxies.push_back(proxyFromRow(row));
     return proxies;
+}
+
+LXCandidateList LedgerixWorkspace::candidatesFromRows(const std::vector<Row>& rows, const LXPlugInFilter& filter) {
+    LXCandidateList candidates;
+    candidates.reserve(rows.size());
+    for (const Row& row : rows) {
+        if (row.held) {
+            candidates.push_back(LXCandidate{nullptr, row.uuid, row.appPlaceholder});
+            continue;
+        }
+        std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(row);
+        if (filter && !filter(row.identifier.value_or(""), proxy->entitlements())) continue;
+        candidates.push_back(LXCandidate{std::move(proxy), row.uuid, row.appPlaceholder});
+    }
+    return candidates;
 }
 
 LXProxyList LedgerixWorkspace::plugInsOfApplication(int64_t applicationId) {
@@ -355,6 +387,12 @@ std::shared_ptr<const LXApplicationProxy> LedgerixWorkspace::applicationProxyFor
     return nullptr;
 }
 
+std::optional<LXCandidateList> LedgerixWorkspace::installedCandidates(const LXKnownRecord& known) {
+    std::optional<std::vector<Row>> rows = selectRows("", {}, std::nullopt, " ORDER BY p.id", known ? &known : nullptr);
+    if (!rows) return std::nullopt;
+    return candidatesFromRows(*rows, {});
+}
+
 std::optional<LXProxyList> LedgerixWorkspace::installedPlugins() {
     std::optional<std::vector<Row>> rows = selectRows("", {}, std::nullopt);
     if (!rows) return std::nullopt;
@@ -399,24 +437,40 @@ struct Preselected {
 // The walk's order; the index plugins_walk holds exactly this expression.
 constexpr std::string_view kWalkKey = "coalesce(p.identifier, '')";
 
+LXProxyList proxiesOf(LXCandidateList candidates) {
+    LXProxyList proxies;
+    proxies.reserve(candidates.size());
+    for (LXCandidate& candidate : candidates) proxies.push_back(std::move(candidate.proxy));
+    return proxies;
+}
+
+// What a query asks `known`: nothing when it has a filter, which needs every candidate's entitlements.
+const LXKnownRecord* consulted(const LXPlugInFilter& filter, const LXKnownRecord& known) {
+    return !filter && known ? &known : nullptr;
+}
+
 }  // namespace
 
 std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(const Value& query,
                                                                               const LXPlugInFilter& filter,
                                                                               const LXPreselection& preselection) {
+    std::optional<LXCandidateList> candidates = candidatesMatchingQuery(query, filter, preselection, {});
+    if (!candidates) return std::nullopt;
+    return proxiesOf(std::move(*candidates));
+}
+
+std::optional<LXCandidateList> LedgerixWorkspace::candidatesMatchingQuery(const Value& query,
+                                                                          const LXPlugInFilter& filter,
+                                                                          const LXPreselection& preselection,
+                                                                          const LXKnownRecord& known) {
     Preselected preselected(preselection);
-    std::optional<std::vector<Row>> rows = selectRows(preselected.where, preselected.arguments, std::nullopt);
+    std::optional<std::vector<Row>> rows =
+        selectRows(preselected.where, preselected.arguments, std::nullopt, " ORDER BY p.id", consulted(filter, known));
     if (!rows) return std::nullopt;
     log::lx().debug("%zu candidate(s) for %@ (pre-selection: %s)", rows->size(), query,
                     preselected.where.empty() ? std::string("none") : preselected.where);
-
     // The filter runs without the lock: it may call back into the registry.
-    LXProxyList matches;
-    for (const Row& row : *rows) {
-        std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(row);
-        if (filter && !filter(row.identifier.value_or(""), proxy->entitlements())) continue;
-        matches.push_back(std::move(proxy));
-    }
+    LXCandidateList matches = candidatesFromRows(*rows, filter);
     log::lx().debug("%zu plug-in(s) pass the filter", matches.size());
     return matches;
 }
@@ -424,6 +478,17 @@ std::optional<LXProxyList> LedgerixWorkspace::pluginsMatchingQueryApplyFilter(co
 std::optional<LXWalkSlice> LedgerixWorkspace::pluginsMatchingQueryAfterIdentifier(
     const Value& query, const LXPlugInFilter& filter, const LXPreselection& preselection,
     const std::optional<std::string>& after, size_t rows) {
+    std::optional<LXCandidateSlice> slice = candidatesAfterIdentifier(query, filter, preselection, after, rows, {});
+    if (!slice) return std::nullopt;
+    return LXWalkSlice{proxiesOf(std::move(slice->candidates)), std::move(slice->last), slice->ended};
+}
+
+std::optional<LXCandidateSlice> LedgerixWorkspace::candidatesAfterIdentifier(const Value& query,
+                                                                             const LXPlugInFilter& filter,
+                                                                             const LXPreselection& preselection,
+                                                                             const std::optional<std::string>& after,
+                                                                             size_t rows, const LXKnownRecord& known) {
+    const LXKnownRecord* heldBy = consulted(filter, known);
     Preselected preselected(preselection);
     const std::string key(kWalkKey);
     const int64_t limit = static_cast<int64_t>(std::clamp<size_t>(rows, 1, INT32_MAX));
@@ -437,7 +502,7 @@ std::optional<LXWalkSlice> LedgerixWorkspace::pluginsMatchingQueryAfterIdentifie
             where = preselected.whereAnd(key + " > ?");
             arguments.push_back(*after);
         }
-        stretch = selectRowsLocked(lookups_, where, arguments, limit, " ORDER BY " + key + ", p.id LIMIT ?");
+        stretch = selectRowsLocked(lookups_, where, arguments, limit, " ORDER BY " + key + ", p.id LIMIT ?", heldBy);
         if (!stretch) return std::nullopt;
         full = static_cast<int64_t>(stretch->size()) == limit;
         // A full stretch may have cut its last identifier short: the rest of that identifier comes with it.
@@ -446,21 +511,18 @@ std::optional<LXWalkSlice> LedgerixWorkspace::pluginsMatchingQueryAfterIdentifie
             std::vector<std::string> sameArguments = preselected.arguments;
             sameArguments.push_back(last.identifier.value_or(""));
             std::optional<std::vector<Row>> rest =
-                selectRowsLocked(lookups_, preselected.whereAnd(key + " = ? AND p.id > ?"), sameArguments, last.id);
+                selectRowsLocked(lookups_, preselected.whereAnd(key + " = ? AND p.id > ?"), sameArguments, last.id,
+                                 " ORDER BY p.id", heldBy);
             if (!rest) return std::nullopt;
             for (Row& row : *rest) stretch->push_back(std::move(row));
         }
     }
-    LXWalkSlice slice;
+    LXCandidateSlice slice;
     slice.ended = !full;
     if (!stretch->empty()) slice.last = stretch->back().identifier.value_or("");
     log::lx().debug("%zu candidate(s) for %@ after %s", stretch->size(), query, after ? *after : std::string("-"));
     // The filter runs without the lock: it may call back into the registry.
-    for (const Row& row : *stretch) {
-        std::shared_ptr<const LXBexilProxy> proxy = proxyFromRow(row);
-        if (filter && !filter(row.identifier.value_or(""), proxy->entitlements())) continue;
-        slice.plugIns.push_back(std::move(proxy));
-    }
+    slice.candidates = candidatesFromRows(*stretch, filter);
     return slice;
 }
 

@@ -77,6 +77,14 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
                                                                    const LXPreselection& preselection,
                                                                    const std::optional<std::string>& after,
                                                                    size_t rows) override;
+    std::optional<LXCandidateList> installedCandidates(const LXKnownRecord& known) override;
+    std::optional<LXCandidateList> candidatesMatchingQuery(const Value& query, const LXPlugInFilter& filter,
+                                                           const LXPreselection& preselection,
+                                                           const LXKnownRecord& known) override;
+    std::optional<LXCandidateSlice> candidatesAfterIdentifier(const Value& query, const LXPlugInFilter& filter,
+                                                              const LXPreselection& preselection,
+                                                              const std::optional<std::string>& after, size_t rows,
+                                                              const LXKnownRecord& known) override;
 
     const std::filesystem::path& databasePath() const { return databasePath_; }
     // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
@@ -106,15 +114,18 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // failure().
     std::shared_ptr<Statement> statement(Connection& connection, const std::string& sql);
     // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
-    // anything after it, such as a LIMIT that `integerArgument` binds).
+    // anything after it, such as a LIMIT that `integerArgument` binds). Rows that `known` says the caller holds are
+    // read only in part (Row::held).
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument,
-                                                     std::string_view order = " ORDER BY p.id");
+                                                     std::string_view order = " ORDER BY p.id",
+                                                     const LXKnownRecord* known = nullptr);
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument,
-                                               std::string_view order = " ORDER BY p.id");
+                                               std::string_view order = " ORDER BY p.id",
+                                               const LXKnownRecord* known = nullptr);
     // The record at exactly this path; none when there is none or the store failed (then *failed is set).
     std::optional<Row> rowAtPathLocked(Connection& connection, const std::string& path, bool* failed);
     std::optional<Error> commitLocked(const Row& row, const Uuid& uuid, double registered,
@@ -129,6 +140,8 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
 
     std::shared_ptr<const LXBexilProxy> proxyFromRow(const Row& row);
     LXProxyList proxiesFromRows(const std::vector<Row>& rows);
+    // The candidates of a query's rows that pass the filter (a held row is a UUID only; the filter never sees one).
+    LXCandidateList candidatesFromRows(const std::vector<Row>& rows, const LXPlugInFilter& filter);
     std::shared_ptr<const LXApplicationProxy> applicationFromRow(const Row& row);
     LXProxyList plugInsOfApplication(int64_t applicationId);
     enum class Change { Installed, Uninstalled };
