@@ -501,16 +501,27 @@ Result<size_t> ZemCodec::encodedSize(const Value& value) {
     return sizer.size;
 }
 
-template <class Bytes>
-std::optional<Error> ZemCodec::encode(const Value& value, Bytes& out, size_t maxBytes) {
+namespace {
+
+// The size of `value`'s encoding, once the first pass found it encodable and no larger than `maxBytes`.
+Result<size_t> measuredWithin(const Value& value, size_t maxBytes) {
     Sizer sizer;
     sizer.visit(value, 0);
-    if (sizer.error) return sizer.error;
+    if (sizer.error) return *sizer.error;
     if (sizer.size > maxBytes)
         return zemError(ZemErrorCode::FrameTooLarge,
                         fmt::format("encoding of {} bytes exceeds the limit of {} bytes", sizer.size, maxBytes));
+    return sizer.size;
+}
+
+}  // namespace
+
+template <class Bytes>
+std::optional<Error> ZemCodec::encode(const Value& value, Bytes& out, size_t maxBytes) {
+    Result<size_t> size = measuredWithin(value, maxBytes);
+    if (!size) return size.error();
     size_t start = out.size();
-    out.resize(start + sizer.size);
+    out.resize(start + *size);
     uint8_t* end = Writer{}.write(out.data() + start, value);
     if (end != out.data() + out.size())
         throw InternalInconsistency("Zem encoder wrote a different number of bytes than it measured");
@@ -522,16 +533,12 @@ template std::optional<Error> ZemCodec::encode(const Value&, ZemBytes&, size_t);
 
 std::optional<Error> ZemCodec::encodeReferencing(const Value& value, ZemBytes& out, std::vector<Reference>& references,
                                                  size_t minimum, size_t maxBytes) {
-    Sizer sizer;
-    sizer.visit(value, 0);
-    if (sizer.error) return sizer.error;
-    if (sizer.size > maxBytes)
-        return zemError(ZemErrorCode::FrameTooLarge,
-                        fmt::format("encoding of {} bytes exceeds the limit of {} bytes", sizer.size, maxBytes));
+    Result<size_t> size = measuredWithin(value, maxBytes);
+    if (!size) return size.error();
     // Room for the whole encoding, of which the referenced bytes are then given back (nothing is written there).
     const size_t start = out.size();
     const size_t listed = references.size();
-    out.resize(start + sizer.size);
+    out.resize(start + *size);
     Writer writer{out.data(), &references, minimum};
     uint8_t* end = writer.write(out.data() + start, value);
     size_t referenced = 0;
