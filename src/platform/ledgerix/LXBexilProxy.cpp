@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "base/Document.h"
+#include "platform/log/Log.h"
 
 namespace bexil {
 
@@ -71,7 +72,12 @@ class SharedStrings {
         if (auto it = strings_.find(std::string_view(text)); it != strings_.end()) return it->second;
         Value made = Value::string(std::move(text));
         // The key views the Value's own text, which never changes or moves while the Value is kept here.
-        if (strings_.size() < kSharedStrings) strings_.emplace(made.stringView(), made);
+        if (strings_.size() < kSharedStrings) {
+            strings_.emplace(made.stringView(), made);
+            if (strings_.size() == kSharedStrings)
+                log::lx().info("%zu strings shared between records (kSharedStrings): later ones are kept per record",
+                               kSharedStrings);
+        }
         return made;
     }
 
