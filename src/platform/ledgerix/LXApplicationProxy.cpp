@@ -17,12 +17,14 @@ LXApplicationProxy::LXApplicationProxy(Fields fields, PlugInList plugIns)
 
 const LXApplicationProxy::PlugInList& LXApplicationProxy::plugIns() const {
     std::call_once(loaded_, [this] {
+        // Marked before the loader runs: the records it builds must not share this one, or this record would hold
+        // itself through its own list and never be freed.
+        plugInsRead_.store(true, std::memory_order_release);
         if (loader_) {
             plugIns_ = loader_();
             // The loader may hold the registry alive; it is not needed any more.
             loader_ = nullptr;
         }
-        plugInsRead_.store(true, std::memory_order_release);
     });
     return plugIns_;
 }

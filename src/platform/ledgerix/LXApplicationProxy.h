@@ -48,7 +48,8 @@ class LXApplicationProxy {
 
     // The application's plug-ins in the order of their paths.
     const PlugInList& plugIns() const;
-    // True once plugIns() has read the list (a record made with a fixed list has it from the start).
+    // True once plugIns() was first asked for the list, from before it is read (a record made with a fixed list has
+    // it from the start).
     bool plugInsRead() const { return plugInsRead_.load(std::memory_order_acquire); }
 
     // "<application com.example.greeter /path/Greeter.app>" for log lines.
