@@ -145,14 +145,18 @@ void ZemSocketConnection::resumeOnQueue() {
         return;
     suspended_ = false;
     if (side_ == Side::Client && state_ == State::Idle && !connectClient()) return;
-    std::vector<ZemFrame> held = std::move(heldFrames_);
-    heldFrames_.clear();
-    for (ZemFrame& frame : held) {
+    handleSetAside(heldFrames_);
+    readMore();
+    writeMore();
+}
+
+void ZemSocketConnection::handleSetAside(std::vector<ZemFrame>& frames) {
+    std::vector<ZemFrame> taken = std::move(frames);
+    frames.clear();
+    for (ZemFrame& frame : taken) {
         if (state_ != State::Open) break;
         handleFrame(std::move(frame));
     }
-    readMore();
-    writeMore();
 }
 
 void ZemSocketConnection::suspend() {
@@ -490,12 +494,7 @@ void ZemSocketConnection::finishHandBack(HandBack work) {
     if (work.broken) {
         close(*work.broken);
     } else if (state_ == State::Open) {
-        std::vector<ZemFrame> strays = std::move(strayFrames_);
-        strayFrames_.clear();
-        for (ZemFrame& frame : strays) {
-            if (state_ != State::Open) break;
-            handleFrame(std::move(frame));
-        }
+        handleSetAside(strayFrames_);
         writeMore();
         readMore();
     }

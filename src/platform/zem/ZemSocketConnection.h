@@ -148,6 +148,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // replies the peer does not read; cancels it otherwise.
     void watchStall();
     void handleFrame(ZemFrame frame);
+    // Handles the frames set aside in `frames` (emptied first, since handling may set more aside), in order, while
+    // the connection stays open.
+    void handleSetAside(std::vector<ZemFrame>& frames);
     // What a frame carries: a dictionary to encode, or one encoded already.
     struct Payload {
         Payload(const Value& dictionary) : value(dictionary) {}  // NOLINT(google-explicit-constructor)
