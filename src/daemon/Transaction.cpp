@@ -172,6 +172,21 @@ void Transaction::continueOnWriter(std::function<void()> work, std::function<voi
         });
 }
 
+void Transaction::resumeLater(std::function<void()> step) {
+    holdReply();
+    resumed_ = true;
+    server()->mainQueue().async([self = shared_from_this(), step = std::move(step)] {
+        self->resumed_ = false;
+        self->guarded(step);
+        if (!self->answered() && !self->resumed_) {
+            log::ops().fault("%{public}s left unanswered for client %d", protocol::nameOf(self->handling_).data(),
+                             self->client_->pid());
+            self->fail(ErrorCode::OperationFailed, "internal error: no reply");
+        }
+        if (self->answered()) self->releaseReply();
+    });
+}
+
 // The code travels as an unsigned 64-bit number: the signed 32-bit code widened with its sign.
 static Value wireErrorCode(int64_t code) {
     return Value::uint64(static_cast<uint64_t>(static_cast<int64_t>(static_cast<int32_t>(code))));

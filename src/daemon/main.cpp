@@ -37,6 +37,9 @@ constexpr size_t kDescriptorsPerConnection = 2;
 
 // A positive count from the environment variable `name`; none when it is unset, and none (logged) when it is not a
 // positive number.
+// A paged "match" that kept the request queue longer than this at a time would defeat the point of its steps.
+constexpr size_t kLongestPageStepMicroseconds = 1'000'000;
+
 std::optional<size_t> countFromEnvironment(const char* name) {
     const char* text = getenv(name);
     if (text == nullptr || *text == '\0') return std::nullopt;
@@ -138,11 +141,13 @@ int main(int argc, char** argv) {
     server->service().setLimits(limits);
     server->setVerbose(verbose);
     server->setCacheLimit(cacheLimit);
+    if (auto step = countFromEnvironment("BX_PAGE_STEP_MICROSECONDS"))
+        server->setPageStep(std::chrono::microseconds(std::min<size_t>(*step, kLongestPageStepMicroseconds)));
     log::ops().debug(
         "bxd configured: service %s, cache limit %u, annotations %s, verbose %u, connections %zu "
-        "(%zu per user, %zu kept for root)",
+        "(%zu per user, %zu kept for root), page steps of %lld us",
         serviceName, cacheLimit, databasePath ? databasePath : "(default)", verbose, limits.maxConnections,
-        limits.maxConnectionsPerUser, limits.reservedForRoot);
+        limits.maxConnectionsPerUser, limits.reservedForRoot, static_cast<long long>(server->pageStep().count()));
     // Plug-ins run no longer than the daemon that started them: their hosts reach them through sockets bxd handed
     // out, and the instance records that termination and holds rely on are bxd's own.
     server->serviceManager().endSandboxedInstances("left running by an earlier bxd");

@@ -357,20 +357,20 @@ std::vector<AcceptedForms::EncodedForm> AcceptedForms::takeEncoded() {
     return encoded;
 }
 
-Result<size_t> AcceptedForms::encodedSize(const EncodedForm& form) {
-    return ZemCodec::mergedSize(*form.kept, form.changing, kFormDepth);
-}
-
 std::optional<Error> AcceptedForms::appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out) {
     size_t start = out.size();
     ZemCodec::appendArrayHeader(forms.size(), out);
     for (const EncodedForm& form : forms) {
-        if (std::optional<Error> error = ZemCodec::encodeMerged(*form.kept, form.changing, out, kFormDepth)) {
+        if (std::optional<Error> error = appendForm(form, out)) {
             out.resize(start);
             return error;
         }
     }
     return std::nullopt;
+}
+
+std::optional<Error> AcceptedForms::appendForm(const EncodedForm& form, std::vector<uint8_t>& out) {
+    return ZemCodec::encodeMerged(*form.kept, form.changing, out, kFormDepth);
 }
 
 }  // namespace bexil

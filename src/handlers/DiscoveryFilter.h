@@ -112,11 +112,11 @@ class AcceptedForms {
         Value changing;
     };
     std::vector<EncodedForm> takeEncoded();
-    // The bytes `form` takes within a reply, or why it cannot be encoded.
-    static Result<size_t> encodedSize(const EncodedForm& form);
     // Appends the value of a reply's matches entry, an array of `forms`; the entry nests the forms two levels below
     // the reply.
     static std::optional<Error> appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out);
+    // Appends one form as an element of that array (after its header).
+    static std::optional<Error> appendForm(const EncodedForm& form, std::vector<uint8_t>& out);
 
   private:
     struct Form {

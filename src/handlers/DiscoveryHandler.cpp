@@ -13,7 +13,8 @@
 // candidates of an identifier compete within one page, exactly as they would in one reply. The continuation names
 // the last identifier walked, so a page costs what it walks, registrations and annotation changes between pages
 // neither skip nor repeat a plug-in that stayed visible, and replacement links are written among the forms of a
-// page (the client library links across pages when it puts them together).
+// page (the client library links across pages when it puts them together). A page is made in short steps with
+// other requests served between them; a change between two steps is seen like one between two pages.
 
 #include <algorithm>
 #include <cerrno>
@@ -51,15 +52,11 @@ namespace formKey = protocol::form;
 namespace page = protocol::page;
 
 // The most candidates one page walks: a page whose rules reject nearly everything still answers (with fewer
-// forms, possibly none, and a continuation) before it has held the request queue for long.
+// forms, possibly none, and a continuation) in bounded time.
 constexpr size_t kMaxPageWalk = 20000;
-// The longest a page keeps the request queue once it holds a form: the daemon serves one request at a time, so
-// another client's request waits for the page in progress, and a point match must not wait for a whole page of
-// hundreds of forms. A page that runs out of time ends after the stretch in progress, with a continuation.
-constexpr std::chrono::microseconds kPageTimeBudget{500};
-// The most candidates asked of the registry at a time. The time budget is checked between stretches, so a stretch
-// is never read and then thrown away; small stretches keep a page close to its budget.
-constexpr size_t kWalkStretch = 16;
+// The most candidates asked of the registry at a time. Each query has a fixed cost (a read transaction of its
+// own), so larger stretches make a walk cheaper; a stretch that a step leaves half offered is kept for the next.
+constexpr size_t kWalkStretch = 32;
 
 // Exports the candidates that pass the filter and lets them compete.
 void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t to, const CandidateFilter& filter,
@@ -71,6 +68,12 @@ void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t 
             log::ops().error("failed to export matching plug-in %{public}@",
                              plugIn->uuid() ? plugIn->uuid()->string() : std::string());
     }
+}
+
+// Binds a continuation to `rules`, encoded (left unbound when they cannot be encoded).
+void bindRules(DiscoveryContinuation::Binding& binding, const Value& rules) {
+    if (Result<std::vector<uint8_t>> encoded = ZemCodec::encode(rules); encoded)
+        binding.rules.assign(encoded->begin(), encoded->end());
 }
 
 // Answers with `forms` as the reply's matches, written from the encoded entries the records keep and the few that
@@ -103,7 +106,237 @@ std::optional<uint64_t> pageSizeOf(const Value& entry) {
     return size;
 }
 
-// One page of a paged "match" (see the top of this file). Answers the transaction.
+// A page of a paged "match" on its way: the walk's place, what it accepted so far and what it checks candidates
+// against, then the page's forms as they are encoded. The daemon serves one request at a time, so a page is made
+// in steps of about BXDServer::pageStep() and the request queue serves the requests that came meanwhile between
+// two steps: a client paging through a large registry never makes another client's point match wait for more than
+// a step. A step ends after the candidate (or the form being encoded) in progress once its time is up; each costs
+// a trip through the event loop, about a microsecond. Lives on the request queue, kept alive by the step queued
+// next.
+class PageWalk {
+  public:
+    PageWalk(std::shared_ptr<Transaction> transaction, Value rules, uint64_t flags, size_t wanted,
+             DiscoveryContinuation::Binding binding, std::optional<std::string> after)
+        : transaction_(std::move(transaction)),
+          database_(*transaction_->server()),
+          rules_(std::move(rules)),
+          flags_(flags),
+          wanted_(wanted),
+          binding_(std::move(binding)),
+          context_{.annotations = &database_.annotationSource()},
+          exclusions_(BXDUserPrefs::exclusionRuleSets(database_.currentExclusions())),
+          filter_{rules_, exclusions_, flags_, *transaction_->client(), database_, context_},
+          // Taken after the exclusions are read, since reading them may publish their change, which the page
+          // reflects.
+          generation_(database_.changeFeed().current()),
+          accepted_(flags),
+          walkedTo_(std::move(after)),
+          group_(flags) {}
+
+    // Makes the page until it is answered or the step's time is up; then the next step waits behind the requests
+    // that came meanwhile.
+    static void step(std::shared_ptr<PageWalk> page) {
+        Transaction& transaction = *page->transaction_;
+        if (transaction.client()->isDead()) {
+            // Nobody reads the reply; the page stops here.
+            transaction.done();
+            return;
+        }
+        const auto deadline = std::chrono::steady_clock::now() + page->database_.pageStep();
+        if (!page->forms_) {
+            if (!page->walk(deadline)) return resume(std::move(page));
+            page->accepted_.linkReplacements();
+            page->forms_ = page->accepted_.takeEncoded();
+        }
+        if (!page->encode(deadline)) return resume(std::move(page));
+        page->answer();
+    }
+
+  private:
+    static void resume(std::shared_ptr<PageWalk> page) {
+        Transaction& transaction = *page->transaction_;
+        transaction.resumeLater([page = std::move(page)]() mutable { step(std::move(page)); });
+    }
+
+    // Walks until the page is complete (true) or `deadline` has passed (false). A step ends between two
+    // candidates; the stretch it was in and the identifier it was offering carry over to the next step, unless
+    // something changed in between, in which case the next step reads them again.
+    bool walk(std::chrono::steady_clock::time_point deadline) {
+        if (slice_ && database_.changeFeed().current() != sliceGeneration_) {
+            slice_.reset();
+            group_ = AcceptedForms(flags_);
+            groupIdentifier_.reset();
+        }
+        while (true) {
+            if (!slice_ || at_ == slice_->plugIns.size()) {
+                if (slice_) {
+                    if (!closeGroup()) return true;
+                    // Identifiers whose candidates the registry's election filter dropped were walked too.
+                    if (slice_->last) walkedTo_ = slice_->last;
+                    if (slice_->ended) {
+                        ended_ = true;
+                        return true;
+                    }
+                    slice_.reset();
+                }
+                if (accepted_.count() >= wanted_ || walked_ >= kMaxPageWalk) return true;
+                // A stretch is read at the start of a step rather than at the end of one that has taken its time.
+                if (std::chrono::steady_clock::now() > deadline) return false;
+                size_t stretch = std::clamp<size_t>(wanted_ - accepted_.count(), 1, kWalkStretch);
+                sliceGeneration_ = database_.changeFeed().current();
+                slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
+                walked_ += stretch;
+                at_ = 0;
+                if (!slice_) {
+                    ended_ = true;
+                    return true;
+                }
+                trace::discoverRaw(static_cast<unsigned>(slice_->plugIns.size()));
+                continue;
+            }
+            const std::shared_ptr<BXDPlugIn>& plugIn = slice_->plugIns[at_];
+            std::string identifier = plugIn->identifier().value_or("");
+            if (groupIdentifier_ != identifier) {
+                if (!closeGroup()) return true;
+                groupIdentifier_ = std::move(identifier);
+            }
+            offerAdmitted(slice_->plugIns, at_, at_ + 1, filter_, group_, database_);
+            ++at_;
+            if (std::chrono::steady_clock::now() > deadline) return false;
+        }
+    }
+
+    // Takes the forms of the identifier being offered into the page; false when they do not fit, which ends the
+    // page before them.
+    bool closeGroup() {
+        if (!groupIdentifier_) return true;
+        if (accepted_.count() > 0 && accepted_.count() + group_.count() > wanted_) return false;
+        accepted_.absorb(std::move(group_));
+        group_ = AcceptedForms(flags_);
+        groupEnds_.emplace_back(*groupIdentifier_, accepted_.count());
+        walkedTo_ = std::move(groupIdentifier_);
+        groupIdentifier_.reset();
+        return true;
+    }
+
+    // Encodes the page's forms as the reply's matches until all are (true) or `deadline` has passed (false). The
+    // page ends before the identifier whose forms would take it past page::kMaxBytes (the first is always kept).
+    bool encode(std::chrono::steady_clock::time_point deadline) {
+        std::vector<uint8_t>& out = matches_.bytes;
+        if (!encodingBegun_) {
+            encodingBegun_ = true;
+            if (std::optional<Error> error =
+                    ZemCodec::beginEntry(matches_, protocol::key::kMatches, forms_->empty() ? 1 : 2)) {
+                failure_ = std::move(error);
+                return true;
+            }
+            headerAt_ = out.size();
+            ZemCodec::appendArrayHeader(forms_->size(), out);
+            groupStart_ = out.size();
+        }
+        while (true) {
+            for (; groupsDone_ < groupEnds_.size() && groupEnds_[groupsDone_].second == encoded_; ++groupsDone_) {
+                size_t groupBytes = out.size() - groupStart_;
+                if (groupsDone_ > 0 && formBytes_ + groupBytes > page::kMaxBytes) {
+                    cutBefore(groupsDone_);
+                    return true;
+                }
+                formBytes_ += groupBytes;
+                groupStart_ = out.size();
+            }
+            if (encoded_ == forms_->size()) return true;
+            if (std::optional<Error> error = AcceptedForms::appendForm((*forms_)[encoded_], out)) {
+                failure_ = std::move(error);
+                return true;
+            }
+            ++encoded_;
+            if (std::chrono::steady_clock::now() > deadline) return false;
+        }
+    }
+
+    // Ends the page after the identifier `group` - 1: its forms, encoded already, and the array's count go.
+    void cutBefore(size_t group) {
+        const size_t kept = groupEnds_[group - 1].second;
+        log::ops().info("page for client %d cut at %zu forms: more would exceed %llu bytes (page::kMaxBytes)",
+                        transaction_->client()->pid(), kept, static_cast<unsigned long long>(page::kMaxBytes));
+        std::vector<uint8_t>& out = matches_.bytes;
+        out.resize(groupStart_);
+        std::vector<uint8_t> header, written;
+        ZemCodec::appendArrayHeader(kept, header);
+        ZemCodec::appendArrayHeader(forms_->size(), written);
+        out.erase(out.begin() + static_cast<ptrdiff_t>(headerAt_),
+                  out.begin() + static_cast<ptrdiff_t>(headerAt_ + written.size()));
+        out.insert(out.begin() + static_cast<ptrdiff_t>(headerAt_), header.begin(), header.end());
+        forms_->resize(kept);
+        walkedTo_ = groupEnds_[group - 1].first;
+        ended_ = false;
+    }
+
+    void answer() {
+        Transaction& transaction = *transaction_;
+        if (failure_) {
+            log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(),
+                             *failure_);
+            transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");
+            return;
+        }
+        log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms_->size()));
+        transaction.reply().set(protocol::key::kGeneration, Value::uint64(generation_));
+        if (!ended_ && walkedTo_) {
+            if (binding_.rules.empty()) bindRules(binding_, rules_);
+            std::string continuation = database_.continuations().issue(*walkedTo_, binding_);
+            transaction.reply().set(protocol::key::kContinuation,
+                                    Value::data(std::span<const uint8_t>(
+                                        reinterpret_cast<const uint8_t*>(continuation.data()), continuation.size())));
+        }
+        if (!carriesMessageForms(transaction.version()))
+            transaction.done();
+        else
+            transaction.doneWithEncodedEntries(matches_);
+    }
+
+    std::shared_ptr<Transaction> transaction_;
+    BXDServer& database_;
+    const Value rules_;
+    const uint64_t flags_;
+    const size_t wanted_;
+    DiscoveryContinuation::Binding binding_;
+    BXMatchContext context_;
+    const std::vector<Value> exclusions_;
+    const CandidateFilter filter_;
+    const uint64_t generation_;
+
+    // The walk.
+    AcceptedForms accepted_;
+    // Where each identifier's forms end in the page, for cutting it by size.
+    std::vector<std::pair<std::string, size_t>> groupEnds_;
+    // The last identifier whose forms are in the page (or that the walk passed without a form).
+    std::optional<std::string> walkedTo_;
+    // The stretch being offered, the generation it was read at, and the next candidate in it.
+    std::optional<BXDatabase::PlugInSlice> slice_;
+    uint64_t sliceGeneration_ = 0;
+    size_t at_ = 0;
+    // The forms offered so far of the identifier being offered; they compete among themselves before the page
+    // takes them.
+    AcceptedForms group_;
+    std::optional<std::string> groupIdentifier_;
+    size_t walked_ = 0;
+    bool ended_ = false;
+
+    // The encoding, once the walk is complete: the forms, the reply entry they are written into, how many are
+    // written, how many identifiers are complete in it and where the one in progress starts.
+    std::optional<std::vector<AcceptedForms::EncodedForm>> forms_;
+    ZemCodec::Entries matches_;
+    bool encodingBegun_ = false;
+    size_t headerAt_ = 0;
+    size_t encoded_ = 0;
+    size_t groupsDone_ = 0;
+    size_t groupStart_ = 0;
+    size_t formBytes_ = 0;
+    std::optional<Error> failure_;
+};
+
+// Starts a page of a paged "match" (see the top of this file) once the request's page size and continuation hold.
 void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, const Value* pageSizeEntry,
                const Value* continuationEntry) {
     if (pageSizeEntry == nullptr) {
@@ -127,21 +360,17 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
                         static_cast<unsigned long long>(*asked), static_cast<unsigned long long>(page::kMaxForms));
     const size_t wanted = static_cast<size_t>(std::min(*asked, page::kMaxForms));
 
+    // The rules are bound only when a continuation is read or issued: a walk that fits one page never encodes
+    // them again, which matters for large rule sets.
     DiscoveryContinuation::Binding binding{.connection = client.serial(),
                                            .uid = client.user() ? client.user()->uid : static_cast<uid_t>(-1),
                                            .pid = pid,
                                            .flags = flags,
                                            .rules = {}};
-    // The rules are bound only when a continuation is read or issued: a walk that fits one page never encodes
-    // them again, which matters for large rule sets.
-    auto bindRules = [&binding, &rules] {
-        if (Result<std::vector<uint8_t>> encoded = ZemCodec::encode(rules); encoded)
-            binding.rules.assign(encoded->begin(), encoded->end());
-    };
     std::optional<std::string> after;
     if (continuationEntry != nullptr) {
         std::span<const uint8_t> bytes = continuationEntry->dataBytes();
-        bindRules();
+        bindRules(binding, rules);
         auto position = database.continuations().read(
             std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), binding);
         if (const auto* problem = std::get_if<DiscoveryContinuation::Problem>(&position)) {
@@ -163,90 +392,8 @@ void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, con
         }
         after = std::get<std::string>(std::move(position));
     }
-
-    BXMatchContext context{.annotations = &database.annotationSource()};
-    AcceptedForms accepted(flags);
-    // Taken after the exclusions are read, since reading them may publish their change, which the page reflects.
-    uint64_t generation = 0;
-    // Where each identifier's forms end in the page, for cutting it by size later.
-    std::vector<std::pair<std::string, size_t>> groupEnds;
-    std::optional<std::string> walkedTo = after;
-    bool ended = false;
-    {
-        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database.currentExclusions());
-        CandidateFilter filter{rules, exclusions, flags, client, database, context};
-        generation = database.changeFeed().current();
-        size_t walked = 0;
-        bool full = false;
-        const auto deadline = std::chrono::steady_clock::now() + kPageTimeBudget;
-        while (!full && walked < kMaxPageWalk) {
-            size_t stretch = std::clamp<size_t>(wanted - accepted.count(), 1, kWalkStretch);
-            std::optional<BXDatabase::PlugInSlice> slice =
-                database.findPlugInsAfterIdentifier(rules, walkedTo, stretch);
-            walked += stretch;
-            if (!slice) {
-                ended = true;
-                break;
-            }
-            trace::discoverRaw(static_cast<unsigned>(slice->plugIns.size()));
-            const BXDatabase::PlugInSet& candidates = slice->plugIns;
-            for (size_t first = 0; first < candidates.size();) {
-                std::string identifier = candidates[first]->identifier().value_or("");
-                size_t end = first + 1;
-                while (end < candidates.size() && candidates[end]->identifier().value_or("") == identifier) ++end;
-                AcceptedForms group(flags);
-                offerAdmitted(candidates, first, end, filter, group, database);
-                if (accepted.count() > 0 && accepted.count() + group.count() > wanted) {
-                    full = true;
-                    break;
-                }
-                accepted.absorb(std::move(group));
-                groupEnds.emplace_back(identifier, accepted.count());
-                walkedTo = std::move(identifier);
-                first = end;
-            }
-            if (full) break;
-            // Identifiers whose candidates the registry's election filter dropped were walked too.
-            if (slice->last) walkedTo = slice->last;
-            if (slice->ended) {
-                ended = true;
-                break;
-            }
-            full = accepted.count() >= wanted || (accepted.count() > 0 && std::chrono::steady_clock::now() > deadline);
-        }
-        accepted.linkReplacements();
-    }
-
-    std::vector<AcceptedForms::EncodedForm> forms = accepted.takeEncoded();
-    // The page ends before the identifier whose forms would take it past page::kMaxBytes (the first is always kept).
-    size_t bytes = 0;
-    for (size_t group = 0, at = 0; group < groupEnds.size(); ++group) {
-        size_t groupBytes = 0;
-        for (; at < groupEnds[group].second; ++at) {
-            Result<size_t> size = AcceptedForms::encodedSize(forms[at]);
-            groupBytes += size ? *size : 0;
-        }
-        if (group > 0 && bytes + groupBytes > page::kMaxBytes) {
-            log::ops().info("page for client %d cut at %zu forms: more would exceed %llu bytes (page::kMaxBytes)", pid,
-                            groupEnds[group - 1].second, static_cast<unsigned long long>(page::kMaxBytes));
-            forms.erase(forms.begin() + static_cast<ptrdiff_t>(groupEnds[group - 1].second), forms.end());
-            walkedTo = groupEnds[group - 1].first;
-            ended = false;
-            break;
-        }
-        bytes += groupBytes;
-    }
-
-    log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms.size()));
-    transaction.reply().set(protocol::key::kGeneration, Value::uint64(generation));
-    if (!ended && walkedTo) {
-        if (continuationEntry == nullptr) bindRules();
-        std::string continuation = database.continuations().issue(*walkedTo, binding);
-        transaction.reply().set(protocol::key::kContinuation,
-                                Value::data(std::span<const uint8_t>(
-                                    reinterpret_cast<const uint8_t*>(continuation.data()), continuation.size())));
-    }
-    answerWithForms(transaction, forms);
+    PageWalk::step(std::make_shared<PageWalk>(transaction.shared_from_this(), rules, flags, wanted, std::move(binding),
+                                              std::move(after)));
 }
 
 }  // namespace
