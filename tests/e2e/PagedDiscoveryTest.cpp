@@ -66,6 +66,17 @@ class PagedDiscoveryTest : public DaemonTest {
         paths.push_back(writePlugIn("p09v3", identifier(9), "3"));
         add(paths);
     }
+    // Registers `count` plug-ins of one version each, PREFIX000, PREFIX001... in identifier order, and returns the
+    // UUIDs that an unpaged match then finds.
+    std::multiset<std::string> registerNumbered(const std::string& prefix, int count) {
+        std::vector<std::string> paths;
+        for (int i = 0; i < count; ++i) {
+            std::string number = std::to_string(1000 + i).substr(1);
+            paths.push_back(writePlugIn(prefix + number, "com.example.paged." + prefix + number, "1"));
+        }
+        add(paths);
+        return unpaged();
+    }
     static std::string name(int i) { return (i < 10 ? "p0" : "p") + std::to_string(i); }
     static std::string identifier(int i) { return "com.example.paged." + name(i); }
 
@@ -198,15 +209,8 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
     unsetenv("BX_PAGE_STEP_MICROSECONDS");
     ASSERT_TRUE(started) << bxd_.log();
     grantSelfManager();
-    constexpr int kStable = 120;
-    std::vector<std::string> paths;
-    for (int i = 0; i < kStable; ++i) {
-        std::string number = std::to_string(1000 + i).substr(1);
-        paths.push_back(writePlugIn("s" + number, "com.example.paged.s" + number, "1"));
-    }
-    add(paths);
-    std::multiset<std::string> stable = unpaged();
-    ASSERT_EQ(stable.size(), static_cast<size_t>(kStable));
+    std::multiset<std::string> stable = registerNumbered("s", 120);
+    ASSERT_EQ(stable.size(), 120u);
     // Registered and removed in turn; their identifiers sort among the stable ones.
     std::vector<std::string> churn;
     for (int i = 0; i < 4; ++i)
@@ -247,15 +251,8 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
 TEST_F(PagedDiscoveryTest, APageEndsBeforeTheFormThatWouldTakeItPastItsByteLimit) {
     ASSERT_TRUE(start()) << bxd_.log();
     grantSelfManager();
-    constexpr int kCount = 130;
-    std::vector<std::string> paths;
-    for (int i = 0; i < kCount; ++i) {
-        std::string number = std::to_string(1000 + i).substr(1);
-        paths.push_back(writePlugIn("b" + number, "com.example.paged.b" + number, "1"));
-    }
-    add(paths);
-    std::multiset<std::string> all = unpaged();
-    ASSERT_EQ(all.size(), static_cast<size_t>(kCount));
+    std::multiset<std::string> all = registerNumbered("b", 130);
+    ASSERT_EQ(all.size(), 130u);
     const Value large = Value::dictionary({{"notes", str(std::string(70 * 1024, 'n'))}});
     std::vector<std::pair<std::string, Value>> annotations;
     for (const std::string& uuid : all) annotations.emplace_back(uuid, large);
