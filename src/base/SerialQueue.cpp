@@ -57,6 +57,18 @@ void SerialQueue::dispatch(std::function<void()> block) const {
     asio::dispatch(state_->strand, [state = state_, block = std::move(block)] { detail::runOnQueue(*state, block); });
 }
 
+void SerialQueue::asyncBehindReady(std::function<void()> block) const {
+    if (state_->core->closed()) return;
+    // The first trip through the loop's queue lands behind the handlers ready now and the loop's look for I/O;
+    // the second lands behind what that look found. Only then does the block join this queue (and runs at once
+    // when nothing of the queue is pending).
+    asio::post(*state_->core, [state = state_, block = std::move(block)]() mutable {
+        asio::post(*state->core, [state, block = std::move(block)]() mutable {
+            asio::dispatch(state->strand, [state, block = std::move(block)] { detail::runOnQueue(*state, block); });
+        });
+    });
+}
+
 void SerialQueue::asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
     if (state_->core->closed()) return;
     auto timer = std::make_shared<asio::steady_timer>(*state_->core, delay);

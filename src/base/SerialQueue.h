@@ -45,6 +45,12 @@ class SerialQueue {
     // on the request path, where a trip through the loop costs more than the work handed over.
     void dispatch(std::function<void()> block) const;
 
+    // Like async, except that `block` waits behind the loop's own work first: it enters this queue only once the
+    // loop has run the handlers ready by then and looked for I/O once more, so that what that I/O brings (and
+    // submits to this queue) comes before it. For long work cut into steps that must not delay requests: with
+    // async, a queue kept busy that way would make every request wait for a step before it is even read.
+    void asyncBehindReady(std::function<void()> block) const;
+
     // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
     void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
 

@@ -174,6 +174,38 @@ TEST(SerialQueueTest, DispatchRunsAtOnceOnTheLoopUnlessBlocksAreQueued) {
     EXPECT_TRUE(aCurrentAfter);
 }
 
+// Guards asyncBehindReady, which keeps a long walk's steps from delaying requests: a connection's handler that is
+// ready when the step is submitted hands its request to the queue ahead of the step (async would put the step
+// first), the step still comes after what the queue held already, and it runs as a block of the queue.
+TEST(SerialQueueTest, AsyncBehindReadyLetsWhatTheLoopHasReadyGoFirst) {
+    EventLoop loop(1);
+    SerialQueue requests("requests", loop);
+    SerialQueue connection("connection", loop);
+    std::vector<std::string> order;
+    bool stepOnQueue = false;
+    Countdown done(3);
+    requests.sync([&] {
+        requests.async([&] {
+            order.push_back("queued before");
+            done.arrive();
+        });
+        requests.asyncBehindReady([&] {
+            order.push_back("step");
+            stepOnQueue = requests.isCurrent();
+            done.arrive();
+        });
+        connection.async([&] {
+            requests.async([&] {
+                order.push_back("request");
+                done.arrive();
+            });
+        });
+    });
+    ASSERT_TRUE(done.wait());
+    EXPECT_EQ(order, (std::vector<std::string>{"queued before", "request", "step"}));
+    EXPECT_TRUE(stepOnQueue);
+}
+
 // ---- isCurrent and sync -------------------------------------------------------------------------------------------
 
 // The message of the InternalInconsistency that `attempt` throws, or "no exception".
