@@ -54,6 +54,9 @@ namespace page = protocol::page;
 // The most candidates one page walks: a page whose rules reject nearly everything still answers (with fewer
 // forms, possibly none, and a continuation) in bounded time.
 constexpr size_t kMaxPageWalk = 20000;
+// Every how many steps a page in the making looks whether its client has hung up (a system call), so that a page
+// nobody will read stops within a millisecond or so of work.
+constexpr size_t kStepsPerHangUpProbe = 16;
 // The most candidates asked of the registry at a time. Each query has a fixed cost (a read transaction of its
 // own), so larger stretches make a walk cheaper; a stretch that a step leaves half offered is kept for the next.
 constexpr size_t kWalkStretch = 32;
@@ -137,8 +140,10 @@ class PageWalk {
     // that came meanwhile.
     static void step(std::shared_ptr<PageWalk> page) {
         Transaction& transaction = *page->transaction_;
-        if (transaction.client()->isDead()) {
+        const bool probe = ++page->steps_ % kStepsPerHangUpProbe == 0;
+        if (transaction.client()->isDead() || (probe && transaction.client()->peerHasHungUp())) {
             // Nobody reads the reply; the page stops here.
+            log::ops().info("page for client %d abandoned: the client has gone", transaction.client()->pid());
             transaction.done();
             return;
         }
@@ -334,6 +339,7 @@ class PageWalk {
     size_t groupStart_ = 0;
     size_t formBytes_ = 0;
     std::optional<Error> failure_;
+    size_t steps_ = 0;
 };
 
 // Starts a page of a paged "match" (see the top of this file) once the request's page size and continuation hold.

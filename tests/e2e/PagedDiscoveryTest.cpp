@@ -3,8 +3,11 @@
 // whatever changes between pages, and a continuation works only on the connection, rules and run it came from.
 
 #include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 
 #include <atomic>
+#include <cstring>
 #include <fstream>
 #include <set>
 #include <thread>
@@ -12,6 +15,7 @@
 #include "E2eSupport.h"
 #include "client/BXDaemonClient.h"
 #include "client/BXDaemonClientSync.h"
+#include "platform/zem/ZemFrame.h"
 
 namespace bexil {
 namespace {
@@ -243,6 +247,19 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
     stop.store(true);
     changer.join();
     EXPECT_GE(changes.load(), 60u) << "the changes did not come while pages were made (" << walks << " walks)";
+
+    // Clients that hang up right after asking for a page (before or while it is made) leave the daemon serving.
+    std::vector<uint8_t> frame;
+    ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 1, 0, pageRequest(Value::uint64(1000)), frame));
+    for (int i = 0; i < 3; ++i) {
+        UniqueFd leaving(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_un address{AF_UNIX, {}};
+        strncpy(address.sun_path, bxd_.socketPath().c_str(), sizeof address.sun_path - 1);
+        ASSERT_EQ(connect(leaving.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+        ASSERT_EQ(send(leaving.get(), frame.data(), frame.size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
+    }
+    std::vector<std::string> served = uuidsOf(walk(1000));
+    EXPECT_EQ(std::multiset<std::string>(served.begin(), served.end()), stable);
 }
 
 // Guards the cut by size: with annotations of 70 KB on 130 plug-ins, a page asked for 200 forms ends before the
