@@ -70,9 +70,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void continueOnWriter(std::function<void()> work, std::function<void()> finish = nullptr);
     // Holds the reply and runs `step` on the request queue after the requests queued there by then and those that
     // the loop reads meanwhile, so that a handler with a long walk lets other clients' requests in between its
-    // steps. The reply goes out once a step
-    // has answered; a step may resume again instead. A step that does neither is a fault answered with code 4, and
-    // an exception from a step is answered as from a handler. REQUIRES: on the request queue.
+    // steps. The reply goes out once a step has answered; a step may resume again instead. A step that does neither
+    // is a fault answered with code 4, and an exception from a step is answered as from a handler. REQUIRES: on the
+    // request queue.
     void resumeLater(std::function<void()> step);
 
     const std::shared_ptr<BXDZemClient>& client() const { return client_; }

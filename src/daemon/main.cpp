@@ -35,11 +35,11 @@ constexpr size_t kDescriptorsKeptBack = 128;
 // Each connection holds its socket and a pidfd of its peer (which the peer's grants share rather than copy).
 constexpr size_t kDescriptorsPerConnection = 2;
 
-// A positive count from the environment variable `name`; none when it is unset, and none (logged) when it is not a
-// positive number.
 // A paged "match" that kept the request queue longer than this at a time would defeat the point of its steps.
 constexpr size_t kLongestPageStepMicroseconds = 1'000'000;
 
+// A positive count from the environment variable `name`; none when it is unset, and none (logged) when it is not a
+// positive number.
 std::optional<size_t> countFromEnvironment(const char* name) {
     const char* text = getenv(name);
     if (text == nullptr || *text == '\0') return std::nullopt;
@@ -141,8 +141,15 @@ int main(int argc, char** argv) {
     server->service().setLimits(limits);
     server->setVerbose(verbose);
     server->setCacheLimit(cacheLimit);
-    if (auto step = countFromEnvironment("BX_PAGE_STEP_MICROSECONDS"))
-        server->setPageStep(std::chrono::microseconds(std::min<size_t>(*step, kLongestPageStepMicroseconds)));
+    if (auto step = countFromEnvironment("BX_PAGE_STEP_MICROSECONDS")) {
+        if (*step > kLongestPageStepMicroseconds) {
+            log::ops().error(
+                "BX_PAGE_STEP_MICROSECONDS=%zu is longer than %zu (kLongestPageStepMicroseconds); using that", *step,
+                kLongestPageStepMicroseconds);
+            step = kLongestPageStepMicroseconds;
+        }
+        server->setPageStep(std::chrono::microseconds(*step));
+    }
     log::ops().debug(
         "bxd configured: service %s, cache limit %u, annotations %s, verbose %u, connections %zu "
         "(%zu per user, %zu kept for root), page steps of %lld us",
