@@ -7,6 +7,7 @@
 #include <sys/un.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstring>
 #include <fstream>
 #include <set>
@@ -223,10 +224,10 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
     std::vector<Value> stableUuids;
     for (const std::string& uuid : stable) stableUuids.push_back(Value::uuid(*Uuid::parse(uuid)));
 
-    std::atomic<bool> stop{false};
     std::atomic<unsigned> changes{0};
-    std::thread changer([&] {
-        for (unsigned round = 0; !stop.load(); ++round) {
+    // A jthread, so that a failed assertion below still stops and joins it.
+    std::jthread changer([&](std::stop_token stopping) {
+        for (unsigned round = 0; !stopping.stop_requested(); ++round) {
             const std::string& path = churn[round % churn.size()];
             succeed(pathsRequest("add", {path}));
             succeed(request("annotate", {{"uuids", Value::array({stableUuids[round % stableUuids.size()]})},
@@ -236,7 +237,8 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
         }
     });
     unsigned walks = 0;
-    for (; walks < 200 && (walks < 5 || changes.load() < 60); ++walks) {
+    const auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    for (; (walks < 5 || changes.load() < 60) && std::chrono::steady_clock::now() < giveUp; ++walks) {
         std::vector<Value> pages = walk(1000);
         ASSERT_FALSE(pages.empty());
         std::vector<std::string> served = uuidsOf(pages);
@@ -244,7 +246,7 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
         for (const std::string& uuid : servedSet) ASSERT_EQ(servedSet.count(uuid), 1u) << "served twice: " << uuid;
         for (const std::string& uuid : stable) ASSERT_EQ(servedSet.count(uuid), 1u) << "skipped: " << uuid;
     }
-    stop.store(true);
+    changer.request_stop();
     changer.join();
     EXPECT_GE(changes.load(), 60u) << "the changes did not come while pages were made (" << walks << " walks)";
 
