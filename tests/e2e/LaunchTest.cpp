@@ -301,6 +301,8 @@ TEST_F(LaunchTest, SandboxesDoNotOutliveTheDaemonThatStartedThem) {
     ASSERT_TRUE(restarted) << bxd_.log();
     EXPECT_TRUE(endsSoon(killedFirst)) << "the next daemon left the sandbox running\n" << bxd_.log();
     EXPECT_TRUE(endsSoon(killedOuter));
+    // The sandbox ends as bxd signals it, just before bxd logs that it did: wait for the line, then count it.
+    expectLog("left running by an earlier bxd");
     EXPECT_EQ(bxd_.countInLog("left running by an earlier bxd"), 1u) << bxd_.log();
 
     auto [stoppedOuter, stoppedFirst] = launchPinned();
