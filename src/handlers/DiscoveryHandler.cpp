@@ -79,23 +79,31 @@ void bindRules(DiscoveryContinuation::Binding& binding, const Value& rules) {
         binding.rules.assign(encoded->begin(), encoded->end());
 }
 
+// Answers with `matches`, the reply's matches entry encoded already, or with the failure to encode it. A client of
+// a version before message forms gets the reply without them.
+void answerWithMatches(Transaction& transaction, const ZemCodec::Entries& matches,
+                       const std::optional<Error>& failure) {
+    if (failure) {
+        log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(), *failure);
+        transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");
+    } else if (!carriesMessageForms(transaction.version())) {
+        transaction.done();
+    } else {
+        transaction.doneWithEncodedEntries(matches);
+    }
+}
+
 // Answers with `forms` as the reply's matches, written from the encoded entries the records keep and the few that
 // change, so that no form is built as a dictionary and encoded again on its way out.
 void answerWithForms(Transaction& transaction, std::span<const AcceptedForms::EncodedForm> forms) {
-    if (!carriesMessageForms(transaction.version())) {
-        transaction.done();
-        return;
-    }
     ZemCodec::Entries entries;
-    // The forms were checked at their own level within the reply; the entry's value is the array that holds them.
-    std::optional<Error> error = ZemCodec::beginEntry(entries, protocol::key::kMatches, forms.empty() ? 1 : 2);
-    if (!error) error = AcceptedForms::appendMatches(forms, entries.bytes);
-    if (error) {
-        log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(), *error);
-        transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");
-        return;
+    std::optional<Error> error;
+    if (carriesMessageForms(transaction.version())) {
+        // The forms were checked at their own level within the reply; the entry's value is the array holding them.
+        error = ZemCodec::beginEntry(entries, protocol::key::kMatches, forms.empty() ? 1 : 2);
+        if (!error) error = AcceptedForms::appendMatches(forms, entries.bytes);
     }
-    transaction.doneWithEncodedEntries(entries);
+    answerWithMatches(transaction, entries, error);
 }
 
 // The page size of a paged "match": a positive integer of either integer kind; none for anything else.
@@ -279,12 +287,7 @@ class PageWalk {
 
     void answer() {
         Transaction& transaction = *transaction_;
-        if (failure_) {
-            log::ops().error("cannot encode the forms of a match for client %d: %@", transaction.client()->pid(),
-                             *failure_);
-            transaction.fail(ErrorCode::OperationFailed, "cannot encode the matching forms");
-            return;
-        }
+        if (failure_) return answerWithMatches(transaction, matches_, failure_);
         log::ops().info("match returned %u plug-ins in a page", static_cast<unsigned>(forms_->size()));
         transaction.reply().set(protocol::key::kGeneration, Value::uint64(generation_));
         if (!ended_ && walkedTo_) {
@@ -294,10 +297,7 @@ class PageWalk {
                                     Value::data(std::span<const uint8_t>(
                                         reinterpret_cast<const uint8_t*>(continuation.data()), continuation.size())));
         }
-        if (!carriesMessageForms(transaction.version()))
-            transaction.done();
-        else
-            transaction.doneWithEncodedEntries(matches_);
+        answerWithMatches(transaction, matches_, std::nullopt);
     }
 
     std::shared_ptr<Transaction> transaction_;

@@ -27,49 +27,6 @@ Value versioned(std::string_view name, std::optional<Value> version) {
 }
 const Value kBogus = request("bogus");
 
-// A raw stream socket to the daemon, for bytes that no well-behaved client would send.
-class RawSocket {
-  public:
-    explicit RawSocket(const std::string& path) : fd_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-        sockaddr_un addr{AF_UNIX, {}};
-        strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-        EXPECT_EQ(connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0) << strerror(errno);
-    }
-    ~RawSocket() { closeNow(); }
-    void write(const std::vector<uint8_t>& bytes) { (void)!::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL); }
-    void closeNow() {
-        if (fd_ >= 0) ::close(std::exchange(fd_, -1));
-    }
-    // Exactly `count` bytes, or fewer when the peer closes or 5 s pass without any.
-    std::vector<uint8_t> read(size_t count) {
-        timeval tv{5, 0};
-        setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-        std::vector<uint8_t> bytes(count);
-        size_t got = 0;
-        while (got < count) {
-            ssize_t n = ::recv(fd_, bytes.data() + got, count - got, 0);
-            if (n <= 0) break;
-            got += static_cast<size_t>(n);
-        }
-        bytes.resize(got);
-        return bytes;
-    }
-    // True when the daemon closed the connection (a read gives 0 or an error other than the time limit) in 5 s.
-    bool closedByPeer() {
-        timeval tv{5, 0};
-        setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-        char buf[4096];
-        ssize_t n = 0;
-        do {
-            n = ::recv(fd_, buf, sizeof buf, 0);
-        } while (n > 0);
-        return n == 0 || (errno != EAGAIN && errno != EWOULDBLOCK);
-    }
-
-  private:
-    int fd_;
-};
-
 // `count` well-formed "bogus" request frames back to back.
 std::vector<uint8_t> burst(uint64_t count) {
     std::vector<uint8_t> out, one;

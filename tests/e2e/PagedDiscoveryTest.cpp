@@ -3,12 +3,9 @@
 // whatever changes between pages, and a continuation works only on the connection, rules and run it came from.
 
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 
 #include <atomic>
 #include <chrono>
-#include <cstring>
 #include <fstream>
 #include <set>
 #include <thread>
@@ -253,13 +250,7 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugIns
     // Clients that hang up right after asking for a page (before or while it is made) leave the daemon serving.
     std::vector<uint8_t> frame;
     ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Request, 1, 0, pageRequest(Value::uint64(1000)), frame));
-    for (int i = 0; i < 3; ++i) {
-        UniqueFd leaving(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_un address{AF_UNIX, {}};
-        strncpy(address.sun_path, bxd_.socketPath().c_str(), sizeof address.sun_path - 1);
-        ASSERT_EQ(connect(leaving.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-        ASSERT_EQ(send(leaving.get(), frame.data(), frame.size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
-    }
+    for (int i = 0; i < 3; ++i) RawSocket(bxd_.socketPath()).write(frame);
     std::vector<std::string> served = uuidsOf(walk(1000));
     EXPECT_EQ(std::multiset<std::string>(served.begin(), served.end()), stable);
 }
