@@ -4,6 +4,7 @@
 // Unix socket plumbing, blocking whole writes and reads, and the private environment a child bxd starts in.
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -104,8 +105,16 @@ inline void writeAll(int fd, const uint8_t* bytes, size_t length) {
     }
 }
 
+// Waits for input with poll before each read, as the client library does: a thread blocked in read() on a Unix
+// stream socket is also woken, for nothing, each time the peer takes in what it sent, and such a wake-up can queue
+// it on a busy CPU just before its answer comes.
 inline void readExactly(int fd, uint8_t* bytes, size_t length) {
     while (length > 0) {
+        pollfd ready{.fd = fd, .events = POLLIN, .revents = 0};
+        if (poll(&ready, 1, -1) < 0) {
+            if (errno == EINTR) continue;
+            die("poll");
+        }
         ssize_t n = read(fd, bytes, length);
         if (n < 0 && errno == EINTR) continue;
         if (n <= 0) die("read (bxd closed the connection)");
