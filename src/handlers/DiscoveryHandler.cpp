@@ -161,7 +161,14 @@ class PageWalk {
             page->accepted_.linkReplacements();
             page->forms_ = page->accepted_.takeEncoded();
         }
-        if (!page->encode(deadline)) return resume(std::move(page));
+        if (!page->made_) {
+            if (!page->encode(deadline)) return resume(std::move(page));
+            page->made_ = true;
+            // A page that took steps is answered behind the requests that came during its last one: its client
+            // then spends a millisecond or so reading it, and woken first it would hold the CPU that the client of
+            // a point match answered just after is woken onto, for a whole time slice.
+            if (page->steps_ > 1) return resume(std::move(page));
+        }
         page->answer();
     }
 
@@ -339,6 +346,8 @@ class PageWalk {
     size_t groupStart_ = 0;
     size_t formBytes_ = 0;
     std::optional<Error> failure_;
+    // The page is complete and waits for its answer to go out.
+    bool made_ = false;
     size_t steps_ = 0;
 };
 
