@@ -28,7 +28,6 @@ inline constexpr std::string_view kExtensionPointKey = "RZExtensionPointIdentifi
 inline constexpr std::string_view kIdentifierKey = "RZExtensionIdentifier";
 // Dynamic discovery queries get statements of their own shape; past this many the cache is dropped and rebuilt.
 inline constexpr size_t kMaxCachedStatements = 64;
-// Dynamic discovery queries get statements of their own shape; past this many the cache is dropped and rebuilt.
 
 inline constexpr std::string_view kSelectRow =
     "SELECT p.id, p.uuid, p.path, p.identifier, p.bundle_identifier, p.bundle_version, p.application_id, p.system, "
