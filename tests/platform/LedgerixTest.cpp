@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sqlite3.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -592,6 +593,50 @@ TEST_F(LedgerixPersistenceTest, DatabaseOfANewerSchemaIsRefused) {
     EXPECT_TRUE(fs::exists(file)) << "a newer database must be left alone";
 }
 
+// A file of the previous schema (before the pre-selection's walk indexes) is brought up to date when it is opened,
+// and a narrowed walk then reads through the new indexes (which it names, so it would fail without them).
+TEST_F(LedgerixPersistenceTest, AFileOfTheEarlierSchemaGetsTheWalkIndexesWhenOpened) {
+    for (int i = 0; i < 4; ++i)
+        registerOK(writePlugIn(bundles_ / ("P" + std::to_string(i) + ".bxplugin"),
+                               {.identifier = "com.example.p" + std::to_string(i),
+                                .point = i % 2 ? "com.example.odd" : "com.example.even"}));
+    workspace_.reset();
+    const std::string file = (state_ / "registry.sqlite3").string();
+    auto sql = [&](const std::string& statements, int64_t* number = nullptr) {
+        sqlite3* db = nullptr;
+        ASSERT_EQ(sqlite3_open(file.c_str(), &db), SQLITE_OK);
+        auto keep = [](void* out, int, char** values, char**) {
+            *static_cast<int64_t*>(out) = values[0] ? std::stoll(values[0]) : -1;
+            return 0;
+        };
+        EXPECT_EQ(sqlite3_exec(db, statements.c_str(), number ? +keep : nullptr, number, nullptr), SQLITE_OK)
+            << sqlite3_errmsg(db);
+        sqlite3_close(db);
+    };
+    const std::string walkIndexes =
+        "SELECT count(*) FROM sqlite_master WHERE type = 'index' AND name IN "
+        "('plugins_point_walk', 'plugins_wild_walk', 'plugins_identifier_walk')";
+    sql("DROP INDEX plugins_point_walk; DROP INDEX plugins_wild_walk; DROP INDEX plugins_identifier_walk; "
+        "PRAGMA user_version = 2;");
+    int64_t indexes = -1, version = -1;
+    sql(walkIndexes, &indexes);
+    ASSERT_EQ(indexes, 0);
+
+    open();
+    std::optional<LXWalkSlice> odd = workspace_->pluginsMatchingQueryAfterIdentifier(
+        Value(), {}, LXPreselection{.extensionPoints = std::vector<std::string>{"com.example.odd"}}, std::nullopt, 10);
+    ASSERT_TRUE(odd);
+    ASSERT_EQ(odd->plugIns.size(), 2u);
+    EXPECT_EQ(odd->plugIns[0]->pluginIdentifier(), "com.example.p1");
+    EXPECT_EQ(odd->plugIns[1]->pluginIdentifier(), "com.example.p3");
+    EXPECT_TRUE(odd->ended);
+    workspace_.reset();
+    sql(walkIndexes, &indexes);
+    sql("PRAGMA user_version", &version);
+    EXPECT_EQ(indexes, 3);
+    EXPECT_EQ(version, LedgerixWorkspace::kSchemaVersion);
+}
+
 // ---- Discovery queries ----
 
 class LedgerixQueryTest : public LedgerixTest {
@@ -675,16 +720,27 @@ TEST_F(LedgerixQueryTest, PlugInsThatMayAnswerAPointRuleElsewhereAreAlwaysCandid
 // The paged walk: stretches of any size, from the indexed query and from the interface's default (which sorts the
 // whole candidate list), visit every candidate once, by identifier (none first) and then registration; no
 // identifier is split between stretches, a stretch that is not the last has at least the rows asked for, and the
-// pre-selection narrows the walk as it narrows a query.
+// pre-selection narrows the walk as it narrows a query. A narrowed walk merges the alternatives of its
+// pre-selection (each point or identifier, and the plug-ins that may answer a rule elsewhere), read separately.
 TEST_F(LedgerixQueryTest, TheWalkVisitsEveryCandidateOnceByIdentifierWithoutSplittingOne) {
     for (const char* copy : {"Q7b", "Q7c"})
         registerOK(writePlugIn(bundles_ / (std::string(copy) + ".bxplugin"),
                                {.identifier = "com.example.q7", .point = "com.example.b"}));
     registerOK(writePlugIn(bundles_ / "W3.bxplugin", {.identifier = ""}));
+    // Their points are not one plain string, so every point pre-selection keeps them; they sort among the others.
+    registerOK(writePlugIn(
+        bundles_ / "W1.bxplugin",
+        {.identifier = "com.example.q15", .extraAttributes = {{"RZExtensionPointIdentifier", str("com.example.b")}}}));
+    registerOK(writePlugIn(bundles_ / "W2.bxplugin",
+                           {.identifier = "com.example.q0", .extraInfo = {{"RZExtensionPointIdentifier", str("x")}}}));
     auto keepAll = [](std::string_view, const std::optional<Value>&) { return true; };
     auto identifierOf = [](const auto& proxy) { return proxy->pluginIdentifier().value_or(""); };
     for (const LXPreselection& preselection :
-         {LXPreselection{}, LXPreselection{.extensionPoints = Strings{"com.example.b"}}}) {
+         {LXPreselection{}, LXPreselection{.extensionPoints = Strings{"com.example.b"}},
+          LXPreselection{.extensionPoints = Strings{"com.example.b", "com.example.a", "com.example.b"}},
+          LXPreselection{.identifiers = Strings{"com.example.q7", "com.example.q15", "com.example.q0"}},
+          LXPreselection{.extensionPoints = Strings{"com.example.a", "com.example.v1"},
+          .identifiers = Strings{"com.example.q0", "com.example.q1", "com.example.q15"}}}) {
         std::optional<LXProxyList> all = workspace_->pluginsMatchingQueryApplyFilter(Value(), keepAll, preselection);
         ASSERT_TRUE(all);
         std::stable_sort(all->begin(), all->end(),
@@ -714,7 +770,8 @@ TEST_F(LedgerixQueryTest, TheWalkVisitsEveryCandidateOnceByIdentifierWithoutSpli
                     EXPECT_GE(slice->plugIns.size(), rows);
                     after = slice->last;
                 }
-                EXPECT_EQ(walked, expected) << (indexed ? "indexed" : "default") << ", stretches of " << rows;
+                EXPECT_EQ(walked, expected) << (indexed ? "indexed" : "default") << ", stretches of " << rows << ", "
+                                            << expected.size() << " candidates";
             }
         }
     }

@@ -57,6 +57,13 @@ constexpr const char* kMigrations[] = {
     R"sql(
     CREATE INDEX plugins_walk ON plugIns(coalesce(identifier, ''), id);
     )sql",
+    // A walk narrowed to an extension point or an identifier reads each alternative of the pre-selection in walk
+    // order from one of these; without them every stretch would collect and sort all the point's remaining plug-ins.
+    R"sql(
+    CREATE INDEX plugins_point_walk ON plugIns(point_key, coalesce(identifier, ''), id);
+    CREATE INDEX plugins_wild_walk ON plugIns(coalesce(identifier, ''), id) WHERE point_wild = 1;
+    CREATE INDEX plugins_identifier_walk ON plugIns(identifier_key, coalesce(identifier, ''), id);
+    )sql",
 };
 static_assert(std::size(kMigrations) == LedgerixWorkspace::kSchemaVersion);
 

@@ -22,6 +22,8 @@
 #include <cstdint>
 #include <cstring>
 #include <fstream>
+#include <set>
+#include <string>
 #include <utility>
 
 #include "base/Document.h"
@@ -179,8 +181,14 @@ bool readHeldRow(const StatementUse& use, const LXKnownRecord& known, LedgerixWo
 
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRowsLocked(
     Connection& connection, std::string_view where, const std::vector<std::string>& arguments,
-    std::optional<int64_t> integerArgument, std::string_view order, const LXKnownRecord* known) {
+    std::optional<int64_t> integerArgument, std::string_view order, const LXKnownRecord* known,
+    std::string_view through) {
     std::string sql(kSelectRow);
+    if (!through.empty()) {
+        constexpr std::string_view kTable = "FROM plugins p";
+        if (size_t at = sql.find(kTable); at != std::string::npos)
+            sql.insert(at + kTable.size(), " INDEXED BY " + std::string(through));
+    }
     if (!where.empty()) {
         sql += " WHERE ";
         sql += where;
@@ -434,8 +442,50 @@ struct Preselected {
     }
 };
 
+// One alternative of a pre-selection (a point, the plug-ins whose point is not plain, an identifier, the plug-ins
+// without one) with the index that holds its plug-ins in walk order.
+struct WalkBranch {
+    std::string where;
+    std::vector<std::string> arguments;
+    std::string_view index;
+};
+
+// The alternatives of the first constraint of `preselection` (the points, else the identifiers), each narrowed by
+// the other constraint; one alternative without a condition when nothing is pre-selected. The walk reads each in
+// order from its index and merges them: one query with the whole pre-selection, ordered and limited, would collect
+// and sort all the remaining candidates for every stretch.
+std::vector<WalkBranch> walkBranches(const LXPreselection& preselection) {
+    auto present = [](const std::optional<std::vector<std::string>>& values) { return values && !values->empty(); };
+    std::vector<WalkBranch> branches;
+    auto split = [&](const std::vector<std::string>& values, std::string_view column, std::string_view orElse,
+                     std::string_view index, std::string_view orElseIndex, const Preselected& other) {
+        std::set<std::string> keys;
+        for (const std::string& value : values) keys.insert(matchForm(value));
+        auto add = [&](std::string condition, std::vector<std::string> arguments, std::string_view through) {
+            arguments.insert(arguments.end(), other.arguments.begin(), other.arguments.end());
+            branches.push_back({other.where.empty() ? condition : "(" + condition + ") AND (" + other.where + ")",
+                                std::move(arguments), through});
+        };
+        for (const std::string& key : keys) add(std::string(column) + " = ?", {key}, index);
+        add(std::string(orElse), {}, orElseIndex);
+    };
+    if (present(preselection.extensionPoints)) {
+        split(*preselection.extensionPoints, "p.point_key", "p.point_wild = 1", "plugins_point_walk",
+              "plugins_wild_walk",
+              Preselected(LXPreselection{.extensionPoints = std::nullopt, .identifiers = preselection.identifiers}));
+    } else if (present(preselection.identifiers)) {
+        split(*preselection.identifiers, "p.identifier_key", "p.identifier_key IS NULL", "plugins_identifier_walk",
+              "plugins_identifier_walk", Preselected(LXPreselection{}));
+    } else {
+        branches.push_back({"", {}, "plugins_walk"});
+    }
+    return branches;
+}
+
 // The walk's order; the index plugins_walk holds exactly this expression.
 constexpr std::string_view kWalkKey = "coalesce(p.identifier, '')";
+// What the walk's order puts in place of a missing identifier.
+const std::string kNoIdentifier;
 
 LXProxyList proxiesOf(LXCandidateList candidates) {
     LXProxyList proxies;
@@ -496,15 +546,29 @@ std::optional<LXCandidateSlice> LedgerixWorkspace::candidatesAfterIdentifier(con
     bool full = false;
     {
         std::lock_guard lock(lookups_.mutex);
-        std::vector<std::string> arguments = preselected.arguments;
-        std::string where = preselected.where;
-        if (after) {
-            where = preselected.whereAnd(key + " > ?");
-            arguments.push_back(*after);
+        // Each alternative's next `limit` rows; the first `limit` of them all, in walk order, are the stretch.
+        stretch.emplace();
+        std::set<int64_t> seen;
+        for (WalkBranch& branch : walkBranches(preselection)) {
+            std::string where = branch.where;
+            if (after) {
+                where = where.empty() ? key + " > ?" : "(" + where + ") AND " + key + " > ?";
+                branch.arguments.push_back(*after);
+            }
+            std::optional<std::vector<Row>> next = selectRowsLocked(
+                lookups_, where, branch.arguments, limit, " ORDER BY " + key + ", p.id LIMIT ?", heldBy, branch.index);
+            if (!next) return std::nullopt;
+            for (Row& row : *next)
+                if (seen.insert(row.id).second) stretch->push_back(std::move(row));
         }
-        stretch = selectRowsLocked(lookups_, where, arguments, limit, " ORDER BY " + key + ", p.id LIMIT ?", heldBy);
-        if (!stretch) return std::nullopt;
-        full = static_cast<int64_t>(stretch->size()) == limit;
+        auto walkOrder = [](const Row& a, const Row& b) {
+            const std::string& left = a.identifier ? *a.identifier : kNoIdentifier;
+            const std::string& right = b.identifier ? *b.identifier : kNoIdentifier;
+            return left != right ? left < right : a.id < b.id;
+        };
+        std::sort(stretch->begin(), stretch->end(), walkOrder);
+        full = static_cast<int64_t>(stretch->size()) >= limit;
+        if (full) stretch->resize(static_cast<size_t>(limit));
         // A full stretch may have cut its last identifier short: the rest of that identifier comes with it.
         if (full) {
             const Row& last = stretch->back();

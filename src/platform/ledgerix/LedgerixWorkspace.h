@@ -24,7 +24,7 @@ namespace bexil {
 
 class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enable_shared_from_this<LedgerixWorkspace> {
   public:
-    static constexpr int kSchemaVersion = 2;
+    static constexpr int kSchemaVersion = 3;
     static constexpr std::string_view kDatabaseFileName = "registry.sqlite3";
     static constexpr std::string_view kContainersDirectoryName = "containers";
 
@@ -116,11 +116,12 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
     // anything after it, such as a LIMIT that `integerArgument` binds). Rows that `known` says the caller holds are
     // read only in part (Row::held).
+    // `through`, when given, names the index SQLite must read the plug-ins through.
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument,
                                                      std::string_view order = " ORDER BY p.id",
-                                                     const LXKnownRecord* known = nullptr);
+                                                     const LXKnownRecord* known = nullptr, std::string_view index = {});
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument,
