@@ -12,11 +12,14 @@
 //    since past some count the reply cannot be sent at all;
 //  - the paged match with no rules (pages of --page-size, every page asked on one connection until the last):
 //    time per returned plug-in at every size, since no reply is larger than a page;
+//  - the paged match of one of the busy points (as a host pages through its own plug-ins): its time and bxd's CPU
+//    per returned plug-in, which should stay near the figure of the paged match with no rules;
 //  - "explain" of one plug-in on the point with the point's rules, beside the point match and a match of that one
 //    plug-in by identifier: round trips and their ratios, in the same run;
 //  - the point match beside a client that runs paged full discoveries back to back on another connection: its
-//    p50 / p99 against the idle figures of the same run, once with that client at normal priority and once at
-//    nice 19 (on 2 cores the first also measures the client's own decoding competing for the CPU).
+//    p50 / p99 against the idle figures of the same run and the share slower than twice the idle p99, once with
+//    that client at normal priority and once at nice 19 (on 2 cores the first also measures the client's own
+//    decoding competing for the CPU).
 //
 // --point-only stops after the point match and "explain" (the other figures take long at 100,000); --no-explain
 // leaves "explain" out, to measure a bxd that does not serve it.
