@@ -115,13 +115,13 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     std::shared_ptr<Statement> statement(Connection& connection, const std::string& sql);
     // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
     // anything after it, such as a LIMIT that `integerArgument` binds). Rows that `known` says the caller holds are
-    // read only in part (Row::held).
-    // `through`, when given, names the index SQLite must read the plug-ins through.
+    // read only in part (Row::held). `through`, when given, names the index SQLite must read the plug-ins through.
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument,
                                                      std::string_view order = " ORDER BY p.id",
-                                                     const LXKnownRecord* known = nullptr, std::string_view index = {});
+                                                     const LXKnownRecord* known = nullptr,
+                                                     std::string_view through = {});
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument,
