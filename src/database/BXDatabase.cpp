@@ -355,6 +355,25 @@ std::optional<BXDatabase::PlugInSlice> BXDatabase::findPlugInsAfterIdentifier(co
     return PlugInSlice{std::move(*records), std::move(slice->last), slice->ended};
 }
 
+std::optional<BXDatabase::PlugInStretch> BXDatabase::findPlugInsAfterRegistration(const Value& query, int64_t after,
+                                                                                  size_t rows) {
+    BX_ASSERT_NOT_ON_QUEUE(_sync);
+    // As in findPlugIns, an empty query is every installed plug-in without election filtering.
+    const bool all = !query.isDictionary() || query.count() == 0;
+    const LXPlugInFilter filter = all ? LXPlugInFilter() : filterFor(query);
+    const LXPreselection preselection = all ? LXPreselection{} : preselectionFor(query);
+    std::optional<LXRegistrationSlice> slice;
+    std::optional<PlugInSet> records = recordsAsking([&](const LXKnownRecord& known) -> std::optional<LXCandidateList> {
+        slice = workspace_->candidatesAfterRegistration(query, filter, preselection, after, rows, known);
+        if (!slice) return std::nullopt;
+        return std::move(slice->candidates);
+    });
+    if (!records) return std::nullopt;
+    return PlugInStretch{std::move(*records), slice->last, slice->ended};
+}
+
+std::optional<uint64_t> BXDatabase::registryVersion() { return workspace_->contentVersion(); }
+
 BXDatabase::PlugInSet BXDatabase::recordsForProxies(const LXProxyList& proxies) {
     LXCandidateList candidates;
     candidates.reserve(proxies.size());
@@ -458,6 +477,10 @@ void BXDatabase::setAnnotationForPlugIn(const Value& annotation, const BXDPlugIn
         saveAnnotations();
     else
         writer_.sync([this] { saveAnnotations(); });
+}
+
+uint64_t BXDatabase::annotationGeneration() {
+    return _sync.sync([&] { return annotations_->generation(); });
 }
 
 void BXDatabase::changeAnnotationForPlugIn(const Value& annotation, const BXDPlugIn& plugIn) {

@@ -129,6 +129,24 @@ class BXDatabase {
     std::optional<PlugInSlice> findPlugInsAfterIdentifier(const Value& query, const std::optional<std::string>& after,
                                                           size_t rows);
 
+    // One stretch of findPlugIns in the registry's order (see LXRegistrationSlice): the records, where the next
+    // stretch starts, and whether this was the last.
+    struct PlugInStretch {
+        PlugInSet plugIns;
+        int64_t last = 0;
+        bool ended = false;
+    };
+    // findPlugIns over the candidates after registry position `after` (0: from the start), at most `rows` of them
+    // where the registry can walk them in its order (it may give more). None when the registry gave nothing.
+    // REQUIRES: not inside `_sync`.
+    std::optional<PlugInStretch> findPlugInsAfterRegistration(const Value& query, int64_t after, size_t rows);
+    // A number that moves with every change of an annotation, as soon as it is made (before it is saved).
+    // REQUIRES: not inside `_sync`.
+    uint64_t annotationGeneration();
+    // A number that moves whenever a change to the registry has been committed (see
+    // LXApplicationWorkspace::contentVersion); none when the registry cannot say.
+    std::optional<uint64_t> registryVersion();
+
     // findPlugIns narrowed to the candidates whose identifier is `identifier`, in the registry's order (a standing
     // query recomputes one identifier at a time). None when the registry gave nothing.
     // REQUIRES: not inside `_sync`.

@@ -843,6 +843,60 @@ TEST_F(LedgerixQueryTest, RecordsTheCallerHoldsComeBackAsUuidsInTheirPlaceUnless
     EXPECT_EQ(asked, 0);
 }
 
+// Guards the walk in registration order: stretches of any size, from the start, give every plug-in once in
+// registration order, and only the last stretch says the walk ended, also when a filter refuses half of them (a
+// refusal is still a row read); a pre-selection comes in one stretch; and the content version moves with a commit
+// and only then.
+TEST_F(LedgerixQueryTest, StretchesInRegistrationOrderMakeUpTheWholeAndTheVersionMovesWithCommits) {
+    std::optional<LXProxyList> installed = workspace_->installedPlugins();
+    ASSERT_TRUE(installed);
+    ASSERT_EQ(installed->size(), 30u);
+    std::vector<Uuid> inOrder;
+    for (const auto& proxy : *installed) inOrder.push_back(*proxy->pluginUUID());
+    int offered = 0;
+    auto keepOdd = [&](std::string_view, const std::optional<Value>&) { return ++offered % 2 == 1; };
+    auto walk = [&](size_t rows, const LXPlugInFilter& filter, size_t* stretches) {
+        std::vector<Uuid> walked;
+        int64_t after = 0;
+        for (*stretches = 1; *stretches < 100; ++*stretches) {
+            std::optional<LXRegistrationSlice> slice =
+                workspace_->candidatesAfterRegistration(Value(), filter, {}, after, rows, {});
+            EXPECT_TRUE(slice);
+            if (!slice) break;
+            EXPECT_LE(slice->candidates.size(), rows);
+            for (const LXCandidate& candidate : slice->candidates) walked.push_back(candidate.uuid);
+            if (slice->ended) break;
+            EXPECT_GT(slice->last, after);
+            after = slice->last;
+        }
+        return walked;
+    };
+    for (size_t rows : {1u, 7u, 30u, 100u}) {
+        size_t stretches = 0;
+        EXPECT_EQ(walk(rows, {}, &stretches), inOrder) << "stretches of " << rows;
+        // A full stretch cannot tell that nothing follows it: one more, empty or short, ends the walk.
+        EXPECT_EQ(stretches, rows > 30 ? 1u : 30 / rows + 1) << "stretches of " << rows;
+    }
+    size_t stretches = 0;
+    std::vector<Uuid> kept = walk(4, keepOdd, &stretches);
+    EXPECT_EQ(offered, 30);
+    EXPECT_EQ(kept.size(), 15u);
+    EXPECT_EQ(stretches, 8u);
+
+    std::optional<LXRegistrationSlice> pointB =
+        workspace_->candidatesAfterRegistration(Value(), {}, {.extensionPoints = Strings{"com.example.b"}}, 0, 1, {});
+    ASSERT_TRUE(pointB);
+    EXPECT_TRUE(pointB->ended);
+    EXPECT_EQ(pointB->candidates.size(), 10u);
+
+    std::optional<uint64_t> version = workspace_->contentVersion();
+    ASSERT_TRUE(version);
+    workspace_->installedPlugins();
+    EXPECT_EQ(workspace_->contentVersion(), version) << "a read is no change";
+    registerOK(writePlugIn(bundles_ / "Q.app/PlugIns/Late.bxplugin", {.identifier = "com.example.late"}));
+    EXPECT_NE(workspace_->contentVersion(), version);
+}
+
 // ---- Bundles the registry refuses ----
 
 using LedgerixBadBundleTest = LedgerixTest;

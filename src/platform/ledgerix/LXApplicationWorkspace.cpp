@@ -90,4 +90,14 @@ std::optional<LXCandidateSlice> LXApplicationWorkspace::candidatesAfterIdentifie
     return LXCandidateSlice{candidatesOf(std::move(slice->plugIns)), std::move(slice->last), slice->ended};
 }
 
+std::optional<LXRegistrationSlice> LXApplicationWorkspace::candidatesAfterRegistration(
+    const Value& query, const LXPlugInFilter& filter, const LXPreselection& preselection, int64_t after, size_t,
+    const LXKnownRecord& known) {
+    // Without positions to walk by, the first stretch is everything and there is no second.
+    if (after != 0) return LXRegistrationSlice{{}, after, true};
+    std::optional<LXCandidateList> candidates = candidatesMatchingQuery(query, filter, preselection, known);
+    if (!candidates) return std::nullopt;
+    return LXRegistrationSlice{std::move(*candidates), 1, true};
+}
+
 }  // namespace bexil

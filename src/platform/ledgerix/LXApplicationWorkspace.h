@@ -6,6 +6,7 @@
 // own while calling an observer or a query filter. LedgerixWorkspace is the implementation over SQLite; tests of
 // the layers above may substitute their own.
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -94,6 +95,15 @@ struct LXCandidateSlice {
     bool ended = false;
 };
 
+// One stretch of the candidates in registration order, for a walk that was told which records the caller holds.
+struct LXRegistrationSlice {
+    LXCandidateList candidates;
+    // Where the next stretch starts: the registry's position of the last candidate read, whether or not it passed.
+    int64_t last = 0;
+    // True when no candidate comes after `last`: the walk is over.
+    bool ended = false;
+};
+
 class LXApplicationWorkspace {
   public:
     virtual ~LXApplicationWorkspace() = default;
@@ -160,6 +170,18 @@ class LXApplicationWorkspace {
                                                                       const LXPreselection& preselection,
                                                                       const std::optional<std::string>& after,
                                                                       size_t rows, const LXKnownRecord& known);
+    // candidatesMatchingQuery a stretch at a time: at most `rows` candidates whose registry position comes after
+    // `after` (0: from the start), in registration order. A registry may hand out more at once where its indexes
+    // cannot walk the pre-selection in that order; the default hands out every candidate in one stretch.
+    virtual std::optional<LXRegistrationSlice> candidatesAfterRegistration(const Value& query,
+                                                                           const LXPlugInFilter& filter,
+                                                                           const LXPreselection& preselection,
+                                                                           int64_t after, size_t rows,
+                                                                           const LXKnownRecord& known);
+    // A number that changes whenever a change to the registry's contents has been committed since it was last
+    // read, so that a walk over several stretches can tell that they all saw one state; none when the registry
+    // cannot say (a walk must then read everything at once).
+    virtual std::optional<uint64_t> contentVersion() { return std::nullopt; }
 };
 
 }  // namespace bexil

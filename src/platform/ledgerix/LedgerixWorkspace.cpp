@@ -182,7 +182,7 @@ bool readHeldRow(const StatementUse& use, const LXKnownRecord& known, LedgerixWo
 std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRowsLocked(
     Connection& connection, std::string_view where, const std::vector<std::string>& arguments,
     std::optional<int64_t> integerArgument, std::string_view order, const LXKnownRecord* known,
-    std::string_view through) {
+    std::string_view through, Extent* extent) {
     std::string sql(kSelectRow);
     if (!through.empty()) {
         constexpr std::string_view kTable = "FROM plugins p";
@@ -203,6 +203,10 @@ std::optional<std::vector<LedgerixWorkspace::Row>> LedgerixWorkspace::selectRows
     std::vector<Row> rows;
     int rc;
     while ((rc = use.step()) == SQLITE_ROW) {
+        if (extent) {
+            ++extent->rows;
+            extent->last = use.integer(0);
+        }
         Row& row = rows.emplace_back();
         if (known && readHeldRow(use, *known, row)) continue;
         readRowColumns(use, row);
@@ -588,6 +592,54 @@ std::optional<LXCandidateSlice> LedgerixWorkspace::candidatesAfterIdentifier(con
     // The filter runs without the lock: it may call back into the registry.
     slice.candidates = candidatesFromRows(*stretch, filter);
     return slice;
+}
+
+std::optional<LXRegistrationSlice> LedgerixWorkspace::candidatesAfterRegistration(const Value& query,
+                                                                                  const LXPlugInFilter& filter,
+                                                                                  const LXPreselection& preselection,
+                                                                                  int64_t after, size_t rows,
+                                                                                  const LXKnownRecord& known) {
+    Preselected preselected(preselection);
+    // The pre-selection's indexes give their rows in another order, so that a stretch after a position would sort
+    // all the rest of them each time: what they select is read at once, in one query, instead.
+    if (!preselected.where.empty()) {
+        if (after != 0) return LXRegistrationSlice{{}, after, true};
+        std::optional<LXCandidateList> candidates = candidatesMatchingQuery(query, filter, preselection, known);
+        if (!candidates) return std::nullopt;
+        return LXRegistrationSlice{std::move(*candidates), INT64_MAX, true};
+    }
+    const int64_t limit = static_cast<int64_t>(std::clamp<size_t>(rows, 1, INT32_MAX));
+    Extent extent{0, after};
+    std::optional<std::vector<Row>> stretch;
+    {
+        std::lock_guard lock(lookups_.mutex);
+        // One integer argument is the limit; the position is bound as text and read back as the integer it is,
+        // which still lets SQLite seek to it by the primary key.
+        stretch = selectRowsLocked(lookups_, "p.id > CAST(? AS INTEGER)", {std::to_string(after)}, limit,
+                                   " ORDER BY p.id LIMIT ?", consulted(filter, known), {}, &extent);
+    }
+    if (!stretch) return std::nullopt;
+    LXRegistrationSlice slice;
+    slice.last = extent.last;
+    // Rows are counted as read, kept or not: only a short stretch is the last one.
+    slice.ended = extent.rows < static_cast<size_t>(limit);
+    log::lx().debug("%zu candidate(s) for %@ after position %lld", stretch->size(), query,
+                    static_cast<long long>(after));
+    // The filter runs without the lock: it may call back into the registry.
+    slice.candidates = candidatesFromRows(*stretch, filter);
+    return slice;
+}
+
+std::optional<uint64_t> LedgerixWorkspace::contentVersion() {
+    std::lock_guard lock(lookups_.mutex);
+    std::shared_ptr<Statement> stmt = statement(lookups_, "PRAGMA data_version");
+    if (!stmt) return std::nullopt;
+    StatementUse use(stmt->get());
+    if (use.step() != SQLITE_ROW) {
+        failure(lookups_, "read the data version");
+        return std::nullopt;
+    }
+    return static_cast<uint64_t>(use.integer(0));
 }
 
 std::optional<size_t> LedgerixWorkspace::plugInCount() {

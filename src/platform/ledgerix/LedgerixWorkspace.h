@@ -85,6 +85,11 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
                                                               const LXPreselection& preselection,
                                                               const std::optional<std::string>& after, size_t rows,
                                                               const LXKnownRecord& known) override;
+    std::optional<LXRegistrationSlice> candidatesAfterRegistration(const Value& query, const LXPlugInFilter& filter,
+                                                                   const LXPreselection& preselection, int64_t after,
+                                                                   size_t rows, const LXKnownRecord& known) override;
+    // SQLite's data version of the look-up connection, which moves with every commit of the change connection.
+    std::optional<uint64_t> contentVersion() override;
 
     const std::filesystem::path& databasePath() const { return databasePath_; }
     // Runs the store's full integrity check and decodes every stored dictionary; the first problem found, or none.
@@ -116,12 +121,17 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
     // anything after it, such as a LIMIT that `integerArgument` binds). Rows that `known` says the caller holds are
     // read only in part (Row::held). `through`, when given, names the index SQLite must read the plug-ins through.
+    // `extent`, when given, counts the rows read, kept or not, and keeps the position of the last.
+    struct Extent {
+        size_t rows = 0;
+        int64_t last = 0;
+    };
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument,
                                                      std::string_view order = " ORDER BY p.id",
                                                      const LXKnownRecord* known = nullptr,
-                                                     std::string_view through = {});
+                                                     std::string_view through = {}, Extent* extent = nullptr);
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument,
