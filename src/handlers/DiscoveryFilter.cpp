@@ -277,6 +277,7 @@ std::vector<size_t>* AcceptedForms::compete(const BXDPlugIn& plugIn) {
             return nullptr;
         }
         if (defeats_ != nullptr) (*defeats_)[uuidTextOfForm(other)] = {uuidTextOf(plugIn), rule};
+        if (other.kept) keptEntryBytes_ -= other.kept->bytes.size();
         forms_[*at].reset();
         sameIdentifier.erase(at);
         --kept_;
@@ -287,6 +288,7 @@ std::vector<size_t>* AcceptedForms::compete(const BXDPlugIn& plugIn) {
 
 void AcceptedForms::keep(const BXDPlugIn& plugIn, std::vector<size_t>& sameIdentifier, FormPointer form) {
     sameIdentifier.push_back(forms_.size());
+    if (form->kept) keptEntryBytes_ += form->kept->bytes.size();
     forms_.push_back(form);
     ++kept_;
     // A later plug-in naming the same identifier takes the entry over.
@@ -339,6 +341,7 @@ void AcceptedForms::absorb(AcceptedForms&& group) {
         ++kept_;
     }
     for (auto& [identifier, form] : group.replacements_) replacements_[identifier] = std::move(form);
+    keptEntryBytes_ += group.keptEntryBytes_;
 }
 
 std::vector<Value> AcceptedForms::take() {
@@ -357,16 +360,10 @@ std::vector<AcceptedForms::EncodedForm> AcceptedForms::takeEncoded() {
     return encoded;
 }
 
-std::optional<Error> AcceptedForms::appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out) {
-    size_t start = out.size();
-    ZemCodec::appendArrayHeader(forms.size(), out);
-    for (const EncodedForm& form : forms) {
-        if (std::optional<Error> error = appendForm(form, out)) {
-            out.resize(start);
-            return error;
-        }
-    }
-    return std::nullopt;
+std::optional<AcceptedForms::EncodedForm> AcceptedForms::takeEncodedAt(size_t slot) {
+    FormPointer form = std::move(forms_[slot]);
+    if (!form) return std::nullopt;
+    return EncodedForm{form->kept, form->entries.take()};
 }
 
 std::optional<Error> AcceptedForms::appendForm(const EncodedForm& form, std::vector<uint8_t>& out) {

@@ -101,6 +101,8 @@ class AcceptedForms {
     // Writes the replacement links into the forms, once every candidate has been seen.
     void linkReplacements();
     size_t count() const { return kept_; }
+    // The bytes of the kept entries of the forms offered encoded and kept: what their encoding takes at least.
+    size_t keptEntryBytes() const { return keptEntryBytes_; }
     // Appends the kept forms and replacement claims of `group`, whose identifier none of this one's forms have.
     void absorb(AcceptedForms&& group);
     // The kept forms as values. The builders are not used again: their entries move rather than being copied.
@@ -112,10 +114,13 @@ class AcceptedForms {
         Value changing;
     };
     std::vector<EncodedForm> takeEncoded();
-    // Appends the value of a reply's matches entry, an array of `forms`; the entry nests the forms two levels below
-    // the reply.
-    static std::optional<Error> appendMatches(std::span<const EncodedForm> forms, std::vector<uint8_t>& out);
-    // Appends one form as an element of that array (after its header).
+    // The same one form at a time, for a reply written in steps: the slots of forms_ (kept forms and the empty
+    // slots of beaten ones), and the form of a slot, taken out and released here (none for an empty slot). Once a
+    // form is taken, the competition is over: nothing more may be offered.
+    size_t slots() const { return forms_.size(); }
+    std::optional<EncodedForm> takeEncodedAt(size_t slot);
+    // Appends one form as an element of a reply's matches array (after its header); the entry nests the forms two
+    // levels below the reply.
     static std::optional<Error> appendForm(const EncodedForm& form, std::vector<uint8_t>& out);
 
   private:
@@ -140,6 +145,7 @@ class AcceptedForms {
     std::unordered_map<std::string, std::vector<size_t>> positions_;
     std::unordered_map<std::string, FormPointer> replacements_;
     size_t kept_ = 0;
+    size_t keptEntryBytes_ = 0;
 };
 
 }  // namespace bexil

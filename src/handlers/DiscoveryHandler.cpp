@@ -15,6 +15,10 @@
 // neither skip nor repeat a plug-in that stayed visible, and replacement links are written among the forms of a
 // page (the client library links across pages when it puts them together). A page is made in short steps with
 // other requests served between them; a change between two steps is seen like one between two pages.
+//
+// An unpaged "match" of many candidates is made in steps as well, reading the registry a stretch at a time in
+// registration order, but its reply must stay the one state that one go would answer: a change between two steps
+// starts it over (see WholeMatch).
 
 #include <algorithm>
 #include <cerrno>
@@ -60,6 +64,14 @@ constexpr size_t kStepsPerHangUpProbe = 16;
 // The most candidates asked of the registry at a time. Each query has a fixed cost (a read transaction of its
 // own), so larger stretches make a walk cheaper; a stretch that a step leaves half offered is kept for the next.
 constexpr size_t kWalkStretch = 32;
+// An unpaged "match" whose candidates all come in one stretch of at most this many is made in one step: its
+// offers cost less than the trips through the event loop that steps would add.
+constexpr size_t kOneStepCandidates = 256;
+// How many times an unpaged "match" starts again because the plug-ins changed between its steps before it is made in
+// one go, which nothing can interrupt.
+constexpr unsigned kMaxRestarts = 2;
+// The most bytes an array's header takes: its tag and a count of up to 64 bits.
+constexpr size_t kMaxArrayHeaderBytes = 11;
 
 // Exports the candidates that pass the filter and lets them compete.
 void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t to, const CandidateFilter& filter,
@@ -91,19 +103,6 @@ void answerWithMatches(Transaction& transaction, const ZemCodec::Entries& matche
     } else {
         transaction.doneWithEncodedEntries(matches);
     }
-}
-
-// Answers with `forms` as the reply's matches, written from the encoded entries the records keep and the few that
-// change, so that no form is built as a dictionary and encoded again on its way out.
-void answerWithForms(Transaction& transaction, std::span<const AcceptedForms::EncodedForm> forms) {
-    ZemCodec::Entries entries;
-    std::optional<Error> error;
-    if (carriesMessageForms(transaction.version())) {
-        // The forms were checked at their own level within the reply; the entry's value is the array holding them.
-        error = ZemCodec::beginEntry(entries, protocol::key::kMatches, forms.empty() ? 1 : 2);
-        if (!error) error = AcceptedForms::appendMatches(forms, entries.bytes);
-    }
-    answerWithMatches(transaction, entries, error);
 }
 
 // The page size of a paged "match": a positive integer of either integer kind; none for anything else.
@@ -351,6 +350,225 @@ class PageWalk {
     size_t steps_ = 0;
 };
 
+// An unpaged "match" on its way. Its reply must be what one go would answer at one moment: every candidate in
+// registration order, competing with all the others, so unlike a page it cannot end early. It is still made in steps
+// of BXDServer::pageStep(), reading the registry a stretch at a time and serving the requests that came meanwhile
+// between two steps. Whatever changed between two steps (a commit to the registry, or any change a client observes
+// through "match": annotations, holds, exclusions) starts it again from the first stretch, so that its reply is one
+// state; after kMaxRestarts it is made in one go. A match whose candidates come in one short stretch (a point match,
+// most often) is made in one step whatever its time. Lives on the request queue, kept alive by the step queued next.
+class WholeMatch {
+  public:
+    WholeMatch(std::shared_ptr<Transaction> transaction, Value rules, uint64_t flags)
+        : transaction_(std::move(transaction)),
+          database_(*transaction_->server()),
+          rules_(std::move(rules)),
+          flags_(flags),
+          context_{.annotations = &database_.annotationSource()} {}
+
+    static void step(std::shared_ptr<WholeMatch> match) {
+        Transaction& transaction = *match->transaction_;
+        const bool probe = ++match->steps_ % kStepsPerHangUpProbe == 0;
+        if (match->steps_ > 1 && (transaction.client()->isDead() || (probe && transaction.client()->peerHasHungUp()))) {
+            log::ops().info("match for client %d abandoned: the client has gone", transaction.client()->pid());
+            transaction.done();
+            return;
+        }
+        if (!match->walked_) {
+            if (match->attempt_ && match->changedSinceBegun())
+                match->startAgain("the plug-ins changed while it was made");
+            if (!match->attempt_) match->begin();
+        }
+        const auto deadline = match->restarts_ >= kMaxRestarts
+                                  ? std::chrono::steady_clock::time_point::max()
+                                  : std::chrono::steady_clock::now() + match->database_.pageStep();
+        if (!match->walked_) {
+            switch (match->walk(deadline)) {
+                case Walked::Paused:
+                    return resume(std::move(match));
+                case Walked::Changed:
+                    match->startAgain("the plug-ins changed while it was made");
+                    return step(std::move(match));
+                case Walked::Unreadable:
+                    match->startAgain("the registry could not be read");
+                    return step(std::move(match));
+                case Walked::Unversioned:
+                    // The first stretch did not hold every candidate: the walk starts over with the registry's
+                    // version read first. A match that fits one stretch never pays for reading it.
+                    match->versioned_ = true;
+                    match->attempt_.reset();
+                    return step(std::move(match));
+                case Walked::Complete:
+                    match->walked_ = true;
+                    break;
+            }
+        }
+        // A match made in one step is answered in it too.
+        const bool stepped = match->attempt_->stepped;
+        if (!match->encode(stepped ? deadline : std::chrono::steady_clock::time_point::max()))
+            return resume(std::move(match));
+        match->answer();
+    }
+
+  private:
+    enum class Walked { Complete, Paused, Changed, Unversioned, Unreadable };
+
+    static void resume(std::shared_ptr<WholeMatch> match) {
+        Transaction& transaction = *match->transaction_;
+        transaction.resumeLater([match = std::move(match)]() mutable { step(std::move(match)); });
+    }
+
+    // What one try reads and checks against, and what it accepted so far. The filter refers to the exclusions, so
+    // an attempt never moves.
+    struct Attempt {
+        Attempt(const WholeMatch& match, std::vector<Value> exclusionSets)
+            : exclusions(std::move(exclusionSets)),
+              filter{match.rules_,    exclusions,    match.flags_, *match.transaction_->client(),
+                     match.database_, match.context_},
+              accepted(match.flags_) {}
+        Attempt(const Attempt&) = delete;
+        Attempt& operator=(const Attempt&) = delete;
+
+        const std::vector<Value> exclusions;
+        const CandidateFilter filter;
+        // The change feed's generation, the annotations' and the registry's version the attempt began at; the
+        // registry's is read only for a walk of several stretches.
+        uint64_t generation = 0;
+        uint64_t annotationGeneration = 0;
+        std::optional<uint64_t> version;
+        AcceptedForms accepted;
+        // The stretch being offered, the next candidate in it, and the candidates read so far.
+        std::optional<BXDatabase::PlugInStretch> stretch;
+        size_t at = 0;
+        size_t read = 0;
+        // Whether this attempt may take more than one step.
+        bool stepped = false;
+    };
+
+    void begin() {
+        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database_.currentExclusions());
+        attempt_ = std::make_unique<Attempt>(*this, std::move(exclusions));
+        // Taken after the exclusions are read, since reading them may publish their change, which the reply
+        // reflects; the registry's version before its first stretch is read.
+        attempt_->generation = database_.changeFeed().current();
+        attempt_->annotationGeneration = database_.annotationGeneration();
+        if (versioned_) {
+            attempt_->version = database_.registryVersion();
+            unversionable_ = !attempt_->version;
+        }
+    }
+
+    // Whether something a client observes through "match" changed since the attempt began: a published change, or
+    // an annotation changed in memory, which is published only once it is saved.
+    bool changedSinceBegun() {
+        return attempt_->generation != database_.changeFeed().current() ||
+               attempt_->annotationGeneration != database_.annotationGeneration();
+    }
+
+    void startAgain(const char* why) {
+        attempt_.reset();
+        ++restarts_;
+        log::ops().info("match for client %d started again (%u): %s%s", transaction_->client()->pid(), restarts_, why,
+                        restarts_ >= kMaxRestarts ? "; it is made in one go" : "");
+    }
+
+    // Reads and offers candidates until all are offered (Complete), `deadline` has passed (Paused), the registry
+    // changed since the attempt began (Changed), a second stretch is due without the version to check it by
+    // (Unversioned), or a stretch after the first could not be read (Unreadable: answering the stretches before it
+    // would leave out the rest without saying so; a first stretch that cannot be read answers no plug-ins, as the
+    // registry giving nothing always has).
+    Walked walk(std::chrono::steady_clock::time_point deadline) {
+        Attempt& attempt = *attempt_;
+        // Without a version to tell one state from another, everything is read in one stretch.
+        const bool oneGo = deadline == std::chrono::steady_clock::time_point::max() || unversionable_;
+        while (true) {
+            if (!attempt.stretch || attempt.at == attempt.stretch->plugIns.size()) {
+                if (attempt.stretch && attempt.stretch->ended) {
+                    trace::discoverRaw(static_cast<unsigned>(attempt.read));
+                    return Walked::Complete;
+                }
+                if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
+                if (attempt.stretch && std::chrono::steady_clock::now() > deadline) return Walked::Paused;
+                const int64_t after = attempt.stretch ? attempt.stretch->last : 0;
+                attempt.stretch =
+                    database_.findPlugInsAfterRegistration(rules_, after, oneGo ? SIZE_MAX : kWalkStretch);
+                attempt.at = 0;
+                if (!attempt.stretch) {
+                    if (after != 0 && !oneGo) return Walked::Unreadable;
+                    trace::discoverRaw(0);
+                    return Walked::Complete;
+                }
+                // The stretches so far are one state of the registry only while nothing was committed since the
+                // version was read.
+                if (attempt.version && database_.registryVersion() != attempt.version) return Walked::Changed;
+                attempt.read += attempt.stretch->plugIns.size();
+                if (!attempt.stepped)
+                    attempt.stepped = !attempt.stretch->ended || attempt.stretch->plugIns.size() > kOneStepCandidates;
+                continue;
+            }
+            offerAdmitted(attempt.stretch->plugIns, attempt.at, attempt.at + 1, attempt.filter, attempt.accepted,
+                          database_);
+            ++attempt.at;
+            if (attempt.stepped && std::chrono::steady_clock::now() > deadline) return Walked::Paused;
+        }
+    }
+
+    // Writes the reply's matches until they are complete (true) or `deadline` has passed (false), releasing each
+    // form once written (a large reply's forms take a while to free). A client of a version before message forms
+    // gets none.
+    bool encode(std::chrono::steady_clock::time_point deadline) {
+        if (!carriesMessageForms(transaction_->version()) || failure_) return true;
+        AcceptedForms& accepted = attempt_->accepted;
+        std::vector<uint8_t>& out = matches_.bytes;
+        if (!writingBegun_) {
+            writingBegun_ = true;
+            accepted.linkReplacements();
+            if ((failure_ = ZemCodec::beginEntry(matches_, protocol::key::kMatches, accepted.count() == 0 ? 1 : 2)))
+                return true;
+            // Growing the entry would copy megabytes at once. A form's changing entries (annotations, token) take
+            // less than its kept ones unless its annotations are large, so twice the kept entries is room for the
+            // whole reply but in such cases; room never written to costs no memory.
+            out.reserve(out.size() + kMaxArrayHeaderBytes + 2 * accepted.keptEntryBytes());
+            ZemCodec::appendArrayHeader(accepted.count(), out);
+        }
+        while (nextSlot_ < accepted.slots()) {
+            std::optional<AcceptedForms::EncodedForm> form = accepted.takeEncodedAt(nextSlot_++);
+            if (!form) continue;
+            if ((failure_ = AcceptedForms::appendForm(*form, out))) return true;
+            if (std::chrono::steady_clock::now() > deadline) return false;
+        }
+        return true;
+    }
+
+    void answer() {
+        Transaction& transaction = *transaction_;
+        transaction.reply().set(protocol::key::kGeneration, Value::uint64(attempt_->generation));
+        if (!failure_) log::ops().info("match returned %u plug-ins", static_cast<unsigned>(attempt_->accepted.count()));
+        answerWithMatches(transaction, matches_, failure_);
+    }
+
+    std::shared_ptr<Transaction> transaction_;
+    BXDServer& database_;
+    const Value rules_;
+    const uint64_t flags_;
+    BXMatchContext context_;
+    std::unique_ptr<Attempt> attempt_;
+    // Whether attempts read the registry's version before their first stretch (once one stretch did not hold every
+    // candidate), and whether the registry turned out unable to give one.
+    bool versioned_ = false;
+    bool unversionable_ = false;
+    unsigned restarts_ = 0;
+    size_t steps_ = 0;
+    // Every candidate is offered; what remains is writing the reply.
+    bool walked_ = false;
+
+    // The reply's matches entry as it is written, and the next slot of the accepted forms to write.
+    ZemCodec::Entries matches_;
+    bool writingBegun_ = false;
+    size_t nextSlot_ = 0;
+    std::optional<Error> failure_;
+};
+
 // Starts a page of a paged "match" (see the top of this file) once the request's page size and continuation hold.
 void matchPage(Transaction& transaction, const Value& rules, uint64_t flags, const Value* pageSizeEntry,
                const Value* continuationEntry) {
@@ -430,23 +648,7 @@ void Transaction::matchPlugIns() {
         return;
     }
 
-    BXDServer* database = server();
-    BXMatchContext context{.annotations = &database->annotationSource()};
-    AcceptedForms accepted(flags);
-    {
-        // The candidates and the rejected forms live in this scope, so they are gone before the reply is encoded.
-        std::vector<Value> exclusions = BXDUserPrefs::exclusionRuleSets(database->currentExclusions());
-        CandidateFilter filter{rules, exclusions, flags, *client(), *database, context};
-        reply().set(protocol::key::kGeneration, Value::uint64(database->changeFeed().current()));
-        std::optional<BXDatabase::PlugInSet> candidates = database->findPlugIns(rules);
-        trace::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0);
-        if (candidates) offerAdmitted(*candidates, 0, candidates->size(), filter, accepted, *database);
-        accepted.linkReplacements();
-    }
-
-    log::ops().info("match returned %u plug-ins", static_cast<unsigned>(accepted.count()));
-    answerWithForms(*this, accepted.takeEncoded());
-    log::ops().debug("reply marshalled");
+    WholeMatch::step(std::make_shared<WholeMatch>(shared_from_this(), rules, flags));
 }
 
 }  // namespace bexil

@@ -1,6 +1,7 @@
 // Paged discovery through the real daemon: a "match" with a page size walks the plug-ins by identifier and hands
 // out a continuation per page. The pages put together must be the unpaged answer, whatever the page size and
-// whatever changes between pages, and a continuation works only on the connection, rules and run it came from.
+// whatever changes between pages, and a continuation works only on the connection, rules and run it came from. An
+// unpaged "match" is made in steps too, and must still answer one state, as if made in one go.
 
 #include <gtest/gtest.h>
 
@@ -333,6 +334,84 @@ TEST_F(PagedDiscoveryTest, BadPageSizesAreRefusedAndHugeOnesServedAsTheLargest) 
     expectLog("serving 10000 (page::kMaxForms)");
     size_t five = succeed(pageRequest(Value::int64(5))).get("matches").count();
     EXPECT_TRUE(five > 0 && five <= 5) << "a positive int64 is a size";
+}
+
+// Guards an unpaged "match" made in steps: with steps of 1 us, a match of everything (read a stretch at a time,
+// offered a candidate per step) answers what a match of the one extension point (read at once and offered in one
+// step) does: the same forms in the same order, three versions of one identifier registered stretches apart
+// competing as they would in one go, with and without all versions.
+TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersWhatOneGoDoes) {
+    setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
+    const bool started = start();
+    unsetenv("BX_PAGE_STEP_MICROSECONDS");
+    ASSERT_TRUE(started) << bxd_.log();
+    grantSelfManager();
+    add({writePlugIn("d1", "com.example.paged.dup", "1")});
+    registerNumbered("a", 50);
+    add({writePlugIn("d3", "com.example.paged.dup", "3")});
+    registerNumbered("b", 50);
+    add({writePlugIn("d2", "com.example.paged.dup", "2")});
+    for (uint64_t flags : {uint64_t{0}, kAllVersions}) {
+        auto match = [&](const Value& rules) {
+            return succeed(request("match", {{"rules", rules}, {"flags", Value::uint64(flags)}})).get("matches");
+        };
+        const Value everything = match(Value::emptyDictionary());
+        const Value onThePoint = match(Value::dictionary({{"RZExtensionPointIdentifier", str(kPoint)}}));
+        ASSERT_EQ(everything.count(), flags ? 103u : 101u);
+        EXPECT_TRUE(everything == onThePoint) << "flags " << flags;
+        std::vector<std::string> versions;
+        for (const Value& form : everything.items())
+            if (form.get("identifier").stringView() == "com.example.paged.dup")
+                versions.emplace_back(form.get("version").stringView());
+        const std::vector<std::string> expected =
+            flags ? std::vector<std::string>{"1", "3", "2"} : std::vector<std::string>{"3"};
+        EXPECT_EQ(versions, expected);
+    }
+}
+
+// Guards the one state of an unpaged "match" made in steps: while another client sets the same annotation on every
+// plug-in in one bulk change after another and registers and removes one more, every reply serves each plug-in
+// once, all with the annotation of one bulk change, and the daemon says that it started matches again.
+TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersOneStateWhileThePlugInsChange) {
+    setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
+    const bool started = start();
+    unsetenv("BX_PAGE_STEP_MICROSECONDS");
+    ASSERT_TRUE(started) << bxd_.log();
+    grantSelfManager();
+    std::multiset<std::string> stable = registerNumbered("s", 100);
+    ASSERT_EQ(stable.size(), 100u);
+    const std::string churn = writePlugIn("c", "com.example.paged.c", "1");
+
+    std::atomic<unsigned> changes{0};
+    std::jthread changer([&](std::stop_token stopping) {
+        for (int64_t round = 1; !stopping.stop_requested(); ++round) {
+            std::vector<std::pair<std::string, Value>> annotations;
+            for (const std::string& uuid : stable)
+                annotations.emplace_back(uuid, Value::dictionary({{"round", Value::int64(round)}}));
+            succeed(request("bulk-annotate", {{"annotations", Value::dictionary(std::move(annotations))}}));
+            succeed(pathsRequest(round % 2 ? "add" : "remove", {churn}));
+            changes.fetch_add(2);
+        }
+    });
+    unsigned matches = 0;
+    const auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    for (; (matches < 5 || changes.load() < 40) && std::chrono::steady_clock::now() < giveUp; ++matches) {
+        Value reply = succeed(request("match", {{"rules", Value::emptyDictionary()}}));
+        std::multiset<std::string> served;
+        std::set<int64_t> rounds;
+        for (const Value& form : reply.get("matches").items()) {
+            std::string uuid(form.get("uuid").stringView());
+            if (stable.count(uuid) == 0) continue;
+            served.insert(uuid);
+            rounds.insert(form.get("annotations").get("extension").get("round").getInt64().value_or(0));
+        }
+        ASSERT_EQ(served, stable);
+        ASSERT_EQ(rounds.size(), 1u) << "forms of " << rounds.size() << " bulk changes in one reply";
+    }
+    changer.request_stop();
+    changer.join();
+    EXPECT_GE(changes.load(), 40u) << "the changes did not come while matches were made (" << matches << ")";
+    expectLog("started again");
 }
 
 // Guards the tool on more plug-ins than one default page: `bexil add` registers them in batches and `bexil match`
