@@ -16,10 +16,10 @@
 //    per returned plug-in, which should stay near the figure of the paged match with no rules;
 //  - "explain" of one plug-in on the point with the point's rules, beside the point match and a match of that one
 //    plug-in by identifier: round trips and their ratios, in the same run;
-//  - the point match beside a client that runs paged full discoveries back to back on another connection: its
-//    p50 / p99 against the idle figures of the same run and the share slower than twice the idle p99, once with
-//    that client at normal priority and once at nice 19 (on 2 cores the first also measures the client's own
-//    decoding competing for the CPU).
+//  - the point match beside a client that runs full discoveries back to back on another connection, paged and
+//    (up to --all-max) unpaged: its p50 / p99 against the idle figures of the same run and the share slower than
+//    twice the idle p99 and the slowest, once with that client at normal priority and once at nice 19 (on 2 cores the
+//    first also measures the client's own decoding competing for the CPU).
 //
 // --point-only stops after the point match and "explain" (the other figures take long at 100,000); --no-explain
 // leaves "explain" out, to measure a bxd that does not serve it.
@@ -607,42 +607,52 @@ void runSize(const Options& options, int count) {
             forms, pages, static_cast<unsigned long long>(options.pageSize), wallUs / 1000, walks, cpu, loadAverage());
     }
 
-    // The point match beside a client that discovers everything, page after page, on its own connection. The
-    // discovering client decodes every page, so on a machine with fewer cores than busy threads part of what the
+    // The point match beside a client that discovers everything on its own connection, back to back: page after
+    // page, and (where the reply fits a frame) unpaged, as a client of the protocol without pages asks. The
+    // discovering client decodes every reply, so on a machine with fewer cores than busy threads part of what the
     // point match waits for is that client's own work, which no server can give back; the second round runs it
     // at the lowest priority, so that what remains is the wait inside bxd.
-    for (int discovererNice : {0, 19}) {
-        std::atomic<bool> stop{false};
-        std::atomic<unsigned> walks{0};
-        std::thread discoverer([&] {
-            setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), discovererNice);
-            Connection other = connectWhenUp(socketPath, bxd);
-            while (!stop.load()) {
-                pagedWalk(other, options.pageSize);
-                walks.fetch_add(1);
+    for (bool paged : {true, false}) {
+        if (!paged && !all) break;
+        for (int discovererNice : {0, 19}) {
+            std::atomic<bool> stop{false};
+            std::atomic<unsigned> walks{0};
+            std::thread discoverer([&] {
+                setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), discovererNice);
+                Connection other = connectWhenUp(socketPath, bxd);
+                while (!stop.load()) {
+                    if (paged)
+                        pagedWalk(other, options.pageSize);
+                    else {
+                        other.roundTrip(matchRequest(noRules));
+                        other.matches();
+                    }
+                    walks.fetch_add(1);
+                }
+                close(other.fd);
+            });
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            std::vector<double> busy;
+            busy.reserve(options.requests);
+            for (unsigned i = 0; i < options.requests; ++i) {
+                Clock::time_point start = Clock::now();
+                connection.roundTrip(matchRequest(pointRules));
+                busy.push_back(elapsedUs(start));
             }
-            close(other.fd);
-        });
-        std::this_thread::sleep_for(std::chrono::milliseconds(50));
-        std::vector<double> busy;
-        busy.reserve(options.requests);
-        for (unsigned i = 0; i < options.requests; ++i) {
-            Clock::time_point start = Clock::now();
-            connection.roundTrip(matchRequest(pointRules));
-            busy.push_back(elapsedUs(start));
+            stop.store(true);
+            discoverer.join();
+            Percentiles b = percentiles(busy);
+            // The slow tail is made of whole scheduler time slices, so the p99 jumps as their share crosses 1%; the
+            // share itself says how close it is.
+            double beyond = static_cast<double>(
+                                std::count_if(busy.begin(), busy.end(), [&](double us) { return us > 2 * p.p99Us; })) /
+                            static_cast<double>(busy.size());
+            printf(
+                "point match beside %s full discovery (discovering client at nice %d, %u walks meanwhile): p50 "
+                "%.1f us (%.2fx idle), p99 %.1f us (%.2fx idle), %.2f%% beyond 2x the idle p99, slowest %.1f ms\n",
+                paged ? "paged" : "unpaged", discovererNice, walks.load(), b.p50Us, b.p50Us / p.p50Us, b.p99Us,
+                b.p99Us / p.p99Us, 100 * beyond, *std::max_element(busy.begin(), busy.end()) / 1000);
         }
-        stop.store(true);
-        discoverer.join();
-        Percentiles b = percentiles(busy);
-        // The slow tail is made of whole scheduler time slices, so the p99 jumps as their share crosses 1%; the
-        // share itself says how close it is.
-        double beyond =
-            static_cast<double>(std::count_if(busy.begin(), busy.end(), [&](double us) { return us > 2 * p.p99Us; })) /
-            static_cast<double>(busy.size());
-        printf(
-            "point match beside paged full discovery (discovering client at nice %d, %u walks meanwhile): p50 %.1f "
-            "us (%.2fx idle), p99 %.1f us (%.2fx idle), %.2f%% beyond 2x the idle p99\n",
-            discovererNice, walks.load(), b.p50Us, b.p50Us / p.p50Us, b.p99Us, b.p99Us / p.p99Us, 100 * beyond);
     }
     fflush(stdout);
 
