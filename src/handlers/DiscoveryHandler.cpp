@@ -437,10 +437,12 @@ class WholeMatch {
         uint64_t annotationGeneration = 0;
         std::optional<uint64_t> version;
         AcceptedForms accepted;
-        // The stretch being offered, the next candidate in it, and the candidates read so far.
+        // The stretch being offered, the next candidate in it, and the candidates read so far; whether a stretch
+        // was read since the registry's version was last looked at.
         std::optional<BXDatabase::PlugInStretch> stretch;
         size_t at = 0;
         size_t read = 0;
+        bool unchecked = false;
         // Whether this attempt may take more than one step.
         bool stepped = false;
     };
@@ -481,14 +483,21 @@ class WholeMatch {
         Attempt& attempt = *attempt_;
         // Without a version to tell one state from another, everything is read in one stretch.
         const bool oneGo = deadline == std::chrono::steady_clock::time_point::max() || unversionable_;
+        // The stretches read so far are one state of the registry as long as nothing was committed since the version
+        // was read: looked at once before a step ends, which covers every stretch the step read.
+        auto endOfStep = [&](Walked outcome) {
+            if (!attempt.unchecked) return outcome;
+            attempt.unchecked = false;
+            return database_.registryVersion() == attempt.version ? outcome : Walked::Changed;
+        };
         while (true) {
             if (!attempt.stretch || attempt.at == attempt.stretch->plugIns.size()) {
                 if (attempt.stretch && attempt.stretch->ended) {
                     trace::discoverRaw(static_cast<unsigned>(attempt.read));
-                    return Walked::Complete;
+                    return endOfStep(Walked::Complete);
                 }
                 if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
-                if (attempt.stretch && std::chrono::steady_clock::now() > deadline) return Walked::Paused;
+                if (attempt.stretch && std::chrono::steady_clock::now() > deadline) return endOfStep(Walked::Paused);
                 const int64_t after = attempt.stretch ? attempt.stretch->last : 0;
                 attempt.stretch =
                     database_.findPlugInsAfterRegistration(rules_, after, oneGo ? SIZE_MAX : kWalkStretch);
@@ -498,9 +507,7 @@ class WholeMatch {
                     trace::discoverRaw(0);
                     return Walked::Complete;
                 }
-                // The stretches so far are one state of the registry only while nothing was committed since the
-                // version was read.
-                if (attempt.version && database_.registryVersion() != attempt.version) return Walked::Changed;
+                attempt.unchecked = attempt.version.has_value();
                 attempt.read += attempt.stretch->plugIns.size();
                 if (!attempt.stepped)
                     attempt.stepped = !attempt.stretch->ended || attempt.stretch->plugIns.size() > kOneStepCandidates;
@@ -509,7 +516,7 @@ class WholeMatch {
             offerAdmitted(attempt.stretch->plugIns, attempt.at, attempt.at + 1, attempt.filter, attempt.accepted,
                           database_);
             ++attempt.at;
-            if (attempt.stepped && std::chrono::steady_clock::now() > deadline) return Walked::Paused;
+            if (attempt.stepped && std::chrono::steady_clock::now() > deadline) return endOfStep(Walked::Paused);
         }
     }
 
