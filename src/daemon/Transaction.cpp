@@ -230,6 +230,18 @@ void Transaction::doneWithEncodedEntries(const ZemCodec::Entries& entries) {
     answer(HeldReply{Value(), {}, std::move(encoded)});
 }
 
+void Transaction::doneWithEncodedReply(std::vector<uint8_t> payload) {
+    if (answered_.exchange(true)) {
+        log::ops().fault("transaction answered twice for client %d", client_->pid());
+        return;
+    }
+    if (payload.size() > ZemFrame::kMaxPayloadBytes) {
+        answer(HeldReply{tooLargeReply(payload.size()), {}, {}});
+        return;
+    }
+    answer(HeldReply{Value(), {}, std::move(payload)});
+}
+
 Value Transaction::tooLargeReply(size_t size) const {
     log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", size,
                      client_->pid(), ZemFrame::kMaxPayloadBytes);

@@ -48,6 +48,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // The same, with the reply's dictionary made of what the handler set and `entries`, encoded already (the
     // handler's entry of a key replaces the encoded one). For replies most of whose bytes were kept encoded.
     void doneWithEncodedEntries(const ZemCodec::Entries& entries);
+    // The same with the whole reply encoded already, what the handler set included, so that a reply of megabytes
+    // is not copied once more on its way out.
+    void doneWithEncodedReply(std::vector<uint8_t> payload);
     // Sets "errorcode" and "error" in the reply, then done().
     void fail(ErrorCode code, std::string_view message);
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.

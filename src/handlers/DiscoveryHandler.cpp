@@ -520,38 +520,61 @@ class WholeMatch {
         }
     }
 
-    // Writes the reply's matches until they are complete (true) or `deadline` has passed (false), releasing each
-    // form once written (a large reply's forms take a while to free). A client of a version before message forms
-    // gets none.
+    // Writes the whole reply until it is complete (true) or `deadline` has passed (false): the handler's entries
+    // and "matches" among them in key order, each form released once written (a large reply's forms take a while
+    // to free). The reply is handed over as written: copying megabytes into another buffer would hold the queue,
+    // all the longer for memory that was never used before. A client of a version before message forms gets none.
     bool encode(std::chrono::steady_clock::time_point deadline) {
         if (!carriesMessageForms(transaction_->version()) || failure_) return true;
         AcceptedForms& accepted = attempt_->accepted;
-        std::vector<uint8_t>& out = matches_.bytes;
         if (!writingBegun_) {
             writingBegun_ = true;
             accepted.linkReplacements();
-            if ((failure_ = ZemCodec::beginEntry(matches_, protocol::key::kMatches, accepted.count() == 0 ? 1 : 2)))
-                return true;
-            // Growing the entry would copy megabytes at once. A form's changing entries (annotations, token) take
-            // less than its kept ones unless its annotations are large, so twice the kept entries is room for the
-            // whole reply but in such cases; room never written to costs no memory.
-            out.reserve(out.size() + kMaxArrayHeaderBytes + 2 * accepted.keptEntryBytes());
-            ZemCodec::appendArrayHeader(accepted.count(), out);
+            transaction_->reply().set(protocol::key::kGeneration, Value::uint64(attempt_->generation));
+            Result<ZemCodec::Entries> others = ZemCodec::encodeEntries(transaction_->reply().value());
+            ZemCodec::Entries matchesKey;
+            if (!others) failure_ = others.error();
+            if (!failure_) failure_ = ZemCodec::beginEntry(matchesKey, protocol::key::kMatches, 2);
+            if (failure_) return true;
+            others_ = std::move(*others);
+            while (othersWritten_ < others_.count() && others_.key(othersWritten_) < protocol::key::kMatches)
+                ++othersWritten_;
+            // Room for it all: a form's changing entries (annotations, token) take less than its kept ones
+            // unless its annotations are large, so twice the kept entries is room enough but in such cases, where
+            // the reply grows; room never written to costs no memory.
+            payload_.reserve(kMaxArrayHeaderBytes * 2 + others_.bytes.size() + matchesKey.bytes.size() +
+                             2 * accepted.keptEntryBytes());
+            ZemCodec::appendDictionaryHeader(others_.count() + 1, payload_);
+            payload_.insert(payload_.end(), others_.bytes.begin(),
+                            others_.bytes.begin() + static_cast<ptrdiff_t>(othersWritten_ < others_.count()
+                                                                               ? others_.starts[othersWritten_]
+                                                                               : others_.bytes.size()));
+            payload_.insert(payload_.end(), matchesKey.bytes.begin(), matchesKey.bytes.end());
+            ZemCodec::appendArrayHeader(accepted.count(), payload_);
         }
         while (nextSlot_ < accepted.slots()) {
             std::optional<AcceptedForms::EncodedForm> form = accepted.takeEncodedAt(nextSlot_++);
             if (!form) continue;
-            if ((failure_ = AcceptedForms::appendForm(*form, out))) return true;
+            if ((failure_ = AcceptedForms::appendForm(*form, payload_))) return true;
             if (std::chrono::steady_clock::now() > deadline) return false;
+        }
+        if (othersWritten_ < others_.count()) {
+            payload_.insert(payload_.end(),
+                            others_.bytes.begin() + static_cast<ptrdiff_t>(others_.starts[othersWritten_]),
+                            others_.bytes.end());
+            othersWritten_ = others_.count();
         }
         return true;
     }
 
     void answer() {
         Transaction& transaction = *transaction_;
-        transaction.reply().set(protocol::key::kGeneration, Value::uint64(attempt_->generation));
         if (!failure_) log::ops().info("match returned %u plug-ins", static_cast<unsigned>(attempt_->accepted.count()));
-        answerWithMatches(transaction, matches_, failure_);
+        if (failure_ || !carriesMessageForms(transaction.version())) {
+            transaction.reply().set(protocol::key::kGeneration, Value::uint64(attempt_->generation));
+            return answerWithMatches(transaction, ZemCodec::Entries(), failure_);
+        }
+        transaction.doneWithEncodedReply(std::move(payload_));
     }
 
     std::shared_ptr<Transaction> transaction_;
@@ -569,8 +592,11 @@ class WholeMatch {
     // Every candidate is offered; what remains is writing the reply.
     bool walked_ = false;
 
-    // The reply's matches entry as it is written, and the next slot of the accepted forms to write.
-    ZemCodec::Entries matches_;
+    // The reply as it is written: the handler's entries, how many of them are written, and the next slot of the
+    // accepted forms to write.
+    std::vector<uint8_t> payload_;
+    ZemCodec::Entries others_;
+    size_t othersWritten_ = 0;
     bool writingBegun_ = false;
     size_t nextSlot_ = 0;
     std::optional<Error> failure_;

@@ -662,4 +662,10 @@ void ZemCodec::appendArrayHeader(size_t count, std::vector<uint8_t>& out) {
     putVarint(putTag(out.data() + start, ZemTag::Array), count);
 }
 
+void ZemCodec::appendDictionaryHeader(size_t count, std::vector<uint8_t>& out) {
+    size_t start = out.size();
+    out.resize(start + 1 + varintSize(count));
+    putVarint(putTag(out.data() + start, ZemTag::Dictionary), count);
+}
+
 }  // namespace bexil

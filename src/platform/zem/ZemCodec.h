@@ -100,6 +100,8 @@ class ZemCodec {
     static Result<size_t> mergedSize(const Entries& entries, const Value& extra, size_t depth = 0);
     // Appends the start of an array of `count` items; the caller appends the items' encodings after it.
     static void appendArrayHeader(size_t count, std::vector<uint8_t>& out);
+    // The same for a dictionary of `count` entries, which the caller appends in ascending key order.
+    static void appendDictionaryHeader(size_t count, std::vector<uint8_t>& out);
 };
 
 }  // namespace bexil
