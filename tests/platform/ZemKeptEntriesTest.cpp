@@ -83,7 +83,7 @@ TEST(ZemKeptEntries, MergeWritesWhatEncodingTheMergedDictionaryWrites) {
 
 // Entries appended one by one (as a reply's pre-encoded matches are) merge like those of a dictionary; a frame
 // around an encoded payload is the frame around the value.
-TEST(ZemKeptEntries, AppendedEntriesAndEncodedFramesMatchTheValuePath) {
+TEST(ZemKeptEntries, AppendedEntriesHeadersAndEncodedFramesMatchTheValuePath) {
     const Value list = Value::array({Value::string("x"), Value::dictionary({{"k", Value::uint64(1)}})});
     ZemCodec::Entries entries;
     ASSERT_FALSE(ZemCodec::appendEntry(entries, "list", encoded(list), 2));
@@ -103,6 +103,24 @@ TEST(ZemKeptEntries, AppendedEntriesAndEncodedFramesMatchTheValuePath) {
     ASSERT_FALSE(ZemFrame::encode(ZemFrameKind::Reply, 5, 4, whole, fromValue));
     ASSERT_FALSE(ZemFrame::encodeEncoded(ZemFrameKind::Reply, 5, 4, merged, fromBytes));
     EXPECT_EQ(fromBytes, fromValue);
+    // The same dictionary written by hand, as a reply too large to copy once more is written: its header, then
+    // entries in key order, one of them an array whose header and items are appended separately.
+    Bytes byHand;
+    ZemCodec::appendDictionaryHeader(4, byHand);
+    const ZemCodec::Entries others = kept(extra);
+    byHand.insert(byHand.end(), others.entry(0).begin(), others.entry(0).end());
+    ZemCodec::Entries listKey;
+    ASSERT_FALSE(ZemCodec::beginEntry(listKey, "list", 2));
+    byHand.insert(byHand.end(), listKey.bytes.begin(), listKey.bytes.end());
+    ZemCodec::appendArrayHeader(2, byHand);
+    for (const Value& item : list.items()) {
+        Bytes one = encoded(item);
+        byHand.insert(byHand.end(), one.begin(), one.end());
+    }
+    byHand.insert(byHand.end(), others.entry(1).begin(), others.entry(1).end());
+    byHand.insert(byHand.end(), entries.entry(1).begin(), entries.entry(1).end());
+    EXPECT_EQ(byHand, encoded(whole));
+
     // Only a dictionary is a payload.
     Bytes refused = {7};
     std::optional<Error> error = ZemFrame::encodeEncoded(ZemFrameKind::Reply, 5, 4, encoded(list), refused);
