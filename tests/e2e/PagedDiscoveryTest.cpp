@@ -80,6 +80,14 @@ class PagedDiscoveryTest : public DaemonTest {
         add(paths);
         return unpaged();
     }
+    // Starts bxd with discovery steps of 1 us (about one candidate each) and makes this process a manager.
+    void startInStepsOfOneMicrosecond() {
+        setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
+        const bool started = start();
+        unsetenv("BX_PAGE_STEP_MICROSECONDS");
+        ASSERT_TRUE(started) << bxd_.log();
+        grantSelfManager();
+    }
     static std::string name(int i) { return (i < 10 ? "p0" : "p") + std::to_string(i); }
     static std::string identifier(int i) { return "com.example.paged." + name(i); }
 
@@ -207,11 +215,7 @@ TEST_F(PagedDiscoveryTest, ChangesBetweenPagesNeitherSkipNorRepeatPlugInsThatSta
 // plug-in that stays registered exactly once, serves nothing twice, and the stretch a step was in when a change
 // came is read again rather than offered as it was.
 TEST_F(PagedDiscoveryTest, ChangesBetweenStepsOfAPageNeitherSkipNorRepeatPlugInsThatStayed) {
-    setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
-    const bool started = start();
-    unsetenv("BX_PAGE_STEP_MICROSECONDS");
-    ASSERT_TRUE(started) << bxd_.log();
-    grantSelfManager();
+    ASSERT_NO_FATAL_FAILURE(startInStepsOfOneMicrosecond());
     std::multiset<std::string> stable = registerNumbered("s", 120);
     ASSERT_EQ(stable.size(), 120u);
     // Registered and removed in turn; their identifiers sort among the stable ones.
@@ -341,11 +345,7 @@ TEST_F(PagedDiscoveryTest, BadPageSizesAreRefusedAndHugeOnesServedAsTheLargest) 
 // step) does: the same forms in the same order, three versions of one identifier registered stretches apart
 // competing as they would in one go, with and without all versions.
 TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersWhatOneGoDoes) {
-    setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
-    const bool started = start();
-    unsetenv("BX_PAGE_STEP_MICROSECONDS");
-    ASSERT_TRUE(started) << bxd_.log();
-    grantSelfManager();
+    ASSERT_NO_FATAL_FAILURE(startInStepsOfOneMicrosecond());
     add({writePlugIn("d1", "com.example.paged.dup", "1")});
     registerNumbered("a", 50);
     add({writePlugIn("d3", "com.example.paged.dup", "3")});
@@ -373,11 +373,7 @@ TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersWhatOneGoDoes) {
 // plug-in in one bulk change after another and registers and removes one more, every reply serves each plug-in
 // once, all with the annotation of one bulk change, and the daemon says that it started matches again.
 TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersOneStateWhileThePlugInsChange) {
-    setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
-    const bool started = start();
-    unsetenv("BX_PAGE_STEP_MICROSECONDS");
-    ASSERT_TRUE(started) << bxd_.log();
-    grantSelfManager();
+    ASSERT_NO_FATAL_FAILURE(startInStepsOfOneMicrosecond());
     std::multiset<std::string> stable = registerNumbered("s", 100);
     ASSERT_EQ(stable.size(), 100u);
     const std::string churn = writePlugIn("c", "com.example.paged.c", "1");
