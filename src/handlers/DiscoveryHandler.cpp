@@ -493,8 +493,9 @@ class WholeMatch {
         while (true) {
             if (!attempt.stretch || attempt.at == attempt.stretch->plugIns.size()) {
                 if (attempt.stretch && attempt.stretch->ended) {
-                    trace::discoverRaw(static_cast<unsigned>(attempt.read));
-                    return endOfStep(Walked::Complete);
+                    const Walked outcome = endOfStep(Walked::Complete);
+                    if (outcome == Walked::Complete) trace::discoverRaw(static_cast<unsigned>(attempt.read));
+                    return outcome;
                 }
                 if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
                 if (attempt.stretch && std::chrono::steady_clock::now() > deadline) return endOfStep(Walked::Paused);
