@@ -493,6 +493,10 @@ TEST_F(WatchTest, TheToolPrintsOneLinePerChangeWhenNotOnATerminal) {
         "exec '" BEXIL_BINARY_DIR "/tools/bexil/bexil' watch RZExtensionPointIdentifier=" + std::string(kPointA) +
         " >'" + out.string() + "' 2>'" + err.string() + "'";
     auto run = [&]() -> pid_t {
+        // Emptied here, not only by the shell's redirection: a wait that began before the new shell started would
+        // otherwise count the previous run's lines.
+        std::ofstream(out, std::ios::trunc);
+        std::ofstream(err, std::ios::trunc);
         pid_t pid = 0;
         const char* argv[] = {"/bin/sh", "-c", command.c_str(), nullptr};
         EXPECT_EQ(posix_spawn(&pid, "/bin/sh", nullptr, nullptr, const_cast<char**>(argv), environ), 0);
