@@ -102,8 +102,17 @@ EventLoop::EventLoop(unsigned ownThreads) : core_(std::make_shared<detail::Event
 EventLoop::~EventLoop() {
     stop();
     for (auto& thread : threads_) thread.join();
+    // The bulk thread leaves after its block. It goes before the core can: its blocks hold queues, which hold the
+    // core, and the last of them may go on that thread.
+    if (core_->bulk) core_->bulk->join();
     // Pending blocks hold their queues, and queues hold the core: destroying the blocks here breaks that cycle.
     core_->shutDown();
+}
+
+void EventLoop::startBulkThread(int niceIncrement) {
+    if (core_->runners.load() != 0 || core_->bulk)
+        throw InternalInconsistency("a bulk thread starts before anything runs the loop, once");
+    core_->bulk = std::make_shared<detail::BulkThread>(niceIncrement);
 }
 
 void EventLoop::runOnCurrentThread() {
@@ -115,6 +124,7 @@ void EventLoop::runOnCurrentThread() {
 void EventLoop::stop() {
     core_->releaseKeepAlive();
     core_->stop();
+    if (core_->bulk) core_->bulk->stop();
 }
 
 bool EventLoop::isStopped() const { return core_->stopped(); }

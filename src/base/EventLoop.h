@@ -45,11 +45,21 @@ class EventLoop {
 
     // Stops the loop, joins its own threads and destroys every block still pending, without running it. Queues
     // made on this loop may outlive it; whatever they are given afterwards is dropped.
-    // REQUIRES: not called from one of the loop's threads.
+    // REQUIRES: not called from one of the loop's threads, nor from a block of its bulk thread.
     ~EventLoop();
 
     EventLoop(const EventLoop&) = delete;
     EventLoop& operator=(const EventLoop&) = delete;
+
+    // Gives the loop a bulk thread for SerialQueue::asyncInBulk: idle-scheduled where the process may raise it
+    // back, and `niceIncrement` steps of nice value below the caller whenever it runs at normal scheduling. From
+    // then on every block of the loop's queues takes the loop's exclusion, so blocks of different queues no longer
+    // overlap either, whichever thread runs them: the loop stays one logical thread. The bulk thread lets a loop
+    // thread that waits for the exclusion go first, and is raised to normal scheduling while one waits for its
+    // block to end.
+    // REQUIRES: no thread runs the loop yet (a loop made with no threads of its own); otherwise throws
+    // InternalInconsistency.
+    void startBulkThread(int niceIncrement);
 
     // Makes the calling thread one of the loop's threads until stop() is called (at once if it already was).
     void runOnCurrentThread();

@@ -20,20 +20,78 @@
 #define ASIO_NO_DEPRECATED
 #endif
 
+#include <sys/types.h>
+
 #include <asio.hpp>
 #include <atomic>
+#include <condition_variable>
+#include <deque>
 #include <exception>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <utility>
 
 #include "base/EventLoop.h"
 #include "base/SerialQueue.h"
 
 namespace bexil::detail {
+
+struct SerialQueueState;
+
+// The second thread of a loop that has one (EventLoop::startBulkThread): it runs the blocks given to
+// SerialQueue::asyncInBulk, one at a time. Every block of the loop's queues takes the loop's exclusion, here, so no
+// two blocks ever overlap whichever thread runs them, and the loop's threads go first: after each of its blocks the
+// bulk thread waits for a loop thread that wants the exclusion to have taken it.
+//
+// Where it may be raised again, the thread is scheduled as idle: it runs on a CPU only when nothing of normal
+// priority wants that CPU, and the kernel counts a CPU that runs only it as free when it places a waking thread.
+// While a loop thread waits for the exclusion, the bulk thread is raised to normal scheduling (at its nice value)
+// until its block ends, so that the wait lasts the block, not until the machine is quiet.
+class BulkThread {
+  public:
+    // Starts the thread, `niceIncrement` steps of nice value below its creator.
+    explicit BulkThread(int niceIncrement);
+    // Joins the thread; blocks still waiting are destroyed without running.
+    ~BulkThread();
+    BulkThread(const BulkThread&) = delete;
+    BulkThread& operator=(const BulkThread&) = delete;
+
+    void submit(std::shared_ptr<SerialQueueState> state, std::function<void()> block);
+    // Makes the thread leave after the block it is running, if any; blocks submitted afterwards are dropped.
+    // Never waits, so a block may call it.
+    void stop();
+    // Stops the thread and waits until it has left. REQUIRES: not called from a block of the loop.
+    void join();
+
+    // Takes and gives back the exclusion, on any thread.
+    void enter();
+    void leave() { exclusion_.unlock(); }
+
+  private:
+    void run(int niceIncrement);
+    // Lifts the thread out of idle scheduling until its block ends (settle); on a loop thread that must wait.
+    void raise();
+    void settle();
+
+    std::mutex exclusion_;
+    // Loop threads waiting for the exclusion.
+    std::atomic<unsigned> loopWaiting_{0};
+    // Set by the thread before it runs anything: its id, and whether it is idle-scheduled.
+    std::atomic<pid_t> tid_{0};
+    std::atomic<bool> idle_{false};
+    std::atomic<bool> raised_{false};
+
+    std::mutex mutex_;
+    std::condition_variable ready_;
+    std::deque<std::pair<std::shared_ptr<SerialQueueState>, std::function<void()>>> blocks_;
+    bool stopping_ = false;
+    std::thread thread_;
+};
 
 // The io_context of one EventLoop plus what the queues need to know about the threads running it.
 class EventLoopCore : public asio::io_context {
@@ -56,6 +114,9 @@ class EventLoopCore : public asio::io_context {
 
     // Number of threads running the loop or about to (own threads and callers of runOnCurrentThread).
     std::atomic<unsigned> runners{0};
+
+    // Set once, before any block of the loop runs, when the loop has a bulk thread.
+    std::shared_ptr<BulkThread> bulk;
 
   private:
     std::mutex keepAliveMutex_;
@@ -106,10 +167,27 @@ class CurrentQueueScope {
     const QueueFrame* previous_;
 };
 
+// Holds the exclusion of the loop's bulk thread for the scope's lifetime, when the loop has one and the calling
+// thread does not hold it already (a block run inside another, by dispatch). Nothing otherwise.
+class ExclusiveScope {
+  public:
+    explicit ExclusiveScope(const EventLoopCore& core);
+    ~ExclusiveScope();
+    ExclusiveScope(const ExclusiveScope&) = delete;
+    ExclusiveScope& operator=(const ExclusiveScope&) = delete;
+
+  private:
+    BulkThread* taken_ = nullptr;
+};
+
+// True when the calling thread holds the exclusion of `core`'s bulk thread.
+bool holdsExclusion(const EventLoopCore& core);
+
 // Runs `block` as a block of the queue: marked current, and an escaping exception is reported instead of unwinding
 // through the loop (which would end the loop thread and, with it, the process).
 template <class Block>
 void runOnQueue(const SerialQueueState& state, Block&& block) noexcept {
+    ExclusiveScope exclusive(*state.core);
     CurrentQueueScope scope(&state);
     try {
         std::forward<Block>(block)();

@@ -6,9 +6,19 @@
 
 #include "base/SerialQueue.h"
 
+#include <pthread.h>
+#include <sched.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
 #include <condition_variable>
 #include <exception>
+#include <fstream>
 #include <mutex>
+#include <string>
+#include <thread>
 
 #include "base/Error.h"
 #include "base/EventLoopAsio.h"
@@ -18,6 +28,12 @@ namespace bexil {
 namespace {
 
 thread_local const detail::QueueFrame* tlsCurrentFrame = nullptr;
+// The bulk thread whose exclusion the calling thread holds, if any.
+thread_local const detail::BulkThread* tlsExclusion = nullptr;
+
+// How often the bulk thread gives the CPU away, at most, waiting for a loop thread it woke to take the exclusion;
+// past that it takes its turn again (the loop thread may be waiting for a CPU that the bulk thread is not on).
+constexpr int kMaxGiveWays = 64;
 
 }  // namespace
 
@@ -31,6 +47,133 @@ CurrentQueueScope::CurrentQueueScope(const SerialQueueState* state, const QueueF
 }
 
 CurrentQueueScope::~CurrentQueueScope() { tlsCurrentFrame = previous_; }
+
+ExclusiveScope::ExclusiveScope(const EventLoopCore& core) {
+    BulkThread* bulk = core.bulk.get();
+    if (bulk == nullptr || tlsExclusion == bulk) return;
+    bulk->enter();
+    tlsExclusion = bulk;
+    taken_ = bulk;
+}
+
+ExclusiveScope::~ExclusiveScope() {
+    if (taken_ == nullptr) return;
+    tlsExclusion = nullptr;
+    taken_->leave();
+}
+
+bool holdsExclusion(const EventLoopCore& core) { return core.bulk && tlsExclusion == core.bulk.get(); }
+
+namespace {
+
+thread_local bool tlsOnBulkThread = false;
+
+// Whether this process may give a thread back normal scheduling, at `nice`, once it has made it idle-scheduled:
+// with CAP_SYS_NICE, or within RLIMIT_NICE (which counts 20 - nice).
+bool mayRaiseTo(int nice) {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NICE, &limit) == 0 &&
+        (limit.rlim_cur == RLIM_INFINITY || static_cast<rlim_t>(20 - nice) <= limit.rlim_cur))
+        return true;
+    std::ifstream status("/proc/thread-self/status");
+    std::string line;
+    constexpr int kCapSysNice = 23;
+    while (std::getline(status, line))
+        if (line.rfind("CapEff:", 0) == 0) return (std::stoull(line.substr(7), nullptr, 16) >> kCapSysNice) & 1;
+    return false;
+}
+
+}  // namespace
+
+BulkThread::BulkThread(int niceIncrement) : thread_([this, niceIncrement] { run(niceIncrement); }) {}
+
+BulkThread::~BulkThread() {
+    // The loop joins the thread when it goes; a loop never destroyed keeps its core, and this, alive too.
+    if (thread_.joinable()) join();
+}
+
+void BulkThread::join() {
+    stop();
+    if (thread_.joinable()) thread_.join();
+}
+
+void BulkThread::submit(std::shared_ptr<SerialQueueState> state, std::function<void()> block) {
+    {
+        std::lock_guard lock(mutex_);
+        if (stopping_) return;
+        blocks_.emplace_back(std::move(state), std::move(block));
+    }
+    ready_.notify_one();
+}
+
+void BulkThread::stop() {
+    {
+        std::lock_guard lock(mutex_);
+        stopping_ = true;
+    }
+    ready_.notify_one();
+}
+
+void BulkThread::enter() {
+    if (tlsOnBulkThread) {
+        exclusion_.lock();
+        return;
+    }
+    if (exclusion_.try_lock()) return;
+    loopWaiting_.fetch_add(1, std::memory_order_relaxed);
+    raise();
+    exclusion_.lock();
+    loopWaiting_.fetch_sub(1, std::memory_order_relaxed);
+}
+
+void BulkThread::raise() {
+    if (!idle_.load() || raised_.exchange(true)) return;
+    // sched_setscheduler keeps the thread's nice value.
+    sched_param normal{};
+    if (sched_setscheduler(tid_.load(), SCHED_OTHER, &normal) != 0) raised_.store(false);
+}
+
+void BulkThread::settle() {
+    if (!raised_.exchange(false)) return;
+    sched_param idle{};
+    sched_setscheduler(0, SCHED_IDLE, &idle);
+}
+
+void BulkThread::run(int niceIncrement) {
+    tlsOnBulkThread = true;
+    // Named apart from the loop's thread, in ps -L, top -H and scheduler traces.
+    pthread_setname_np(pthread_self(), "bulk");
+    // The thread started with its creator's nice value; on Linux this changes this thread's alone. Lowering one's
+    // own priority needs no privilege, so neither call can be refused.
+    const auto self = static_cast<pid_t>(gettid());
+    errno = 0;
+    const int nice = getpriority(PRIO_PROCESS, static_cast<id_t>(self));
+    const int lowered = std::min(nice + niceIncrement, 19);
+    if (errno == 0) setpriority(PRIO_PROCESS, static_cast<id_t>(self), lowered);
+    tid_.store(self);
+    sched_param idle{};
+    if (mayRaiseTo(lowered) && sched_setscheduler(0, SCHED_IDLE, &idle) == 0) idle_.store(true);
+    for (;;) {
+        std::pair<std::shared_ptr<SerialQueueState>, std::function<void()>> next;
+        {
+            std::unique_lock lock(mutex_);
+            ready_.wait(lock, [this] { return stopping_ || !blocks_.empty(); });
+            if (stopping_) {
+                blocks_.clear();
+                return;
+            }
+            next = std::move(blocks_.front());
+            blocks_.pop_front();
+        }
+        runOnQueue(*next.first, next.second);
+        next = {};
+        settle();
+        // A loop thread woken by the unlock has not necessarily run yet; taking the exclusion straight back would
+        // make it wait a whole block more.
+        for (int i = 0; i < kMaxGiveWays && loopWaiting_.load(std::memory_order_relaxed) > 0; ++i)
+            std::this_thread::yield();
+    }
+}
 
 }  // namespace detail
 
@@ -69,6 +212,12 @@ void SerialQueue::asyncBehindReady(std::function<void()> block) const {
     });
 }
 
+void SerialQueue::asyncInBulk(std::function<void()> block) const {
+    if (state_->core->closed()) return;
+    if (!state_->core->bulk) return asyncBehindReady(std::move(block));
+    state_->core->bulk->submit(state_, std::move(block));
+}
+
 void SerialQueue::asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
     if (state_->core->closed()) return;
     auto timer = std::make_shared<asio::steady_timer>(*state_->core, delay);
@@ -90,6 +239,9 @@ void SerialQueue::syncBlock(const std::function<void()>& block) const {
             throw InternalInconsistency("sync on queue \"" + state_->label + "\" from inside the same queue");
         }
     }
+    if (detail::holdsExclusion(*state_->core)) {
+        throw InternalInconsistency("sync on queue \"" + state_->label + "\" from a block of the same event loop");
+    }
     if (detail::runsOnCurrentThread(*state_->core) && state_->core->runners.load() <= 1) {
         throw InternalInconsistency("sync on queue \"" + state_->label + "\" from the only thread of its event loop");
     }
@@ -103,6 +255,7 @@ void SerialQueue::syncBlock(const std::function<void()>& block) const {
     std::exception_ptr failure;
     asio::post(state_->strand, [&, state = state_] {
         {
+            detail::ExclusiveScope exclusive(*state->core);
             detail::CurrentQueueScope scope(state.get(), caller);
             try {
                 block();

@@ -51,6 +51,12 @@ class SerialQueue {
     // async, a queue kept busy that way would make every request wait for a step before it is even read.
     void asyncBehindReady(std::function<void()> block) const;
 
+    // Like asyncBehindReady, except that on a loop with a bulk thread (EventLoop::startBulkThread) `block` runs on
+    // that thread: still as a block of this queue, and never beside any other block of the loop, but counted by
+    // the kernel against the bulk thread's share of the CPU. For the later steps of long work, so that the thread
+    // that reads and answers requests keeps the standing of a thread that mostly waits.
+    void asyncInBulk(std::function<void()> block) const;
+
     // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
     void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
 

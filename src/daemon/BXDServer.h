@@ -120,8 +120,9 @@ class BXDServer : public BXDatabase, public BXDatabaseDelegate {
     // Makes and checks the continuations of paged discovery with this run's key.
     const DiscoveryContinuation& continuations() const { return continuations_; }
     // The longest a "match" (a page, or an unpaged one of many candidates) keeps the request queue at a time before
-    // it lets the requests that came meanwhile in; $BX_PAGE_STEP_MICROSECONDS sets it. Shorter steps serve other
-    // clients sooner and make a discovery cost a little more. REQUIRES: on mainQueue.
+    // it lets the requests that came meanwhile in (its steps after the first run on the loop's bulk thread);
+    // $BX_PAGE_STEP_MICROSECONDS sets it. Shorter steps serve other clients sooner and make a discovery cost a little
+    // more. REQUIRES: on mainQueue.
     static constexpr std::chrono::microseconds kDefaultPageStep{50};
     std::chrono::microseconds pageStep() const { return pageStep_; }
     void setPageStep(std::chrono::microseconds step) { pageStep_ = step; }

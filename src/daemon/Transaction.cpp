@@ -175,7 +175,7 @@ void Transaction::continueOnWriter(std::function<void()> work, std::function<voi
 void Transaction::resumeLater(std::function<void()> step) {
     holdReply();
     resumed_ = true;
-    server()->mainQueue().asyncBehindReady([self = shared_from_this(), step = std::move(step)] {
+    server()->mainQueue().asyncInBulk([self = shared_from_this(), step = std::move(step)] {
         self->resumed_ = false;
         self->guarded(step);
         if (!self->answered() && !self->resumed_) {

@@ -71,11 +71,12 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // and only then sends the reply either of them made. An exception from either is answered as from a handler.
     // REQUIRES: on the request queue.
     void continueOnWriter(std::function<void()> work, std::function<void()> finish = nullptr);
-    // Holds the reply and runs `step` on the request queue after the requests queued there by then and those that
-    // the loop reads meanwhile, so that a handler with a long walk lets other clients' requests in between its
-    // steps. The reply goes out once a step has answered; a step may resume again instead. A step that does neither
-    // is a fault answered with code 4, and an exception from a step is answered as from a handler. REQUIRES: on the
-    // request queue.
+    // Holds the reply and runs `step` on the request queue, on the loop's bulk thread: never beside another block,
+    // but idle-scheduled, and the thread that reads requests goes first whenever it waits. So a handler
+    // with a long walk lets other clients' requests in between its steps, and the CPU its steps take is not held
+    // against theirs. The reply goes out once a step has answered; a step may resume again instead. A step that does
+    // neither is a fault answered with code 4, and an exception from a step is answered as from a handler. REQUIRES: on
+    // the request queue.
     void resumeLater(std::function<void()> step);
 
     const std::shared_ptr<BXDZemClient>& client() const { return client_; }

@@ -35,6 +35,11 @@ constexpr size_t kDescriptorsKeptBack = 128;
 // Each connection holds its socket and a pidfd of its peer (which the peer's grants share rather than copy).
 constexpr size_t kDescriptorsPerConnection = 2;
 
+// How far below the request thread the steps of large discoveries run while a request waits for one of them to end
+// (otherwise they run only on a CPU nothing else wants), or always where bxd may not raise a thread it has made
+// idle-scheduled. At 10 the kernel gives them about a tenth of a CPU that something of normal priority also wants.
+constexpr int kBulkStepsNiceIncrement = 10;
+
 // A paged "match" that kept the request queue longer than this at a time would defeat the point of its steps.
 constexpr size_t kLongestPageStepMicroseconds = 1'000'000;
 
@@ -133,6 +138,11 @@ int main(int argc, char** argv) {
     mallopt(M_TRIM_THRESHOLD, kFreeMemoryKeptBytes);
     const ZemListener::Limits limits = connectionLimits();
     EventLoop loop(0);
+    // The later steps of a large discovery run on a thread of their own, still one at a time with everything else.
+    // The kernel then charges the CPU they take to that thread, not to the one that reads and answers requests,
+    // which so keeps the standing of a thread that mostly waits and gets the CPU as soon as a request comes; and
+    // idle-scheduled, a bulk discovery gives way to the other work of the machine, a host's point match first.
+    loop.startBulkThread(kBulkStepsNiceIncrement);
     std::unique_ptr<BXDServer> server = BXDServer::initForServiceDatabase(serviceName, databasePath, loop);
     if (!server) {
         log::ops().error("unable to construct server");

@@ -121,8 +121,8 @@ std::optional<uint64_t> pageSizeOf(const Value& entry) {
 // in steps of about BXDServer::pageStep() and the request queue serves the requests that came meanwhile between
 // two steps: a client paging through a large registry never makes another client's point match wait for more than
 // a step. A step ends after the candidate (or the form being encoded) in progress once its time is up; each costs
-// a trip through the event loop, about a microsecond. Lives on the request queue, kept alive by the step queued
-// next.
+// a hand-over to the loop's bulk thread, which runs the steps after the first, about a microsecond. Lives on the
+// request queue, kept alive by the step queued next.
 class PageWalk {
   public:
     PageWalk(std::shared_ptr<Transaction> transaction, Value rules, uint64_t flags, size_t wanted,

@@ -1,4 +1,7 @@
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
@@ -7,6 +10,8 @@
 #include <future>
 #include <memory>
 #include <mutex>
+#include <numeric>
+#include <set>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -243,6 +248,135 @@ TEST(SerialQueueTest, SyncReturnsRethrowsAndRefusesWhatWouldDeadlock) {
     EXPECT_NE(what.find("only thread"), std::string::npos) << what;
     narrow.stop();
     EXPECT_THROW(c.sync([] {}), InternalInconsistency);
+}
+
+// Guards the bulk thread: its blocks run as blocks of their queue, in order, on a thread of their own that runs at a
+// lower priority, and never beside any block of the loop, whatever queue and thread; a sync that would wait for the
+// loop from inside it is refused; the loop's end drops what is still waiting. A loop without one runs them itself.
+TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideItsBlocks) {
+    const int creatorNice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
+    auto sentinel = std::make_shared<int>(0);
+    std::atomic<bool> lateRan{false};
+    {
+        EventLoop loop(0);
+        loop.startBulkThread(10);
+        EXPECT_THROW(loop.startBulkThread(10), InternalInconsistency);
+        std::thread runner([&] { loop.runOnCurrentThread(); });
+        SerialQueue a("a", loop);
+        SerialQueue b("b", loop);
+
+        // Neither side starts a block while the other is inside one: each waits a while, inside, for the other.
+        auto meets = [](auto submitInside, auto submitOther) {
+            std::promise<void> inside;
+            std::atomic<bool> otherEntered{false};
+            std::promise<bool> sawOther;
+            std::promise<void> otherDone;
+            submitInside([&] {
+                inside.set_value();
+                auto until = std::chrono::steady_clock::now() + 100ms;
+                while (!otherEntered && std::chrono::steady_clock::now() < until) std::this_thread::yield();
+                sawOther.set_value(otherEntered.load());
+            });
+            inside.get_future().wait();
+            submitOther([&] {
+                otherEntered = true;
+                otherDone.set_value();
+            });
+            bool met = sawOther.get_future().get();
+            otherDone.get_future().wait();
+            return met;
+        };
+        EXPECT_FALSE(meets([&](auto block) { a.asyncInBulk(block); }, [&](auto block) { b.async(block); }));
+        EXPECT_FALSE(meets([&](auto block) { b.async(block); }, [&](auto block) { a.asyncInBulk(block); }));
+
+        constexpr int kRounds = 100;
+        Countdown done(2 * kRounds);
+        std::vector<int> bulkOrder;
+        std::set<std::thread::id> bulkThreads;
+        std::thread::id loopThread;
+        bool allCurrent = true;
+        int bulkNice = 0;
+        for (int i = 0; i < kRounds; ++i) {
+            b.async([&] {
+                loopThread = std::this_thread::get_id();
+                done.arrive();
+            });
+            a.asyncInBulk([&, i] {
+                bulkOrder.push_back(i);
+                bulkThreads.insert(std::this_thread::get_id());
+                allCurrent = allCurrent && a.isCurrent() && !b.isCurrent();
+                bulkNice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
+                done.arrive();
+            });
+        }
+        ASSERT_TRUE(done.wait());
+        std::vector<int> expected(kRounds);
+        std::iota(expected.begin(), expected.end(), 0);
+        EXPECT_EQ(bulkOrder, expected);
+        ASSERT_EQ(bulkThreads.size(), 1u);
+        EXPECT_NE(*bulkThreads.begin(), loopThread);
+        EXPECT_TRUE(allCurrent);
+        EXPECT_EQ(bulkNice, std::min(creatorNice + 10, 19));
+
+        // Idle-scheduled where it may be raised again (root may), and raised while a loop thread waits for it.
+        std::promise<pid_t> bulkTid;
+        std::promise<void> release, held;
+        auto released = release.get_future().share();
+        a.asyncInBulk([&, released] {
+            bulkTid.set_value(static_cast<pid_t>(gettid()));
+            held.set_value();
+            released.wait();
+        });
+        held.get_future().wait();
+        const pid_t tid = bulkTid.get_future().get();
+        const int policy = sched_getscheduler(tid);
+        if (geteuid() == 0) {
+            EXPECT_EQ(policy, SCHED_IDLE);
+        }
+        auto policyBecomes = [tid](int wanted) {
+            for (auto until = std::chrono::steady_clock::now() + kPatience; std::chrono::steady_clock::now() < until;
+                 std::this_thread::sleep_for(1ms)) {
+                if (sched_getscheduler(tid) == wanted) return true;
+            }
+            return false;
+        };
+        std::promise<void> waited;
+        b.async([&] { waited.set_value(); });
+        if (policy == SCHED_IDLE) {
+            EXPECT_TRUE(policyBecomes(SCHED_OTHER));
+            EXPECT_EQ(getpriority(PRIO_PROCESS, static_cast<id_t>(tid)), std::min(creatorNice + 10, 19));
+        }
+        release.set_value();
+        waited.get_future().wait();
+        EXPECT_TRUE(policyBecomes(policy));
+
+        std::promise<std::string> refused;
+        a.asyncInBulk([&] { refused.set_value(refusal([&] { b.sync([] {}); })); });
+        std::string what = refused.get_future().get();
+        EXPECT_NE(what.find("same event loop"), std::string::npos) << what;
+
+        // A block held up in bulk, and one behind it that must never run.
+        std::promise<void> gate, holding;
+        auto opened = gate.get_future().share();
+        a.asyncInBulk([opened, &holding] {
+            holding.set_value();
+            opened.wait();
+        });
+        holding.get_future().wait();
+        a.asyncInBulk([&lateRan, sentinel] { lateRan = true; });
+        loop.stop();
+        gate.set_value();
+        runner.join();
+    }
+    EXPECT_FALSE(lateRan.load());
+    EXPECT_EQ(sentinel.use_count(), 1);
+
+    EventLoop plain(1);
+    SerialQueue queue("plain", plain);
+    std::promise<std::thread::id> inBulk;
+    const std::thread::id loopThread = queue.sync([] { return std::this_thread::get_id(); });
+    queue.asyncInBulk([&] { inBulk.set_value(std::this_thread::get_id()); });
+    EXPECT_EQ(inBulk.get_future().get(), loopThread);
 }
 
 // ---- failures and lifetime ----------------------------------------------------------------------------------------

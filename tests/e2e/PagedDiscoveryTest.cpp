@@ -8,7 +8,10 @@
 #include <atomic>
 #include <chrono>
 #include <fstream>
+#include <optional>
 #include <set>
+#include <sstream>
+#include <string_view>
 #include <thread>
 
 #include "E2eSupport.h"
@@ -21,6 +24,27 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace test;
+
+// The nice value of the thread of process `pid` named `name`, from /proc; none when there is no such thread.
+std::optional<int> niceOfThread(pid_t pid, std::string_view name) {
+    const fs::path tasks = fs::path("/proc") / std::to_string(pid) / "task";
+    std::error_code ignored;
+    for (const fs::directory_entry& task : fs::directory_iterator(tasks, ignored)) {
+        std::ifstream comm(task.path() / "comm");
+        std::string threadName;
+        if (!std::getline(comm, threadName) || threadName != name) continue;
+        std::ifstream stat(task.path() / "stat");
+        std::string line;
+        std::getline(stat, line);
+        // The fields after the parenthesised name start with the state (the third); the nice value is the 19th.
+        std::istringstream fields(line.substr(line.rfind(')') + 2));
+        std::string field;
+        for (int i = 3; i < 19; ++i) fields >> field;
+        int nice;
+        if (fields >> nice) return nice;
+    }
+    return std::nullopt;
+}
 
 Value str(std::string_view s) { return Value::string(s); }
 
@@ -367,6 +391,10 @@ TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersWhatOneGoDoes) {
             flags ? std::vector<std::string>{"1", "3", "2"} : std::vector<std::string>{"3"};
         EXPECT_EQ(versions, expected);
     }
+    // The steps have a thread of their own, ten steps of nice value below the one that reads requests.
+    const std::optional<int> requestNice = niceOfThread(bxd_.pid(), "bxd");
+    ASSERT_TRUE(requestNice);
+    EXPECT_EQ(niceOfThread(bxd_.pid(), "bulk"), std::min(*requestNice + 10, 19));
 }
 
 // Guards the one state of an unpaged "match" made in steps: while another client sets the same annotation on every
