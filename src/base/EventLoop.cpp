@@ -119,6 +119,9 @@ void EventLoop::runOnCurrentThread() {
     if (runsOnCurrentThread()) throw InternalInconsistency("runOnCurrentThread called from inside the same loop");
     core_->runners.fetch_add(1);
     runLoop(*core_);
+    // Whoever ran the loop goes on to tear down what its blocks use: the block the bulk thread may still be in ends
+    // first.
+    if (core_->stopped() && core_->bulk) core_->bulk->join();
 }
 
 void EventLoop::stop() {

@@ -61,7 +61,8 @@ class EventLoop {
     // InternalInconsistency.
     void startBulkThread(int niceIncrement);
 
-    // Makes the calling thread one of the loop's threads until stop() is called (at once if it already was).
+    // Makes the calling thread one of the loop's threads until stop() is called (at once if it already was). When
+    // it returns, the bulk thread, if any, has left too.
     void runOnCurrentThread();
 
     // Makes every thread leave the loop soon; blocks already queued are not run. A stopped loop stays stopped.

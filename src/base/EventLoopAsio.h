@@ -84,7 +84,9 @@ class BulkThread {
     // Set by the thread before it runs anything: its id, and whether it is idle-scheduled.
     std::atomic<pid_t> tid_{0};
     std::atomic<bool> idle_{false};
+    // Whether a loop thread has raised it; changed with its policy, under `policyMutex_`.
     std::atomic<bool> raised_{false};
+    std::mutex policyMutex_;
 
     std::mutex mutex_;
     std::condition_variable ready_;

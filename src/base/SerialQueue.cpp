@@ -14,6 +14,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <condition_variable>
+#include <cstdlib>
 #include <exception>
 #include <fstream>
 #include <mutex>
@@ -79,7 +80,7 @@ bool mayRaiseTo(int nice) {
     std::string line;
     constexpr int kCapSysNice = 23;
     while (std::getline(status, line))
-        if (line.rfind("CapEff:", 0) == 0) return (std::stoull(line.substr(7), nullptr, 16) >> kCapSysNice) & 1;
+        if (line.rfind("CapEff:", 0) == 0) return (std::strtoull(line.c_str() + 7, nullptr, 16) >> kCapSysNice) & 1;
     return false;
 }
 
@@ -127,16 +128,19 @@ void BulkThread::enter() {
 }
 
 void BulkThread::raise() {
-    if (!idle_.load() || raised_.exchange(true)) return;
+    if (!idle_.load()) return;
+    std::lock_guard lock(policyMutex_);
     // sched_setscheduler keeps the thread's nice value.
     sched_param normal{};
-    if (sched_setscheduler(tid_.load(), SCHED_OTHER, &normal) != 0) raised_.store(false);
+    if (!raised_.load() && sched_setscheduler(tid_.load(), SCHED_OTHER, &normal) == 0) raised_.store(true);
 }
 
 void BulkThread::settle() {
-    if (!raised_.exchange(false)) return;
+    // A raise still under way is settled after the next block.
+    if (!raised_.load()) return;
+    std::lock_guard lock(policyMutex_);
     sched_param idle{};
-    sched_setscheduler(0, SCHED_IDLE, &idle);
+    if (sched_setscheduler(0, SCHED_IDLE, &idle) == 0) raised_.store(false);
 }
 
 void BulkThread::run(int niceIncrement) {

@@ -355,18 +355,23 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
         std::string what = refused.get_future().get();
         EXPECT_NE(what.find("same event loop"), std::string::npos) << what;
 
-        // A block held up in bulk, and one behind it that must never run.
+        // A block held up in bulk, and one behind it that must never run. Whoever ran the loop goes on only once
+        // the block in bulk has ended, since what comes next tears down what blocks use.
         std::promise<void> gate, holding;
         auto opened = gate.get_future().share();
-        a.asyncInBulk([opened, &holding] {
+        std::atomic<bool> heldEnded{false};
+        a.asyncInBulk([opened, &holding, &heldEnded] {
             holding.set_value();
             opened.wait();
+            std::this_thread::sleep_for(50ms);
+            heldEnded = true;
         });
         holding.get_future().wait();
         a.asyncInBulk([&lateRan, sentinel] { lateRan = true; });
         loop.stop();
         gate.set_value();
         runner.join();
+        EXPECT_TRUE(heldEnded.load());
     }
     EXPECT_FALSE(lateRan.load());
     EXPECT_EQ(sentinel.use_count(), 1);
