@@ -163,9 +163,10 @@ class PageWalk {
         if (!page->made_) {
             if (!page->encode(deadline)) return resume(std::move(page));
             page->made_ = true;
-            // A page that took steps is answered behind the requests that came during its last one: its client
-            // then spends a millisecond or so reading it, and woken first it would hold the CPU that the client of
-            // a point match answered just after is woken onto, for a whole time slice.
+            // A page that took steps is answered in a step of its own, so that requests that came during its last
+            // one (the request thread waiting for the loop) go first: its client then spends a millisecond or so
+            // reading it, and woken first it would hold the CPU that the client of a point match answered just
+            // after is woken onto, for a whole time slice.
             if (page->steps_ > 1) return resume(std::move(page));
         }
         page->answer();
