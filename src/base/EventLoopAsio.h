@@ -71,6 +71,8 @@ class BulkThread {
     // Takes and gives back the exclusion, on any thread.
     void enter();
     void leave() { exclusion_.unlock(); }
+    // Whether a loop thread waits for the exclusion now.
+    bool waitedFor() const { return loopWaiting_.load(std::memory_order_relaxed) > 0; }
 
   private:
     void run(int niceIncrement);

@@ -222,6 +222,10 @@ void SerialQueue::asyncInBulk(std::function<void()> block) const {
     state_->core->bulk->submit(state_, std::move(block));
 }
 
+bool SerialQueue::bulkBlockIsWaitedFor() {
+    return detail::tlsOnBulkThread && tlsExclusion != nullptr && tlsExclusion->waitedFor();
+}
+
 void SerialQueue::asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
     if (state_->core->closed()) return;
     auto timer = std::make_shared<asio::steady_timer>(*state_->core, delay);

@@ -57,6 +57,11 @@ class SerialQueue {
     // that reads and answers requests keeps the standing of a thread that mostly waits.
     void asyncInBulk(std::function<void()> block) const;
 
+    // Whether the calling block runs in bulk while a thread of its loop waits to run a block of its own. Long work
+    // asks between two pieces and, when so, queues the rest and returns: the waiting block then runs after one
+    // piece rather than after the whole step. False anywhere but in a bulk block.
+    static bool bulkBlockIsWaitedFor();
+
     // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
     void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
 

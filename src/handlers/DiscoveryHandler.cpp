@@ -31,6 +31,7 @@
 #include <variant>
 #include <vector>
 
+#include "base/SerialQueue.h"
 #include "bexil/Protocol.h"
 #include "daemon/BXDServer.h"
 #include "daemon/BXDZemClient.h"
@@ -72,6 +73,13 @@ constexpr size_t kOneStepCandidates = 256;
 constexpr unsigned kMaxRestarts = 2;
 // The most bytes an array's header takes: its tag and a count of up to 64 bits.
 constexpr size_t kMaxArrayHeaderBytes = 11;
+
+// Whether a step that has done some of its work ends now: its time is up or, on the bulk thread, a request waits for
+// it. A step that may not end early (one made in one go) has no deadline.
+bool stepIsOver(std::chrono::steady_clock::time_point deadline) {
+    if (deadline == std::chrono::steady_clock::time_point::max()) return false;
+    return SerialQueue::bulkBlockIsWaitedFor() || std::chrono::steady_clock::now() > deadline;
+}
 
 // Exports the candidates that pass the filter and lets them compete.
 void offerAdmitted(const BXDatabase::PlugInSet& candidates, size_t from, size_t to, const CandidateFilter& filter,
@@ -120,9 +128,9 @@ std::optional<uint64_t> pageSizeOf(const Value& entry) {
 // against, then the page's forms as they are encoded. The daemon serves one request at a time, so a page is made
 // in steps of about BXDServer::pageStep() and the request queue serves the requests that came meanwhile between
 // two steps: a client paging through a large registry never makes another client's point match wait for more than
-// a step. A step ends after the candidate (or the form being encoded) in progress once its time is up; each costs
-// a hand-over to the loop's bulk thread, which runs the steps after the first, about a microsecond. Lives on the
-// request queue, kept alive by the step queued next.
+// a step. A step ends after the candidate (or the form being encoded) in progress once its time is up, or sooner on
+// the loop's bulk thread, which runs the steps after the first, when a request waits for it; each step costs a
+// hand-over to that thread, about a microsecond. Lives on the request queue, kept alive by the step queued next.
 class PageWalk {
   public:
     PageWalk(std::shared_ptr<Transaction> transaction, Value rules, uint64_t flags, size_t wanted,
@@ -182,6 +190,7 @@ class PageWalk {
     // candidates; the stretch it was in and the identifier it was offering carry over to the next step, unless
     // something changed in between, in which case the next step reads them again.
     bool walk(std::chrono::steady_clock::time_point deadline) {
+        bool offered = false;
         if (slice_ && database_.changeFeed().current() != sliceGeneration_) {
             slice_.reset();
             group_ = AcceptedForms(flags_);
@@ -200,8 +209,9 @@ class PageWalk {
                     slice_.reset();
                 }
                 if (accepted_.count() >= wanted_ || walked_ >= kMaxPageWalk) return true;
-                // A stretch is read at the start of a step rather than at the end of one that has taken its time.
-                if (std::chrono::steady_clock::now() > deadline) return false;
+                // A stretch is read at the start of a step rather than at the end of one that has taken its time
+                // (or that a request waits for).
+                if (offered ? stepIsOver(deadline) : std::chrono::steady_clock::now() > deadline) return false;
                 size_t stretch = std::clamp<size_t>(wanted_ - accepted_.count(), 1, kWalkStretch);
                 sliceGeneration_ = database_.changeFeed().current();
                 slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
@@ -222,7 +232,8 @@ class PageWalk {
             }
             offerAdmitted(slice_->plugIns, at_, at_ + 1, filter_, group_, database_);
             ++at_;
-            if (std::chrono::steady_clock::now() > deadline) return false;
+            offered = true;
+            if (stepIsOver(deadline)) return false;
         }
     }
 
@@ -270,7 +281,7 @@ class PageWalk {
                 return true;
             }
             ++encoded_;
-            if (std::chrono::steady_clock::now() > deadline) return false;
+            if (stepIsOver(deadline)) return false;
         }
     }
 
@@ -353,11 +364,12 @@ class PageWalk {
 
 // An unpaged "match" on its way. Its reply must be what one go would answer at one moment: every candidate in
 // registration order, competing with all the others, so unlike a page it cannot end early. It is still made in steps
-// of BXDServer::pageStep(), reading the registry a stretch at a time and serving the requests that came meanwhile
-// between two steps. Whatever changed between two steps (a commit to the registry, or any change a client observes
-// through "match": annotations, holds, exclusions) starts it again from the first stretch, so that its reply is one
-// state; after kMaxRestarts it is made in one go. A match whose candidates come in one short stretch (a point match,
-// most often) is made in one step whatever its time. Lives on the request queue, kept alive by the step queued next.
+// of BXDServer::pageStep() (ended early on the bulk thread when a request waits, as a page's are), reading the
+// registry a stretch at a time and serving the requests that came meanwhile between two steps. Whatever changed between
+// two steps (a commit to the registry, or any change a client observes through "match": annotations, holds, exclusions)
+// starts it again from the first stretch, so that its reply is one state; after kMaxRestarts it is made in one go. A
+// match whose candidates come in one short stretch (a point match, most often) is made in one step whatever its time.
+// Lives on the request queue, kept alive by the step queued next.
 class WholeMatch {
   public:
     WholeMatch(std::shared_ptr<Transaction> transaction, Value rules, uint64_t flags)
@@ -486,6 +498,7 @@ class WholeMatch {
         const bool oneGo = deadline == std::chrono::steady_clock::time_point::max() || unversionable_;
         // The stretches read so far are one state of the registry as long as nothing was committed since the version
         // was read: looked at once before a step ends, which covers every stretch the step read.
+        bool offered = false;
         auto endOfStep = [&](Walked outcome) {
             if (!attempt.unchecked) return outcome;
             attempt.unchecked = false;
@@ -499,7 +512,8 @@ class WholeMatch {
                     return outcome;
                 }
                 if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
-                if (attempt.stretch && std::chrono::steady_clock::now() > deadline) return endOfStep(Walked::Paused);
+                if (attempt.stretch && (offered ? stepIsOver(deadline) : std::chrono::steady_clock::now() > deadline))
+                    return endOfStep(Walked::Paused);
                 const int64_t after = attempt.stretch ? attempt.stretch->last : 0;
                 attempt.stretch =
                     database_.findPlugInsAfterRegistration(rules_, after, oneGo ? SIZE_MAX : kWalkStretch);
@@ -518,7 +532,8 @@ class WholeMatch {
             offerAdmitted(attempt.stretch->plugIns, attempt.at, attempt.at + 1, attempt.filter, attempt.accepted,
                           database_);
             ++attempt.at;
-            if (attempt.stepped && std::chrono::steady_clock::now() > deadline) return endOfStep(Walked::Paused);
+            offered = true;
+            if (attempt.stepped && stepIsOver(deadline)) return endOfStep(Walked::Paused);
         }
     }
 
@@ -558,7 +573,7 @@ class WholeMatch {
             std::optional<AcceptedForms::EncodedForm> form = accepted.takeEncodedAt(nextSlot_++);
             if (!form) continue;
             if ((failure_ = AcceptedForms::appendForm(*form, payload_))) return true;
-            if (std::chrono::steady_clock::now() > deadline) return false;
+            if (stepIsOver(deadline)) return false;
         }
         if (othersWritten_ < others_.count()) {
             payload_.insert(payload_.end(),

@@ -251,8 +251,9 @@ TEST(SerialQueueTest, SyncReturnsRethrowsAndRefusesWhatWouldDeadlock) {
 }
 
 // Guards the bulk thread: its blocks run as blocks of their queue, in order, on a thread of their own that runs at a
-// lower priority, and never beside any block of the loop, whatever queue and thread; a sync that would wait for the
-// loop from inside it is refused; the loop's end drops what is still waiting. A loop without one runs them itself.
+// lower priority, and never beside any block of the loop, whatever queue and thread; such a block learns when a loop
+// thread waits for it, and nothing else ever thinks so; a sync that would wait for the loop from inside it is
+// refused; the loop's end drops what is still waiting. A loop without one runs them itself.
 TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideItsBlocks) {
     const int creatorNice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
     auto sentinel = std::make_shared<int>(0);
@@ -322,10 +323,16 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
         std::promise<pid_t> bulkTid;
         std::promise<void> release, held;
         auto released = release.get_future().share();
+        bool waitedForAtFirst = true;
+        bool waitedForOnceWaited = false;
         a.asyncInBulk([&, released] {
+            waitedForAtFirst = SerialQueue::bulkBlockIsWaitedFor();
             bulkTid.set_value(static_cast<pid_t>(gettid()));
             held.set_value();
             released.wait();
+            for (auto until = std::chrono::steady_clock::now() + kPatience;
+                 !waitedForOnceWaited && std::chrono::steady_clock::now() < until; std::this_thread::sleep_for(1ms))
+                waitedForOnceWaited = SerialQueue::bulkBlockIsWaitedFor();
         });
         held.get_future().wait();
         const pid_t tid = bulkTid.get_future().get();
@@ -341,7 +348,11 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
             return false;
         };
         std::promise<void> waited;
-        b.async([&] { waited.set_value(); });
+        bool waitedForInLoopBlock = true;
+        b.async([&] {
+            waitedForInLoopBlock = SerialQueue::bulkBlockIsWaitedFor();
+            waited.set_value();
+        });
         if (policy == SCHED_IDLE) {
             EXPECT_TRUE(policyBecomes(SCHED_OTHER));
             EXPECT_EQ(getpriority(PRIO_PROCESS, static_cast<id_t>(tid)), std::min(creatorNice + 10, 19));
@@ -349,6 +360,10 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
         release.set_value();
         waited.get_future().wait();
         EXPECT_TRUE(policyBecomes(policy));
+        EXPECT_FALSE(waitedForAtFirst);
+        EXPECT_TRUE(waitedForOnceWaited);
+        EXPECT_FALSE(waitedForInLoopBlock);
+        EXPECT_FALSE(SerialQueue::bulkBlockIsWaitedFor());
 
         std::promise<std::string> refused;
         a.asyncInBulk([&] { refused.set_value(refusal([&] { b.sync([] {}); })); });
@@ -380,7 +395,10 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
     SerialQueue queue("plain", plain);
     std::promise<std::thread::id> inBulk;
     const std::thread::id loopThread = queue.sync([] { return std::this_thread::get_id(); });
-    queue.asyncInBulk([&] { inBulk.set_value(std::this_thread::get_id()); });
+    queue.asyncInBulk([&] {
+        EXPECT_FALSE(SerialQueue::bulkBlockIsWaitedFor());
+        inBulk.set_value(std::this_thread::get_id());
+    });
     EXPECT_EQ(inBulk.get_future().get(), loopThread);
 }
 
