@@ -97,8 +97,7 @@ void ZemSocketConnection::watchStall() {
                 log::ops().error(
                     "peer %d has not read its replies for %lld s (%zu bytes queued, "
                     "kStalledConnectionTimeout): disconnecting",
-                    static_cast<int>(self->pid_), static_cast<long long>(timeout.count()),
-                    self->outgoing_.size() + self->writing_.size());
+                    static_cast<int>(self->pid_), static_cast<long long>(timeout.count()), self->queuedBytesHere());
                 self->close(ZemError::Kind::ConnectionInvalid);
                 return;
             }
@@ -529,14 +528,13 @@ bool ZemSocketConnection::connectClient() {
 void ZemSocketConnection::readMore() {
     for (int turn = 0; turn < kReadsPerTurn; ++turn) {
         if (suspended_ || reading_ || state_ != State::Open) return;
-        if (side_ == Side::Peer &&
-            outgoing_.size() + writing_.size() >= readPauseBytes.load(std::memory_order_relaxed)) {
+        if (side_ == Side::Peer && queuedBytesHere() >= readPauseBytes.load(std::memory_order_relaxed)) {
             // The peer does not read what it asked for: its next requests wait until it does.
             if (!readPaused_)
                 log::ops().notice(
                     "peer %d has %zu bytes of replies unread, over the limit (kQueuedReplyBytes): its "
                     "requests wait until it reads",
-                    static_cast<int>(pid_), outgoing_.size() + writing_.size());
+                    static_cast<int>(pid_), queuedBytesHere());
             readPaused_ = true;
             watchStall();
             return;
@@ -744,7 +742,7 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
     }
     if (pending) pendingReplies_.emplace(serial, std::move(*pending));
     if (!descriptors.empty()) attachments_.push_back(Attachment{start, std::move(descriptors)});
-    size_t queued = outgoing_.size() + writing_.size();
+    size_t queued = queuedBytesHere();
     if (queued > kMaxQueuedBytes) {
         log::ops().error("peer %d has %zu bytes queued, over the limit of %zu (kMaxQueuedBytes): disconnecting",
                          static_cast<int>(pid_), queued, kMaxQueuedBytes);
@@ -756,7 +754,7 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
 
 void ZemSocketConnection::writeMore() {
     writeMoreNow();
-    buffered_.store(outgoing_.size() + writing_.size());
+    buffered_.store(queuedBytesHere());
 }
 
 void ZemSocketConnection::writeMoreNow() {
@@ -769,18 +767,18 @@ void ZemSocketConnection::writeMoreNow() {
         close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
         return;
     }
-    if (sent > 0) {
-        if (static_cast<size_t>(sent) == outgoing_.size()) {
-            outgoing_.clear();
-            return;
-        }
-        outgoing_.erase(outgoing_.begin(), outgoing_.begin() + sent);
+    if (sent > 0 && static_cast<size_t>(sent) == outgoing_.size()) {
+        outgoing_.clear();
+        return;
     }
+    // The write goes on from where the send stopped: moving the rest to the front first would copy most of a large
+    // reply once more.
     writing_.swap(outgoing_);
     outgoing_.clear();
+    writtenAlready_ = sent > 0 ? static_cast<size_t>(sent) : 0;
     writeInFlight_ = true;
     asio::async_write(
-        socket_, asio::buffer(writing_),
+        socket_, asio::buffer(writing_) + writtenAlready_,
         detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error, size_t bytes) {
             self->onWritten(error, bytes);
         }));
@@ -852,6 +850,7 @@ void ZemSocketConnection::dropSent(size_t bytes) {
 void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
     writeInFlight_ = false;
     writing_.clear();
+    writtenAlready_ = 0;
     buffered_.store(outgoing_.size());
     if (state_ != State::Open) return;
     if (error) {
@@ -863,8 +862,7 @@ void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
 }
 
 void ZemSocketConnection::resumeReadingIfDrained() {
-    if (!readPaused_ || state_ != State::Open ||
-        outgoing_.size() + writing_.size() >= readPauseBytes.load(std::memory_order_relaxed))
+    if (!readPaused_ || state_ != State::Open || queuedBytesHere() >= readPauseBytes.load(std::memory_order_relaxed))
         return;
     readPaused_ = false;
     watchStall();
@@ -910,7 +908,7 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     stallTimer_.cancel();
     reader_ = ZemFrameReader();
     outgoing_.clear();
-    buffered_.store(writing_.size());
+    buffered_.store(writing_.size() - writtenAlready_);
     attachments_.clear();
     receivedFds_.clear();
     heldFrames_.clear();

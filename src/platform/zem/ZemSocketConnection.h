@@ -163,6 +163,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // enqueueFrame once the queue owns the socket.
     void enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyTo, const Payload& payload,
                            std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors);
+    // The bytes of replies and requests this side still has to write: outgoing_ and what the write in flight has
+    // not written. REQUIRES: on the connection's queue.
+    size_t queuedBytesHere() const { return outgoing_.size() + writing_.size() - writtenAlready_; }
     // Writes what the socket takes now and notes what remains for queuedBytes.
     void writeMore();
     void writeMoreNow();
@@ -202,10 +205,11 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     std::vector<uint8_t> readBuffer_;
     ZemBytes outgoing_;                   // frames waiting for the write in flight to finish
     ZemBytes writing_;                    // the frames of the write in flight
+    size_t writtenAlready_ = 0;           // bytes of writing_ the socket took before the write was started
     std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
     std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
-    // outgoing_ and writing_ together, for queuedBytes on other threads; and the encoded size of the messages
+    // queuedBytesHere(), for queuedBytes on other threads; and the encoded size of the messages
     // handed to send() whose frames are not in outgoing_ yet.
     std::atomic<size_t> buffered_{0};
     std::atomic<size_t> postedBytes_{0};
