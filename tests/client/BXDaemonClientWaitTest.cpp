@@ -19,6 +19,7 @@
 #include "client/BXDaemonClient.h"
 #include "client/BXDaemonClientSync.h"
 #include "platform/log/CaptureSink.h"
+#include "platform/zem/ZemCodec.h"
 #include "platform/zem/ZemListener.h"
 
 namespace bexil {
@@ -28,10 +29,11 @@ using Reply = BXDaemonClient::Reply;
 using namespace std::chrono_literals;
 
 // Flags that make the service misbehave; any other request is answered at once with {"echo": request}.
-constexpr uint64_t kAnswerLate = 1000;  // answers after lateBy()
-constexpr uint64_t kHangUp = 1001;      // closes the connection instead of answering
-constexpr uint64_t kChatty = 1002;      // sends a one-way message, then the answer
-constexpr uint64_t kNoteLater = 1003;   // answers, then sends a one-way message
+constexpr uint64_t kAnswerLate = 1000;   // answers after lateBy()
+constexpr uint64_t kHangUp = 1001;       // closes the connection instead of answering
+constexpr uint64_t kChatty = 1002;       // sends a one-way message, then the answer
+constexpr uint64_t kNoteLater = 1003;    // answers, then sends a one-way message
+constexpr uint64_t kEncodedEcho = 1004;  // answers with the echo encoded already, then sends a one-way message
 
 class EchoService {
   public:
@@ -61,6 +63,14 @@ class EchoService {
                     peer->send(Value::dictionary({{"note", Value::string("unasked")}}));
                     return queue_.asyncAfter(20ms,
                                              [peer, request = *message, answer] { peer->sendReply(request, answer); });
+                }
+                if (behaviour == kEncodedEcho) {
+                    // A large encoded reply leaves from its own buffer; the message queued behind it while the
+                    // socket is still taking it must follow it whole.
+                    Result<std::vector<uint8_t>> encoded = ZemCodec::encode(answer);
+                    ASSERT_TRUE(encoded.ok());
+                    peer->sendEncodedReply(*message, std::move(*encoded));
+                    return peer->send(Value::dictionary({{"note", Value::string("behind the encoded reply")}}));
                 }
                 peer->sendReply(*message, answer);
                 if (behaviour == kNoteLater) peer->send(Value::dictionary({{"note", Value::string("afterwards")}}));
@@ -255,17 +265,19 @@ TEST_F(BXDaemonClientWaitTest, AConnectionKeptFromParkingDeliversMessagesBetween
 
 // Guards large messages both ways, at the sizes where reading changes its way (one read, the read chunk, the
 // reader's first reservation, many reads): what comes back is byte for byte what went out, whether the client's
-// queue or the waiting thread read it.
+// queue or the waiting thread read it, and whether the service's reply was encoded into its outgoing buffer or left
+// from a buffer of its own (encoded already, then followed by a message that must not cut into it).
 TEST_F(BXDaemonClientWaitTest, LargeRequestsAndRepliesCrossIntact) {
+    log::CaptureSink capture;
     BXDaemonClient client;
     for (size_t size : {size_t{0}, size_t{1}, size_t{65536 - 60}, size_t{65536}, size_t{65537}, size_t{131072 + 3},
-                        size_t{1 << 20}, size_t{(1 << 20) + 13}}) {
+                        size_t{1 << 20}, size_t{(1 << 20) + 13}, size_t{4 << 20}}) {
         std::vector<uint8_t> blob(size);
         for (size_t i = 0; i < size; ++i) blob[i] = static_cast<uint8_t>((i * 131 + size) >> 3);
         Value rules = Value::dictionary({{"blob", Value::data(blob)}});
-        for (int twice = 0; twice < 2; ++twice) {
-            auto reply =
-                sendAndWait([&](auto handler) { client.matchPlugInsFlagsReply(rules, 9, std::move(handler)); }, 10s);
+        for (uint64_t flags : {uint64_t{9}, uint64_t{9}, kEncodedEcho, kEncodedEcho}) {
+            auto reply = sendAndWait(
+                [&](auto handler) { client.matchPlugInsFlagsReply(rules, flags, std::move(handler)); }, 10s);
             ASSERT_TRUE(reply && std::holds_alternative<Value>(*reply)) << size;
             Value back = std::get<Value>(*reply).get("echo").get("rules").get("blob");
             ASSERT_TRUE(back.isData()) << size;
@@ -273,6 +285,8 @@ TEST_F(BXDaemonClientWaitTest, LargeRequestsAndRepliesCrossIntact) {
             EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), blob.begin(), blob.end())) << size;
         }
     }
+    EXPECT_EQ(echoed(bulk(client, 2)), 2u);
+    EXPECT_TRUE(capture.contains("behind the encoded reply"));
 }
 
 // Guards a large request that a waiting thread sends straight from the request's own bytes and cannot finish before

@@ -164,25 +164,47 @@ std::optional<Error> ZemFrame::encodeReferencing(ZemFrameKind kind, uint64_t ser
         });
 }
 
-template <class Bytes>
-std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
-                                             std::span<const uint8_t> payload, Bytes& out, uint8_t descriptorCount) {
+namespace {
+
+// The header of a frame around an encoded payload, or why there can be none.
+Result<ZemFrameHeader> headerForEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                        std::span<const uint8_t> payload, uint8_t descriptorCount) {
     if (payload.empty() || payload[0] != static_cast<uint8_t>(ZemTag::Dictionary))
         return zemError(
             ZemErrorCode::NotDictionary,
             fmt::format("a {} carries a dictionary; this payload is something else", zemFrameKindName(kind)));
     ZemFrameHeader header{kind, serial, inReplyTo, 0, descriptorCount};
-    if (descriptorCount > kMaxDescriptorsPerFrame)
+    if (descriptorCount > ZemFrame::kMaxDescriptorsPerFrame)
         return zemError(ZemErrorCode::BadHeader, fmt::format("a frame carries at most {} descriptors, not {}",
-                                                             kMaxDescriptorsPerFrame, descriptorCount));
-    if (auto error = checkHeader(header)) return error;
-    if (payload.size() > kMaxPayloadBytes)
-        return zemError(ZemErrorCode::FrameTooLarge, fmt::format("frame of {} bytes exceeds limit kMaxFrameBytes ({})",
-                                                                 kHeaderBytes + payload.size(), kMaxFrameBytes));
+                                                             ZemFrame::kMaxDescriptorsPerFrame, descriptorCount));
+    if (auto error = ZemFrame::checkHeader(header)) return *error;
+    if (payload.size() > ZemFrame::kMaxPayloadBytes)
+        return zemError(ZemErrorCode::FrameTooLarge,
+                        fmt::format("frame of {} bytes exceeds limit kMaxFrameBytes ({})",
+                                    ZemFrame::kHeaderBytes + payload.size(), ZemFrame::kMaxFrameBytes));
     header.payloadLength = static_cast<uint32_t>(payload.size());
+    return header;
+}
+
+}  // namespace
+
+std::optional<Error> ZemFrame::encodeEncodedHeader(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                                   std::span<const uint8_t> payload,
+                                                   std::span<uint8_t, kHeaderBytes> out) {
+    Result<ZemFrameHeader> header = headerForEncoded(kind, serial, inReplyTo, payload, 0);
+    if (!header) return header.error();
+    encodeHeader(*header, out);
+    return std::nullopt;
+}
+
+template <class Bytes>
+std::optional<Error> ZemFrame::encodeEncoded(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                             std::span<const uint8_t> payload, Bytes& out, uint8_t descriptorCount) {
+    Result<ZemFrameHeader> header = headerForEncoded(kind, serial, inReplyTo, payload, descriptorCount);
+    if (!header) return header.error();
     size_t start = out.size();
     out.resize(start + kHeaderBytes + payload.size());
-    encodeHeader(header, std::span<uint8_t, kHeaderBytes>(out.data() + start, kHeaderBytes));
+    encodeHeader(*header, std::span<uint8_t, kHeaderBytes>(out.data() + start, kHeaderBytes));
     std::memcpy(out.data() + start + kHeaderBytes, payload.data(), payload.size());
     return std::nullopt;
 }

@@ -95,6 +95,12 @@ class ZemFrame {
                                               std::span<const uint8_t> payload, Bytes& out,
                                               uint8_t descriptorCount = 0);
 
+    // The header alone of the frame that encodeEncoded() would append, for a sender that writes `payload` from
+    // where it is; the same checks, the same errors.
+    static std::optional<Error> encodeEncodedHeader(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo,
+                                                    std::span<const uint8_t> payload,
+                                                    std::span<uint8_t, kHeaderBytes> out);
+
   private:
     // The checks and the header around a payload that `encodePayload()` appends to `out`, of which `elsewhere()`
     // bytes are not in `out`.

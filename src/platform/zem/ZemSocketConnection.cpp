@@ -5,6 +5,7 @@
 #include <sys/uio.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cinttypes>
 #include <climits>
@@ -21,11 +22,14 @@
 // read is issued, so a peer that floods us is throttled by our own pace. Writes are double-buffered: frames are
 // encoded straight into `outgoing_` and sent at once with a non-blocking send; what the socket does not take is
 // swapped into `writing_` for an asynchronous write, and replies produced meanwhile gather in `outgoing_` to leave
-// together when it completes. Replies are handed over with SerialQueue::dispatch, so a request answered on the
-// loop's thread is written from inside the request's own handling, possibly while this connection is still
-// delivering the request further out on the stack: every member function is safe to enter that way. The queued-bytes
-// limit bounds what a peer that stops reading can cost us. Every pending operation holds a strong reference, so the
-// object lives exactly as long as it has I/O in flight or an owner outside.
+// together when it completes. A large reply encoded already (a discovery's) that nothing queued precedes is not
+// copied: its header goes in `outgoing_` and the payload leaves from its own buffer, which the write in flight keeps
+// (megabytes copied into fresh memory would hold the loop's thread for tens of milliseconds). Replies are handed over
+// with SerialQueue::dispatch, so a request answered on the loop's thread is written from inside the request's own
+// handling, possibly while this connection is still delivering the request further out on the stack: every member
+// function is safe to enter that way. The queued-bytes limit bounds what a peer that stops reading can cost us. Every
+// pending operation holds a strong reference, so the object lives exactly as long as it has I/O in flight or an owner
+// outside.
 //
 // A client connection may also be driven by the thread that waits for a reply. Handing every request to the loop's
 // thread and every reply back costs two wake-ups per round trip, more than the rest of a small request. So once a
@@ -732,6 +736,10 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
         return;
     }
     const auto descriptorCount = static_cast<uint8_t>(descriptors.size());
+    if (descriptors.empty() && sendInPlace(kind, serial, inReplyTo, payload, pending)) {
+        buffered_.store(queuedBytesHere());
+        return;
+    }
     if (std::optional<Error> error =
             payload.encoded
                 ? ZemFrame::encodeEncoded(kind, serial, inReplyTo, *payload.encoded, outgoing_, descriptorCount)
@@ -750,6 +758,52 @@ void ZemSocketConnection::enqueueOwnedFrame(ZemFrameKind kind, uint64_t inReplyT
         return;
     }
     writeMore();
+}
+
+bool ZemSocketConnection::sendInPlace(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Payload& payload,
+                                      std::optional<PendingReply>& pending) {
+    if (!payload.encoded || payload.encoded->size() < kInPlaceMinimum || !outgoing_.empty() || writeInFlight_ ||
+        !attachments_.empty() || state_ != State::Open)
+        return false;
+    const std::vector<uint8_t>& bytes = *payload.encoded;
+    outgoing_.resize(ZemFrame::kHeaderBytes);
+    if (ZemFrame::encodeEncodedHeader(
+            kind, serial, inReplyTo, bytes,
+            std::span<uint8_t, ZemFrame::kHeaderBytes>(outgoing_.data(), ZemFrame::kHeaderBytes))) {
+        // Copied like any other frame, it meets the same fault, which is reported there.
+        outgoing_.clear();
+        return false;
+    }
+    if (pending) pendingReplies_.emplace(serial, std::move(*pending));
+    iovec pieces[2] = {{outgoing_.data(), outgoing_.size()}, {const_cast<uint8_t*>(bytes.data()), bytes.size()}};
+    msghdr gathered{};
+    gathered.msg_iov = pieces;
+    gathered.msg_iovlen = 2;
+    ssize_t sent = ::sendmsg(socket_.native_handle(), &gathered, MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (sent < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
+        outgoing_.clear();
+        close(side_ == Side::Client ? ZemError::Kind::ConnectionInterrupted : ZemError::Kind::ConnectionInvalid);
+        return true;
+    }
+    const size_t taken = sent > 0 ? static_cast<size_t>(sent) : 0;
+    if (taken == outgoing_.size() + bytes.size()) {
+        outgoing_.clear();
+        return true;
+    }
+    writing_.swap(outgoing_);
+    outgoing_.clear();
+    writtenAlready_ = std::min(taken, writing_.size());
+    writingPayload_ = payload.encoded;
+    payloadWrittenAlready_ = taken - writtenAlready_;
+    writeInFlight_ = true;
+    const std::array<asio::const_buffer, 2> rest{asio::buffer(writing_) + writtenAlready_,
+                                                 asio::buffer(bytes) + payloadWrittenAlready_};
+    asio::async_write(
+        socket_, rest,
+        detail::bindToQueue(queue_, [self = shared_from_this()](const asio::error_code& error, size_t written) {
+            self->onWritten(error, written);
+        }));
+    return true;
 }
 
 void ZemSocketConnection::writeMore() {
@@ -851,6 +905,8 @@ void ZemSocketConnection::onWritten(const asio::error_code& error, size_t) {
     writeInFlight_ = false;
     writing_.clear();
     writtenAlready_ = 0;
+    writingPayload_.reset();
+    payloadWrittenAlready_ = 0;
     buffered_.store(outgoing_.size());
     if (state_ != State::Open) return;
     if (error) {
@@ -908,7 +964,7 @@ void ZemSocketConnection::close(ZemError::Kind kind) {
     stallTimer_.cancel();
     reader_ = ZemFrameReader();
     outgoing_.clear();
-    buffered_.store(writing_.size() - writtenAlready_);
+    buffered_.store(queuedBytesHere());
     attachments_.clear();
     receivedFds_.clear();
     heldFrames_.clear();

@@ -35,6 +35,9 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     // Strings and data of at least this many bytes in a request that a waiting thread sends itself go to the socket
     // straight from the request (a gathering send), not copied into the outgoing buffer first.
     static constexpr size_t kGatherMinimum = 16 * 1024;
+    // Encoded payloads of at least this many bytes (a large discovery's reply) go to the socket from their own
+    // buffer when nothing is queued before them, instead of being copied into the outgoing buffer.
+    static constexpr size_t kInPlaceMinimum = 64 * 1024;
     // Reads tried at once before waiting for the socket to become readable: enough for a burst of pipelined
     // requests, few enough that one peer cannot keep the loop to itself.
     static constexpr int kReadsPerTurn = 4;
@@ -165,7 +168,15 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
                            std::optional<PendingReply> pending, std::vector<UniqueFd> descriptors);
     // The bytes of replies and requests this side still has to write: outgoing_ and what the write in flight has
     // not written. REQUIRES: on the connection's queue.
-    size_t queuedBytesHere() const { return outgoing_.size() + writing_.size() - writtenAlready_; }
+    size_t queuedBytesHere() const {
+        return outgoing_.size() + writing_.size() - writtenAlready_ +
+               (writingPayload_ ? writingPayload_->size() - payloadWrittenAlready_ : 0);
+    }
+    // Sends a frame whose large encoded payload nothing queued precedes from the payload's own buffer (its header
+    // goes in outgoing_); false, having done nothing, when it must be copied into outgoing_ instead.
+    // `pending`, when it is sent so, is taken before the send, which may fail it.
+    bool sendInPlace(ZemFrameKind kind, uint64_t serial, uint64_t inReplyTo, const Payload& payload,
+                     std::optional<PendingReply>& pending);
     // Writes what the socket takes now and notes what remains for queuedBytes.
     void writeMore();
     void writeMoreNow();
@@ -203,9 +214,12 @@ class ZemSocketConnection final : public ZemConnection, public std::enable_share
     bool reading_ = false;
     ZemFrameReader reader_;
     std::vector<uint8_t> readBuffer_;
-    ZemBytes outgoing_;                   // frames waiting for the write in flight to finish
-    ZemBytes writing_;                    // the frames of the write in flight
-    size_t writtenAlready_ = 0;           // bytes of writing_ the socket took before the write was started
+    ZemBytes outgoing_;          // frames waiting for the write in flight to finish
+    ZemBytes writing_;           // the frames of the write in flight
+    size_t writtenAlready_ = 0;  // bytes of writing_ the socket took before the write was started
+    // The payload written after writing_ by the write in flight (sendInPlace), and how much of it had gone before.
+    std::shared_ptr<const std::vector<uint8_t>> writingPayload_;
+    size_t payloadWrittenAlready_ = 0;
     std::deque<Attachment> attachments_;  // in the order of their offsets in outgoing_
     std::deque<UniqueFd> receivedFds_;    // received, not yet claimed by a frame
     bool writeInFlight_ = false;
