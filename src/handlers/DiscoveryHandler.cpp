@@ -74,11 +74,11 @@ constexpr unsigned kMaxRestarts = 2;
 // The most bytes an array's header takes: its tag and a count of up to 64 bits.
 constexpr size_t kMaxArrayHeaderBytes = 11;
 
-// Whether a step that has done some of its work ends now: its time is up or, on the bulk thread, a request waits for
-// it. A step that may not end early (one made in one go) has no deadline.
-bool stepIsOver(std::chrono::steady_clock::time_point deadline) {
+// Whether a step ends now: its time is up or, once it has done some of its work (`worked`), a request waits for it
+// on the bulk thread. A step that may not end early (one made in one go) has no deadline.
+bool stepIsOver(std::chrono::steady_clock::time_point deadline, bool worked = true) {
     if (deadline == std::chrono::steady_clock::time_point::max()) return false;
-    return SerialQueue::bulkBlockIsWaitedFor() || std::chrono::steady_clock::now() > deadline;
+    return (worked && SerialQueue::bulkBlockIsWaitedFor()) || std::chrono::steady_clock::now() > deadline;
 }
 
 // Exports the candidates that pass the filter and lets them compete.
@@ -211,7 +211,7 @@ class PageWalk {
                 if (accepted_.count() >= wanted_ || walked_ >= kMaxPageWalk) return true;
                 // A stretch is read at the start of a step rather than at the end of one that has taken its time
                 // (or that a request waits for).
-                if (offered ? stepIsOver(deadline) : std::chrono::steady_clock::now() > deadline) return false;
+                if (stepIsOver(deadline, offered)) return false;
                 size_t stretch = std::clamp<size_t>(wanted_ - accepted_.count(), 1, kWalkStretch);
                 sliceGeneration_ = database_.changeFeed().current();
                 slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
@@ -512,8 +512,7 @@ class WholeMatch {
                     return outcome;
                 }
                 if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
-                if (attempt.stretch && (offered ? stepIsOver(deadline) : std::chrono::steady_clock::now() > deadline))
-                    return endOfStep(Walked::Paused);
+                if (attempt.stretch && stepIsOver(deadline, offered)) return endOfStep(Walked::Paused);
                 const int64_t after = attempt.stretch ? attempt.stretch->last : 0;
                 attempt.stretch =
                     database_.findPlugInsAfterRegistration(rules_, after, oneGo ? SIZE_MAX : kWalkStretch);
