@@ -54,9 +54,9 @@ class EventLoop {
     // Gives the loop a bulk thread for SerialQueue::asyncInBulk: idle-scheduled where the process may raise it
     // back, and `niceIncrement` steps of nice value below the caller whenever it runs at normal scheduling. From
     // then on every block of the loop's queues takes the loop's exclusion, so blocks of different queues no longer
-    // overlap either, whichever thread runs them: the loop stays one logical thread. The bulk thread lets a loop
-    // thread that waits for the exclusion go first, and is raised to normal scheduling while one waits for its
-    // block to end.
+    // overlap either, whichever thread runs them: the loop stays one logical thread, but for the work a bulk block
+    // runs with the loop let go (SerialQueue::withLoopLetGo). The bulk thread lets a loop thread that waits for the
+    // exclusion go first, and is raised to normal scheduling while one waits for its block to end.
     // REQUIRES: no thread runs the loop yet (a loop made with no threads of its own); otherwise throws
     // InternalInconsistency.
     void startBulkThread(int niceIncrement);

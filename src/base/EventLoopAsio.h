@@ -45,8 +45,9 @@ struct SerialQueueState;
 
 // The second thread of a loop that has one (EventLoop::startBulkThread): it runs the blocks given to
 // SerialQueue::asyncInBulk, one at a time. Every block of the loop's queues takes the loop's exclusion, here, so no
-// two blocks ever overlap whichever thread runs them, and the loop's threads go first: after each of its blocks the
-// bulk thread waits for a loop thread that wants the exclusion to have taken it.
+// two blocks ever overlap whichever thread runs them (a bulk block gives it back only around work that is safe
+// beside them, SerialQueue::withLoopLetGo), and the loop's threads go first: after each of its blocks the bulk
+// thread waits for a loop thread that wants the exclusion to have taken it.
 //
 // Where it may be raised again, the thread is scheduled as idle: it runs on a CPU only when nothing of normal
 // priority wants that CPU, and the kernel counts a CPU that runs only it as free when it places a waking thread.

@@ -30,7 +30,7 @@ namespace {
 
 thread_local const detail::QueueFrame* tlsCurrentFrame = nullptr;
 // The bulk thread whose exclusion the calling thread holds, if any.
-thread_local const detail::BulkThread* tlsExclusion = nullptr;
+thread_local detail::BulkThread* tlsExclusion = nullptr;
 
 // How often the bulk thread gives the CPU away, at most, waiting for a loop thread it woke to take the exclusion;
 // past that it takes its turn again (the loop thread may be waiting for a CPU that the bulk thread is not on).
@@ -220,6 +220,19 @@ void SerialQueue::asyncInBulk(std::function<void()> block) const {
     if (state_->core->closed()) return;
     if (!state_->core->bulk) return asyncBehindReady(std::move(block));
     state_->core->bulk->submit(state_, std::move(block));
+}
+
+SerialQueue::LetGo::LetGo() {
+    if (!detail::tlsOnBulkThread || tlsExclusion == nullptr) return;
+    released_ = tlsExclusion;
+    tlsExclusion = nullptr;
+    released_->leave();
+}
+
+SerialQueue::LetGo::~LetGo() {
+    if (released_ == nullptr) return;
+    released_->enter();
+    tlsExclusion = released_;
 }
 
 bool SerialQueue::bulkBlockIsWaitedFor() {

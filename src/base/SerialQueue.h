@@ -19,6 +19,7 @@ namespace bexil {
 
 namespace detail {
 struct SerialQueueState;
+class BulkThread;
 }  // namespace detail
 
 class SerialQueue {
@@ -62,6 +63,17 @@ class SerialQueue {
     // piece rather than after the whole step. False anywhere but in a bulk block.
     static bool bulkBlockIsWaitedFor();
 
+    // Runs `work` and returns its result; in a bulk block, with the loop let go meanwhile: the loop's thread may run
+    // blocks of every queue, this one's included, while `work` runs, and the block holds the loop again once `work`
+    // returns. So `work` may touch only what is safe from any thread (the database's public operations are), and the
+    // caller must expect what those blocks changed meanwhile. Anywhere else it runs `work` as it is. For the slow
+    // reads of long work, which a request would otherwise wait for.
+    template <class F>
+    static std::invoke_result_t<F&> withLoopLetGo(F&& work) {
+        LetGo letGo;
+        return work();
+    }
+
     // Queues `block` once `delay` has passed; it then runs in order with the blocks submitted by then.
     void asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const;
 
@@ -90,6 +102,18 @@ class SerialQueue {
 
   private:
     friend struct detail::QueueInternals;
+
+    // Lets go of the loop for its lifetime, in a bulk block; does nothing elsewhere.
+    class LetGo {
+      public:
+        LetGo();
+        ~LetGo();
+        LetGo(const LetGo&) = delete;
+        LetGo& operator=(const LetGo&) = delete;
+
+      private:
+        detail::BulkThread* released_ = nullptr;
+    };
 
     void syncBlock(const std::function<void()>& block) const;
 

@@ -214,7 +214,15 @@ class PageWalk {
                 if (stepIsOver(deadline, offered)) return false;
                 size_t stretch = std::clamp<size_t>(wanted_ - accepted_.count(), 1, kWalkStretch);
                 sliceGeneration_ = database_.changeFeed().current();
-                slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
+                // The read touches only the database, so requests are served meanwhile. A change published
+                // during it is one between two steps: the stretch is read again, with the loop held this time so
+                // that the walk goes on however often the plug-ins change.
+                slice_ = SerialQueue::withLoopLetGo(
+                    [&] { return database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch); });
+                if (database_.changeFeed().current() != sliceGeneration_) {
+                    sliceGeneration_ = database_.changeFeed().current();
+                    slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
+                }
                 walked_ += stretch;
                 at_ = 0;
                 if (!slice_) {
@@ -514,9 +522,16 @@ class WholeMatch {
                 if (attempt.stretch && !attempt.version && !oneGo) return Walked::Unversioned;
                 if (attempt.stretch && stepIsOver(deadline, offered)) return endOfStep(Walked::Paused);
                 const int64_t after = attempt.stretch ? attempt.stretch->last : 0;
-                attempt.stretch =
-                    database_.findPlugInsAfterRegistration(rules_, after, oneGo ? SIZE_MAX : kWalkStretch);
+                // A stretch of a walk in steps is read with the loop let go, as a page's is; what the requests
+                // served meanwhile changed starts the attempt again, as a change between two steps does. One go
+                // holds the loop throughout.
+                if (oneGo)
+                    attempt.stretch = database_.findPlugInsAfterRegistration(rules_, after, SIZE_MAX);
+                else
+                    attempt.stretch = SerialQueue::withLoopLetGo(
+                        [&] { return database_.findPlugInsAfterRegistration(rules_, after, kWalkStretch); });
                 attempt.at = 0;
+                if (!oneGo && changedSinceBegun()) return Walked::Changed;
                 if (!attempt.stretch) {
                     if (after != 0 && !oneGo) return Walked::Unreadable;
                     trace::discoverRaw(0);

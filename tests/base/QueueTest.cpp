@@ -365,6 +365,29 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
         EXPECT_FALSE(waitedForInLoopBlock);
         EXPECT_FALSE(SerialQueue::bulkBlockIsWaitedFor());
 
+        // A bulk block that lets the loop go: a block of its own queue runs meanwhile, and once the work returns
+        // the bulk block holds the loop again. A loop block letting go keeps the bulk thread out all the same.
+        auto runsWithin = [](auto&& submit, std::chrono::milliseconds patience) {
+            auto ran = std::make_shared<std::promise<void>>();
+            submit([ran] { ran->set_value(); });
+            return ran->get_future().wait_for(patience) == std::future_status::ready;
+        };
+        auto onLoop = [&](const SerialQueue& queue) { return [&queue](auto block) { queue.async(block); }; };
+        std::promise<std::pair<bool, bool>> letGo;
+        a.asyncInBulk([&] {
+            bool ranMeanwhile = SerialQueue::withLoopLetGo([&] { return runsWithin(onLoop(a), kPatience); });
+            letGo.set_value({ranMeanwhile, runsWithin(onLoop(b), 50ms)});
+        });
+        auto [ranMeanwhile, ranAfterwards] = letGo.get_future().get();
+        EXPECT_TRUE(ranMeanwhile);
+        EXPECT_FALSE(ranAfterwards);
+        std::promise<bool> loopLetGo;
+        b.async([&] {
+            loopLetGo.set_value(SerialQueue::withLoopLetGo(
+                [&] { return runsWithin([&](auto block) { a.asyncInBulk(block); }, 50ms); }));
+        });
+        EXPECT_FALSE(loopLetGo.get_future().get());
+
         std::promise<std::string> refused;
         a.asyncInBulk([&] { refused.set_value(refusal([&] { b.sync([] {}); })); });
         std::string what = refused.get_future().get();

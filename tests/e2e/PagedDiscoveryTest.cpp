@@ -105,8 +105,9 @@ class PagedDiscoveryTest : public DaemonTest {
         return unpaged();
     }
     // Starts bxd with discovery steps of 1 us (about one candidate each) and makes this process a manager.
-    void startInStepsOfOneMicrosecond() {
-        setenv("BX_PAGE_STEP_MICROSECONDS", "1", 1);
+    void startInStepsOfOneMicrosecond() { startInSteps("1"); }
+    void startInSteps(const char* microseconds) {
+        setenv("BX_PAGE_STEP_MICROSECONDS", microseconds, 1);
         const bool started = start();
         unsetenv("BX_PAGE_STEP_MICROSECONDS");
         ASSERT_TRUE(started) << bxd_.log();
@@ -406,36 +407,44 @@ TEST_F(PagedDiscoveryTest, AnUnpagedMatchMadeInStepsAnswersOneStateWhileThePlugI
     ASSERT_EQ(stable.size(), 100u);
     const std::string churn = writePlugIn("c", "com.example.paged.c", "1");
 
-    std::atomic<unsigned> changes{0};
-    std::jthread changer([&](std::stop_token stopping) {
-        for (int64_t round = 1; !stopping.stop_requested(); ++round) {
-            std::vector<std::pair<std::string, Value>> annotations;
-            for (const std::string& uuid : stable)
-                annotations.emplace_back(uuid, Value::dictionary({{"round", Value::int64(round)}}));
-            succeed(request("bulk-annotate", {{"annotations", Value::dictionary(std::move(annotations))}}));
-            succeed(pathsRequest(round % 2 ? "add" : "remove", {churn}));
-            changes.fetch_add(2);
+    // Steps of one candidate, then steps that read several stretches each, the changes landing while one is read.
+    for (const char* step : {"1", "300"}) {
+        SCOPED_TRACE(std::string("steps of ") + step + " us");
+        if (std::string_view(step) != "1") {
+            bxd_.stop();
+            ASSERT_NO_FATAL_FAILURE(startInSteps(step));
         }
-    });
-    unsigned matches = 0;
-    const auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    for (; (matches < 5 || changes.load() < 40) && std::chrono::steady_clock::now() < giveUp; ++matches) {
-        Value reply = succeed(request("match", {{"rules", Value::emptyDictionary()}}));
-        std::multiset<std::string> served;
-        std::set<int64_t> rounds;
-        for (const Value& form : reply.get("matches").items()) {
-            std::string uuid(form.get("uuid").stringView());
-            if (stable.count(uuid) == 0) continue;
-            served.insert(uuid);
-            rounds.insert(form.get("annotations").get("extension").get("round").getInt64().value_or(0));
+        std::atomic<unsigned> changes{0};
+        std::jthread changer([&](std::stop_token stopping) {
+            for (int64_t round = 1; !stopping.stop_requested(); ++round) {
+                std::vector<std::pair<std::string, Value>> annotations;
+                for (const std::string& uuid : stable)
+                    annotations.emplace_back(uuid, Value::dictionary({{"round", Value::int64(round)}}));
+                succeed(request("bulk-annotate", {{"annotations", Value::dictionary(std::move(annotations))}}));
+                succeed(pathsRequest(round % 2 ? "add" : "remove", {churn}));
+                changes.fetch_add(2);
+            }
+        });
+        unsigned matches = 0;
+        const auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+        for (; (matches < 5 || changes.load() < 40) && std::chrono::steady_clock::now() < giveUp; ++matches) {
+            Value reply = succeed(request("match", {{"rules", Value::emptyDictionary()}}));
+            std::multiset<std::string> served;
+            std::set<int64_t> rounds;
+            for (const Value& form : reply.get("matches").items()) {
+                std::string uuid(form.get("uuid").stringView());
+                if (stable.count(uuid) == 0) continue;
+                served.insert(uuid);
+                rounds.insert(form.get("annotations").get("extension").get("round").getInt64().value_or(0));
+            }
+            ASSERT_EQ(served, stable);
+            ASSERT_EQ(rounds.size(), 1u) << "forms of " << rounds.size() << " bulk changes in one reply";
         }
-        ASSERT_EQ(served, stable);
-        ASSERT_EQ(rounds.size(), 1u) << "forms of " << rounds.size() << " bulk changes in one reply";
+        changer.request_stop();
+        changer.join();
+        EXPECT_GE(changes.load(), 40u) << "the changes did not come while matches were made (" << matches << ")";
+        expectLog("started again");
     }
-    changer.request_stop();
-    changer.join();
-    EXPECT_GE(changes.load(), 40u) << "the changes did not come while matches were made (" << matches << ")";
-    expectLog("started again");
 }
 
 // Guards the tool on more plug-ins than one default page: `bexil add` registers them in batches and `bexil match`
