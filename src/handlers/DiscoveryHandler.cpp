@@ -165,8 +165,12 @@ class PageWalk {
         const auto deadline = std::chrono::steady_clock::now() + page->database_.pageStep();
         if (!page->forms_) {
             if (!page->walk(deadline)) return resume(std::move(page));
-            page->accepted_.linkReplacements();
-            page->forms_ = page->accepted_.takeEncoded();
+            // The page's forms are its own, and putting them in their final shape takes a few hundred
+            // microseconds for a large page: done with the loop let go, so that a request need not wait for it.
+            page->forms_ = SerialQueue::withLoopLetGo([&] {
+                page->accepted_.linkReplacements();
+                return page->accepted_.takeEncoded();
+            });
         }
         if (!page->made_) {
             if (!page->encode(deadline)) return resume(std::move(page));
@@ -178,6 +182,9 @@ class PageWalk {
             if (page->steps_ > 1) return resume(std::move(page));
         }
         page->answer();
+        // Freeing what the page held (its forms, its copy of the reply's bytes, the stretch's records) takes as
+        // long again; with the loop let go too.
+        SerialQueue::withLoopLetGo([&] { page->release(); });
     }
 
   private:
@@ -291,6 +298,16 @@ class PageWalk {
             ++encoded_;
             if (stepIsOver(deadline)) return false;
         }
+    }
+
+    // Frees what the page holds once it is answered.
+    void release() {
+        forms_.reset();
+        matches_ = ZemCodec::Entries();
+        accepted_ = AcceptedForms(flags_);
+        group_ = AcceptedForms(flags_);
+        slice_.reset();
+        groupEnds_ = {};
     }
 
     // Ends the page after the identifier `group` - 1: its forms, encoded already, and the array's count go.
