@@ -222,8 +222,10 @@ void SerialQueue::asyncInBulk(std::function<void()> block) const {
     state_->core->bulk->submit(state_, std::move(block));
 }
 
+bool SerialQueue::letsLoopGo() { return detail::tlsOnBulkThread && tlsExclusion != nullptr; }
+
 SerialQueue::LetGo::LetGo() {
-    if (!detail::tlsOnBulkThread || tlsExclusion == nullptr) return;
+    if (!letsLoopGo()) return;
     released_ = tlsExclusion;
     tlsExclusion = nullptr;
     released_->leave();

@@ -68,6 +68,10 @@ class SerialQueue {
     // returns. So `work` may touch only what is safe from any thread (the database's public operations are), and the
     // caller must expect what those blocks changed meanwhile. Anywhere else it runs `work` as it is. For the slow
     // reads of long work, which a request would otherwise wait for.
+    //
+    // letsLoopGo() says whether withLoopLetGo, called here, would let the loop go: only then can blocks have run
+    // during `work`.
+    static bool letsLoopGo();
     template <class F>
     static std::invoke_result_t<F&> withLoopLetGo(F&& work) {
         LetGo letGo;

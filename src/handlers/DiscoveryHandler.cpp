@@ -226,8 +226,8 @@ class PageWalk {
                 // that the walk goes on however often the plug-ins change.
                 slice_ = SerialQueue::withLoopLetGo(
                     [&] { return database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch); });
-                if (database_.changeFeed().current() != sliceGeneration_) {
-                    sliceGeneration_ = database_.changeFeed().current();
+                if (const uint64_t now = database_.changeFeed().current(); now != sliceGeneration_) {
+                    sliceGeneration_ = now;
                     slice_ = database_.findPlugInsAfterIdentifier(rules_, walkedTo_, stretch);
                 }
                 walked_ += stretch;
@@ -542,13 +542,14 @@ class WholeMatch {
                 // A stretch of a walk in steps is read with the loop let go, as a page's is; what the requests
                 // served meanwhile changed starts the attempt again, as a change between two steps does. One go
                 // holds the loop throughout.
+                const bool letGo = !oneGo && SerialQueue::letsLoopGo();
                 if (oneGo)
                     attempt.stretch = database_.findPlugInsAfterRegistration(rules_, after, SIZE_MAX);
                 else
                     attempt.stretch = SerialQueue::withLoopLetGo(
                         [&] { return database_.findPlugInsAfterRegistration(rules_, after, kWalkStretch); });
                 attempt.at = 0;
-                if (!oneGo && changedSinceBegun()) return Walked::Changed;
+                if (letGo && changedSinceBegun()) return Walked::Changed;
                 if (!attempt.stretch) {
                     if (after != 0 && !oneGo) return Walked::Unreadable;
                     trace::discoverRaw(0);

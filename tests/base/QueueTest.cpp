@@ -373,20 +373,33 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
             return ran->get_future().wait_for(patience) == std::future_status::ready;
         };
         auto onLoop = [&](const SerialQueue& queue) { return [&queue](auto block) { queue.async(block); }; };
+        // letsLoopGo() tells each case apart: only a bulk block that holds the loop lets it go.
         std::promise<std::pair<bool, bool>> letGo;
+        bool letsGoInBulk = false;
+        bool letsGoAgainMeanwhile = true;
         a.asyncInBulk([&] {
-            bool ranMeanwhile = SerialQueue::withLoopLetGo([&] { return runsWithin(onLoop(a), kPatience); });
+            letsGoInBulk = SerialQueue::letsLoopGo();
+            bool ranMeanwhile = SerialQueue::withLoopLetGo([&] {
+                letsGoAgainMeanwhile = SerialQueue::letsLoopGo();
+                return runsWithin(onLoop(a), kPatience);
+            });
             letGo.set_value({ranMeanwhile, runsWithin(onLoop(b), 50ms)});
         });
         auto [ranMeanwhile, ranAfterwards] = letGo.get_future().get();
         EXPECT_TRUE(ranMeanwhile);
         EXPECT_FALSE(ranAfterwards);
+        EXPECT_TRUE(letsGoInBulk);
+        EXPECT_FALSE(letsGoAgainMeanwhile);
         std::promise<bool> loopLetGo;
+        bool letsGoOnLoop = true;
         b.async([&] {
+            letsGoOnLoop = SerialQueue::letsLoopGo();
             loopLetGo.set_value(SerialQueue::withLoopLetGo(
                 [&] { return runsWithin([&](auto block) { a.asyncInBulk(block); }, 50ms); }));
         });
         EXPECT_FALSE(loopLetGo.get_future().get());
+        EXPECT_FALSE(letsGoOnLoop);
+        EXPECT_FALSE(SerialQueue::letsLoopGo());
 
         std::promise<std::string> refused;
         a.asyncInBulk([&] { refused.set_value(refusal([&] { b.sync([] {}); })); });
