@@ -52,7 +52,9 @@ struct SerialQueueState;
 // Where it may be raised again, the thread is scheduled as idle: it runs on a CPU only when nothing of normal
 // priority wants that CPU, and the kernel counts a CPU that runs only it as free when it places a waking thread.
 // While a loop thread waits for the exclusion, the bulk thread is raised to normal scheduling (at its nice value)
-// until its block ends, so that the wait lasts the block, not until the machine is quiet.
+// until it gives the exclusion back, so that the wait lasts the block, not until the machine is quiet. It is idle
+// again before it wakes the waiting thread: raised, the kernel would let it finish its time slice first, on the CPU
+// where the woken thread is placed, even with another CPU free.
 class BulkThread {
   public:
     // Starts the thread, `niceIncrement` steps of nice value below its creator.
@@ -71,13 +73,14 @@ class BulkThread {
 
     // Takes and gives back the exclusion, on any thread.
     void enter();
-    void leave() { exclusion_.unlock(); }
+    void leave();
     // Whether a loop thread waits for the exclusion now.
     bool waitedFor() const { return loopWaiting_.load(std::memory_order_relaxed) > 0; }
 
   private:
     void run(int niceIncrement);
-    // Lifts the thread out of idle scheduling until its block ends (settle); on a loop thread that must wait.
+    // Lifts the thread out of idle scheduling until it gives the exclusion back (settle); on a loop thread that must
+    // wait.
     void raise();
     void settle();
 

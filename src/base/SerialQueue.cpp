@@ -127,6 +127,11 @@ void BulkThread::enter() {
     loopWaiting_.fetch_sub(1, std::memory_order_relaxed);
 }
 
+void BulkThread::leave() {
+    if (tlsOnBulkThread) settle();
+    exclusion_.unlock();
+}
+
 void BulkThread::raise() {
     if (!idle_.load()) return;
     std::lock_guard lock(policyMutex_);
@@ -171,6 +176,7 @@ void BulkThread::run(int niceIncrement) {
         }
         runOnQueue(*next.first, next.second);
         next = {};
+        // A raise that came just after the block gave the exclusion back.
         settle();
         // A loop thread woken by the unlock has not necessarily run yet; taking the exclusion straight back would
         // make it wait a whole block more.

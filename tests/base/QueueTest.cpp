@@ -319,13 +319,16 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
         EXPECT_TRUE(allCurrent);
         EXPECT_EQ(bulkNice, std::min(creatorNice + 10, 19));
 
-        // Idle-scheduled where it may be raised again (root may), and raised while a loop thread waits for it.
+        // Idle-scheduled where it may be raised again (root may), raised while a loop thread waits for it, and idle
+        // again before that thread goes on.
         std::promise<pid_t> bulkTid;
         std::promise<void> release, held;
         auto released = release.get_future().share();
         bool waitedForAtFirst = true;
         bool waitedForOnceWaited = false;
-        a.asyncInBulk([&, released] {
+        std::promise<void> waited;
+        auto loopBlockRan = waited.get_future().share();
+        a.asyncInBulk([&, released, loopBlockRan] {
             waitedForAtFirst = SerialQueue::bulkBlockIsWaitedFor();
             bulkTid.set_value(static_cast<pid_t>(gettid()));
             held.set_value();
@@ -333,6 +336,8 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
             for (auto until = std::chrono::steady_clock::now() + kPatience;
                  !waitedForOnceWaited && std::chrono::steady_clock::now() < until; std::this_thread::sleep_for(1ms))
                 waitedForOnceWaited = SerialQueue::bulkBlockIsWaitedFor();
+            // The waiting block runs while this one has let the loop go, and sees it idle again.
+            SerialQueue::withLoopLetGo([&] { loopBlockRan.wait_for(kPatience); });
         });
         held.get_future().wait();
         const pid_t tid = bulkTid.get_future().get();
@@ -347,10 +352,11 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
             }
             return false;
         };
-        std::promise<void> waited;
         bool waitedForInLoopBlock = true;
+        int policyInLoopBlock = -1;
         b.async([&] {
             waitedForInLoopBlock = SerialQueue::bulkBlockIsWaitedFor();
+            policyInLoopBlock = sched_getscheduler(tid);
             waited.set_value();
         });
         if (policy == SCHED_IDLE) {
@@ -358,7 +364,8 @@ TEST(SerialQueueTest, BlocksInBulkRunBelowTheLoopOnTheirOwnThreadAndNeverBesideI
             EXPECT_EQ(getpriority(PRIO_PROCESS, static_cast<id_t>(tid)), std::min(creatorNice + 10, 19));
         }
         release.set_value();
-        waited.get_future().wait();
+        loopBlockRan.wait();
+        EXPECT_EQ(policyInLoopBlock, policy);
         EXPECT_TRUE(policyBecomes(policy));
         EXPECT_FALSE(waitedForAtFirst);
         EXPECT_TRUE(waitedForOnceWaited);
