@@ -243,9 +243,7 @@ SerialQueue::LetGo::~LetGo() {
     tlsExclusion = released_;
 }
 
-bool SerialQueue::bulkBlockIsWaitedFor() {
-    return detail::tlsOnBulkThread && tlsExclusion != nullptr && tlsExclusion->waitedFor();
-}
+bool SerialQueue::bulkBlockIsWaitedFor() { return letsLoopGo() && tlsExclusion->waitedFor(); }
 
 void SerialQueue::asyncAfter(std::chrono::steady_clock::duration delay, std::function<void()> block) const {
     if (state_->core->closed()) return;

@@ -118,6 +118,8 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     // REQUIRES: the connection's mutex held, for every member whose name ends in Locked, for statement() and
     // failure().
     std::shared_ptr<Statement> statement(Connection& connection, const std::string& sql);
+    // The order the rows are read in unless a caller says otherwise; put by the reader, not by SQLite.
+    static constexpr std::string_view kRegistrationOrder = " ORDER BY p.id";
     // The rows that `where` selects, in registration order unless `order` says otherwise (an ORDER BY clause and
     // anything after it, such as a LIMIT that `integerArgument` binds). Rows that `known` says the caller holds are
     // read only in part (Row::held). `through`, when given, names the index SQLite must read the plug-ins through.
@@ -129,13 +131,13 @@ class LedgerixWorkspace final : public LXApplicationWorkspace, public std::enabl
     std::optional<std::vector<Row>> selectRowsLocked(Connection& connection, std::string_view where,
                                                      const std::vector<std::string>& arguments,
                                                      std::optional<int64_t> integerArgument,
-                                                     std::string_view order = " ORDER BY p.id",
+                                                     std::string_view order = kRegistrationOrder,
                                                      const LXKnownRecord* known = nullptr,
                                                      std::string_view through = {}, Extent* extent = nullptr);
     // On the look-up connection.
     std::optional<std::vector<Row>> selectRows(std::string_view where, const std::vector<std::string>& arguments,
                                                std::optional<int64_t> integerArgument,
-                                               std::string_view order = " ORDER BY p.id",
+                                               std::string_view order = kRegistrationOrder,
                                                const LXKnownRecord* known = nullptr);
     // The record at exactly this path; none when there is none or the store failed (then *failed is set).
     std::optional<Row> rowAtPathLocked(Connection& connection, const std::string& path, bool* failed);
