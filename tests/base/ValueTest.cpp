@@ -40,7 +40,7 @@ TEST(ValueSharing, SharedAcrossThreadsWithoutRaces) {
 }
 
 // Guards dictionaries: the last duplicate wins, and look-ups find every key however the keys were inserted (the
-// sorted order itself shows in DocumentRoundTrip.WritesTheDocumentedLayout).
+// sorted order itself shows in DocumentRoundTrip.WritesTheDocumentedLayout), in order or not.
 TEST(ValueDictionary, LastDuplicateWinsAndTheBuilderLookupMatchesTheBuiltValue) {
     Value d = dict({{"zeta", Value::int64(1)}, {"alpha", Value::int64(2)}, {"alpha", Value::int64(4)}});
     EXPECT_EQ(d.count(), 2u);
@@ -56,6 +56,13 @@ TEST(ValueDictionary, LastDuplicateWinsAndTheBuilderLookupMatchesTheBuiltValue) 
     for (size_t i = 1; i < built.count(); ++i) ASSERT_LT(built.entries()[i - 1].key, built.entries()[i].key);
     // The builder stays usable after value().
     EXPECT_EQ(b.take(), built);
+
+    // Inserted in order, so every set lands after what is there; setting the last key or an earlier one again
+    // replaces its value.
+    MutableDictionary ascending;
+    for (std::string key : {"a", "b", "c", "c", "a"}) ascending.set(key, Value::string(key + "'"));
+    ascending.set("c", Value::int64(3));
+    EXPECT_EQ(ascending.take(), dict({{"a", Value::string("a'")}, {"b", Value::string("b'")}, {"c", Value::int64(3)}}));
 }
 
 // Guards equality, which matching and the annotation merge rely on: numbers by value across kinds (exactly, also
