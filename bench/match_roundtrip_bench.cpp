@@ -4,7 +4,8 @@
 // spread round-robin over the other 49 points. Every plug-in declares one shared resource, so each form carries a
 // resource token as well as its annotations.
 //
-// For each size it prints:
+// First it prints what the host takes from a thread that spins for a second (see printHostStalls). For each size it
+// prints:
 //  - the point match: p50 / p99 round trip through bxd, and the same work done in this process (the database's
 //    query, the rules, export, annotations, tokens and the encoding of the forms) as the server-side figure;
 //  - the match with no rules (every visible plug-in): round trip and server-side time per returned plug-in, the
@@ -19,7 +20,8 @@
 //  - the point match beside a client that runs full discoveries back to back on another connection, paged and
 //    (up to --all-max) unpaged: its p50 / p99 against the idle figures of the same run and the share slower than
 //    twice the idle p99 and the slowest, once with that client at normal priority and once at nice 19 (on 2 cores the
-//    first also measures the client's own decoding competing for the CPU).
+//    first also measures the client's own decoding competing for the CPU); and its p99 against that of an idle
+//    window of the same size just before it.
 //
 // --point-only stops after the point match and "explain" (the other figures take long at 100,000); --no-explain
 // leaves "explain" out, to measure a bxd that does not serve it.
@@ -429,6 +431,28 @@ double loadAverage() {
     return load;
 }
 
+// What the machine itself takes from a busy thread: one second of reading the clock in a loop, every gap longer
+// than 20 us counted as time lost (interrupts, the hypervisor, other tasks). The tails measured here are only as
+// steady as this is: on a host that stalls a CPU for milliseconds a few times a second, a p99 of a few thousand round
+// trips moves by whole stalls from one window to the next.
+void printHostStalls() {
+    constexpr double kGapUs = 20, kLongUs = 300;
+    const Clock::time_point end = Clock::now() + std::chrono::seconds(1);
+    Clock::time_point last = Clock::now();
+    double lostUs = 0, longestUs = 0;
+    unsigned longGaps = 0;
+    for (Clock::time_point now = last; now < end; last = now) {
+        now = Clock::now();
+        double gap = std::chrono::duration<double, std::micro>(now - last).count();
+        if (gap <= kGapUs) continue;
+        lostUs += gap;
+        longestUs = std::max(longestUs, gap);
+        if (gap > kLongUs) ++longGaps;
+    }
+    printf("host stalls: a spinning thread lost %.1f%% of a second, %u gaps over %.0f us, the longest %.0f us\n",
+           lostUs / 1e4, longGaps, kLongUs, longestUs);
+}
+
 void runSize(const Options& options, int count) {
     fs::path registry = prepareRegistry(options.cache, count);
     std::string pattern = (fs::temp_directory_path() / "bexil-match-run-XXXXXX").string();
@@ -612,9 +636,22 @@ void runSize(const Options& options, int count) {
     // discovering client decodes every reply, so on a machine with fewer cores than busy threads part of what the
     // point match waits for is that client's own work, which no server can give back; the second round runs it
     // at the lowest priority, so that what remains is the wait inside bxd.
+    // This host's own stalls drift over a run, and the idle figure above was taken well before these: each
+    // window also gets an idle window of the same size just before it, to tell drift from what the discovery costs.
+    auto pointWindow = [&] {
+        std::vector<double> us;
+        us.reserve(options.requests);
+        for (unsigned i = 0; i < options.requests; ++i) {
+            Clock::time_point start = Clock::now();
+            connection.roundTrip(matchRequest(pointRules));
+            us.push_back(elapsedUs(start));
+        }
+        return us;
+    };
     for (bool paged : {true, false}) {
         if (!paged && !all) break;
         for (int discovererNice : {0, 19}) {
+            const Percentiles before = percentiles(pointWindow());
             std::atomic<bool> stop{false};
             std::atomic<unsigned> walks{0};
             std::thread discoverer([&] {
@@ -632,13 +669,7 @@ void runSize(const Options& options, int count) {
                 close(other.fd);
             });
             std::this_thread::sleep_for(std::chrono::milliseconds(50));
-            std::vector<double> busy;
-            busy.reserve(options.requests);
-            for (unsigned i = 0; i < options.requests; ++i) {
-                Clock::time_point start = Clock::now();
-                connection.roundTrip(matchRequest(pointRules));
-                busy.push_back(elapsedUs(start));
-            }
+            std::vector<double> busy = pointWindow();
             stop.store(true);
             discoverer.join();
             Percentiles b = percentiles(busy);
@@ -649,9 +680,11 @@ void runSize(const Options& options, int count) {
                             static_cast<double>(busy.size());
             printf(
                 "point match beside %s full discovery (discovering client at nice %d, %u walks meanwhile): p50 "
-                "%.1f us (%.2fx idle), p99 %.1f us (%.2fx idle), %.2f%% beyond 2x the idle p99, slowest %.1f ms\n",
+                "%.1f us (%.2fx idle), p99 %.1f us (%.2fx idle), %.2f%% beyond 2x the idle p99, slowest %.1f ms; "
+                "idle just before: p99 %.1f us (%.2fx)\n",
                 paged ? "paged" : "unpaged", discovererNice, walks.load(), b.p50Us, b.p50Us / p.p50Us, b.p99Us,
-                b.p99Us / p.p99Us, 100 * beyond, *std::max_element(busy.begin(), busy.end()) / 1000);
+                b.p99Us / p.p99Us, 100 * beyond, *std::max_element(busy.begin(), busy.end()) / 1000, before.p99Us,
+                b.p99Us / before.p99Us);
         }
     }
     fflush(stdout);
@@ -678,6 +711,7 @@ int main(int argc, char** argv) {
     std::string pattern = (fs::temp_directory_path() / "bexil-match-runtime-XXXXXX").string();
     if (!mkdtemp(pattern.data())) die("mkdtemp");
     setenv("BX_RUNTIME_DIR", pattern.c_str(), 1);
+    printHostStalls();
     for (int count : options.counts) runSize(options, count);
     std::error_code ignored;
     fs::remove_all(pattern, ignored);
