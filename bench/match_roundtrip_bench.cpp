@@ -498,17 +498,21 @@ void runSize(const Options& options, int count) {
     // The first point match builds the candidates' records; a few more settle the caches.
     for (int i = 0; i < 20; ++i) connection.roundTrip(matchRequest(pointRules));
     size_t pointCount = connection.matches();
-    std::vector<double> times;
-    times.reserve(options.requests);
+    // --requests point matches back to back: their round trips, and the size of the last reply in pointBytes.
     size_t pointBytes = 0;
+    auto pointWindow = [&] {
+        std::vector<double> us;
+        us.reserve(options.requests);
+        for (unsigned i = 0; i < options.requests; ++i) {
+            Clock::time_point start = Clock::now();
+            pointBytes = connection.roundTrip(matchRequest(pointRules));
+            us.push_back(elapsedUs(start));
+        }
+        return us;
+    };
     double cpuBefore = cpuUs(server);
-    for (unsigned i = 0; i < options.requests; ++i) {
-        Clock::time_point start = Clock::now();
-        pointBytes = connection.roundTrip(matchRequest(pointRules));
-        times.push_back(elapsedUs(start));
-    }
+    Percentiles p = percentiles(pointWindow());
     double pointCpu = (cpuUs(server) - cpuBefore) / options.requests;
-    Percentiles p = percentiles(times);
     printf(
         "round trip point match: %zu forms, %zu bytes, p50 %.1f us, p99 %.1f us, bxd CPU %.1f us per request "
         "(load %.2f)\n",
@@ -638,16 +642,6 @@ void runSize(const Options& options, int count) {
     // at the lowest priority, so that what remains is the wait inside bxd.
     // This host's own stalls drift over a run, and the idle figure above was taken well before these: each
     // window also gets an idle window of the same size just before it, to tell drift from what the discovery costs.
-    auto pointWindow = [&] {
-        std::vector<double> us;
-        us.reserve(options.requests);
-        for (unsigned i = 0; i < options.requests; ++i) {
-            Clock::time_point start = Clock::now();
-            connection.roundTrip(matchRequest(pointRules));
-            us.push_back(elapsedUs(start));
-        }
-        return us;
-    };
     for (bool paged : {true, false}) {
         if (!paged && !all) break;
         for (int discovererNice : {0, 19}) {
