@@ -242,6 +242,14 @@ void Transaction::doneWithEncodedReply(std::vector<uint8_t> payload) {
     answer(HeldReply{Value(), {}, std::move(payload)});
 }
 
+void Transaction::doneWithOversizedReply(size_t size) {
+    if (answered_.exchange(true)) {
+        log::ops().fault("transaction answered twice for client %d", client_->pid());
+        return;
+    }
+    answer(HeldReply{tooLargeReply(size), {}, {}});
+}
+
 Value Transaction::tooLargeReply(size_t size) const {
     log::ops().error("reply of %zu bytes to client %d exceeds the frame limit of %zu bytes (kMaxFrameBytes)", size,
                      client_->pid(), ZemFrame::kMaxPayloadBytes);

@@ -51,6 +51,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     // The same with the whole reply encoded already, what the handler set included, so that a reply of megabytes
     // is not copied once more on its way out.
     void doneWithEncodedReply(std::vector<uint8_t> payload);
+    // Answers that the reply, of `size` bytes (past the frame limit), cannot be sent: what doneWithEncodedReply
+    // answers for such a payload, from a handler that stopped writing it once it was past the limit.
+    void doneWithOversizedReply(size_t size);
     // Sets "errorcode" and "error" in the reply, then done().
     void fail(ErrorCode code, std::string_view message);
     // A Bexil-domain error answers with its own code and message; any other with `code` and its description.

@@ -44,6 +44,7 @@
 #include "platform/log/Log.h"
 #include "platform/trace/Probes.h"
 #include "platform/zem/ZemCodec.h"
+#include "platform/zem/ZemFrame.h"
 #include "policy/BXDPlugIn.h"
 #include "policy/BXHostAccessPolicy.h"
 #include "policy/BXIssueReadExtension.h"
@@ -573,6 +574,8 @@ class WholeMatch {
     // and "matches" among them in key order, each form released once written (a large reply's forms take a while
     // to free). The reply is handed over as written: copying megabytes into another buffer would hold the queue,
     // all the longer for memory that was never used before. A client of a version before message forms gets none.
+    // A reply that grows past the frame limit will be refused: from there on its forms are only measured, one at a
+    // time, so that the refusal still gives its size without holding it all.
     bool encode(std::chrono::steady_clock::time_point deadline) {
         if (!carriesMessageForms(transaction_->version()) || failure_) return true;
         AcceptedForms& accepted = attempt_->accepted;
@@ -591,8 +594,9 @@ class WholeMatch {
             // Room for it all: a form's changing entries (annotations, token) take less than its kept ones
             // unless its annotations are large, so twice the kept entries is room enough but in such cases, where
             // the reply grows; room never written to costs no memory.
-            payload_.reserve(kMaxArrayHeaderBytes * 2 + others_.bytes.size() + matchesKey.bytes.size() +
-                             2 * accepted.keptEntryBytes());
+            payload_.reserve(std::min(kMaxArrayHeaderBytes * 2 + others_.bytes.size() + matchesKey.bytes.size() +
+                                          2 * accepted.keptEntryBytes(),
+                                      ZemFrame::kMaxPayloadBytes + 1));
             ZemCodec::appendDictionaryHeader(others_.count() + 1, payload_);
             payload_.insert(payload_.end(), others_.bytes.begin(),
                             others_.bytes.begin() + static_cast<ptrdiff_t>(othersWritten_ < others_.count()
@@ -604,7 +608,12 @@ class WholeMatch {
         while (nextSlot_ < accepted.slots()) {
             std::optional<AcceptedForms::EncodedForm> form = accepted.takeEncodedAt(nextSlot_++);
             if (!form) continue;
-            if ((failure_ = AcceptedForms::appendForm(*form, payload_))) return true;
+            // A form's kept entries are what it takes at least: one that cannot fit is not copied in first (past
+            // the buffer's room, which is the limit's, that would copy the whole reply once more).
+            if (!oversized_ && form->kept && payload_.size() + form->kept->bytes.size() > ZemFrame::kMaxPayloadBytes)
+                countPastTheLimit(true);
+            if ((failure_ = AcceptedForms::appendForm(*form, oversized_ ? measured_ : payload_))) return true;
+            countPastTheLimit();
             if (stepIsOver(deadline)) return false;
         }
         if (othersWritten_ < others_.count()) {
@@ -612,8 +621,22 @@ class WholeMatch {
                             others_.bytes.begin() + static_cast<ptrdiff_t>(others_.starts[othersWritten_]),
                             others_.bytes.end());
             othersWritten_ = others_.count();
+            countPastTheLimit();
         }
         return true;
+    }
+
+    // Once the reply is past the frame limit (or `surely` will be), lets go of what it holds, keeping its size;
+    // then adds each piece measured since.
+    void countPastTheLimit(bool surely = false) {
+        if (oversized_) {
+            *oversized_ += measured_.size() + payload_.size();
+            measured_.clear();
+            payload_.clear();
+        } else if (surely || payload_.size() > ZemFrame::kMaxPayloadBytes) {
+            oversized_ = payload_.size();
+            std::vector<uint8_t>().swap(payload_);
+        }
     }
 
     void answer() {
@@ -623,7 +646,10 @@ class WholeMatch {
             transaction.reply().set(protocol::key::kGeneration, Value::uint64(attempt_->generation));
             return answerWithMatches(transaction, ZemCodec::Entries(), failure_);
         }
-        transaction.doneWithEncodedReply(std::move(payload_));
+        if (oversized_)
+            transaction.doneWithOversizedReply(*oversized_);
+        else
+            transaction.doneWithEncodedReply(std::move(payload_));
     }
 
     std::shared_ptr<Transaction> transaction_;
@@ -649,6 +675,10 @@ class WholeMatch {
     bool writingBegun_ = false;
     size_t nextSlot_ = 0;
     std::optional<Error> failure_;
+    // The size of a reply past the frame limit, counted so far (none while it is within), and the form being
+    // measured.
+    std::optional<size_t> oversized_;
+    std::vector<uint8_t> measured_;
 };
 
 // Starts a page of a paged "match" (see the top of this file) once the request's page size and continuation hold.

@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdio>
 #include <iostream>
 #include <map>
 #include <mutex>
@@ -12,6 +13,7 @@
 
 #include "E2eSupport.h"
 #include "platform/notify/SystemNotifications.h"
+#include "platform/zem/ZemFrame.h"
 
 namespace bexil {
 namespace {
@@ -171,6 +173,36 @@ TEST_F(AnnotationTest, DiscoveryReplyTooLargeForAFrameIsAnErrorNotASilence) {
     EXPECT_EQ(errorCode(reply), 4);
     EXPECT_NE(errorText(reply).find("exceeds the frame limit"), std::string::npos) << errorText(reply);
     expectLog("exceeds the frame limit of");
+    EXPECT_EQ(errorCode(client.replyTo(matchRequest(identifierRule("none")))), 0) << "the connection stays usable";
+}
+
+// Guards the refusal of a reply that passes the frame limit well before its last form: it still names the whole
+// reply's size, so a client learns how far over it is, though bxd stopped keeping the reply once it was past.
+TEST_F(AnnotationTest, OversizedDiscoveryReplyIsMeasuredToItsEnd) {
+    copyExamples({"Notes.app"});
+    add({plugIn("Notes.app/PlugIns/Stationery.bxplugin")});
+    const Uuid stationery = registeredUuid(plugIn("Notes.app/PlugIns/Stationery.bxplugin")).value_or(Uuid());
+    ASSERT_FALSE(stationery.isNil());
+    ASSERT_EQ(identifiers(succeed(matchRequest())).size(), 3u) << "every plug-in is a form of the reply";
+    // The two registered first take the reply past the limit; the last one comes after that.
+    constexpr size_t kLarge = 9u << 20;
+    constexpr size_t kAfter = 6u << 20;
+    auto annotation = [](size_t size) {
+        return Value::dictionary({{"extension", Value::dictionary({{"bulk", Value::string(std::string(size, 'y'))}})}});
+    };
+    succeed(annotateRequest(annotation(kLarge), {hello_, bonjour_}));
+    succeed(annotateRequest(annotation(kAfter), {stationery}));
+    TestClient client;
+    Value reply = client.replyTo(matchRequest());
+    ASSERT_EQ(errorCode(reply), 4) << errorText(reply);
+    unsigned long long size = 0, limit = 0;
+    ASSERT_EQ(std::sscanf(errorText(reply).c_str(), "reply of %llu bytes exceeds the frame limit of %llu bytes", &size,
+                          &limit),
+              2)
+        << errorText(reply);
+    EXPECT_EQ(limit, ZemFrame::kMaxPayloadBytes);
+    EXPECT_GT(size, 2 * kLarge + kAfter) << "the form after the limit is counted too";
+    EXPECT_LT(size, 2 * kLarge + kAfter + 64 * 1024);
     EXPECT_EQ(errorCode(client.replyTo(matchRequest(identifierRule("none")))), 0) << "the connection stays usable";
 }
 
