@@ -593,7 +593,8 @@ class WholeMatch {
                 ++othersWritten_;
             // Room for it all: a form's changing entries (annotations, token) take less than its kept ones
             // unless its annotations are large, so twice the kept entries is room enough but in such cases, where
-            // the reply grows; room never written to costs no memory.
+            // the reply grows; room never written to costs no memory. Never more than a frame takes, though: past
+            // that the reply is only measured.
             payload_.reserve(std::min(kMaxArrayHeaderBytes * 2 + others_.bytes.size() + matchesKey.bytes.size() +
                                           2 * accepted.keptEntryBytes(),
                                       ZemFrame::kMaxPayloadBytes + 1));
