@@ -612,32 +612,36 @@ class WholeMatch {
             // A form's kept entries are what it takes at least: one that cannot fit is not copied in first (past
             // the buffer's room, which is the limit's, that would copy the whole reply once more).
             if (!oversized_ && form->kept && payload_.size() + form->kept->bytes.size() > ZemFrame::kMaxPayloadBytes)
-                countPastTheLimit(true);
-            if ((failure_ = AcceptedForms::appendForm(*form, oversized_ ? measured_ : payload_))) return true;
-            countPastTheLimit();
+                stopKeeping();
+            if ((failure_ = AcceptedForms::appendForm(*form, written()))) return true;
+            countWritten();
             if (stepIsOver(deadline)) return false;
         }
         if (othersWritten_ < others_.count()) {
-            payload_.insert(payload_.end(),
-                            others_.bytes.begin() + static_cast<ptrdiff_t>(others_.starts[othersWritten_]),
-                            others_.bytes.end());
+            written().insert(written().end(),
+                             others_.bytes.begin() + static_cast<ptrdiff_t>(others_.starts[othersWritten_]),
+                             others_.bytes.end());
             othersWritten_ = others_.count();
-            countPastTheLimit();
+            countWritten();
         }
         return true;
     }
 
-    // Once the reply is past the frame limit (or `surely` will be), lets go of what it holds, keeping its size;
-    // then adds each piece measured since.
-    void countPastTheLimit(bool surely = false) {
+    // Where the next piece of the reply goes: the reply, or once it is past the frame limit the piece measured.
+    std::vector<uint8_t>& written() { return oversized_ ? measured_ : payload_; }
+    // Counts the piece just measured, or stops keeping the reply once it is past the limit.
+    void countWritten() {
         if (oversized_) {
-            *oversized_ += measured_.size() + payload_.size();
+            *oversized_ += measured_.size();
             measured_.clear();
-            payload_.clear();
-        } else if (surely || payload_.size() > ZemFrame::kMaxPayloadBytes) {
-            oversized_ = payload_.size();
-            std::vector<uint8_t>().swap(payload_);
+        } else if (payload_.size() > ZemFrame::kMaxPayloadBytes) {
+            stopKeeping();
         }
+    }
+    // Lets go of the reply, keeping its size; what follows is only measured.
+    void stopKeeping() {
+        oversized_ = payload_.size();
+        std::vector<uint8_t>().swap(payload_);
     }
 
     void answer() {
