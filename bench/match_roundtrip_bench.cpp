@@ -4,8 +4,8 @@
 // spread round-robin over the other 49 points. Every plug-in declares one shared resource, so each form carries a
 // resource token as well as its annotations.
 //
-// First it prints what the host takes from a thread that spins for a second (see printHostStalls). For each size it
-// prints:
+// First it prints what the host takes from a thread that spins for a second, alone and with every CPU spinning (see
+// printHostStalls). For each size it prints:
 //  - the point match: p50 / p99 round trip through bxd, and the same work done in this process (the database's
 //    query, the rules, export, annotations, tokens and the encoding of the forms) as the server-side figure;
 //  - the match with no rules (every visible plug-in): round trip and server-side time per returned plug-in, the
@@ -21,7 +21,9 @@
 //    (up to --all-max) unpaged: its p50 / p99 against the idle figures of the same run and the share slower than
 //    twice the idle p99 and the slowest, once with that client at normal priority and once at nice 19 (on 2 cores the
 //    first also measures the client's own decoding competing for the CPU); and its p99 against that of an idle
-//    window of the same size just before it.
+//    window of the same size just before it. Beside each, the same figure for a stand-in server (see StandIn) that
+//    spends bxd's CPU per point match and sends a reply of its size, but shares nothing with bxd: what the host
+//    alone does to such a request's tail while the same client discovers.
 //
 // --point-only stops after the point match and "explain" (the other figures take long at 100,000); --no-explain
 // leaves "explain" out, to measure a bxd that does not serve it.
@@ -35,6 +37,7 @@
 
 #include <fcntl.h>
 #include <getopt.h>
+#include <sched.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -50,6 +53,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -431,27 +435,138 @@ double loadAverage() {
     return load;
 }
 
-// What the machine itself takes from a busy thread: one second of reading the clock in a loop, every gap longer
-// than 20 us counted as time lost (interrupts, the hypervisor, other tasks). The tails measured here are only as
-// steady as this is: on a host that stalls a CPU for milliseconds a few times a second, a p99 of a few thousand round
-// trips moves by whole stalls from one window to the next.
-void printHostStalls() {
-    constexpr double kGapUs = 20, kLongUs = 300;
-    const Clock::time_point end = Clock::now() + std::chrono::seconds(1);
-    Clock::time_point last = Clock::now();
-    double lostUs = 0, longestUs = 0;
+// What the machine itself takes from busy threads: one second of reading the clock in a loop, every gap longer than
+// 20 us counted as time lost, first on one thread while the other CPUs idle, then on one thread per CPU at once.
+// Beside each figure is the share of the second that the kernel saw the thread run: when that is near 100% while the
+// gaps add up to several percent, the time went to the hypervisor, which this machine's scheduler cannot see or give
+// back. The tails measured here are only as steady as this is: on a host that stalls a CPU for milliseconds a few
+// times a second, a p99 of a few thousand round trips moves by whole stalls from one window to the next.
+struct Stalls {
+    double lostPercent = 0;
+    double ranPercent = 0;
     unsigned longGaps = 0;
+    double longestUs = 0;
+};
+
+// The CPU time the calling thread has had so far, as the kernel's scheduler counts it, in microseconds.
+double threadRunUs() {
+    std::ifstream stat("/proc/thread-self/schedstat");
+    unsigned long long runNs = 0;
+    stat >> runNs;
+    return static_cast<double>(runNs) / 1e3;
+}
+
+Stalls spinOneSecond(int cpu) {
+    constexpr double kGapUs = 20, kLongUs = 300;
+    cpu_set_t only;
+    CPU_ZERO(&only);
+    CPU_SET(cpu, &only);
+    sched_setaffinity(0, sizeof only, &only);
+    Stalls stalls;
+    const double ranBefore = threadRunUs();
+    const Clock::time_point start = Clock::now(), end = start + std::chrono::seconds(1);
+    Clock::time_point last = start;
+    double lostUs = 0;
     for (Clock::time_point now = last; now < end; last = now) {
         now = Clock::now();
         double gap = std::chrono::duration<double, std::micro>(now - last).count();
         if (gap <= kGapUs) continue;
         lostUs += gap;
-        longestUs = std::max(longestUs, gap);
-        if (gap > kLongUs) ++longGaps;
+        stalls.longestUs = std::max(stalls.longestUs, gap);
+        if (gap > kLongUs) ++stalls.longGaps;
     }
-    printf("host stalls: a spinning thread lost %.1f%% of a second, %u gaps over %.0f us, the longest %.0f us\n",
-           lostUs / 1e4, longGaps, kLongUs, longestUs);
+    const double wallUs = elapsedUs(start);
+    stalls.lostPercent = 100 * lostUs / wallUs;
+    stalls.ranPercent = 100 * (threadRunUs() - ranBefore) / wallUs;
+    return stalls;
 }
+
+void printHostStalls() {
+    cpu_set_t allowed;
+    CPU_ZERO(&allowed);
+    if (sched_getaffinity(0, sizeof allowed, &allowed) != 0) die("sched_getaffinity");
+    std::vector<int> cpus;
+    for (int cpu = 0; cpu < CPU_SETSIZE; ++cpu)
+        if (CPU_ISSET(cpu, &allowed)) cpus.push_back(cpu);
+    std::vector<Stalls> every(cpus.size());
+    Stalls alone;
+    // Threads of their own, so that pinning them leaves this thread's CPUs as they were.
+    std::thread([&] { alone = spinOneSecond(cpus.front()); }).join();
+    std::vector<std::thread> spinners;
+    for (size_t i = 0; i < cpus.size(); ++i) spinners.emplace_back([&, i] { every[i] = spinOneSecond(cpus[i]); });
+    for (std::thread& spinner : spinners) spinner.join();
+    const Stalls& worst = *std::max_element(
+        every.begin(), every.end(), [](const Stalls& a, const Stalls& b) { return a.lostPercent < b.lostPercent; });
+    printf(
+        "host stalls: a spinning thread lost %.1f%% of a second alone (gaps over 300 us: %u, the longest %.0f us; "
+        "the kernel saw it run %.1f%%), and up to %.1f%% with one spinning on each of the %zu CPUs (gaps over "
+        "300 us: %u, the longest %.0f us; seen running %.1f%%)\n",
+        alone.lostPercent, alone.longGaps, alone.longestUs, alone.ranPercent, worst.lostPercent, cpus.size(),
+        worst.longGaps, worst.longestUs, worst.ranPercent);
+}
+
+// A stand-in for bxd that shares nothing with it: a forked process that answers each 8-byte request on its end of a
+// socket pair with `replyBytes` bytes, after spending `cpuUs` of its own CPU time, as bxd spends on a point match.
+// Beside the same discovering client, its tail is what this host alone adds to a request of that cost, which no
+// server can give back: the in-run reference for the point match's tail.
+class StandIn {
+  public:
+    StandIn(size_t replyBytes, double cpuUs) : reply_(replyBytes) {
+        int pair[2];
+        if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) die("socketpair");
+        pid_ = fork();
+        if (pid_ < 0) die("fork");
+        if (pid_ == 0) {
+            // Only its own socket: a copy of a connection to bxd held here would keep it open past its close.
+            close_range(3, static_cast<unsigned>(pair[1]) - 1, 0);
+            close_range(static_cast<unsigned>(pair[1]) + 1, ~0U, 0);
+            serve(pair[1], cpuUs);
+        }
+        close(pair[1]);
+        fd_ = pair[0];
+    }
+    ~StandIn() {
+        close(fd_);  // the stand-in exits at the end of its input
+        waitpid(pid_, nullptr, 0);
+    }
+    StandIn(const StandIn&) = delete;
+    StandIn& operator=(const StandIn&) = delete;
+
+    void roundTrip() {
+        const uint8_t request[kRequestBytes] = {};
+        writeAll(fd_, request, sizeof request);
+        readExactly(fd_, reply_.data(), reply_.size());
+    }
+
+  private:
+    static constexpr size_t kRequestBytes = 8;
+
+    static double threadCpuUs() {
+        timespec now{};
+        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
+        return static_cast<double>(now.tv_sec) * 1e6 + static_cast<double>(now.tv_nsec) / 1e3;
+    }
+
+    [[noreturn]] void serve(int fd, double cpuUs) {
+        std::vector<uint8_t> request(kRequestBytes);
+        for (;;) {
+            size_t got = 0;
+            while (got < request.size()) {
+                ssize_t n = read(fd, request.data() + got, request.size() - got);
+                if (n < 0 && errno == EINTR) continue;
+                if (n <= 0) _exit(0);
+                got += static_cast<size_t>(n);
+            }
+            for (const double until = threadCpuUs() + cpuUs; threadCpuUs() < until;) {
+            }
+            writeAll(fd, reply_.data(), reply_.size());
+        }
+    }
+
+    std::vector<uint8_t> reply_;
+    pid_t pid_ = -1;
+    int fd_ = -1;
+};
 
 void runSize(const Options& options, int count) {
     fs::path registry = prepareRegistry(options.cache, count);
@@ -635,17 +750,33 @@ void runSize(const Options& options, int count) {
             forms, pages, static_cast<unsigned long long>(options.pageSize), wallUs / 1000, walks, cpu, loadAverage());
     }
 
+    // The in-run reference for the windows below: a server that costs what the point match costs and shares nothing
+    // with bxd.
+    StandIn standIn(pointBytes, pointCpu);
+    auto standInWindow = [&](unsigned requests, std::vector<double> us = {}) {
+        us.reserve(us.size() + requests);
+        for (unsigned i = 0; i < requests; ++i) {
+            Clock::time_point start = Clock::now();
+            standIn.roundTrip();
+            us.push_back(elapsedUs(start));
+        }
+        return us;
+    };
+
     // The point match beside a client that discovers everything on its own connection, back to back: page after
     // page, and (where the reply fits a frame) unpaged, as a client of the protocol without pages asks. The
     // discovering client decodes every reply, so on a machine with fewer cores than busy threads part of what the
     // point match waits for is that client's own work, which no server can give back; the second round runs it
-    // at the lowest priority, so that what remains is the wait inside bxd.
+    // at the lowest priority, which takes most of its share of the CPU away but not its time slice: a thread woken
+    // onto the CPU it runs on may still wait for the rest of that slice (a scheduler trace here showed bxd's request
+    // thread waiting behind it at nice 19 as at nice 0, for most of a millisecond at a time).
     // This host's own stalls drift over a run, and the idle figure above was taken well before these: each
     // window also gets an idle window of the same size just before it, to tell drift from what the discovery costs.
     for (bool paged : {true, false}) {
         if (!paged && !all) break;
         for (int discovererNice : {0, 19}) {
             const Percentiles before = percentiles(pointWindow());
+            const Percentiles standInIdle = percentiles(standInWindow(options.requests));
             std::atomic<bool> stop{false};
             std::atomic<unsigned> walks{0};
             std::thread discoverer([&] {
@@ -663,7 +794,12 @@ void runSize(const Options& options, int count) {
                 close(other.fd);
             });
             std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            // Half of the stand-in's requests before the point match's and half after, so that on average both see
+            // the same stretch of the discovery.
+            std::vector<double> standInBusy = standInWindow(options.requests / 2);
             std::vector<double> busy = pointWindow();
+            const Percentiles standInBeside =
+                percentiles(standInWindow(options.requests - options.requests / 2, std::move(standInBusy)));
             stop.store(true);
             discoverer.join();
             Percentiles b = percentiles(busy);
@@ -679,6 +815,8 @@ void runSize(const Options& options, int count) {
                 paged ? "paged" : "unpaged", discovererNice, walks.load(), b.p50Us, b.p50Us / p.p50Us, b.p99Us,
                 b.p99Us / p.p99Us, 100 * beyond, *std::max_element(busy.begin(), busy.end()) / 1000, before.p99Us,
                 b.p99Us / before.p99Us);
+            printf("  the stand-in server beside the same discovery: p99 %.1f us (%.2fx its idle p99 of %.1f us)\n",
+                   standInBeside.p99Us, standInBeside.p99Us / standInIdle.p99Us, standInIdle.p99Us);
         }
     }
     fflush(stdout);
