@@ -449,11 +449,10 @@ struct Stalls {
 };
 
 // The CPU time the calling thread has had so far, as the kernel's scheduler counts it, in microseconds.
-double threadRunUs() {
-    std::ifstream stat("/proc/thread-self/schedstat");
-    unsigned long long runNs = 0;
-    stat >> runNs;
-    return static_cast<double>(runNs) / 1e3;
+double threadCpuUs() {
+    timespec now{};
+    clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
+    return static_cast<double>(now.tv_sec) * 1e6 + static_cast<double>(now.tv_nsec) / 1e3;
 }
 
 Stalls spinOneSecond(int cpu) {
@@ -463,7 +462,7 @@ Stalls spinOneSecond(int cpu) {
     CPU_SET(cpu, &only);
     sched_setaffinity(0, sizeof only, &only);
     Stalls stalls;
-    const double ranBefore = threadRunUs();
+    const double ranBefore = threadCpuUs();
     const Clock::time_point start = Clock::now(), end = start + std::chrono::seconds(1);
     Clock::time_point last = start;
     double lostUs = 0;
@@ -477,7 +476,7 @@ Stalls spinOneSecond(int cpu) {
     }
     const double wallUs = elapsedUs(start);
     stalls.lostPercent = 100 * lostUs / wallUs;
-    stalls.ranPercent = 100 * (threadRunUs() - ranBefore) / wallUs;
+    stalls.ranPercent = 100 * (threadCpuUs() - ranBefore) / wallUs;
     return stalls;
 }
 
@@ -540,12 +539,6 @@ class StandIn {
 
   private:
     static constexpr size_t kRequestBytes = 8;
-
-    static double threadCpuUs() {
-        timespec now{};
-        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &now);
-        return static_cast<double>(now.tv_sec) * 1e6 + static_cast<double>(now.tv_nsec) / 1e3;
-    }
 
     [[noreturn]] void serve(int fd, double cpuUs) {
         std::vector<uint8_t> request(kRequestBytes);
